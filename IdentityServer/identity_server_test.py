@@ -1,0 +1,452 @@
+"""Tests of the development identity server over real TLS, against a server process of their own.
+
+Run from this directory with `/usr/bin/python3 -m unittest identity_server_test`, or by path with
+`/usr/bin/python3 IdentityServer/identity_server_test.py`.
+"""
+
+from __future__ import annotations
+
+import base64
+import datetime
+import hashlib
+import http.client
+import json
+import os
+import plistlib
+import signal
+import socket
+import ssl
+import subprocess
+import sys
+import tempfile
+import threading
+import time
+import unittest
+import xmlrpc.client
+from pathlib import Path
+from typing import Any
+from urllib.parse import urlsplit
+
+sys.path.insert(0, str(Path(__file__).resolve().parent))
+
+from control_client import INTERPRETER, ControlError, IdentityServer  # noqa: E402
+
+PREFIX = "com.velto.dir.idm.web.collaboration.PersonService."
+JANE = "jane.roe@example.com"
+JANE_HASH = hashlib.sha256(b"correct horse").hexdigest()
+SIGN_IN = {"veltoConnect": JANE, "pwdHash": JANE_HASH}
+TIMEOUT = 20
+
+# What the agent writes where implementations differ: one line, zone letter, wide integer, nil, broken base64.
+AGENT_DOCUMENT = (
+    '<?xml version="1.0"?><methodCall><methodName>' + PREFIX + 'authenticate</methodName><params><param>'
+    '<value><struct>%s</struct></value></param></params></methodCall>')
+AGENT_MEMBERS = (
+    ("veltoConnect", f"<string>{JANE}</string>", JANE),
+    ("pwdHash", f"<string>{JANE_HASH}</string>", JANE_HASH),
+    ("When", "<dateTime.iso8601>20260117T01:58:42Z</dateTime.iso8601>", {"$date": "20260117T01:58:42Z"}),
+    ("Wide", "<i4>5000000000</i4>", 5000000000),
+    ("Nothing", "<nil/>", None),
+    ("Blob", "<base64>" + "QUJD" * 16 + "\r\nQQ==</base64>", {"$base64": "QUJD" * 16 + "QQ=="}),
+    ("Escaped &amp; &lt;", "<string>a&amp;lt;b &#x27;&quot;&gt; ü</string>", "a&lt;b '\"> ü"),
+    ("Flag", "<boolean>1</boolean>", True),
+    ("Lifetime", "<double>1209600</double>", 1209600.0),
+)
+
+
+def setUpModule() -> None:
+    global server, trust
+    directory = tempfile.TemporaryDirectory()
+    unittest.addModuleCleanup(directory.cleanup)
+    server = IdentityServer(Path(directory.name) / "state").start()
+    unittest.addModuleCleanup(server.stop)
+    trust = ssl.create_default_context(cafile=server.authority)
+
+
+def agent_document(*members: tuple[str, str, Any]) -> bytes:
+    texts = (f"<member><name>{name}</name><value>{value}</value></member>" for name, value, _ in members)
+    return (AGENT_DOCUMENT % "".join(texts)).encode()
+
+
+def exchange(body: bytes | None, url: str = "", verb: str = "POST", **headers: str) -> tuple[int, bytes]:
+    """One HTTPS request; status and body of the answer."""
+    address = urlsplit(url or server.url)
+    connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=trust)
+    try:
+        fields = {name.replace("_", "-"): value for name, value in headers.items()}
+        connection.request(verb, address.path, body, {"Content-Type": "text/xml"} | fields)
+        response = connection.getresponse()
+        return response.status, response.read()
+    finally:
+        connection.close()
+
+
+def call(method: str, parameters: Any, url: str = "") -> dict[str, Any]:
+    """One remote call; raises `xmlrpc.client.Fault`."""
+    status, body = exchange(xmlrpc.client.dumps((parameters,), PREFIX + method).encode(), url)
+    if status != 200:
+        raise AssertionError(f"{status}: {body!r}")
+    return xmlrpc.client.loads(body, use_builtin_types=True)[0][0]
+
+
+def fault_of(method: str, parameters: Any) -> int | None:
+    try:
+        call(method, parameters)
+    except xmlrpc.client.Fault as fault:
+        return fault.faultCode
+    return None
+
+
+class ServerTest(unittest.TestCase):
+    def setUp(self) -> None:
+        server.clear_next()
+        server.clear_received()
+        server.settings(dsSessionValidityDuration=300, Version=101, SuggestValidDuration=2592000, record=True)
+        session = call("authenticate", SIGN_IN)["dsSession"]
+        self.session = {"dsSession": session}
+        server.clear_received()
+
+
+class SignInTest(ServerTest):
+    def test_sign_in_is_answered_by_account_password_and_state(self) -> None:
+        password = "p\u00e4ss"
+        server.accounts({"name": "New.User@Example.com", "password": password},
+                        {"name": "off@example.com", "pwdHash": JANE_HASH, "disabled": True})
+        new_hash = hashlib.sha256(password.encode()).hexdigest()
+        for label, name, password_hash, expected in (
+                ("right", JANE, JANE_HASH, None),
+                ("name in another case", "Jane.ROE@example.com", JANE_HASH, None),
+                ("added account", "new.user@example.com", new_hash, None),
+                ("wrong password", JANE, "0" * 64, -20101),
+                ("hash in upper case", JANE, JANE_HASH.upper(), -20101),
+                ("hash that is not ASCII", JANE, "ü", -20101),
+                ("hash of another type", JANE, 5, -20101),
+                ("unknown account", "nobody@example.com", JANE_HASH, -20101),
+                ("disabled", "off@example.com", JANE_HASH, -20209),
+                ("disabled, wrong password", "off@example.com", "", -20101)):
+            with self.subTest(label):
+                parameters = {"veltoConnect": name, "pwdHash": password_hash}
+                self.assertEqual(fault_of("authenticate", parameters), expected)
+
+    def test_reply_follows_settings_and_account(self) -> None:
+        reply = call("authenticate", SIGN_IN)
+        self.assertEqual((reply["Version"], reply["dsSessionValidityDuration"]), (101, 300))
+        self.assertTrue(reply["encDsId"])
+        self.assertNotIn("CertificateIsValid", reply)
+        self.assertNotEqual(reply["dsSession"], self.session["dsSession"])
+        server.settings(Version=102, dsSessionValidityDuration=None)
+        server.accounts({"name": JANE, "CertificateIsValid": False, "encDsId": "changed"})
+        as_before = {"name": JANE, "CertificateIsValid": None, "encDsId": reply["encDsId"]}
+        self.addCleanup(server.accounts, as_before)
+        reply = call("authenticate", SIGN_IN)
+        self.assertEqual((reply["Version"], reply["encDsId"]), (102, "changed"))
+        self.assertIs(reply["CertificateIsValid"], False)
+        self.assertNotIn("dsSessionValidityDuration", reply)
+
+    def test_calls_that_no_method_can_serve_are_faults(self) -> None:
+        server.accounts({"name": "leaver@example.com", "pwdHash": JANE_HASH, "disabled": False})
+        leaver = call("authenticate", {"veltoConnect": "leaver@example.com", "pwdHash": JANE_HASH})
+        server.accounts({"name": "leaver@example.com", "disabled": True})
+        self.assertIn(b"unknown method", exchange(agent_document().replace(PREFIX.encode(), b""))[1])
+        for label, method, parameters, code in (
+                ("no session", "getMyInfo", {}, -1), ("unknown session", "getMyInfo", {"dsSession": "x"}, -1),
+                ("disabled meanwhile", "getMyInfo", {"dsSession": leaver["dsSession"]}, -20209),
+                ("unknown method", "getYourInfo", self.session, -1),
+                ("not a struct", "getMyInfo", "text", -1)):
+            with self.subTest(label):
+                self.assertEqual(fault_of(method, parameters), code)
+
+
+class MyInfoTest(ServerTest):
+    def verified(self, reply: dict[str, Any]) -> dict[str, Any]:
+        """The content of the reply's record, once its signature and its signer's authority are proved."""
+        record = base64.b64decode(reply["VIDVRecord"], validate=True)
+        arguments = ["openssl", "cms", "-verify", "-binary", "-inform", "DER", "-CAfile", server.authority]
+        done = subprocess.run(arguments, input=record, capture_output=True, check=False)
+        self.assertEqual(done.returncode, 0, done.stderr)
+        return plistlib.loads(done.stdout)
+
+    def test_details_come_with_a_signed_record(self) -> None:
+        reply = call("getMyInfo", self.session)
+        self.assertEqual((reply["VeltoID"], reply["firstNm"], reply["lastNm"]), (JANE, "Jane", "Roe"))
+        self.assertEqual((reply["PrimaryEmail"], reply["ValidatedEmail"]), (JANE, [JANE]))
+        self.assertEqual((len(reply["AllEmails"]), len(reply["ValidatedPhones"])), (2, 1))
+        statement = self.verified(reply)
+        self.assertEqual(statement["SuggestValidDuration"], 2592000)
+        age = datetime.datetime.utcnow() - statement["ValidAsOf"]
+        self.assertLess(abs(age), datetime.timedelta(minutes=10))
+        for key in ("encDsId", "ValidatedEmail", "ValidatedPhones"):
+            self.assertEqual(statement[key], reply[key])
+
+    def test_record_is_sent_until_the_client_has_it(self) -> None:
+        first = call("getMyInfo", self.session)
+        known = self.session | {"ClientVIDVRecordIdentifier": first["VIDVRecordIdentifier"]}
+        announced = call("authenticate", SIGN_IN)["VeltoIDRecordIdentifier"]
+        self.assertEqual(announced, first["VIDVRecordIdentifier"])
+        self.assertNotIn("VIDVRecord", call("getMyInfo", known))
+        server.settings(SuggestValidDuration=0)
+        aged = call("getMyInfo", known)
+        self.assertEqual(self.verified(aged)["SuggestValidDuration"], 0)
+        self.assertNotEqual(call("getMyInfo", known)["VIDVRecordIdentifier"], aged["VIDVRecordIdentifier"])
+        server.settings(SuggestValidDuration=2592000)
+        changes = {"ValidatedPhones": ["+15555550199"], "ValidForInterval": 60, "firstNm": None,
+                   "VIDVRecordNextCheckDate": "2030-01-01T00:00:00Z"}
+        server.accounts({"name": JANE, **changes})
+        self.addCleanup(server.accounts, {
+            "name": JANE, "ValidatedPhones": ["+15555550123"], "firstNm": "Jane", "ValidForInterval": None,
+            "VIDVRecordNextCheckDate": None})
+        changed = call("getMyInfo", known)
+        self.assertEqual({key: changed.get(key) for key in changes}, changes)
+        self.assertEqual(self.verified(changed)["ValidatedPhones"], ["+15555550199"])
+
+
+class WireTest(ServerTest):
+    def test_every_form_that_the_agent_writes_is_understood_and_recorded(self) -> None:
+        document = agent_document(*AGENT_MEMBERS)
+        status, body = exchange(document, User_Agent="VeltoIDXMLRPC")
+        self.assertEqual(status, 200)
+        self.assertIn("dsSession", xmlrpc.client.loads(body)[0][0])
+        (received,) = server.received("authenticate")
+        self.assertEqual(received["raw"], document.decode())
+        self.assertEqual(received["headers"]["User-Agent"], "VeltoIDXMLRPC")
+        names = [name.replace("&amp;", "&").replace("&lt;", "<") for name, _, _ in AGENT_MEMBERS]
+        self.assertEqual(received["parameters"], dict(zip(names, (value for _, _, value in AGENT_MEMBERS))))
+
+    def test_documents_that_are_no_calls_are_refused_and_recorded(self) -> None:
+        good = agent_document()
+        deep = "<array><data><value>" * 20000 + "</value></data></array>" * 20000
+        for label, body, content_type in (
+                ("empty", b"", "text/xml"), ("no XML", b"hello", "text/xml"),
+                ("half a document", good[:-20], "text/xml"),
+                ("a reply", xmlrpc.client.dumps(("x",), methodresponse=True).encode(), "text/xml"),
+                ("wrong content type", good, "application/json"), ("not UTF-8", b"\xff\xfe\xff", "text/xml"),
+                ("bad date", agent_document(("d", "<dateTime.iso8601>26</dateTime.iso8601>", 0)), "text/xml"),
+                ("bad integer", agent_document(("i", "<i4>five</i4>", 0)), "text/xml"),
+                ("very deep", agent_document(("a", deep, 0)), "text/xml")):
+            with self.subTest(label):
+                server.clear_received()
+                self.assertEqual(exchange(body, Content_Type=content_type)[0], 400)
+                (received,) = server.received()
+                self.assertEqual(received["raw"], body.decode("utf-8", "replace"))
+                self.assertEqual(received["method"], "(malformed)")
+                self.assertTrue(received["error"])
+        self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
+
+    def test_requests_that_are_not_for_the_door_get_a_status(self) -> None:
+        elsewhere = server.url.replace("dsxmlrpc", "other")
+        most = 16 * 1024 * 1024
+        for label, status, arguments, headers in (
+                ("GET", 405, (None, "", "GET"), {}), ("PUT", 405, (b"x", "", "PUT"), {}),
+                ("HEAD", 405, (None, "", "HEAD"), {}), ("GET elsewhere", 404, (None, elsewhere, "GET"), {}),
+                ("POST elsewhere", 404, (b"x", elsewhere), {}), ("largest", 400, (b" " * most,), {}),
+                ("too large", 413, (b" " * (most + 1),), {}),
+                ("bad length", 400, (b"x",), {"Content_Length": "-5"}),
+                ("chunked", 411, (b"",), {"Transfer_Encoding": "chunked"})):
+            with self.subTest(label):
+                self.assertEqual(exchange(*arguments, **headers)[0], status)
+
+    def test_a_client_that_asks_before_sending_is_told_to_go_on(self) -> None:
+        body = agent_document(*AGENT_MEMBERS)
+        head = (f"POST /dsservices/dsxmlrpc HTTP/1.1\r\nHost: localhost\r\nContent-Type: text/xml\r\n"
+                f"Content-Length: {len(body)}\r\nExpect: 100-continue\r\n\r\n")
+        with socket.create_connection(("127.0.0.1", urlsplit(server.url).port), TIMEOUT) as plain:
+            with trust.wrap_socket(plain, server_hostname="127.0.0.1") as connection:
+                connection.sendall(head.encode())
+                self.assertTrue(connection.recv(1024).startswith(b"HTTP/1.1 100 "))
+                connection.sendall(body)
+                self.assertTrue(connection.recv(1024).startswith(b"HTTP/1.1 200 "))
+
+    def test_a_client_that_never_speaks_holds_up_nobody(self) -> None:
+        with socket.create_connection(("127.0.0.1", urlsplit(server.url).port), TIMEOUT):
+            self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
+
+
+class InjectionTest(ServerTest):
+    def observe(self) -> Any:
+        """What a getMyInfo call meets: a status and text, a fault, a reply or a broken connection."""
+        try:
+            status, body = exchange(xmlrpc.client.dumps((self.session,), PREFIX + "getMyInfo").encode())
+            if status != 200 or b"<methodResponse>" not in body:
+                return status, body.decode("latin-1")
+            return xmlrpc.client.loads(body, use_builtin_types=True)[0][0]
+        except xmlrpc.client.Fault as fault:
+            return fault.faultCode, fault.faultString
+        except (http.client.HTTPException, ConnectionError, ssl.SSLError) as error:
+            return "cut", len(getattr(error, "partial", b"")), isinstance(error, http.client.IncompleteRead)
+
+    def test_outcomes_that_replace_the_reply(self) -> None:
+        for injection, expected in (
+                ({"fault": {"code": -20283, "string": "no <&> ü"}}, (-20283, "no <&> ü")),
+                ({"status": 500}, (500, "")), ({"status": 503, "body": "<html>busy"}, (503, "<html>busy")),
+                ({"body": "<?xml version='1.0'?><half"}, (200, "<?xml version='1.0'?><half")),
+                ({"bodyBase64": "/wA="}, (200, "\xff\x00")), ({"close": "before"}, ("cut", 0, False)),
+                ({"close": "headers"}, ("cut", 0, True))):
+            with self.subTest(injection):
+                server.next("getMyInfo", **injection)
+                self.assertEqual(self.observe(), expected)
+                self.assertEqual(self.observe()["lastNm"], "Roe")
+        whole = len(exchange(xmlrpc.client.dumps((self.session,), PREFIX + "getMyInfo").encode())[1])
+        server.next(close="middle")
+        self.assertEqual(self.observe(), ("cut", whole // 2, True))
+
+    def test_set_changes_fields_of_the_reply(self) -> None:
+        changes = {"FlushAndExit": True, "NextLaunchTimeInterval": 3600, "lastNm": "Other", "firstNm": None,
+                   "MetaInformation": {"X": "NULL", "list": [1, 0.5]}, "Blob": {"$base64": "QUJD"},
+                   "When": {"$date": "20260117T01:58:42Z"}}
+        server.next("getMyInfo", set=changes)
+        reply = self.observe()
+        self.assertNotIn("firstNm", reply)
+        for key in ("lastNm", "FlushAndExit", "NextLaunchTimeInterval", "MetaInformation"):
+            self.assertEqual(reply[key], changes[key])
+        self.assertEqual((reply["When"].isoformat(), reply["Blob"]), ("2026-01-17T01:58:42", b"ABC"))
+
+    def test_size_is_exact_and_the_document_valid(self) -> None:
+        for size in (5000, 17 * 1024 * 1024):
+            server.next("getMyInfo", size=size)
+            _, body = exchange(xmlrpc.client.dumps((self.session,), PREFIX + "getMyInfo").encode())
+            self.assertEqual(len(body), size)
+            self.assertEqual(xmlrpc.client.loads(body)[0][0]["lastNm"], "Roe")
+
+    def test_delay_comes_after_the_call_is_recorded(self) -> None:
+        server.next("getMyInfo", delay=0.3, status=500)
+        seen: list[Any] = []
+        caller = threading.Thread(target=lambda: seen.append(self.observe()))
+        began = time.monotonic()
+        caller.start()
+        self.assertTrue(server.wait("getMyInfo"))
+        self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
+        caller.join(TIMEOUT)
+        self.assertEqual(seen, [(500, "")])
+        self.assertGreaterEqual(time.monotonic() - began, 0.3)
+
+    def test_injections_wait_for_their_method_in_order_and_as_often_as_told(self) -> None:
+        server.next("authenticate", status=501)
+        server.next("getMyInfo", times=2, status=502)
+        server.next(status=503)
+        self.assertEqual([self.observe() for _ in range(3)], [(502, ""), (502, ""), (503, "")])
+        self.assertEqual(self.observe()["lastNm"], "Roe")
+        self.assertEqual(server.pending(), [{"method": "authenticate", "times": 1}])
+        server.clear_next()
+        self.assertIsNone(fault_of("authenticate", SIGN_IN))
+
+    def test_calls_at_the_same_time_use_an_injection_up_exactly(self) -> None:
+        callers, calls_each, injected = 8, 10, 30
+        server.next("getMyInfo", times=injected, status=500)
+        seen: list[bool] = []
+
+        def call_often() -> None:
+            for _ in range(calls_each):
+                seen.append(self.observe() == (500, ""))
+
+        threads = [threading.Thread(target=call_often) for _ in range(callers)]
+        for thread in threads:
+            thread.start()
+        for thread in threads:
+            thread.join(TIMEOUT)
+        self.assertEqual((len(seen), sum(seen)), (callers * calls_each, injected))
+        self.assertEqual(server.counts()["getMyInfo"], callers * calls_each)
+
+
+class ControlTest(ServerTest):
+    def refusal(self, verb: str, path: str, value: Any = None) -> int:
+        with self.assertRaises(ControlError) as caught:
+            server.command(verb, path, value)
+        return caught.exception.status
+
+    def test_mistakes_are_explained_and_change_nothing(self) -> None:
+        for path, value in (
+                ("/next", 5), ("/next", [{"status": 500}, {"method": "*"}]),
+                ("/next", {"method": "typo", "status": 500}), ("/next", {"tatus": 500}),
+                ("/next", {"status": 500, "close": "before"}), ("/next", {"status": 99}),
+                ("/next", {"status": 500, "times": 0}), ("/next", {"delay": True}),
+                ("/next", {"fault": {"string": "no code"}}), ("/next", {"fault": {"code": 2**40}}),
+                ("/next", {"bodyBase64": "?"}), ("/next", {"body": "\ud800"}), ("/next", {"size": 2**40}),
+                ("/next", {"close": "late"}), ("/next", {"set": {"Wide": 2**40}}),
+                ("/next", {"set": {"a": [None]}}), ("/next", {"set": {"When": {"$date": "soon"}}}),
+                ("/next", {"set": {"Blob": {"$base64": 5}}}), ("/accounts", ["x"]),
+                ("/accounts", [{"name": JANE, "pwdHash": "0"}, {"name": "x"}]),
+                ("/accounts", {"name": JANE, "disabled": "yes"}),
+                ("/accounts", {"name": JANE, "AllEmails": [1]}),
+                ("/settings", {"Version": 102, "record": 1}), ("/settings", {"x": 1}),
+                ("/wait", {"count": "many"}), ("/wait", {"timeout": 1e9})):
+            with self.subTest(path=path, value=value):
+                self.assertEqual(self.refusal("POST", path, value), 400)
+        self.assertEqual((self.refusal("GET", "/nowhere"), self.refusal("DELETE", "/health")), (404, 405))
+        self.assertEqual(server.pending(), [])
+        self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
+
+    def test_bodies_that_are_not_json_are_refused(self) -> None:
+        for body in (b"", b"{", b"\xff\xfe", b"[" * 100000):
+            connection = http.client.HTTPConnection(urlsplit(server.control).netloc, timeout=TIMEOUT)
+            connection.request("POST", "/next", body)
+            response = connection.getresponse()
+            self.assertEqual((response.status, list(json.loads(response.read()))), (400, ["error"]))
+            connection.close()
+        self.assertEqual(server.command("GET", "/health"), {"ok": True, "pid": server.pid})
+
+    def test_calls_are_counted_awaited_and_forgotten(self) -> None:
+        self.assertFalse(server.wait("getMyInfo", timeout=0))
+        reached: list[bool] = []
+        wait = lambda: reached.append(server.wait("getMyInfo", count=3, timeout=3 * TIMEOUT))
+        waiter = threading.Thread(target=wait, daemon=True)
+        waiter.start()
+        for _ in range(2):
+            call("getMyInfo", self.session)
+        server.settings(record=False)
+        call("getMyInfo", self.session)
+        fault_of("createCert", {})
+        waiter.join(TIMEOUT)
+        self.assertEqual(reached, [True])
+        self.assertEqual(server.counts(), {"getMyInfo": 3, "createCert": 1, "*": 4})
+        self.assertEqual(len(server.received()), 2)
+        server.clear_received()
+        self.assertEqual((server.received(), server.counts()), ([], {}))
+
+
+class TrustTest(ServerTest):
+    def test_only_the_right_name_under_the_right_authority_is_trusted(self) -> None:
+        self.assertIsNone(fault_of("authenticate", SIGN_IN))
+        by_address = server.url.replace("localhost", "127.0.0.1")
+        self.assertEqual(call("authenticate", SIGN_IN, by_address)["Version"], 101)
+        for url, reason in ((server.wrong_name_url, "Hostname mismatch"),
+                            (server.unknown_authority_url, "unable to get local issuer certificate")):
+            with self.subTest(url=url), self.assertRaises(ssl.SSLCertVerificationError) as caught:
+                call("authenticate", SIGN_IN, url)
+            self.assertIn(reason, caught.exception.verify_message)
+
+    def test_a_restart_keeps_the_authority_and_takes_accounts_from_a_file(self) -> None:
+        state = Path(server.authority).parent
+        anchor = Path(server.authority).read_bytes()
+        accounts = state / "accounts.json"
+        accounts.write_text(json.dumps([{"name": "only@example.com", "pwdHash": JANE_HASH}]))
+        second = IdentityServer(state, "--accounts", str(accounts)).start()
+        try:
+            self.assertEqual(Path(second.authority).read_bytes(), anchor)
+            only = {"veltoConnect": "only@example.com", "pwdHash": JANE_HASH}
+            self.assertEqual(call("authenticate", only, second.url)["Version"], 101)
+            with self.assertRaises(xmlrpc.client.Fault):
+                call("authenticate", SIGN_IN, second.url)
+        finally:
+            self.assertEqual(second.stop(), 0)
+        self.assertEqual({path.name: path.stat().st_mode & 0o777 for path in state.glob("*author*")},
+                         {"authority.pem": 0o644, "authority-key.pem": 0o600})
+        self.assertEqual(list(state.glob(".new-*")), [])
+
+    def test_a_server_that_cannot_start_says_why_and_an_interrupt_ends_it_well(self) -> None:
+        taken = str(urlsplit(server.url).port)
+        with tempfile.TemporaryDirectory() as state:
+            for options, reason in ((("--port", taken), "in use"), (("--host", "192.0.2.1"), "loopback"),
+                                    (("--accounts", "/nonexistent"), "No such file")):
+                command = [INTERPRETER, str(Path(__file__).parent), "--state-dir", state, *options]
+                done = subprocess.run(command, capture_output=True, text=True, timeout=TIMEOUT, check=False)
+                with self.subTest(options):
+                    self.assertNotEqual(done.returncode, 0)
+                    self.assertIn(reason, done.stderr)
+                    self.assertNotIn("Traceback", done.stderr)
+            other = IdentityServer(state).start()
+            os.kill(other.pid, signal.SIGINT)
+            self.assertEqual(other.stop(), 0)
+
+
+if __name__ == "__main__":
+    unittest.main()

@@ -1,0 +1,84 @@
+#include "Platform/EventLoop.h"
+
+#include <sys/eventfd.h>
+#include <systemd/sd-event.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+#include "Platform/WorkQueue.h"
+
+namespace platform::event_loop {
+namespace {
+
+sd_event* loop = nullptr;
+int wakeDescriptor = -1;
+
+[[noreturn]] void fail(const char* what, int error) {
+    // NOLINTNEXTLINE(cert-err33-c): the process ends in any case
+    std::fprintf(stderr, "event loop: %s: %s\n", what, std::strerror(error));
+    std::abort();
+}
+
+void wakeLoop() {
+    const uint64_t one = 1;
+    if (write(wakeDescriptor, &one, sizeof one) < 0 && errno != EAGAIN) fail("waking", errno);
+}
+
+int woken(sd_event_source* /*source*/, int descriptor, uint32_t /*events*/, void* /*context*/) {
+    uint64_t count = 0;
+    if (read(descriptor, &count, sizeof count) < 0 && errno != EAGAIN) fail("reading wake-ups", errno);
+    main_queue::runPending();
+    return 0;
+}
+
+int signalled(sd_event_source* /*source*/, const signalfd_siginfo* /*info*/, void* context) {
+    (*static_cast<std::function<void()>*>(context))();
+    return 0;
+}
+
+}  // namespace
+
+void prepare() {
+    sigset_t served;
+    sigemptyset(&served);
+    sigaddset(&served, SIGINT);
+    sigaddset(&served, SIGTERM);
+    sigprocmask(SIG_BLOCK, &served, nullptr);
+    std::signal(SIGPIPE, SIG_IGN);
+
+    if (const int result = sd_event_default(&loop); result < 0) fail("creating", -result);
+    wakeDescriptor = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (wakeDescriptor < 0) fail("creating wake descriptor", errno);
+    const int result = sd_event_add_io(loop, nullptr, wakeDescriptor, EPOLLIN, woken, nullptr);
+    if (result < 0) fail("watching wake descriptor", -result);
+    main_queue::adopt(wakeLoop);
+}
+
+void onSignal(int signal, std::function<void()> handler) {
+    // Lives as long as the process, like the signal's source.
+    auto* kept = new std::function<void()>(std::move(handler));
+    const int result = sd_event_add_signal(loop, nullptr, signal, signalled, kept);
+    if (result < 0) fail("watching signal", -result);
+}
+
+void run() {
+    const int result = sd_event_loop(loop);
+    if (result < 0) fail("running", -result);
+    exitProcess(result);
+}
+
+sd_event* handle() { return loop; }
+
+void exitProcess(int status) {
+    // NOLINTNEXTLINE(cert-err33-c): nobody is left to tell
+    std::fflush(stdout);
+    _exit(status);
+}
+
+}  // namespace platform::event_loop

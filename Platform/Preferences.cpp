@@ -1,0 +1,210 @@
+#include "Platform/Preferences.h"
+
+#include <fcntl.h>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <array>
+#include <cctype>
+#include <cerrno>
+#include <cstdlib>
+#include <exception>
+
+#include "Platform/PropertyList.h"
+#include "Platform/SQLiteFile.h"
+#include "Platform/SystemLog.h"
+
+namespace platform {
+
+namespace {
+
+using Outcome = SQLiteFile::Outcome;
+
+constexpr SQLiteFile::Format kFormat = {
+    "preferences.db",
+    0x48575046,  // "HWPF"
+    1,
+    "CREATE TABLE preferences ("
+    "  domain TEXT NOT NULL,"
+    "  key TEXT NOT NULL,"
+    "  value BLOB NOT NULL,"
+    "  PRIMARY KEY (domain, key)"
+    ") WITHOUT ROWID",
+};
+
+/// Never destroyed, so that exit from any thread is safe.
+SQLiteFile& file() {
+    static auto& shared = *new SQLiteFile(kFormat);
+    return shared;
+}
+
+/// Runs one operation of the interface, out of which nothing is thrown.
+template <typename Operation>
+bool guarded(const std::string& domain, const char* name, Operation operation) {
+    try {
+        return operation();
+    } catch (const std::exception& exception) {
+        VELTOID_PLATFORM_LOG(Error,
+                             "preferences of " + domain + ": " + name + " failed: " + exception.what());
+        return false;
+    }
+}
+
+std::string homeDirectory() {
+    const char* const home = std::getenv("HOME");
+    if (home != nullptr && *home == '/') return home;
+    constexpr size_t kMaxEntryBytes = 16384;
+    std::vector<char> buffer(kMaxEntryBytes);
+    passwd entry{};
+    passwd* found = nullptr;
+    if (getpwuid_r(geteuid(), &entry, buffer.data(), buffer.size(), &found) != 0 || found == nullptr)
+        return {};
+    return found->pw_dir;
+}
+
+std::string baseDirectory() {
+    const char* const state = std::getenv("XDG_STATE_HOME");
+    if (state != nullptr && *state == '/') return state;
+    const std::string home = homeDirectory();
+    return home.empty() ? home : home + "/.local/state";
+}
+
+/// The name under which this machine is known to its user; a home directory may be shared between machines.
+std::string machineName() {
+    constexpr size_t kDigits = 32;
+    std::array<char, kDigits> digits{};
+    const int descriptor = open("/etc/machine-id", O_RDONLY | O_CLOEXEC);
+    const ssize_t got = descriptor < 0 ? -1 : ::read(descriptor, digits.data(), digits.size());
+    if (descriptor >= 0) close(descriptor);
+    const bool valid =
+        got == static_cast<ssize_t>(kDigits) &&
+        std::ranges::all_of(digits, [](unsigned char digit) { return std::isxdigit(digit) != 0; });
+    return valid ? std::string(digits.begin(), digits.end()) : "no-machine-id";
+}
+
+bool isDirectory(const std::string& path, struct stat& information) {
+    if (stat(path.c_str(), &information) != 0) return false;
+    errno = ENOTDIR;
+    return S_ISDIR(information.st_mode);
+}
+
+/// Creates every missing component with mode 0700; false with errno set.
+bool createDirectories(const std::string& path) {
+    struct stat information {};
+    if (isDirectory(path, information)) return true;
+    for (size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
+        const std::string component = path.substr(0, end);
+        if (!isDirectory(component, information)) {
+            if (mkdir(component.c_str(), S_IRWXU) != 0 && errno != EEXIST) return false;
+            if (!isDirectory(component, information)) return false;
+            (void)syncDirectory(component + "/..");
+        }
+        if (end == std::string::npos) return true;
+    }
+}
+
+/// The directory may be older than this program: it is ours alone from now on.
+bool makePrivate(const std::string& path) {
+    struct stat information {};
+    if (!isDirectory(path, information)) return false;
+    return (information.st_mode & (S_IRWXG | S_IRWXO)) == 0 || chmod(path.c_str(), S_IRWXU) == 0;
+}
+
+}  // namespace
+
+std::string stateDirectory() {
+    const std::string base = baseDirectory();
+    if (base.empty()) {
+        errno = ENOENT;
+        return {};
+    }
+    const std::string ours = base + "/harbwell";
+    std::string directory = ours + '/' + machineName();
+    return createDirectories(directory) && makePrivate(ours) && makePrivate(directory) ? directory
+                                                                                       : std::string();
+}
+
+Preferences::ReadResult Preferences::read(std::string_view key, ValueSink& sink) const {
+    auto result = ReadResult::Failed;
+    guarded(domain_, "read", [&] {
+        SecretBytes value;
+        const Outcome outcome = file().read([&](SQLiteTransaction& transaction) {
+            auto statement =
+                transaction.prepare("SELECT value FROM preferences WHERE domain = ? AND key = ?");
+            statement.bindText(domain_).bindText(key);
+            if (!statement.step()) return false;
+            const Bytes stored = statement.blob(0);
+            value.assign(stored.begin(), stored.end());
+            return true;
+        });
+        if (outcome == Outcome::Failed) return false;
+        // The sink is served outside the transaction: it may take its time, and may use preferences itself.
+        const bool found = outcome == Outcome::Done && readBinaryPropertyList(value, sink);
+        result = found ? ReadResult::Found : ReadResult::Absent;
+        if (found || outcome != Outcome::Done) return true;
+        VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the value of \"" + std::string(key) +
+                                        "\" is damaged and counts as absent");
+        return true;
+    });
+    return result;
+}
+
+std::vector<std::string> Preferences::keys() const {
+    std::vector<std::string> keys;
+    const bool done = guarded(domain_, "keys", [&] {
+        return file().read([&](SQLiteTransaction& transaction) {
+            keys.clear();
+            auto statement = transaction.prepare("SELECT key FROM preferences WHERE domain = ? ORDER BY key");
+            statement.bindText(domain_);
+            while (statement.step()) keys.emplace_back(statement.text(0));
+            return true;
+        }) == Outcome::Done;
+    });
+    if (!done) keys.clear();
+    return keys;
+}
+
+bool Preferences::set(const std::vector<std::pair<std::string, ValueWriter>>& values) const {
+    return guarded(domain_, "set", [&] {
+        std::vector<std::pair<std::string_view, SecretBytes>> rows;
+        for (const auto& [key, writer] : values) {
+            rows.emplace_back(key, writeBinaryPropertyList(writer));
+            if (!rows.back().second.empty()) continue;
+            VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the value for \"" + key +
+                                            "\" has no stored form; nothing is set");
+            return false;
+        }
+        return file().write([&](SQLiteTransaction& transaction) {
+            for (const auto& [key, value] : rows) {
+                transaction.prepare("REPLACE INTO preferences (domain, key, value) VALUES (?, ?, ?)")
+                    .bindText(domain_)
+                    .bindText(key)
+                    .bindBlob(value)
+                    .run();
+            }
+            return true;
+        }) == Outcome::Done;
+    });
+}
+
+bool Preferences::remove(const std::vector<std::string>& keys) const {
+    return guarded(domain_, "remove", [&] {
+        return file().write([&](SQLiteTransaction& transaction) {
+            for (const auto& key : keys) {
+                transaction.prepare("DELETE FROM preferences WHERE domain = ? AND key = ?")
+                    .bindText(domain_)
+                    .bindText(key)
+                    .run();
+            }
+            return true;
+        }) == Outcome::Done;
+    });
+}
+
+bool Preferences::synchronize() const {
+    return guarded(domain_, "synchronize", [] { return file().checkpoint(); });
+}
+
+}  // namespace platform

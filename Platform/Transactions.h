@@ -1,0 +1,19 @@
+// Open transactions: while there is at least one, the agent is not ended for being idle.
+#pragma once
+
+#include <functional>
+#include <string_view>
+
+namespace platform::transactions {
+
+/// Any thread. Each began is balanced by one ended.
+void began();
+void ended();
+
+/// How many are open now.
+long openCount();
+
+/// Calls `function` on the main queue as soon as none is open, once; at once (queued) when none is.
+void whenNoneIsOpen(std::function<void()> function);
+
+}  // namespace platform::transactions

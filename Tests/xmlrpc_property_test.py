@@ -1,0 +1,180 @@
+"""Random values through the agent's XML-RPC code and Python's: what one writes, the other must read as the same value.
+
+usage: xmlrpc_property_test.py PEER [DOCUMENTS]
+"""
+
+from __future__ import annotations
+
+import base64
+import datetime
+import math
+import random
+import subprocess
+import sys
+import xmlrpc.client
+
+SEED = 20_260_117
+DOCUMENTS = 1500
+DEEPEST = 5
+LONGEST_REPORT = 2000
+EPOCH = datetime.datetime(1970, 1, 1)
+
+# What the agent's parser takes off both ends of a text.
+WHITE_SPACE = ("\t\n\v\f\r \x85\xa0\u1680\u2000\u2001\u2002\u2003\u2004\u2005\u2006\u2007\u2008\u2009\u200a"
+               "\u2028\u2029\u202f\u205f\u3000")
+# Everything that has a meaning in XML, white space of all kinds, and characters of one to four bytes.
+CHARACTERS = "ab01<>&\"';#x]\\ \t\n\r\x7f\x85\xa0\u2003\u3000\xe9\u20ac\u200b\ufeff\U0001f600"
+
+
+class Generator:
+    def __init__(self, seed: int, for_parser: bool):
+        self.random = random.Random(seed)
+        # The parser keeps 32 bits of an integer; Python's writer has no form for None.
+        self.bits = 31 if for_parser else 63
+        self.leaves = [self.integer, self.double, self.boolean, self.text, self.date, self.data]
+        if not for_parser:
+            self.leaves.append(lambda: None)
+
+    def integer(self) -> int:
+        bits = self.random.randint(0, self.bits)
+        return self.random.choice([self.random.randint(-(1 << bits), (1 << bits) - 1), -(1 << self.bits)])
+
+    def double(self) -> float:
+        choices = [self.random.uniform(-10, 10), self.random.gauss(0, 1) * 10.0 ** self.random.randint(-300, 300),
+                   0.1 * self.random.randint(0, 9), -0.0, 5e-324, sys.float_info.max, float(1 << 53)]
+        return self.random.choice(choices)
+
+    def boolean(self) -> bool:
+        return self.random.random() < 0.5
+
+    def text(self) -> str:
+        return "".join(self.random.choices(CHARACTERS, k=self.random.choice([0, 1, 2, 5, 40, 400])))
+
+    def date(self) -> datetime.datetime:
+        # Python's writer pads no year of less than four digits.
+        first, last = datetime.datetime(1000, 1, 1), datetime.datetime(9999, 12, 31, 23, 59, 59)
+        return first + datetime.timedelta(seconds=self.random.randint(0, int((last - first).total_seconds())))
+
+    def data(self) -> bytes:
+        return self.random.randbytes(self.random.choice([0, 1, 2, 3, 47, 48, 49, 57, 96, 1000]))
+
+    def value(self, depth: int = 0):
+        kind = self.random.random()
+        if depth == DEEPEST or kind < 0.4:
+            return self.random.choice(self.leaves)()
+        if kind < 0.7:
+            return [self.value(depth + 1) for _ in range(self.random.randint(0, 6))]
+        members = {}
+        for _ in range(self.random.choice([0, 1, 3, 12])):
+            name = self.text()
+            # Names that differ in their outer white space only are one name to the parser.
+            if trimmed(name) not in {trimmed(each) for each in members}:
+                members[name] = self.value(depth + 1)
+        return members
+
+
+def line_ends_read(text: str) -> str:
+    """What every XML reader makes of line ends."""
+    return text.replace("\r\n", "\n").replace("\r", "\n")
+
+
+def trimmed(text: str) -> str:
+    return line_ends_read(text).strip(WHITE_SPACE)
+
+
+def words(value, text=lambda each: each) -> str:
+    """The value in the peer's words, every text put through a function first."""
+    def coded(kind: str, content: bytes) -> str:
+        return kind + base64.b64encode(content).decode()
+
+    match value:
+        case None: return "n"
+        case bool(): return f"b{int(value)}"
+        case int(): return f"i{value}"
+        case float(): return f"d{value!r}"
+        case str(): return coded("s", text(value).encode())
+        case bytes(): return coded("x", value)
+        case datetime.datetime(): return f"t{int((value - EPOCH).total_seconds())}"
+        case list(): return " ".join([f"a{len(value)}", *(words(each, text) for each in value)])
+        case dict():
+            pairs = (f"{words(name, text)} {words(each, text)}" for name, each in value.items())
+            return " ".join([f"m{len(value)}", *pairs])
+    raise TypeError(value)
+
+
+def same_words(ours: str, expected: str) -> bool:
+    """Doubles are compared as numbers: both sides write the shortest form, but not in the same notation."""
+    def same(one: str, other: str) -> bool:
+        if one[0] == other[0] == "d":
+            first, second = float(one[1:]), float(other[1:])
+            return first == second and math.copysign(1, first) == math.copysign(1, second)
+        return one == other
+
+    pairs = list(zip(ours.split(), expected.split(), strict=False))
+    return len(ours.split()) == len(expected.split()) and all(same(*pair) for pair in pairs)
+
+
+def as_read_by_python(value):
+    """What Python's reader makes of a value that the agent's encoder wrote."""
+    match value:
+        case str(): return line_ends_read(value)
+        case datetime.datetime(): return xmlrpc.client.DateTime(value.strftime("%Y%m%dT%H:%M:%SZ"))
+        case bytes(): return xmlrpc.client.Binary(value)
+        case list(): return [as_read_by_python(each) for each in value]
+        case dict(): return {line_ends_read(name): as_read_by_python(each) for name, each in value.items()}
+    return value
+
+
+class Peer:
+    def __init__(self, path: str):
+        self.process = subprocess.Popen([path], stdin=subprocess.PIPE, stdout=subprocess.PIPE, text=True)
+
+    def ask(self, line: str) -> str:
+        self.process.stdin.write(line + "\n")
+        self.process.stdin.flush()
+        answer = self.process.stdout.readline()
+        if not answer:
+            sys.exit(f"the peer ended at: {line[:LONGEST_REPORT]}")
+        return answer.strip()
+
+    def parse(self, document: str) -> str:
+        return self.ask("parse " + base64.b64encode(document.encode()).decode())
+
+    def encode(self, value) -> str:
+        return base64.b64decode(self.ask("encode " + words(value))).decode()
+
+
+def check_parser(peer: Peer, documents: int) -> None:
+    generator = Generator(SEED, for_parser=True)
+    for number in range(documents):
+        value, kind = generator.value(), "value"
+        document = xmlrpc.client.dumps((value,), methodresponse=True)
+        if number % 10 == 0:
+            fault = xmlrpc.client.Fault(generator.integer(), generator.text())
+            document, kind = xmlrpc.client.dumps(fault), "fault"
+            value = {"faultCode": fault.faultCode, "faultString": fault.faultString}
+        ours = peer.parse(document)
+        if not same_words(ours, expected := f"{kind} {words(value, trimmed)}"):
+            sys.exit(f"document {number}:\n{document}\nread as:\n{ours}\ninstead of:\n{expected}")
+
+
+def check_encoder(peer: Peer, documents: int) -> None:
+    generator = Generator(SEED + 1, for_parser=False)
+    for number in range(documents):
+        value = generator.value()
+        document = peer.encode(value)
+        parameters, method = xmlrpc.client.loads(document)
+        if method != "test" or parameters != (as_read_by_python(value),):
+            sys.exit(f"value {number}:\n{value!r}\nwritten as:\n{document}\nread as:\n{parameters!r}")
+
+
+def main() -> None:
+    peer = Peer(sys.argv[1])
+    documents = int(sys.argv[2]) if len(sys.argv) > 2 else DOCUMENTS
+    check_parser(peer, documents)
+    check_encoder(peer, documents)
+    print(f"{documents} responses parsed and {documents} requests encoded alike")
+
+
+if __name__ == "__main__":
+    main()

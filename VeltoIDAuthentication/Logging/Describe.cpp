@@ -1,0 +1,286 @@
+#include "Logging/Describe.h"
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+#include <cstdio>
+#include <ctime>
+#include <sstream>
+#include <vector>
+
+#include "Platform/Clock.h"
+#include "Values/Error.h"
+#include "Values/SecurityObject.h"
+
+namespace veltoid {
+namespace {
+
+struct ErrorName {
+    int64_t code;
+    const char* name;
+};
+
+/// Codes of kIdentityErrorDomain; the first entry of a code names it. The last names of -101 and -102 belong to the
+/// same failures seen from a client's side and are never printed.
+constexpr ErrorName kErrorNames[] = {
+    {-100, "kHWIdentityVeltoIDUnknownError"},
+    {-99, "kHWIdentityInvalidParametersErr"},
+    {-10, "kHWIdentityCertificateDoesNotContainRequestedValueErr"},
+    {-11, "kHWIdentityAgentCommunicationFailure"},
+    {-101, "kHWIdentityVeltoIDInvalidAccountOrPasswordErr"},
+    {-102, "kHWIdentityVeltoIDAccountLogonDisabledErr"},
+    {-103, "kHWIdentityVeltoIDServerCannotBeReachedErr"},
+    {-104, "kHWIdentityVeltoIDServerProtocolErr"},
+    {-105, "kHWIdentityVeltoIDServerNoLongerSupportedErr"},
+    {-106, "kHWIdentityVeltoIDNoCertificateForAccountErr"},
+    {-107, "kHWIdentityVeltoIDNoAccounts"},
+    {-108, "kHWIdentityUnknownAccountErr"},
+    {-101, "kHWIdentityAuthenticationFailedErr"},
+    {-102, "kHWIdentityAuthenticationDisabledErr"},
+    {-110, "kHWIdentityVeltoIDValidationRecordCorruptErr"},
+    {-111, "kHWIdentityVeltoIDValidationRecordBadVersionErr"},
+    {-112, "kHWIdentityVeltoIDValidationRecordValidAsOfNotCurrentErr"},
+    {-113, "kHWIdentityVeltoIDValidationRecordTrustNotEstablishedErr"},
+    {-114, "kHWIdentityUnsupportedFeatureOnThisDeviceErr"},
+};
+
+constexpr const char* kTrustResultNames[] = {
+    "TrustResultInvalid",     "TrustResultProceed",
+    "TrustResultConfirm",     "TrustResultDeny",
+    "TrustResultUnspecified", "TrustResultRecoverableTrustFailure",
+    "TrustResultFatalTrustFailure", "TrustResultOtherError",
+};
+
+constexpr double kRelativeWordingLimit = 300;
+
+void append(std::string& text, const Value& value);
+
+void appendHexadecimal(std::string& text, std::span<const uint8_t> bytes, const char* digits) {
+    for (const uint8_t byte : bytes) {
+        text += digits[byte >> 4U];
+        text += digits[byte & 15U];
+    }
+}
+
+void appendQuoted(std::string& text, std::string_view bytes) {
+    text += '"';
+    appendEscapedBytes(text, bytes.data(), bytes.size());
+    text += '"';
+}
+
+void appendArray(std::string& text, const Array& array) {
+    text += "( ";
+    bool first = true;
+    for (const Value& element : array) {
+        if (!std::exchange(first, false)) text += ", ";
+        append(text, element);
+    }
+    text += ")";
+}
+
+bool lessIgnoringCase(std::string_view a, std::string_view b) {
+    const auto lower = [](char c) { return c >= 'A' && c <= 'Z' ? static_cast<char>(c + 32) : c; };
+    return std::lexicographical_compare(a.begin(), a.end(), b.begin(), b.end(), [&](char x, char y) {
+        return static_cast<unsigned char>(lower(x)) < static_cast<unsigned char>(lower(y));
+    });
+}
+
+void appendDictionary(std::string& text, const Dictionary& dictionary) {
+    std::vector<const Dictionary::Entry*> entries;
+    for (const Dictionary::Entry& entry : dictionary) entries.push_back(&entry);
+    std::stable_sort(entries.begin(), entries.end(),
+                     [](const auto* a, const auto* b) { return lessIgnoringCase(a->key.view(), b->key.view()); });
+    text += "{ ";
+    bool first = true;
+    for (const Dictionary::Entry* entry : entries) {
+        if (!std::exchange(first, false)) text += ", ";
+        appendQuoted(text, entry->key.view());
+        text += '=';
+        append(text, entry->value);
+    }
+    text += " }";
+}
+
+void appendData(std::string& text, std::span<const uint8_t> bytes) {
+    const bool printable = std::all_of(bytes.begin(), bytes.end(), [](uint8_t byte) {
+        return (byte >= 32 && byte <= 126) || byte == '\t' || byte == '\n' || byte == '\r';
+    });
+    text += '$';
+    if (printable) {
+        appendQuoted(text, {reinterpret_cast<const char*>(bytes.data()), bytes.size()});
+    } else {
+        appendHexadecimal(text, bytes, "0123456789abcdef");
+    }
+}
+
+void appendDate(std::string& text, double date) {
+    const double distance = date - platform::Clock::shared().now();
+    std::ostringstream relative;
+    if (distance >= -1 && distance <= 0) {
+        relative << "now-ish ";
+    } else if (distance > 0 && distance <= 1) {
+        relative << "soon-ish ";
+    } else if (distance > 1 && distance <= kRelativeWordingLimit) {
+        relative << distance << " seconds from now, ";
+    } else if (distance < -1 && distance >= -kRelativeWordingLimit) {
+        relative << std::llround(-distance) << " seconds ago, ";
+    }
+    text += relative.str();
+
+    std::tm calendar{};
+    // Years beyond what the calendar can hold: nothing sensible to print.
+    if (!std::isfinite(date) || std::abs(date) > 6e16) {
+        text += "?";
+        return;
+    }
+    const auto seconds = static_cast<time_t>(std::floor(date));
+    if (localtime_r(&seconds, &calendar) == nullptr) {
+        text += "?";
+        return;
+    }
+    std::array<char, 64> buffer{};
+    const int length = std::snprintf(buffer.data(), buffer.size(), "%04d/%02d/%02d %02d:%02d:%02d",
+                                     calendar.tm_year + 1900, calendar.tm_mon + 1, calendar.tm_mday, calendar.tm_hour,
+                                     calendar.tm_min, calendar.tm_sec);
+    text.append(buffer.data(), static_cast<size_t>(length));
+}
+
+void appendFloating(std::string& text, double number) {
+    if (std::isnan(number)) {
+        text += "NAN";
+        return;
+    }
+    std::ostringstream stream;
+    stream << std::showpoint << number;
+    text += stream.str();
+}
+
+/// The bytes of a number of a kind without a decimal form, in memory order.
+void appendRawNumber(std::string& text, uint64_t number) {
+    std::array<uint8_t, sizeof number> bytes{};
+    std::memcpy(bytes.data(), &number, sizeof number);
+    const auto* firstUsed = std::find_if(bytes.begin(), bytes.end(), [](uint8_t byte) { return byte != 0; });
+    text += "0x";
+    if (firstUsed == bytes.end()) {
+        text += '0';
+    } else {
+        appendHexadecimal(text, {firstUsed, bytes.end()}, "0123456789ABCDEF");
+    }
+}
+
+void appendNumber(std::string& text, const Value& number) {
+    switch (*number.numberKind()) {
+        case NumberKind::Float32:
+        case NumberKind::Float64: appendFloating(text, *number.asDouble()); break;
+        case NumberKind::UInt64: appendRawNumber(text, *number.asUInt64()); break;
+        default: text += std::to_string(*number.asInt64());
+    }
+}
+
+void appendURL(std::string& text, const std::pair<String, String>& url) {
+    append(text, url.first);
+    if (!url.second) return;
+    text += " base:";
+    append(text, url.second);
+}
+
+void appendError(std::string& text, const Error& error) {
+    text += "ERROR:";
+    append(text, error.domain);
+    text += " #" + std::to_string(error.code);
+    if (error.domain.view() == kIdentityErrorDomain) {
+        const auto* name = std::find_if(std::begin(kErrorNames), std::end(kErrorNames),
+                                        [&](const ErrorName& entry) { return entry.code == error.code; });
+        if (name != std::end(kErrorNames)) text.append(" ").append(name->name);
+    }
+    if (error.userInfo.empty()) return;
+    text += ' ';
+    appendDictionary(text, error.userInfo);
+}
+
+/// Writes the text of each kind of security object.
+struct ObjectWriter {
+    std::string& text;
+
+    void operator()(const CertificateDescription& certificate) const {
+        text += "CERT:";
+        if (certificate.subjectSummary) {
+            append(text, certificate.subjectSummary);
+            text += "  ";
+        } else {
+            text += ' ';
+        }
+    }
+    void operator()(const KeyDescription& key) const {
+        text += "KEY:";
+        append(text, key.text);
+    }
+    void operator()(const IdentityDescription& identity) const {
+        text += "[ ";
+        if (identity.certificate) (*this)(*identity.certificate);
+        if (identity.privateKey) (*this)(*identity.privateKey);
+        text += "] ";
+    }
+    void operator()(const TrustDescription& trust) const {
+        text += "TRUSTOBJ:[ ";
+        if (trust.result) text += resultName(*trust.result);
+        text += " CERTs:[";
+        for (size_t i = 0; i < trust.certificates.size(); ++i) {
+            if (i > 0) text += ", ";
+            (*this)(trust.certificates[i]);
+        }
+        text += "]";
+    }
+    void operator()(const UnknownDescription& unknown) const {
+        text += "Unknown QVType id=" + std::to_string(unknown.typeID);
+        append(text, unknown.text);
+    }
+
+    static std::string resultName(int result) {
+        if (result >= 0 && result < static_cast<int>(std::size(kTrustResultNames)))
+            return kTrustResultNames[result];
+        return "TrustResultUnknown," + std::to_string(result);
+    }
+};
+
+void append(std::string& text, const Value& value) {
+    switch (value.kind()) {
+        case Value::Kind::Absent: text += "[ NULL ] "; break;
+        case Value::Kind::Null: text += "NULL"; break;
+        case Value::Kind::Boolean: text += *value.asBoolean() ? "true" : "false"; break;
+        case Value::Kind::Number: appendNumber(text, value); break;
+        case Value::Kind::Date: appendDate(text, *value.asDate()); break;
+        case Value::Kind::String: appendQuoted(text, *value.asText()); break;
+        case Value::Kind::Data: appendData(text, value.asData().bytes()); break;
+        case Value::Kind::Array: appendArray(text, *value.asArray()); break;
+        case Value::Kind::Dictionary: appendDictionary(text, *value.asDictionary()); break;
+        case Value::Kind::URL: appendURL(text, *value.asURL()); break;
+        case Value::Kind::UUID: appendData(text, *value.asUUID()); break;
+        case Value::Kind::Error: appendError(text, *value.asError()); break;
+        case Value::Kind::Object: std::visit(ObjectWriter{text}, value.asObject()->description); break;
+    }
+}
+
+}  // namespace
+
+std::string describeValue(const Value& value) {
+    std::string text;
+    append(text, value);
+    return text;
+}
+
+void appendEscapedBytes(std::string& text, const char* bytes, size_t length) {
+    for (size_t i = 0; i < length; ++i) {
+        const auto byte = static_cast<unsigned char>(bytes[i]);
+        if (byte >= 32) {
+            text += bytes[i];
+        } else if (byte == 0) {
+            text += "(null)";
+        } else {
+            text += '\\';
+            text += byte == '\t' ? 't' : byte == '\n' ? 'n' : byte == '\r' ? 'r' : static_cast<char>(byte + 96);
+        }
+    }
+}
+
+}  // namespace veltoid

@@ -1,0 +1,64 @@
+#include "Logging/Log.h"
+
+#include <unistd.h>
+
+#include <cstdio>
+#include <cstring>
+#include <mutex>
+
+#include "Platform/SystemLog.h"
+#include "Platform/Transactions.h"
+#include "Platform/WorkQueue.h"
+
+namespace veltoid {
+namespace {
+
+constexpr const char* kPrefix = "SERVER ";
+constexpr unsigned kLevelMask = 0x3F;
+
+void write(int level, const std::string& text, const platform::LogOrigin& origin) {
+    platform::SystemLog::shared().write(static_cast<platform::LogPriority>(level), text, origin);
+}
+
+/// Passes by the level filter: a log without the moment of its start is hard to read.
+void writeStartBanner() {
+    std::ostringstream banner;
+    banner << kPrefix << "Starting logging for veltoidauthentication " << std::string(46, '*') << " euid=" << geteuid()
+           << " uid=" << getuid() << " BUILT approximately " << __DATE__ << " " << __TIME__;
+    write(log_level::kInfo, banner.str(), {});
+}
+
+void openOnce() {
+    static std::once_flag opened;
+    std::call_once(opened, writeStartBanner);
+}
+
+const char* fileNameOf(const char* path) {
+    if (path == nullptr) return "";
+    const char* slash = std::strrchr(path, '/');
+    return slash != nullptr ? slash + 1 : path;
+}
+
+}  // namespace
+
+bool logLevelEnabled(int level) {
+    openOnce();
+    return level >= 0 && level <= 7 && ((kLevelMask >> static_cast<unsigned>(level)) & 1U) != 0;
+}
+
+void logLine(int level, const char* sourcePath, const char* functionName, int lineNumber, const char* message) {
+    openOnce();
+    platform::transactions::began();
+    const std::string* label = platform::WorkQueue::currentLabel();
+    const char* queue = label != nullptr && !label->empty() ? label->c_str() : "-";
+    const char* function = functionName != nullptr ? functionName : "";
+    const char* file = fileNameOf(sourcePath);
+
+    std::string text(kPrefix);
+    text.append(message != nullptr ? message : "-").append(" (").append(function).append("()/").append(file);
+    text.append(" #").append(std::to_string(lineNumber)).append(") ").append(queue);
+    write(level, text, {file, lineNumber, function, queue});
+    platform::transactions::ended();
+}
+
+}  // namespace veltoid

@@ -1,0 +1,265 @@
+#include "Values/Base64.h"
+
+#include <algorithm>
+#include <array>
+#include <cstring>
+
+namespace veltoid {
+namespace {
+
+constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+constexpr size_t kXMLRPCLineLength = 64;
+
+// --- Encoding
+
+/// The two symbols of every 12 bits.
+constexpr auto kSymbolPairs = [] {
+    std::array<std::array<char, 2>, 4096> pairs{};
+    for (size_t bits = 0; bits < pairs.size(); ++bits) pairs[bits] = {kAlphabet[bits >> 6U], kAlphabet[bits & 63U]};
+    return pairs;
+}();
+
+constexpr size_t encodedSize(size_t bytes) { return (bytes + 2) / 3 * 4; }
+
+/// A group is 24 bits.
+void writeGroup(uint64_t group, char* out) {
+    std::memcpy(out, kSymbolPairs[group >> 12U].data(), 2);
+    std::memcpy(out + 2, kSymbolPairs[group & 4095U].data(), 2);
+}
+
+uint32_t groupAt(const uint8_t* bytes) {
+    return (uint32_t{bytes[0]} << 16U) | (uint32_t{bytes[1]} << 8U) | bytes[2];
+}
+
+/// Six bytes and the two behind them.
+uint64_t twoGroupsAt(const uint8_t* bytes) {
+    uint64_t bits = 0;
+    for (size_t i = 0; i < sizeof bits; ++i) bits = (bits << 8U) | bytes[i];
+    return bits;
+}
+
+/// Writes encodedSize(bytes.size()) characters.
+void encodeGroups(platform::Bytes bytes, char* out) {
+    size_t i = 0;
+    for (; i + sizeof(uint64_t) <= bytes.size(); i += 6, out += 8) {
+        const uint64_t bits = twoGroupsAt(&bytes[i]);
+        writeGroup(bits >> 40U, out);
+        writeGroup((bits >> 16U) & 0xFFFFFFU, out + 4);
+    }
+    for (; i + 3 <= bytes.size(); i += 3, out += 4) writeGroup(groupAt(&bytes[i]), out);
+    const size_t left = bytes.size() - i;
+    if (left == 0) return;
+    writeGroup((uint32_t{bytes[i]} << 16U) | (left == 2 ? uint32_t{bytes[i + 1]} << 8U : 0U), out);
+    out[3] = '=';
+    if (left == 1) out[2] = '=';
+}
+
+/// Collects short pieces of text, so that the growing text is appended to in larger ones.
+class BlockWriter {
+  public:
+    static constexpr size_t kBlock = 4096;
+
+    explicit BlockWriter(platform::SecretText& out) : out_(out) {}
+    ~BlockWriter() {
+        flush();
+        platform::wipe(block_.data(), block_.size());
+    }
+    BlockWriter(const BlockWriter&) = delete;
+    BlockWriter& operator=(const BlockWriter&) = delete;
+
+    /// Room for `size` characters, at most kBlock, that the caller writes.
+    char* next(size_t size) {
+        if (used_ + size > kBlock) flush();
+        char* const room = block_.data() + used_;
+        used_ += size;
+        return room;
+    }
+
+  private:
+    void flush() {
+        out_.append(block_.data(), used_);
+        used_ = 0;
+    }
+
+    platform::SecretText& out_;
+    size_t used_ = 0;
+    std::array<char, kBlock> block_;  // NOLINT(cppcoreguidelines-pro-type-member-init): written before it is read
+};
+
+/// Appends the body in lines of `lineLength` characters, a multiple of 4 and at most half a block, with `lineBreak`
+/// between them.
+void appendLines(platform::SecretText& out, platform::Bytes bytes, size_t lineLength, std::string_view lineBreak) {
+    const size_t bytesPerLine = lineLength / 4 * 3;
+    BlockWriter writer(out);
+    for (size_t start = 0; start < bytes.size(); start += bytesPerLine) {
+        const platform::Bytes line = bytes.subspan(start, std::min(bytesPerLine, bytes.size() - start));
+        if (start != 0) std::memcpy(writer.next(lineBreak.size()), lineBreak.data(), lineBreak.size());
+        encodeGroups(line, writer.next(encodedSize(line.size())));
+    }
+}
+
+void appendUnbroken(platform::SecretText& out, platform::Bytes bytes) {
+    appendLines(out, bytes, BlockWriter::kBlock / 2, {});
+}
+
+/// For line lengths that cut through a group.
+void appendOddLines(platform::SecretText& out, platform::Bytes bytes, size_t lineLength) {
+    platform::SecretText body;
+    body.reserve(encodedSize(bytes.size()) + sizeof body);
+    appendUnbroken(body, bytes);
+    for (size_t start = 0; start < body.size(); start += lineLength) {
+        if (start != 0) out += '\n';
+        out += std::string_view(body).substr(start, lineLength);
+    }
+}
+
+// --- Decoding
+
+constexpr uint8_t kNoSymbol = 0xFF;
+constexpr uint32_t kNoGroup = 0xFF000000;
+/// What a value means at each of the four places of a group.
+using PlaceTable = std::array<uint32_t, 256>;
+
+constexpr std::array<uint8_t, 256> kSymbolValues = [] {
+    std::array<uint8_t, 256> values{};
+    values.fill(kNoSymbol);
+    for (uint8_t i = 0; i < 64; ++i) values[static_cast<uint8_t>(kAlphabet[i])] = i;
+    return values;
+}();
+
+/// Whatever is no symbol sets bits that no group has, so that one test serves all four.
+constexpr std::array<PlaceTable, 4> kPlaces = [] {
+    std::array<PlaceTable, 4> places{};
+    for (size_t place = 0; place < places.size(); ++place) {
+        for (size_t byte = 0; byte < kSymbolValues.size(); ++byte) {
+            const uint32_t value = kSymbolValues[byte];
+            places[place][byte] = value == kNoSymbol ? kNoGroup : value << (18 - 6 * place);
+        }
+    }
+    return places;
+}();
+
+/// Puts symbols together to groups of four and groups to bytes.
+class GroupDecoder {
+  public:
+    explicit GroupDecoder(uint8_t* out) : start_(out), out_(out) {}
+
+    /// Takes whole groups for as long as four symbols stand together; the number of characters taken.
+    size_t takeGroups(platform::Bytes text) {
+        if (inGroup_ != 0) return 0;
+        size_t i = 0;
+        for (; i + 4 <= text.size(); i += 4) {
+            const uint32_t group = kPlaces[0][text[i]] | kPlaces[1][text[i + 1]] | kPlaces[2][text[i + 2]] |
+                                   kPlaces[3][text[i + 3]];
+            if ((group & kNoGroup) != 0) break;
+            emit(group, 3);
+        }
+        return i;
+    }
+
+    /// Takes one symbol; true when it completed a group, which the caller then emits.
+    bool take(uint32_t value) {
+        group_ = (group_ << 6U) | value;
+        inGroup_ = (inGroup_ + 1) % 4;
+        return inGroup_ == 0;
+    }
+
+    void emitGroup(size_t bytes) { emit(std::exchange(group_, 0), bytes); }
+
+    /// Two or three symbols left over give one byte or two.
+    void emitRest() {
+        if (inGroup_ >= 2) emit(group_ << (inGroup_ == 3 ? 6U : 12U), inGroup_ - 1);
+    }
+
+    size_t size() const { return static_cast<size_t>(out_ - start_); }
+
+  private:
+    void emit(uint32_t group, size_t bytes) {
+        *out_++ = static_cast<uint8_t>(group >> 16U);
+        if (bytes > 1) *out_++ = static_cast<uint8_t>(group >> 8U);
+        if (bytes > 2) *out_++ = static_cast<uint8_t>(group);
+    }
+
+    uint8_t* const start_;
+    uint8_t* out_;
+    uint32_t group_ = 0;
+    size_t inGroup_ = 0;
+};
+
+bool isSpace(uint8_t byte) { return byte == ' ' || (byte >= '\t' && byte <= '\r'); }
+
+}  // namespace
+
+String base64Encode(const Data& data, std::string_view prefix, std::string_view suffix, size_t lineLength) {
+    if (!data || data.size() > kMaxBase64InputBytes) return nullptr;
+    const size_t bodySize = encodedSize(data.size());
+    platform::SecretText text;
+    text.reserve(prefix.size() + bodySize + (lineLength ? bodySize / lineLength : 0) + suffix.size() + sizeof text);
+    text += prefix;
+    if (lineLength == 0) {
+        appendUnbroken(text, data.bytes());
+    } else if (lineLength % 4 == 0 && lineLength <= BlockWriter::kBlock / 2) {
+        appendLines(text, data.bytes(), lineLength, "\n");
+    } else {
+        appendOddLines(text, data.bytes(), lineLength);
+    }
+    if (lineLength != 0 && bodySize != 0 && bodySize % lineLength == 0) text += '\n';
+    text += suffix;
+    return String(std::string_view(text));
+}
+
+Data base64Decode(const String& text) {
+    if (text.empty()) return {};
+    const platform::Bytes symbols = platform::bytesOf(text.view());
+    return Data::filledBy(symbols.size() / 4 * 3, [&](uint8_t* out) {
+        GroupDecoder decoder(out);
+        size_t padding = 0;
+        for (size_t i = 0;;) {
+            if (const size_t taken = decoder.takeGroups(symbols.subspan(i))) {
+                i += taken;
+                padding = 0;
+            }
+            if (i == symbols.size() || symbols[i] == '<') return decoder.size();
+            const uint8_t byte = symbols[i++];
+            if (isSpace(byte)) continue;
+            padding = byte == '=' ? padding + 1 : 0;
+            const uint8_t value = byte == '=' ? 0 : kSymbolValues[byte];
+            if (value != kNoSymbol && decoder.take(value)) decoder.emitGroup(3 - std::min<size_t>(padding, 2));
+        }
+    });
+}
+
+void appendXMLRPCBase64(platform::SecretText& text, platform::Bytes bytes, bool separateLines) {
+    if (separateLines) {
+        appendLines(text, bytes, kXMLRPCLineLength, "\r\n");
+    } else {
+        appendUnbroken(text, bytes);
+    }
+}
+
+String xmlrpcBase64Encode(platform::Bytes bytes, bool separateLines) {
+    const size_t bodySize = encodedSize(bytes.size());
+    platform::SecretText text;
+    text.reserve(bodySize + (separateLines ? bodySize / kXMLRPCLineLength * 2 : 0) + sizeof text);
+    appendXMLRPCBase64(text, bytes, separateLines);
+    return String(std::string_view(text));
+}
+
+Data xmlrpcBase64Decode(std::string_view text) {
+    const platform::Bytes symbols = platform::bytesOf(text);
+    return Data::filledBy((symbols.size() + 3) / 4 * 3, [&](uint8_t* out) {
+        GroupDecoder decoder(out);
+        for (size_t i = 0;;) {
+            i += decoder.takeGroups(symbols.subspan(i));
+            while (i < symbols.size() && kSymbolValues[symbols[i]] == kNoSymbol) ++i;
+            if (i == symbols.size()) break;
+            // Four symbols that stand together are taken at once, unless they would begin inside a group.
+            if (decoder.isBetweenGroups() && i + 4 <= symbols.size()) continue;
+            if (decoder.take(kSymbolValues[symbols[i++]])) decoder.emitGroup(3);
+        }
+        decoder.emitRest();
+        return decoder.size();
+    });
+}
+
+}  // namespace veltoid

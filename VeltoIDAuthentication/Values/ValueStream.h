@@ -1,0 +1,49 @@
+// Values to and from the platform's event form.
+#pragma once
+
+#include <vector>
+
+#include "Platform/ValueSink.h"
+#include "Values/Value.h"
+
+namespace veltoid {
+
+/// Writes the value; what the event form does not carry (absent, URL, Error, objects) becomes null.
+void writeValue(const Value& value, platform::ValueSink& sink);
+
+/// Builds one Value from events. File descriptors have no Value form and are left out.
+class ValueBuilder : public platform::ValueSink {
+  public:
+    void null() override { add(Value::null()); }
+    void boolean(bool value) override { add(Value::boolean(value)); }
+    void integer(int64_t value) override { add(Value::int64(value)); }
+    void unsignedInteger(uint64_t value) override { add(Value::uint64(value)); }
+    void real(double value) override { add(Value::real(value)); }
+    void singleReal(float value) override { add(Value::singleReal(value)); }
+    void string(std::string_view utf8) override { add(String(utf8)); }
+    void data(platform::Bytes bytes) override { add(Data(bytes)); }
+    void date(double seconds) override { add(Value::date(seconds)); }
+    void uuid(std::span<const uint8_t, 16> bytes) override { add(Value::uuid(bytes)); }
+    void fileDescriptor(int) override {}
+    void beginArray() override { open_.push_back({Array(), {}, {}}); }
+    void endArray() override;
+    void beginDictionary() override { open_.push_back({{}, Dictionary(), {}}); }
+    void key(std::string_view utf8) override { open_.back().key = String(utf8); }
+    void endDictionary() override;
+
+    /// The value, once it is complete; absent before.
+    const Value& value() const { return value_; }
+
+  private:
+    struct Level {
+        std::optional<Array> array;
+        std::optional<Dictionary> dictionary;
+        String key;
+    };
+    void add(Value value);
+
+    std::vector<Level> open_;
+    Value value_;
+};
+
+}  // namespace veltoid

@@ -1,0 +1,112 @@
+#include "VeltoIDAuthd/AccountStatus.h"
+
+#include <unistd.h>
+
+#include "Logging/Log.h"
+#include "Platform/Clock.h"
+#include "Platform/LockState.h"
+#include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
+
+namespace veltoid {
+namespace {
+
+const double kLaunchTime = platform::Clock::shared().now();
+
+/// Null for a state that clients have no name for.
+String nameOf(AccountState state) {
+    switch (state) {
+        case AccountState::NoEncodedDSID: return "NoEncodedDSID";
+        case AccountState::PasswordInaccessibleInKeychain: return "PasswordInaccessibleInKeychain";
+        case AccountState::PasswordInvalid: return "PasswordInvalid";
+        case AccountState::NoCertificate: return "NoCertificate";
+        case AccountState::CertificateRevoked: return "CertificateRevoked";
+        case AccountState::CertificateExpired: return "CertificateExpired";
+        case AccountState::Unknown: return "Unknown";
+        case AccountState::CertificateOK: return "CertificateOK";
+        case AccountState::CertificateAssumedOK: return "CertificateAssumedOK";
+        case AccountState::CertificateShouldBeRenewed: return "CertificateShouldBeRenewed";
+        case AccountState::CertificateMustBeRenewed: return "CertificateMustBeRenewed";
+        case AccountState::ValidationRecordNeedsToBeUpdated: return "VeltoIDValidationRecordNeedsToBeUpdated";
+        case AccountState::CertificatePending: return "CertificatePending";
+    }
+    return nullptr;
+}
+
+/// What the override says; none without one.
+std::optional<bool> userActionOverride() {
+    const String text = __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaAccountRequiresUserActionKey,
+                                                     Value::Kind::String)
+                            .asString();
+    if (!text) return std::nullopt;
+    const bool required = text != "0";
+    VELTOID_LOG_FROM("copyAccountStatusesDictionary", kWarning,
+                     "copyAccountStatusesDictionaryVeltoIDAccountStatusRequiresUserAction override value "
+                         << (required ? 1 : 0));
+    return required;
+}
+
+/// None while the password may yet become readable.
+std::optional<bool> requiresUserAction(AccountState state) {
+    if (const auto override = userActionOverride()) return override;
+    if (state == AccountState::PasswordInaccessibleInKeychain)
+        return platform::hasBeenUnlockedSinceBoot() ? std::optional(true) : std::nullopt;
+    return state == AccountState::PasswordInvalid;
+}
+
+Dictionary copyAccountStatus(const String& name, const Dictionary& options) {
+    Dictionary status;
+    Dictionary record;
+    if (__VeltoIDDBCopyVeltoIDAccount(name, &record))
+        status.set(kVeltoIDAccountLastValidationDateKey, record[kVeltoIDAccountLastValidationDateKey]);
+    std::optional<double> nextAction;
+    if (copyNextActionDateForAccount(name, &nextAction) && nextAction)
+        status.set("NextActionTime", Value::date(*nextAction));
+
+    const AccountState state = checkAccountAndDetermineNextAction(name, options);
+    status.set("AccountState", nameOf(state));
+    if (state == AccountState::CertificatePending)
+        if (const auto nextFetch = record.date("NextCertificateFetchDate"))
+            status.set("NextFetchAttempt", Value::date(*nextFetch));
+    if (const auto required = requiresUserAction(state))
+        status.set("AccountRequiresUserAction", Value::boolean(*required));
+    return status;
+}
+
+Dictionary copyStatusOfEveryAccount(const Dictionary& options) {
+    Dictionary statuses;
+    Array names;
+    __VeltoIDCopyVeltoIDs(options, &names);
+    for (const Value& name : names)
+        if (name.isString()) statuses.set(name.asString(), copyAccountStatus(name.asString(), options));
+    return statuses;
+}
+
+}  // namespace
+
+double launchTime() { return kLaunchTime; }
+
+Dictionary copyDeviceStatusDictionary() {
+    return {{"DeviceUnlockedSinceBoot", Value::boolean(platform::hasBeenUnlockedSinceBoot())}};
+}
+
+Dictionary copyAccountStatusesDictionary(const Dictionary& options) {
+    Dictionary status;
+    status.set("AccountStatuses", copyStatusOfEveryAccount(options));
+    if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(false, false)) status.set("DirtyAccounts", *dirty);
+    if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(false, true))
+        status.set("DirtyAccountsAndCertificates", *dirty);
+    for (const std::string_view key : {kVeltoIDMetaLastSuccessfulConnectKey, kVeltoIDMetaLastConnectAttemptKey})
+        status.set(key, __VeltoIDDBCopyMetaInfoValue(nullptr, options, key));
+    status.set("LaunchTime", Value::date(kLaunchTime));
+    if (const auto next = nextLaunchDate()) status.set("NextLaunchTime", Value::date(*next));
+    status.set("pid", Value::int64(getpid()));
+    for (const auto& [key, value] : copyDeviceStatusDictionary()) status.set(key, value);
+    return status;
+}
+
+}  // namespace veltoid

@@ -1,0 +1,198 @@
+#include "VeltoIDAuthd/AuthenticationService.h"
+
+#include <algorithm>
+#include <cstdlib>
+
+#include "IPCHelpers/Transaction.h"
+#include "Logging/Log.h"
+#include "Platform/EventLoop.h"
+#include "Values/DictionaryAccess.h"
+#include "Values/LowerCase.h"
+#include "VeltoIDAuthd/AccountStatus.h"
+#include "VeltoIDAuthd/PasswordCheckService.h"
+#include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthd/Request.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AddForget.h"
+
+namespace veltoid {
+namespace {
+
+constexpr const char* kHandlerName = "handleAuthenticationIPCMessage";
+
+/// Long enough for the reply to leave before the process ends (seconds).
+constexpr double kTerminationDelay = 0.1;
+
+struct Outcome {
+    bool success = false;
+    std::optional<Error> error;
+};
+
+void countFor(const String& account, const Request& request, std::string_view counter) {
+    __VeltoIDDBIncrementMetaInfoCounter(account, request.options(), counter, 1);
+}
+
+Outcome ping(Request& /*request*/) { return {true, {}}; }
+
+/// False when the request names nothing that can be set.
+bool setDatabaseValue(const Request& request, bool& success) {
+    const String domain = request.string("domain");
+    const String item = request.string("item");
+    const String key = request.string("key");
+    const Value value = request.value("value");
+    const bool notify = getBool(&request.options(), "Dirty", true);
+    if (!domain || !key) return false;
+    if (domain == "MetaInfo") {
+        success = __VeltoIDDBSetMetaInfoValue(item, key, value);
+    } else if (item && domain == "Accounts") {
+        success = __VeltoIDDBSetAccountValue(item, key, value, notify);
+    } else if (item && domain == "Certificates") {
+        success = __VeltoIDDBSetCertificateValue(item, key, value, notify);
+    } else {
+        return false;
+    }
+    return true;
+}
+
+Outcome setValueOrFail(Request& request) {
+    bool success = false;
+    setDatabaseValue(request, success);
+    return {success, {}};
+}
+
+Outcome setValueIfPossible(Request& request) {
+    bool success = true;
+    setDatabaseValue(request, success);
+    return {success, {}};
+}
+
+/// The agent keeps one account.
+void forgetOtherAccounts(const String& added) {
+    Array names;
+    __VeltoIDDBCopyVeltoIDs(&names);
+    const String addedInLowerCase = lowerCased(added);
+    for (const Value& name : names)
+        if (name.isString() && lowerCased(name.asString()) != addedInLowerCase)
+            __VeltoIDForgetVeltoID(name.asString(), {{"RemovePrivateKeyFromKeychain", Value::boolean(true)}});
+}
+
+Outcome addAccount(Request& request) {
+    Outcome outcome;
+    String encDsId;
+    std::optional<Dictionary> record;
+    outcome.success = __VeltoIDDoAddVeltoID(request.account(), request.string("hashedpassword"), request.options(),
+                                            &encDsId, &record, &outcome.error);
+    countFor(nullptr, request, kVeltoIDAddVeltoIDCountKey);
+    if (!outcome.success) return outcome;
+    __VeltoIDDBSetAccountValue(request.account(), kVeltoIDAccountLastValidationDateKey, Value::null(), true);
+    request.answer("encDsId", encDsId);
+    if (record) request.answer("accountinfo", *record);
+    forgetOtherAccounts(request.account());
+    return outcome;
+}
+
+Outcome getMyInfo(Request& request) {
+    Outcome outcome;
+    Dictionary info;
+    outcome.success = __VeltoIDDoGetMyInfo(request.account(), request.options(), &info, &outcome.error);
+    countFor(request.account(), request, kVeltoIDGetMyInfoCountKey);
+    if (outcome.success) request.answer("info", info);
+    return outcome;
+}
+
+Outcome listAccounts(Request& request) {
+    Outcome outcome;
+    Array names;
+    outcome.success = __VeltoIDCopyVeltoIDs(request.options(), &names, &outcome.error);
+    if (outcome.success) request.answer("result", names);
+    return outcome;
+}
+
+Outcome forgetAccount(Request& request) {
+    Outcome outcome;
+    Dictionary record;
+    if (__VeltoIDDBCopyVeltoIDAccount(request.account(), &record, &outcome.error)) {
+        const String name = record.string(kVeltoIDAccountNameKey);
+        outcome.success = __VeltoIDForgetVeltoID(name, request.options(), &outcome.error);
+        if (outcome.success) {
+            request.answer("VeltoID", name);
+            request.answer("encDSID", record.string(kVeltoIDAccountDSIDKey));
+            request.answer("accountInfo", record);
+        }
+    }
+    countFor(nullptr, request, kVeltoIDForgetVeltoIDCountKey);
+    return outcome;
+}
+
+Outcome verifyPassword(Request& request) {
+    Outcome outcome;
+    outcome.success = verifyRequestedPassword(request, &outcome.error);
+    return outcome;
+}
+
+Outcome copyAllContents(Request& request) {
+    std::optional<Dictionary> contents;
+    const bool success = __VeltoIDDBCopyAllContents(&contents);
+    if (contents) request.answer("result", *contents);
+    return {success, {}};
+}
+
+void terminateAfterReply() {
+    platform::WorkQueue::main().asyncAfter(kTerminationDelay, [] {
+        VELTOID_LOG_FROM(kHandlerName, kNotice,
+                         "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
+                         "request.");
+        platform::message_service::flush();
+        platform::event_loop::exitProcess(EXIT_SUCCESS);
+    });
+}
+
+Outcome status(Request& request) {
+    const bool terminates = getBool(&request.options(), "VeltoIDAuthenticationStatusTerminateServer", false);
+    if (terminates) computeRelaunchFromAccounts();
+    request.answer("status", terminates ? copyDeviceStatusDictionary() : copyAccountStatusesDictionary(request.options()));
+    if (terminates) terminateAfterReply();
+    return {true, {}};
+}
+
+struct Command {
+    int64_t number;
+    Outcome (*run)(Request& request);
+};
+
+constexpr int64_t kPingCommand = 0x1;
+constexpr int64_t kTerminateCommand = 0x9999;
+
+constexpr Command kCommands[] = {
+    {kPingCommand, ping},       {0xFE, setValueOrFail},  {0xFF, setValueIfPossible}, {0x120, addAccount},
+    {0x130, getMyInfo},         {0x150, listAccounts},   {0x160, forgetAccount},     {0x180, verifyPassword},
+    {0x500, copyAllContents},   {0x510, status},
+};
+
+Outcome dispatch(Request& request) {
+    const auto* command = std::find_if(std::begin(kCommands), std::end(kCommands),
+                                       [&](const Command& known) { return known.number == request.command(); });
+    return command != std::end(kCommands) ? command->run(request) : Outcome();
+}
+
+}  // namespace
+
+void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
+    const Transaction guard(kHandlerName);
+    Request request(message);
+    if (request.command() == kTerminateCommand) {
+        computeRelaunchFromAccounts();
+        platform::event_loop::exitProcess(EXIT_SUCCESS);
+    }
+    const Outcome outcome = dispatch(request);
+    request.finish(outcome.success, outcome.error);
+}
+
+bool isAnsweredAtOnce(platform::IncomingMessage& message) { return message.peekInteger("command") == kPingCommand; }
+
+}  // namespace veltoid

@@ -1,0 +1,60 @@
+#include "VeltoIDAuthd/Listeners.h"
+
+#include <memory>
+
+#include "IPCHelpers/Transaction.h"
+#include "Platform/MessageService.h"
+#include "VeltoIDAuthd/AuthenticationService.h"
+#include "VeltoIDAuthd/PasswordCheckService.h"
+#include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+
+namespace veltoid {
+namespace {
+
+using platform::ConnectionError;
+using platform::PeerConnection;
+
+using RequestHandler = void (*)(platform::IncomingMessage& message);
+
+void serve(PeerConnection& peer, RequestHandler handle) {
+    peer.setTargetQueue(platform::WorkQueue("client " + std::to_string(peer.processID())));
+    // The queue ends with the last event that uses it, so the end of the connection needs no action of its own.
+    peer.setEventHandler([handle](const platform::PeerEvent& event) {
+        if (const auto* message = std::get_if<std::shared_ptr<platform::IncomingMessage>>(&event)) handle(**message);
+    });
+    peer.setAnsweredAtOnce(isAnsweredAtOnce);
+    peer.resume();
+}
+
+/// Anything but the notice that the process is about to be ended means that clients may not reach it any more.
+void handleAuthenticationListenerError(ConnectionError error) {
+    if (error != ConnectionError::TerminationImminent) computeRelaunchFromAccounts();
+    __VeltoIDDBSynchronize();
+}
+
+}  // namespace
+
+void registerAuthenticationListener(const std::string& serviceName) {
+    const Transaction keepAlive("registerAuthenticationListener");
+    const auto listener = platform::Listener::create(serviceName, [](const platform::ListenerEvent& event) {
+        if (const auto* error = std::get_if<ConnectionError>(&event)) {
+            handleAuthenticationListenerError(*error);
+        } else {
+            serve(*std::get<std::shared_ptr<PeerConnection>>(event), handleAuthenticationIPCMessage);
+        }
+    });
+    listener->resume();
+}
+
+void registerPasswordCheckListener() {
+    const Transaction keepAlive("registerPasswordCheckListener");
+    const auto listener =
+        platform::Listener::create(kVeltoIDPasswordCheckServiceName, [](const platform::ListenerEvent& event) {
+            if (const auto* peer = std::get_if<std::shared_ptr<PeerConnection>>(&event))
+                serve(**peer, handlePasswordCheckIPCMessage);
+        });
+    listener->resume();
+}
+
+}  // namespace veltoid

@@ -1,0 +1,15 @@
+// The named services: each client connection gets a serial queue of its own, on which its requests are handled.
+#pragma once
+
+#include <string>
+
+namespace veltoid {
+
+inline constexpr const char* kVeltoIDAuthenticationServiceName = "com.velto.harbwell.veltoid.authentication";
+inline constexpr const char* kVeltoIDPasswordCheckServiceName = "com.velto.harbwell.veltoid.checkpassword";
+
+/// Main queue, once each.
+void registerAuthenticationListener(const std::string& serviceName);
+void registerPasswordCheckListener();
+
+}  // namespace veltoid

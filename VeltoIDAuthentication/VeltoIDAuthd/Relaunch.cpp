@@ -1,0 +1,86 @@
+#include "VeltoIDAuthd/Relaunch.h"
+
+#include <cstdint>
+#include <limits>
+#include <memory>
+#include <mutex>
+
+#include "IPCHelpers/Transaction.h"
+#include "Platform/Clock.h"
+#include "Platform/ServiceManager.h"
+#include "Platform/WorkQueue.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
+
+namespace veltoid {
+namespace {
+
+constexpr double kNoParticularTime = 1e10;
+constexpr double kLongestInterval = std::numeric_limits<uint32_t>::max();
+
+/// Changed on the main queue only; the lock is for the status, which reads it from a client's queue.
+struct NextLaunch {
+    std::mutex mutex;
+    std::optional<double> date;
+
+    static NextLaunch& shared() {
+        static auto* next = new NextLaunch;
+        return *next;
+    }
+};
+
+/// Main queue.
+void handOver(double requested, bool force) {
+    const double now = platform::Clock::shared().now();
+    const double target = requested > 0 ? requested : now + kNoParticularTime;
+    NextLaunch& next = NextLaunch::shared();
+    const std::lock_guard lock(next.mutex);
+    if (!force && next.date && target > *next.date) return;
+    const double delta = target - now;
+    next.date.reset();
+    if (delta < 0) return;
+    next.date = now + delta;
+    platform::ServiceManager::shared().setStartInterval(
+        delta >= kLongestInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
+}
+
+}  // namespace
+
+void scheduleRelaunch(std::optional<double> date, bool force) {
+    const auto keepAlive = std::make_shared<Transaction>("scheduleRelaunch");
+    platform::WorkQueue::main().async([keepAlive, requested = date.value_or(0), force] {
+        handOver(requested, force);
+        keepAlive->close();
+    });
+}
+
+Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
+    Array names;
+    Array needing;
+    std::optional<double> earliest;
+    __VeltoIDDBCopyVeltoIDs(&names);
+    for (const Value& name : names) {
+        std::optional<double> date;
+        if (!copyNextActionDateForAccount(name.asString(), &date) || !date) continue;
+        needing.append(name);
+        if (!earliest || *date < *earliest) earliest = date;
+    }
+    if (earliestDate != nullptr) *earliestDate = earliest;
+    return needing;
+}
+
+void computeRelaunchFromAccounts() {
+    std::optional<double> earliest;
+    const Array accounts = copyAccountsNeedingAction(&earliest);
+    if (!accounts.empty() && earliest) scheduleRelaunch(earliest, true);
+    __VeltoIDDBSynchronize();
+}
+
+std::optional<double> nextLaunchDate() {
+    NextLaunch& next = NextLaunch::shared();
+    const std::lock_guard lock(next.mutex);
+    return next.date;
+}
+
+}  // namespace veltoid

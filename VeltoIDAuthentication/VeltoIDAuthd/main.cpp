@@ -1,0 +1,113 @@
+// The agent: opens the log, reads the command line, registers its services and serves the main queue until it is ended.
+#include <sys/prctl.h>
+#include <sys/resource.h>
+
+#include <clocale>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+
+#include "Logging/Log.h"
+#include "Platform/Clock.h"
+#include "Platform/EventLoop.h"
+#include "Platform/MessageService.h"
+#include "Platform/SystemLog.h"
+#include "Platform/Transactions.h"
+#include "VeltoIDAuthd/CommandLine.h"
+#include "VeltoIDAuthd/Listeners.h"
+#include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
+
+namespace veltoid {
+namespace {
+
+/// A relaunch is asked for at start, so that an agent that dies early comes back (seconds).
+constexpr double kRelaunchAfterStart = 30;
+
+/// How long open transactions may hold up the end after SIGTERM (seconds).
+constexpr double kLongestTermination = 10;
+
+/// Memory of this process holds password hashes: it is never written to a core file, nor open to debuggers.
+void keepMemoryPrivate() {
+    const rlimit none{0, 0};
+    setrlimit(RLIMIT_CORE, &none);
+#ifndef VELTOID_SANITIZED
+    // Sanitizers look at their own process the way a debugger does.
+    prctl(PR_SET_DUMPABLE, 0);
+#endif
+}
+
+[[noreturn]] void exitWithUsage(int argc, char* const* argv, const CommandLineError& error) {
+    VELTOID_LOG_FROM("main", kError, "Got an unexpected argument; ch = " << error.option << " index=" << error.index);
+    std::printf("%s : [ --checkpassword ] [ --authentication ]\n", argc > 0 ? argv[0] : "unknown");
+    platform::event_loop::exitProcess(-1);
+}
+
+void exitOnce() {
+    __VeltoIDDBSynchronize();
+    platform::message_service::flush();
+    platform::event_loop::exitProcess(EXIT_SUCCESS);
+}
+
+/// The listeners save what they have, requests in work are finished, and the agent leaves.
+void terminate() {
+    platform::message_service::announceTermination();
+    platform::transactions::whenNoneIsOpen(exitOnce);
+    platform::WorkQueue::main().asyncAfter(kLongestTermination, exitOnce);
+}
+
+void handleSignals() {
+    static const auto* flushQueue = new platform::WorkQueue("flush on interrupt");
+    platform::event_loop::onSignal(SIGINT, [] { flushQueue->async([] { __VeltoIDDBSynchronize(); }); });
+    platform::event_loop::onSignal(SIGTERM, terminate);
+}
+
+void prepareDatabase(const CommandLine& line) {
+    if (line.preferencesDomainName) __VeltoIDDBSetPreferencesDomainName(*line.preferencesDomainName);
+    __VeltoIDDBSetUsePreferences(line.usePreferences);
+    setUseSystemKeychain(line.usePreferences);
+    for (const auto& [key, value] : line.metaInfoValues) __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+}
+
+void startServices(const CommandLine& line) {
+    if (line.runsAuthentication()) {
+        scheduleRelaunch(platform::Clock::shared().now() + kRelaunchAfterStart, true);
+        registerAuthenticationListener(
+            line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
+    }
+    if (line.checkPassword) registerPasswordCheckListener();
+}
+
+/// Every account is validated at its next check.
+void forceValidationOfEveryAccount() {
+    Array names;
+    __VeltoIDDBCopyVeltoIDs(&names);
+    for (const Value& name : names)
+        __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true), true);
+}
+
+}  // namespace
+}  // namespace veltoid
+
+int main(int argc, char** argv) {
+    using namespace veltoid;
+    keepMemoryPrivate();
+    std::setlocale(LC_CTYPE, "");
+    platform::event_loop::prepare();
+    platform::SystemLog::shared().open(program_invocation_short_name);
+
+    CommandLineError error;
+    const auto line = parseCommandLine(argc, argv, error);
+    if (!line) exitWithUsage(argc, argv, error);
+    prepareDatabase(*line);
+    setRelaunchScheduler(scheduleRelaunch);
+    handleSignals();
+    startServices(*line);
+    if (line->leaks) forceValidationOfEveryAccount();
+    platform::event_loop::run();
+}

@@ -1,0 +1,105 @@
+// Keys of the account database: top level, account records, certificate entries, meta information.
+#pragma once
+
+#include <array>
+#include <string_view>
+
+namespace veltoid {
+
+inline constexpr std::string_view kVeltoIDDBDefaultDomain = "com.velto.harbwell.veltoidauthenticationinfo";
+
+// Top level of the preference domain.
+inline constexpr std::string_view kVeltoIDDBVersionKey = "Version";
+inline constexpr std::string_view kVeltoIDDBCreationDateKey = "CreationDate";
+inline constexpr std::string_view kVeltoIDDBAccountsKey = "Accounts";
+inline constexpr std::string_view kVeltoIDDBCertificatesKey = "AuthCertificates";
+inline constexpr std::string_view kVeltoIDDBMetaInfoKey = "MetaInfo";
+inline constexpr std::string_view kVeltoIDDBAccessorVersionsKey = "AccessorVersions";
+
+// Account records.
+inline constexpr std::string_view kVeltoIDAccountNameKey = "VeltoID";
+inline constexpr std::string_view kVeltoIDAccountDSIDKey = "encDsId";
+inline constexpr std::string_view kVeltoIDAccountHashedPasswordKey = "HashedPassword";
+inline constexpr std::string_view kVeltoIDAccountHashedPasswordKeychainReferenceKey = "HashedPasswordRef";
+inline constexpr std::string_view kVeltoIDAccountFirstNameKey = "FirstName";
+inline constexpr std::string_view kVeltoIDAccountLastNameKey = "LastName";
+inline constexpr std::string_view kVeltoIDAccountPrimaryEmailKey = "PrimaryEmail";
+/// The key is spelled so in every stored database.
+inline constexpr std::string_view kVeltoIDAccountEmailAddressesKey = "EmailAddresess";
+inline constexpr std::string_view kVeltoIDAccountValidatedEmailKey = "ValidatedEmail";
+inline constexpr std::string_view kVeltoIDAccountValidatedPhonesKey = "ValidatedPhones";
+inline constexpr std::string_view kVeltoIDAccountCreationDateKey = "CreationDate";
+inline constexpr std::string_view kVeltoIDAccountModificationDateKey = "ModificationDate";
+inline constexpr std::string_view kVeltoIDAccountLastValidationDateKey = "ValidationDate";
+inline constexpr std::string_view kVeltoIDAccountNextValidationDateKey = "NextValidationDate";
+inline constexpr std::string_view kVeltoIDAccountForceValidationKey = "ForceValidation";
+inline constexpr std::string_view kVeltoIDAccountCertificateTokenKey = "CertificateToken";
+inline constexpr std::string_view kVeltoIDAccountEarliestAllowedConnectionDateKey = "EarliestAllowedConnectionDate";
+inline constexpr std::string_view kVeltoIDAccountClientTooOldKey = "ClientTooOld";
+inline constexpr std::string_view kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
+inline constexpr std::string_view kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
+inline constexpr std::string_view kVeltoIDAccountValidationRecordIdentifierKey =
+    "VeltoIDAccountValidationRecordIdentifierKey";
+inline constexpr std::string_view kVeltoIDAccountValidationRecordDataKey = "VeltoIDAccountValidationRecordData";
+inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckDateKey =
+    "VeltoIDAccountValidationRecordNextCheckDateKey";
+inline constexpr std::string_view kVeltoIDAccountUUIDKey = "AccountUUID";
+inline constexpr std::string_view kVeltoIDAccountStableUUIDKey = "AccountStableUUID";
+inline constexpr std::string_view kVeltoIDAccountServerURLKey = "ServerURL";
+inline constexpr std::string_view kVeltoIDDirtyKey = "Dirty";
+
+// Certificate entries.
+inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentReferenceKey = "CertificateReference";
+inline constexpr std::string_view kVeltoIDCertificatePrivateKeyPersistentReferenceKey =
+    "CertificatePrivateKeyReference";
+inline constexpr std::string_view kVeltoIDCertificateStatusKey = "CertStatus";
+inline constexpr std::string_view kVeltoIDCertificateExpirationDateKey = "Expires";
+inline constexpr std::string_view kVeltoIDCertificateSerialNumberKey = "SerialNumber";
+inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey = "LastSuccessfulValidation";
+
+/// Statuses that the certificate's validity depends on.
+inline constexpr std::string_view kVeltoIDCertificateStatusIssued = "CERT_ISSUED";
+inline constexpr std::string_view kVeltoIDCertificateStatusInvalid = "CERTIFICATE_INVALID";
+
+// Meta information.
+inline constexpr std::string_view kVeltoIDMetaUserUUIDKey = "UserUUID";
+inline constexpr std::string_view kVeltoIDDBServerURLKey = "ServerURL";
+inline constexpr std::string_view kVeltoIDMetaPreExpirationIntervalKey = "PreExpirationInterval";
+inline constexpr std::string_view kVeltoIDMetaAccountPresumedValidIntervalKey = "AccountPresumedValidInterval";
+inline constexpr std::string_view kVeltoIDMetaSendServerMetaInformationItemsKey =
+    "VeltoIDMetaSendServerMetaInformationItems";
+inline constexpr std::string_view kVeltoIDMetaSendServerAccountInformationItemsKey =
+    "VeltoIDMetaSendServerAccountInformationItems";
+inline constexpr std::string_view kVeltoIDMetaLastConnectAttemptKey = "LastConnectAttempt";
+inline constexpr std::string_view kVeltoIDMetaLastSuccessfulConnectKey = "LastSuccessfulConnect";
+inline constexpr std::string_view kVeltoIDMetaAccountRequiresUserActionKey = "AccountRequiresUserAction";
+
+// Counters of the meta information.
+inline constexpr std::string_view kVeltoIDMetaConnectionAttemptCountKey = "VeltoIDMetaConnectionAttemptCount";
+inline constexpr std::string_view kVeltoIDMetaSuccessfulConnectionCountKey = "VeltoIDMetaSuccessfulConnectionCount";
+inline constexpr std::string_view kVeltoIDMetaUnsuccessfulConnectionCountKey =
+    "VeltoIDMetaUnsuccessfulConnectionCount";
+inline constexpr std::string_view kVeltoIDXMLAuthenticateCountKey = "VeltoIDXMLAuthenticateCount";
+inline constexpr std::string_view kVeltoIDXMLSessionReusedCountKey = "VeltoIDXMLSessionReusedCount";
+inline constexpr std::string_view kVeltoIDXMLGetMyInfoCountKey = "VeltoIDXMLGetMyInfoCount";
+inline constexpr std::string_view kVeltoIDAddVeltoIDCountKey = "VeltoIDAddVeltoIDCount";
+inline constexpr std::string_view kVeltoIDForgetVeltoIDCountKey = "VeltoIDForgetVeltoIDCount";
+inline constexpr std::string_view kVeltoIDGetMyInfoCountKey = "VeltoIDGetMyInfoCount";
+
+/// What may be reported to the server, when the server asks for it.
+inline constexpr std::array<std::string_view, 12> kVeltoIDReportableMetaInformation = {
+    "LastConnectAttempt",
+    "LastSuccessfulConnect",
+    "AccountPresumedValidInterval",
+    "AccountValidationInterval",
+    "CertificateValidationInterval",
+    "CertificateRenewalInterval",
+    "UserUUID",
+    "CertificateValidationAssumedOKInterval",
+    "DefaultRelaunchInterval",
+    "VeltoIDMetaInfoValidationRecordRenewalAttemptInterval",
+    "VeltoIDMetaSendServerMetaInformationItems",
+    "VeltoIDMetaSendServerAccountInformationItems",
+};
+
+}  // namespace veltoid

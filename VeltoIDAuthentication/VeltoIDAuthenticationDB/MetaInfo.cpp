@@ -1,0 +1,85 @@
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+
+namespace veltoid {
+namespace {
+
+using database::Store;
+
+constexpr database::Sections kMetaInfoSection{false, false, true};
+
+const Dictionary& defaults() {
+    static const auto* values = new Dictionary{
+        {kVeltoIDDBServerURLKey, kVeltoIDDefaultServerURL},
+        {kVeltoIDMetaPreExpirationIntervalKey, Value::real(kVeltoIDDefaultPreExpirationInterval)},
+    };
+    return *values;
+}
+
+bool fits(const Value& value, std::optional<Value::Kind> requiredKind) {
+    return !value.isAbsent() && (!requiredKind || value.kind() == *requiredKind);
+}
+
+/// Sets or removes one value; false when it is as it should be already.
+bool change(Dictionary& dictionary, const String& key, const Value& value) {
+    if (value.isAbsent() || value.isNull()) return dictionary.remove(key.view());
+    if (dictionary[key.view()] == value) return false;
+    dictionary.set(key, value);
+    return true;
+}
+
+}  // namespace
+
+Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& options, const String& key,
+                                   std::optional<Value::Kind> requiredKind) {
+    if (!key) return {};
+    if (const Value& given = options[key.view()]; fits(given, requiredKind)) return given;
+    const Value stored = database::perform([&](const Store& store) {
+        if (const Dictionary* own = Store::find(store.metaInfo, section))
+            if (const Value& value = (*own)[key.view()]; fits(value, requiredKind)) return value;
+        const Value& value = store.metaInfo[key.view()];
+        return fits(value, requiredKind) ? value : Value();
+    });
+    if (!stored.isAbsent()) return stored;
+    const Value& standard = defaults()[key.view()];
+    return fits(standard, requiredKind) ? standard : Value();
+}
+
+bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const Value& value) {
+    if (!key) return false;
+    return database::perform([&](Store& store) {
+        bool changed = false;
+        if (section) {
+            const Dictionary* existing = Store::find(store.metaInfo, section);
+            Dictionary own = existing != nullptr ? *existing : Dictionary();
+            changed = change(own, key, value);
+            store.metaInfo.set(section, own);
+        } else {
+            changed = change(store.metaInfo, key, value);
+        }
+        if (changed) store.writeSections(kMetaInfoSection, false);
+        return true;
+    });
+}
+
+int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options, const String& key,
+                                            int64_t delta) {
+    if (!key) return 0;
+    const Value current = __VeltoIDDBCopyMetaInfoValue(section, options, key, Value::Kind::Number);
+    const auto sum = static_cast<int64_t>(static_cast<uint64_t>(current.asInt64().value_or(0)) +
+                                          static_cast<uint64_t>(delta));
+    __VeltoIDDBSetMetaInfoValue(section, key, Value::int64(sum));
+    return sum;
+}
+
+std::optional<Dictionary> __VeltoIDDBCopyMetaInformation(const String& section, const Dictionary& options) {
+    Dictionary information;
+    for (const std::string_view key : kVeltoIDReportableMetaInformation)
+        information.set(key, __VeltoIDDBCopyMetaInfoValue(section, options, key));
+    if (information.empty()) return std::nullopt;
+    return information;
+}
+
+}  // namespace veltoid

@@ -1,0 +1,249 @@
+#include "VeltoIDAuthenticationDB/Store.h"
+
+#include <algorithm>
+#include <atomic>
+#include <vector>
+
+#include "Platform/Clock.h"
+#include "Values/Digest.h"
+#include "Values/ValueStream.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+
+namespace veltoid {
+namespace database {
+namespace {
+
+// Agents up to these accessor versions left something behind that the load puts right.
+constexpr double kLastWithCertificatesInRecords = 478;
+constexpr double kLastWithVersionsInMetaInfo = 481;
+constexpr double kLastWithoutUserUUID = 508;
+constexpr double kLastWithCertificateLists = 617;
+
+Store& store() {
+    static auto* shared = new Store;
+    return *shared;
+}
+
+/// The stored value, absent when there is none; nothing when the preference store cannot be read now.
+std::optional<Value> readPreference(const platform::Preferences& preferences, std::string_view key) {
+    ValueBuilder builder;
+    if (preferences.read(key, builder) == platform::Preferences::ReadResult::Failed) return std::nullopt;
+    return builder.value();
+}
+
+std::pair<std::string, platform::ValueWriter> preference(std::string_view key, const Value& value) {
+    return {std::string(key), [value](platform::ValueSink& sink) { writeValue(value, sink); }};
+}
+
+enum class OtherEntries { Drop, Keep };
+
+/// The entries of a stored section; those that are no dictionaries are dropped or kept.
+Dictionary sectionFrom(const Value& stored, OtherEntries others) {
+    Dictionary section;
+    if (const Dictionary* entries = stored.asDictionary()) {
+        for (const auto& [name, value] : *entries)
+            if (others == OtherEntries::Keep || value.isDictionary()) section.set(name, value);
+    }
+    return section;
+}
+
+/// Changes every record of the accounts by `change(name, record)`.
+template <typename Change>
+void changeEveryRecord(Dictionary& accounts, Change change) {
+    const Dictionary before = accounts;
+    for (const auto& [name, value] : before) {
+        Dictionary record = *value.asDictionary();
+        change(name, record);
+        accounts.set(name, record);
+    }
+}
+
+/// Numbers in descending order, before everything else.
+bool descendingNumbers(const Value& a, const Value& b) {
+    const std::optional<double> x = a.asDouble();
+    const std::optional<double> y = b.asDouble();
+    if (x && y) return *x > *y;
+    return x.has_value() && !y.has_value();
+}
+
+}  // namespace
+
+platform::WorkQueue queue() {
+    static const auto* shared = new platform::WorkQueue("VeltoIDDBQueue");
+    return *shared;
+}
+
+Store& loadedStore() {
+    static std::atomic<bool> loaded{false};
+    if (!loaded.load(std::memory_order_acquire)) {
+        queue().sync([] {
+            if (!loaded.load(std::memory_order_relaxed)) loaded.store(store().load(), std::memory_order_release);
+        });
+    }
+    return store();
+}
+
+const Dictionary* Store::find(const Dictionary& section, const String& key) {
+    return key ? section.dictionary(key.view()) : nullptr;
+}
+
+platform::Preferences Store::preferences() const {
+    return platform::Preferences(domainName_ ? domainName_.text() : std::string(kVeltoIDDBDefaultDomain));
+}
+
+bool Store::load() {
+    if (!usePreferences_) return true;
+    const platform::Preferences domain = preferences();
+    const std::optional<Value> version = readPreference(domain, kVeltoIDDBVersionKey);
+    if (!version || !keepOrInitialize(domain, *version)) return false;
+
+    const auto storedAccounts = readPreference(domain, kVeltoIDDBAccountsKey);
+    const auto storedCertificates = readPreference(domain, kVeltoIDDBCertificatesKey);
+    const auto storedMetaInfo = readPreference(domain, kVeltoIDDBMetaInfoKey);
+    const auto storedVersions = readPreference(domain, kVeltoIDDBAccessorVersionsKey);
+    if (!storedAccounts || !storedCertificates || !storedMetaInfo || !storedVersions) return false;
+
+    accounts = sectionFrom(*storedAccounts, OtherEntries::Drop);
+    certificates = sectionFrom(*storedCertificates, OtherEntries::Drop);
+    metaInfo = sectionFrom(*storedMetaInfo, OtherEntries::Keep);
+    canWrite_ = true;
+    Array versions = storedVersions->asArray() != nullptr ? *storedVersions->asArray() : Array();
+    const bool migrated = migrate(domain, versions);
+    const bool recorded = recordAccessor(domain, versions);
+    if (migrated || recorded) writeSections({true, true, true}, false);
+    return true;
+}
+
+/// Keeps stored data of a usable version; otherwise starts the domain afresh. False when that fails.
+bool Store::keepOrInitialize(const platform::Preferences& domain, const Value& version) {
+    const std::optional<int64_t> number = version.asInt64();
+    if (number && static_cast<uint64_t>(*number) >= static_cast<uint64_t>(kVeltoIDDBVersion)) return true;
+    return domain.remove(domain.keys()) &&
+           domain.set({preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion)),
+                       preference(kVeltoIDDBCreationDateKey, Value::date(platform::Clock::shared().now()))}) &&
+           domain.synchronize();
+}
+
+/// Puts right what the agents named in "AccessorVersions" left. True when something has to be written; the versions are
+/// cut where they were cut in the domain.
+bool Store::migrate(const platform::Preferences& domain, Array& versions) {
+    std::vector<Value> sorted(versions.begin(), versions.end());
+    std::stable_sort(sorted.begin(), sorted.end(), descendingNumbers);
+
+    bool changed = false;
+    for (size_t i = 0; i < sorted.size(); ++i) {
+        const double version = sorted[i].asDouble().value_or(0);
+        if (!(version > 0)) continue;
+        if (version <= kLastWithCertificatesInRecords) {
+            changeEveryRecord(accounts, [](const String&, Dictionary& record) {
+                record.set(kVeltoIDDirtyKey, Value::boolean(true));
+                record.remove("Certificate");
+                record.remove("PrivateKey");
+            });
+            sorted.resize(i + 1);
+            versions = Array();
+            for (const Value& kept : sorted) versions.append(kept);
+            domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
+            domain.synchronize();
+        } else if (version <= kLastWithVersionsInMetaInfo) {
+            metaInfo.remove(kVeltoIDDBAccessorVersionsKey);
+        } else if (version <= kLastWithoutUserUUID) {
+            changed = addUserUUID() || changed;
+        } else if (version <= kLastWithCertificateLists) {
+            changeEveryRecord(accounts,
+                              [](const String&, Dictionary& record) { record.remove("Certificates"); });
+        }
+    }
+    return changed;
+}
+
+/// Gives the device its identifier, and every account the one derived from it. False when the device has one.
+bool Store::addUserUUID() {
+    if (metaInfo.contains(kVeltoIDMetaUserUUIDKey)) return false;
+    metaInfo.set(kVeltoIDMetaUserUUIDKey, randomUUIDText());
+    changeEveryRecord(accounts, [this](const String& name, Dictionary& record) {
+        deriveAccountUUIDs(name, record, metaInfo);
+    });
+    return true;
+}
+
+/// Adds this agent to the versions that have opened the domain. True when it was not among them.
+bool Store::recordAccessor(const platform::Preferences& domain, Array versions) {
+    const Value own = Value::real(kVeltoIDDBAccessorVersion);
+    if (std::find(versions.begin(), versions.end(), own) != versions.end()) return false;
+    versions.append(own);
+    domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
+    domain.synchronize();
+    return true;
+}
+
+void Store::writeSections(const Sections& sections, bool signal) {
+    if (usePreferences_ && canWrite_) {
+        std::vector<std::pair<std::string, platform::ValueWriter>> values;
+        if (sections.accounts) values.push_back(preference(kVeltoIDDBAccountsKey, accounts));
+        if (sections.certificates) values.push_back(preference(kVeltoIDDBCertificatesKey, certificates));
+        if (sections.metaInfo) values.push_back(preference(kVeltoIDDBMetaInfoKey, metaInfo));
+        preferences().set(values);
+        planFlush();
+    }
+    if (signal && changeSemaphore_) changeSemaphore_->signal();
+}
+
+void Store::planFlush() {
+    if (pendingFlush_) return;
+    pendingFlush_ = std::make_unique<Transaction>("VeltoIDDBFlush");
+    queue().asyncAfter(kVeltoIDDBFlushDelay, [this] { synchronize(); });
+}
+
+bool Store::synchronize() {
+    const Transaction keepAlive("VeltoIDDBSynchronize");
+    preferences().synchronize();
+    pendingFlush_.reset();
+    return true;
+}
+
+}  // namespace database
+
+using database::Store;
+
+void __VeltoIDDBSetPreferencesDomainName(const String& name) {
+    database::queue().sync([&] { database::store().domainName_ = name; });
+}
+
+void __VeltoIDDBSetUsePreferences(bool usePreferences) {
+    database::queue().sync([&] {
+        Store& store = database::store();
+        if (store.usePreferences_) store.writeSections({true, true, true}, false);
+        store.usePreferences_ = usePreferences;
+    });
+}
+
+void __VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore) {
+    database::queue().sync([&] { database::store().changeSemaphore_ = semaphore; });
+}
+
+bool __VeltoIDDBSynchronize() {
+    return database::queue().sync([] {
+        Store& store = database::store();
+        return !store.usePreferences_ || store.synchronize();
+    });
+}
+
+bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {
+    if (contents == nullptr) return true;
+    *contents = database::perform([](const Store& store) {
+        Dictionary all;
+        if (store.usePreferences_) {
+            const platform::Preferences domain = store.preferences();
+            for (const std::string& key : domain.keys())
+                all.set(String(key), database::readPreference(domain, key).value_or(Value()));
+        } else {
+            all = {{"Accounts", store.accounts}, {"Certificates", store.certificates}, {"MetaInfo", store.metaInfo}};
+        }
+        return all;
+    });
+    return true;
+}
+
+}  // namespace veltoid

@@ -1,0 +1,106 @@
+// The account database: account records, certificate entries and meta information, loaded once from a preference domain,
+// written back section by section and flushed lazily.
+//
+// Everything here belongs to one serial queue, VeltoIDDBQueue: public operations run their bodies on it synchronously and
+// never call each other from there. Bodies may call the keychain, which never calls back.
+//
+// Changes reach the preference store at once and survive the process; making them durable on disk is put off for three
+// seconds, so that a burst of changes costs one flush, and a transaction keeps the agent alive until it has run.
+#pragma once
+
+#include <memory>
+#include <optional>
+
+#include "IPCHelpers/Transaction.h"
+#include "Platform/Preferences.h"
+#include "Platform/WorkQueue.h"
+#include "Values/Error.h"
+#include "Values/Value.h"
+
+namespace veltoid {
+
+/// Layout of the stored data; smaller ones are not kept.
+inline constexpr int64_t kVeltoIDDBVersion = 100;
+/// Version of this agent as an accessor of the database.
+inline constexpr double kVeltoIDDBAccessorVersion = 727.8;
+inline constexpr double kVeltoIDDBFlushDelay = 3.0;
+
+/// Uses the preference domain `name` instead of the default one. Called before any other database operation.
+void __VeltoIDDBSetPreferencesDomainName(const String& name);
+
+/// Whether the database is kept in preferences or in memory only. When it was kept so far, it is written first. Changing
+/// this after the first access does not load again.
+void __VeltoIDDBSetUsePreferences(bool usePreferences);
+
+/// The semaphore that changing operations signal when asked to.
+void __VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore);
+
+/// Makes all changes durable on disk. True.
+bool __VeltoIDDBSynchronize();
+
+/// Every key of the preference domain with its value; without preferences the sections under "Accounts", "Certificates"
+/// and "MetaInfo". True.
+bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
+
+/// For the rooms of the database; their callers use the operations above and those of the other headers.
+namespace database {
+
+struct Sections {
+    bool accounts = false;
+    bool certificates = false;
+    bool metaInfo = false;
+};
+
+/// All members belong to the database queue.
+class Store {
+  public:
+    Dictionary accounts;
+    Dictionary certificates;
+    Dictionary metaInfo;
+
+    /// The record or entry under a key of a section; null when there is none or it is not a Dictionary.
+    static const Dictionary* find(const Dictionary& section, const String& key);
+
+    /// Hands the selected sections to the preference store, plans the flush and signals the change semaphore if asked.
+    void writeSections(const Sections& sections, bool signal);
+
+  private:
+    friend void veltoid::__VeltoIDDBSetPreferencesDomainName(const String& name);
+    friend void veltoid::__VeltoIDDBSetUsePreferences(bool usePreferences);
+    friend void veltoid::__VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore);
+    friend bool veltoid::__VeltoIDDBSynchronize();
+    friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
+    friend Store& loadedStore();
+
+    platform::Preferences preferences() const;
+    bool load();
+    static bool keepOrInitialize(const platform::Preferences& domain, const Value& version);
+    bool migrate(const platform::Preferences& domain, Array& versions);
+    bool addUserUUID();
+    bool recordAccessor(const platform::Preferences& domain, Array versions);
+    void planFlush();
+    bool synchronize();
+
+    bool usePreferences_ = false;
+    /// Set once the stored data is loaded: what cannot be read is never overwritten.
+    bool canWrite_ = false;
+    String domainName_;
+    std::unique_ptr<Transaction> pendingFlush_;
+    std::optional<platform::Semaphore> changeSemaphore_;
+};
+
+platform::WorkQueue queue();
+
+/// The store, loaded. The first caller loads it before its body is queued; others wait for that. While the preference
+/// store cannot be read, the sections are empty and nothing is written, and each call tries to load again.
+Store& loadedStore();
+
+/// Runs `body(store)` on the database queue and returns its result.
+template <typename Body>
+auto perform(Body&& body) {
+    Store& store = loadedStore();
+    return queue().sync([&] { return body(store); });
+}
+
+}  // namespace database
+}  // namespace veltoid

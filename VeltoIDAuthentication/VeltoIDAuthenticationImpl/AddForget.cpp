@@ -1,0 +1,120 @@
+#include "VeltoIDAuthenticationImpl/AddForget.h"
+
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Platform/Notifications.h"
+#include "Values/DictionaryAccess.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/NotificationNames.h"
+#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDXMLServerCommunications/SignIn.h"
+
+namespace veltoid {
+namespace {
+
+std::string describeError(const std::optional<Error>& error) { return error ? describeValue(*error) : std::string(); }
+
+bool isAlreadyOnItsWay(const String& accountName, const Dictionary& options) {
+    return !getBool(&options, "ForceCertificateCreation", false) &&
+           (__VeltoIDDBHasCertificateToken(accountName) || __VeltoIDDBHasValidCertificate(accountName));
+}
+
+/// Signs in and fetches the account's information; null, with the error, when the sign-in failed.
+Session signIn(const String& accountName, const String& hashedPassword, const Dictionary& options, ErrorOut error) {
+    String encDsId;
+    Session session =
+        __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, &encDsId, nullptr, error);
+    if (!session) return nullptr;
+    if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId, true);
+    if (!getBool(&options, "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", false)) {
+        Dictionary fetchOptions = options;
+        fetchOptions.set("ForceValidationRecordFetch", Value::boolean(true));
+        __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
+    }
+    return session;
+}
+
+struct AddOutcome {
+    std::optional<Dictionary> record;
+    bool succeeded = false;
+};
+
+AddOutcome copyOutcome(const String& accountName, ErrorOut error) {
+    Dictionary record;
+    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return {};
+    return {record, true};
+}
+
+AddOutcome readd(const String& accountName) {
+    std::optional<Error> copyError;
+    AddOutcome outcome = copyOutcome(accountName, &copyError);
+    const bool hasDSID = outcome.record && outcome.record->string(kVeltoIDAccountDSIDKey);
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
+                     "VeltoIDAuth: Already existing account " << accountName.view() << " re-added; "
+                                                              << (hasDSID ? "succeeded." : "failed, ")
+                                                              << describeError(copyError));
+    return outcome;
+}
+
+AddOutcome addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options) {
+    std::optional<Error> held;
+    Session session;
+    AddOutcome outcome;
+    const bool checksPassword = !getBool(&options, "DoNotCheckPassword", false);
+    if (checksPassword) session = signIn(accountName, hashedPassword, options, &held);
+    if (session || !checksPassword) outcome = copyOutcome(accountName, &held);
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
+                     "VeltoIDAuth: Adding account " << accountName.view() << " "
+                                                    << (outcome.succeeded ? "succeeded." : "failed, ")
+                                                    << describeError(held));
+    __VeltoIDSessionRelease(std::move(session));
+    return outcome;
+}
+
+/// The certificate entry goes unless another account has the same encDsId.
+void forgetCertificate(const String& encDsId) {
+    if (!encDsId || __VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr)) return;
+    __VeltoIDDBRemoveCertificateInfo(encDsId);
+}
+
+}  // namespace
+
+bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPassword, const Dictionary& options,
+                           String* encDsId, std::optional<Dictionary>* accountRecord, ErrorOut error) {
+    if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr)) {
+        fillError(error, VELTOID_ERROR(identity_error::kUnknown));
+        return false;
+    }
+    const AddOutcome outcome = isAlreadyOnItsWay(accountName, options)
+                                   ? readd(accountName)
+                                   : addAnew(accountName, hashedPassword, options);
+    platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
+    if (encDsId != nullptr && outcome.record) *encDsId = outcome.record->string(kVeltoIDAccountDSIDKey);
+    if (accountRecord != nullptr) *accountRecord = outcome.record;
+    return true;
+}
+
+bool __VeltoIDForgetVeltoID(const String& accountName, const Dictionary& /*options*/, ErrorOut error) {
+    if (accountName) {
+        VELTOID_LOG(kNotice, "VeltoIDAuth: Forgetting account " << accountName.view() << ".");
+        auto& notifications = platform::Notifications::shared();
+        Dictionary record;
+        if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) {
+            __VeltoIDDBRemoveVeltoIDAccount(accountName);
+            forgetCertificate(record.string(kVeltoIDAccountDSIDKey));
+            if (const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+                removePasswordFromKeychainGivenPersistentRef(reference);
+            notifications.post(kVeltoIDAccountAddedOrRemovedNotification);
+            notifications.post(kVeltoIDAccountChangeNotification);
+            return true;
+        }
+        notifications.post(kVeltoIDAccountChangeNotification);
+    }
+    fillError(error, VELTOID_ERROR(identity_error::kUnknown));
+    return false;
+}
+
+}  // namespace veltoid

@@ -1,0 +1,26 @@
+#include "VeltoIDAuthenticationImpl/PasswordVerification.h"
+
+#include "VeltoIDXMLServerCommunications/SignIn.h"
+
+namespace veltoid {
+
+bool __VeltoIDDoVerifyPassword(const String& accountName, const String& hashedPassword, const Dictionary& options,
+                               ErrorOut error) {
+    if (!accountName || !hashedPassword) {
+        fillError(error, VELTOID_ERROR(identity_error::kInvalidParameters));
+        return false;
+    }
+    Dictionary signInOptions = options;
+    signInOptions.set("DoNotUseCachedSession", Value::boolean(true));
+    std::optional<Error> sessionError;
+    Session session = __VeltoIDSessionDoCreateSession(accountName, hashedPassword, signInOptions, nullptr, nullptr,
+                                                      &sessionError);
+    if (session) {
+        __VeltoIDSessionRelease(std::move(session));
+        return true;
+    }
+    fillError(error, sessionError ? *sessionError : VELTOID_ERROR(identity_error::kInvalidAccountOrPassword));
+    return false;
+}
+
+}  // namespace veltoid

@@ -1,0 +1,124 @@
+#include "VeltoIDXMLServerCommunications/Invoke.h"
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Platform/Clock.h"
+#include "Platform/EventLoop.h"
+#include "Platform/SystemVersion.h"
+#include "Values/DictionaryAccess.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+#include "XMLRPC/XMLRPCShim.h"
+
+namespace veltoid {
+namespace {
+
+using RelaunchScheduler = std::function<void(std::optional<double>, bool)>;
+
+RelaunchScheduler& relaunchScheduler() {
+    static auto* scheduler = new RelaunchScheduler([](std::optional<double>, bool) {});
+    return *scheduler;
+}
+
+const String& frameworkVersionText() {
+    static const auto* text = [] {
+        char buffer[32];
+        std::snprintf(buffer, sizeof buffer, "%g", kVeltoIDDBAccessorVersion);
+        return new String(buffer);
+    }();
+    return *text;
+}
+
+bool metaSwitchIsOn(const String& accountName, const Dictionary& options, std::string_view key) {
+    return __VeltoIDDBCopyMetaInfoValue(accountName, options, key, Value::Kind::Boolean).asBoolean().value_or(false);
+}
+
+/// The server writes the text "NULL" where a value is to be removed.
+Value commandValue(const Value& value) {
+    return value.asText() == std::string_view("NULL") ? Value::null() : value;
+}
+
+void applyValidityDuration(VeltoIDAuthenticationSessionInfo& session, const Value& duration) {
+    if (const auto seconds = duration.asDouble()) {
+        session.fValidityDuration = std::max(*seconds, 0.0);
+    } else if (const String text = duration.asString()) {
+        const double value = std::strtod(text.text().c_str(), nullptr);
+        session.fValidityDuration = value > 0 ? value : 0;
+    }
+}
+
+void applyRelaunch(const Dictionary& reply) {
+    const int32_t interval = getInt32(&reply, "NextLaunchTimeInterval", 0);
+    if (interval < 1) return;
+    const double date = platform::Clock::shared().now() + interval;
+    VELTOID_LOG_FROM("xmlInvoke", kNotice,
+                     "Received 'NextLaunchTimeInterval' == " << interval
+                                                             << " from server, so setting NextLaunchDate to "
+                                                             << describeValue(Value::date(date)));
+    relaunchScheduler()(date, true);
+}
+
+void applyFlushAndExit(const Dictionary& reply) {
+    if (!getBool(&reply, "FlushAndExit", false)) return;
+    VELTOID_LOG_FROM("xmlInvoke", kNotice,
+                     "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
+    __VeltoIDDBSynchronize();
+    platform::event_loop::exitProcess(EXIT_SUCCESS);
+}
+
+void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& reply) {
+    applyValidityDuration(session, reply["dsSessionValidityDuration"]);
+    if (reply.contains("NewURL"))
+        VELTOID_LOG_FROM("xmlInvoke", kNotice,
+                         "Ignoring a new server URL in a reply: credentials are not redirected by a reply.");
+    if (const Dictionary* metaInformation = reply.dictionary("MetaInformation"))
+        for (const auto& [key, value] : *metaInformation)
+            __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
+    if (const Dictionary* accountInformation = reply.dictionary("AccountInformation"))
+        for (const auto& [key, value] : *accountInformation)
+            __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), false);
+    applyRelaunch(reply);
+    applyFlushAndExit(reply);
+}
+
+}  // namespace
+
+void setRelaunchScheduler(RelaunchScheduler scheduler) { relaunchScheduler() = std::move(scheduler); }
+
+Dictionary createCallParameters(const String& accountName, const String& sessionID, const Dictionary& options) {
+    Dictionary parameters;
+    parameters.set("dsSession", sessionID);
+    parameters.set("VeltoIDAuthProtocolVersion", Value::int64(kVeltoIDAuthProtocolVersion));
+    parameters.set("TamrixVersion", frameworkVersionText());
+    parameters.set("ClientTime", Value::date(platform::Clock::shared().now()));
+    const platform::SystemVersion& system = platform::systemVersion();
+    if (system.productName) parameters.set("ProductName", *system.productName);
+    if (system.buildVersion) parameters.set("SystemVersion", *system.buildVersion);
+    if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerMetaInformationItemsKey)) {
+        if (auto information = __VeltoIDDBCopyMetaInformation(accountName, options))
+            parameters.set("MetaInformation", *information);
+    }
+    if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerAccountInformationItemsKey)) {
+        Dictionary record;
+        if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) parameters.set("AccountInformation", record);
+    }
+    return parameters;
+}
+
+bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName, const Dictionary& parameters,
+               std::optional<Dictionary>* result, ErrorOut error) {
+    std::optional<Dictionary> reply;
+    const bool succeeded = xmlInvoke(session.fServerURL, methodName, parameters, &reply, error);
+    if (succeeded && reply) applyCommands(session, *reply);
+    if (result != nullptr) *result = std::move(reply);
+    return succeeded;
+}
+
+}  // namespace veltoid

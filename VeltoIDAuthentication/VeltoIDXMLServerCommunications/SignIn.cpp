@@ -1,0 +1,263 @@
+#include "VeltoIDXMLServerCommunications/SignIn.h"
+
+#include <atomic>
+#include <string>
+
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Platform/Clock.h"
+#include "Values/DateText.h"
+#include "Values/DictionaryAccess.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
+#include "VeltoIDXMLServerCommunications/SessionCache.h"
+
+namespace veltoid {
+namespace {
+
+constexpr const char* kOperation = "__VeltoIDSessionDoCreateSession";
+constexpr std::string_view kClientOutOfDate =
+    "The client on this machine is out of date and can not talk with the Velto ID server.";
+
+std::atomic<int32_t> serverVersion{0};
+
+Error signInError(int64_t code, int line, const ErrorTexts& texts = {}) {
+    return makeError(code, texts, {}, kOperation, __FILE_NAME__, line);
+}
+
+/// One sign-in; everything runs on the account's queue.
+class SignIn {
+  public:
+    SignIn(const String& accountName, const String& passwordHash, const Dictionary& options)
+        : accountName_(accountName), passwordHash_(passwordHash), options_(options) {}
+
+    void run() {
+        hasRecord_ = __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
+        const String url = serverURL();
+        if (!getBool(&options_, "DoNotUseCachedSession", false))
+            session_ = takeCachedSession(accountName_, passwordHash_, url);
+        if (session_) {
+            encDsId_ = session_->fEncDsId;
+            count(kVeltoIDXMLSessionReusedCountKey);
+        } else {
+            if (mayConnect()) signInAnew(url);
+            if (!session_ && !held_) held_ = Error{String(kIdentityErrorDomain), identity_error::kSignInFailed, {}};
+        }
+        keepBooks();
+    }
+
+    Session takeSession() { return std::move(session_); }
+    const String& encDsId() const { return encDsId_; }
+    const std::optional<Dictionary>& result() const { return result_; }
+    const std::optional<Error>& error() const { return held_; }
+
+  private:
+    void count(std::string_view counter) {
+        __VeltoIDDBIncrementMetaInfoCounter(accountName_, options_, counter, 1);
+    }
+
+    /// From the options, the account's record, the meta information or its default; null for none.
+    String serverURL() const {
+        const Value& given = options_["ServerURL"];
+        String url = given.asString();
+        if (const auto asURL = given.asURL()) url = asURL->first;
+        if (!url && hasRecord_) url = record_.string(kVeltoIDAccountServerURLKey);
+        if (!url)
+            url = __VeltoIDDBCopyMetaInfoValue(nullptr, options_, kVeltoIDDBServerURLKey, Value::Kind::String)
+                      .asString();
+        return url.empty() ? String() : url;
+    }
+
+    /// False, with the error held, while the server must not be contacted for this account.
+    bool mayConnect() {
+        if (!hasRecord_) return true;
+        if (record_.boolean(kVeltoIDAccountClientTooOldKey).value_or(false)) {
+            VELTOID_LOG_FROM(kOperation, kNotice,
+                             "Not connecting to VeltoID authentication server because clientTooOld = true is set "
+                             "for this account "
+                                 << accountName_.view() << ".");
+            held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
+            return false;
+        }
+        const auto earliest = record_.date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
+        if (earliest && *earliest > now_) {
+            VELTOID_LOG_FROM(kOperation, kNotice,
+                             "Not connecting to VeltoID authentication server because there is an "
+                             "earliest-allowed-connection-date set for this account "
+                                 << accountName_.view() << ", " << describeValue(Value::date(*earliest))
+                                 << " which is before now.");
+            held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
+            return false;
+        }
+        return true;
+    }
+
+    void signInAnew(const String& url) {
+        const Dictionary parameters = authenticateParameters();
+        count(kVeltoIDMetaConnectionAttemptCountKey);
+        if (url) {
+            authenticate(url, parameters);
+        } else {
+            held_ = copyAndHandleXMLErrorResponse(accountName_, std::nullopt,
+                                                  signInError(identity_error::kUnknown, __LINE__));
+        }
+        if (session_) return;
+        VELTOID_LOG_FROM(kOperation, kNotice,
+                         "Didn't succeed with .authenticate, and error is "
+                             << describeValue(held_ ? Value(*held_) : Value()) << " so releasing session.");
+    }
+
+    Dictionary authenticateParameters() {
+        Dictionary parameters = createCallParameters(accountName_, nullptr, options_);
+        parameters.set("veltoConnect", accountName_);
+        parameters.set("pwdHash", passwordHash_);
+        parameters.set("UserUUID",
+                       __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaUserUUIDKey, Value::Kind::String));
+        parameters.set("ClientDateTime", Value::date(now_));
+        if (hasRecord_) addAccountParameters(parameters);
+        return parameters;
+    }
+
+    void addAccountParameters(Dictionary& parameters) {
+        oldEncDsId_ = record_.string(kVeltoIDAccountDSIDKey);
+        oldRecordIdentifier_ = record_.string(kVeltoIDAccountValidationRecordIdentifierKey);
+        parameters.set("ClientVIDVRecordIdentifier", oldRecordIdentifier_);
+        Dictionary entry;
+        if (oldEncDsId_ && __VeltoIDDBCopyCertificateInfo(oldEncDsId_, &entry))
+            parameters.set("CertificateSerialNumber", entry.string(kVeltoIDCertificateSerialNumberKey));
+        const String uuid = record_.string(kVeltoIDAccountUUIDKey);
+        parameters.set("AccountUUID", uuid);
+        parameters.set("machineUUID", uuid);
+        parameters.set("AccountStableUUID", record_.string(kVeltoIDAccountStableUUIDKey));
+    }
+
+    void authenticate(const String& url, const Dictionary& parameters) {
+        auto session = std::make_unique<VeltoIDAuthenticationSessionInfo>(VeltoIDAuthenticationSessionInfo{
+            accountName_, passwordHash_, url, nullptr, now_, 0, nullptr, copySessionQueueForAccount(accountName_)});
+        std::optional<Dictionary> reply;
+        std::optional<Error> callError;
+        const String method = std::string(kVeltoIDMethodPrefix) + "authenticate";
+        if (!xmlInvoke(*session, method, parameters, &reply, &callError)) {
+            held_ = copyAndHandleXMLErrorResponse(accountName_, reply, callError);
+            return;
+        }
+        count(kVeltoIDXMLAuthenticateCountKey);
+        if (reply) applyReply(*reply, *session);
+        if (session->fEncDsId) session_ = std::move(session);
+    }
+
+    void applyReply(const Dictionary& reply, VeltoIDAuthenticationSessionInfo& session) {
+        serverVersion = getInt32(&reply, "Version", 0);
+        applyEmbargo(reply);
+        if (reply.boolean("ClientTooOld").value_or(false)) {
+            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true), true);
+            held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
+        }
+        encDsId_ = reply.string("encDsId");
+        if (oldEncDsId_ && encDsId_ && oldEncDsId_ != encDsId_) disableCertificatesOfChangedAccount();
+        session.fSessionID = reply.string("dsSession");
+        if (encDsId_) {
+            session.fEncDsId = encDsId_;
+            applyCertificateState(reply);
+        } else if (!held_) {
+            held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
+        }
+        applyRecordIdentifier(reply.string("VeltoIDRecordIdentifier"));
+        result_ = reply;
+    }
+
+    void applyEmbargo(const Dictionary& reply) {
+        std::optional<double> date = dateFromValue(reply["DoNotConnectBeforeX"]);
+        const int32_t seconds = getInt32(&reply, "DoNotConnectForX", 0);
+        if (!date && seconds >= 1) date = now_ + seconds;
+        if (!date || *date <= now_) return;
+        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountEarliestAllowedConnectionDateKey,
+                                   Value::date(*date), true);
+        held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
+    }
+
+    void disableCertificatesOfChangedAccount() {
+        VELTOID_LOG_FROM(kOperation, kError,
+                         "Got back a different encDSID for our account, "
+                             << describeValue(encDsId_) << " vs " << describeValue(oldEncDsId_)
+                             << " so disabling the certs and VeltoIDValidationRecord on this account.");
+        for (const String& encDsId : {oldEncDsId_, encDsId_})
+            __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
+                                           true);
+        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountValidationRecordIdentifierKey, Value::null(), true);
+        __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_), true);
+    }
+
+    void applyCertificateState(const Dictionary& reply) {
+        if (reply.boolean("CertificateIsValid").value_or(false)) {
+            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateLastSuccessfulValidationDateKey,
+                                           Value::date(now_), true);
+        } else if (reply.contains("CertificateIsValid") || reply.contains("CertificateNoLongerValid")) {
+            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
+                                           true);
+            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_), true);
+        }
+    }
+
+    /// Another record than the one that the account has: it is fetched again.
+    void applyRecordIdentifier(const String& identifier) {
+        if (!identifier || identifier == oldRecordIdentifier_) return;
+        __VeltoIDDBSetAccountValues(accountName_,
+                                    {{kVeltoIDAccountValidationRecordIdentifierKey, Value::null()},
+                                     {kVeltoIDAccountValidationRecordNextCheckDateKey, Value::null()}},
+                                    true);
+    }
+
+    void keepBooks() {
+        if (!session_ || getBool(&options_, "DoNotSaveSessionInfo", false)) {
+            count(kVeltoIDMetaUnsuccessfulConnectionCountKey);
+            return;
+        }
+        count(kVeltoIDMetaSuccessfulConnectionCountKey);
+        for (const std::string_view key : {kVeltoIDMetaLastConnectAttemptKey, kVeltoIDMetaLastSuccessfulConnectKey})
+            __VeltoIDDBSetMetaInfoValue(nullptr, key, Value::date(now_));
+    }
+
+    const String& accountName_;
+    const String& passwordHash_;
+    const Dictionary& options_;
+    const double now_ = platform::Clock::shared().now();
+    bool hasRecord_ = false;
+    Dictionary record_;
+    String oldEncDsId_;
+    String oldRecordIdentifier_;
+    Session session_;
+    String encDsId_;
+    std::optional<Dictionary> result_;
+    std::optional<Error> held_;
+};
+
+}  // namespace
+
+Session __VeltoIDSessionDoCreateSession(const String& accountName, const String& passwordHash,
+                                        const Dictionary& options, String* encDsId,
+                                        std::optional<Dictionary>* result, ErrorOut error) {
+    if (encDsId != nullptr) *encDsId = nullptr;
+    if (result != nullptr) result->reset();
+    if (!accountName || !passwordHash) return nullptr;
+    return copySessionQueueForAccount(accountName).sync([&] {
+        SignIn signIn(accountName, passwordHash, options);
+        signIn.run();
+        Session session = signIn.takeSession();
+        if (!session) {
+            fillError(error, signIn.error());
+        } else {
+            if (encDsId != nullptr) *encDsId = signIn.encDsId();
+            if (result != nullptr) *result = signIn.result();
+        }
+        return session;
+    });
+}
+
+int32_t __VeltoIDSessionGetServerVersion() { return serverVersion; }
+
+}  // namespace veltoid

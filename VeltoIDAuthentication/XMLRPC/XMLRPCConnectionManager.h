@@ -1,0 +1,45 @@
+// Owns the event-driven XML-RPC connections that are under way.
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <vector>
+
+#include "XMLRPC/XMLRPCConnection.h"
+
+namespace veltoid {
+
+/// All operations may be called from any thread.
+class XMLRPCConnectionManager {
+  public:
+    /// The only one, made on first use and never destroyed.
+    static XMLRPCConnectionManager& sharedManager();
+
+    XMLRPCConnectionManager(const XMLRPCConnectionManager&) = delete;
+    XMLRPCConnectionManager& operator=(const XMLRPCConnectionManager&) = delete;
+
+    /// Starts an exchange whose outcome goes to the delegate. The identifier of the connection; null when there is no
+    /// HTTP session to be had.
+    String spawnConnectionWithXMLRPCRequest(std::shared_ptr<XMLRPCRequest> request,
+                                            std::shared_ptr<XMLRPCConnectionDelegate> delegate);
+
+    std::vector<String> activeConnectionIdentifiers() const;
+    size_t numberOfActiveConnections() const;
+    /// Null when no connection of that identifier is held.
+    std::shared_ptr<XMLRPCConnection> connectionForIdentifier(const String& identifier) const;
+
+    /// Cancels the connection and lets go of it; nothing when it is not held.
+    void closeConnectionForIdentifier(const String& identifier);
+    void closeConnections();
+
+  private:
+    XMLRPCConnectionManager() = default;
+    ~XMLRPCConnectionManager() = default;
+
+    mutable std::mutex mutex_;
+    /// By identifier; guarded by the mutex, which is never held while a connection is called.
+    std::map<std::string, std::shared_ptr<XMLRPCConnection>, std::less<>> myConnections;
+};
+
+}  // namespace veltoid

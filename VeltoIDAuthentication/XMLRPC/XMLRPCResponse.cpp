@@ -1,0 +1,24 @@
+#include "XMLRPC/XMLRPCResponse.h"
+
+#include "XMLRPC/XMLRPCEventBasedParser.h"
+#include "XMLRPC/XMLRPCHelpers.h"
+
+namespace veltoid {
+
+XMLRPCResponse::XMLRPCResponse(platform::SecretBytes data) : myBody(std::move(data)) {
+    XMLRPCEventBasedParser parser(myBody);
+    myObject = parser.parse();
+    myIsFault = parser.isFault();
+}
+
+String XMLRPCResponse::body() const {
+    const std::string_view text = platform::textOf(myBody);
+    return isUTF8(text) ? String(text) : String();
+}
+
+const Value& XMLRPCResponse::faultEntry(std::string_view key) const {
+    const Dictionary* fault = myIsFault ? myObject.asDictionary() : nullptr;
+    return fault == nullptr ? absentValue() : (*fault)[key];
+}
+
+}  // namespace veltoid
