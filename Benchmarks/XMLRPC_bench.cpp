@@ -1,5 +1,5 @@
-// Parsing and encoding against the bare XML parser underneath and against another XML-RPC library, on the same
-// documents: 4 MB, 1,000 structs of 40 members of mixed types.
+// Parsing and encoding against the bare XML parser underneath and against another XML-RPC library, on the
+// same documents: 4 MB, 1,000 structs of 40 members of mixed types.
 #include <benchmark/benchmark.h>
 #include <expat.h>
 #include <xmlrpc-c/base.h>
@@ -22,12 +22,18 @@ constexpr size_t kDocumentLimit = 64U << 20U;
 Value memberValue(int structNumber, int memberNumber) {
     const int number = structNumber * kMembers + memberNumber;
     switch (memberNumber % 6) {
-        case 0: return Value::int32(number);
-        case 1: return Value::real(number / 8.0);
-        case 2: return Value::boolean(number % 2 == 0);
-        case 3: return Value::date(1'700'000'000.0 + number);
-        case 4: return Data(platform::bytesOf("some bytes of member " + std::to_string(number)));
-        default: return "text <" + std::to_string(number) + "> & more of it, as people write it";
+        case 0:
+            return Value::int32(number);
+        case 1:
+            return Value::real(number / 8.0);
+        case 2:
+            return Value::boolean(number % 2 == 0);
+        case 3:
+            return Value::date(1'700'000'000.0 + number);
+        case 4:
+            return Data(platform::bytesOf("some bytes of member " + std::to_string(number)));
+        default:
+            return "text <" + std::to_string(number) + "> & more of it, as people write it";
     }
 }
 
@@ -36,7 +42,8 @@ const Value& values() {
         Array structs;
         for (int i = 0; i < kStructs; ++i) {
             Dictionary dictionary;
-            for (int k = 0; k < kMembers; ++k) dictionary.set(std::string_view("memberName" + std::to_string(k)), memberValue(i, k));
+            for (int k = 0; k < kMembers; ++k)
+                dictionary.set(std::string_view("memberName" + std::to_string(k)), memberValue(i, k));
             structs.append(dictionary);
         }
         return new Value(structs);
@@ -74,7 +81,8 @@ void parseBareExpat(benchmark::State& state) {
         XML_SetElementHandler(
             parser, [](void*, const XML_Char*, const XML_Char**) {}, [](void*, const XML_Char*) {});
         XML_SetCharacterDataHandler(parser, [](void*, const XML_Char*, int) {});
-        if (XML_Parse(parser, response().data(), static_cast<int>(response().size()), XML_TRUE) != XML_STATUS_OK)
+        if (XML_Parse(parser, response().data(), static_cast<int>(response().size()), XML_TRUE) !=
+            XML_STATUS_OK)
             state.SkipWithError("not parsed");
         XML_ParserFree(parser);
     }
@@ -93,7 +101,8 @@ void parseOtherLibrary(benchmark::State& state) {
         xmlrpc_value* value = nullptr;
         int faultCode = 0;
         const char* faultString = nullptr;
-        xmlrpc_parse_response2(&environment, document.data(), document.size(), &value, &faultCode, &faultString);
+        xmlrpc_parse_response2(&environment, document.data(), document.size(), &value, &faultCode,
+                               &faultString);
         if (environment.fault_occurred) {
             state.SkipWithError(environment.fault_string);
             break;
@@ -122,8 +131,10 @@ BENCHMARK(encodeOurs)->Unit(benchmark::kMillisecond);
 
 xmlrpc_value* otherValue(xmlrpc_env* environment, const Value& value) {
     switch (value.kind()) {
-        case Value::Kind::Boolean: return xmlrpc_bool_new(environment, *value.asBoolean());
-        case Value::Kind::Date: return xmlrpc_datetime_new_sec(environment, static_cast<time_t>(*value.asDate()));
+        case Value::Kind::Boolean:
+            return xmlrpc_bool_new(environment, *value.asBoolean());
+        case Value::Kind::Date:
+            return xmlrpc_datetime_new_sec(environment, static_cast<time_t>(*value.asDate()));
         case Value::Kind::String: {
             const std::string_view text = *value.asText();
             return xmlrpc_string_new_lp(environment, text.size(), text.data());

@@ -75,15 +75,17 @@ void CurlExchange::setTransportOptions() {
     set(CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
     set(CURLOPT_TIMEOUT, kLongestExchangeSeconds);
     set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(kMaxHTTPResponseBytes));
-    // Proxies stay at the library's default: https_proxy and no_proxy of the environment are followed, the TLS session
-    // going through the proxy's tunnel to the server itself. The tunnel's own header is not the response's.
+    // Proxies stay at the library's default: https_proxy and no_proxy of the environment are followed, the
+    // TLS session going through the proxy's tunnel to the server itself. The tunnel's own header is not the
+    // response's.
     set(CURLOPT_SUPPRESS_CONNECT_HEADERS, 1L);
 }
 
 void CurlExchange::setTrustAnchors() {
-    // The directory is looked up by hash when a chain is checked, while the bundle that the library is built with would
-    // be parsed as a whole for every exchange.
-    const char* file = std::getenv(kCertificateFileVariable);  // NOLINT(concurrency-mt-unsafe): nothing sets it
+    // The directory is looked up by hash when a chain is checked, while the bundle that the library is built
+    // with would be parsed as a whole for every exchange.
+    const char* file =
+        std::getenv(kCertificateFileVariable);  // NOLINT(concurrency-mt-unsafe): nothing sets it
     const bool hasFile = file != nullptr && *file != '\0';
     set(CURLOPT_CAINFO, hasFile ? file : static_cast<const char*>(nullptr));
     set(CURLOPT_CAPATH, hasFile ? static_cast<const char*>(nullptr) : kCertificateDirectory);
@@ -133,7 +135,7 @@ std::optional<HTTPError> CurlExchange::run(const std::atomic<bool>& cancelled) {
     if (failure_ != CURLE_OK) return errorOf(failure_);
     if (curl_.multiAddHandle(multi_.get(), easy_.get()) != CURLM_OK) return errorOf(CURLE_FAILED_INIT);
     const bool ended = drive(cancelled);
-    const std::optional<HTTPError> error = ended ? outcome() : errorOf(CURLE_ABORTED_BY_CALLBACK);
+    std::optional<HTTPError> error = ended ? outcome() : errorOf(CURLE_ABORTED_BY_CALLBACK);
     curl_.multiRemoveHandle(multi_.get(), easy_.get());
     return error;
 }
@@ -227,10 +229,12 @@ size_t CurlExchange::onBody(char* bytes, size_t size, size_t count, void* exchan
         self.failure_ = CURLE_FILESIZE_EXCEEDED;
         return 0;
     }
-    return self.delivered([=](HTTPSessionEvents& events) { events.bodyBytes(bytesOf(piece)); }) ? piece.size() : 0;
+    return self.delivered([=](HTTPSessionEvents& events) { events.bodyBytes(bytesOf(piece)); }) ? piece.size()
+                                                                                                : 0;
 }
 
-int CurlExchange::onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected, curl_off_t sent) noexcept {
+int CurlExchange::onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
+                             curl_off_t sent) noexcept {
     auto& self = *static_cast<CurlExchange*>(exchange);
     if (sent <= self.reportedSent_) return 0;
     self.reportedSent_ = sent;

@@ -1,4 +1,5 @@
-// One HTTPS exchange on libcurl: how a request is put to the library, and what comes back. Internal to the HTTPS client.
+// One HTTPS exchange on libcurl: how a request is put to the library, and what comes back. Internal to the
+// HTTPS client.
 #pragma once
 
 #include <atomic>
@@ -17,8 +18,8 @@ class CurlExchange {
     CurlExchange(const CurlExchange&) = delete;
     CurlExchange& operator=(const CurlExchange&) = delete;
 
-    /// Runs until the exchange has ended or `cancelled` is set, telling the events everything but the completion. None
-    /// when the response arrived whole, whatever its status.
+    /// Runs until the exchange has ended or `cancelled` is set, telling the events everything but the
+    /// completion. None when the response arrived whole, whatever its status.
     std::optional<HTTPError> run(const std::atomic<bool>& cancelled);
 
     /// Makes `run` look at `cancelled`. Any thread.
@@ -58,7 +59,8 @@ class CurlExchange {
     static CURLcode onTLSContext(CURL*, void* context, void* exchange) noexcept;
     static size_t onHeader(char* line, size_t size, size_t count, void* exchange) noexcept;
     static size_t onBody(char* bytes, size_t size, size_t count, void* exchange) noexcept;
-    static int onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected, curl_off_t sent) noexcept;
+    static int onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
+                          curl_off_t sent) noexcept;
 
     const CurlLibrary& curl_;
     HTTPSessionEvents& events_;

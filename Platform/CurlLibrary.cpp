@@ -61,7 +61,8 @@ const CurlLibrary* load() {
     void* library = dlopen(kLibraryName, RTLD_NOW | RTLD_LOCAL);
     if (library == nullptr) {
         const char* reason = dlerror();  // NOLINT(concurrency-mt-unsafe): thread-local in glibc
-        VELTOID_PLATFORM_LOG(Error, std::string("cannot load the HTTPS client library: ") + (reason ? reason : "?"));
+        VELTOID_PLATFORM_LOG(Error,
+                             std::string("cannot load the HTTPS client library: ") + (reason ? reason : "?"));
         return nullptr;
     }
     static CurlLibrary curl;
@@ -69,8 +70,8 @@ const CurlLibrary* load() {
         VELTOID_PLATFORM_LOG(Error, std::string(kLibraryName) + " lacks " + missing);
         return nullptr;
     }
-    // An exchange may be under way when the process exits: OpenSSL, which the library is built on, must not take its
-    // tables down underneath it. Only the first caller of OpenSSL in a process can choose that.
+    // An exchange may be under way when the process exits: OpenSSL, which the library is built on, must not
+    // take its tables down underneath it. Only the first caller of OpenSSL in a process can choose that.
     OPENSSL_init_crypto(OPENSSL_INIT_NO_ATEXIT, nullptr);
     if (curl.globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
         VELTOID_PLATFORM_LOG(Error, "cannot initialise the HTTPS client library");

@@ -1,4 +1,5 @@
-// The functions of libcurl that are in use, found in the library at run time. Internal to the HTTPS client's sources.
+// The functions of libcurl that are in use, found in the library at run time. Internal to the HTTPS client's
+// sources.
 #pragma once
 
 #include <curl/curl.h>
@@ -29,8 +30,8 @@ struct CurlLibrary {
     decltype(&::curl_url_get) urlGet = nullptr;
     decltype(&::curl_free) free = nullptr;
 
-    /// Loaded and initialised on the first call and kept for the life of the process; null when the library or one of
-    /// the functions is missing. Any thread.
+    /// Loaded and initialised on the first call and kept for the life of the process; null when the library
+    /// or one of the functions is missing. Any thread.
     static const CurlLibrary* shared();
 };
 

@@ -36,11 +36,12 @@ class FakeHTTPTransport {
     using Responder = std::function<FakeHTTPAnswer(const HTTPRequest&)>;
 
     FakeHTTPTransport() {
-        HTTPSession::replaceFactory([state = state_](auto events, auto eventQueue) -> std::shared_ptr<HTTPSession> {
-            ++state->created;
-            if (!state->isAvailable) return nullptr;
-            return std::make_shared<Session>(state, std::move(events), std::move(eventQueue));
-        });
+        HTTPSession::replaceFactory(
+            [state = state_](auto events, auto eventQueue) -> std::shared_ptr<HTTPSession> {
+                ++state->created;
+                if (!state->isAvailable) return nullptr;
+                return std::make_shared<Session>(state, std::move(events), std::move(eventQueue));
+            });
     }
     ~FakeHTTPTransport() { HTTPSession::replaceFactory({}); }
     FakeHTTPTransport(const FakeHTTPTransport&) = delete;
@@ -104,7 +105,8 @@ class FakeHTTPTransport {
         void start(HTTPRequest request) override {
             const auto answer = std::make_shared<FakeHTTPAnswer>(state_->answerTo(request));
             if (answer->delaySeconds == kForever) return;
-            queue_.asyncAfter(answer->delaySeconds, [self = shared_from_this(), answer] { self->answerWith(*answer); });
+            queue_.asyncAfter(answer->delaySeconds,
+                              [self = shared_from_this(), answer] { self->answerWith(*answer); });
         }
 
         void invalidateAndCancel() override {

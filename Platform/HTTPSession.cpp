@@ -11,8 +11,8 @@
 namespace platform {
 namespace {
 
-/// Runs its exchange on a queue of its own, which is the delivery thread, and hands the events on: to the event queue
-/// when there is one, and no longer once the session was cancelled.
+/// Runs its exchange on a queue of its own, which is the delivery thread, and hands the events on: to the
+/// event queue when there is one, and no longer once the session was cancelled.
 class CurlSession : public HTTPSession,
                     private HTTPSessionEvents,
                     public std::enable_shared_from_this<CurlSession> {
@@ -91,7 +91,9 @@ class CurlSession : public HTTPSession,
             if (const auto events = receiver()) events->bodyBytes(bytes);
             return;
         }
-        deliver([copy = SecretBytes(bytes.begin(), bytes.end())](HTTPSessionEvents& events) { events.bodyBytes(copy); });
+        deliver([copy = SecretBytes(bytes.begin(), bytes.end())](HTTPSessionEvents& events) {
+            events.bodyBytes(copy);
+        });
     }
 
     void uploadProgress(uint64_t sent, uint64_t expected) override {

@@ -129,8 +129,8 @@ std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query
         collect(statement, query.attributes, rows);
     }
     std::ranges::sort(rows, {}, &Row::sequence);
-    const auto repeated = std::ranges::unique(rows, {}, &Row::sequence);
-    rows.erase(repeated.begin(), repeated.end());
+    const auto same = [](const Row& one, const Row& other) { return one.sequence == other.sequence; };
+    rows.erase(std::unique(rows.begin(), rows.end(), same), rows.end());
     return rows;
 }
 

@@ -278,6 +278,10 @@ std::shared_ptr<Listener> Listener::create(std::string serviceName,
 
 namespace message_service {
 
+void onConnectionLost(std::function<void()> handler) {
+    bus::onDisconnect([handler = std::move(handler)] { WorkQueue::main().async(handler); });
+}
+
 void announceTermination() {
     const auto listeners = Services::shared().listeners;
     for (const auto& listener : listeners) listener->notify(ConnectionError::TerminationImminent);

@@ -83,6 +83,9 @@ class Listener {
 
 namespace message_service {
 
+/// Calls `handler` on the main queue when the bus has ended the connection, after the listeners were told. Once, at start.
+void onConnectionLost(std::function<void()> handler);
+
 /// Tells every listener that the process is about to be ended. Main queue.
 void announceTermination();
 

@@ -294,7 +294,7 @@ TEST_F(SQLiteFileTest, AFullDiskFailsWritesOnlyAndKeepsTheFile) {
     signal(SIGXFSZ, SIG_IGN);
     rlimit before{};
     getrlimit(RLIMIT_FSIZE, &before);
-    const rlimit full{64 * 1024, before.rlim_max};
+    const rlimit full{65536, before.rlim_max};
     setrlimit(RLIMIT_FSIZE, &full);
     for (int i = 0; i < 3; ++i) {
         EXPECT_EQ(put(file, "b", std::string(1U << 20U, 'x')), Outcome::Failed);

@@ -11,8 +11,9 @@
 namespace platform {
 namespace {
 
-/// Documents are handed over in pieces that stay in the processor's cache while the parser works on its copy of them.
-constexpr size_t kPieceBytes = 64 * 1024;
+/// Documents are handed over in pieces that stay in the processor's cache while the parser works on its copy
+/// of them.
+constexpr size_t kPieceBytes = 64U << 10U;
 
 constexpr const char* kEntitiesRefused = "entity declarations and undeclared entities are refused";
 constexpr const char* kEventsFailed = "the receiver of the events failed";
@@ -55,8 +56,8 @@ struct Reading {
     }
 };
 
-/// Calls `deliver(events)` unless the reading was stopped. The library's frames lie between here and whoever started
-/// the reading, so nothing may be thrown through them.
+/// Calls `deliver(events)` unless the reading was stopped. The library's frames lie between here and whoever
+/// started the reading, so nothing may be thrown through them.
 template <typename Deliver>
 void guarded(void* context, Deliver deliver) noexcept {
     auto& reading = *static_cast<Reading*>(context);
@@ -81,12 +82,13 @@ void onCharacters(void* context, const XML_Char* text, int length) {
     guarded(context, [=](XMLEvents& events) { events.characters({text, static_cast<size_t>(length)}); });
 }
 
-void onEntityDeclaration(void* context, const XML_Char*, int, const XML_Char*, int, const XML_Char*, const XML_Char*,
-                         const XML_Char*, const XML_Char*) {
+void onEntityDeclaration(void* context, const XML_Char*, int, const XML_Char*, int, const XML_Char*,
+                         const XML_Char*, const XML_Char*, const XML_Char*) {
     static_cast<Reading*>(context)->stop(kEntitiesRefused);
 }
 
-/// A reference to what only a document type outside the document may declare: the text would silently lose it.
+/// A reference to what only a document type outside the document may declare: the text would silently lose
+/// it.
 void onSkippedEntity(void* context, const XML_Char*, int) {
     static_cast<Reading*>(context)->stop(kEntitiesRefused);
 }
@@ -97,8 +99,8 @@ void installHandlers(XML_Parser parser, Reading& reading) {
     XML_SetCharacterDataHandler(parser, onCharacters);
     XML_SetEntityDeclHandler(parser, onEntityDeclaration);
     XML_SetSkippedEntityHandler(parser, onSkippedEntity);
-    // References to parameter entities are looked at, so that they end the reading; without a handler for external
-    // entities nothing is loaded.
+    // References to parameter entities are looked at, so that they end the reading; without a handler for
+    // external entities nothing is loaded.
     XML_SetParamEntityParsing(parser, XML_PARAM_ENTITY_PARSING_ALWAYS);
 }
 
@@ -131,7 +133,8 @@ bool XMLReader::read(XMLEvents& events) {
     parser_ = nullptr;
     if (done) return true;
 
-    const char* reason = reading.reason != nullptr ? reading.reason : XML_ErrorString(XML_GetErrorCode(parser.get()));
+    const char* reason =
+        reading.reason != nullptr ? reading.reason : XML_ErrorString(XML_GetErrorCode(parser.get()));
     const auto byteOffset = XML_GetCurrentByteIndex(parser.get());
     error_ = XMLError{reason != nullptr ? reason : "unknown error",
                       static_cast<size_t>(XML_GetCurrentLineNumber(parser.get())),

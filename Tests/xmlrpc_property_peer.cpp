@@ -3,9 +3,9 @@
 //   parse BASE64    the value of a response document, after "fault" or "value"; "none" when it has none
 //   encode VALUE    the base64 text of a request with this one parameter, its method being "test"
 //
-// A value is a sequence of words, the first character of which is its kind: iN integer, dX double, bN boolean, sB string
-// and xB data in base64, tN date, n Null, aN an array of the N values that follow, mN a dictionary of the N pairs of
-// string and value that follow.
+// A value is a sequence of words, the first character of which is its kind: iN integer, dX double, bN
+// boolean, sB string and xB data in base64, tN date, n Null, aN an array of the N values that follow, mN a
+// dictionary of the N pairs of string and value that follow.
 #include <charconv>
 #include <cmath>
 #include <cstdio>
@@ -21,7 +21,9 @@ namespace {
 
 using namespace veltoid;
 
-std::string base64(std::string_view text) { return xmlrpcBase64Encode(platform::bytesOf(text), false).text(); }
+std::string base64(std::string_view text) {
+    return xmlrpcBase64Encode(platform::bytesOf(text), false).text();
+}
 
 std::string bytesOfBase64(const std::string& text) {
     return std::string(platform::textOf(xmlrpcBase64Decode(text).bytes()));
@@ -29,8 +31,12 @@ std::string bytesOfBase64(const std::string& text) {
 
 void describe(std::ostream& out, const Value& value) {
     switch (value.kind()) {
-        case Value::Kind::Null: out << " n"; break;
-        case Value::Kind::Boolean: out << " b" << *value.asBoolean(); break;
+        case Value::Kind::Null:
+            out << " n";
+            break;
+        case Value::Kind::Boolean:
+            out << " b" << *value.asBoolean();
+            break;
         case Value::Kind::Number: {
             char digits[32];
             const auto end = value.isFloating()
@@ -39,9 +45,15 @@ void describe(std::ostream& out, const Value& value) {
             out << (value.isFloating() ? " d" : " i") << std::string_view(digits, end);
             break;
         }
-        case Value::Kind::Date: out << " t" << std::llround(*value.asDate()); break;
-        case Value::Kind::String: out << " s" << base64(*value.asText()); break;
-        case Value::Kind::Data: out << " x" << base64(platform::textOf(value.asData().bytes())); break;
+        case Value::Kind::Date:
+            out << " t" << std::llround(*value.asDate());
+            break;
+        case Value::Kind::String:
+            out << " s" << base64(*value.asText());
+            break;
+        case Value::Kind::Data:
+            out << " x" << base64(platform::textOf(value.asData().bytes()));
+            break;
         case Value::Kind::Array:
             out << " a" << value.asArray()->size();
             for (const Value& element : *value.asArray()) describe(out, element);
@@ -53,7 +65,8 @@ void describe(std::ostream& out, const Value& value) {
                 describe(out, member);
             }
             break;
-        default: std::abort();
+        default:
+            std::abort();
     }
 }
 
@@ -62,13 +75,20 @@ Value readValue(std::istream& in) {
     if (!(in >> word)) std::abort();
     const std::string rest = word.substr(1);
     switch (word[0]) {
-        case 'n': return Value::null();
-        case 'b': return Value::boolean(rest == "1");
-        case 'i': return Value::int64(std::stoll(rest));
-        case 'd': return Value::real(std::strtod(rest.c_str(), nullptr));
-        case 't': return Value::date(std::strtod(rest.c_str(), nullptr));
-        case 's': return bytesOfBase64(rest);
-        case 'x': return xmlrpcBase64Decode(rest);
+        case 'n':
+            return Value::null();
+        case 'b':
+            return Value::boolean(rest == "1");
+        case 'i':
+            return Value::int64(std::stoll(rest));
+        case 'd':
+            return Value::real(std::strtod(rest.c_str(), nullptr));
+        case 't':
+            return Value::date(std::strtod(rest.c_str(), nullptr));
+        case 's':
+            return bytesOfBase64(rest);
+        case 'x':
+            return xmlrpcBase64Decode(rest);
         case 'a': {
             Array array;
             for (long left = std::stol(rest); left > 0; --left) array.append(readValue(in));
@@ -82,7 +102,8 @@ Value readValue(std::istream& in) {
             }
             return dictionary;
         }
-        default: std::abort();
+        default:
+            std::abort();
     }
 }
 

@@ -8,14 +8,17 @@ namespace veltoid {
 namespace {
 
 constexpr char kAlphabet[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
+constexpr std::string_view kLineFeed = "\n";
 constexpr size_t kXMLRPCLineLength = 64;
+constexpr std::string_view kXMLRPCLineBreak = "\r\n";
 
 // --- Encoding
 
 /// The two symbols of every 12 bits.
 constexpr auto kSymbolPairs = [] {
     std::array<std::array<char, 2>, 4096> pairs{};
-    for (size_t bits = 0; bits < pairs.size(); ++bits) pairs[bits] = {kAlphabet[bits >> 6U], kAlphabet[bits & 63U]};
+    for (size_t bits = 0; bits < pairs.size(); ++bits)
+        pairs[bits] = {kAlphabet[bits >> 6U], kAlphabet[bits & 63U]};
     return pairs;
 }();
 
@@ -54,62 +57,38 @@ void encodeGroups(platform::Bytes bytes, char* out) {
     if (left == 1) out[2] = '=';
 }
 
-/// Collects short pieces of text, so that the growing text is appended to in larger ones.
-class BlockWriter {
-  public:
-    static constexpr size_t kBlock = 4096;
+/// The size of the body with breaks between its lines; a line length of 0 stands for a single line.
+size_t brokenSize(size_t bytes, size_t lineLength, std::string_view lineBreak) {
+    const size_t body = encodedSize(bytes);
+    return lineLength == 0 || body == 0 ? body : body + (body - 1) / lineLength * lineBreak.size();
+}
 
-    explicit BlockWriter(platform::SecretText& out) : out_(out) {}
-    ~BlockWriter() {
-        flush();
-        platform::wipe(block_.data(), block_.size());
-    }
-    BlockWriter(const BlockWriter&) = delete;
-    BlockWriter& operator=(const BlockWriter&) = delete;
-
-    /// Room for `size` characters, at most kBlock, that the caller writes.
-    char* next(size_t size) {
-        if (used_ + size > kBlock) flush();
-        char* const room = block_.data() + used_;
-        used_ += size;
-        return room;
-    }
-
-  private:
-    void flush() {
-        out_.append(block_.data(), used_);
-        used_ = 0;
-    }
-
-    platform::SecretText& out_;
-    size_t used_ = 0;
-    std::array<char, kBlock> block_;  // NOLINT(cppcoreguidelines-pro-type-member-init): written before it is read
-};
-
-/// Appends the body in lines of `lineLength` characters, a multiple of 4 and at most half a block, with `lineBreak`
-/// between them.
-void appendLines(platform::SecretText& out, platform::Bytes bytes, size_t lineLength, std::string_view lineBreak) {
+/// For lines of whole groups, which can be written where they belong.
+void writeWholeGroupLines(platform::Bytes bytes, size_t lineLength, std::string_view lineBreak, char* out) {
     const size_t bytesPerLine = lineLength / 4 * 3;
-    BlockWriter writer(out);
     for (size_t start = 0; start < bytes.size(); start += bytesPerLine) {
         const platform::Bytes line = bytes.subspan(start, std::min(bytesPerLine, bytes.size() - start));
-        if (start != 0) std::memcpy(writer.next(lineBreak.size()), lineBreak.data(), lineBreak.size());
-        encodeGroups(line, writer.next(encodedSize(line.size())));
+        if (start != 0) out = std::copy(lineBreak.begin(), lineBreak.end(), out);
+        encodeGroups(line, out);
+        out += lineLength;
     }
 }
 
-void appendUnbroken(platform::SecretText& out, platform::Bytes bytes) {
-    appendLines(out, bytes, BlockWriter::kBlock / 2, {});
-}
+/// Writes brokenSize() characters.
+void writeBroken(platform::Bytes bytes, size_t lineLength, std::string_view lineBreak, char* out) {
+    const size_t bodySize = encodedSize(bytes.size());
+    if (lineLength == 0 || lineLength >= bodySize) return encodeGroups(bytes, out);
+    if (lineLength % 4 == 0) return writeWholeGroupLines(bytes, lineLength, lineBreak, out);
 
-/// For line lengths that cut through a group.
-void appendOddLines(platform::SecretText& out, platform::Bytes bytes, size_t lineLength) {
-    platform::SecretText body;
-    body.reserve(encodedSize(bytes.size()) + sizeof body);
-    appendUnbroken(body, bytes);
-    for (size_t start = 0; start < body.size(); start += lineLength) {
-        if (start != 0) out += '\n';
-        out += std::string_view(body).substr(start, lineLength);
+    // The body goes to the end of the room and its lines move forward from there.
+    const char* body = out + brokenSize(bytes.size(), lineLength, lineBreak) - bodySize;
+    encodeGroups(bytes, const_cast<char*>(body));
+    for (size_t left = bodySize;;) {
+        const size_t size = std::min(left, lineLength);
+        std::memmove(out, body, size);
+        if ((left -= size) == 0) return;
+        body += size;
+        out = std::copy(lineBreak.begin(), lineBreak.end(), out + size);
     }
 }
 
@@ -193,18 +172,14 @@ bool isSpace(uint8_t byte) { return byte == ' ' || (byte >= '\t' && byte <= '\r'
 String base64Encode(const Data& data, std::string_view prefix, std::string_view suffix, size_t lineLength) {
     if (!data || data.size() > kMaxBase64InputBytes) return nullptr;
     const size_t bodySize = encodedSize(data.size());
-    platform::SecretText text;
-    text.reserve(prefix.size() + bodySize + (lineLength ? bodySize / lineLength : 0) + suffix.size() + sizeof text);
-    text += prefix;
-    if (lineLength == 0) {
-        appendUnbroken(text, data.bytes());
-    } else if (lineLength % 4 == 0 && lineLength <= BlockWriter::kBlock / 2) {
-        appendLines(text, data.bytes(), lineLength, "\n");
-    } else {
-        appendOddLines(text, data.bytes(), lineLength);
-    }
-    if (lineLength != 0 && bodySize != 0 && bodySize % lineLength == 0) text += '\n';
-    text += suffix;
+    const size_t linesSize = brokenSize(data.size(), lineLength, kLineFeed);
+    const bool endsFullLine = lineLength != 0 && bodySize != 0 && bodySize % lineLength == 0;
+    platform::SecretText text(prefix.size() + linesSize + (endsFullLine ? 1 : 0) + suffix.size(), '\0');
+    char* out = std::copy(prefix.begin(), prefix.end(), text.data());
+    writeBroken(data.bytes(), lineLength, kLineFeed, out);
+    out += linesSize;
+    if (endsFullLine) *out++ = '\n';
+    std::copy(suffix.begin(), suffix.end(), out);
     return String(std::string_view(text));
 }
 
@@ -224,23 +199,21 @@ Data base64Decode(const String& text) {
             if (isSpace(byte)) continue;
             padding = byte == '=' ? padding + 1 : 0;
             const uint8_t value = byte == '=' ? 0 : kSymbolValues[byte];
-            if (value != kNoSymbol && decoder.take(value)) decoder.emitGroup(3 - std::min<size_t>(padding, 2));
+            if (value != kNoSymbol && decoder.take(value))
+                decoder.emitGroup(3 - std::min<size_t>(padding, 2));
         }
     });
 }
 
 void appendXMLRPCBase64(platform::SecretText& text, platform::Bytes bytes, bool separateLines) {
-    if (separateLines) {
-        appendLines(text, bytes, kXMLRPCLineLength, "\r\n");
-    } else {
-        appendUnbroken(text, bytes);
-    }
+    const size_t lineLength = separateLines ? kXMLRPCLineLength : 0;
+    const size_t before = text.size();
+    text.resize(before + brokenSize(bytes.size(), lineLength, kXMLRPCLineBreak));
+    writeBroken(bytes, lineLength, kXMLRPCLineBreak, text.data() + before);
 }
 
 String xmlrpcBase64Encode(platform::Bytes bytes, bool separateLines) {
-    const size_t bodySize = encodedSize(bytes.size());
     platform::SecretText text;
-    text.reserve(bodySize + (separateLines ? bodySize / kXMLRPCLineLength * 2 : 0) + sizeof text);
     appendXMLRPCBase64(text, bytes, separateLines);
     return String(std::string_view(text));
 }
@@ -250,12 +223,13 @@ Data xmlrpcBase64Decode(std::string_view text) {
     return Data::filledBy((symbols.size() + 3) / 4 * 3, [&](uint8_t* out) {
         GroupDecoder decoder(out);
         for (size_t i = 0;;) {
-            i += decoder.takeGroups(symbols.subspan(i));
             while (i < symbols.size() && kSymbolValues[symbols[i]] == kNoSymbol) ++i;
             if (i == symbols.size()) break;
-            // Four symbols that stand together are taken at once, unless they would begin inside a group.
-            if (decoder.isBetweenGroups() && i + 4 <= symbols.size()) continue;
-            if (decoder.take(kSymbolValues[symbols[i++]])) decoder.emitGroup(3);
+            if (const size_t taken = decoder.takeGroups(symbols.subspan(i))) {
+                i += taken;
+            } else if (decoder.take(kSymbolValues[symbols[i++]])) {
+                decoder.emitGroup(3);
+            }
         }
         decoder.emitRest();
         return decoder.size();

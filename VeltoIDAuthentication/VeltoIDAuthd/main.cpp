@@ -61,6 +61,9 @@ void terminate() {
     platform::WorkQueue::main().asyncAfter(kLongestTermination, exitOnce);
 }
 
+/// Without its bus the agent can be reached by nobody and hold up the end of a log-in session: it leaves as on SIGTERM.
+void leaveWithTheBus() { platform::message_service::onConnectionLost(terminate); }
+
 void handleSignals() {
     static const auto* flushQueue = new platform::WorkQueue("flush on interrupt");
     platform::event_loop::onSignal(SIGINT, [] { flushQueue->async([] { __VeltoIDDBSynchronize(); }); });
@@ -107,6 +110,7 @@ int main(int argc, char** argv) {
     prepareDatabase(*line);
     setRelaunchScheduler(scheduleRelaunch);
     handleSignals();
+    leaveWithTheBus();
     startServices(*line);
     if (line->leaks) forceValidationOfEveryAccount();
     platform::event_loop::run();

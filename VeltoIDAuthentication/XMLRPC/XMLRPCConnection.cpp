@@ -18,8 +18,8 @@ Error transportError(const platform::HTTPError& error) {
 
 Error noClientError() { return transportError({0, "the HTTPS client library cannot be loaded"}); }
 
-/// What one synchronous call and the HTTP session's delivery thread share: whoever comes first, the outcome or the end
-/// of the wait, closes it for the other.
+/// What one synchronous call and the HTTP session's delivery thread share: whoever comes first, the outcome
+/// or the end of the wait, closes it for the other.
 class SynchronousExchange : public platform::HTTPSessionEvents {
   public:
     // On the delivery thread, one after the other.
@@ -65,7 +65,9 @@ class SynchronousExchange : public platform::HTTPSessionEvents {
 };
 
 void logLine(platform::LogPriority priority, const std::string& text, int line, std::string_view function) {
-    platform::SystemLog::shared().write(priority, text, {__FILE_NAME__, line, function, "main"});
+    const std::string* queue = platform::WorkQueue::currentLabel();
+    platform::SystemLog::shared().write(priority, text,
+                                        {__FILE_NAME__, line, function, queue ? *queue : std::string_view()});
 }
 
 }  // namespace
@@ -78,8 +80,8 @@ std::optional<XMLRPCResponse> XMLRPCConnection::sendSynchronousXMLRPCRequest(con
         fillError(error, noClientError());
         return std::nullopt;
     }
-    // A timer of its own rather than a wait with a limit: that one also ends when the date is set, and setting the date
-    // is no reason to give up a call.
+    // A timer of its own rather than a wait with a limit: that one also ends when the date is set, and
+    // setting the date is no reason to give up a call.
     platform::Clock& clock = platform::Clock::shared();
     const auto timer = clock.callAfter(kSynchronousTimeoutSeconds, false, [exchange] { exchange->giveUp(); });
     session->start(request.request());
@@ -98,11 +100,12 @@ std::shared_ptr<XMLRPCConnection> XMLRPCConnection::initWithXMLRPCRequest(
     connection->mySession = platform::HTTPSession::create(events, platform::WorkQueue::main());
     const std::string name = connection->myIdentifier.text();
     if (!connection->mySession) {
-        logLine(platform::LogPriority::Error, "The session, " + name + ", could not be established!", __LINE__,
-                __func__);
+        logLine(platform::LogPriority::Error, "The session, " + name + ", could not be established!",
+                __LINE__, __func__);
         return nullptr;
     }
-    logLine(platform::LogPriority::Notice, "The session, " + name + ", has been established!", __LINE__, __func__);
+    logLine(platform::LogPriority::Notice, "The session, " + name + ", has been established!", __LINE__,
+            __func__);
     return connection;
 }
 
@@ -135,7 +138,9 @@ void XMLRPCConnection::responseHeader(int statusCode) {
     }
 }
 
-void XMLRPCConnection::bodyBytes(platform::Bytes bytes) { myData.insert(myData.end(), bytes.begin(), bytes.end()); }
+void XMLRPCConnection::bodyBytes(platform::Bytes bytes) {
+    myData.insert(myData.end(), bytes.begin(), bytes.end());
+}
 
 void XMLRPCConnection::uploadProgress(uint64_t sent, uint64_t expected) {
     if (expected > 0)
@@ -150,8 +155,8 @@ void XMLRPCConnection::completed(const std::optional<platform::HTTPError>& error
 
 void XMLRPCConnection::sessionBecameInvalid(const Error& error) {
     logLine(platform::LogPriority::Error,
-            "The connection, " + myIdentifier.text() + ", failed with the following error: " +
-                error.userInfo.string(kErrorDescriptionKey).text(),
+            "The connection, " + myIdentifier.text() +
+                ", failed with the following error: " + error.userInfo.string(kErrorDescriptionKey).text(),
             __LINE__, __func__);
     myDelegate->didFailWithError(*myRequest, error);
     close();

@@ -1,4 +1,5 @@
-// Carries XML-RPC requests over HTTPS: one call that waits, and an event-driven connection that reports to a delegate.
+// Carries XML-RPC requests over HTTPS: one call that waits, and an event-driven connection that reports to a
+// delegate.
 #pragma once
 
 #include <memory>
@@ -16,7 +17,8 @@ class XMLRPCConnectionManager;
 /// How long a synchronous call waits for the server.
 inline constexpr double kSynchronousTimeoutSeconds = 5.0;
 
-/// Who calls, for platforms whose HTTP sessions carry an identity context. Linux has none: sessions go without.
+/// Who calls, for platforms whose HTTP sessions carry an identity context. Linux has none: sessions go
+/// without.
 inline constexpr const char* kIdentityContextIdentifier = "com.velto.harbwell.veltoidauthagent";
 
 /// The exchange did not take place; the code is the HTTPS client library's.
@@ -27,7 +29,8 @@ inline constexpr std::string_view kHTTPErrorDomain = "HTTP";
 /// The first status that is a failure.
 inline constexpr int kFirstHTTPErrorStatus = 400;
 
-/// Told how an event-driven connection went, on the main queue. An optional operation that is not offered returns none.
+/// Told how an event-driven connection went, on the main queue. An optional operation that is not offered
+/// returns none.
 class XMLRPCConnectionDelegate {
   public:
     virtual ~XMLRPCConnectionDelegate() = default;
@@ -50,21 +53,23 @@ class XMLRPCConnectionDelegate {
     }
 };
 
-/// The event-driven form. Its HTTP session reports to it on the main queue; it lives until the manager closes it: on
-/// failure, on status 304, on completion or when asked to.
-class XMLRPCConnection : private platform::HTTPSessionEvents, public std::enable_shared_from_this<XMLRPCConnection> {
+/// The event-driven form. Its HTTP session reports to it on the main queue; it lives until the manager closes
+/// it: on failure, on status 304, on completion or when asked to.
+class XMLRPCConnection : private platform::HTTPSessionEvents,
+                         public std::enable_shared_from_this<XMLRPCConnection> {
     struct Private {};
 
   public:
-    /// Sends the request and waits for the answer, at most kSynchronousTimeoutSeconds; a later one is discarded. None
-    /// when the exchange failed (`error` says why), when the status was 400 or above or nothing came in time (`error`
-    /// is not touched). Blocks; any thread that may.
-    static std::optional<XMLRPCResponse> sendSynchronousXMLRPCRequest(const XMLRPCRequest& request, ErrorOut error);
+    /// Sends the request and waits for the answer, at most kSynchronousTimeoutSeconds; a later one is
+    /// discarded. None when the exchange failed (`error` says why), when the status was 400 or above or
+    /// nothing came in time (`error` is not touched). Blocks; any thread that may.
+    static std::optional<XMLRPCResponse> sendSynchronousXMLRPCRequest(const XMLRPCRequest& request,
+                                                                      ErrorOut error);
 
     /// A connection that has not started yet; null when there is no HTTP session to be had.
-    static std::shared_ptr<XMLRPCConnection> initWithXMLRPCRequest(std::shared_ptr<XMLRPCRequest> request,
-                                                                   std::shared_ptr<XMLRPCConnectionDelegate> delegate,
-                                                                   XMLRPCConnectionManager& manager);
+    static std::shared_ptr<XMLRPCConnection> initWithXMLRPCRequest(
+        std::shared_ptr<XMLRPCRequest> request, std::shared_ptr<XMLRPCConnectionDelegate> delegate,
+        XMLRPCConnectionManager& manager);
 
     XMLRPCConnection(Private, std::shared_ptr<XMLRPCRequest> request,
                      std::shared_ptr<XMLRPCConnectionDelegate> delegate, XMLRPCConnectionManager& manager);

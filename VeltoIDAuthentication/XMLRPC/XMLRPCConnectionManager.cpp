@@ -9,8 +9,8 @@ XMLRPCConnectionManager& XMLRPCConnectionManager::sharedManager() {
     return *manager;
 }
 
-String XMLRPCConnectionManager::spawnConnectionWithXMLRPCRequest(std::shared_ptr<XMLRPCRequest> request,
-                                                                 std::shared_ptr<XMLRPCConnectionDelegate> delegate) {
+String XMLRPCConnectionManager::spawnConnectionWithXMLRPCRequest(
+    std::shared_ptr<XMLRPCRequest> request, std::shared_ptr<XMLRPCConnectionDelegate> delegate) {
     const auto connection =
         XMLRPCConnection::initWithXMLRPCRequest(std::move(request), std::move(delegate), *this);
     if (!connection) return nullptr;
@@ -36,7 +36,8 @@ size_t XMLRPCConnectionManager::numberOfActiveConnections() const {
     return myConnections.size();
 }
 
-std::shared_ptr<XMLRPCConnection> XMLRPCConnectionManager::connectionForIdentifier(const String& identifier) const {
+std::shared_ptr<XMLRPCConnection> XMLRPCConnectionManager::connectionForIdentifier(
+    const String& identifier) const {
     const std::lock_guard lock(mutex_);
     const auto position = myConnections.find(identifier.view());
     return position == myConnections.end() ? nullptr : position->second;

@@ -19,8 +19,8 @@ class XMLRPCConnectionManager {
     XMLRPCConnectionManager(const XMLRPCConnectionManager&) = delete;
     XMLRPCConnectionManager& operator=(const XMLRPCConnectionManager&) = delete;
 
-    /// Starts an exchange whose outcome goes to the delegate. The identifier of the connection; null when there is no
-    /// HTTP session to be had.
+    /// Starts an exchange whose outcome goes to the delegate. The identifier of the connection; null when
+    /// there is no HTTP session to be had.
     String spawnConnectionWithXMLRPCRequest(std::shared_ptr<XMLRPCRequest> request,
                                             std::shared_ptr<XMLRPCConnectionDelegate> delegate);
 

@@ -13,10 +13,12 @@ namespace {
 using platform::FakeHTTPAnswer;
 using platform::HTTPError;
 
-const std::string kDocument = "<methodResponse><params><param><value>x</value></param></params></methodResponse>";
+const std::string kDocument =
+    "<methodResponse><params><param><value>x</value></param></params></methodResponse>";
 const std::string kFault = "<methodResponse><fault><value>x</value></fault></methodResponse>";
 
-FakeHTTPAnswer answer(int status, const std::string& body = {}, std::optional<HTTPError> error = std::nullopt) {
+FakeHTTPAnswer answer(int status, const std::string& body = {},
+                      std::optional<HTTPError> error = std::nullopt) {
     FakeHTTPAnswer result;
     result.status = status;
     result.body = body;
@@ -54,7 +56,11 @@ TEST(SynchronousSend, AResponseIsABodyOfAGoodStatus) {
         {"an empty body", answer(200), true, {}, {}},
         {"no XML", answer(200, "<html>"), true, {}, {}},
         {"no connection", answer(0, {}, HTTPError{7, "refused"}), false, {}, transportError(7, "refused")},
-        {"an end inside the body", answer(200, kDocument, HTTPError{18, "cut"}), false, {}, transportError(18, "cut")},
+        {"an end inside the body",
+         answer(200, kDocument, HTTPError{18, "cut"}),
+         false,
+         {},
+         transportError(18, "cut")},
     };
     for (const Case& each : cases) {
         platform::FakeHTTPTransport transport;
@@ -87,7 +93,8 @@ class TimedSend : public testing::Test {
         late.delaySeconds = serverDelay;
         transport_.enqueue(late);
         caller_.async([this] {
-            hasResponse_ = XMLRPCConnection::sendSynchronousXMLRPCRequest(*someRequest(), &error_).has_value();
+            hasResponse_ =
+                XMLRPCConnection::sendSynchronousXMLRPCRequest(*someRequest(), &error_).has_value();
             isOver_ = true;
         });
         clock_.settle();
@@ -140,10 +147,12 @@ class Recorder : public XMLRPCConnectionDelegate {
     void didFailWithError(const XMLRPCRequest&, const Error& error) override {
         note("failure " + error.domain.text() + " " + std::to_string(error.code));
     }
-    void didSendBodyData(const XMLRPCRequest&, float fraction) override { note("sent " + std::to_string(fraction)); }
+    void didSendBodyData(const XMLRPCRequest&, float fraction) override {
+        note("sent " + std::to_string(fraction));
+    }
 
-    std::optional<bool> canAuthenticateAgainstProtectionSpace(const XMLRPCRequest&,
-                                                              const platform::ProtectionSpace& space) override {
+    std::optional<bool> canAuthenticateAgainstProtectionSpace(
+        const XMLRPCRequest&, const platform::ProtectionSpace& space) override {
         note("may authenticate at " + space.host);
         return canAuthenticate;
     }
@@ -194,7 +203,8 @@ TEST_F(AsynchronousConnection, TellsTheDelegateOfEveryOutcome) {
     EXPECT_EQ(linesOf(answer(304, kDocument)), Lines{});
     EXPECT_EQ(linesOf(answer(404)), Lines{"failure HTTP 404"});
     EXPECT_EQ(linesOf(answer(500, kDocument)), (Lines{"failure HTTP 500", "response x to m"}));
-    EXPECT_EQ(linesOf(answer(200, kDocument, HTTPError{18, "cut"})), Lines{"failure HWTransportErrorDomain 18"});
+    EXPECT_EQ(linesOf(answer(200, kDocument, HTTPError{18, "cut"})),
+              Lines{"failure HWTransportErrorDomain 18"});
     EXPECT_TRUE(log_.contains(", failed with the following error: cut"));
     FakeHTTPAnswer slow = answer(200, kDocument);
     slow.progress = {{1, 4}, {4, 4}};

@@ -35,7 +35,9 @@ class ElementWriter {
     void object(const Value& value);
     void array(const Array& array);
     void dictionary(const Dictionary& dictionary);
-    void boolean(bool value) { out_.append("<value><boolean>").append(value ? "1" : "0").append("</boolean></value>"); }
+    void boolean(bool value) {
+        out_.append("<value><boolean>").append(value ? "1" : "0").append("</boolean></value>");
+    }
     void number(const Value& number);
     void string(std::string_view text);
     void date(double seconds);
@@ -70,15 +72,24 @@ void ElementWriter::document(const String& method, const std::optional<Array>& p
 
 void ElementWriter::object(const Value& value) {
     switch (value.kind()) {
-        case Value::Kind::Absent: return;
-        case Value::Kind::Array: return array(*value.asArray());
-        case Value::Kind::Dictionary: return dictionary(*value.asDictionary());
-        case Value::Kind::Boolean: return boolean(*value.asBoolean());
-        case Value::Kind::Number: return number(value);
-        case Value::Kind::String: return string(*value.asText());
-        case Value::Kind::Date: return date(*value.asDate());
-        case Value::Kind::Data: return data(value.asData().bytes());
-        default: out_ += "<value><nil/></value>";
+        case Value::Kind::Absent:
+            return;
+        case Value::Kind::Array:
+            return array(*value.asArray());
+        case Value::Kind::Dictionary:
+            return dictionary(*value.asDictionary());
+        case Value::Kind::Boolean:
+            return boolean(*value.asBoolean());
+        case Value::Kind::Number:
+            return number(value);
+        case Value::Kind::String:
+            return string(*value.asText());
+        case Value::Kind::Date:
+            return date(*value.asDate());
+        case Value::Kind::Data:
+            return data(value.asData().bytes());
+        default:
+            out_ += "<value><nil/></value>";
     }
 }
 
@@ -133,7 +144,8 @@ void ElementWriter::padded(int number, ptrdiff_t width) {
         --width;
     }
     const ptrdiff_t size = end - std::begin(digits);
-    out_.append(static_cast<size_t>(std::max<ptrdiff_t>(width - size, 0)), '0').append(digits, static_cast<size_t>(size));
+    out_.append(static_cast<size_t>(std::max<ptrdiff_t>(width - size, 0)), '0')
+        .append(digits, static_cast<size_t>(size));
 }
 
 void ElementWriter::date(double seconds) {

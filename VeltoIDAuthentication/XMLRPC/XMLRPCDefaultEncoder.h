@@ -8,8 +8,8 @@
 
 namespace veltoid {
 
-/// A method call and its document text. Encoding cannot fail. The texts are of the wiping kind because parameters carry
-/// password hashes. One object belongs to one thread at a time.
+/// A method call and its document text. Encoding cannot fail. The texts are of the wiping kind because
+/// parameters carry password hashes. One object belongs to one thread at a time.
 class XMLRPCDefaultEncoder {
   public:
     /// Replaces both; none means no parameters.
@@ -21,14 +21,14 @@ class XMLRPCDefaultEncoder {
     /// The whole document, written in one pass.
     platform::SecretText encode() const;
 
-    // The `value` element of one value; nothing for the absent one. Null, and what XML-RPC has no form for (URL, UUID,
-    // Error, objects), is the nil element of the common extension.
+    // The `value` element of one value; nothing for the absent one. Null, and what XML-RPC has no form for
+    // (URL, UUID, Error, objects), is the nil element of the common extension.
     static platform::SecretText encodeObject(const Value& value);
     static platform::SecretText encodeArray(const Array& array);
     static platform::SecretText encodeDictionary(const Dictionary& dictionary);
     static platform::SecretText encodeBoolean(bool value);
-    /// Double-precision numbers as "double" in the shortest form that reads back; every other kind as "i4", without
-    /// regard to 32 bits.
+    /// Double-precision numbers as "double" in the shortest form that reads back; every other kind as "i4",
+    /// without regard to 32 bits.
     static platform::SecretText encodeNumber(const Value& number);
     /// With `omitTag` just the escaped text.
     static platform::SecretText encodeString(std::string_view text, bool omitTag);

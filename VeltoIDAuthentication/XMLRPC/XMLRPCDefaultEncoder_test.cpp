@@ -51,9 +51,9 @@ TEST(XMLRPCDefaultEncoder, WritesEachKindInItsForm) {
         {Error{"domain", 1, {}}, "<value><nil/></value>"},
         {Value::url("https://elsewhere.example"), "<value><nil/></value>"},
         {Array(), "<value><array><data></data></array></value>"},
-        {Array{"a", Value::null(), Value::int32(1)},
-         "<value><array><data>" + scalar("string", "a") + "<value><nil/></value>" + scalar("i4", "1") +
-             "</data></array></value>"},
+        {Array{"a", Value::null(), Value::int32(1)}, "<value><array><data>" + scalar("string", "a") +
+                                                         "<value><nil/></value>" + scalar("i4", "1") +
+                                                         "</data></array></value>"},
         {Dictionary(), "<value><struct></struct></value>"},
         {Dictionary{{"z", "1"}, {"a<", Value::null()}},
          "<value><struct><member><name>z</name>" + scalar("string", "1") +
@@ -67,13 +67,18 @@ TEST(XMLRPCDefaultEncoder, WritesDatesAtUTCWithoutFractions) {
     setenv("TZ", "America/Los_Angeles", 1);
     tzset();
     const std::pair<double, const char*> dates[] = {
-        {1'768'615'122.9, "20260117T01:58:42Z"}, {0, "19700101T00:00:00Z"},
-        {-0.5, "19691231T23:59:59Z"},            {1'709'164'800, "20240229T00:00:00Z"},
-        {-62'135'596'800, "00010101T00:00:00Z"}, {253'402'300'799.9, "99991231T23:59:59Z"},
-        {253'402'300'800, "100000101T00:00:00Z"}, {std::nan(""), "19700101T00:00:00Z"},
+        {1'768'615'122.9, "20260117T01:58:42Z"},
+        {0, "19700101T00:00:00Z"},
+        {-0.5, "19691231T23:59:59Z"},
+        {1'709'164'800, "20240229T00:00:00Z"},
+        {-62'135'596'800, "00010101T00:00:00Z"},
+        {253'402'300'799.9, "99991231T23:59:59Z"},
+        {253'402'300'800, "100000101T00:00:00Z"},
+        {std::nan(""), "19700101T00:00:00Z"},
     };
     for (const auto& [seconds, text] : dates)
-        EXPECT_EQ(std::string_view(XMLRPCDefaultEncoder::encodeDate(seconds)), scalar("dateTime.iso8601", text));
+        EXPECT_EQ(std::string_view(XMLRPCDefaultEncoder::encodeDate(seconds)),
+                  scalar("dateTime.iso8601", text));
     // Beyond every calendar: some date, but no crash.
     EXPECT_FALSE(XMLRPCDefaultEncoder::encodeDate(std::numeric_limits<double>::infinity()).empty());
     EXPECT_FALSE(XMLRPCDefaultEncoder::encodeDate(-1e300).empty());
@@ -88,14 +93,16 @@ TEST(XMLRPCDefaultEncoder, DoublesReadBackAsTheSameNumber) {
 }
 
 TEST(XMLRPCDefaultEncoder, WritesTheDocumentInOneLine) {
-    const std::string start = "<?xml version=\"1.0\"?><methodCall><methodName>a&lt;&#x27;</methodName><params>";
+    const std::string start =
+        "<?xml version=\"1.0\"?><methodCall><methodName>a&lt;&#x27;</methodName><params>";
     const std::string end = "</params></methodCall>";
     const std::pair<std::optional<Array>, std::string> documents[] = {
         {std::nullopt, ""},
         {Array(), ""},
-        {Array{Dictionary{{"k", "t"}}},
-         "<param><value><struct><member><name>k</name>" + scalar("string", "t") + "</member></struct></value></param>"},
-        {Array{"1", "2"}, "<param>" + scalar("string", "1") + "</param><param>" + scalar("string", "2") + "</param>"},
+        {Array{Dictionary{{"k", "t"}}}, "<param><value><struct><member><name>k</name>" +
+                                            scalar("string", "t") + "</member></struct></value></param>"},
+        {Array{"1", "2"},
+         "<param>" + scalar("string", "1") + "</param><param>" + scalar("string", "2") + "</param>"},
     };
     XMLRPCDefaultEncoder encoder;
     EXPECT_EQ(encoder.method(), String(""));
@@ -130,9 +137,11 @@ TEST(XMLRPCHelpers, Base64WithNonASCIIDecodesToNothing) {
 }
 
 TEST(XMLRPCHelpers, KnowsUTF8) {
-    const char* const good[] = {"", "a", "\u00E9", "\u20AC", "\U0001F600", "\xED\x9F\xBF", "\xF4\x8F\xBF\xBF"};
-    const char* const bad[] = {"\x80",         "\xC1\xBF",     "\xE0\x9F\xBF", "\xED\xA0\x80",     "\xF0\x8F\xBF\xBF",
-                               "\xF5\x80\x80", "a\xE2\x82",    "\xC3(",        "\xF4\x90\x80\x80", "\xE2\x28\xA1"};
+    const char* const good[] = {
+        "", "a", "\u00E9", "\u20AC", "\U0001F600", "\xED\x9F\xBF", "\xF4\x8F\xBF\xBF"};
+    const char* const bad[] = {
+        "\x80",         "\xC1\xBF",  "\xE0\x9F\xBF", "\xED\xA0\x80",     "\xF0\x8F\xBF\xBF",
+        "\xF5\x80\x80", "a\xE2\x82", "\xC3(",        "\xF4\x90\x80\x80", "\xE2\x28\xA1"};
     for (const char* text : good) EXPECT_TRUE(isUTF8(text)) << text;
     for (const char* text : bad) EXPECT_FALSE(isUTF8(text)) << testing::PrintToString(std::string(text));
 }

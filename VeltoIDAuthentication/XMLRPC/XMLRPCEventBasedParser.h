@@ -12,8 +12,9 @@ class XMLRPCEventBasedParser : private platform::XMLEvents {
     /// The bytes must outlive the parser.
     explicit XMLRPCEventBasedParser(platform::Bytes data) : myParser(data) {}
 
-    /// The first value of the document, whatever the elements around it are called. Absent when there is none, when the
-    /// document is not well-formed (before or after that value), declares entities or is nested too deeply.
+    /// The first value of the document, whatever the elements around it are called. Absent when there is
+    /// none, when the document is not well-formed (before or after that value), declares entities or is
+    /// nested too deeply.
     Value parse();
 
     /// From inside `parse` only.

@@ -25,9 +25,12 @@ uint32_t hashOf(std::string_view text) {
 XMLRPCTag tagNamed(std::string_view name) {
     // By length first: one comparison decides.
     switch (name.size()) {
-        case 2: return name == "i4" ? XMLRPCTag::Integer : XMLRPCTag::Other;
-        case 3: return name == "int" ? XMLRPCTag::Integer : XMLRPCTag::Other;
-        case 4: return name == "name" ? XMLRPCTag::Name : XMLRPCTag::Other;
+        case 2:
+            return name == "i4" ? XMLRPCTag::Integer : XMLRPCTag::Other;
+        case 3:
+            return name == "int" ? XMLRPCTag::Integer : XMLRPCTag::Other;
+        case 4:
+            return name == "name" ? XMLRPCTag::Name : XMLRPCTag::Other;
         case 5:
             if (name == "value") return XMLRPCTag::Value;
             if (name == "array") return XMLRPCTag::Array;
@@ -38,9 +41,12 @@ XMLRPCTag tagNamed(std::string_view name) {
             if (name == "struct") return XMLRPCTag::Struct;
             if (name == "double") return XMLRPCTag::Double;
             return name == "base64" ? XMLRPCTag::Data : XMLRPCTag::Other;
-        case 7: return name == "boolean" ? XMLRPCTag::Boolean : XMLRPCTag::Other;
-        case 16: return name == "dateTime.iso8601" ? XMLRPCTag::Date : XMLRPCTag::Other;
-        default: return XMLRPCTag::Other;
+        case 7:
+            return name == "boolean" ? XMLRPCTag::Boolean : XMLRPCTag::Other;
+        case 16:
+            return name == "dateTime.iso8601" ? XMLRPCTag::Date : XMLRPCTag::Other;
+        default:
+            return XMLRPCTag::Other;
     }
 }
 
@@ -60,10 +66,15 @@ bool XMLRPCEventBasedParserDelegate::push(XMLRPCElementType type) {
 
 bool XMLRPCEventBasedParserDelegate::startElement(XMLRPCTag tag) {
     switch (tag) {
-        case XMLRPCTag::Value: return push(XMLRPCElementType::String);
-        case XMLRPCTag::Member: return push(XMLRPCElementType::Member);
-        case XMLRPCTag::Name: return push(XMLRPCElementType::Name);
-        default: setElementType(tag); return true;
+        case XMLRPCTag::Value:
+            return push(XMLRPCElementType::String);
+        case XMLRPCTag::Member:
+            return push(XMLRPCElementType::Member);
+        case XMLRPCTag::Name:
+            return push(XMLRPCElementType::Name);
+        default:
+            setElementType(tag);
+            return true;
     }
 }
 
@@ -80,13 +91,26 @@ void XMLRPCEventBasedParserDelegate::setElementType(XMLRPCTag tag) {
             node.dictionary = Dictionary();
             node.text.clear();
             break;
-        case XMLRPCTag::Integer: node.myElementType = XMLRPCElementType::Integer; break;
-        case XMLRPCTag::Double: node.myElementType = XMLRPCElementType::Double; break;
-        case XMLRPCTag::Boolean: node.myElementType = XMLRPCElementType::Boolean; break;
-        case XMLRPCTag::String: node.myElementType = XMLRPCElementType::String; break;
-        case XMLRPCTag::Date: node.myElementType = XMLRPCElementType::Date; break;
-        case XMLRPCTag::Data: node.myElementType = XMLRPCElementType::Data; break;
-        default: break;
+        case XMLRPCTag::Integer:
+            node.myElementType = XMLRPCElementType::Integer;
+            break;
+        case XMLRPCTag::Double:
+            node.myElementType = XMLRPCElementType::Double;
+            break;
+        case XMLRPCTag::Boolean:
+            node.myElementType = XMLRPCElementType::Boolean;
+            break;
+        case XMLRPCTag::String:
+            node.myElementType = XMLRPCElementType::String;
+            break;
+        case XMLRPCTag::Date:
+            node.myElementType = XMLRPCElementType::Date;
+            break;
+        case XMLRPCTag::Data:
+            node.myElementType = XMLRPCElementType::Data;
+            break;
+        default:
+            break;
     }
 }
 
@@ -107,19 +131,29 @@ void XMLRPCEventBasedParserDelegate::endElement(XMLRPCTag tag) {
 
 Value XMLRPCEventBasedParserDelegate::elementValue(Node& node) {
     switch (node.myElementType) {
-        case XMLRPCElementType::Array: return std::move(node.array);
-        case XMLRPCElementType::Dictionary: return std::move(node.dictionary);
-        case XMLRPCElementType::Member: return node.memberValue.isAbsent() ? empty_ : std::move(node.memberValue);
-        default: break;
+        case XMLRPCElementType::Array:
+            return std::move(node.array);
+        case XMLRPCElementType::Dictionary:
+            return std::move(node.dictionary);
+        case XMLRPCElementType::Member:
+            return node.memberValue.isAbsent() ? empty_ : std::move(node.memberValue);
+        default:
+            break;
     }
     const std::string_view text = xmlrpc::parseString(node.text);
     switch (node.myElementType) {
-        case XMLRPCElementType::Integer: return Value::int32(xmlrpc::parseInteger(text));
-        case XMLRPCElementType::Double: return Value::real(xmlrpc::parseDouble(text));
-        case XMLRPCElementType::Boolean: return Value::boolean(xmlrpc::parseBoolean(text));
-        case XMLRPCElementType::Date: return xmlrpc::parseDate(text);
-        case XMLRPCElementType::Data: return xmlrpc::parseData(text);
-        default: return text.empty() ? empty_ : String(text);
+        case XMLRPCElementType::Integer:
+            return Value::int32(xmlrpc::parseInteger(text));
+        case XMLRPCElementType::Double:
+            return Value::real(xmlrpc::parseDouble(text));
+        case XMLRPCElementType::Boolean:
+            return Value::boolean(xmlrpc::parseBoolean(text));
+        case XMLRPCElementType::Date:
+            return xmlrpc::parseDate(text);
+        case XMLRPCElementType::Data:
+            return xmlrpc::parseData(text);
+        default:
+            return text.empty() ? empty_ : String(text);
     }
 }
 
@@ -132,9 +166,14 @@ void XMLRPCEventBasedParserDelegate::addElementValueToParent(Node& node, Node& p
                 parent.memberValue = elementValue(node);
             }
             break;
-        case XMLRPCElementType::Dictionary: addMember(parent.dictionary, node.myElementKey, elementValue(node)); break;
-        case XMLRPCElementType::Array: parent.array.append(elementValue(node)); break;
-        default: break;
+        case XMLRPCElementType::Dictionary:
+            addMember(parent.dictionary, node.myElementKey, elementValue(node));
+            break;
+        case XMLRPCElementType::Array:
+            parent.array.append(elementValue(node));
+            break;
+        default:
+            break;
     }
 }
 

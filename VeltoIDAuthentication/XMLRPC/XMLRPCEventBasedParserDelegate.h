@@ -1,9 +1,10 @@
 // Assembles a value from the elements inside one XML-RPC `value` element.
 //
-// The rules, which servers rely on: a `value`, `member` or `name` element is a node; the elements inside it that name a
-// type only set the node's type; a value without a type is a String; unknown elements (`data` and `nil` among them) do
-// nothing, so that a nil is an empty String; every text is trimmed. Open nodes are records on a stack that keep their
-// text buffers for the next node at that depth, so that an element costs no allocation.
+// The rules, which servers rely on: a `value`, `member` or `name` element is a node; the elements inside it
+// that name a type only set the node's type; a value without a type is a String; unknown elements (`data` and
+// `nil` among them) do nothing, so that a nil is an empty String; every text is trimmed. Open nodes are
+// records on a stack that keep their text buffers for the next node at that depth, so that an element costs
+// no allocation.
 #pragma once
 
 #include <array>
@@ -14,7 +15,8 @@
 
 namespace veltoid {
 
-/// Open nodes at once; a document with more is refused, for the sake of everyone who walks the tree by recursion.
+/// Open nodes at once; a document with more is refused, for the sake of everyone who walks the tree by
+/// recursion.
 inline constexpr size_t kMaxXMLRPCDepth = 256;
 
 enum class XMLRPCElementType : uint8_t {

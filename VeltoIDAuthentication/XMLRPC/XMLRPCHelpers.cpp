@@ -12,6 +12,9 @@ namespace {
 
 constexpr unsigned char kLastASCII = 0x7F;
 
+/// At least what a string keeps inside itself, where it would not be wiped.
+constexpr size_t kKeptInside = 32;
+
 /// What replaces each byte; empty for the many that stay.
 constexpr std::array<std::string_view, 256> kReplacements = [] {
     std::array<std::string_view, 256> replacements{};
@@ -65,7 +68,7 @@ void appendEscapedString(platform::SecretText& out, std::string_view text) {
 
 platform::SecretText escapedString(std::string_view text) {
     platform::SecretText escaped;
-    escaped.reserve(text.size() + sizeof escaped);
+    escaped.reserve(text.size() + kKeptInside);
     appendEscapedString(escaped, text);
     return escaped;
 }
@@ -73,8 +76,8 @@ platform::SecretText escapedString(std::string_view text) {
 String base64EncodedString(platform::Bytes bytes) { return xmlrpcBase64Encode(bytes, true); }
 
 Data dataFromBase64String(std::string_view text) {
-    const bool isASCII =
-        std::all_of(text.begin(), text.end(), [](char c) { return static_cast<unsigned char>(c) <= kLastASCII; });
+    const bool isASCII = std::all_of(text.begin(), text.end(),
+                                     [](char c) { return static_cast<unsigned char>(c) <= kLastASCII; });
     return isASCII ? xmlrpcBase64Decode(text) : Data(platform::Bytes());
 }
 

@@ -17,8 +17,8 @@ void appendEscapedString(platform::SecretText& out, std::string_view text);
 /// Base64 in lines of 64 characters with CR LF between them and none after the last; empty for no bytes.
 String base64EncodedString(platform::Bytes bytes);
 
-/// The bytes of a base64 text, white space and everything else outside the alphabet skipped; empty when the text holds
-/// a non-ASCII character.
+/// The bytes of a base64 text, white space and everything else outside the alphabet skipped; empty when the
+/// text holds a non-ASCII character.
 Data dataFromBase64String(std::string_view text);
 
 /// Whether the text is well-formed UTF-8 (RFC 3629).

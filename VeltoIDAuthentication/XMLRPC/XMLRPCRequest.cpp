@@ -49,7 +49,8 @@ platform::HTTPRequest XMLRPCRequest::request() const {
     request.setHeaderField("Content-Length", std::to_string(request.body.size()));
     request.setHeaderField("Accept", "text/xml");
     if (request.headerField("User-Agent") == nullptr) {
-        if (const String userAgent = userAgentOfSettings()) request.setHeaderField("User-Agent", userAgent.view());
+        if (const String userAgent = userAgentOfSettings())
+            request.setHeaderField("User-Agent", userAgent.view());
     }
     return request;
 }

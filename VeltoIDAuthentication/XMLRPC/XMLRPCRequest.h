@@ -29,7 +29,9 @@ class XMLRPCRequest {
     void setMethod(const String& method) { myXMLEncoder->setMethod(method, std::nullopt); }
     /// A call with one parameter, or without any when the value is absent.
     void setMethod(const String& method, const Value& parameter);
-    void setMethod(const String& method, const Array& parameters) { myXMLEncoder->setMethod(method, parameters); }
+    void setMethod(const String& method, const Array& parameters) {
+        myXMLEncoder->setMethod(method, parameters);
+    }
 
     const String& method() const { return myXMLEncoder->method(); }
     const std::optional<Array>& parameters() const { return myXMLEncoder->parameters(); }
@@ -37,8 +39,8 @@ class XMLRPCRequest {
     /// The document.
     platform::SecretText body() const { return myXMLEncoder->encode(); }
 
-    /// The finished POST: XML content and its length in bytes, and the "User-Agent" of the agent's preferences when none
-    /// was set.
+    /// The finished POST: XML content and its length in bytes, and the "User-Agent" of the agent's
+    /// preferences when none was set.
     platform::HTTPRequest request() const;
 
     /// Replaces an earlier value of that field.

@@ -23,10 +23,11 @@ TEST(XMLRPCRequest, IsAnXMLPostOfTheDocument) {
     EXPECT_EQ(http.url, "https://server.example/rpc");
     EXPECT_EQ(http.method, "POST");
     EXPECT_FALSE(http.handlesCookies);
-    EXPECT_EQ(std::string_view(http.body),
-              "<?xml version=\"1.0\"?><methodCall><methodName>m</methodName><params><param><value><struct><member>"
-              "<name>k</name><value><string>\u20AC</string></value></member></struct></value></param></params>"
-              "</methodCall>");
+    EXPECT_EQ(
+        std::string_view(http.body),
+        "<?xml version=\"1.0\"?><methodCall><methodName>m</methodName><params><param><value><struct><member>"
+        "<name>k</name><value><string>\u20AC</string></value></member></struct></value></param></params>"
+        "</methodCall>");
     EXPECT_EQ(http.body, request.body());
     // The length counts bytes: the one character of the text is three of them.
     EXPECT_EQ(http.headerFields, (Fields{{"User-Agent", "VeltoIDXMLRPC"},

@@ -15,7 +15,8 @@ class XMLRPCResponse {
     bool isFault() const { return myIsFault; }
     const Value& object() const { return myObject; }
 
-    /// The whole body, for diagnostics; null when it is not UTF-8. It may hold secrets: it is nothing for a log.
+    /// The whole body, for diagnostics; null when it is not UTF-8. It may hold secrets: it is nothing for a
+    /// log.
     String body() const;
 
     /// What the fault says of itself; absent when this is no fault or it says nothing.

@@ -15,16 +15,21 @@ XMLRPCResponse responseOf(std::string_view text) {
 }
 
 std::string document(const std::string& value) {
-    return "<?xml version='1.0'?><methodResponse><params><param>" + value + "</param></params></methodResponse>";
+    return "<?xml version='1.0'?><methodResponse><params><param>" + value +
+           "</param></params></methodResponse>";
 }
 
 std::string member(const std::string& name, const std::string& value) {
     return "<member><name>" + name + "</name>" + value + "</member>";
 }
 
-std::string structure(const std::string& members) { return "<value><struct>" + members + "</struct></value>"; }
+std::string structure(const std::string& members) {
+    return "<value><struct>" + members + "</struct></value>";
+}
 
-std::string array(const std::string& values) { return "<value><array><data>" + values + "</data></array></value>"; }
+std::string array(const std::string& values) {
+    return "<value><array><data>" + values + "</data></array></value>";
+}
 
 struct Case {
     const char* what;
@@ -75,7 +80,8 @@ TEST(XMLRPCResponse, ReadsArraysAndStructs) {
         {"an empty struct", structure(""), Dictionary()},
         {"members in order", structure(" " + member("b", one) + "\n" + member("a", "<value>x</value>")),
          Dictionary{{"b", Value::int32(1)}, {"a", "x"}}},
-        {"a name that needs trimming", structure(member(" a&amp;b\n", one)), Dictionary{{"a&b", Value::int32(1)}}},
+        {"a name that needs trimming", structure(member(" a&amp;b\n", one)),
+         Dictionary{{"a&b", Value::int32(1)}}},
         {"the later of two of a name", structure(member("a", "<value>x</value>") + member("a", one)),
          Dictionary{{"a", Value::int32(1)}}},
         {"no date removes the name", structure(member("a", one) + member("b", one) + member("a", noDate)),
@@ -88,7 +94,8 @@ TEST(XMLRPCResponse, ReadsArraysAndStructs) {
         {"an empty name", structure(member("", one)), Dictionary{{"", Value::int32(1)}}},
         {"the last of two values", structure("<member><name>a</name><value>x</value>" + one + "</member>"),
          Dictionary{{"a", Value::int32(1)}}},
-        {"nesting", structure(member("a", array(structure(member("b", array(one))) + one)) + member("c", one)),
+        {"nesting",
+         structure(member("a", array(structure(member("b", array(one))) + one)) + member("c", one)),
          Dictionary{{"a", Array{Dictionary{{"b", Array{Value::int32(1)}}}, Value::int32(1)}},
                     {"c", Value::int32(1)}}},
     });
@@ -100,7 +107,8 @@ TEST(XMLRPCResponse, SurvivesElementsInWrongPlaces) {
         {"unknown elements everywhere", "<x/><value><y><i4><z>1</z>2</i4></y></value>", Value::int32(12)},
         {"the last type counts, all text", "<value>1<string>2</string><i4>3</i4></value>", Value::int32(123)},
         {"a value in a value", "<value>a" + one + "b</value>", "ab"},
-        {"a type after an array", "<value><array><value>x</value></array><i4>7</i4></value>", Value::int32(7)},
+        {"a type after an array", "<value><array><value>x</value></array><i4>7</i4></value>",
+         Value::int32(7)},
         {"text around an array", "<value>x<array>y</array>z</value>", Array()},
         {"a second array", "<value><array>" + one + "</array><array/></value>", Array()},
         {"a struct after an array", "<value><array>" + one + "</array><struct/></value>", Dictionary()},
@@ -109,7 +117,8 @@ TEST(XMLRPCResponse, SurvivesElementsInWrongPlaces) {
         {"a name in an array", array("<name> a </name>"), Array{"a"}},
         {"a typed name is a value", structure("<member><name>a</name><name><i4>2</i4></name></member>"),
          Dictionary{{"a", Value::int32(2)}}},
-        {"a typed member", structure("<member><name>a</name><i4>3</i4></member>"), Dictionary{{"a", Value::int32(3)}}},
+        {"a typed member", structure("<member><name>a</name><i4>3</i4></member>"),
+         Dictionary{{"a", Value::int32(3)}}},
         {"a member in an array", array(member("a", one)), Array{Value::int32(1)}},
         {"only the first value", one + "<value>x</value>", Value::int32(1)},
         {"no value", "<i4>1</i4>", Value()},
@@ -142,7 +151,8 @@ TEST(XMLRPCResponse, TellsFaultsApart) {
 
     EXPECT_TRUE(fault("").isFault());
     EXPECT_TRUE(fault(structure(text)).faultCode().isAbsent());
-    EXPECT_TRUE(responseOf(document(structure(code + text))).faultCode().isAbsent()) << "no fault, whatever it says";
+    EXPECT_TRUE(responseOf(document(structure(code + text))).faultCode().isAbsent())
+        << "no fault, whatever it says";
 }
 
 TEST(XMLRPCResponse, ABrokenDocumentHasNoObject) {
@@ -153,7 +163,8 @@ TEST(XMLRPCResponse, ABrokenDocumentHasNoObject) {
         good + "x",
         good.substr(0, good.size() / 2),
         document("<value>\xFF</value>"),
-        "<!DOCTYPE x [<!ENTITY e 'v'>]>" + document("<value>&e;</value>").substr(strlen("<?xml version='1.0'?>")),
+        "<!DOCTYPE x [<!ENTITY e 'v'>]>" +
+            document("<value>&e;</value>").substr(strlen("<?xml version='1.0'?>")),
     };
     for (const std::string& text : bad) EXPECT_TRUE(responseOf(text).object().isAbsent()) << text;
     // Cut off anywhere, a document is never half a value.

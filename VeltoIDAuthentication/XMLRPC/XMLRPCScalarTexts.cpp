@@ -43,8 +43,8 @@ std::string_view withoutPlus(std::string_view text) {
     return text.starts_with('+') && !text.substr(1).starts_with('-') ? text.substr(1) : text;
 }
 
-/// Whether a number that a double cannot hold is too large rather than too small: the place of its first significant
-/// digit decides.
+/// Whether a number that a double cannot hold is too large rather than too small: the place of its first
+/// significant digit decides.
 bool isTooLarge(std::string_view number) {
     const size_t exponentMark = number.find_first_of("eE");
     const std::string_view digits = number.substr(0, exponentMark);
@@ -56,12 +56,14 @@ bool isTooLarge(std::string_view number) {
 
     const std::string_view exponentText = withoutPlus(number.substr(exponentMark + 1));
     int64_t exponent = 0;
-    const auto read = std::from_chars(exponentText.data(), exponentText.data() + exponentText.size(), exponent);
+    const auto read =
+        std::from_chars(exponentText.data(), exponentText.data() + exponentText.size(), exponent);
     if (read.ec == std::errc::result_out_of_range) return !exponentText.starts_with('-');
     return exponent > -place;
 }
 
-/// Takes fixed-width fields off the front of a text; once something does not fit, everything after it fails too.
+/// Takes fixed-width fields off the front of a text; once something does not fit, everything after it fails
+/// too.
 class FieldReader {
   public:
     explicit FieldReader(std::string_view text) : left_(text) {}
@@ -141,7 +143,8 @@ int32_t parseInteger(std::string_view text) {
     int32_t result = 0;
     const auto read = std::from_chars(number.data(), number.data() + number.size(), result);
     if (read.ec != std::errc::result_out_of_range) return result;
-    return number.starts_with('-') ? std::numeric_limits<int32_t>::min() : std::numeric_limits<int32_t>::max();
+    return number.starts_with('-') ? std::numeric_limits<int32_t>::min()
+                                   : std::numeric_limits<int32_t>::max();
 }
 
 double parseDouble(std::string_view text) {

@@ -1,5 +1,5 @@
-// Reading the texts of XML-RPC scalars. Texts come trimmed; one that cannot be read gives a neutral value, never a
-// failure. No locale and no time zone of the process takes part.
+// Reading the texts of XML-RPC scalars. Texts come trimmed; one that cannot be read gives a neutral value,
+// never a failure. No locale and no time zone of the process takes part.
 #pragma once
 
 #include <array>
@@ -16,7 +16,8 @@ struct DateFormat {
     bool zone;
 };
 
-/// In the order in which parseDate tries them: the basic and the extended calendar form of ISO 8601, zoned ones first.
+/// In the order in which parseDate tries them: the basic and the extended calendar form of ISO 8601, zoned
+/// ones first.
 inline constexpr std::array<DateFormat, 4> kDateFormats = {
     {{false, true}, {true, true}, {false, false}, {true, false}}};
 
@@ -37,8 +38,8 @@ bool parseBoolean(std::string_view text);
 /// The date in the first format that reads the whole text; Null when none does.
 Value parseDate(std::string_view text);
 
-/// Seconds since 1970-01-01 00:00:00 UTC. A zone is "Z" or an offset such as "+0100" or "-08:00"; without one the text
-/// is at UTC. None unless the whole text is in this format and names an existing second.
+/// Seconds since 1970-01-01 00:00:00 UTC. A zone is "Z" or an offset such as "+0100" or "-08:00"; without one
+/// the text is at UTC. None unless the whole text is in this format and names an existing second.
 std::optional<double> parseDateString(std::string_view text, DateFormat withFormat);
 
 /// See dataFromBase64String.

@@ -20,9 +20,9 @@ TEST(XMLRPCScalarTexts, TrimsEveryKindOfWhiteSpaceAtTheEndsOnly) {
                                            {" \t\r\n\v\f", ""},
                                            {"  a b  ", "a b"},
                                            {"\u00A0\u2003a\u00A0b\u3000\u2028\u0085", "a\u00A0b"},
-                                           {"\u200Ba", "\u200Ba"},   // zero width: no white space
-                                           {"\u00E0", "\u00E0"},     // ends in the byte A0
-                                           {"x\x85", "x\x85"}};      // a stray continuation byte
+                                           {"\u200Ba", "\u200Ba"},  // zero width: no white space
+                                           {"\u00E0", "\u00E0"},    // ends in the byte A0
+                                           {"x\x85", "x\x85"}};     // a stray continuation byte
     for (const auto& [text, trimmed] : cases) EXPECT_EQ(parseString(text), trimmed) << text;
 }
 
@@ -74,7 +74,8 @@ TEST(XMLRPCScalarTexts, ReadsTheLeadingNumber) {
 }
 
 TEST(XMLRPCScalarTexts, OnlyOneIsTrue) {
-    const Cases<bool> cases = {{"1", true}, {"0", false}, {"true", false}, {"01", false}, {"", false}, {"11", false}};
+    const Cases<bool> cases = {{"1", true},   {"0", false}, {"true", false},
+                               {"01", false}, {"", false},  {"11", false}};
     for (const auto& [text, flag] : cases) EXPECT_EQ(parseBoolean(text), flag) << text;
 }
 
@@ -101,11 +102,11 @@ TEST(XMLRPCScalarTexts, WhatIsNoDateIsNull) {
         "17.01.2026",
         "20260117",
         "20260117T01:58",
-        "20260117T01:58:42.5",      // fractions
-        "20260117T01:58:42 ",       // more than the date
+        "20260117T01:58:42.5",  // fractions
+        "20260117T01:58:42 ",   // more than the date
         "20260117T01:58:42z",
         "20260117T01:58:42GMT",
-        "20260117T01:58:42+01",     // half a zone
+        "20260117T01:58:42+01",  // half a zone
         "20260117T01:58:42+2400",
         "20260117T01:58:42+0160",
         "20260117T24:00:00",
@@ -114,11 +115,11 @@ TEST(XMLRPCScalarTexts, WhatIsNoDateIsNull) {
         "20260017T01:58:42",
         "20261317T01:58:42",
         "20260100T01:58:42",
-        "20250229T00:00:00",        // no leap year
-        "19000229T00:00:00",        // nor a century
+        "20250229T00:00:00",  // no leap year
+        "19000229T00:00:00",  // nor a century
         "20260431T00:00:00",
         "00000101T00:00:00",
-        "2026-0117T01:58:42",       // half-hearted hyphens
+        "2026-0117T01:58:42",  // half-hearted hyphens
         "202601-17T01:58:42",
         "20260117 01:58:42",
         "+2026117T01:58:42",
@@ -132,7 +133,8 @@ TEST(XMLRPCScalarTexts, OneFormatReadsNoOtherForm) {
                                       "2026-01-17T01:58:42"};
     for (size_t format = 0; format < kDateFormats.size(); ++format)
         for (size_t form = 0; form < std::size(forms); ++form)
-            EXPECT_EQ(parseDateString(forms[form], kDateFormats[format]).has_value(), form == format) << forms[form];
+            EXPECT_EQ(parseDateString(forms[form], kDateFormats[format]).has_value(), form == format)
+                << forms[form];
 }
 
 }  // namespace

@@ -28,8 +28,8 @@ constexpr int32_t kDefaultLogLevel = static_cast<int32_t>(platform::LogPriority:
 Error noResponseError(std::optional<Error> transportError) {
     Dictionary userInfo;
     if (transportError) userInfo.set(kErrorUnderlyingErrorKey, *std::move(transportError));
-    return makeError(identity_error::kNoResponse, {kNoResponseReason, nullptr, nullptr}, userInfo, kNoResponseFunction,
-                     kNoResponseFile, kNoResponseLine);
+    return makeError(identity_error::kNoResponse, {kNoResponseReason, nullptr, nullptr}, userInfo,
+                     kNoResponseFunction, kNoResponseFile, kNoResponseLine);
 }
 
 int32_t faultCodeOf(const Value& code) {
@@ -37,8 +37,8 @@ int32_t faultCodeOf(const Value& code) {
     if (const auto text = code.asText()) return xmlrpc::parseInteger(*text);
     if (const auto flag = code.asBoolean()) return *flag ? 1 : 0;
     const double number = code.asDouble().value_or(0);
-    return static_cast<int32_t>(std::clamp<double>(number, std::numeric_limits<int32_t>::min(),
-                                                   std::numeric_limits<int32_t>::max()));
+    return static_cast<int32_t>(
+        std::clamp<double>(number, std::numeric_limits<int32_t>::min(), std::numeric_limits<int32_t>::max()));
 }
 
 Error faultError(const XMLRPCResponse& response) {
@@ -56,15 +56,15 @@ void logServerMessage(const Dictionary& answer) {
         std::clamp(level, static_cast<int32_t>(platform::LogPriority::Emergency),
                    static_cast<int32_t>(platform::LogPriority::Debug)));
     const std::string* queue = platform::WorkQueue::currentLabel();
-    platform::SystemLog::shared().write(priority,
-                                        "VeltoIDAuthentication: Message from server \"" + describeValue(message) + "\"",
-                                        {__FILE_NAME__, __LINE__, __func__, queue ? *queue : std::string_view()});
+    platform::SystemLog::shared().write(
+        priority, "VeltoIDAuthentication: Message from server \"" + describeValue(message) + "\"",
+        {__FILE_NAME__, __LINE__, __func__, queue ? *queue : std::string_view()});
 }
 
 }  // namespace
 
-bool xmlInvoke(const String& url, const String& methodName, const Value& parameter, std::optional<Dictionary>* result,
-               ErrorOut error) {
+bool xmlInvoke(const String& url, const String& methodName, const Value& parameter,
+               std::optional<Dictionary>* result, ErrorOut error) {
     if (result != nullptr) result->reset();
     XMLRPCRequest request(url);
     request.setMethod(methodName, parameter);

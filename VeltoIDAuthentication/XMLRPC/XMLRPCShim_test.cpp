@@ -21,7 +21,9 @@ std::string member(const std::string& name, const std::string& value) {
     return "<member><name>" + name + "</name><value>" + value + "</value></member>";
 }
 
-std::string structure(const std::string& members) { return "<value><struct>" + members + "</struct></value>"; }
+std::string structure(const std::string& members) {
+    return "<value><struct>" + members + "</struct></value>";
+}
 
 std::string fault(const std::string& members) {
     return "<methodResponse><fault>" + structure(members) + "</fault></methodResponse>";
@@ -45,7 +47,8 @@ class XMLRPCShim : public testing::Test {
     Outcome invoke(const platform::FakeHTTPAnswer& answer) {
         transport_.enqueue(answer);
         Outcome outcome;
-        outcome.success = xmlInvoke(kURL, "some.method", Dictionary{{"k", "v"}}, &outcome.result, &outcome.error);
+        outcome.success =
+            xmlInvoke(kURL, "some.method", Dictionary{{"k", "v"}}, &outcome.result, &outcome.error);
         return outcome;
     }
 
@@ -60,10 +63,12 @@ TEST_F(XMLRPCShim, SendsOneParameterInItsOwnName) {
     ASSERT_EQ(requests.size(), 2U);
     EXPECT_EQ(requests[0].url, kURL);
     EXPECT_EQ(*requests[0].headerField("User-Agent"), "VeltoIDXMLRPC");
-    EXPECT_EQ(std::string_view(requests[0].body),
-              "<?xml version=\"1.0\"?><methodCall><methodName>some.method</methodName><params><param><value><struct>"
-              "<member><name>k</name><value><string>v</string></value></member></struct></value></param></params>"
-              "</methodCall>");
+    EXPECT_EQ(
+        std::string_view(requests[0].body),
+        "<?xml "
+        "version=\"1.0\"?><methodCall><methodName>some.method</methodName><params><param><value><struct>"
+        "<member><name>k</name><value><string>v</string></value></member></struct></value></param></params>"
+        "</methodCall>");
     EXPECT_NE(requests[1].body.find("<params></params>"), std::string::npos);
 }
 
@@ -122,7 +127,8 @@ TEST_F(XMLRPCShim, NoResponseIsAnErrorOfItsOwn) {
     unreachable.status = 0;
     unreachable.error = platform::HTTPError{7, "refused"};
     Dictionary withReason = userInfo;
-    withReason.set(kErrorUnderlyingErrorKey, Error{kTransportErrorDomain, 7, {{kErrorDescriptionKey, "refused"}}});
+    withReason.set(kErrorUnderlyingErrorKey,
+                   Error{kTransportErrorDomain, 7, {{kErrorDescriptionKey, "refused"}}});
     EXPECT_EQ(invoke(unreachable).error, (Error{kIdentityErrorDomain, -1, withReason}));
     transport_.enqueue(unreachable);
     EXPECT_FALSE(xmlInvoke(kURL, "m", Value(), nullptr, nullptr));
