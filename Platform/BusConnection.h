@@ -1,4 +1,5 @@
-// The agent's one bus connection (sd-bus on the event loop). Inside Platform only; main thread.
+// The agent's one bus connection (sd-bus on the event loop). For Platform and, the names, for the programs
+// beside the agent; main thread.
 #pragma once
 
 #include <functional>

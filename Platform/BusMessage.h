@@ -1,5 +1,5 @@
-// Values in bus messages: reading one message's body into a sink, and a sink that appends to a message. Inside Platform
-// only. The wire form is described in MessageService.h.
+// Values in bus messages: reading one message's body into a sink, and a sink that appends to a message. For Platform
+// and the programs beside the agent. The wire form is described in MessageService.h.
 #pragma once
 
 #include <optional>

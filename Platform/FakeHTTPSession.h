@@ -138,8 +138,8 @@ class FakeHTTPTransport {
         }
 
         void deliverResponse(const FakeHTTPAnswer& answer) {
-            for (const auto& [sent, expected] : answer.progress)
-                deliver([&](HTTPSessionEvents& events) { events.uploadProgress(sent, expected); });
+            for (const auto& step : answer.progress)
+                deliver([&](HTTPSessionEvents& events) { events.uploadProgress(step.first, step.second); });
             if (answer.status != 0)
                 deliver([&](HTTPSessionEvents& events) { events.responseHeader(answer.status); });
             for (size_t start = 0; start < answer.body.size(); start += answer.pieceBytes) {

@@ -225,6 +225,9 @@ TEST(PropertyList, RefusesBadTrailers) {
         bad[bad.size() - 32 + at] = value;
         EXPECT_EQ(readBack(bad), "refused") << name;
     }
+    SecretBytes wrapping = listOf({{0xAF, 0x13, 0x20, 0, 0, 0, 0, 0, 0, 0}});
+    wrapping[wrapping.size() - 32 + 7] = 8;
+    EXPECT_EQ(readBack(wrapping), "refused") << "2^61 references of 8 bytes";
     SecretBytes otherFormat = sound;
     otherFormat[7] = '1';
     EXPECT_EQ(readBack(otherFormat), "refused");

@@ -469,8 +469,7 @@ void SQLiteFile::fail(int code, const std::string& what) {
 }
 
 void SQLiteFile::reportTrouble(Activity activity) {
-    if (trouble_[activity] == errorText_) return;
-    // The same trouble of another activity has been logged already.
+    // Logged already, by this activity or by another one with the same trouble.
     const bool known = std::ranges::find(trouble_, errorText_) != trouble_.end();
     trouble_[activity] = errorText_;
     if (known) return;

@@ -318,6 +318,15 @@ TEST_F(SQLiteFileTest, WritesGoToTheFileThatHasTheName) {
     SQLiteFile second(kFormat);
     EXPECT_EQ(get(second, "b"), "new");
     EXPECT_EQ(get(first, "a"), std::nullopt);
+    // The same in the middle of a transaction.
+    int runs = 0;
+    const Outcome outcome = first.write([&](SQLiteTransaction& transaction) {
+        transaction.prepare("REPLACE INTO rows VALUES ('during', x'31')").run();
+        if (++runs == 1) fs::rename(path(), path().string() + ".aside2");
+        return true;
+    });
+    EXPECT_EQ(outcome, Outcome::Done);
+    EXPECT_EQ(get(second, "during"), "1");
     fs::remove_all(directory_.base() / "harbwell");
     EXPECT_EQ(put(first, "c", "newer"), Outcome::Done);
     EXPECT_EQ(get(second, "c"), "newer");
@@ -395,12 +404,23 @@ TEST_F(SQLiteFileTest, TwoProcessesCreateAndChangeItTogether) {
 }
 
 TEST_F(SQLiteFileTest, TwoProcessesMoveADamagedFileAsideOnce) {
-    for (int round = 0; round < 10; ++round) {
+    for (int round = 0; round < 30; ++round) {
         for (const auto& old : fs::directory_iterator(stateDirectory())) fs::remove(old.path());
         TemporaryStateDirectory::writeFile(path(), "not a database, and long enough to be looked at");
+        // Both wait for the other end to close, so that they begin at the same moment.
+        int start[2];
+        ASSERT_EQ(pipe(start), 0);
+        const auto putOne = [&](const char* name, const char* value) {
+            char byte = 0;
+            close(start[1]);
+            return read(start[0], &byte, 1) == 0 &&
+                   put(*new SQLiteFile(kFormat), name, value) == Outcome::Done;
+        };
         {
-            ChildProcess one([] { return put(*new SQLiteFile(kFormat), "one", "1") == Outcome::Done; });
-            ChildProcess two([] { return put(*new SQLiteFile(kFormat), "two", "2") == Outcome::Done; });
+            ChildProcess one([&] { return putOne("one", "1"); });
+            ChildProcess two([&] { return putOne("two", "2"); });
+            close(start[1]);
+            close(start[0]);
             EXPECT_TRUE(one.succeeded() && two.succeeded());
         }
         SQLiteFile file(kFormat);

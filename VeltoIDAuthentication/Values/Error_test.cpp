@@ -1,1 +1,51 @@
-// Error
+#include "Values/Error.h"
+
+#include <gtest/gtest.h>
+
+namespace veltoid {
+namespace {
+
+TEST(Error, SaysWhereItWasMadeAndKeepsTheGivenInformation) {
+    const Error error = makeError(-101, {"reason", nullptr, "suggestion"}, {{"more", "x"}}, "function", nullptr, 7);
+    EXPECT_EQ(error.domain.view(), kIdentityErrorDomain);
+    EXPECT_EQ(error.userInfo, (Dictionary{{"more", "x"},
+                                          {kErrorFailureReasonKey, "reason"},
+                                          {kErrorRecoverySuggestionKey, "suggestion"},
+                                          {"function", "function"},
+                                          {"file", "-"},
+                                          {"line", Value::int64(7)}}));
+}
+
+TEST(Error, SurvivesTheWayThroughADictionaryWithWhatLiesUnderneath) {
+    const Error deepest{"HTTP", 500, {}};
+    const Error fault{String(kXMLErrorDomain), -20101, {{kErrorUnderlyingErrorKey, deepest}}};
+    const Error error = makeError(-100, {}, {{kErrorUnderlyingErrorKey, fault}}, "f", "g", 1);
+    const Dictionary dictionary = errorToDictionary(error);
+    EXPECT_EQ(dictionary.dictionary("UserInfo")->dictionary(kErrorUnderlyingErrorKey)->string("Domain").view(),
+              kXMLErrorDomain);
+    EXPECT_EQ(dictionaryToError(dictionary), error);
+}
+
+TEST(Error, DictionariesOfAnotherShapeAreNone) {
+    EXPECT_EQ(dictionaryToError(Value()), std::nullopt);
+    EXPECT_EQ(dictionaryToError("text"), std::nullopt);
+    EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}}), std::nullopt);
+    EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}, {"Code", "1"}}), std::nullopt);
+    EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}, {"Code", Value::real(1.5)}}), std::nullopt);
+    const auto odd = dictionaryToError(
+        Dictionary{{"Domain", "d"}, {"Code", Value::int32(1)}, {"UserInfo", Dictionary{{kErrorUnderlyingErrorKey, "text"}}}});
+    ASSERT_TRUE(odd);
+    EXPECT_EQ(odd->userInfo.string(kErrorUnderlyingErrorKey), "text") << "what is no error stays as it is";
+}
+
+TEST(Error, EndlessChainsEnd) {
+    Dictionary chain{{"Domain", "d"}, {"Code", Value::int32(0)}};
+    for (int i = 0; i < 1'000; ++i)
+        chain = {{"Domain", "d"}, {"Code", Value::int32(i)}, {"UserInfo", Dictionary{{kErrorUnderlyingErrorKey, chain}}}};
+    const auto error = dictionaryToError(chain);
+    ASSERT_TRUE(error);
+    EXPECT_TRUE(errorToDictionary(*error).contains("UserInfo"));
+}
+
+}  // namespace
+}  // namespace veltoid

@@ -1,4 +1,4 @@
-// Writes XML-RPC method calls (http://xmlrpc.com/spec.md): one line, no white space between tags.
+// Writes XML-RPC method calls (xmlrpc.com): one line, no white space between tags.
 #pragma once
 
 #include <optional>

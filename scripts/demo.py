@@ -1,0 +1,108 @@
+"""The story that scripts/demo tells; the parts come from the end-to-end tests."""
+
+from __future__ import annotations
+
+import os
+import pathlib
+import select
+import shlex
+import signal
+import subprocess
+import sys
+import textwrap
+
+ROOT = pathlib.Path(__file__).resolve().parent.parent
+BUILD = ROOT / "build" / "release"
+os.environ.setdefault("VELTOID_AGENT", str(BUILD / "VeltoIDAuthentication" / "VeltoIDAuthd" / "veltoidauthd"))
+sys.path.insert(0, str(ROOT / "Tests"))
+from harness import ACCOUNT, INTERFACE, OBJECT, PASSWORD, SERVICE, World  # noqa: E402
+
+
+def say(text: str):
+    print("\n" + textwrap.fill(text, 96), flush=True)
+
+
+class Story:
+    def __init__(self, world: World):
+        self.world = world
+
+    def run(self, *command: str, stdin: str | None = None, expected: int = 0, shown: str | None = None) -> str:
+        """Runs a command as a person would, prints what it prints, and insists on its exit status."""
+        print(f"\n    $ {shown or shlex.join(command)}", flush=True)
+        program = str(BUILD / "veltoidctl" / "veltoidctl") if command[0] == "veltoidctl" else command[0]
+        result = subprocess.run([program, *command[1:]], input=stdin, text=True, stdout=subprocess.PIPE,
+                                stderr=subprocess.STDOUT, check=False,
+                                env={**os.environ, "DBUS_SESSION_BUS_ADDRESS": self.world.bus.address})
+        print(textwrap.indent(result.stdout.rstrip(), "    "), flush=True)
+        if result.returncode != expected:
+            sys.exit(f"demo: expected exit status {expected}, got {result.returncode}")
+        return result.stdout
+
+    def insist(self, text: str, *parts: str):
+        for part in parts:
+            if part not in text:
+                sys.exit(f"demo: expected to see {part!r}")
+
+    @staticmethod
+    def end(pid: int):
+        """Ends a process that is not our child, and returns when it is gone."""
+        process = os.pidfd_open(pid)
+        os.kill(pid, signal.SIGTERM)
+        select.select([process], [], [], 15)
+        os.close(process)
+
+    def tell(self):
+        world, url = self.world, self.world.server.url
+        say(f"A message bus of our own is up, and beside it an identity server at {url}: a separate program in Python "
+            "that answers XML-RPC over TLS with a certificate of its own test authority. The agent is not running: the "
+            "bus starts it with the first message. Any D-Bus client will do, here the bus's own tool:")
+        self.run("busctl", f"--address={world.bus.address}", "call", SERVICE, OBJECT, INTERFACE, "Send", "a{sv}", "1",
+                 "command", "x", "1", shown=f"busctl --user call {SERVICE} {OBJECT} {INTERFACE} Send 'a{{sv}}' 1 command x 1")
+
+        say("That was a ping. Now an account. The password is hashed by the client, so the agent never sees it; the agent "
+            "puts the hash into its keychain, signs in, and learns the account's directory identifier (encDsId).")
+        added = self.run("veltoidctl", "add", ACCOUNT, "--password-stdin", stdin=PASSWORD + "\n",
+                         shown=f"echo {PASSWORD!r} | veltoidctl add {ACCOUNT} --password-stdin")
+        self.insist(added, "signed in as")
+        details = self.run("veltoidctl", "info", ACCOUNT)
+        self.insist(details, "Jane", "Roe", ACCOUNT, "jane@roe.example", "encDsId")
+        self.insist(self.run("veltoidctl", "status"), "NoCertificate", "next action")
+        counts = world.server.counts()
+        sent = world.server.received()[0]["parameters"]["pwdHash"]
+        say(f"The server has seen {counts['authenticate']} sign-ins and {counts['getMyInfo']} requests for details. It was "
+            f"sent the hash {sent[:12]}..., never the password.")
+
+        say("The agent is now ended, as it would be at log-out, and started again by the next message. Account, details "
+            "and password are still there: the refresh signs in with the stored hash.")
+        before = world.agent_pid()
+        self.end(before)
+        self.insist(self.run("veltoidctl", "list"), ACCOUNT)
+        self.insist(self.run("veltoidctl", "info", ACCOUNT, "--refresh"), "Jane", "Roe")
+        after = world.agent_pid()
+        if before == after:
+            sys.exit("demo: the agent was not restarted")
+        print(f"\n    (process {before} before, {after} now)")
+
+        say("A wrong password is refused by the server, and told apart from a server that cannot be reached. The server "
+            "has spoken against the account, so the stored password goes too: the account needs its owner.")
+        refused = self.run("veltoidctl", "verify", ACCOUNT, "--password-stdin", stdin="wrong horse\n", expected=1,
+                           shown=f"echo 'wrong horse' | veltoidctl verify {ACCOUNT} --password-stdin")
+        self.insist(refused, "-101")
+        self.insist(self.run("veltoidctl", "status"), "PasswordInvalid")
+
+        say("Finally the account is forgotten, with its password item and everything known of it.")
+        self.run("veltoidctl", "forget", ACCOUNT)
+        self.insist(self.run("veltoidctl", "list"), "no accounts")
+        files = sorted(file.name for file in world.state_files().iterdir())
+        say(f"All of it lived in a temporary folder ({', '.join(files)}), which is removed now together with the bus, the "
+            "server and the agent.")
+
+
+def main():
+    with World() as world:
+        Story(world).tell()
+    print("\ndemo: done", flush=True)
+
+
+if __name__ == "__main__":
+    main()

@@ -1,0 +1,41 @@
+// A client's connection to the agent: one dictionary request, one dictionary reply.
+#pragma once
+
+#include <nlohmann/json.hpp>
+#include <stdexcept>
+#include <string>
+
+#include "Platform/ValueSink.h"
+
+struct sd_bus;
+
+namespace veltoidctl {
+
+/// Insertion order is the agent's own.
+using Json = nlohmann::ordered_json;
+
+/// The agent could not be reached or did not answer in time.
+class Unreachable : public std::runtime_error {
+  public:
+    using std::runtime_error::runtime_error;
+};
+
+class AgentConnection {
+  public:
+    /// Throws Unreachable when there is no bus.
+    AgentConnection(std::string service, double timeoutSeconds);
+    ~AgentConnection();
+    AgentConnection(const AgentConnection&) = delete;
+    AgentConnection& operator=(const AgentConnection&) = delete;
+
+    /// Sends what `writer` writes (one dictionary) and returns the reply: dates as ISO 8601 text at UTC, data as base64
+    /// text. The request's memory is wiped. Throws Unreachable.
+    Json send(const platform::ValueWriter& writer);
+
+  private:
+    std::string service_;
+    double timeoutSeconds_;
+    sd_bus* bus_ = nullptr;
+};
+
+}  // namespace veltoidctl

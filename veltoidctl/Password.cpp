@@ -1,0 +1,93 @@
+#include "veltoidctl/Password.h"
+
+#include <fcntl.h>
+#include <termios.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <stdexcept>
+
+#include "Platform/Crypto.h"
+
+namespace veltoidctl {
+namespace {
+
+constexpr size_t kMaxPasswordBytes = 4'096;
+
+/// Reads up to the line's end, byte by byte: what follows belongs to somebody else. No buffer but this one sees it.
+platform::SecretText readLine(int descriptor) {
+    platform::SecretText line;
+    line.reserve(kMaxPasswordBytes);
+    for (char c = 0;;) {
+        const ssize_t count = read(descriptor, &c, 1);
+        if (count < 0 && errno == EINTR) continue;
+        if (count < 0) throw std::runtime_error(std::string("reading the password: ") + strerror(errno));
+        if (count == 0 || c == '\n') break;
+        if (line.size() == kMaxPasswordBytes) throw std::runtime_error("the password is too long");
+        line += c;
+    }
+    if (!line.empty() && line.back() == '\r') line.pop_back();
+    if (line.empty()) throw std::runtime_error("there is no password");
+    return line;
+}
+
+/// The terminal without echo for as long as this exists.
+class QuietTerminal {
+  public:
+    QuietTerminal() : descriptor_(open("/dev/tty", O_RDWR | O_CLOEXEC)) {
+        if (descriptor_ < 0 || tcgetattr(descriptor_, &before_) != 0)
+            throw std::runtime_error("there is no terminal to ask at; use --password-stdin");
+        termios quiet = before_;
+        quiet.c_lflag &= ~static_cast<tcflag_t>(ECHO);
+        tcsetattr(descriptor_, TCSAFLUSH, &quiet);
+    }
+    ~QuietTerminal() {
+        tcsetattr(descriptor_, TCSAFLUSH, &before_);
+        say("\n");
+        close(descriptor_);
+    }
+    QuietTerminal(const QuietTerminal&) = delete;
+    QuietTerminal& operator=(const QuietTerminal&) = delete;
+
+    void say(const std::string& text) const {
+        [[maybe_unused]] const ssize_t written = write(descriptor_, text.data(), text.size());
+    }
+    int descriptor() const { return descriptor_; }
+
+  private:
+    int descriptor_;
+    termios before_{};
+};
+
+platform::SecretText promptFor(const std::string& account) {
+    const QuietTerminal terminal;
+    terminal.say("Password for " + account + ": ");
+    return readLine(terminal.descriptor());
+}
+
+platform::SecretText hashOf(const platform::SecretText& password) {
+    constexpr char kDigits[] = "0123456789abcdef";
+    platform::SHA256Digest digest = platform::sha256(platform::bytesOf(password));
+    platform::SecretText text;
+    text.reserve(2 * digest.size());
+    for (const uint8_t byte : digest) {
+        text += kDigits[byte >> 4U];
+        text += kDigits[byte & 15U];
+    }
+    platform::wipe(digest.data(), digest.size());
+    return text;
+}
+
+}  // namespace
+
+platform::SecretText readPasswordHash(PasswordSource source, const std::string& account) {
+    switch (source) {
+        case PasswordSource::HashedStandardInput: return readLine(STDIN_FILENO);
+        case PasswordSource::StandardInput: return hashOf(readLine(STDIN_FILENO));
+        case PasswordSource::Prompt: break;
+    }
+    return hashOf(promptFor(account));
+}
+
+}  // namespace veltoidctl

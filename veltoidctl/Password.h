@@ -1,0 +1,23 @@
+// Passwords on their way from a person to the agent.
+#pragma once
+
+#include <string>
+
+#include "Platform/SecureMemory.h"
+
+namespace veltoidctl {
+
+enum class PasswordSource {
+    /// Asked for at the terminal, without echo.
+    Prompt,
+    /// The first line of standard input.
+    StandardInput,
+    /// The first line of standard input, which is a hash already.
+    HashedStandardInput,
+};
+
+/// The password hash to send: lower-case hexadecimal SHA-256 of the UTF-8 password. Everything read is wiped. Throws
+/// std::runtime_error when there is no terminal to ask at, or no line.
+platform::SecretText readPasswordHash(PasswordSource source, const std::string& account);
+
+}  // namespace veltoidctl
