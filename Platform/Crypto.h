@@ -25,7 +25,8 @@ UUIDBytes randomUUID();
 /// 36 characters, upper-case hexadecimal, hyphens after the 8th, 12th, 16th and 20th digit.
 std::string canonicalUUIDText(const UUIDBytes& uuid);
 
-/// AES-256-GCM with a fresh random nonce: nonce (12 bytes), ciphertext, tag (16 bytes). `key` holds kSealingKeyBytes.
+/// AES-256-GCM with a fresh random nonce: nonce (12 bytes), ciphertext, tag (16 bytes). `key` holds
+/// kSealingKeyBytes.
 SecretBytes seal(Bytes key, Bytes additionalData, Bytes plain);
 
 /// None when key, additional data or sealed bytes are not the ones that were sealed together.

@@ -100,9 +100,13 @@ class BusPeer : public PeerConnection {
         if (!atOnce || !queue_.tryRunNow(task)) queue_.async(task);
     }
 
-    /// Calls `gone` when the bus says that the name has left it.
-    void watch(sd_bus* bus, const char* name, sd_bus_track_handler_t gone, void* context) {
-        if (sd_bus_track_new(bus, &track_, gone, context) >= 0) sd_bus_track_add_name(track_, name);
+    /// Calls `gone`, possibly more than once, when the bus says that the name has left it. The context lives as long
+    /// as this peer.
+    template <typename Context>
+    void watch(sd_bus* bus, sd_bus_track_handler_t gone, std::shared_ptr<Context> context) {
+        watchContext_ = context;
+        if (sd_bus_track_new(bus, &track_, gone, context.get()) >= 0)
+            sd_bus_track_add_name(track_, context->name.c_str());
     }
 
   private:
@@ -113,6 +117,7 @@ class BusPeer : public PeerConnection {
     std::function<bool(IncomingMessage&)> answeredAtOnce_;
     std::vector<PeerEvent> waiting_;
     bool resumed_ = false;
+    std::shared_ptr<void> watchContext_;
     sd_bus_track* track_ = nullptr;
 };
 
@@ -220,15 +225,15 @@ class BusListener : public Listener {
     void watchPeer(const std::string& name) {
         const auto peer = peers_.find(name);
         if (peer == peers_.end()) return;
-        peer->second->watch(bus::connection(), name.c_str(), peerGone, new Watch{this, name});
+        peer->second->watch(bus::connection(), peerGone, std::make_shared<Watch>(Watch{this, name}));
     }
 
     static int peerGone(sd_bus_track* /*track*/, void* context) {
-        const std::unique_ptr<Watch> watch(static_cast<Watch*>(context));
+        const auto* watch = static_cast<const Watch*>(context);
         const auto node = watch->listener->peers_.extract(watch->name);
         if (!node) return 0;
         node.mapped()->deliver(ConnectionError::Invalid);
-        // The track that calls this belongs to the peer and must outlive the call.
+        // The track that calls this, and the context, belong to the peer and must outlive the call.
         WorkQueue::main().async([peer = node.mapped()] {});
         return 0;
     }

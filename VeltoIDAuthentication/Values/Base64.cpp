@@ -174,13 +174,14 @@ String base64Encode(const Data& data, std::string_view prefix, std::string_view 
     const size_t bodySize = encodedSize(data.size());
     const size_t linesSize = brokenSize(data.size(), lineLength, kLineFeed);
     const bool endsFullLine = lineLength != 0 && bodySize != 0 && bodySize % lineLength == 0;
-    platform::SecretText text(prefix.size() + linesSize + (endsFullLine ? 1 : 0) + suffix.size(), '\0');
-    char* out = std::copy(prefix.begin(), prefix.end(), text.data());
-    writeBroken(data.bytes(), lineLength, kLineFeed, out);
-    out += linesSize;
-    if (endsFullLine) *out++ = '\n';
-    std::copy(suffix.begin(), suffix.end(), out);
-    return String(std::string_view(text));
+    const size_t size = prefix.size() + linesSize + (endsFullLine ? 1 : 0) + suffix.size();
+    return String::writtenBy(size, [&](char* out) {
+        out = std::copy(prefix.begin(), prefix.end(), out);
+        writeBroken(data.bytes(), lineLength, kLineFeed, out);
+        out += linesSize;
+        if (endsFullLine) *out++ = '\n';
+        std::copy(suffix.begin(), suffix.end(), out);
+    });
 }
 
 Data base64Decode(const String& text) {
@@ -213,9 +214,10 @@ void appendXMLRPCBase64(platform::SecretText& text, platform::Bytes bytes, bool 
 }
 
 String xmlrpcBase64Encode(platform::Bytes bytes, bool separateLines) {
-    platform::SecretText text;
-    appendXMLRPCBase64(text, bytes, separateLines);
-    return String(std::string_view(text));
+    const size_t lineLength = separateLines ? kXMLRPCLineLength : 0;
+    return String::writtenBy(brokenSize(bytes.size(), lineLength, kXMLRPCLineBreak), [=](char* out) {
+        writeBroken(bytes, lineLength, kXMLRPCLineBreak, out);
+    });
 }
 
 Data xmlrpcBase64Decode(std::string_view text) {

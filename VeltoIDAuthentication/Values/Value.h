@@ -100,6 +100,15 @@ class String {
     String(const std::string& utf8) : String(std::string_view(utf8)) {}
     String(std::nullptr_t) {}
 
+    /// New text of `size` bytes, all of which `write(char*)` writes.
+    template <typename Write>
+    static String writtenBy(size_t size, Write&& write) {
+        String result;
+        result.node_ = detail::Handle<detail::BytesNode>(detail::BytesNode::create(size));
+        write(reinterpret_cast<char*>(result.node_->bytes()));
+        return result;
+    }
+
     explicit operator bool() const { return static_cast<bool>(node_); }
     /// Empty when null.
     std::string_view view() const;
