@@ -1,11 +1,127 @@
 #include "Platform/CurlExchange.h"
 
+#include <curl/curl.h>
+#include <dlfcn.h>
+#include <openssl/crypto.h>
+
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <string>
+
+#include "Platform/SystemLog.h"
 
 namespace platform {
 namespace {
+
+// --- The library
+
+/// The functions of libcurl that are in use, found in the library at run time.
+struct CurlLibrary {
+    decltype(&::curl_global_init) globalInit = nullptr;
+    decltype(&::curl_easy_init) easyInit = nullptr;
+    decltype(&::curl_easy_cleanup) easyCleanup = nullptr;
+    decltype(&::curl_easy_setopt) easySetopt = nullptr;
+    decltype(&::curl_easy_getinfo) easyGetinfo = nullptr;
+    decltype(&::curl_easy_strerror) easyStrerror = nullptr;
+    decltype(&::curl_slist_append) slistAppend = nullptr;
+    decltype(&::curl_slist_free_all) slistFreeAll = nullptr;
+    decltype(&::curl_multi_init) multiInit = nullptr;
+    decltype(&::curl_multi_cleanup) multiCleanup = nullptr;
+    decltype(&::curl_multi_add_handle) multiAddHandle = nullptr;
+    decltype(&::curl_multi_remove_handle) multiRemoveHandle = nullptr;
+    decltype(&::curl_multi_perform) multiPerform = nullptr;
+    decltype(&::curl_multi_poll) multiPoll = nullptr;
+    decltype(&::curl_multi_wakeup) multiWakeup = nullptr;
+    decltype(&::curl_multi_info_read) multiInfoRead = nullptr;
+
+    decltype(&::curl_url) url = nullptr;
+    decltype(&::curl_url_cleanup) urlCleanup = nullptr;
+    decltype(&::curl_url_set) urlSet = nullptr;
+    decltype(&::curl_url_get) urlGet = nullptr;
+    decltype(&::curl_free) free = nullptr;
+
+    /// Loaded and initialised on the first call and kept for the life of the process; null when the library
+    /// or one of the functions is missing. Any thread.
+    static const CurlLibrary* shared();
+};
+
+constexpr const char* kLibraryName = "libcurl.so.4";
+
+/// Looks functions up until one is missing.
+class SymbolReader {
+  public:
+    explicit SymbolReader(void* library) : library_(library) {}
+
+    template <typename Function>
+    void find(Function& function, const char* name) {
+        function = reinterpret_cast<Function>(dlsym(library_, name));
+        if (function == nullptr && missing_ == nullptr) missing_ = name;
+    }
+
+    const char* missing() const { return missing_; }
+
+  private:
+    void* library_;
+    const char* missing_ = nullptr;
+};
+
+const char* findAll(void* library, CurlLibrary& curl) {
+    SymbolReader symbols(library);
+    symbols.find(curl.globalInit, "curl_global_init");
+    symbols.find(curl.easyInit, "curl_easy_init");
+    symbols.find(curl.easyCleanup, "curl_easy_cleanup");
+    symbols.find(curl.easySetopt, "curl_easy_setopt");
+    symbols.find(curl.easyGetinfo, "curl_easy_getinfo");
+    symbols.find(curl.easyStrerror, "curl_easy_strerror");
+    symbols.find(curl.slistAppend, "curl_slist_append");
+    symbols.find(curl.slistFreeAll, "curl_slist_free_all");
+    symbols.find(curl.multiInit, "curl_multi_init");
+    symbols.find(curl.multiCleanup, "curl_multi_cleanup");
+    symbols.find(curl.multiAddHandle, "curl_multi_add_handle");
+    symbols.find(curl.multiRemoveHandle, "curl_multi_remove_handle");
+    symbols.find(curl.multiPerform, "curl_multi_perform");
+    symbols.find(curl.multiPoll, "curl_multi_poll");
+    symbols.find(curl.multiWakeup, "curl_multi_wakeup");
+    symbols.find(curl.multiInfoRead, "curl_multi_info_read");
+    symbols.find(curl.url, "curl_url");
+    symbols.find(curl.urlCleanup, "curl_url_cleanup");
+    symbols.find(curl.urlSet, "curl_url_set");
+    symbols.find(curl.urlGet, "curl_url_get");
+    symbols.find(curl.free, "curl_free");
+    return symbols.missing();
+}
+
+const CurlLibrary* load() {
+    // Never closed: its threads and TLS state live as long as the process.
+    void* library = dlopen(kLibraryName, RTLD_NOW | RTLD_LOCAL);
+    if (library == nullptr) {
+        const char* reason = dlerror();  // NOLINT(concurrency-mt-unsafe): thread-local in glibc
+        VELTOID_PLATFORM_LOG(Error,
+                             std::string("cannot load the HTTPS client library: ") + (reason ? reason : "?"));
+        return nullptr;
+    }
+    static CurlLibrary curl;
+    if (const char* missing = findAll(library, curl)) {
+        VELTOID_PLATFORM_LOG(Error, std::string(kLibraryName) + " lacks " + missing);
+        return nullptr;
+    }
+    // An exchange may be under way when the process exits: OpenSSL, which the library is built on, must not
+    // take its tables down underneath it. Only the first caller of OpenSSL in a process can choose that.
+    OPENSSL_init_crypto(OPENSSL_INIT_NO_ATEXIT, nullptr);
+    if (curl.globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
+        VELTOID_PLATFORM_LOG(Error, "cannot initialise the HTTPS client library");
+        return nullptr;
+    }
+    return &curl;
+}
+
+const CurlLibrary* CurlLibrary::shared() {
+    static const CurlLibrary* const curl = load();
+    return curl;
+}
+
+// --- The exchange
 
 /// No exchange goes on longer, even if its owner has forgotten it.
 constexpr long kLongestExchangeSeconds = 60;
@@ -36,7 +152,74 @@ bool isFieldValue(std::string_view value) {
 
 }  // namespace
 
-CurlExchange::CurlExchange(const CurlLibrary& curl, const HTTPRequest& request, HTTPSessionEvents& events)
+/// The exchange itself, in the library's terms.
+class CurlExchange::Transfer {
+  public:
+    /// Request and events must outlive the exchange.
+    Transfer(const CurlLibrary& curl, const HTTPRequest& request, HTTPSessionEvents& events);
+    Transfer(const Transfer&) = delete;
+    Transfer& operator=(const Transfer&) = delete;
+
+    /// Runs until the exchange has ended or `cancelled` is set, telling the events everything but the
+    /// completion. None when the response arrived whole, whatever its status.
+    std::optional<HTTPError> run(const std::atomic<bool>& cancelled);
+
+    /// Makes `run` look at `cancelled`. Any thread.
+    void wakeUp();
+
+  private:
+    struct EasyDeleter {
+        const CurlLibrary* curl;
+        void operator()(CURL* handle) const { curl->easyCleanup(handle); }
+    };
+    struct MultiDeleter {
+        const CurlLibrary* curl;
+        void operator()(CURLM* handle) const { curl->multiCleanup(handle); }
+    };
+    struct ListDeleter {
+        const CurlLibrary* curl;
+        void operator()(curl_slist* list) const { curl->slistFreeAll(list); }
+    };
+
+    template <typename Value>
+    void set(CURLoption option, Value value);
+    template <typename Deliver>
+    bool delivered(Deliver deliver) noexcept;
+
+    void setTransportOptions();
+    void setTrustAnchors();
+    void setCallbacks();
+    void setRequest(const HTTPRequest& request);
+    void addHeaderField(std::string_view name, std::string_view value);
+
+    bool drive(const std::atomic<bool>& cancelled);
+    std::optional<HTTPError> outcome();
+    HTTPError errorOf(CURLcode code) const;
+    ProtectionSpace protectionSpace() const;
+
+    // The library's callbacks.
+    static CURLcode onTLSContext(CURL*, void* context, void* exchange) noexcept;
+    static size_t onHeader(char* line, size_t size, size_t count, void* exchange) noexcept;
+    static size_t onBody(char* bytes, size_t size, size_t count, void* exchange) noexcept;
+    static int onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
+                          curl_off_t sent) noexcept;
+
+    const CurlLibrary& curl_;
+    HTTPSessionEvents& events_;
+    const std::string& url_;
+    std::unique_ptr<curl_slist, ListDeleter> headerFields_;
+    std::unique_ptr<CURL, EasyDeleter> easy_;
+    std::unique_ptr<CURLM, MultiDeleter> multi_;
+    /// The first thing that went wrong on this side of the library.
+    CURLcode failure_ = CURLE_OK;
+    bool wasChallenged_ = false;
+    bool hasHeader_ = false;
+    size_t bodyBytes_ = 0;
+    curl_off_t reportedSent_ = 0;
+};
+
+CurlExchange::Transfer::Transfer(const CurlLibrary& curl, const HTTPRequest& request,
+                                 HTTPSessionEvents& events)
     : curl_(curl),
       events_(events),
       url_(request.url),
@@ -54,12 +237,12 @@ CurlExchange::CurlExchange(const CurlLibrary& curl, const HTTPRequest& request, 
 }
 
 template <typename Value>
-void CurlExchange::set(CURLoption option, Value value) {
+void CurlExchange::Transfer::set(CURLoption option, Value value) {
     const CURLcode code = curl_.easySetopt(easy_.get(), option, value);
     if (failure_ == CURLE_OK) failure_ = code;
 }
 
-void CurlExchange::setTransportOptions() {
+void CurlExchange::Transfer::setTransportOptions() {
     set(CURLOPT_PROTOCOLS_STR, "https");
     set(CURLOPT_FOLLOWLOCATION, 0L);
     set(CURLOPT_SSLVERSION, static_cast<long>(CURL_SSLVERSION_TLSv1_2));
@@ -81,7 +264,7 @@ void CurlExchange::setTransportOptions() {
     set(CURLOPT_SUPPRESS_CONNECT_HEADERS, 1L);
 }
 
-void CurlExchange::setTrustAnchors() {
+void CurlExchange::Transfer::setTrustAnchors() {
     // The directory is looked up by hash when a chain is checked, while the bundle that the library is built
     // with would be parsed as a whole for every exchange.
     const char* file =
@@ -91,19 +274,19 @@ void CurlExchange::setTrustAnchors() {
     set(CURLOPT_CAPATH, hasFile ? static_cast<const char*>(nullptr) : kCertificateDirectory);
 }
 
-void CurlExchange::setCallbacks() {
-    set(CURLOPT_SSL_CTX_FUNCTION, &CurlExchange::onTLSContext);
+void CurlExchange::Transfer::setCallbacks() {
+    set(CURLOPT_SSL_CTX_FUNCTION, &CurlExchange::Transfer::onTLSContext);
     set(CURLOPT_SSL_CTX_DATA, this);
-    set(CURLOPT_HEADERFUNCTION, &CurlExchange::onHeader);
+    set(CURLOPT_HEADERFUNCTION, &CurlExchange::Transfer::onHeader);
     set(CURLOPT_HEADERDATA, this);
-    set(CURLOPT_WRITEFUNCTION, &CurlExchange::onBody);
+    set(CURLOPT_WRITEFUNCTION, &CurlExchange::Transfer::onBody);
     set(CURLOPT_WRITEDATA, this);
-    set(CURLOPT_XFERINFOFUNCTION, &CurlExchange::onProgress);
+    set(CURLOPT_XFERINFOFUNCTION, &CurlExchange::Transfer::onProgress);
     set(CURLOPT_XFERINFODATA, this);
     set(CURLOPT_NOPROGRESS, 0L);
 }
 
-void CurlExchange::setRequest(const HTTPRequest& request) {
+void CurlExchange::Transfer::setRequest(const HTTPRequest& request) {
     set(CURLOPT_URL, request.url.c_str());
     if (request.method != "GET" || !request.body.empty()) {
         set(CURLOPT_POST, 1L);
@@ -121,7 +304,7 @@ void CurlExchange::setRequest(const HTTPRequest& request) {
     set(CURLOPT_HTTPHEADER, headerFields_.get());
 }
 
-void CurlExchange::addHeaderField(std::string_view name, std::string_view value) {
+void CurlExchange::Transfer::addHeaderField(std::string_view name, std::string_view value) {
     if (!isFieldName(name) || !isFieldValue(value)) {
         if (failure_ == CURLE_OK) failure_ = CURLE_BAD_FUNCTION_ARGUMENT;
         return;
@@ -131,7 +314,7 @@ void CurlExchange::addHeaderField(std::string_view name, std::string_view value)
     headerFields_.reset(curl_.slistAppend(headerFields_.release(), line.c_str()));
 }
 
-std::optional<HTTPError> CurlExchange::run(const std::atomic<bool>& cancelled) {
+std::optional<HTTPError> CurlExchange::Transfer::run(const std::atomic<bool>& cancelled) {
     if (failure_ != CURLE_OK) return errorOf(failure_);
     if (curl_.multiAddHandle(multi_.get(), easy_.get()) != CURLM_OK) return errorOf(CURLE_FAILED_INIT);
     const bool ended = drive(cancelled);
@@ -140,7 +323,7 @@ std::optional<HTTPError> CurlExchange::run(const std::atomic<bool>& cancelled) {
     return error;
 }
 
-bool CurlExchange::drive(const std::atomic<bool>& cancelled) {
+bool CurlExchange::Transfer::drive(const std::atomic<bool>& cancelled) {
     while (!cancelled) {
         int running = 0;
         if (curl_.multiPerform(multi_.get(), &running) != CURLM_OK) return false;
@@ -150,7 +333,7 @@ bool CurlExchange::drive(const std::atomic<bool>& cancelled) {
     return false;
 }
 
-std::optional<HTTPError> CurlExchange::outcome() {
+std::optional<HTTPError> CurlExchange::Transfer::outcome() {
     int left = 0;
     const CURLMsg* message = curl_.multiInfoRead(multi_.get(), &left);
     const CURLcode code =
@@ -160,13 +343,13 @@ std::optional<HTTPError> CurlExchange::outcome() {
     return errorOf(failure_ != CURLE_OK ? failure_ : code);
 }
 
-void CurlExchange::wakeUp() {
+void CurlExchange::Transfer::wakeUp() {
     if (multi_) curl_.multiWakeup(multi_.get());
 }
 
-HTTPError CurlExchange::errorOf(CURLcode code) const { return {code, curl_.easyStrerror(code)}; }
+HTTPError CurlExchange::Transfer::errorOf(CURLcode code) const { return {code, curl_.easyStrerror(code)}; }
 
-ProtectionSpace CurlExchange::protectionSpace() const {
+ProtectionSpace CurlExchange::Transfer::protectionSpace() const {
     ProtectionSpace space{{}, 0, "ServerTrust"};
     CURLU* url = curl_.url();
     char* part = nullptr;
@@ -186,7 +369,7 @@ ProtectionSpace CurlExchange::protectionSpace() const {
 
 /// Whether the receiver took the event: nothing may be thrown through the library's frames.
 template <typename Deliver>
-bool CurlExchange::delivered(Deliver deliver) noexcept {
+bool CurlExchange::Transfer::delivered(Deliver deliver) noexcept {
     try {
         deliver(events_);
         return true;
@@ -197,8 +380,8 @@ bool CurlExchange::delivered(Deliver deliver) noexcept {
 }
 
 /// The TLS session is about to begin. Whatever the answer, the server's certificate is verified.
-CURLcode CurlExchange::onTLSContext(CURL*, void*, void* exchange) noexcept {
-    auto& self = *static_cast<CurlExchange*>(exchange);
+CURLcode CurlExchange::Transfer::onTLSContext(CURL*, void*, void* exchange) noexcept {
+    auto& self = *static_cast<Transfer*>(exchange);
     if (std::exchange(self.wasChallenged_, true)) return CURLE_OK;
     ChallengeAnswer answer = ChallengeAnswer::Cancel;
     self.delivered([&](HTTPSessionEvents& events) { answer = events.challenge(self.protectionSpace()); });
@@ -208,8 +391,8 @@ CURLcode CurlExchange::onTLSContext(CURL*, void*, void* exchange) noexcept {
 }
 
 /// Called for every line of every header; the empty line that ends the final one is the event.
-size_t CurlExchange::onHeader(char* line, size_t size, size_t count, void* exchange) noexcept {
-    auto& self = *static_cast<CurlExchange*>(exchange);
+size_t CurlExchange::Transfer::onHeader(char* line, size_t size, size_t count, void* exchange) noexcept {
+    auto& self = *static_cast<Transfer*>(exchange);
     const std::string_view text(line, size * count);
     if (self.hasHeader_ || text.find_first_not_of("\r\n") != std::string_view::npos) return text.size();
     long status = 0;
@@ -221,8 +404,8 @@ size_t CurlExchange::onHeader(char* line, size_t size, size_t count, void* excha
     return taken ? text.size() : 0;
 }
 
-size_t CurlExchange::onBody(char* bytes, size_t size, size_t count, void* exchange) noexcept {
-    auto& self = *static_cast<CurlExchange*>(exchange);
+size_t CurlExchange::Transfer::onBody(char* bytes, size_t size, size_t count, void* exchange) noexcept {
+    auto& self = *static_cast<Transfer*>(exchange);
     const std::string_view piece(bytes, size * count);
     self.bodyBytes_ += piece.size();
     if (self.bodyBytes_ > kMaxHTTPResponseBytes) {
@@ -233,9 +416,9 @@ size_t CurlExchange::onBody(char* bytes, size_t size, size_t count, void* exchan
                                                                                                 : 0;
 }
 
-int CurlExchange::onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
-                             curl_off_t sent) noexcept {
-    auto& self = *static_cast<CurlExchange*>(exchange);
+int CurlExchange::Transfer::onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
+                                       curl_off_t sent) noexcept {
+    auto& self = *static_cast<Transfer*>(exchange);
     if (sent <= self.reportedSent_) return 0;
     self.reportedSent_ = sent;
     const bool taken = self.delivered([=](HTTPSessionEvents& events) {
@@ -243,5 +426,20 @@ int CurlExchange::onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t 
     });
     return taken ? 0 : 1;
 }
+
+// --- What the rest of the HTTPS client sees
+
+bool CurlExchange::isLibraryAvailable() { return CurlLibrary::shared() != nullptr; }
+
+CurlExchange::CurlExchange(const HTTPRequest& request, HTTPSessionEvents& events)
+    : transfer_(std::make_unique<Transfer>(*CurlLibrary::shared(), request, events)) {}
+
+CurlExchange::~CurlExchange() = default;
+
+std::optional<HTTPError> CurlExchange::run(const std::atomic<bool>& cancelled) {
+    return transfer_->run(cancelled);
+}
+
+void CurlExchange::wakeUp() { transfer_->wakeUp(); }
 
 }  // namespace platform

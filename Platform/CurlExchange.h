@@ -4,8 +4,8 @@
 
 #include <atomic>
 #include <memory>
+#include <optional>
 
-#include "Platform/CurlLibrary.h"
 #include "Platform/HTTPSession.h"
 
 namespace platform {
@@ -13,8 +13,13 @@ namespace platform {
 /// Made, run and destroyed on one thread, except for wakeUp.
 class CurlExchange {
   public:
-    /// Request and events must outlive the exchange.
-    CurlExchange(const CurlLibrary& curl, const HTTPRequest& request, HTTPSessionEvents& events);
+    /// Whether the library and all the functions that are in use could be loaded; the first call loads it,
+    /// for the life of the process. Any thread.
+    static bool isLibraryAvailable();
+
+    /// Only when the library is available. Request and events must outlive the exchange.
+    CurlExchange(const HTTPRequest& request, HTTPSessionEvents& events);
+    ~CurlExchange();
     CurlExchange(const CurlExchange&) = delete;
     CurlExchange& operator=(const CurlExchange&) = delete;
 
@@ -26,54 +31,8 @@ class CurlExchange {
     void wakeUp();
 
   private:
-    struct EasyDeleter {
-        const CurlLibrary* curl;
-        void operator()(CURL* handle) const { curl->easyCleanup(handle); }
-    };
-    struct MultiDeleter {
-        const CurlLibrary* curl;
-        void operator()(CURLM* handle) const { curl->multiCleanup(handle); }
-    };
-    struct ListDeleter {
-        const CurlLibrary* curl;
-        void operator()(curl_slist* list) const { curl->slistFreeAll(list); }
-    };
-
-    template <typename Value>
-    void set(CURLoption option, Value value);
-    template <typename Deliver>
-    bool delivered(Deliver deliver) noexcept;
-
-    void setTransportOptions();
-    void setTrustAnchors();
-    void setCallbacks();
-    void setRequest(const HTTPRequest& request);
-    void addHeaderField(std::string_view name, std::string_view value);
-
-    bool drive(const std::atomic<bool>& cancelled);
-    std::optional<HTTPError> outcome();
-    HTTPError errorOf(CURLcode code) const;
-    ProtectionSpace protectionSpace() const;
-
-    // The library's callbacks.
-    static CURLcode onTLSContext(CURL*, void* context, void* exchange) noexcept;
-    static size_t onHeader(char* line, size_t size, size_t count, void* exchange) noexcept;
-    static size_t onBody(char* bytes, size_t size, size_t count, void* exchange) noexcept;
-    static int onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
-                          curl_off_t sent) noexcept;
-
-    const CurlLibrary& curl_;
-    HTTPSessionEvents& events_;
-    const std::string& url_;
-    std::unique_ptr<curl_slist, ListDeleter> headerFields_;
-    std::unique_ptr<CURL, EasyDeleter> easy_;
-    std::unique_ptr<CURLM, MultiDeleter> multi_;
-    /// The first thing that went wrong on this side of the library.
-    CURLcode failure_ = CURLE_OK;
-    bool wasChallenged_ = false;
-    bool hasHeader_ = false;
-    size_t bodyBytes_ = 0;
-    curl_off_t reportedSent_ = 0;
+    class Transfer;
+    std::unique_ptr<Transfer> transfer_;
 };
 
 }  // namespace platform

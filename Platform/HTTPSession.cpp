@@ -17,9 +17,8 @@ class CurlSession : public HTTPSession,
                     private HTTPSessionEvents,
                     public std::enable_shared_from_this<CurlSession> {
   public:
-    CurlSession(const CurlLibrary& curl, std::shared_ptr<HTTPSessionEvents> events,
-                std::optional<WorkQueue> eventQueue)
-        : curl_(curl), eventQueue_(std::move(eventQueue)), events_(std::move(events)) {}
+    CurlSession(std::shared_ptr<HTTPSessionEvents> events, std::optional<WorkQueue> eventQueue)
+        : eventQueue_(std::move(eventQueue)), events_(std::move(events)) {}
 
     void start(HTTPRequest request) override {
         {
@@ -42,7 +41,7 @@ class CurlSession : public HTTPSession,
 
   private:
     void run(const HTTPRequest& request) {
-        CurlExchange exchange(curl_, request, *this);
+        CurlExchange exchange(request, *this);
         setExchange(&exchange);
         const std::optional<HTTPError> error = exchange.run(cancelled_);
         setExchange(nullptr);
@@ -108,7 +107,6 @@ class CurlSession : public HTTPSession,
         });
     }
 
-    const CurlLibrary& curl_;
     const WorkQueue queue_{"http"};
     const std::optional<WorkQueue> eventQueue_;
     std::atomic<bool> cancelled_ = false;
@@ -159,9 +157,8 @@ std::shared_ptr<HTTPSession> HTTPSession::create(std::shared_ptr<HTTPSessionEven
         factory = replacedFactory().factory;
     }
     if (factory) return factory(std::move(events), std::move(eventQueue));
-    const CurlLibrary* curl = CurlLibrary::shared();
-    if (curl == nullptr) return nullptr;
-    return std::make_shared<CurlSession>(*curl, std::move(events), std::move(eventQueue));
+    if (!CurlExchange::isLibraryAvailable()) return nullptr;
+    return std::make_shared<CurlSession>(std::move(events), std::move(eventQueue));
 }
 
 void HTTPSession::replaceFactory(Factory factory) {

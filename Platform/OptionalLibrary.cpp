@@ -1,9 +1,9 @@
 #include "Platform/OptionalLibrary.h"
 
-#include "Platform/CurlLibrary.h"
+#include "Platform/CurlExchange.h"
 
 namespace platform {
 
-bool isHTTPSClientAvailable() { return CurlLibrary::shared() != nullptr; }
+bool isHTTPSClientAvailable() { return CurlExchange::isLibraryAvailable(); }
 
 }  // namespace platform
