@@ -5,7 +5,6 @@
 //                                                the reply; the service is killed between runs
 //   bus_load ping RUNS CALLS NAME...             median microseconds of CALLS calls, one after the other
 //   bus_load parallel RUNS CLIENTS MILLISECONDS NAME...   answers per second to that many clients
-#include <sys/pidfd.h>
 #include <systemd/sd-bus.h>
 
 #include <algorithm>
@@ -85,14 +84,12 @@ class Client {
         const std::string rule = "type='signal',sender='org.freedesktop.DBus',member='NameOwnerChanged',arg0='" +
                                  service + "',arg2=''";
         require(sd_bus_add_match(bus_, &slot, rule.c_str(), noteGone, &gone), "match");
-        const int process = pidfd_open(processOf(service), 0);
-        if (process < 0 || pidfd_send_signal(process, SIGKILL, nullptr, 0) < 0) require(-errno, "kill");
+        if (::kill(processOf(service), SIGKILL) < 0) require(-errno, "kill");
         while (!gone) {
             const int result = sd_bus_process(bus_, nullptr);
             require(result, "waiting");
             if (result == 0) require(sd_bus_wait(bus_, UINT64_MAX), "waiting");
         }
-        close(process);
         sd_bus_slot_unref(slot);
     }
 

@@ -45,7 +45,7 @@ Json AgentConnection::send(const platform::ValueWriter& writer) {
     if (result >= 0) result = platform::bus::appendDictionary(call, writer);
     if (result < 0) throw Unreachable(std::string("the request cannot be sent: ") + strerror(-result));
 
-    sd_bus_error error = SD_BUS_ERROR_NULL;
+    sd_bus_error error{};
     sd_bus_message* answer = nullptr;
     result = sd_bus_call(bus_, call, static_cast<uint64_t>(timeoutSeconds_ * kMicrosecondsPerSecond), &error, &answer);
     const Message reply(answer, sd_bus_message_unref);
