@@ -37,6 +37,8 @@ int main(int argc, char** argv) {
     sd_bus* bus = nullptr;
     require(sd_event_default(&loop), "event loop");
     require(sd_bus_open_user(&bus), "bus");
+    // Without its bus it has nothing to do.
+    require(sd_bus_set_exit_on_disconnect(bus, 1), "bus");
     require(sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kMessageInterface, kInterfaceTable, nullptr),
             "object");
     require(sd_bus_request_name(bus, argv[1], 0), "name");

@@ -35,7 +35,8 @@ class Clock {
     /// False when the timer has fired, is firing or is unknown.
     virtual bool cancel(TimerID timer) = 0;
 
-    /// Work queues report work that is queued or running; a simulated clock stands still until all of it has ended.
+    /// Work queues report work that can run; a simulated clock stands still until all of it has ended. A task that waits
+    /// does not count meanwhile, nor does what is queued behind it.
     virtual void workBegan() {}
     virtual void workEnded() {}
 };

@@ -11,11 +11,29 @@
 #include <memory>
 #include <string>
 
+#include "Platform/LazyLibrary.h"
 #include "Platform/SystemLog.h"
 
 namespace platform {
 
 namespace {
+
+constinit const LazyLibrary library("libcrypto.so.3");
+VELTOID_LAZY_FUNCTION(library, ERR_clear_error);
+VELTOID_LAZY_FUNCTION(library, ERR_error_string_n);
+VELTOID_LAZY_FUNCTION(library, ERR_get_error);
+VELTOID_LAZY_FUNCTION(library, EVP_aes_256_gcm);
+VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_ctrl);
+VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_free);
+VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_new);
+VELTOID_LAZY_FUNCTION(library, EVP_DecryptFinal_ex);
+VELTOID_LAZY_FUNCTION(library, EVP_DecryptInit_ex2);
+VELTOID_LAZY_FUNCTION(library, EVP_DecryptUpdate);
+VELTOID_LAZY_FUNCTION(library, EVP_Digest);
+VELTOID_LAZY_FUNCTION(library, EVP_EncryptFinal_ex);
+VELTOID_LAZY_FUNCTION(library, EVP_EncryptInit_ex2);
+VELTOID_LAZY_FUNCTION(library, EVP_EncryptUpdate);
+VELTOID_LAZY_FUNCTION(library, EVP_sha256);
 
 constexpr size_t kNonceBytes = 12;
 constexpr size_t kTagBytes = 16;

@@ -41,6 +41,9 @@ struct CurlLibrary {
     decltype(&::curl_url_get) urlGet = nullptr;
     decltype(&::curl_free) free = nullptr;
 
+    /// Of the OpenSSL that the library is built on.
+    decltype(&::OPENSSL_init_crypto) initCrypto = nullptr;
+
     /// Loaded and initialised on the first call and kept for the life of the process; null when the library
     /// or one of the functions is missing. Any thread.
     static const CurlLibrary* shared();
@@ -89,6 +92,7 @@ const char* findAll(void* library, CurlLibrary& curl) {
     symbols.find(curl.urlSet, "curl_url_set");
     symbols.find(curl.urlGet, "curl_url_get");
     symbols.find(curl.free, "curl_free");
+    symbols.find(curl.initCrypto, "OPENSSL_init_crypto");
     return symbols.missing();
 }
 
@@ -108,7 +112,7 @@ const CurlLibrary* load() {
     }
     // An exchange may be under way when the process exits: OpenSSL, which the library is built on, must not
     // take its tables down underneath it. Only the first caller of OpenSSL in a process can choose that.
-    OPENSSL_init_crypto(OPENSSL_INIT_NO_ATEXIT, nullptr);
+    curl.initCrypto(OPENSSL_INIT_NO_ATEXIT, nullptr);
     if (curl.globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
         VELTOID_PLATFORM_LOG(Error, "cannot initialise the HTTPS client library");
         return nullptr;

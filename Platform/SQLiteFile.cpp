@@ -15,12 +15,41 @@
 #include <memory>
 
 #include "Platform/Clock.h"
+#include "Platform/LazyLibrary.h"
 #include "Platform/Preferences.h"
 #include "Platform/SystemLog.h"
 
 namespace platform {
 
 namespace {
+
+constinit const LazyLibrary library("libsqlite3.so.0");
+VELTOID_LAZY_FUNCTION(library, sqlite3_bind_blob64);
+VELTOID_LAZY_FUNCTION(library, sqlite3_bind_int64);
+VELTOID_LAZY_FUNCTION(library, sqlite3_bind_null);
+VELTOID_LAZY_FUNCTION(library, sqlite3_bind_text64);
+VELTOID_LAZY_FUNCTION(library, sqlite3_busy_timeout);
+VELTOID_LAZY_FUNCTION(library, sqlite3_clear_bindings);
+VELTOID_LAZY_FUNCTION(library, sqlite3_close);
+VELTOID_LAZY_FUNCTION(library, sqlite3_column_blob);
+VELTOID_LAZY_FUNCTION(library, sqlite3_column_bytes);
+VELTOID_LAZY_FUNCTION(library, sqlite3_column_int64);
+VELTOID_LAZY_FUNCTION(library, sqlite3_column_text);
+VELTOID_LAZY_FUNCTION(library, sqlite3_column_type);
+VELTOID_LAZY_FUNCTION(library, sqlite3_db_config);
+VELTOID_LAZY_FUNCTION(library, sqlite3_errstr);
+VELTOID_LAZY_FUNCTION(library, sqlite3_exec);
+VELTOID_LAZY_FUNCTION(library, sqlite3_file_control);
+VELTOID_LAZY_FUNCTION(library, sqlite3_finalize);
+VELTOID_LAZY_FUNCTION(library, sqlite3_get_autocommit);
+VELTOID_LAZY_FUNCTION(library, sqlite3_open);
+VELTOID_LAZY_FUNCTION(library, sqlite3_open_v2);
+VELTOID_LAZY_FUNCTION(library, sqlite3_prepare_v2);
+VELTOID_LAZY_FUNCTION(library, sqlite3_prepare_v3);
+VELTOID_LAZY_FUNCTION(library, sqlite3_reset);
+VELTOID_LAZY_FUNCTION(library, sqlite3_step);
+VELTOID_LAZY_FUNCTION(library, sqlite3_system_errno);
+VELTOID_LAZY_FUNCTION(library, sqlite3_wal_checkpoint_v2);
 
 constexpr int kBusyTimeoutMilliseconds = 5000;
 /// Damage is believed when it is seen twice; then the fresh file, and once more for a file that another

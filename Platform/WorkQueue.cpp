@@ -129,6 +129,12 @@ class ThreadPool {
     size_t idle_ = 0;
 };
 
+/// Has a ready queue run; it counts as work until it has nothing to run or waits.
+void runOnPool(const StatePointer& state) {
+    Clock::shared().workBegan();
+    ThreadPool::shared().run(state);
+}
+
 /// Gives the queue to whoever comes next. Called by the thread that has it.
 void passOn(const StatePointer& state, std::unique_lock<std::mutex>& lock) {
     if (state->items.empty()) {
@@ -139,19 +145,16 @@ void passOn(const StatePointer& state, std::unique_lock<std::mutex>& lock) {
         waiter->release();
     } else {
         lock.unlock();
-        ThreadPool::shared().run(state);
+        runOnPool(state);
     }
 }
 
 void runTask(const StatePointer& state, WorkQueue::Task& task) {
-    {
-        const CurrentQueueScope scope(state.get());
-        tRunsCountedTask = true;
-        task();
-        task = nullptr;
-        tRunsCountedTask = false;
-    }
-    Clock::shared().workEnded();
+    const CurrentQueueScope scope(state.get());
+    tRunsCountedTask = true;
+    task();
+    task = nullptr;
+    tRunsCountedTask = false;
 }
 
 void drain(const StatePointer& state) {
@@ -164,6 +167,8 @@ void drain(const StatePointer& state) {
         lock.lock();
     }
     passOn(state, lock);
+    // Only now: whoever waited for the queue counts again.
+    Clock::shared().workEnded();
 }
 
 const StatePointer& mainState() {
@@ -185,15 +190,15 @@ WorkQueue::WorkQueue(std::string label) : state_(std::make_shared<State>(std::mo
 WorkQueue WorkQueue::main() { return WorkQueue(mainState()); }
 
 void WorkQueue::async(Task task) const {
-    Clock::shared().workBegan();
     std::unique_lock lock(state_->mutex);
     state_->items.push_back({std::move(task), nullptr});
     if (state_->wakeLoop) {
+        Clock::shared().workBegan();
         state_->wakeLoop();
     } else if (!state_->active) {
         state_->active = true;
         lock.unlock();
-        ThreadPool::shared().run(state_);
+        runOnPool(state_);
     }
 }
 
@@ -276,6 +281,7 @@ void runPending() {
         state->items.pop_front();
         lock.unlock();
         runTask(state, task);
+        Clock::shared().workEnded();
         lock.lock();
     }
 }

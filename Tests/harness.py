@@ -183,7 +183,12 @@ class World:
         self.bus.stop()
         if self.server:
             self.server.stop()
+        log = self.log_text()
         shutil.rmtree(self.folder, ignore_errors=True)
+        # The agent's process is not the test's: what a sanitizer has to say about it stands in its log.
+        for mark in ("ThreadSanitizer", "AddressSanitizer", "runtime error:"):
+            if mark in log:
+                raise AssertionError(log[log.index(mark) - 100:][:4000])
 
     def client(self, service: str = SERVICE, starts_agent: bool = True) -> Client:
         return Client(self.bus.address, service, starts_agent)

@@ -45,7 +45,7 @@ Value IPCMessage::copyValue(std::string_view key, std::optional<Value::Kind> exp
 }
 
 String IPCMessage::copyAccountName(std::string_view key) const {
-    const String name = copyValue(key, Value::Kind::String).asString();
+    String name = copyValue(key, Value::Kind::String).asString();
     if (!name || name.view().find_first_of(kUpperCaseLetters) == std::string_view::npos) return name;
     return lowerCased(name);
 }

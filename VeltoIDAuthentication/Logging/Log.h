@@ -25,6 +25,8 @@ void logLine(int level, const char* sourcePath, const char* functionName, int li
 
 }  // namespace veltoid
 
+// NOLINTBEGIN(bugprone-macro-parentheses): what is streamed is a chain of "<<", which parentheses would turn into a shift
+
 /// Composes the line only when its level is recorded: VELTOID_LOG(kNotice, "text " << value).
 #define VELTOID_LOG_FROM(function, level, streamed)                                             \
     do {                                                                                        \
@@ -37,3 +39,5 @@ void logLine(int level, const char* sourcePath, const char* functionName, int li
     } while (false)
 
 #define VELTOID_LOG(level, streamed) VELTOID_LOG_FROM(__func__, level, streamed)
+
+// NOLINTEND(bugprone-macro-parentheses)

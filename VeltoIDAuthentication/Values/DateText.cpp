@@ -1,30 +1,14 @@
 #include "Values/DateText.h"
 
+#include <chrono>
 #include <cstdio>
-#include <cstring>
+#include <string>
 
 namespace veltoid {
 namespace {
 
 constexpr size_t kMaxDateTextBytes = 128;
 constexpr long kMaxOffset = 9'999;
-
-bool isLeapYear(long year) { return (year % 4 == 0 && year % 100 != 0) || year % 400 == 0; }
-
-long daysInMonth(long year, long month) {
-    constexpr long kDays[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
-    return month == 2 && isLeapYear(year) ? 29 : kDays[month - 1];
-}
-
-/// Days since 1970-01-01 of the proleptic Gregorian calendar, by whole 400-year eras that begin in March.
-long daysFromCivil(long year, long month, long day) {
-    const long shifted = month <= 2 ? year - 1 : year;
-    const long era = (shifted >= 0 ? shifted : shifted - 399) / 400;
-    const long yearOfEra = shifted - era * 400;
-    const long dayOfYear = (153 * (month + (month > 2 ? -3 : 9)) + 2) / 5 + day - 1;
-    const long dayOfEra = yearOfEra * 365 + yearOfEra / 4 - yearOfEra / 100 + dayOfYear;
-    return era * 146'097 + dayOfEra - 719'468;
-}
 
 struct Fields {
     long year = 0, month = 0, day = 0, hour = 0, minute = 0, second = 0, offset = 0;
@@ -43,15 +27,21 @@ bool readFields(const char* text, Fields& f) {
     return false;
 }
 
-}  // namespace
-
-std::optional<double> dateFromCalendar(long year, long month, long day, long hour, long minute, long second) {
+/// Seconds since 1970 of the fields as a time at UTC; none when they are no date or time.
+std::optional<double> wallClockOf(const Fields& f) {
     // A leap second is read as the second after it.
-    if (year < 1 || year > 9'999 || month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) ||
-        hour < 0 || hour > 23 || minute < 0 || minute > 59 || second < 0 || second > 60)
+    if (f.year < 1 || f.year > 9'999 || f.month < 1 || f.month > 12 || f.day < 1 || f.day > 31 || f.hour < 0 ||
+        f.hour > 23 || f.minute < 0 || f.minute > 59 || f.second < 0 || f.second > 60)
         return std::nullopt;
-    return static_cast<double>(daysFromCivil(year, month, day) * 86'400 + hour * 3'600 + minute * 60 + second);
+    const std::chrono::year_month_day date{std::chrono::year(static_cast<int>(f.year)),
+                                           std::chrono::month(static_cast<unsigned>(f.month)),
+                                           std::chrono::day(static_cast<unsigned>(f.day))};
+    if (!date.ok()) return std::nullopt;
+    const std::chrono::sys_seconds midnight = std::chrono::sys_days(date);
+    return static_cast<double>(midnight.time_since_epoch().count() + f.hour * 3'600 + f.minute * 60 + f.second);
 }
+
+}  // namespace
 
 std::optional<double> dateFromValue(const Value& value) {
     if (const auto date = value.asDate()) return date;
@@ -61,7 +51,7 @@ std::optional<double> dateFromValue(const Value& value) {
     Fields f;
     if (!readFields(std::string(*text).c_str(), f) || f.offset < -kMaxOffset || f.offset > kMaxOffset)
         return std::nullopt;
-    const std::optional<double> wallClock = dateFromCalendar(f.year, f.month, f.day, f.hour, f.minute, f.second);
+    const std::optional<double> wallClock = wallClockOf(f);
     if (!wallClock) return std::nullopt;
     const long hours = f.offset / 100;
     const long minutes = f.offset - 100 * hours;

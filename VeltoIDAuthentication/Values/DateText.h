@@ -11,7 +11,4 @@ namespace veltoid {
 /// "2014-03-05T09:04:00-0800" and "2014-03-05 09:04:00 -0800"; none for anything else. Any thread.
 std::optional<double> dateFromValue(const Value& value);
 
-/// Seconds since 1970-01-01 00:00:00 UTC of a Gregorian calendar date and time at UTC; none for fields out of range.
-std::optional<double> dateFromCalendar(long year, long month, long day, long hour, long minute, long second);
-
 }  // namespace veltoid

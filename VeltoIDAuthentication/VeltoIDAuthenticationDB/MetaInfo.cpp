@@ -36,7 +36,7 @@ Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& opti
                                    std::optional<Value::Kind> requiredKind) {
     if (!key) return {};
     if (const Value& given = options[key.view()]; fits(given, requiredKind)) return given;
-    const Value stored = database::perform([&](const Store& store) {
+    Value stored = database::perform([&](const Store& store) {
         if (const Dictionary* own = Store::find(store.metaInfo, section))
             if (const Value& value = (*own)[key.view()]; fits(value, requiredKind)) return value;
         const Value& value = store.metaInfo[key.view()];

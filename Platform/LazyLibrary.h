@@ -1,0 +1,55 @@
+// Shared libraries that are loaded with the first call of one of their functions. The agent is started for every
+// message that finds it away, and most starts need neither storage nor cryptography: having the dynamic linker map and
+// relocate those libraries before main would take longer than everything else up to the first answer.
+//
+//     LazyLibrary library("libexample.so.1");
+//     VELTOID_LAZY_FUNCTION(library, example_open);
+//
+// Below these lines, in the same namespace, example_open(...) is written as if the library had been linked. It is not:
+// a function that is missing from such a list is an error of the linker.
+#pragma once
+
+#include <atomic>
+
+namespace platform {
+
+/// The library by its fixed soname, kept for the life of the process.
+class LazyLibrary {
+  public:
+    explicit constexpr LazyLibrary(const char* soname) : soname_(soname) {}
+
+    /// The address of a function; ends the process with a log line when the library or the function is missing, like
+    /// the dynamic linker with a library that is linked. Any thread.
+    void* addressOf(const char* function) const;
+
+  private:
+    const char* soname_;
+};
+
+/// A function of a library, called like the function itself.
+template <typename Function>
+class LazyFunction {
+  public:
+    constexpr LazyFunction(const LazyLibrary& library, const char* name) : library_(library), name_(name) {}
+
+    operator Function*() const {  // NOLINT(google-explicit-constructor): this is what makes it callable
+        void* address = address_.load(std::memory_order_acquire);
+        if (address == nullptr) {
+            // Threads that meet here find the same address.
+            address = library_.addressOf(name_);
+            address_.store(address, std::memory_order_release);
+        }
+        return reinterpret_cast<Function*>(address);
+    }
+
+  private:
+    const LazyLibrary& library_;
+    const char* name_;
+    mutable std::atomic<void*> address_{nullptr};
+};
+
+}  // namespace platform
+
+// The name is the library's own, so that it hides the declaration of its header.
+#define VELTOID_LAZY_FUNCTION(library, function) \
+    constinit const ::platform::LazyFunction<decltype(::function)> function(library, #function)
