@@ -61,10 +61,11 @@ class RealSystemLog : public SystemLog {
 
   private:
     bool writeToJournal(LogPriority priority, const std::string& line, const LogOrigin& origin) const {
-        const std::array<std::string, 7> fields = {
+        const std::array<std::string, 8> fields = {
             "MESSAGE=" + line,
             "PRIORITY=" + std::to_string(static_cast<int>(priority)),
-            "SYSLOG_IDENTIFIER=" + programName_,
+            "SYSLOG_IDENTIFIER=" + (origin.identity.empty() ? programName_ : std::string(origin.identity)),
+            "SUBSYSTEM=" + std::string(origin.facility),
             "CODE_FILE=" + std::string(origin.file),
             "CODE_LINE=" + std::to_string(origin.line),
             "CODE_FUNC=" + std::string(origin.function),

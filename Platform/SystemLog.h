@@ -17,6 +17,9 @@ struct LogOrigin {
     int line = 0;
     std::string_view function;
     std::string_view queue;
+    /// Who speaks (SYSLOG_IDENTIFIER in the journal; the program when empty), and the facility that it speaks for.
+    std::string_view identity = {};
+    std::string_view facility = {};
 };
 
 /// All operations may be called from any thread.

@@ -13,10 +13,14 @@
 namespace veltoid {
 namespace {
 
+constexpr const char* kIdentity = "VeltoIDAuthAgent";
+constexpr const char* kFacility = "com.velto.harbwell.veltoidauth";
 constexpr const char* kPrefix = "SERVER ";
 constexpr unsigned kLevelMask = 0x3F;
 
-void write(int level, const std::string& text, const platform::LogOrigin& origin) {
+void write(int level, const std::string& text, platform::LogOrigin origin) {
+    origin.identity = kIdentity;
+    origin.facility = kFacility;
     platform::SystemLog::shared().write(static_cast<platform::LogPriority>(level), text, origin);
 }
 
