@@ -1,5 +1,5 @@
-// Messages of any shape, as clients may send them: reading one must end well, and what was read and written again must
-// read the same.
+// Messages of any shape, as clients may send them: reading one must end well, and what was read and written
+// again must read the same.
 #include <sys/socket.h>
 #include <systemd/sd-bus.h>
 
@@ -59,8 +59,9 @@ class Appender {
     }
 
     void variant(int depth) {
-        static constexpr const char* kSignatures[] = {"x", "y", "n", "q", "i", "u", "t", "b", "d", "s", "o", "g", "ay",
-                                                      "(d)", "(ay)", "(s)", "as", "a{ss}", "a{us}", "av", "a{sv}", "v"};
+        static constexpr const char* kSignatures[] = {
+            "x", "y",  "n",   "q",    "i",   "u",  "t",     "b",     "d",  "s",     "o",
+            "g", "ay", "(d)", "(ay)", "(s)", "as", "a{ss}", "a{us}", "av", "a{sv}", "v"};
         const char* signature = kSignatures[next() % std::size(kSignatures)];
         constexpr int kDeepest = 18;
         if (depth >= kDeepest) signature = "x";
@@ -154,9 +155,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size) {
     Appender(first.get(), bytes, size).dictionary(0);
     const veltoid::MessageValue value = read(first.get());
     const Message second = newMessage();
-    if (platform::bus::appendDictionary(second.get(), [&](platform::ValueSink& sink) {
-            veltoid::writeMessageValue(value, sink);
-        }) < 0)
+    if (platform::bus::appendDictionary(
+            second.get(), [&](platform::ValueSink& sink) { veltoid::writeMessageValue(value, sink); }) < 0)
         return 0;
     if (veltoid::describe(value) != veltoid::describe(read(second.get()))) __builtin_trap();
     (void)veltoid::messageFromValue(veltoid::valueFromMessage(value));

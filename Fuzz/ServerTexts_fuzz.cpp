@@ -11,7 +11,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size) {
     (void)veltoid::pemBodyToData(string);
     const veltoid::Data decoded = veltoid::base64Decode(string);
     // Whatever was decoded encodes to something that decodes to it again.
-    if (decoded.size() > 0 && veltoid::base64Decode(veltoid::base64Encode(decoded)) != decoded) __builtin_trap();
+    if (decoded.size() > 0 && veltoid::base64Decode(veltoid::base64Encode(decoded)) != decoded)
+        __builtin_trap();
     const veltoid::Data loose = veltoid::xmlrpcBase64Decode(text);
     if (veltoid::xmlrpcBase64Decode(veltoid::xmlrpcBase64Encode(loose.bytes(), true).view()) != loose)
         __builtin_trap();

@@ -34,12 +34,13 @@ int disconnected(sd_bus_message* /*message*/, void* /*context*/, sd_bus_error* /
 int openBus(sd_bus** bus) {
     const char* starter = std::getenv("DBUS_STARTER_BUS_TYPE");
     return starter != nullptr && std::strcmp(starter, "system") == 0 ? sd_bus_open_system(bus)
-                                                                    : sd_bus_open_user(bus);
+                                                                     : sd_bus_open_user(bus);
 }
 
 int watchDisconnect(sd_bus* bus) {
-    return sd_bus_match_signal_async(bus, nullptr, "org.freedesktop.DBus.Local", "/org/freedesktop/DBus/Local",
-                                     "org.freedesktop.DBus.Local", "Disconnected", disconnected, nullptr, nullptr);
+    return sd_bus_match_signal_async(bus, nullptr, "org.freedesktop.DBus.Local",
+                                     "/org/freedesktop/DBus/Local", "org.freedesktop.DBus.Local",
+                                     "Disconnected", disconnected, nullptr, nullptr);
 }
 
 }  // namespace

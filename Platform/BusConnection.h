@@ -13,7 +13,8 @@ inline constexpr const char* kObjectPath = "/com/velto/harbwell/veltoid";
 inline constexpr const char* kMessageInterface = "com.velto.harbwell.veltoid.MessageService";
 inline constexpr const char* kNotificationInterface = "com.velto.harbwell.veltoid.Notifications";
 
-/// The connection, opened and attached to the event loop on first use; null when there is no bus (logged once).
+/// The connection, opened and attached to the event loop on first use; null when there is no bus (logged
+/// once).
 sd_bus* connection();
 
 /// Emits Posted(name); nothing happens without a connection that was opened before.

@@ -12,8 +12,8 @@
 namespace platform::bus {
 namespace {
 
-/// The bus refuses messages whose containers nest deeper than this, variants and dictionary entries included, and
-/// drops the connection that sent one.
+/// The bus refuses messages whose containers nest deeper than this, variants and dictionary entries included,
+/// and drops the connection that sent one.
 constexpr int kMaxWireDepth = 62;
 
 // --- Reading
@@ -28,10 +28,14 @@ class Reader {
         const char* contents = nullptr;
         if (sd_bus_message_peek_type(message_, &type, &contents) <= 0) return false;
         switch (type) {
-            case SD_BUS_TYPE_VARIANT: return readVariant(contents, depth);
-            case SD_BUS_TYPE_ARRAY: return readArrayLike(contents, depth);
-            case SD_BUS_TYPE_STRUCT: return readStruct(contents);
-            default: return readBasic(type);
+            case SD_BUS_TYPE_VARIANT:
+                return readVariant(contents, depth);
+            case SD_BUS_TYPE_ARRAY:
+                return readArrayLike(contents, depth);
+            case SD_BUS_TYPE_STRUCT:
+                return readStruct(contents);
+            default:
+                return readBasic(type);
         }
     }
 
@@ -39,7 +43,8 @@ class Reader {
     bool readVariant(const char* contents, int depth) {
         // A copy: the message may reuse the text while the container is entered.
         const std::string signature(contents);
-        if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_VARIANT, signature.c_str()) <= 0) return false;
+        if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_VARIANT, signature.c_str()) <= 0)
+            return false;
         if (!readValue(depth)) return false;
         return sd_bus_message_exit_container(message_) >= 0;
     }
@@ -137,12 +142,18 @@ class Reader {
 
     bool readBasic(char type) {
         switch (type) {
-            case SD_BUS_TYPE_BYTE: return readInteger<uint8_t>(type);
-            case SD_BUS_TYPE_INT16: return readInteger<int16_t>(type);
-            case SD_BUS_TYPE_UINT16: return readInteger<uint16_t>(type);
-            case SD_BUS_TYPE_INT32: return readInteger<int32_t>(type);
-            case SD_BUS_TYPE_UINT32: return readInteger<uint32_t>(type);
-            case SD_BUS_TYPE_INT64: return readInteger<int64_t>(type);
+            case SD_BUS_TYPE_BYTE:
+                return readInteger<uint8_t>(type);
+            case SD_BUS_TYPE_INT16:
+                return readInteger<int16_t>(type);
+            case SD_BUS_TYPE_UINT16:
+                return readInteger<uint16_t>(type);
+            case SD_BUS_TYPE_INT32:
+                return readInteger<int32_t>(type);
+            case SD_BUS_TYPE_UINT32:
+                return readInteger<uint32_t>(type);
+            case SD_BUS_TYPE_INT64:
+                return readInteger<int64_t>(type);
             case SD_BUS_TYPE_UINT64: {
                 uint64_t value = 0;
                 if (sd_bus_message_read_basic(message_, type, &value) <= 0) return false;
@@ -167,7 +178,8 @@ class Reader {
                 sink_.fileDescriptor(descriptor);
                 return true;
             }
-            default: return readText(type);
+            default:
+                return readText(type);
         }
     }
 
@@ -177,8 +189,8 @@ class Reader {
 
 // --- Writing
 
-/// Appends values as variants; the outermost dictionary is the body itself. After the first failure nothing more is
-/// written and `result` tells it.
+/// Appends values as variants; the outermost dictionary is the body itself. After the first failure nothing
+/// more is written and `result` tells it.
 class MessageSink : public ValueSink {
   public:
     explicit MessageSink(sd_bus_message* message) : message_(message) {}
@@ -241,12 +253,15 @@ class MessageSink : public ValueSink {
 
   private:
     static bool isUTF8(std::string_view text) {
-        // Only texts from foreign bytes can be anything else, so a plain check of lead and continuation bytes will do.
+        // Only texts from foreign bytes can be anything else, so a plain check of lead and continuation bytes
+        // will do.
         for (size_t i = 0; i < text.size();) {
             const auto lead = static_cast<unsigned char>(text[i]);
-            const size_t length = lead < 0x80 ? 1 : lead >= 0xC2 && lead < 0xE0 ? 2 : lead >= 0xE0 && lead < 0xF0 ? 3
-                                                : lead >= 0xF0 && lead < 0xF5                                     ? 4
-                                                                                                                  : 0;
+            const size_t length = lead < 0x80                   ? 1
+                                  : lead >= 0xC2 && lead < 0xE0 ? 2
+                                  : lead >= 0xE0 && lead < 0xF0 ? 3
+                                  : lead >= 0xF0 && lead < 0xF5 ? 4
+                                                                : 0;
             if (length == 0 || i + length > text.size()) return false;
             for (size_t k = 1; k < length; ++k)
                 if ((static_cast<unsigned char>(text[i + k]) & 0xC0U) != 0x80U) return false;
@@ -261,7 +276,8 @@ class MessageSink : public ValueSink {
 
     void openVariant(const char* signature) {
         if (tooDeep_ > 0) return;
-        if (!entryOpen_.empty()) check(sd_bus_message_open_container(message_, SD_BUS_TYPE_VARIANT, signature));
+        if (!entryOpen_.empty())
+            check(sd_bus_message_open_container(message_, SD_BUS_TYPE_VARIANT, signature));
     }
 
     void closeVariant() {

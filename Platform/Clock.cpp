@@ -34,9 +34,9 @@ timespec timespecOf(double seconds) {
     return {static_cast<time_t>(whole), static_cast<long>((seconds - whole) * kNanosecondsPerSecond)};
 }
 
-/// Dates from CLOCK_REALTIME, waits on CLOCK_BOOTTIME so that time in suspend counts. One thread serves all timers; it
-/// exists from the first timer on and sleeps until the next deadline or a jump of the real-time clock.
-/// All members are guarded by the mutex.
+/// Dates from CLOCK_REALTIME, waits on CLOCK_BOOTTIME so that time in suspend counts. One thread serves all
+/// timers; it exists from the first timer on and sleeps until the next deadline or a jump of the real-time
+/// clock. All members are guarded by the mutex.
 class RealClock : public Clock {
   public:
     double now() const override { return secondsOf(CLOCK_REALTIME); }
@@ -46,7 +46,8 @@ class RealClock : public Clock {
         startThreadOnce();
         const double deadline = secondsOf(CLOCK_BOOTTIME) + std::clamp(seconds, 0.0, kFarthestDeadline);
         const TimerID id = ++lastID_;
-        const auto position = timers_.emplace(std::pair(deadline, id), Timer{endsEarlyOnJump, std::move(fire)}).first;
+        const auto position =
+            timers_.emplace(std::pair(deadline, id), Timer{endsEarlyOnJump, std::move(fire)}).first;
         deadlines_[id] = deadline;
         if (position == timers_.begin()) wake();
         return id;

@@ -7,8 +7,9 @@ struct sd_event;
 
 namespace platform::event_loop {
 
-/// Makes the calling thread the main thread: the main queue's tasks wait for `run` from now on. Called first in main,
-/// before any other thread exists, since it blocks the signals that `onSignal` serves in every thread.
+/// Makes the calling thread the main thread: the main queue's tasks wait for `run` from now on. Called first
+/// in main, before any other thread exists, since it blocks the signals that `onSignal` serves in every
+/// thread.
 void prepare();
 
 /// Runs `handler` on the main thread whenever the signal (SIGINT or SIGTERM) arrives.
@@ -20,8 +21,8 @@ void onSignal(int signal, std::function<void()> handler);
 /// The loop, for the bus connection; null before `prepare`.
 sd_event* handle();
 
-/// Ends the process at once from any thread: standard output is flushed, no destructor or exit handler runs, so that
-/// other threads may go on until the end.
+/// Ends the process at once from any thread: standard output is flushed, no destructor or exit handler runs,
+/// so that other threads may go on until the end.
 [[noreturn]] void exitProcess(int status);
 
 }  // namespace platform::event_loop

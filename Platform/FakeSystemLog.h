@@ -28,7 +28,8 @@ class FakeSystemLog : public SystemLog {
 
     void write(LogPriority priority, std::string_view text, const LogOrigin& origin) override {
         const std::lock_guard lock(mutex_);
-        lines_.push_back({priority, std::string(text), std::string(origin.function), std::string(origin.queue)});
+        lines_.push_back(
+            {priority, std::string(text), std::string(origin.function), std::string(origin.queue)});
     }
 
     std::vector<Line> lines() const {

@@ -1,8 +1,8 @@
 // HTTPS client sessions (libcurl, loaded on first use so that start-up does not pay for it).
 //
-// A session carries one exchange. No cookies, no redirects, no connection kept afterwards; TLS 1.2 or newer; the
-// server's certificate and name are always verified, against the system's hashed certificate directory (looked up as
-// needed) or the file that SSL_CERT_FILE names. Only https URLs are accepted.
+// A session carries one exchange. No cookies, no redirects, no connection kept afterwards; TLS 1.2 or newer;
+// the server's certificate and name are always verified, against the system's hashed certificate directory
+// (looked up as needed) or the file that SSL_CERT_FILE names. Only https URLs are accepted.
 #pragma once
 
 #include <cstdint>
@@ -35,7 +35,8 @@ struct HTTPRequest {
     const std::string* headerField(std::string_view name) const;
 };
 
-/// Why an exchange did not complete: the domain names the layer, the text never holds request or response content.
+/// Why an exchange did not complete: the domain names the layer, the text never holds request or response
+/// content.
 struct HTTPError {
     int64_t code = 0;
     std::string description;
@@ -50,11 +51,14 @@ struct ProtectionSpace {
 
 enum class ChallengeAnswer { PerformDefaultHandling, Cancel };
 
-/// Receives the events of one exchange on the session's event queue, or on its delivery thread when it has none.
+/// Receives the events of one exchange on the session's event queue, or on its delivery thread when it has
+/// none.
 class HTTPSessionEvents {
   public:
     virtual ~HTTPSessionEvents() = default;
-    virtual ChallengeAnswer challenge(const ProtectionSpace&) { return ChallengeAnswer::PerformDefaultHandling; }
+    virtual ChallengeAnswer challenge(const ProtectionSpace&) {
+        return ChallengeAnswer::PerformDefaultHandling;
+    }
     virtual void responseHeader(int statusCode) = 0;
     virtual void bodyBytes(Bytes bytes) = 0;
     virtual void uploadProgress(uint64_t /*sent*/, uint64_t /*expected*/) {}
@@ -80,7 +84,8 @@ class HTTPSession {
     /// Starts the one exchange of this session.
     virtual void start(HTTPRequest request) = 0;
 
-    /// Ends a running exchange; no event is delivered once this has returned, except one already being handled.
+    /// Ends a running exchange; no event is delivered once this has returned, except one already being
+    /// handled.
     virtual void invalidateAndCancel() = 0;
 };
 

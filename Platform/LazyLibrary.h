@@ -1,12 +1,13 @@
-// Shared libraries that are loaded with the first call of one of their functions. The agent is started for every
-// message that finds it away, and most starts need neither storage nor cryptography: having the dynamic linker map and
-// relocate those libraries before main would take longer than everything else up to the first answer.
+// Shared libraries that are loaded with the first call of one of their functions. The agent is started for
+// every message that finds it away, and most starts need neither storage nor cryptography: having the dynamic
+// linker map and relocate those libraries before main would take longer than everything else up to the first
+// answer.
 //
 //     LazyLibrary library("libexample.so.1");
 //     VELTOID_LAZY_FUNCTION(library, example_open);
 //
-// Below these lines, in the same namespace, example_open(...) is written as if the library had been linked. It is not:
-// a function that is missing from such a list is an error of the linker.
+// Below these lines, in the same namespace, example_open(...) is written as if the library had been linked.
+// It is not: a function that is missing from such a list is an error of the linker.
 #pragma once
 
 #include <atomic>
@@ -18,8 +19,8 @@ class LazyLibrary {
   public:
     explicit constexpr LazyLibrary(const char* soname) : soname_(soname) {}
 
-    /// The address of a function; ends the process with a log line when the library or the function is missing, like
-    /// the dynamic linker with a library that is linked. Any thread.
+    /// The address of a function; ends the process with a log line when the library or the function is
+    /// missing, like the dynamic linker with a library that is linked. Any thread.
     void* addressOf(const char* function) const;
 
   private:

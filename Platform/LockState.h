@@ -3,8 +3,8 @@
 
 namespace platform {
 
-/// True once the keychain's "after first unlock" key can be had. The key is wrapped by the device key alone, so the
-/// device counts as unlocked from the start. Any thread.
+/// True once the keychain's "after first unlock" key can be had. The key is wrapped by the device key alone,
+/// so the device counts as unlocked from the start. Any thread.
 bool hasBeenUnlockedSinceBoot();
 
 }  // namespace platform

@@ -40,7 +40,8 @@ void sendReply(sd_bus_message* request, const ValueWriter& writer) {
     sd_bus_message_unref(reply);
     if (result >= 0) return;
     bus::logFailure("replying", result);
-    sd_bus_reply_method_errorf(request, SD_BUS_ERROR_LIMITS_EXCEEDED, "The reply does not fit into a message.");
+    sd_bus_reply_method_errorf(request, SD_BUS_ERROR_LIMITS_EXCEEDED,
+                               "The reply does not fit into a message.");
 }
 
 class BusRequest : public IncomingMessage {
@@ -58,7 +59,8 @@ class BusRequest : public IncomingMessage {
         if (mainQueue.isCurrent()) {
             sendReply(message_.get(), writer);
         } else {
-            mainQueue.async([message = message_, writer = std::move(writer)] { sendReply(message.get(), writer); });
+            mainQueue.async(
+                [message = message_, writer = std::move(writer)] { sendReply(message.get(), writer); });
         }
     }
 
@@ -81,7 +83,9 @@ class BusPeer : public PeerConnection {
     void setEventHandler(std::function<void(const PeerEvent&)> handler) override {
         handler_ = std::make_shared<std::function<void(const PeerEvent&)>>(std::move(handler));
     }
-    void setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) override { answeredAtOnce_ = std::move(test); }
+    void setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) override {
+        answeredAtOnce_ = std::move(test);
+    }
 
     void resume() override {
         resumed_ = true;
@@ -100,8 +104,8 @@ class BusPeer : public PeerConnection {
         if (!atOnce || !queue_.tryRunNow(task)) queue_.async(task);
     }
 
-    /// Calls `gone`, possibly more than once, when the bus says that the name has left it. The context lives as long
-    /// as this peer.
+    /// Calls `gone`, possibly more than once, when the bus says that the name has left it. The context lives
+    /// as long as this peer.
     template <typename Context>
     void watch(sd_bus* bus, sd_bus_track_handler_t gone, std::shared_ptr<Context> context) {
         watchContext_ = context;
@@ -163,13 +167,15 @@ class BusListener : public Listener {
     void resume() override {
         sd_bus* bus = bus::connection();
         int result = bus != nullptr ? addObject(bus) : -ENOTCONN;
-        if (result >= 0) result = sd_bus_request_name_async(bus, nullptr, name_.c_str(), 0, nameRequested, this);
+        if (result >= 0)
+            result = sd_bus_request_name_async(bus, nullptr, name_.c_str(), 0, nameRequested, this);
         if (result >= 0) return;
         bus::logFailure("registering a service", result);
         notify(ConnectionError::Invalid);
     }
 
-    /// The peer of that bus name, new when this is its first message; null when it may not speak to the agent.
+    /// The peer of that bus name, new when this is its first message; null when it may not speak to the
+    /// agent.
     BusPeer* peerFor(sd_bus_message* message) {
         const char* sender = sd_bus_message_get_sender(message);
         if (sender == nullptr) return nullptr;
@@ -210,7 +216,8 @@ class BusListener : public Listener {
         pid_t process = 0;
         const bool known =
             sd_bus_query_sender_creds(message, SD_BUS_CREDS_EUID | SD_BUS_CREDS_PID, &credentials) >= 0 &&
-            sd_bus_creds_get_euid(credentials, &user) >= 0 && sd_bus_creds_get_pid(credentials, &process) >= 0;
+            sd_bus_creds_get_euid(credentials, &user) >= 0 &&
+            sd_bus_creds_get_pid(credentials, &process) >= 0;
         sd_bus_creds_unref(credentials);
         if (!known || (user != geteuid() && user != 0)) return nullptr;
 
@@ -239,7 +246,8 @@ class BusListener : public Listener {
     }
 
     void connectionLost() {
-        for (const auto& [name, peer] : std::exchange(peers_, {})) peer->deliver(ConnectionError::Interrupted);
+        for (const auto& [name, peer] : std::exchange(peers_, {}))
+            peer->deliver(ConnectionError::Interrupted);
         notify(ConnectionError::Invalid);
     }
 
@@ -264,7 +272,8 @@ int handleSend(sd_bus_message* message, void* /*context*/, sd_bus_error* error) 
         BusListener* listener = listenerFor(message);
         BusPeer* peer = listener != nullptr ? listener->peerFor(message) : nullptr;
         if (peer == nullptr)
-            return sd_bus_error_set(error, SD_BUS_ERROR_ACCESS_DENIED, "This service serves its own user only.");
+            return sd_bus_error_set(error, SD_BUS_ERROR_ACCESS_DENIED,
+                                    "This service serves its own user only.");
         peer->deliver(std::make_shared<BusRequest>(message));
         return 1;
     } catch (...) {

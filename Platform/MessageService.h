@@ -1,14 +1,16 @@
-// The message-passing service: named services whose clients send dictionary messages and get dictionary replies, over
-// D-Bus (session bus; the system bus when DBUS_STARTER_BUS_TYPE says so).
+// The message-passing service: named services whose clients send dictionary messages and get dictionary
+// replies, over D-Bus (session bus; the system bus when DBUS_STARTER_BUS_TYPE says so).
 //
-// A service is a well-known bus name. All of them share the object /com/velto/harbwell/veltoid with the interface
-// com.velto.harbwell.veltoid.MessageService and its method Send(a{sv}) -> (a{sv}). A peer is a unique bus name; its first
-// message to a service is the new-connection event, and the bus saying that the name is gone ends the connection. Messages
-// of other users (root excepted) are refused before any handler sees them.
+// A service is a well-known bus name. All of them share the object /com/velto/harbwell/veltoid with the
+// interface com.velto.harbwell.veltoid.MessageService and its method Send(a{sv}) -> (a{sv}). A peer is a
+// unique bus name; its first message to a service is the new-connection event, and the bus saying that the
+// name is gone ends the connection. Messages of other users (root excepted) are refused before any handler
+// sees them.
 //
-// On the wire a value is: boolean b; signed integer x (y n q i u are read too); unsigned t; double d; string s (o is read
-// too); data ay; array av (any other array is read too); dictionary a{sv} (any string-keyed one is read too); date (d),
-// seconds since 1970-01-01 UTC; null g with an empty signature; UUID (ay) of 16 bytes; file descriptor h.
+// On the wire a value is: boolean b; signed integer x (y n q i u are read too); unsigned t; double d; string
+// s (o is read too); data ay; array av (any other array is read too); dictionary a{sv} (any string-keyed one
+// is read too); date (d), seconds since 1970-01-01 UTC; null g with an empty signature; UUID (ay) of 16
+// bytes; file descriptor h.
 #pragma once
 
 #include <sys/types.h>
@@ -40,8 +42,8 @@ class IncomingMessage {
     /// Writes the dictionary into the sink. May be called once.
     virtual void read(ValueSink& sink) = 0;
 
-    /// Sends the dictionary that `writer` writes as the reply, from any thread; the first reply counts. A message that
-    /// is dropped without one leaves its sender waiting until the connection ends.
+    /// Sends the dictionary that `writer` writes as the reply, from any thread; the first reply counts. A
+    /// message that is dropped without one leaves its sender waiting until the connection ends.
     virtual void reply(ValueWriter writer) = 0;
 };
 
@@ -59,9 +61,9 @@ class PeerConnection {
     virtual void setTargetQueue(WorkQueue queue) = 0;
     virtual void setEventHandler(std::function<void(const PeerEvent&)> handler) = 0;
 
-    /// Messages for which `test` answers true are handled on the bus thread when the target queue is idle, as that
-    /// queue's task: for requests that are answered without waiting for anything, where waking another thread would
-    /// cost more than the answer.
+    /// Messages for which `test` answers true are handled on the bus thread when the target queue is idle, as
+    /// that queue's task: for requests that are answered without waiting for anything, where waking another
+    /// thread would cost more than the answer.
     virtual void setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) = 0;
 
     /// Starts delivery; until then events wait.
@@ -83,7 +85,8 @@ class Listener {
 
 namespace message_service {
 
-/// Calls `handler` on the main queue when the bus has ended the connection, after the listeners were told. Once, at start.
+/// Calls `handler` on the main queue when the bus has ended the connection, after the listeners were told.
+/// Once, at start.
 void onConnectionLost(std::function<void()> handler);
 
 /// Tells every listener that the process is about to be ended. Main queue.

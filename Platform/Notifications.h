@@ -1,5 +1,5 @@
-// System-wide notifications: a name, no payload, for whoever listens (D-Bus signal Posted(s name) of interface
-// com.velto.harbwell.veltoid.Notifications on the agent's object).
+// System-wide notifications: a name, no payload, for whoever listens (D-Bus signal Posted(s name) of
+// interface com.velto.harbwell.veltoid.Notifications on the agent's object).
 #pragma once
 
 #include <string>

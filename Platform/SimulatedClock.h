@@ -1,5 +1,5 @@
-// A clock for tests: time stands still while anything works and jumps to the next deadline when a test advances it, so
-// that years pass in seconds and in the same order each time.
+// A clock for tests: time stands still while anything works and jumps to the next deadline when a test
+// advances it, so that years pass in seconds and in the same order each time.
 #pragma once
 
 #include <condition_variable>

@@ -100,7 +100,8 @@ SystemLog& SystemLog::shared() {
 
 void SystemLog::replaceShared(SystemLog* log) { replacement.store(log, std::memory_order_release); }
 
-void logPlatform(LogPriority priority, std::string_view text, const char* file, int line, const char* function) {
+void logPlatform(LogPriority priority, std::string_view text, const char* file, int line,
+                 const char* function) {
     const std::string* queue = WorkQueue::currentLabel();
     std::string_view name(file);
     name.remove_prefix(std::min(name.size(), name.rfind('/') + 1));

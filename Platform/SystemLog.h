@@ -1,5 +1,5 @@
-// The system log: the journal with structured fields where its socket exists, else syslog; standard error as well
-// unless it already leads to the journal. The text of a line is the same everywhere.
+// The system log: the journal with structured fields where its socket exists, else syslog; standard error as
+// well unless it already leads to the journal. The text of a line is the same everywhere.
 #pragma once
 
 #include <memory>
@@ -17,7 +17,8 @@ struct LogOrigin {
     int line = 0;
     std::string_view function;
     std::string_view queue;
-    /// Who speaks (SYSLOG_IDENTIFIER in the journal; the program when empty), and the facility that it speaks for.
+    /// Who speaks (SYSLOG_IDENTIFIER in the journal; the program when empty), and the facility that it speaks
+    /// for.
     std::string_view identity = {};
     std::string_view facility = {};
 };
@@ -40,7 +41,8 @@ class SystemLog {
 };
 
 /// What the platform itself has to report (a store moved aside, a value damaged), at the place that is given.
-void logPlatform(LogPriority priority, std::string_view text, const char* file, int line, const char* function);
+void logPlatform(LogPriority priority, std::string_view text, const char* file, int line,
+                 const char* function);
 
 }  // namespace platform
 

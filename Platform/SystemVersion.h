@@ -11,7 +11,8 @@ struct SystemVersion {
     std::optional<std::string> buildVersion;
 };
 
-/// NAME and BUILD_ID (else VERSION_ID) of /etc/os-release or /usr/lib/os-release; read once per process. Any thread.
+/// NAME and BUILD_ID (else VERSION_ID) of /etc/os-release or /usr/lib/os-release; read once per process. Any
+/// thread.
 const SystemVersion& systemVersion();
 
 /// The same from the text of such a file.

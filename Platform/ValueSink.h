@@ -1,5 +1,5 @@
-// The form in which values cross the platform boundary: a stream of events, so that neither side knows the other's
-// tree. Whoever stores or sends a value writes it into a sink; whoever reads one hands a sink in.
+// The form in which values cross the platform boundary: a stream of events, so that neither side knows the
+// other's tree. Whoever stores or sends a value writes it into a sink; whoever reads one hands a sink in.
 #pragma once
 
 #include <cstdint>
@@ -11,8 +11,8 @@
 
 namespace platform {
 
-/// Receives one value as events. Between beginDictionary and endDictionary every value is preceded by its key.
-/// Callers balance begin and end; spans and views live only for the call.
+/// Receives one value as events. Between beginDictionary and endDictionary every value is preceded by its
+/// key. Callers balance begin and end; spans and views live only for the call.
 class ValueSink {
   public:
     virtual ~ValueSink() = default;

@@ -22,8 +22,8 @@ thread_local std::vector<const WorkQueue::State*> tCurrentQueues;
 /// Whether the current thread runs a queued task, and so counts as work for the clock.
 thread_local bool tRunsCountedTask = false;
 
-/// One blocked thread. While it is blocked it does not count as work; whoever ends the block counts it again before it
-/// can run, so that a simulated clock never sees a moment in which nobody works.
+/// One blocked thread. While it is blocked it does not count as work; whoever ends the block counts it again
+/// before it can run, so that a simulated clock never sees a moment in which nobody works.
 class BlockedThread {
   public:
     void release() {
@@ -48,7 +48,6 @@ class BlockedThread {
 };
 
 }  // namespace
-
 
 struct WorkQueue::State {
     struct Item {
@@ -86,7 +85,8 @@ bool isOnQueue(const WorkQueue::State* state) {
 
 void drain(const StatePointer& state);
 
-/// Threads that run ready queues: one more whenever a queue becomes ready and none is idle, fewer when idle for long.
+/// Threads that run ready queues: one more whenever a queue becomes ready and none is idle, fewer when idle
+/// for long.
 class ThreadPool {
   public:
     /// Never destroyed: threads may outlive main.
@@ -117,7 +117,8 @@ class ThreadPool {
                 lock.lock();
             }
             ++idle_;
-            const bool woken = becameReady_.wait_for(lock, kIdleThreadLifetime, [this] { return !ready_.empty(); });
+            const bool woken =
+                becameReady_.wait_for(lock, kIdleThreadLifetime, [this] { return !ready_.empty(); });
             --idle_;
             if (!woken) return;
         }

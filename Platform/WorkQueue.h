@@ -1,8 +1,9 @@
-// Serial work queues over a pool of threads, the main queue, and the counting semaphore. Everything in the agent that
-// runs, waits or is delayed goes through these, and through the Clock beneath them.
+// Serial work queues over a pool of threads, the main queue, and the counting semaphore. Everything in the
+// agent that runs, waits or is delayed goes through these, and through the Clock beneath them.
 //
-// A queue runs its tasks one at a time in the order in which they came. It costs no thread while it is empty. `sync` on
-// an idle queue runs on the caller's thread: waking another thread costs more than most operations take.
+// A queue runs its tasks one at a time in the order in which they came. It costs no thread while it is empty.
+// `sync` on an idle queue runs on the caller's thread: waking another thread costs more than most operations
+// take.
 #pragma once
 
 #include <functional>
@@ -23,8 +24,8 @@ class WorkQueue {
 
     explicit WorkQueue(std::string label);
 
-    /// The queue labelled "main". Its tasks run on the event loop's thread while the loop runs (EventLoop.h), and
-    /// like those of any other queue before.
+    /// The queue labelled "main". Its tasks run on the event loop's thread while the loop runs (EventLoop.h),
+    /// and like those of any other queue before.
     static WorkQueue main();
 
     void async(Task task) const;
@@ -32,8 +33,8 @@ class WorkQueue {
     /// Queues the task after `seconds`; at once when not positive.
     void asyncAfter(double seconds, Task task) const;
 
-    /// Runs `function` on this queue, after everything queued before it, and returns its result. Waiting for a queue
-    /// that the caller is already on can never end: it aborts the process with both labels.
+    /// Runs `function` on this queue, after everything queued before it, and returns its result. Waiting for
+    /// a queue that the caller is already on can never end: it aborts the process with both labels.
     template <typename Function>
     std::invoke_result_t<Function> sync(Function&& function) const {
         using Result = std::invoke_result_t<Function>;
@@ -77,8 +78,8 @@ class Semaphore {
 
     void wait() const { (void)wait(kForever); }
 
-    /// Takes one signal, waiting for it at most `seconds`; false when there was none. A jump of the real-time clock
-    /// ends the wait early (false), so that the caller looks at the date again.
+    /// Takes one signal, waiting for it at most `seconds`; false when there was none. A jump of the real-time
+    /// clock ends the wait early (false), so that the caller looks at the date again.
     bool wait(double seconds) const;
 
   private:
@@ -89,8 +90,8 @@ class Semaphore {
 /// What the event loop needs to run the main queue's tasks on its own thread.
 namespace main_queue {
 
-/// From now on the main queue's tasks wait until runPending; `wake` is called, from any thread, when there is one.
-/// Called on the thread that will run them, which is on the main queue from now on.
+/// From now on the main queue's tasks wait until runPending; `wake` is called, from any thread, when there is
+/// one. Called on the thread that will run them, which is on the main queue from now on.
 void adopt(std::function<void()> wake);
 
 /// Runs what is queued when it is called. On the adopting thread only.

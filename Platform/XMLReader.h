@@ -1,5 +1,5 @@
-// Event-driven XML reading (expat). No external entity is ever loaded and a document that declares entities of its own
-// is refused.
+// Event-driven XML reading (expat). No external entity is ever loaded and a document that declares entities
+// of its own is refused.
 #pragma once
 
 #include <optional>
@@ -10,8 +10,9 @@
 
 namespace platform {
 
-/// Receives the events of one read, on the reading thread. Names are plain (no namespace processing), attributes are
-/// not delivered, character data comes freed of entities and possibly in pieces. Views live only for the call.
+/// Receives the events of one read, on the reading thread. Names are plain (no namespace processing),
+/// attributes are not delivered, character data comes freed of entities and possibly in pieces. Views live
+/// only for the call.
 class XMLEvents {
   public:
     virtual ~XMLEvents() = default;
@@ -32,8 +33,8 @@ class XMLReader {
     /// The bytes must outlive the reader.
     explicit XMLReader(Bytes document) : document_(document) {}
 
-    /// Reads everything; false when the document is not well-formed or the reading was aborted. Nothing escapes from
-    /// the events: what they throw aborts the reading.
+    /// Reads everything; false when the document is not well-formed or the reading was aborted. Nothing
+    /// escapes from the events: what they throw aborts the reading.
     bool read(XMLEvents& events);
 
     /// Ends the reading from inside an event.

@@ -47,7 +47,8 @@ Json AgentConnection::send(const platform::ValueWriter& writer) {
 
     sd_bus_error error{};
     sd_bus_message* answer = nullptr;
-    result = sd_bus_call(bus_, call, static_cast<uint64_t>(timeoutSeconds_ * kMicrosecondsPerSecond), &error, &answer);
+    result = sd_bus_call(bus_, call, static_cast<uint64_t>(timeoutSeconds_ * kMicrosecondsPerSecond), &error,
+                         &answer);
     const Message reply(answer, sd_bus_message_unref);
     if (result < 0) {
         const std::string text = explain(error, result);

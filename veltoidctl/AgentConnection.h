@@ -28,8 +28,8 @@ class AgentConnection {
     AgentConnection(const AgentConnection&) = delete;
     AgentConnection& operator=(const AgentConnection&) = delete;
 
-    /// Sends what `writer` writes (one dictionary) and returns the reply: dates as ISO 8601 text at UTC, data as base64
-    /// text. The request's memory is wiped. Throws Unreachable.
+    /// Sends what `writer` writes (one dictionary) and returns the reply: dates as ISO 8601 text at UTC, data
+    /// as base64 text. The request's memory is wiped. Throws Unreachable.
     Json send(const platform::ValueWriter& writer);
 
   private:

@@ -67,7 +67,8 @@ void printLine(const std::string& label, const Json& value) {
 }
 
 /// Prints the entries that the reply has, in the given order, under readable labels.
-void printEntries(const Json& dictionary, std::initializer_list<std::pair<const char*, const char*>> entries) {
+void printEntries(const Json& dictionary,
+                  std::initializer_list<std::pair<const char*, const char*>> entries) {
     for (const auto& [key, label] : entries)
         if (dictionary.contains(key)) printLine(label, dictionary[key]);
 }
@@ -79,10 +80,13 @@ std::string reasonOf(const Json& error) {
         if (information.contains(key)) return textOf(information[key]);
     if (information.contains("HWUnderlyingError")) return reasonOf(information["HWUnderlyingError"]);
     switch (error.value("Code", 0)) {
-        case -103: return "the server has asked not to be contacted for a while";
+        case -103:
+            return "the server has asked not to be contacted for a while";
         case -107:
-        case -108: return "there is no such account on this device";
-        default: return "the agent could not do it";
+        case -108:
+            return "there is no such account on this device";
+        default:
+            return "the agent could not do it";
     }
 }
 
@@ -93,7 +97,8 @@ void printRefusal(const Json& reply, const std::string& what) {
         return;
     }
     const Json& error = reply["error"];
-    std::cerr << reasonOf(error) << " (" << error.value("Domain", "?") << " " << error.value("Code", 0) << ")\n";
+    std::cerr << reasonOf(error) << " (" << error.value("Domain", "?") << " " << error.value("Code", 0)
+              << ")\n";
 }
 
 /// Prints the reply as JSON, the refusal, or what `print` makes of it.
@@ -131,7 +136,8 @@ int add(AgentConnection& agent, const Arguments& arguments) {
     const Json reply = send(agent, parts);
     const int status = present(reply, arguments, "add", [&](const Json& added) {
         if (added.contains("encDsId")) {
-            std::cout << arguments.account << " is added and signed in as " << textOf(added["encDsId"]) << "\n";
+            std::cout << arguments.account << " is added and signed in as " << textOf(added["encDsId"])
+                      << "\n";
         } else if (arguments.withoutSigningIn) {
             std::cout << arguments.account << " is added\n";
         }
@@ -144,9 +150,10 @@ int add(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int forget(AgentConnection& agent, const Arguments& arguments) {
-    return present(send(agent, {kForget, arguments.account, {}, {}}), arguments, "forget", [](const Json& reply) {
-        std::cout << textOf(reply.value("VeltoID", Json(""))) << " is forgotten\n";
-    });
+    return present(send(agent, {kForget, arguments.account, {}, {}}), arguments, "forget",
+                   [](const Json& reply) {
+                       std::cout << textOf(reply.value("VeltoID", Json(""))) << " is forgotten\n";
+                   });
 }
 
 int list(AgentConnection& agent, const Arguments& arguments) {
@@ -191,7 +198,8 @@ int status(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int verify(AgentConnection& agent, const Arguments& arguments) {
-    const RequestParts parts{kVerify, arguments.account, readPasswordHash(arguments.password, arguments.account), {}};
+    const RequestParts parts{
+        kVerify, arguments.account, readPasswordHash(arguments.password, arguments.account), {}};
     return present(send(agent, parts), arguments, "verify", [&](const Json&) {
         std::cout << "the server accepts the password of " << arguments.account << "\n";
     });
@@ -199,7 +207,8 @@ int verify(AgentConnection& agent, const Arguments& arguments) {
 
 int database(AgentConnection& agent, const Arguments& arguments) {
     return present(send(agent, {kDatabase, {}, {}, {}}), arguments, "database", [](const Json& reply) {
-        std::cout << reply.value("result", Json::object()).dump(2, ' ', false, Json::error_handler_t::replace) << "\n";
+        std::cout << reply.value("result", Json::object()).dump(2, ' ', false, Json::error_handler_t::replace)
+                  << "\n";
     });
 }
 

@@ -15,7 +15,8 @@ namespace {
 
 constexpr size_t kMaxPasswordBytes = 4'096;
 
-/// Reads up to the line's end, byte by byte: what follows belongs to somebody else. No buffer but this one sees it.
+/// Reads up to the line's end, byte by byte: what follows belongs to somebody else. No buffer but this one
+/// sees it.
 platform::SecretText readLine(int descriptor) {
     platform::SecretText line;
     line.reserve(kMaxPasswordBytes);
@@ -83,9 +84,12 @@ platform::SecretText hashOf(const platform::SecretText& password) {
 
 platform::SecretText readPasswordHash(PasswordSource source, const std::string& account) {
     switch (source) {
-        case PasswordSource::HashedStandardInput: return readLine(STDIN_FILENO);
-        case PasswordSource::StandardInput: return hashOf(readLine(STDIN_FILENO));
-        case PasswordSource::Prompt: break;
+        case PasswordSource::HashedStandardInput:
+            return readLine(STDIN_FILENO);
+        case PasswordSource::StandardInput:
+            return hashOf(readLine(STDIN_FILENO));
+        case PasswordSource::Prompt:
+            break;
     }
     return hashOf(promptFor(account));
 }

@@ -16,8 +16,8 @@ enum class PasswordSource {
     HashedStandardInput,
 };
 
-/// The password hash to send: lower-case hexadecimal SHA-256 of the UTF-8 password. Everything read is wiped. Throws
-/// std::runtime_error when there is no terminal to ask at, or no line.
+/// The password hash to send: lower-case hexadecimal SHA-256 of the UTF-8 password. Everything read is wiped.
+/// Throws std::runtime_error when there is no terminal to ask at, or no line.
 platform::SecretText readPasswordHash(PasswordSource source, const std::string& account);
 
 }  // namespace veltoidctl

@@ -16,7 +16,8 @@ constexpr double kDefaultTimeout = 30;
 
 using Command = int (*)(AgentConnection&, const Arguments&);
 
-CLI::App* addCommand(CLI::App& application, const char* name, const char* purpose, Command command, Command& chosen) {
+CLI::App* addCommand(CLI::App& application, const char* name, const char* purpose, Command command,
+                     Command& chosen) {
     CLI::App* sub = application.add_subcommand(name, purpose);
     sub->callback([command, &chosen] { chosen = command; });
     return sub;
@@ -32,9 +33,9 @@ void takesPassword(CLI::App* command, Arguments& arguments) {
         "--password-stdin", [&] { arguments.password = PasswordSource::StandardInput; },
         "read the password from standard input instead of asking for it");
     command
-        ->add_flag_callback("--hashed-password-stdin",
-                            [&] { arguments.password = PasswordSource::HashedStandardInput; },
-                            "read the password's hash from standard input and pass it on as it is")
+        ->add_flag_callback(
+            "--hashed-password-stdin", [&] { arguments.password = PasswordSource::HashedStandardInput; },
+            "read the password's hash from standard input and pass it on as it is")
         ->excludes(plain);
 }
 
@@ -54,17 +55,20 @@ int run(int argc, char** argv) {
         ->check(CLI::Range(0.1, 3'600.0));
 
     addCommand(application, "ping", "see whether the agent answers", ping, chosen);
-    CLI::App* addAccount = addCommand(application, "add", "add an account, or give it a new password", add, chosen);
+    CLI::App* addAccount =
+        addCommand(application, "add", "add an account, or give it a new password", add, chosen);
     takesAccount(addAccount, arguments);
     takesPassword(addAccount, arguments);
     addAccount->add_flag("--no-sign-in", arguments.withoutSigningIn, "store it without asking the server");
-    takesAccount(addCommand(application, "forget", "take an account off this device", forget, chosen), arguments);
+    takesAccount(addCommand(application, "forget", "take an account off this device", forget, chosen),
+                 arguments);
     addCommand(application, "list", "list the accounts", list, chosen);
     CLI::App* showInfo = addCommand(application, "info", "show who an account is", info, chosen);
     takesAccount(showInfo, arguments, false);
     showInfo->add_flag("--refresh", arguments.refresh, "ask the server even if the information is fresh");
     addCommand(application, "status", "show the accounts' states and what happens next", status, chosen);
-    CLI::App* verifyPassword = addCommand(application, "verify", "check a password with the server", verify, chosen);
+    CLI::App* verifyPassword =
+        addCommand(application, "verify", "check a password with the server", verify, chosen);
     takesAccount(verifyPassword, arguments);
     takesPassword(verifyPassword, arguments);
     addCommand(application, "database", "dump the account database", database, chosen);

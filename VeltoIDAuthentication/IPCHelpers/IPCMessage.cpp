@@ -32,7 +32,8 @@ void IPCMessage::setValue(const String& key, const Value& value) {
     auto* dictionary = message_ ? std::get_if<MessageDictionary>(&message_->content) : nullptr;
     if (dictionary == nullptr || !key || value.isAbsent()) return;
     MessageValue converted = messageFromValue(value);
-    if (!std::holds_alternative<std::monostate>(converted.content)) dictionary->set(key, std::move(converted));
+    if (!std::holds_alternative<std::monostate>(converted.content))
+        dictionary->set(key, std::move(converted));
 }
 
 Value IPCMessage::copyValue(std::string_view key, std::optional<Value::Kind> expectedKind) const {
@@ -57,12 +58,14 @@ Error IPCMessage::copyError() const {
     Error communication{kIdentityErrorDomain, identity_error::kAgentCommunicationFailure, {}};
     if (isError()) {
         const String& description = std::get<MessageError>(message_->content).description;
-        communication.userInfo.set(kErrorDescriptionKey,
-                                   String(describe(description ? MessageValue{description} : MessageValue{})));
+        communication.userInfo.set(
+            kErrorDescriptionKey, String(describe(description ? MessageValue{description} : MessageValue{})));
     }
     return communication;
 }
 
-bool IPCMessage::isError() const { return message_ && std::holds_alternative<MessageError>(message_->content); }
+bool IPCMessage::isError() const {
+    return message_ && std::holds_alternative<MessageError>(message_->content);
+}
 
 }  // namespace veltoid

@@ -31,18 +31,19 @@ class IPCMessage {
     /// Stores the value under `key`, replacing an entry, when both are given and the value can be carried.
     void setValue(const String& key, const Value& value);
 
-    /// The entry, converted; absent when there is none, when it cannot be converted, or when it is not of the expected
-    /// kind.
+    /// The entry, converted; absent when there is none, when it cannot be converted, or when it is not of the
+    /// expected kind.
     Value copyValue(std::string_view key, std::optional<Value::Kind> expectedKind = std::nullopt) const;
 
-    /// The String under `key`, in lower case (by the current locale) when it contains any of the letters A to Z.
+    /// The String under `key`, in lower case (by the current locale) when it contains any of the letters A to
+    /// Z.
     String copyAccountName(std::string_view key) const;
 
     /// Stores the error as a dictionary under "error".
     void setError(const Error& error);
 
-    /// The error that a reply carries; one of code -11 when it carries none, with the description of a connection-level
-    /// error when it is one.
+    /// The error that a reply carries; one of code -11 when it carries none, with the description of a
+    /// connection-level error when it is one.
     Error copyError() const;
 
     /// Whether the message is a connection-level error.

@@ -76,9 +76,9 @@ std::string describeDate(double seconds) {
     const auto whole = static_cast<time_t>(std::clamp(seconds, 0.0, 6e16));
     if (!(seconds > 0) || gmtime_r(&whole, &calendar) == nullptr) return {};
     char text[64];
-    const int length = std::snprintf(text, sizeof text, "%.4d/%.2d/%.2d %.2d:%.2d:%.2d ", calendar.tm_year + 1900,
-                                     calendar.tm_mon + 1, calendar.tm_mday, calendar.tm_hour, calendar.tm_min,
-                                     calendar.tm_sec);
+    const int length = std::snprintf(text, sizeof text, "%.4d/%.2d/%.2d %.2d:%.2d:%.2d ",
+                                     calendar.tm_year + 1900, calendar.tm_mon + 1, calendar.tm_mday,
+                                     calendar.tm_hour, calendar.tm_min, calendar.tm_sec);
     return {text, static_cast<size_t>(length)};
 }
 
@@ -133,16 +133,26 @@ Value valueFromMessage(const MessageValue& value) {
 
 MessageValue messageFromValue(const Value& value) {
     switch (value.kind()) {
-        case Value::Kind::Null: return {MessageNull()};
-        case Value::Kind::Boolean: return {*value.asBoolean()};
-        case Value::Kind::Number: return numberToMessage(value);
-        case Value::Kind::Date: return {MessageDate{*value.asDate()}};
-        case Value::Kind::String: return {value.asString()};
-        case Value::Kind::Data: return {value.asData()};
-        case Value::Kind::Array: return arrayToMessage(*value.asArray());
-        case Value::Kind::Dictionary: return dictionaryToMessage(*value.asDictionary());
-        case Value::Kind::UUID: return {MessageUUID{*value.asUUID()}};
-        default: return {};
+        case Value::Kind::Null:
+            return {MessageNull()};
+        case Value::Kind::Boolean:
+            return {*value.asBoolean()};
+        case Value::Kind::Number:
+            return numberToMessage(value);
+        case Value::Kind::Date:
+            return {MessageDate{*value.asDate()}};
+        case Value::Kind::String:
+            return {value.asString()};
+        case Value::Kind::Data:
+            return {value.asData()};
+        case Value::Kind::Array:
+            return arrayToMessage(*value.asArray());
+        case Value::Kind::Dictionary:
+            return dictionaryToMessage(*value.asDictionary());
+        case Value::Kind::UUID:
+            return {MessageUUID{*value.asUUID()}};
+        default:
+            return {};
     }
 }
 

@@ -47,21 +47,21 @@ struct MessageOther {
 
 /// One value of a message; the empty first alternative is no value at all.
 struct MessageValue {
-    std::variant<std::monostate, MessageNull, bool, int64_t, uint64_t, double, String, Data, MessageDate, MessageArray,
-                 MessageDictionary, MessageError, MessageConnection, MessageUUID, MessageFileDescriptor,
-                 MessageSharedMemory, MessageOther>
+    std::variant<std::monostate, MessageNull, bool, int64_t, uint64_t, double, String, Data, MessageDate,
+                 MessageArray, MessageDictionary, MessageError, MessageConnection, MessageUUID,
+                 MessageFileDescriptor, MessageSharedMemory, MessageOther>
         content;
 };
 
-/// The agent's value of the same kind; absent for kinds that it has none for. Entries and elements without a form are
-/// left out.
+/// The agent's value of the same kind; absent for kinds that it has none for. Entries and elements without a
+/// form are left out.
 Value valueFromMessage(const MessageValue& value);
 
 /// The message value of the same kind; none for what messages do not carry.
 MessageValue messageFromValue(const Value& value);
 
-/// A text of the value for logs: containers in brackets, strings in quotes but not escaped, data as hexadecimal, dates as
-/// UTC calendar time.
+/// A text of the value for logs: containers in brackets, strings in quotes but not escaped, data as
+/// hexadecimal, dates as UTC calendar time.
 std::string describe(const MessageValue& value);
 
 /// Writes the value in the platform's event form; what that does not carry becomes null.

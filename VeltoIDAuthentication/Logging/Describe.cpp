@@ -20,8 +20,8 @@ struct ErrorName {
     const char* name;
 };
 
-/// Codes of kIdentityErrorDomain; the first entry of a code names it. The last names of -101 and -102 belong to the
-/// same failures seen from a client's side and are never printed.
+/// Codes of kIdentityErrorDomain; the first entry of a code names it. The last names of -101 and -102 belong
+/// to the same failures seen from a client's side and are never printed.
 constexpr ErrorName kErrorNames[] = {
     {-100, "kHWIdentityVeltoIDUnknownError"},
     {-99, "kHWIdentityInvalidParametersErr"},
@@ -45,9 +45,9 @@ constexpr ErrorName kErrorNames[] = {
 };
 
 constexpr const char* kTrustResultNames[] = {
-    "TrustResultInvalid",     "TrustResultProceed",
-    "TrustResultConfirm",     "TrustResultDeny",
-    "TrustResultUnspecified", "TrustResultRecoverableTrustFailure",
+    "TrustResultInvalid",           "TrustResultProceed",
+    "TrustResultConfirm",           "TrustResultDeny",
+    "TrustResultUnspecified",       "TrustResultRecoverableTrustFailure",
     "TrustResultFatalTrustFailure", "TrustResultOtherError",
 };
 
@@ -88,8 +88,9 @@ bool lessIgnoringCase(std::string_view a, std::string_view b) {
 void appendDictionary(std::string& text, const Dictionary& dictionary) {
     std::vector<const Dictionary::Entry*> entries;
     for (const Dictionary::Entry& entry : dictionary) entries.push_back(&entry);
-    std::stable_sort(entries.begin(), entries.end(),
-                     [](const auto* a, const auto* b) { return lessIgnoringCase(a->key.view(), b->key.view()); });
+    std::stable_sort(entries.begin(), entries.end(), [](const auto* a, const auto* b) {
+        return lessIgnoringCase(a->key.view(), b->key.view());
+    });
     text += "{ ";
     bool first = true;
     for (const Dictionary::Entry* entry : entries) {
@@ -140,8 +141,8 @@ void appendDate(std::string& text, double date) {
     }
     std::array<char, 64> buffer{};
     const int length = std::snprintf(buffer.data(), buffer.size(), "%04d/%02d/%02d %02d:%02d:%02d",
-                                     calendar.tm_year + 1900, calendar.tm_mon + 1, calendar.tm_mday, calendar.tm_hour,
-                                     calendar.tm_min, calendar.tm_sec);
+                                     calendar.tm_year + 1900, calendar.tm_mon + 1, calendar.tm_mday,
+                                     calendar.tm_hour, calendar.tm_min, calendar.tm_sec);
     text.append(buffer.data(), static_cast<size_t>(length));
 }
 
@@ -171,9 +172,14 @@ void appendRawNumber(std::string& text, uint64_t number) {
 void appendNumber(std::string& text, const Value& number) {
     switch (*number.numberKind()) {
         case NumberKind::Float32:
-        case NumberKind::Float64: appendFloating(text, *number.asDouble()); break;
-        case NumberKind::UInt64: appendRawNumber(text, *number.asUInt64()); break;
-        default: text += std::to_string(*number.asInt64());
+        case NumberKind::Float64:
+            appendFloating(text, *number.asDouble());
+            break;
+        case NumberKind::UInt64:
+            appendRawNumber(text, *number.asUInt64());
+            break;
+        default:
+            text += std::to_string(*number.asInt64());
     }
 }
 
@@ -245,19 +251,45 @@ struct ObjectWriter {
 
 void append(std::string& text, const Value& value) {
     switch (value.kind()) {
-        case Value::Kind::Absent: text += "[ NULL ] "; break;
-        case Value::Kind::Null: text += "NULL"; break;
-        case Value::Kind::Boolean: text += *value.asBoolean() ? "true" : "false"; break;
-        case Value::Kind::Number: appendNumber(text, value); break;
-        case Value::Kind::Date: appendDate(text, *value.asDate()); break;
-        case Value::Kind::String: appendQuoted(text, *value.asText()); break;
-        case Value::Kind::Data: appendData(text, value.asData().bytes()); break;
-        case Value::Kind::Array: appendArray(text, *value.asArray()); break;
-        case Value::Kind::Dictionary: appendDictionary(text, *value.asDictionary()); break;
-        case Value::Kind::URL: appendURL(text, *value.asURL()); break;
-        case Value::Kind::UUID: appendData(text, *value.asUUID()); break;
-        case Value::Kind::Error: appendError(text, *value.asError()); break;
-        case Value::Kind::Object: std::visit(ObjectWriter{text}, value.asObject()->description); break;
+        case Value::Kind::Absent:
+            text += "[ NULL ] ";
+            break;
+        case Value::Kind::Null:
+            text += "NULL";
+            break;
+        case Value::Kind::Boolean:
+            text += *value.asBoolean() ? "true" : "false";
+            break;
+        case Value::Kind::Number:
+            appendNumber(text, value);
+            break;
+        case Value::Kind::Date:
+            appendDate(text, *value.asDate());
+            break;
+        case Value::Kind::String:
+            appendQuoted(text, *value.asText());
+            break;
+        case Value::Kind::Data:
+            appendData(text, value.asData().bytes());
+            break;
+        case Value::Kind::Array:
+            appendArray(text, *value.asArray());
+            break;
+        case Value::Kind::Dictionary:
+            appendDictionary(text, *value.asDictionary());
+            break;
+        case Value::Kind::URL:
+            appendURL(text, *value.asURL());
+            break;
+        case Value::Kind::UUID:
+            appendData(text, *value.asUUID());
+            break;
+        case Value::Kind::Error:
+            appendError(text, *value.asError());
+            break;
+        case Value::Kind::Object:
+            std::visit(ObjectWriter{text}, value.asObject()->description);
+            break;
     }
 }
 
@@ -278,7 +310,10 @@ void appendEscapedBytes(std::string& text, const char* bytes, size_t length) {
             text += "(null)";
         } else {
             text += '\\';
-            text += byte == '\t' ? 't' : byte == '\n' ? 'n' : byte == '\r' ? 'r' : static_cast<char>(byte + 96);
+            text += byte == '\t'   ? 't'
+                    : byte == '\n' ? 'n'
+                    : byte == '\r' ? 'r'
+                                   : static_cast<char>(byte + 96);
         }
     }
 }

@@ -27,8 +27,9 @@ void write(int level, const std::string& text, platform::LogOrigin origin) {
 /// Passes by the level filter: a log without the moment of its start is hard to read.
 void writeStartBanner() {
     std::ostringstream banner;
-    banner << kPrefix << "Starting logging for veltoidauthentication " << std::string(46, '*') << " euid=" << geteuid()
-           << " uid=" << getuid() << " BUILT approximately " << __DATE__ << " " << __TIME__;
+    banner << kPrefix << "Starting logging for veltoidauthentication " << std::string(46, '*')
+           << " euid=" << geteuid() << " uid=" << getuid() << " BUILT approximately " << __DATE__ << " "
+           << __TIME__;
     write(log_level::kInfo, banner.str(), {});
 }
 
@@ -50,7 +51,8 @@ bool logLevelEnabled(int level) {
     return level >= 0 && level <= 7 && ((kLevelMask >> static_cast<unsigned>(level)) & 1U) != 0;
 }
 
-void logLine(int level, const char* sourcePath, const char* functionName, int lineNumber, const char* message) {
+void logLine(int level, const char* sourcePath, const char* functionName, int lineNumber,
+             const char* message) {
     openOnce();
     platform::transactions::began();
     const std::string* label = platform::WorkQueue::currentLabel();

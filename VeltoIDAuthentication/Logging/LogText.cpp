@@ -48,7 +48,8 @@ std::string maskedFront(const std::vector<std::string_view>& characters, size_t 
 
 std::string maskedName(std::string_view name) {
     const std::vector<std::string_view> characters = charactersOf(name);
-    const auto at = static_cast<size_t>(std::find(characters.begin(), characters.end(), "@") - characters.begin());
+    const auto at =
+        static_cast<size_t>(std::find(characters.begin(), characters.end(), "@") - characters.begin());
     std::string front = maskedFront(characters, at);
     const size_t domain = front.find('@');
     if (domain == std::string::npos) return front;

@@ -215,9 +215,8 @@ void appendXMLRPCBase64(platform::SecretText& text, platform::Bytes bytes, bool 
 
 String xmlrpcBase64Encode(platform::Bytes bytes, bool separateLines) {
     const size_t lineLength = separateLines ? kXMLRPCLineLength : 0;
-    return String::writtenBy(brokenSize(bytes.size(), lineLength, kXMLRPCLineBreak), [=](char* out) {
-        writeBroken(bytes, lineLength, kXMLRPCLineBreak, out);
-    });
+    return String::writtenBy(brokenSize(bytes.size(), lineLength, kXMLRPCLineBreak),
+                             [=](char* out) { writeBroken(bytes, lineLength, kXMLRPCLineBreak, out); });
 }
 
 Data xmlrpcBase64Decode(std::string_view text) {

@@ -17,11 +17,13 @@ struct Fields {
 bool readFields(const char* text, Fields& f) {
     int end = -1;
     // NOLINTBEGIN(cert-err34-c): fields are range-checked afterwards
-    if (std::sscanf(text, "%ld-%ld-%ldT%ld:%ld:%ldZ%n", &f.year, &f.month, &f.day, &f.hour, &f.minute, &f.second,
-                    &end) == 6 && end >= 0)
+    if (std::sscanf(text, "%ld-%ld-%ldT%ld:%ld:%ldZ%n", &f.year, &f.month, &f.day, &f.hour, &f.minute,
+                    &f.second, &end) == 6 &&
+        end >= 0)
         return true;
     for (const char* format : {"%ld-%ld-%ldT%ld:%ld:%ld%ld", "%ld-%ld-%ld %ld:%ld:%ld %ld"})
-        if (std::sscanf(text, format, &f.year, &f.month, &f.day, &f.hour, &f.minute, &f.second, &f.offset) == 7)
+        if (std::sscanf(text, format, &f.year, &f.month, &f.day, &f.hour, &f.minute, &f.second, &f.offset) ==
+            7)
             return true;
     // NOLINTEND(cert-err34-c)
     return false;
@@ -30,15 +32,16 @@ bool readFields(const char* text, Fields& f) {
 /// Seconds since 1970 of the fields as a time at UTC; none when they are no date or time.
 std::optional<double> wallClockOf(const Fields& f) {
     // A leap second is read as the second after it.
-    if (f.year < 1 || f.year > 9'999 || f.month < 1 || f.month > 12 || f.day < 1 || f.day > 31 || f.hour < 0 ||
-        f.hour > 23 || f.minute < 0 || f.minute > 59 || f.second < 0 || f.second > 60)
+    if (f.year < 1 || f.year > 9'999 || f.month < 1 || f.month > 12 || f.day < 1 || f.day > 31 ||
+        f.hour < 0 || f.hour > 23 || f.minute < 0 || f.minute > 59 || f.second < 0 || f.second > 60)
         return std::nullopt;
     const std::chrono::year_month_day date{std::chrono::year(static_cast<int>(f.year)),
                                            std::chrono::month(static_cast<unsigned>(f.month)),
                                            std::chrono::day(static_cast<unsigned>(f.day))};
     if (!date.ok()) return std::nullopt;
     const std::chrono::sys_seconds midnight = std::chrono::sys_days(date);
-    return static_cast<double>(midnight.time_since_epoch().count() + f.hour * 3'600 + f.minute * 60 + f.second);
+    return static_cast<double>(midnight.time_since_epoch().count() + f.hour * 3'600 + f.minute * 60 +
+                               f.second);
 }
 
 }  // namespace

@@ -18,8 +18,8 @@ double getDouble(const Dictionary* dictionary, std::string_view key, double defa
 /// The pairs whose key and value are both present, in the order given; none when no pair is complete.
 std::optional<Dictionary> makeDictionary(std::initializer_list<std::pair<String, Value>> pairs);
 
-/// `base` with every entry of `additions`, which replace existing ones only with `replace`. An absent side yields the
-/// other one.
+/// `base` with every entry of `additions`, which replace existing ones only with `replace`. An absent side
+/// yields the other one.
 std::optional<Dictionary> mergeDictionaries(const std::optional<Dictionary>& base,
                                             const std::optional<Dictionary>& additions, bool replace);
 
@@ -32,8 +32,8 @@ bool applyToArray(const Array* array, const std::function<bool(const Value&)>& f
 bool applyToDictionary(const Dictionary* dictionary,
                        const std::function<bool(const String& key, const Value& value)>& function);
 
-/// The elements of a set, each once. True for an empty set; otherwise as applyToArray. The elements are held for the
-/// duration.
+/// The elements of a set, each once. True for an empty set; otherwise as applyToArray. The elements are held
+/// for the duration.
 bool applyToSet(const Array& elements, const std::function<bool(const Value&)>& function);
 
 }  // namespace veltoid

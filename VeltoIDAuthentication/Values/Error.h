@@ -60,16 +60,16 @@ struct ErrorTexts {
     String recoverySuggestion;
 };
 
-/// An error of kIdentityErrorDomain whose user information is a copy of `userInfo` plus the given texts and "function",
-/// "file" ("-" when null) and "line". Any thread.
+/// An error of kIdentityErrorDomain whose user information is a copy of `userInfo` plus the given texts and
+/// "function", "file" ("-" when null) and "line". Any thread.
 Error makeError(int64_t code, const ErrorTexts& texts, const Dictionary& userInfo, const char* function,
                 const char* file, int line);
 
 /// "Domain", "Code" and "UserInfo", an underlying error being converted too.
 Dictionary errorToDictionary(const Error& error);
 
-/// None unless "Domain" is a String and "Code" an integer Number. An underlying-error entry that is no Dictionary is
-/// kept as it is.
+/// None unless "Domain" is a String and "Code" an integer Number. An underlying-error entry that is no
+/// Dictionary is kept as it is.
 std::optional<Error> dictionaryToError(const Value& dictionary);
 
 /// Fills the out-parameter when there is one.

@@ -5,7 +5,8 @@
 
 namespace veltoid {
 
-/// The decoded text between the BEGIN and END lines; a text without them is decoded whole. Null when nothing is left.
+/// The decoded text between the BEGIN and END lines; a text without them is decoded whole. Null when nothing
+/// is left.
 Data pemBodyToData(const String& text);
 
 }  // namespace veltoid

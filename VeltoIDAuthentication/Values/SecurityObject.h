@@ -1,4 +1,5 @@
-// Certificates, keys, identities and trust evaluations as values: what the log formatter needs to know of them.
+// Certificates, keys, identities and trust evaluations as values: what the log formatter needs to know of
+// them.
 #pragma once
 
 #include <memory>
@@ -37,7 +38,8 @@ struct UnknownDescription {
 };
 
 struct SecurityObject {
-    std::variant<CertificateDescription, KeyDescription, IdentityDescription, TrustDescription, UnknownDescription>
+    std::variant<CertificateDescription, KeyDescription, IdentityDescription, TrustDescription,
+                 UnknownDescription>
         description;
 
     friend bool operator==(const SecurityObject& a, const SecurityObject& b) { return &a == &b; }

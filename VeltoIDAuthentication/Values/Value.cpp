@@ -370,26 +370,46 @@ Value Value::object(SecurityObject object) {
 
 Value::Value(const Value& other) noexcept : kind_(other.kind_), numberKind_(other.numberKind_) {
     switch (kind_) {
-        case Kind::String: new (&payload_.string) veltoid::String(other.payload_.string); break;
-        case Kind::Data: new (&payload_.data) veltoid::Data(other.payload_.data); break;
-        case Kind::Array: new (&payload_.array) veltoid::Array(other.payload_.array); break;
-        case Kind::Dictionary: new (&payload_.dictionary) veltoid::Dictionary(other.payload_.dictionary); break;
+        case Kind::String:
+            new (&payload_.string) veltoid::String(other.payload_.string);
+            break;
+        case Kind::Data:
+            new (&payload_.data) veltoid::Data(other.payload_.data);
+            break;
+        case Kind::Array:
+            new (&payload_.array) veltoid::Array(other.payload_.array);
+            break;
+        case Kind::Dictionary:
+            new (&payload_.dictionary) veltoid::Dictionary(other.payload_.dictionary);
+            break;
         case Kind::URL:
         case Kind::UUID:
         case Kind::Error:
-        case Kind::Object: new (&payload_.box) Box(other.payload_.box); break;
+        case Kind::Object:
+            new (&payload_.box) Box(other.payload_.box);
+            break;
         default:
-            std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_), sizeof payload_);
+            std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_),
+                        sizeof payload_);
     }
 }
 
 void Value::releasePayload() noexcept {
     switch (kind_) {
-        case Kind::String: payload_.string.~String(); break;
-        case Kind::Data: payload_.data.~Data(); break;
-        case Kind::Array: payload_.array.~Array(); break;
-        case Kind::Dictionary: payload_.dictionary.~Dictionary(); break;
-        default: payload_.box.~Box();
+        case Kind::String:
+            payload_.string.~String();
+            break;
+        case Kind::Data:
+            payload_.data.~Data();
+            break;
+        case Kind::Array:
+            payload_.array.~Array();
+            break;
+        case Kind::Dictionary:
+            payload_.dictionary.~Dictionary();
+            break;
+        default:
+            payload_.box.~Box();
     }
 }
 
@@ -402,7 +422,9 @@ std::optional<std::string_view> Value::asText() const {
 
 Data Value::asData() const { return kind_ == Kind::Data ? payload_.data : veltoid::Data(); }
 const Array* Value::asArray() const { return kind_ == Kind::Array ? &payload_.array : nullptr; }
-const Dictionary* Value::asDictionary() const { return kind_ == Kind::Dictionary ? &payload_.dictionary : nullptr; }
+const Dictionary* Value::asDictionary() const {
+    return kind_ == Kind::Dictionary ? &payload_.dictionary : nullptr;
+}
 
 std::optional<bool> Value::asBoolean() const {
     if (kind_ != Kind::Boolean) return std::nullopt;
@@ -439,16 +461,21 @@ std::optional<NumberKind> Value::numberKind() const {
 }
 
 bool Value::isFloating() const {
-    return kind_ == Kind::Number && (numberKind_ == NumberKind::Float32 || numberKind_ == NumberKind::Float64);
+    return kind_ == Kind::Number &&
+           (numberKind_ == NumberKind::Float32 || numberKind_ == NumberKind::Float64);
 }
 
 std::optional<double> Value::asDouble() const {
     if (kind_ != Kind::Number) return std::nullopt;
     switch (numberKind_) {
-        case NumberKind::Float64: return payload_.real;
-        case NumberKind::Float32: return static_cast<double>(payload_.single);
-        case NumberKind::UInt64: return static_cast<double>(payload_.unsignedInteger);
-        default: return static_cast<double>(payload_.integer);
+        case NumberKind::Float64:
+            return payload_.real;
+        case NumberKind::Float32:
+            return static_cast<double>(payload_.single);
+        case NumberKind::UInt64:
+            return static_cast<double>(payload_.unsignedInteger);
+        default:
+            return static_cast<double>(payload_.integer);
     }
 }
 
@@ -496,15 +523,24 @@ bool operator==(const Value& a, const Value& b) {
     if (a.kind_ != b.kind_) return false;
     switch (a.kind_) {
         case Value::Kind::Absent:
-        case Value::Kind::Null: return true;
-        case Value::Kind::Boolean: return a.payload_.boolean == b.payload_.boolean;
-        case Value::Kind::Number: return sameNumber(a, b);
-        case Value::Kind::Date: return a.payload_.real == b.payload_.real;
-        case Value::Kind::String: return a.payload_.string == b.payload_.string;
-        case Value::Kind::Data: return a.payload_.data == b.payload_.data;
-        case Value::Kind::Array: return a.payload_.array == b.payload_.array;
-        case Value::Kind::Dictionary: return a.payload_.dictionary == b.payload_.dictionary;
-        default: return a.payload_.box->content == b.payload_.box->content;
+        case Value::Kind::Null:
+            return true;
+        case Value::Kind::Boolean:
+            return a.payload_.boolean == b.payload_.boolean;
+        case Value::Kind::Number:
+            return sameNumber(a, b);
+        case Value::Kind::Date:
+            return a.payload_.real == b.payload_.real;
+        case Value::Kind::String:
+            return a.payload_.string == b.payload_.string;
+        case Value::Kind::Data:
+            return a.payload_.data == b.payload_.data;
+        case Value::Kind::Array:
+            return a.payload_.array == b.payload_.array;
+        case Value::Kind::Dictionary:
+            return a.payload_.dictionary == b.payload_.dictionary;
+        default:
+            return a.payload_.box->content == b.payload_.box->content;
     }
 }
 

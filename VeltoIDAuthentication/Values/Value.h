@@ -1,17 +1,17 @@
 // Values: what records, options, requests, replies and server parameters are made of.
 //
-// A Value is a small handle on something immutable: copying one, or a whole section of the database, costs a reference.
-// Array and Dictionary are handles too; changing one copies its entries once if somebody else holds them. Texts and data
-// are wiped when their last handle goes, since any of them may be a secret.
+// A Value is a small handle on something immutable: copying one, or a whole section of the database, costs a
+// reference. Array and Dictionary are handles too; changing one copies its entries once if somebody else
+// holds them. Texts and data are wiped when their last handle goes, since any of them may be a secret.
 //
-// A value of the wrong type counts as absent: typed getters return null, none or a default and never throw. Handles of
-// the same content may be used from different threads; one handle belongs to one thread at a time.
+// A value of the wrong type counts as absent: typed getters return null, none or a default and never throw.
+// Handles of the same content may be used from different threads; one handle belongs to one thread at a time.
 #pragma once
 
 #include <array>
 #include <atomic>
-#include <cstring>
 #include <cstdint>
+#include <cstring>
 #include <initializer_list>
 #include <memory>
 #include <optional>
@@ -172,7 +172,8 @@ class Array {
     detail::Handle<detail::ArrayNode> node_;
 };
 
-/// String keys to values; iterates in the order in which keys were first set. Look-up is constant time at any size.
+/// String keys to values; iterates in the order in which keys were first set. Look-up is constant time at any
+/// size.
 class Dictionary {
   public:
     struct Entry;
@@ -240,14 +241,14 @@ class Value {
 
     /// The absent value.
     Value() = default;
-    Value(String text);          // NOLINT(google-explicit-constructor)
+    Value(String text);  // NOLINT(google-explicit-constructor)
     Value(const char* text) : Value(String(text)) {}
     Value(std::string_view text) : Value(String(text)) {}
     Value(const std::string& text) : Value(String(text)) {}
-    Value(Data data);            // NOLINT(google-explicit-constructor)
-    Value(Array array);          // NOLINT(google-explicit-constructor)
+    Value(Data data);              // NOLINT(google-explicit-constructor)
+    Value(Array array);            // NOLINT(google-explicit-constructor)
     Value(Dictionary dictionary);  // NOLINT(google-explicit-constructor)
-    Value(Error error);          // NOLINT(google-explicit-constructor)
+    Value(Error error);            // NOLINT(google-explicit-constructor)
     Value(bool) = delete;
     Value(int) = delete;
 
@@ -332,11 +333,13 @@ class Value {
 
     static Value boxed(Kind kind, detail::BoxNode* node);
 
-    /// Every member is one word or a single counted pointer, so that the bytes can move without a count changing.
+    /// Every member is one word or a single counted pointer, so that the bytes can move without a count
+    /// changing.
     void take(Value& other) noexcept {
         kind_ = other.kind_;
         numberKind_ = other.numberKind_;
-        std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_), sizeof payload_);
+        std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_),
+                    sizeof payload_);
         other.kind_ = Kind::Absent;
     }
     void reset() noexcept {

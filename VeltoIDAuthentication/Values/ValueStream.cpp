@@ -5,10 +5,17 @@ namespace {
 
 void writeNumber(const Value& value, platform::ValueSink& sink) {
     switch (*value.numberKind()) {
-        case NumberKind::Float64: sink.real(*value.asDouble()); break;
-        case NumberKind::Float32: sink.singleReal(static_cast<float>(*value.asDouble())); break;
-        case NumberKind::UInt64: sink.unsignedInteger(*value.asUInt64()); break;
-        default: sink.integer(*value.asInt64());
+        case NumberKind::Float64:
+            sink.real(*value.asDouble());
+            break;
+        case NumberKind::Float32:
+            sink.singleReal(static_cast<float>(*value.asDouble()));
+            break;
+        case NumberKind::UInt64:
+            sink.unsignedInteger(*value.asUInt64());
+            break;
+        default:
+            sink.integer(*value.asInt64());
     }
 }
 
@@ -25,19 +32,34 @@ void writeDictionary(const Dictionary& dictionary, platform::ValueSink& sink) {
 
 void writeValue(const Value& value, platform::ValueSink& sink) {
     switch (value.kind()) {
-        case Value::Kind::Boolean: sink.boolean(*value.asBoolean()); break;
-        case Value::Kind::Number: writeNumber(value, sink); break;
-        case Value::Kind::Date: sink.date(*value.asDate()); break;
-        case Value::Kind::String: sink.string(*value.asText()); break;
-        case Value::Kind::Data: sink.data(value.asData().bytes()); break;
-        case Value::Kind::UUID: sink.uuid(*value.asUUID()); break;
+        case Value::Kind::Boolean:
+            sink.boolean(*value.asBoolean());
+            break;
+        case Value::Kind::Number:
+            writeNumber(value, sink);
+            break;
+        case Value::Kind::Date:
+            sink.date(*value.asDate());
+            break;
+        case Value::Kind::String:
+            sink.string(*value.asText());
+            break;
+        case Value::Kind::Data:
+            sink.data(value.asData().bytes());
+            break;
+        case Value::Kind::UUID:
+            sink.uuid(*value.asUUID());
+            break;
         case Value::Kind::Array:
             sink.beginArray();
             for (const Value& element : *value.asArray()) writeValue(element, sink);
             sink.endArray();
             break;
-        case Value::Kind::Dictionary: writeDictionary(*value.asDictionary(), sink); break;
-        default: sink.null();
+        case Value::Kind::Dictionary:
+            writeDictionary(*value.asDictionary(), sink);
+            break;
+        default:
+            sink.null();
     }
 }
 

@@ -20,19 +20,32 @@ const double kLaunchTime = platform::Clock::shared().now();
 /// Null for a state that clients have no name for.
 String nameOf(AccountState state) {
     switch (state) {
-        case AccountState::NoEncodedDSID: return "NoEncodedDSID";
-        case AccountState::PasswordInaccessibleInKeychain: return "PasswordInaccessibleInKeychain";
-        case AccountState::PasswordInvalid: return "PasswordInvalid";
-        case AccountState::NoCertificate: return "NoCertificate";
-        case AccountState::CertificateRevoked: return "CertificateRevoked";
-        case AccountState::CertificateExpired: return "CertificateExpired";
-        case AccountState::Unknown: return "Unknown";
-        case AccountState::CertificateOK: return "CertificateOK";
-        case AccountState::CertificateAssumedOK: return "CertificateAssumedOK";
-        case AccountState::CertificateShouldBeRenewed: return "CertificateShouldBeRenewed";
-        case AccountState::CertificateMustBeRenewed: return "CertificateMustBeRenewed";
-        case AccountState::ValidationRecordNeedsToBeUpdated: return "VeltoIDValidationRecordNeedsToBeUpdated";
-        case AccountState::CertificatePending: return "CertificatePending";
+        case AccountState::NoEncodedDSID:
+            return "NoEncodedDSID";
+        case AccountState::PasswordInaccessibleInKeychain:
+            return "PasswordInaccessibleInKeychain";
+        case AccountState::PasswordInvalid:
+            return "PasswordInvalid";
+        case AccountState::NoCertificate:
+            return "NoCertificate";
+        case AccountState::CertificateRevoked:
+            return "CertificateRevoked";
+        case AccountState::CertificateExpired:
+            return "CertificateExpired";
+        case AccountState::Unknown:
+            return "Unknown";
+        case AccountState::CertificateOK:
+            return "CertificateOK";
+        case AccountState::CertificateAssumedOK:
+            return "CertificateAssumedOK";
+        case AccountState::CertificateShouldBeRenewed:
+            return "CertificateShouldBeRenewed";
+        case AccountState::CertificateMustBeRenewed:
+            return "CertificateMustBeRenewed";
+        case AccountState::ValidationRecordNeedsToBeUpdated:
+            return "VeltoIDValidationRecordNeedsToBeUpdated";
+        case AccountState::CertificatePending:
+            return "CertificatePending";
     }
     return nullptr;
 }
@@ -100,7 +113,8 @@ Dictionary copyAccountStatusesDictionary(const Dictionary& options) {
     if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(false, false)) status.set("DirtyAccounts", *dirty);
     if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(false, true))
         status.set("DirtyAccountsAndCertificates", *dirty);
-    for (const std::string_view key : {kVeltoIDMetaLastSuccessfulConnectKey, kVeltoIDMetaLastConnectAttemptKey})
+    for (const std::string_view key :
+         {kVeltoIDMetaLastSuccessfulConnectKey, kVeltoIDMetaLastConnectAttemptKey})
         status.set(key, __VeltoIDDBCopyMetaInfoValue(nullptr, options, key));
     status.set("LaunchTime", Value::date(kLaunchTime));
     if (const auto next = nextLaunchDate()) status.set("NextLaunchTime", Value::date(*next));

@@ -11,9 +11,9 @@ double launchTime();
 /// "DeviceUnlockedSinceBoot".
 Dictionary copyDeviceStatusDictionary();
 
-/// "AccountStatuses" by account name, "DirtyAccounts", "DirtyAccountsAndCertificates", "LastSuccessfulConnect",
-/// "LastConnectAttempt", "LaunchTime", "NextLaunchTime", "pid" and the device's status, each when there is one. Client's
-/// queue.
+/// "AccountStatuses" by account name, "DirtyAccounts", "DirtyAccountsAndCertificates",
+/// "LastSuccessfulConnect", "LastConnectAttempt", "LaunchTime", "NextLaunchTime", "pid" and the device's
+/// status, each when there is one. Client's queue.
 Dictionary copyAccountStatusesDictionary(const Dictionary& options);
 
 }  // namespace veltoid

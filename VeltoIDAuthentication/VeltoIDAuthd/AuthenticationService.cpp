@@ -85,8 +85,8 @@ Outcome addAccount(Request& request) {
     Outcome outcome;
     String encDsId;
     std::optional<Dictionary> record;
-    outcome.success = __VeltoIDDoAddVeltoID(request.account(), request.string("hashedpassword"), request.options(),
-                                            &encDsId, &record, &outcome.error);
+    outcome.success = __VeltoIDDoAddVeltoID(request.account(), request.string("hashedpassword"),
+                                            request.options(), &encDsId, &record, &outcome.error);
     countFor(nullptr, request, kVeltoIDAddVeltoIDCountKey);
     if (!outcome.success) return outcome;
     __VeltoIDDBSetAccountValue(request.account(), kVeltoIDAccountLastValidationDateKey, Value::null(), true);
@@ -144,9 +144,10 @@ Outcome copyAllContents(Request& request) {
 
 void terminateAfterReply() {
     platform::WorkQueue::main().asyncAfter(kTerminationDelay, [] {
-        VELTOID_LOG_FROM(kHandlerName, kNotice,
-                         "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
-                         "request.");
+        VELTOID_LOG_FROM(
+            kHandlerName, kNotice,
+            "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
+            "request.");
         platform::message_service::flush();
         platform::event_loop::exitProcess(EXIT_SUCCESS);
     });
@@ -155,7 +156,8 @@ void terminateAfterReply() {
 Outcome status(Request& request) {
     const bool terminates = getBool(&request.options(), "VeltoIDAuthenticationStatusTerminateServer", false);
     if (terminates) computeRelaunchFromAccounts();
-    request.answer("status", terminates ? copyDeviceStatusDictionary() : copyAccountStatusesDictionary(request.options()));
+    request.answer("status", terminates ? copyDeviceStatusDictionary()
+                                        : copyAccountStatusesDictionary(request.options()));
     if (terminates) terminateAfterReply();
     return {true, {}};
 }
@@ -169,14 +171,15 @@ constexpr int64_t kPingCommand = 0x1;
 constexpr int64_t kTerminateCommand = 0x9999;
 
 constexpr Command kCommands[] = {
-    {kPingCommand, ping},       {0xFE, setValueOrFail},  {0xFF, setValueIfPossible}, {0x120, addAccount},
-    {0x130, getMyInfo},         {0x150, listAccounts},   {0x160, forgetAccount},     {0x180, verifyPassword},
-    {0x500, copyAllContents},   {0x510, status},
+    {kPingCommand, ping},     {0xFE, setValueOrFail}, {0xFF, setValueIfPossible}, {0x120, addAccount},
+    {0x130, getMyInfo},       {0x150, listAccounts},  {0x160, forgetAccount},     {0x180, verifyPassword},
+    {0x500, copyAllContents}, {0x510, status},
 };
 
 Outcome dispatch(Request& request) {
-    const auto* command = std::find_if(std::begin(kCommands), std::end(kCommands),
-                                       [&](const Command& known) { return known.number == request.command(); });
+    const auto* command = std::find_if(std::begin(kCommands), std::end(kCommands), [&](const Command& known) {
+        return known.number == request.command();
+    });
     return command != std::end(kCommands) ? command->run(request) : Outcome();
 }
 
@@ -193,6 +196,8 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
     request.finish(outcome.success, outcome.error);
 }
 
-bool isAnsweredAtOnce(platform::IncomingMessage& message) { return message.peekInteger("command") == kPingCommand; }
+bool isAnsweredAtOnce(platform::IncomingMessage& message) {
+    return message.peekInteger("command") == kPingCommand;
+}
 
 }  // namespace veltoid

@@ -1,5 +1,5 @@
-// The requests of the authentication service: each unpacks its arguments, calls one operation of the engine or the
-// database, and packs the answer.
+// The requests of the authentication service: each unpacks its arguments, calls one operation of the engine
+// or the database, and packs the answer.
 #pragma once
 
 #include "Platform/MessageService.h"

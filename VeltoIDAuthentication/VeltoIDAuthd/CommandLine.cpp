@@ -8,22 +8,39 @@ namespace veltoid {
 
 std::optional<CommandLine> parseCommandLine(int argc, char* const* argv, CommandLineError& error) {
     static const option kOptions[] = {
-        {"checkpassword", no_argument, nullptr, 'c'},     {"authentication", no_argument, nullptr, 'a'},
-        {"authServiceName", required_argument, nullptr, 's'}, {"leaks", no_argument, nullptr, 'l'},
-        {"prefsFile", required_argument, nullptr, 'f'},   {"noprefsfile", no_argument, nullptr, 'F'},
+        {"checkpassword", no_argument, nullptr, 'c'},
+        {"authentication", no_argument, nullptr, 'a'},
+        {"authServiceName", required_argument, nullptr, 's'},
+        {"leaks", no_argument, nullptr, 'l'},
+        {"prefsFile", required_argument, nullptr, 'f'},
+        {"noprefsfile", no_argument, nullptr, 'F'},
         {nullptr, 0, nullptr, 0},
     };
     CommandLine line;
     optind = 0;
     for (int option = 0; (option = getopt_long(argc, argv, "acs:lf:F", kOptions, nullptr)) != -1;) {
         switch (option) {
-            case 'c': line.checkPassword = true; break;
-            case 'a': line.authentication = true; break;
-            case 's': line.authenticationServiceName = optarg; break;
-            case 'l': line.leaks = true; break;
-            case 'f': line.preferencesDomainName = optarg; break;
-            case 'F': line.usePreferences = false; break;
-            default: error = {option, optind}; return std::nullopt;
+            case 'c':
+                line.checkPassword = true;
+                break;
+            case 'a':
+                line.authentication = true;
+                break;
+            case 's':
+                line.authenticationServiceName = optarg;
+                break;
+            case 'l':
+                line.leaks = true;
+                break;
+            case 'f':
+                line.preferencesDomainName = optarg;
+                break;
+            case 'F':
+                line.usePreferences = false;
+                break;
+            default:
+                error = {option, optind};
+                return std::nullopt;
         }
     }
     line.argumentsAfterOptions = argc - optind;

@@ -19,15 +19,18 @@ using RequestHandler = void (*)(platform::IncomingMessage& message);
 
 void serve(PeerConnection& peer, RequestHandler handle) {
     peer.setTargetQueue(platform::WorkQueue("client " + std::to_string(peer.processID())));
-    // The queue ends with the last event that uses it, so the end of the connection needs no action of its own.
+    // The queue ends with the last event that uses it, so the end of the connection needs no action of its
+    // own.
     peer.setEventHandler([handle](const platform::PeerEvent& event) {
-        if (const auto* message = std::get_if<std::shared_ptr<platform::IncomingMessage>>(&event)) handle(**message);
+        if (const auto* message = std::get_if<std::shared_ptr<platform::IncomingMessage>>(&event))
+            handle(**message);
     });
     peer.setAnsweredAtOnce(isAnsweredAtOnce);
     peer.resume();
 }
 
-/// Anything but the notice that the process is about to be ended means that clients may not reach it any more.
+/// Anything but the notice that the process is about to be ended means that clients may not reach it any
+/// more.
 void handleAuthenticationListenerError(ConnectionError error) {
     if (error != ConnectionError::TerminationImminent) computeRelaunchFromAccounts();
     __VeltoIDDBSynchronize();
@@ -49,8 +52,8 @@ void registerAuthenticationListener(const std::string& serviceName) {
 
 void registerPasswordCheckListener() {
     const Transaction keepAlive("registerPasswordCheckListener");
-    const auto listener =
-        platform::Listener::create(kVeltoIDPasswordCheckServiceName, [](const platform::ListenerEvent& event) {
+    const auto listener = platform::Listener::create(
+        kVeltoIDPasswordCheckServiceName, [](const platform::ListenerEvent& event) {
             if (const auto* peer = std::get_if<std::shared_ptr<PeerConnection>>(&event))
                 serve(**peer, handlePasswordCheckIPCMessage);
         });

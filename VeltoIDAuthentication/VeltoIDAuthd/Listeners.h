@@ -1,4 +1,5 @@
-// The named services: each client connection gets a serial queue of its own, on which its requests are handled.
+// The named services: each client connection gets a serial queue of its own, on which its requests are
+// handled.
 #pragma once
 
 #include <string>

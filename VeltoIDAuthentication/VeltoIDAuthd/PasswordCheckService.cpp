@@ -26,10 +26,14 @@ bool run(const Request& request, ErrorOut error) {
     constexpr int64_t kVerifyPassword = 0x180;
     constexpr int64_t kUpdateLinkedIdentity = 400;
     switch (request.command()) {
-        case kPing: return true;
-        case kVerifyPassword: return verifyRequestedPassword(request, error);
-        case kUpdateLinkedIdentity: return updateLinkedIdentity(request, error);
-        default: return false;
+        case kPing:
+            return true;
+        case kVerifyPassword:
+            return verifyRequestedPassword(request, error);
+        case kUpdateLinkedIdentity:
+            return updateLinkedIdentity(request, error);
+        default:
+            return false;
     }
 }
 
@@ -47,7 +51,8 @@ bool verifyRequestedPassword(const Request& request, ErrorOut error) {
     const String password = request.string("hashedpassword");
     return request.account() && password &&
            __VeltoIDDoVerifyPassword(request.account(), password,
-                                     request.optionsWith("DoNotSaveSessionInfo", Value::boolean(true)), error);
+                                     request.optionsWith("DoNotSaveSessionInfo", Value::boolean(true)),
+                                     error);
 }
 
 void setLinkedIdentityHandler(LinkedIdentityHandler handler) { linkedIdentityHandler() = std::move(handler); }

@@ -1,4 +1,5 @@
-// The password-check service: a ping, the verification of a password, and the provisioning of a linked identity.
+// The password-check service: a ping, the verification of a password, and the provisioning of a linked
+// identity.
 #pragma once
 
 #include <functional>

@@ -1,4 +1,5 @@
-// When the agent is to be started again: it may be ended whenever nothing is pending, so it tells the service manager first.
+// When the agent is to be started again: it may be ended whenever nothing is pending, so it tells the service
+// manager first.
 #pragma once
 
 #include <optional>
@@ -7,13 +8,13 @@
 
 namespace veltoid {
 
-/// Asks for a relaunch at `date` (seconds since 1970; none or not positive: no particular time). Without `force` a date that
-/// is later than the one already asked for changes nothing. Any queue: the work is done on the main queue, inside a
-/// transaction.
+/// Asks for a relaunch at `date` (seconds since 1970; none or not positive: no particular time). Without
+/// `force` a date that is later than the one already asked for changes nothing. Any queue: the work is done
+/// on the main queue, inside a transaction.
 void scheduleRelaunch(std::optional<double> date, bool force);
 
-/// The names of the accounts for which an action is foreseen, and the earliest of their dates. Any queue but the main one's
-/// dependants: reads the database.
+/// The names of the accounts for which an action is foreseen, and the earliest of their dates. Any queue but
+/// the main one's dependants: reads the database.
 Array copyAccountsNeedingAction(std::optional<double>* earliestDate);
 
 /// Asks for a relaunch at the earliest next action, if there is one, and makes the database durable.

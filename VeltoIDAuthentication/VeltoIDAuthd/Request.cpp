@@ -27,7 +27,8 @@ Dictionary Request::optionsWith(std::string_view key, const Value& value) const 
 void Request::finish(bool success, const std::optional<Error>& error) {
     reply_.setValue("success", Value::boolean(success));
     if (!success && error) reply_.setError(*error);
-    message_.reply([reply = reply_.message()](platform::ValueSink& sink) { writeMessageValue(*reply, sink); });
+    message_.reply(
+        [reply = reply_.message()](platform::ValueSink& sink) { writeMessageValue(*reply, sink); });
 }
 
 }  // namespace veltoid

@@ -24,7 +24,9 @@ class Request {
     /// The options with one entry set.
     Dictionary optionsWith(std::string_view key, const Value& value) const;
 
-    String string(std::string_view key) const { return request_.copyValue(key, Value::Kind::String).asString(); }
+    String string(std::string_view key) const {
+        return request_.copyValue(key, Value::Kind::String).asString();
+    }
     Value value(std::string_view key) const { return request_.copyValue(key); }
 
     /// Adds an entry to the reply; an absent value adds nothing.

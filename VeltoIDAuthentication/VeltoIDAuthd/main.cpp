@@ -1,4 +1,5 @@
-// The agent: opens the log, reads the command line, registers its services and serves the main queue until it is ended.
+// The agent: opens the log, reads the command line, registers its services and serves the main queue until it
+// is ended.
 #include <sys/prctl.h>
 #include <sys/resource.h>
 
@@ -43,7 +44,8 @@ void keepMemoryPrivate() {
 }
 
 [[noreturn]] void exitWithUsage(int argc, char* const* argv, const CommandLineError& error) {
-    VELTOID_LOG_FROM("main", kError, "Got an unexpected argument; ch = " << error.option << " index=" << error.index);
+    VELTOID_LOG_FROM("main", kError,
+                     "Got an unexpected argument; ch = " << error.option << " index=" << error.index);
     std::printf("%s : [ --checkpassword ] [ --authentication ]\n", argc > 0 ? argv[0] : "unknown");
     platform::event_loop::exitProcess(-1);
 }
@@ -61,7 +63,8 @@ void terminate() {
     platform::WorkQueue::main().asyncAfter(kLongestTermination, exitOnce);
 }
 
-/// Without its bus the agent can be reached by nobody and hold up the end of a log-in session: it leaves as on SIGTERM.
+/// Without its bus the agent can be reached by nobody and hold up the end of a log-in session: it leaves as
+/// on SIGTERM.
 void leaveWithTheBus() { platform::message_service::onConnectionLost(terminate); }
 
 void handleSignals() {
@@ -74,7 +77,8 @@ void prepareDatabase(const CommandLine& line) {
     if (line.preferencesDomainName) __VeltoIDDBSetPreferencesDomainName(*line.preferencesDomainName);
     __VeltoIDDBSetUsePreferences(line.usePreferences);
     setUseSystemKeychain(line.usePreferences);
-    for (const auto& [key, value] : line.metaInfoValues) __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+    for (const auto& [key, value] : line.metaInfoValues)
+        __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
 }
 
 void startServices(const CommandLine& line) {
@@ -91,7 +95,8 @@ void forceValidationOfEveryAccount() {
     Array names;
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names)
-        __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true), true);
+        __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true),
+                                   true);
 }
 
 }  // namespace

@@ -29,7 +29,8 @@ bool hasPassword(const Dictionary& record) {
 bool keychainHoldsPassword(const Dictionary& record, const String& hashedPassword) {
     const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
     String stored;
-    return reference && copyPasswordFromKeychainGivenPersistentRef(reference, &stored) && stored == hashedPassword;
+    return reference && copyPasswordFromKeychainGivenPersistentRef(reference, &stored) &&
+           stored == hashedPassword;
 }
 
 /// Brings the password into the keychain and its reference into the record.
@@ -37,7 +38,8 @@ bool storePassword(const String& name, const String& hashedPassword, Dictionary&
     if (keychainHoldsPassword(record, hashedPassword)) {
         VELTOID_LOG_FROM("__VeltoIDDBCreateVeltoIDAccount", kNotice,
                          "Password being added for account "
-                             << name.view() << " matches password on keychain, so skipping over addPasswordToKeychain");
+                             << name.view()
+                             << " matches password on keychain, so skipping over addPasswordToKeychain");
         return true;
     }
     Data reference;
@@ -52,7 +54,8 @@ void markDirty(Dictionary& record) {
     record.set(kVeltoIDAccountModificationDateKey, now());
 }
 
-/// Applies one entry; true when it changes the record. Setting a key to Null that is not there changes nothing.
+/// Applies one entry; true when it changes the record. Setting a key to Null that is not there changes
+/// nothing.
 bool applyEntry(Dictionary& record, const String& key, const Value& value) {
     const Value& stored = record[key.view()];
     if (stored == value) return false;
@@ -134,11 +137,13 @@ bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut
     return true;
 }
 
-bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword, const String& encDsId) {
+bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword,
+                                     const String& encDsId) {
     if (!name) return false;
     return database::perform([&](Store& store) {
         const Dictionary* existing = Store::find(store.accounts, name);
-        Dictionary record = existing != nullptr ? *existing : Dictionary{{kVeltoIDAccountCreationDateKey, now()}};
+        Dictionary record =
+            existing != nullptr ? *existing : Dictionary{{kVeltoIDAccountCreationDateKey, now()}};
         record.set(kVeltoIDAccountNameKey, name);
         record.set(kVeltoIDAccountDSIDKey, encDsId);
         if (hashedPassword && !storePassword(name, hashedPassword, record)) return false;
@@ -202,7 +207,8 @@ bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, b
 
 bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, bool signal) {
     if (!key) return false;
-    return __VeltoIDDBSetAccountValues(name, {{key.view(), value.isAbsent() ? Value::null() : value}}, signal);
+    return __VeltoIDDBSetAccountValues(name, {{key.view(), value.isAbsent() ? Value::null() : value}},
+                                       signal);
 }
 
 Value __VeltoIDDBCopyAccountValue(const String& name, const String& key) {

@@ -1,7 +1,9 @@
-// Account records: the stored state of one identity account, in the section "Accounts" under the account's name.
+// Account records: the stored state of one identity account, in the section "Accounts" under the account's
+// name.
 //
-// Bodies run on the database queue; records come out as copies. "Writes" means to the preference store (Store.h); with
-// `signal` the change semaphore is signalled too. Errors are of domain HWIdentityErrorDomain unless said otherwise.
+// Bodies run on the database queue; records come out as copies. "Writes" means to the preference store
+// (Store.h); with `signal` the change semaphore is signalled too. Errors are of domain HWIdentityErrorDomain
+// unless said otherwise.
 #pragma once
 
 #include <optional>
@@ -14,7 +16,8 @@ namespace veltoid {
 /// The names of all accounts; -107 when there is none.
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error = nullptr);
 
-/// A copy of the first record that has a password (a reference or a hash of its own) and an encDsId, as far as required.
+/// A copy of the first record that has a password (a reference or a hash of its own) and an encDsId, as far
+/// as required.
 std::optional<Dictionary> __VeltoIDDBCopyFirstVeltoIDAccount(bool requirePassword, bool requireDSID);
 
 /// -99 for no name, -108 for no record.
@@ -23,18 +26,20 @@ bool __VeltoIDDBCopyVeltoIDAccount(const String& name, Dictionary* record, Error
 /// The name of the first account with that encDsId; -1 with texts when there is none.
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error = nullptr);
 
-/// Creates or updates the record; a password goes to the keychain, its reference into the record. Marks the record dirty
-/// and writes with signal. False, with the record as it was, when the keychain refuses the password.
+/// Creates or updates the record; a password goes to the keychain, its reference into the record. Marks the
+/// record dirty and writes with signal. False, with the record as it was, when the keychain refuses the
+/// password.
 bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword, const String& encDsId);
 
 /// The password hash of a record: from the keychain, else the record's own. Runs on the caller's thread.
 String __VeltoIDDBCopyHashedPassword(const Dictionary& record);
 
-/// Drops password and reference, deletes the keychain item, marks dirty, writes with signal. False without a record.
+/// Drops password and reference, deletes the keychain item, marks dirty, writes with signal. False without a
+/// record.
 bool __VeltoIDDBRemovePassword(const String& name);
 
-/// Sets every key whose value differs; Null removes. A change stamps "ModificationDate", with `signal` marks the record
-/// dirty (unless the values say otherwise), and is written. False without name, values or record.
+/// Sets every key whose value differs; Null removes. A change stamps "ModificationDate", with `signal` marks
+/// the record dirty (unless the values say otherwise), and is written. False without name, values or record.
 bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, bool signal);
 
 /// The same for one key; an absent value removes it.
@@ -43,15 +48,16 @@ bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Val
 /// The stored value, of whatever kind; absent when there is none.
 Value __VeltoIDDBCopyAccountValue(const String& name, const String& key);
 
-/// Removes the record only: keychain items and certificate entry stay. No name: status-code domain, -1; no record: -108.
+/// Removes the record only: keychain items and certificate entry stay. No name: status-code domain, -1; no
+/// record: -108.
 bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error = nullptr);
 
-/// The names of the dirty records; none when there are none. With `clear` the marks of all records go (of certificate
-/// entries too with `includeCertificates`), in memory until the section is next written.
+/// The names of the dirty records; none when there are none. With `clear` the marks of all records go (of
+/// certificate entries too with `includeCertificates`), in memory until the section is next written.
 std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates);
 
-/// Adds "AccountUUID" (random, once) and "AccountStableUUID" (from the name in lower case and the device's "UserUUID", once
-/// that exists) to the record where missing. True when it added one.
+/// Adds "AccountUUID" (random, once) and "AccountStableUUID" (from the name in lower case and the device's
+/// "UserUUID", once that exists) to the record where missing. True when it added one.
 bool __VeltoIDDBDeriveAccountUUIDs(const String& name, Dictionary& record);
 
 /// Whether the account's encDsId has a valid certificate entry.

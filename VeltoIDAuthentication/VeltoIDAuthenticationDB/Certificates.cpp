@@ -61,7 +61,8 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
     });
 }
 
-bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value, bool signal) {
+bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
+                                    bool signal) {
     if (!encDsId || !key) return false;
     return database::perform([&](Store& store) {
         const Dictionary* existing = Store::find(store.certificates, encDsId);

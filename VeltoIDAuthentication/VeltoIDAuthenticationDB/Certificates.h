@@ -1,5 +1,5 @@
-// Certificate entries: what is known of an account's client certificate, in the section "AuthCertificates" under the
-// account's encDsId. Bodies run on the database queue; entries come out as copies.
+// Certificate entries: what is known of an account's client certificate, in the section "AuthCertificates"
+// under the account's encDsId. Bodies run on the database queue; entries come out as copies.
 #pragma once
 
 #include <optional>
@@ -15,13 +15,15 @@ inline constexpr double kVeltoIDCertificateExpirationGrace = 86'400;
 /// The keys of all entries, possibly none. True.
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error = nullptr);
 
-/// Creates or updates the entry from the server's certificate result ("CertificateReference", "Expires", "CertStatus",
-/// "SerialNumber"); without one the entry is emptied. Marks it dirty and writes with signal. False without encDsId.
+/// Creates or updates the entry from the server's certificate result ("CertificateReference", "Expires",
+/// "CertStatus", "SerialNumber"); without one the entry is emptied. Marks it dirty and writes with signal.
+/// False without encDsId.
 bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Dictionary>& info);
 
-/// Sets one value, an absent or Null one removing it; a change stamps "ModificationDate", with `signal` marks the entry
-/// dirty, and is written. False without encDsId, key or entry.
-bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value, bool signal);
+/// Sets one value, an absent or Null one removing it; a change stamps "ModificationDate", with `signal` marks
+/// the entry dirty, and is written. False without encDsId, key or entry.
+bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
+                                    bool signal);
 
 /// True and a copy of the entry when there is one.
 bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, Dictionary* entry);

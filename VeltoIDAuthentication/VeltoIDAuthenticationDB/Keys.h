@@ -34,13 +34,15 @@ inline constexpr std::string_view kVeltoIDAccountLastValidationDateKey = "Valida
 inline constexpr std::string_view kVeltoIDAccountNextValidationDateKey = "NextValidationDate";
 inline constexpr std::string_view kVeltoIDAccountForceValidationKey = "ForceValidation";
 inline constexpr std::string_view kVeltoIDAccountCertificateTokenKey = "CertificateToken";
-inline constexpr std::string_view kVeltoIDAccountEarliestAllowedConnectionDateKey = "EarliestAllowedConnectionDate";
+inline constexpr std::string_view kVeltoIDAccountEarliestAllowedConnectionDateKey =
+    "EarliestAllowedConnectionDate";
 inline constexpr std::string_view kVeltoIDAccountClientTooOldKey = "ClientTooOld";
 inline constexpr std::string_view kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
 inline constexpr std::string_view kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
 inline constexpr std::string_view kVeltoIDAccountValidationRecordIdentifierKey =
     "VeltoIDAccountValidationRecordIdentifierKey";
-inline constexpr std::string_view kVeltoIDAccountValidationRecordDataKey = "VeltoIDAccountValidationRecordData";
+inline constexpr std::string_view kVeltoIDAccountValidationRecordDataKey =
+    "VeltoIDAccountValidationRecordData";
 inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckDateKey =
     "VeltoIDAccountValidationRecordNextCheckDateKey";
 inline constexpr std::string_view kVeltoIDAccountUUIDKey = "AccountUUID";
@@ -49,13 +51,15 @@ inline constexpr std::string_view kVeltoIDAccountServerURLKey = "ServerURL";
 inline constexpr std::string_view kVeltoIDDirtyKey = "Dirty";
 
 // Certificate entries.
-inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentReferenceKey = "CertificateReference";
+inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentReferenceKey =
+    "CertificateReference";
 inline constexpr std::string_view kVeltoIDCertificatePrivateKeyPersistentReferenceKey =
     "CertificatePrivateKeyReference";
 inline constexpr std::string_view kVeltoIDCertificateStatusKey = "CertStatus";
 inline constexpr std::string_view kVeltoIDCertificateExpirationDateKey = "Expires";
 inline constexpr std::string_view kVeltoIDCertificateSerialNumberKey = "SerialNumber";
-inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey = "LastSuccessfulValidation";
+inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey =
+    "LastSuccessfulValidation";
 
 /// Statuses that the certificate's validity depends on.
 inline constexpr std::string_view kVeltoIDCertificateStatusIssued = "CERT_ISSUED";
@@ -65,7 +69,8 @@ inline constexpr std::string_view kVeltoIDCertificateStatusInvalid = "CERTIFICAT
 inline constexpr std::string_view kVeltoIDMetaUserUUIDKey = "UserUUID";
 inline constexpr std::string_view kVeltoIDDBServerURLKey = "ServerURL";
 inline constexpr std::string_view kVeltoIDMetaPreExpirationIntervalKey = "PreExpirationInterval";
-inline constexpr std::string_view kVeltoIDMetaAccountPresumedValidIntervalKey = "AccountPresumedValidInterval";
+inline constexpr std::string_view kVeltoIDMetaAccountPresumedValidIntervalKey =
+    "AccountPresumedValidInterval";
 inline constexpr std::string_view kVeltoIDMetaSendServerMetaInformationItemsKey =
     "VeltoIDMetaSendServerMetaInformationItems";
 inline constexpr std::string_view kVeltoIDMetaSendServerAccountInformationItemsKey =
@@ -76,7 +81,8 @@ inline constexpr std::string_view kVeltoIDMetaAccountRequiresUserActionKey = "Ac
 
 // Counters of the meta information.
 inline constexpr std::string_view kVeltoIDMetaConnectionAttemptCountKey = "VeltoIDMetaConnectionAttemptCount";
-inline constexpr std::string_view kVeltoIDMetaSuccessfulConnectionCountKey = "VeltoIDMetaSuccessfulConnectionCount";
+inline constexpr std::string_view kVeltoIDMetaSuccessfulConnectionCountKey =
+    "VeltoIDMetaSuccessfulConnectionCount";
 inline constexpr std::string_view kVeltoIDMetaUnsuccessfulConnectionCountKey =
     "VeltoIDMetaUnsuccessfulConnectionCount";
 inline constexpr std::string_view kVeltoIDXMLAuthenticateCountKey = "VeltoIDXMLAuthenticateCount";

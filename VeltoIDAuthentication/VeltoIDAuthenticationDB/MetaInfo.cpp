@@ -64,8 +64,8 @@ bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const
     });
 }
 
-int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options, const String& key,
-                                            int64_t delta) {
+int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options,
+                                            const String& key, int64_t delta) {
     if (!key) return 0;
     const Value current = __VeltoIDDBCopyMetaInfoValue(section, options, key, Value::Kind::Number);
     const auto sum = static_cast<int64_t>(static_cast<uint64_t>(current.asInt64().value_or(0)) +

@@ -1,5 +1,6 @@
-// Meta information: device-wide values, intervals and switches from the server, counters, and per-account sections of the
-// same keys. Look-ups fall back to built-in defaults. Bodies run on the database queue; writes never signal.
+// Meta information: device-wide values, intervals and switches from the server, counters, and per-account
+// sections of the same keys. Look-ups fall back to built-in defaults. Bodies run on the database queue;
+// writes never signal.
 #pragma once
 
 #include <optional>
@@ -9,24 +10,27 @@
 namespace veltoid {
 
 /// Where the identity server is reached unless something else is set.
-inline constexpr std::string_view kVeltoIDDefaultServerURL = "https://identity.velto.example/dsservices/dsxmlrpc";
+inline constexpr std::string_view kVeltoIDDefaultServerURL =
+    "https://identity.velto.example/dsservices/dsxmlrpc";
 
 /// How long before its expiry a certificate is renewed (seconds), unless something else is set.
 inline constexpr double kVeltoIDDefaultPreExpirationInterval = 129'600.0;
 
-/// The value of `key`: from the options, the section's dictionary, the top level, the defaults; the first one of the
-/// required kind (a default of another kind ends the search). Absent when there is none. Null section: top level only.
+/// The value of `key`: from the options, the section's dictionary, the top level, the defaults; the first one
+/// of the required kind (a default of another kind ends the search). Absent when there is none. Null section:
+/// top level only.
 Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& options, const String& key,
                                    std::optional<Value::Kind> requiredKind = std::nullopt);
 
-/// Stores the value in the section's dictionary (created when missing), or at the top level without one; an absent or Null
-/// value removes it. False without key.
+/// Stores the value in the section's dictionary (created when missing), or at the top level without one; an
+/// absent or Null value removes it. False without key.
 bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const Value& value);
 
-/// Adds `delta` (wrapping) to the counter as the look-up finds it and stores it; the new value. Read and write are two
-/// operations, so that of two concurrent increments one may be lost. 0 and no change without key.
-int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options, const String& key,
-                                            int64_t delta);
+/// Adds `delta` (wrapping) to the counter as the look-up finds it and stores it; the new value. Read and
+/// write are two operations, so that of two concurrent increments one may be lost. 0 and no change without
+/// key.
+int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options,
+                                            const String& key, int64_t delta);
 
 /// The reportable meta information that has values; none when none has.
 std::optional<Dictionary> __VeltoIDDBCopyMetaInformation(const String& section, const Dictionary& options);

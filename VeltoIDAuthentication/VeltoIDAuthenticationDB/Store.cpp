@@ -78,7 +78,8 @@ Store& loadedStore() {
     static std::atomic<bool> loaded{false};
     if (!loaded.load(std::memory_order_acquire)) {
         queue().sync([] {
-            if (!loaded.load(std::memory_order_relaxed)) loaded.store(store().load(), std::memory_order_release);
+            if (!loaded.load(std::memory_order_relaxed))
+                loaded.store(store().load(), std::memory_order_release);
         });
     }
     return store();
@@ -120,13 +121,14 @@ bool Store::keepOrInitialize(const platform::Preferences& domain, const Value& v
     const std::optional<int64_t> number = version.asInt64();
     if (number && static_cast<uint64_t>(*number) >= static_cast<uint64_t>(kVeltoIDDBVersion)) return true;
     return domain.remove(domain.keys()) &&
-           domain.set({preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion)),
-                       preference(kVeltoIDDBCreationDateKey, Value::date(platform::Clock::shared().now()))}) &&
+           domain.set(
+               {preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion)),
+                preference(kVeltoIDDBCreationDateKey, Value::date(platform::Clock::shared().now()))}) &&
            domain.synchronize();
 }
 
-/// Puts right what the agents named in "AccessorVersions" left. True when something has to be written; the versions are
-/// cut where they were cut in the domain.
+/// Puts right what the agents named in "AccessorVersions" left. True when something has to be written; the
+/// versions are cut where they were cut in the domain.
 bool Store::migrate(const platform::Preferences& domain, Array& versions) {
     std::vector<Value> sorted(versions.begin(), versions.end());
     std::stable_sort(sorted.begin(), sorted.end(), descendingNumbers);
@@ -239,7 +241,9 @@ bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {
             for (const std::string& key : domain.keys())
                 all.set(String(key), database::readPreference(domain, key).value_or(Value()));
         } else {
-            all = {{"Accounts", store.accounts}, {"Certificates", store.certificates}, {"MetaInfo", store.metaInfo}};
+            all = {{"Accounts", store.accounts},
+                   {"Certificates", store.certificates},
+                   {"MetaInfo", store.metaInfo}};
         }
         return all;
     });

@@ -1,11 +1,12 @@
-// The account database: account records, certificate entries and meta information, loaded once from a preference domain,
-// written back section by section and flushed lazily.
+// The account database: account records, certificate entries and meta information, loaded once from a
+// preference domain, written back section by section and flushed lazily.
 //
-// Everything here belongs to one serial queue, VeltoIDDBQueue: public operations run their bodies on it synchronously and
-// never call each other from there. Bodies may call the keychain, which never calls back.
+// Everything here belongs to one serial queue, VeltoIDDBQueue: public operations run their bodies on it
+// synchronously and never call each other from there. Bodies may call the keychain, which never calls back.
 //
-// Changes reach the preference store at once and survive the process; making them durable on disk is put off for three
-// seconds, so that a burst of changes costs one flush, and a transaction keeps the agent alive until it has run.
+// Changes reach the preference store at once and survive the process; making them durable on disk is put off
+// for three seconds, so that a burst of changes costs one flush, and a transaction keeps the agent alive
+// until it has run.
 #pragma once
 
 #include <memory>
@@ -28,8 +29,8 @@ inline constexpr double kVeltoIDDBFlushDelay = 3.0;
 /// Uses the preference domain `name` instead of the default one. Called before any other database operation.
 void __VeltoIDDBSetPreferencesDomainName(const String& name);
 
-/// Whether the database is kept in preferences or in memory only. When it was kept so far, it is written first. Changing
-/// this after the first access does not load again.
+/// Whether the database is kept in preferences or in memory only. When it was kept so far, it is written
+/// first. Changing this after the first access does not load again.
 void __VeltoIDDBSetUsePreferences(bool usePreferences);
 
 /// The semaphore that changing operations signal when asked to.
@@ -38,8 +39,8 @@ void __VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore);
 /// Makes all changes durable on disk. True.
 bool __VeltoIDDBSynchronize();
 
-/// Every key of the preference domain with its value; without preferences the sections under "Accounts", "Certificates"
-/// and "MetaInfo". True.
+/// Every key of the preference domain with its value; without preferences the sections under "Accounts",
+/// "Certificates" and "MetaInfo". True.
 bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
 
 /// For the rooms of the database; their callers use the operations above and those of the other headers.
@@ -61,7 +62,8 @@ class Store {
     /// The record or entry under a key of a section; null when there is none or it is not a Dictionary.
     static const Dictionary* find(const Dictionary& section, const String& key);
 
-    /// Hands the selected sections to the preference store, plans the flush and signals the change semaphore if asked.
+    /// Hands the selected sections to the preference store, plans the flush and signals the change semaphore
+    /// if asked.
     void writeSections(const Sections& sections, bool signal);
 
   private:
@@ -91,8 +93,9 @@ class Store {
 
 platform::WorkQueue queue();
 
-/// The store, loaded. The first caller loads it before its body is queued; others wait for that. While the preference
-/// store cannot be read, the sections are empty and nothing is written, and each call tries to load again.
+/// The store, loaded. The first caller loads it before its body is queued; others wait for that. While the
+/// preference store cannot be read, the sections are empty and nothing is written, and each call tries to
+/// load again.
 Store& loadedStore();
 
 /// Runs `body(store)` on the database queue and returns its result.

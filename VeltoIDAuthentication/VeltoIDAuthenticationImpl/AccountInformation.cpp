@@ -39,8 +39,8 @@ class InformationRequest {
             markForValidation();
             return true;
         }
-        const bool mustAsk = option("ForceValidationRecordFetch") || option("ValidateCertificateSerialNumber") ||
-                             option("ForceValidation");
+        const bool mustAsk = option("ForceValidationRecordFetch") ||
+                             option("ValidateCertificateSerialNumber") || option("ForceValidation");
         if (mustAsk || !fresh || !isComplete()) return askServer(fresh);
         return true;
     }
@@ -54,7 +54,8 @@ class InformationRequest {
         for (const std::string_view key : {kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey})
             info.set(key, record_.string(key));
         if (const Array* all = record_.array(kVeltoIDAccountEmailAddressesKey)) info.set("AllEmails", *all);
-        for (const std::string_view key : {kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey})
+        for (const std::string_view key :
+             {kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey})
             if (const Array* items = record_.array(key)) info.set(key, *items);
         if (const auto date = record_.date(kVeltoIDAccountLastValidationDateKey))
             info.set(kVeltoIDAccountLastValidationDateKey, Value::date(*date));
@@ -79,8 +80,8 @@ class InformationRequest {
     }
 
     bool isFresh() const {
-        const Value stored = __VeltoIDDBCopyMetaInfoValue(name_, options_, kVeltoIDMetaAccountPresumedValidIntervalKey,
-                                                          Value::Kind::Number);
+        const Value stored = __VeltoIDDBCopyMetaInfoValue(
+            name_, options_, kVeltoIDMetaAccountPresumedValidIntervalKey, Value::Kind::Number);
         const double presumed = stored.asDouble().value_or(kVeltoIDPresumedValidInterval);
         double valid = presumed;
         if (const auto own = record_.number(kVeltoIDAccountValidForIntervalKey))
@@ -105,8 +106,8 @@ class InformationRequest {
     bool askServer(bool fresh) {
         std::optional<Error> sessionError;
         encDsId_ = nullptr;
-        Session session = __VeltoIDSessionDoCreateSession(name_, __VeltoIDDBCopyHashedPassword(record_), options_,
-                                                          &encDsId_, nullptr, &sessionError);
+        Session session = __VeltoIDSessionDoCreateSession(name_, __VeltoIDDBCopyHashedPassword(record_),
+                                                          options_, &encDsId_, nullptr, &sessionError);
         if (!session) {
             if (sessionError) held_ = sessionError;
             if (known_ && !fresh) markForValidation();
@@ -120,7 +121,8 @@ class InformationRequest {
     bool fetch(VeltoIDAuthenticationSessionInfo& session) {
         Dictionary result;
         std::optional<Error> fetchError;
-        if (_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result, &fetchError)) {
+        if (_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result,
+                                       &fetchError)) {
             updateAccountWithGetMyInfoResult(name_, result);
             return __VeltoIDDBCopyVeltoIDAccount(name_, &record_, &held_);
         }
@@ -162,7 +164,8 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
                          << accountName.view() << " dsID=" << describeValue(encDsId)
                          << "as invalid because the server said CertificateIsValid = false. ("
                          << describeValue(isValid));
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid, true);
+    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
+                                   true);
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey, Value::date(now()), true);
 }
 
@@ -170,8 +173,8 @@ bool bothPresentAndDifferent(const Value& before, const Value& after) {
     return !before.isAbsent() && !after.isAbsent() && before != after;
 }
 
-/// Record data is kept only with an identifier and a date at which it is looked at again; otherwise the stored one goes.
-/// True when the account has another record than before.
+/// Record data is kept only with an identifier and a date at which it is looked at again; otherwise the
+/// stored one goes. True when the account has another record than before.
 bool applyValidationRecord(const Dictionary& before, const Dictionary& answer, Dictionary& values) {
     constexpr std::string_view kRecordKeys[] = {kVeltoIDAccountValidationRecordIdentifierKey,
                                                 kVeltoIDAccountValidationRecordDataKey,
@@ -185,16 +188,18 @@ bool applyValidationRecord(const Dictionary& before, const Dictionary& answer, D
 }
 
 bool visibleDetailsChanged(const Dictionary& before, const Dictionary& values) {
-    constexpr std::string_view kVisibleKeys[] = {kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey,
-                                                 kVeltoIDAccountEmailAddressesKey, kVeltoIDAccountValidatedEmailKey,
-                                                 kVeltoIDAccountValidatedPhonesKey};
-    return std::any_of(std::begin(kVisibleKeys), std::end(kVisibleKeys),
-                       [&](std::string_view key) { return bothPresentAndDifferent(before[key], values[key]); });
+    constexpr std::string_view kVisibleKeys[] = {
+        kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey, kVeltoIDAccountEmailAddressesKey,
+        kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey};
+    return std::any_of(std::begin(kVisibleKeys), std::end(kVisibleKeys), [&](std::string_view key) {
+        return bothPresentAndDifferent(before[key], values[key]);
+    });
 }
 
 }  // namespace
 
-bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, Dictionary* result, ErrorOut error) {
+bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, Dictionary* result,
+                          ErrorOut error) {
     InformationRequest request(accountName, options);
     if (request.run()) {
         if (result != nullptr) *result = request.answer();

@@ -13,18 +13,19 @@ inline constexpr double kVeltoIDPresumedValidInterval = 28'800;
 /// The least that an account's own validity interval may be (seconds).
 inline constexpr double kVeltoIDLeastValidInterval = 60;
 
-/// Answers the account's information (names, addresses, phones, certificate) from its record, asking the server first when
-/// an option says so or the information is not both fresh and complete. Name null: the first account with a password.
+/// Answers the account's information (names, addresses, phones, certificate) from its record, asking the
+/// server first when an option says so or the information is not both fresh and complete. Name null: the
+/// first account with a password.
 ///
-/// Options (Booleans, default false): "SkipValidation" (never ask; answer fresh and complete information only),
-/// "DeferValidation" (do not ask now; answer complete information and mark the account), then "ForceValidationRecordFetch",
-/// "ValidateCertificateSerialNumber" and "ForceValidation" (ask). A server that cannot be reached does not fail a known
-/// account. Caller's queue; blocks while the server is asked.
+/// Options (Booleans, default false): "SkipValidation" (never ask; answer fresh and complete information
+/// only), "DeferValidation" (do not ask now; answer complete information and mark the account), then
+/// "ForceValidationRecordFetch", "ValidateCertificateSerialNumber" and "ForceValidation" (ask). A server that
+/// cannot be reached does not fail a known account. Caller's queue; blocks while the server is asked.
 bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, Dictionary* result,
                           ErrorOut error = nullptr);
 
-/// Applies the server's answer to the account's record and certificate entry, and posts the change notification when
-/// something that clients see changed.
+/// Applies the server's answer to the account's record and certificate entry, and posts the change
+/// notification when something that clients see changed.
 void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer);
 
 /// The names of all accounts, none being no error.

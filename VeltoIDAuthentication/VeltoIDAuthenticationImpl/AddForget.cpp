@@ -15,7 +15,9 @@
 namespace veltoid {
 namespace {
 
-std::string describeError(const std::optional<Error>& error) { return error ? describeValue(*error) : std::string(); }
+std::string describeError(const std::optional<Error>& error) {
+    return error ? describeValue(*error) : std::string();
+}
 
 bool isAlreadyOnItsWay(const String& accountName, const Dictionary& options) {
     return !getBool(&options, "ForceCertificateCreation", false) &&
@@ -23,7 +25,8 @@ bool isAlreadyOnItsWay(const String& accountName, const Dictionary& options) {
 }
 
 /// Signs in and fetches the account's information; null, with the error, when the sign-in failed.
-Session signIn(const String& accountName, const String& hashedPassword, const Dictionary& options, ErrorOut error) {
+Session signIn(const String& accountName, const String& hashedPassword, const Dictionary& options,
+               ErrorOut error) {
     String encDsId;
     Session session =
         __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, &encDsId, nullptr, error);

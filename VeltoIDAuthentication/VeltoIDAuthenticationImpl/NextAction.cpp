@@ -24,7 +24,9 @@ constexpr double kCSRGenerationInterval = 3'600;
 constexpr int32_t kFirstVersionWithValidationRecords = 101;
 
 double metaInterval(const String& accountName, std::string_view key, double defaultValue) {
-    return __VeltoIDDBCopyMetaInfoValue(accountName, {}, key, Value::Kind::Number).asDouble().value_or(defaultValue);
+    return __VeltoIDDBCopyMetaInfoValue(accountName, {}, key, Value::Kind::Number)
+        .asDouble()
+        .value_or(defaultValue);
 }
 
 /// The earliest of the dates that were considered.
@@ -74,7 +76,8 @@ class NextActionDate {
             earliest_.set(*date);
             return true;
         }
-        if (!embargo.isAbsent() || !record_.boolean(kVeltoIDAccountClientTooOldKey).value_or(false)) return false;
+        if (!embargo.isAbsent() || !record_.boolean(kVeltoIDAccountClientTooOldKey).value_or(false))
+            return false;
         earliest_.set(now_ + kNeverForOldClients);
         return true;
     }
@@ -85,8 +88,9 @@ class NextActionDate {
         } else if (const auto next = record_.date(kVeltoIDAccountNextValidationDateKey)) {
             earliest_.consider(next);
         } else {
-            earliest_.consider(record_.date(kVeltoIDAccountLastValidationDateKey),
-                               metaInterval(accountName_, "AccountValidationInterval", kAccountValidationInterval));
+            earliest_.consider(
+                record_.date(kVeltoIDAccountLastValidationDateKey),
+                metaInterval(accountName_, "AccountValidationInterval", kAccountValidationInterval));
         }
     }
 
@@ -119,7 +123,8 @@ class NextActionDate {
         if (nextFetch) {
             earliest_.consider(nextFetch);
         } else if (generated && *generated <= now_) {
-            earliest_.consider(generated, getDouble(&record_, "CSRGenerationInterval", kCSRGenerationInterval));
+            earliest_.consider(generated,
+                               getDouble(&record_, "CSRGenerationInterval", kCSRGenerationInterval));
         } else {
             earliest_.set(now_);
         }
@@ -149,10 +154,11 @@ AccountState checkAccountAndDetermineNextAction(const String& accountName, const
         return AccountState::PasswordInvalid;
     }
     if (!copyPasswordFromKeychainGivenPersistentRef(passwordReference, nullptr)) {
-        VELTOID_LOG(kNotice, "checkAccount: Velto ID "
-                                 << accountName.view()
-                                 << " doesn't have a password or the password has been removed from the keychain; no "
-                                    "next action.");
+        VELTOID_LOG(kNotice,
+                    "checkAccount: Velto ID "
+                        << accountName.view()
+                        << " doesn't have a password or the password has been removed from the keychain; no "
+                           "next action.");
         return AccountState::PasswordInaccessibleInKeychain;
     }
     const String encDsId = record.string(kVeltoIDAccountDSIDKey);

@@ -25,13 +25,13 @@ enum class AccountState : int {
     CertificatePending = 10,
 };
 
-/// The state of the account; Unknown comes with an error (-100) when no account was given, and without one for an account
-/// whose certificate would have to be examined. Caller's queue; no network.
+/// The state of the account; Unknown comes with an error (-100) when no account was given, and without one
+/// for an account whose certificate would have to be examined. Caller's queue; no network.
 AccountState checkAccountAndDetermineNextAction(const String& accountName, const Dictionary& options,
                                                 ErrorOut error = nullptr);
 
-/// When the account next needs attention (seconds since 1970; none: no action is foreseen). False for an account without
-/// password reference. Caller's queue.
+/// When the account next needs attention (seconds since 1970; none: no action is foreseen). False for an
+/// account without password reference. Caller's queue.
 bool copyNextActionDateForAccount(const String& accountName, std::optional<double>* date);
 
 }  // namespace veltoid

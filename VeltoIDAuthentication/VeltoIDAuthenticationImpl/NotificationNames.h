@@ -5,6 +5,7 @@ namespace veltoid {
 
 inline constexpr const char* kVeltoIDAccountAddedOrRemovedNotification =
     "HWVeltoIDAccountConfigurationAddedOrRemovedNotification";
-inline constexpr const char* kVeltoIDAccountChangeNotification = "HWVeltoIDAccountConfigurationChangeNotification";
+inline constexpr const char* kVeltoIDAccountChangeNotification =
+    "HWVeltoIDAccountConfigurationChangeNotification";
 
 }  // namespace veltoid

@@ -4,8 +4,8 @@
 
 namespace veltoid {
 
-bool __VeltoIDDoVerifyPassword(const String& accountName, const String& hashedPassword, const Dictionary& options,
-                               ErrorOut error) {
+bool __VeltoIDDoVerifyPassword(const String& accountName, const String& hashedPassword,
+                               const Dictionary& options, ErrorOut error) {
     if (!accountName || !hashedPassword) {
         fillError(error, VELTOID_ERROR(identity_error::kInvalidParameters));
         return false;
@@ -13,8 +13,8 @@ bool __VeltoIDDoVerifyPassword(const String& accountName, const String& hashedPa
     Dictionary signInOptions = options;
     signInOptions.set("DoNotUseCachedSession", Value::boolean(true));
     std::optional<Error> sessionError;
-    Session session = __VeltoIDSessionDoCreateSession(accountName, hashedPassword, signInOptions, nullptr, nullptr,
-                                                      &sessionError);
+    Session session = __VeltoIDSessionDoCreateSession(accountName, hashedPassword, signInOptions, nullptr,
+                                                      nullptr, &sessionError);
     if (session) {
         __VeltoIDSessionRelease(std::move(session));
         return true;

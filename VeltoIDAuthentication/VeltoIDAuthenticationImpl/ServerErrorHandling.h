@@ -7,9 +7,9 @@
 
 namespace veltoid {
 
-/// Removes the account's password, which disables the account until a client adds it again, when the server no longer
-/// supports this client (-105), refuses the password (-101) or has disabled the account (-102). Nothing for any other
-/// error or none. Caller's queue.
+/// Removes the account's password, which disables the account until a client adds it again, when the server
+/// no longer supports this client (-105), refuses the password (-101) or has disabled the account (-102).
+/// Nothing for any other error or none. Caller's queue.
 void handleServerError(const String& accountName, const std::optional<Error>& error);
 
 }  // namespace veltoid

@@ -29,7 +29,8 @@ std::vector<std::pair<Data, String>>& memoryItems() {
 
 auto findInMemory(const Data& reference) {
     auto& items = memoryItems();
-    return std::find_if(items.begin(), items.end(), [&](const auto& item) { return item.first == reference; });
+    return std::find_if(items.begin(), items.end(),
+                        [&](const auto& item) { return item.first == reference; });
 }
 
 Data dataOf(const PersistentReference& reference) { return Data(reference); }
@@ -65,7 +66,8 @@ std::string describeItemQuery(const Data& reference) {
     return describeValue(Dictionary{{"class", "genp"}, {"itemList", Array{reference}}});
 }
 
-/// Changes the item's password in place; an item that was bound to this device may move with its backup from then on.
+/// Changes the item's password in place; an item that was bound to this device may move with its backup from
+/// then on.
 bool updateItem(const Data& reference, const String& passwordHash) {
     VELTOID_LOG_FROM("addPasswordToKeychain", kError,
                      "Password already in keychain; updating it to (new) value.  persistentRef="
@@ -93,7 +95,8 @@ KeychainStatus addItem(const KeychainAttributes& attributes, const String& passw
     return status;
 }
 
-bool addOrUpdate(const String& accountName, const String& passwordHash, const String& label, Data* reference) {
+bool addOrUpdate(const String& accountName, const String& passwordHash, const String& label,
+                 Data* reference) {
     std::vector<PersistentReference> found;
     KeychainStatus status = platform::keychain::copyMatchingReferences(queryForAccount(accountName), &found);
     if (status == platform::kKeychainSuccess && !found.empty()) {

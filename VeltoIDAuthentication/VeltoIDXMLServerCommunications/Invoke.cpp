@@ -37,7 +37,9 @@ const String& frameworkVersionText() {
 }
 
 bool metaSwitchIsOn(const String& accountName, const Dictionary& options, std::string_view key) {
-    return __VeltoIDDBCopyMetaInfoValue(accountName, options, key, Value::Kind::Boolean).asBoolean().value_or(false);
+    return __VeltoIDDBCopyMetaInfoValue(accountName, options, key, Value::Kind::Boolean)
+        .asBoolean()
+        .value_or(false);
 }
 
 /// The server writes the text "NULL" where a value is to be removed.
@@ -67,8 +69,9 @@ void applyRelaunch(const Dictionary& reply) {
 
 void applyFlushAndExit(const Dictionary& reply) {
     if (!getBool(&reply, "FlushAndExit", false)) return;
-    VELTOID_LOG_FROM("xmlInvoke", kNotice,
-                     "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
+    VELTOID_LOG_FROM(
+        "xmlInvoke", kNotice,
+        "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
     __VeltoIDDBSynchronize();
     platform::event_loop::exitProcess(EXIT_SUCCESS);
 }
@@ -92,7 +95,8 @@ void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& 
 
 void setRelaunchScheduler(RelaunchScheduler scheduler) { relaunchScheduler() = std::move(scheduler); }
 
-Dictionary createCallParameters(const String& accountName, const String& sessionID, const Dictionary& options) {
+Dictionary createCallParameters(const String& accountName, const String& sessionID,
+                                const Dictionary& options) {
     Dictionary parameters;
     parameters.set("dsSession", sessionID);
     parameters.set("VeltoIDAuthProtocolVersion", Value::int64(kVeltoIDAuthProtocolVersion));
@@ -112,8 +116,8 @@ Dictionary createCallParameters(const String& accountName, const String& session
     return parameters;
 }
 
-bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName, const Dictionary& parameters,
-               std::optional<Dictionary>* result, ErrorOut error) {
+bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName,
+               const Dictionary& parameters, std::optional<Dictionary>* result, ErrorOut error) {
     std::optional<Dictionary> reply;
     const bool succeeded = xmlInvoke(session.fServerURL, methodName, parameters, &reply, error);
     if (succeeded && reply) applyCommands(session, *reply);

@@ -1,4 +1,5 @@
-// One remote call on a session: the parameters that every call carries, and the commands that any reply may carry.
+// One remote call on a session: the parameters that every call carries, and the commands that any reply may
+// carry.
 #pragma once
 
 #include <functional>
@@ -16,17 +17,19 @@ inline constexpr std::string_view kVeltoIDMethodPrefix = "com.velto.dir.idm.web.
 /// Protocol version that this agent speaks.
 inline constexpr int64_t kVeltoIDAuthProtocolVersion = 101;
 
-/// Hands down what the process does when a reply asks for a relaunch at a date (seconds since 1970). Set once, at start.
+/// Hands down what the process does when a reply asks for a relaunch at a date (seconds since 1970). Set
+/// once, at start.
 void setRelaunchScheduler(std::function<void(std::optional<double> date, bool force)> scheduler);
 
-/// A new dictionary of what every call carries: session identifier (when given), protocol and framework version, time,
-/// system, and the meta and account information that the server has asked for.
-Dictionary createCallParameters(const String& accountName, const String& sessionID, const Dictionary& options);
+/// A new dictionary of what every call carries: session identifier (when given), protocol and framework
+/// version, time, system, and the meta and account information that the server has asked for.
+Dictionary createCallParameters(const String& accountName, const String& sessionID,
+                                const Dictionary& options);
 
-/// Calls the method and applies the commands of the reply: validity of the session, meta and account information,
-/// relaunch, flush and exit. The result is absent when the reply is no Dictionary. On the session's queue; blocks for at
-/// most 5 seconds.
-bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName, const Dictionary& parameters,
-               std::optional<Dictionary>* result, ErrorOut error);
+/// Calls the method and applies the commands of the reply: validity of the session, meta and account
+/// information, relaunch, flush and exit. The result is absent when the reply is no Dictionary. On the
+/// session's queue; blocks for at most 5 seconds.
+bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName,
+               const Dictionary& parameters, std::optional<Dictionary>* result, ErrorOut error);
 
 }  // namespace veltoid

@@ -25,8 +25,8 @@ void spoil(VeltoIDAuthenticationSessionInfo& session) {
 }
 
 /// Calls the method with the common parameters and its own; the reply, or none and the translated error.
-std::optional<Dictionary> call(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
-                               const Dictionary& options, ErrorOut error) {
+std::optional<Dictionary> call(VeltoIDAuthenticationSessionInfo& session, const Method& method,
+                               const Dictionary& own, const Dictionary& options, ErrorOut error) {
     Dictionary parameters = createCallParameters(session.fAccountName, session.fSessionID, options);
     for (const auto& [key, value] : own) parameters.set(key, value);
 
@@ -74,7 +74,8 @@ Dictionary getMyInfoResult(const Dictionary& reply) {
     Dictionary result;
     takeValidationRecord(reply, result);
     for (const ReplyEntry& entry : kGetMyInfoEntries)
-        if (const Value& value = reply[entry.replyKey]; value.kind() == entry.kind) result.set(entry.resultKey, value);
+        if (const Value& value = reply[entry.replyKey]; value.kind() == entry.kind)
+            result.set(entry.resultKey, value);
     return result;
 }
 

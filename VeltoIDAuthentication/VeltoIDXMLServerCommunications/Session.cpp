@@ -76,8 +76,9 @@ void cacheSession(Session session) {
     globalQueue().sync([&] {
         auto& sessions = cachedSessions();
         const double now = platform::Clock::shared().now();
-        const auto expired = std::stable_partition(
-            sessions.begin(), sessions.end(), [&](const Session& cached) { return cached->isReusableAt(now); });
+        const auto expired =
+            std::stable_partition(sessions.begin(), sessions.end(),
+                                  [&](const Session& cached) { return cached->isReusableAt(now); });
         std::for_each(expired, sessions.end(), [](Session& cached) { destroySession(std::move(cached)); });
         sessions.erase(expired, sessions.end());
         sessions.push_back(std::move(session));

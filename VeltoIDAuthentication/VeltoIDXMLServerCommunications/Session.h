@@ -1,8 +1,9 @@
 // Sessions with the identity server: the record that a sign-in yields, and the queue of each account.
 //
-// All server traffic of an account runs on the account's own serial queue, so that two calls for one account never overlap
-// while different accounts proceed side by side. A session is built by the sign-in, lives with the engine while methods
-// run, and is given back with __VeltoIDSessionRelease: it is cached while the server lets it be reused, else destroyed.
+// All server traffic of an account runs on the account's own serial queue, so that two calls for one account
+// never overlap while different accounts proceed side by side. A session is built by the sign-in, lives with
+// the engine while methods run, and is given back with __VeltoIDSessionRelease: it is cached while the server
+// lets it be reused, else destroyed.
 #pragma once
 
 #include <memory>

@@ -5,7 +5,8 @@
 
 namespace veltoid {
 
-/// Takes the first session of exactly this account, password and server that is still valid; null when there is none.
+/// Takes the first session of exactly this account, password and server that is still valid; null when there
+/// is none.
 Session takeCachedSession(const String& accountName, const String& passwordHash, const String& serverURL);
 
 /// Keeps the session; those whose time has passed go.

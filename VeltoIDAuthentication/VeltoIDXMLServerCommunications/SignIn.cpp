@@ -45,7 +45,8 @@ class SignIn {
             count(kVeltoIDXMLSessionReusedCountKey);
         } else {
             if (mayConnect()) signInAnew(url);
-            if (!session_ && !held_) held_ = Error{String(kIdentityErrorDomain), identity_error::kSignInFailed, {}};
+            if (!session_ && !held_)
+                held_ = Error{String(kIdentityErrorDomain), identity_error::kSignInFailed, {}};
         }
         keepBooks();
     }
@@ -76,10 +77,11 @@ class SignIn {
     bool mayConnect() {
         if (!hasRecord_) return true;
         if (record_.boolean(kVeltoIDAccountClientTooOldKey).value_or(false)) {
-            VELTOID_LOG_FROM(kOperation, kNotice,
-                             "Not connecting to VeltoID authentication server because clientTooOld = true is set "
-                             "for this account "
-                                 << accountName_.view() << ".");
+            VELTOID_LOG_FROM(
+                kOperation, kNotice,
+                "Not connecting to VeltoID authentication server because clientTooOld = true is set "
+                "for this account "
+                    << accountName_.view() << ".");
             held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
             return false;
         }
@@ -115,8 +117,8 @@ class SignIn {
         Dictionary parameters = createCallParameters(accountName_, nullptr, options_);
         parameters.set("veltoConnect", accountName_);
         parameters.set("pwdHash", passwordHash_);
-        parameters.set("UserUUID",
-                       __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaUserUUIDKey, Value::Kind::String));
+        parameters.set("UserUUID", __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaUserUUIDKey,
+                                                                Value::Kind::String));
         parameters.set("ClientDateTime", Value::date(now_));
         if (hasRecord_) addAccountParameters(parameters);
         return parameters;
@@ -136,8 +138,9 @@ class SignIn {
     }
 
     void authenticate(const String& url, const Dictionary& parameters) {
-        auto session = std::make_unique<VeltoIDAuthenticationSessionInfo>(VeltoIDAuthenticationSessionInfo{
-            accountName_, passwordHash_, url, nullptr, now_, 0, nullptr, copySessionQueueForAccount(accountName_)});
+        auto session = std::make_unique<VeltoIDAuthenticationSessionInfo>(
+            VeltoIDAuthenticationSessionInfo{accountName_, passwordHash_, url, nullptr, now_, 0, nullptr,
+                                             copySessionQueueForAccount(accountName_)});
         std::optional<Dictionary> reply;
         std::optional<Error> callError;
         const String method = std::string(kVeltoIDMethodPrefix) + "authenticate";
@@ -154,7 +157,8 @@ class SignIn {
         serverVersion = getInt32(&reply, "Version", 0);
         applyEmbargo(reply);
         if (reply.boolean("ClientTooOld").value_or(false)) {
-            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true), true);
+            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true),
+                                       true);
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
         }
         encDsId_ = reply.string("encDsId");
@@ -186,10 +190,12 @@ class SignIn {
                              << describeValue(encDsId_) << " vs " << describeValue(oldEncDsId_)
                              << " so disabling the certs and VeltoIDValidationRecord on this account.");
         for (const String& encDsId : {oldEncDsId_, encDsId_})
-            __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
-                                           true);
-        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountValidationRecordIdentifierKey, Value::null(), true);
-        __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_), true);
+            __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey,
+                                           kVeltoIDCertificateStatusInvalid, true);
+        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountValidationRecordIdentifierKey, Value::null(),
+                                   true);
+        __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_),
+                                       true);
     }
 
     void applyCertificateState(const Dictionary& reply) {
@@ -197,9 +203,10 @@ class SignIn {
             __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateLastSuccessfulValidationDateKey,
                                            Value::date(now_), true);
         } else if (reply.contains("CertificateIsValid") || reply.contains("CertificateNoLongerValid")) {
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
+            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey,
+                                           kVeltoIDCertificateStatusInvalid, true);
+            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_),
                                            true);
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_), true);
         }
     }
 
@@ -218,7 +225,8 @@ class SignIn {
             return;
         }
         count(kVeltoIDMetaSuccessfulConnectionCountKey);
-        for (const std::string_view key : {kVeltoIDMetaLastConnectAttemptKey, kVeltoIDMetaLastSuccessfulConnectKey})
+        for (const std::string_view key :
+             {kVeltoIDMetaLastConnectAttemptKey, kVeltoIDMetaLastSuccessfulConnectKey})
             __VeltoIDDBSetMetaInfoValue(nullptr, key, Value::date(now_));
     }
 
