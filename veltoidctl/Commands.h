@@ -11,6 +11,7 @@ namespace veltoidctl {
 /// Exit statuses.
 inline constexpr int kDone = 0;
 inline constexpr int kRefused = 1;
+inline constexpr int kWrongUse = 2;
 inline constexpr int kAgentUnreachable = 3;
 
 /// What was asked for on the command line.

@@ -73,7 +73,12 @@ int run(int argc, char** argv) {
     takesPassword(verifyPassword, arguments);
     addCommand(application, "database", "dump the account database", database, chosen);
 
-    CLI11_PARSE(application, argc, argv);
+    try {
+        application.parse(argc, argv);
+    } catch (const CLI::ParseError& error) {
+        // Prints the help that was asked for, or what is wrong.
+        return application.exit(error) == 0 ? kDone : kWrongUse;
+    }
     AgentConnection agent(service, timeout);
     return chosen(agent, arguments);
 }
