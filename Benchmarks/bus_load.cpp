@@ -1,7 +1,9 @@
-// Sends pings (command 1) to services on the session bus and prints how long they took. Services named together are
-// measured in turn, so that whatever else the machine does hits all of them alike. One line per run: NAME NUMBER.
+// Sends pings (command 1) to services on the session bus and prints how long they took. Services named
+// together are measured in turn, so that whatever else the machine does hits all of them alike. One line per
+// run: NAME NUMBER.
 //
-//   bus_load cold RUNS NAME...                   microseconds from the message that makes the bus start the service to
+//   bus_load cold RUNS NAME...                   microseconds from the message that makes the bus start the
+//   service to
 //                                                the reply; the service is killed between runs
 //   bus_load ping RUNS CALLS NAME...             median microseconds of CALLS calls, one after the other
 //   bus_load parallel RUNS CLIENTS MILLISECONDS NAME...   answers per second to that many clients
@@ -38,7 +40,9 @@ void require(int result, const char* what) {
 
 Moment now() { return std::chrono::steady_clock::now(); }
 
-double microsecondsSince(Moment start) { return std::chrono::duration<double, std::micro>(now() - start).count(); }
+double microsecondsSince(Moment start) {
+    return std::chrono::duration<double, std::micro>(now() - start).count();
+}
 
 double median(std::vector<double> numbers) {
     const auto middle = numbers.begin() + static_cast<std::ptrdiff_t>(numbers.size() / 2);
@@ -81,8 +85,9 @@ class Client {
     void kill(const std::string& service) {
         bool gone = false;
         sd_bus_slot* slot = nullptr;
-        const std::string rule = "type='signal',sender='org.freedesktop.DBus',member='NameOwnerChanged',arg0='" +
-                                 service + "',arg2=''";
+        const std::string rule =
+            "type='signal',sender='org.freedesktop.DBus',member='NameOwnerChanged',arg0='" + service +
+            "',arg2=''";
         require(sd_bus_add_match(bus_, &slot, rule.c_str(), noteGone, &gone), "match");
         if (::kill(processOf(service), SIGKILL) < 0) require(-errno, "kill");
         while (!gone) {
@@ -102,8 +107,8 @@ class Client {
     pid_t processOf(const std::string& service) {
         sd_bus_message* reply = nullptr;
         uint32_t process = 0;
-        require(sd_bus_call_method(bus_, kBus, kBusPath, kBus, "GetConnectionUnixProcessID", nullptr, &reply, "s",
-                                   service.c_str()),
+        require(sd_bus_call_method(bus_, kBus, kBusPath, kBus, "GetConnectionUnixProcessID", nullptr, &reply,
+                                   "s", service.c_str()),
                 "process");
         require(sd_bus_message_read(reply, "u", &process), "process");
         sd_bus_message_unref(reply);
@@ -142,7 +147,8 @@ void measurePings(int runs, int calls, const std::vector<std::string>& services)
 }
 
 /// How many answers the clients get together while the period lasts.
-long answersDuring(std::chrono::milliseconds period, std::vector<Client>& clients, const std::string& service) {
+long answersDuring(std::chrono::milliseconds period, std::vector<Client>& clients,
+                   const std::string& service) {
     std::atomic<long> answers{0};
     std::vector<std::thread> threads;
     threads.reserve(clients.size());
@@ -159,7 +165,8 @@ long answersDuring(std::chrono::milliseconds period, std::vector<Client>& client
     return answers;
 }
 
-void measureParallelClients(int runs, size_t count, int milliseconds, const std::vector<std::string>& services) {
+void measureParallelClients(int runs, size_t count, int milliseconds,
+                            const std::vector<std::string>& services) {
     std::vector<Client> clients(count);
     for (const std::string& service : services)
         for (Client& client : clients) client.ping(service);
@@ -187,7 +194,8 @@ int main(int argc, char** argv) {
     } else if (words.size() >= 5 && words[0] == "parallel") {
         measureParallelClients(number(1), static_cast<size_t>(number(2)), number(3), services(4));
     } else {
-        (void)std::fprintf(stderr, "bus_load: cold, ping or parallel, as described at the head of its source\n");
+        (void)std::fprintf(stderr,
+                           "bus_load: cold, ping or parallel, as described at the head of its source\n");
         return EXIT_FAILURE;
     }
     return EXIT_SUCCESS;

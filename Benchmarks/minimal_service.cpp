@@ -1,5 +1,5 @@
-// The least that a service on this bus can be, to measure the agent against: sd-bus on sd-event, the agent's object,
-// interface and method, and one answer to everything. Usage: minimal_service NAME
+// The least that a service on this bus can be, to measure the agent against: sd-bus on sd-event, the agent's
+// object, interface and method, and one answer to everything. Usage: minimal_service NAME
 #include <systemd/sd-bus.h>
 #include <systemd/sd-event.h>
 
@@ -39,7 +39,8 @@ int main(int argc, char** argv) {
     require(sd_bus_open_user(&bus), "bus");
     // Without its bus it has nothing to do.
     require(sd_bus_set_exit_on_disconnect(bus, 1), "bus");
-    require(sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kMessageInterface, kInterfaceTable, nullptr),
+    require(sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kMessageInterface, kInterfaceTable,
+                                     nullptr),
             "object");
     require(sd_bus_request_name(bus, argv[1], 0), "name");
     require(sd_bus_attach_event(bus, loop, SD_EVENT_PRIORITY_NORMAL), "attaching");

@@ -1,6 +1,6 @@
 // Shared libraries that are loaded with the first call of one of their functions. The agent is started for
 // every message that finds it away, and most starts need neither storage nor cryptography: having the dynamic
-// linker map and relocate those libraries before main would take longer than everything else up to the first
+// linker map and relocate those libraries before main would add two fifths to the time up to the first
 // answer.
 //
 //     LazyLibrary library("libexample.so.1");

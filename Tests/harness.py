@@ -6,17 +6,19 @@ to, like in real life, or by hand.
 
 from __future__ import annotations
 
+import contextlib
 import hashlib
 import json
 import os
 import pathlib
+import select
 import shutil
 import signal
 import subprocess
 import sys
 import tempfile
 
-from jeepney import DBusAddress, MatchRule, MessageFlag, MessageType, message_bus, new_method_call
+from jeepney import DBusAddress, DBusErrorResponse, MatchRule, MessageFlag, MessageType, message_bus, new_method_call
 from jeepney.io.blocking import Proxy, open_dbus_connection
 
 ROOT = pathlib.Path(__file__).resolve().parent.parent
@@ -180,6 +182,7 @@ class World:
 
     def __exit__(self, *_):
         self.stop_agent()
+        self.end_agent_of_the_bus()
         self.bus.stop()
         if self.server:
             self.server.stop()
@@ -227,6 +230,18 @@ class World:
         self.agent.stdout.close()
         self.agent = None
         return status
+
+    def end_agent_of_the_bus(self):
+        """Ends the agent that the bus has started, if any, and returns when it is gone: it writes files on its way."""
+        with contextlib.closing(open_dbus_connection(bus=self.bus.address)) as connection:
+            try:
+                process = os.pidfd_open(Proxy(message_bus, connection).GetConnectionUnixProcessID(SERVICE)[0])
+            except (DBusErrorResponse, ProcessLookupError):
+                return  # there is none, or it has just left
+        with contextlib.suppress(ProcessLookupError):
+            signal.pidfd_send_signal(process, signal.SIGTERM)
+        select.select([process], [], [], 15)
+        os.close(process)
 
     def log_text(self) -> str:
         return (self.folder / "agent.log").read_text(errors="replace")
