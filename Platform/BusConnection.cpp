@@ -24,7 +24,7 @@ struct State {
     }
 };
 
-int disconnected(sd_bus_message* /*message*/, void* /*context*/, sd_bus_error* /*error*/) {
+int disconnected(sd_bus_message* /*message*/, void* /*context*/, sd_bus_error* /*error*/) noexcept {
     VELTOID_PLATFORM_LOG(Error, "The message bus has ended the connection.");
     for (const auto& handler : State::shared().disconnectHandlers) handler();
     return 0;
@@ -73,6 +73,10 @@ void emitPosted(const std::string& name) {
     const int result =
         sd_bus_emit_signal(bus, kObjectPath, kNotificationInterface, "Posted", "s", name.c_str());
     if (result < 0) logFailure("posting a notification", result);
+}
+
+void flush() {
+    if (sd_bus* bus = State::shared().bus) sd_bus_flush(bus);
 }
 
 void onDisconnect(std::function<void()> handler) {

@@ -20,6 +20,9 @@ sd_bus* connection();
 /// Emits Posted(name); nothing happens without a connection that was opened before.
 void emitPosted(const std::string& name);
 
+/// Hands everything that was sent to the bus.
+void flush();
+
 /// Calls `handler` when the bus ends the connection.
 void onDisconnect(std::function<void()> handler);
 

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "Platform/MessageService.h"
+#include "Platform/UTF8.h"
 
 namespace platform::bus {
 namespace {
@@ -209,10 +210,13 @@ class MessageSink : public ValueSink {
 
     void string(std::string_view utf8) override {
         // The bus carries neither NUL bytes nor text that is not UTF-8: such a string travels as data.
-        const std::string text(utf8);
-        if (text.find('\0') != std::string::npos || !isUTF8(utf8)) {
+        if (utf8.find('\0') != std::string_view::npos || !isUTF8(utf8)) {
             data(bytesOf(utf8));
         } else {
+            // Any text may be a secret: none stays behind in this copy.
+            SecretText text;
+            text.reserve(utf8.size() + 32);
+            text += utf8;
             basic("s", SD_BUS_TYPE_STRING, text.c_str());
         }
     }
@@ -252,24 +256,6 @@ class MessageSink : public ValueSink {
     }
 
   private:
-    static bool isUTF8(std::string_view text) {
-        // Only texts from foreign bytes can be anything else, so a plain check of lead and continuation bytes
-        // will do.
-        for (size_t i = 0; i < text.size();) {
-            const auto lead = static_cast<unsigned char>(text[i]);
-            const size_t length = lead < 0x80                   ? 1
-                                  : lead >= 0xC2 && lead < 0xE0 ? 2
-                                  : lead >= 0xE0 && lead < 0xF0 ? 3
-                                  : lead >= 0xF0 && lead < 0xF5 ? 4
-                                                                : 0;
-            if (length == 0 || i + length > text.size()) return false;
-            for (size_t k = 1; k < length; ++k)
-                if ((static_cast<unsigned char>(text[i + k]) & 0xC0U) != 0x80U) return false;
-            i += length;
-        }
-        return true;
-    }
-
     void check(int result) {
         if (result < 0 && result_ >= 0) result_ = result;
     }

@@ -11,6 +11,7 @@
 #include <cstdlib>
 #include <cstring>
 
+#include "Platform/BusConnection.h"
 #include "Platform/WorkQueue.h"
 
 namespace platform::event_loop {
@@ -30,14 +31,15 @@ void wakeLoop() {
     if (write(wakeDescriptor, &one, sizeof one) < 0 && errno != EAGAIN) fail("waking", errno);
 }
 
-int woken(sd_event_source* /*source*/, int descriptor, uint32_t /*events*/, void* /*context*/) {
+// What a task throws has no caller to go to: the process ends there rather than inside the C library.
+int woken(sd_event_source* /*source*/, int descriptor, uint32_t /*events*/, void* /*context*/) noexcept {
     uint64_t count = 0;
     if (read(descriptor, &count, sizeof count) < 0 && errno != EAGAIN) fail("reading wake-ups", errno);
     main_queue::runPending();
     return 0;
 }
 
-int signalled(sd_event_source* /*source*/, const signalfd_siginfo* /*info*/, void* context) {
+int signalled(sd_event_source* /*source*/, const signalfd_siginfo* /*info*/, void* context) noexcept {
     (*static_cast<std::function<void()>*>(context))();
     return 0;
 }
@@ -74,6 +76,16 @@ void run() {
 }
 
 sd_event* handle() { return loop; }
+
+void exitAfterPendingWork(int status) {
+    const auto leave = [status] {
+        bus::flush();
+        exitProcess(status);
+    };
+    if (WorkQueue::main().isCurrent()) leave();
+    WorkQueue::main().sync(leave);
+    std::abort();  // not reached
+}
 
 void exitProcess(int status) {
     // NOLINTNEXTLINE(cert-err33-c): nobody is left to tell

@@ -198,7 +198,7 @@ class BusListener : public Listener {
                                         kNotificationInterfaceTable, nullptr);
     }
 
-    static int nameRequested(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) {
+    static int nameRequested(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
         const auto* listener = static_cast<const BusListener*>(context);
         constexpr uint32_t kPrimaryOwner = 1;
         uint32_t outcome = 0;
@@ -235,7 +235,7 @@ class BusListener : public Listener {
         peer->second->watch(bus::connection(), peerGone, std::make_shared<Watch>(Watch{this, name}));
     }
 
-    static int peerGone(sd_bus_track* /*track*/, void* context) {
+    static int peerGone(sd_bus_track* /*track*/, void* context) noexcept {
         const auto* watch = static_cast<const Watch*>(context);
         const auto node = watch->listener->peers_.extract(watch->name);
         if (!node) return 0;
@@ -299,10 +299,6 @@ void onConnectionLost(std::function<void()> handler) {
 void announceTermination() {
     const auto listeners = Services::shared().listeners;
     for (const auto& listener : listeners) listener->notify(ConnectionError::TerminationImminent);
-}
-
-void flush() {
-    if (sd_bus* bus = bus::connection()) sd_bus_flush(bus);
 }
 
 }  // namespace message_service

@@ -92,9 +92,6 @@ void onConnectionLost(std::function<void()> handler);
 /// Tells every listener that the process is about to be ended. Main queue.
 void announceTermination();
 
-/// Hands everything that was sent to the bus. Main queue.
-void flush();
-
 }  // namespace message_service
 
 }  // namespace platform

@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <exception>
 
+#include "Platform/Clock.h"
 #include "Platform/PropertyList.h"
 #include "Platform/SQLiteFile.h"
 #include "Platform/SystemLog.h"
@@ -141,11 +142,15 @@ Preferences::ReadResult Preferences::read(std::string_view key, ValueSink& sink)
         });
         if (outcome == Outcome::Failed) return false;
         // The sink is served outside the transaction: it may take its time, and may use preferences itself.
-        const bool found = outcome == Outcome::Done && readBinaryPropertyList(value, sink);
-        result = found ? ReadResult::Found : ReadResult::Absent;
-        if (found || outcome != Outcome::Done) return true;
-        VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the value of \"" + std::string(key) +
-                                        "\" is damaged and counts as absent");
+        if (outcome != Outcome::Done) {
+            result = ReadResult::Absent;
+            return true;
+        }
+        const bool readable = readBinaryPropertyList(value, sink);
+        result = readable ? ReadResult::Found : ReadResult::Damaged;
+        if (!readable)
+            VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the value of \"" + std::string(key) +
+                                            "\" is damaged");
         return true;
     });
     return result;
@@ -200,6 +205,27 @@ bool Preferences::remove(const std::vector<std::string>& keys) const {
             }
             return true;
         }) == Outcome::Done;
+    });
+}
+
+bool Preferences::setAside(std::string_view key) const {
+    return guarded(domain_, "setAside", [&] {
+        const auto date = static_cast<int64_t>(Clock::shared().now());
+        const std::string asideKey = std::string(key) + "-" + std::to_string(date);
+        const Outcome outcome = file().write([&](SQLiteTransaction& transaction) {
+            transaction
+                .prepare("UPDATE OR REPLACE preferences SET domain = ?, key = ? WHERE domain = ? AND key = ?")
+                .bindText(domain_ + ".damaged")
+                .bindText(asideKey)
+                .bindText(domain_)
+                .bindText(key)
+                .run();
+            return true;
+        });
+        if (outcome == Outcome::Done)
+            VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the damaged value is kept as \"" +
+                                            asideKey + "\" of " + domain_ + ".damaged");
+        return outcome == Outcome::Done;
     });
 }
 

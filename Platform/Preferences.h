@@ -25,8 +25,9 @@ class Preferences {
 
     enum class ReadResult {
         Found,
-        /// There is no such value, or it is damaged (logged).
         Absent,
+        /// There is one, but its bytes make no value (logged).
+        Damaged,
         /// The store cannot be read now: there may be a value.
         Failed,
     };
@@ -42,6 +43,10 @@ class Preferences {
 
     /// Removes all of the given keys or, on failure, none.
     bool remove(const std::vector<std::string>& keys) const;
+
+    /// Takes the key out of the domain and keeps its bytes under the domain's name with ".damaged" and the
+    /// key with the date appended, for whoever wants to look at them.
+    bool setAside(std::string_view key) const;
 
     /// Makes everything set so far durable on disk.
     bool synchronize() const;

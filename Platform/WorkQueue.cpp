@@ -64,7 +64,6 @@ struct WorkQueue::State {
     bool active = false;
     /// Set for the main queue once the event loop runs it.
     std::function<void()> wakeLoop;
-    std::thread::id loopThread;
 };
 
 namespace {
@@ -150,7 +149,19 @@ void passOn(const StatePointer& state, std::unique_lock<std::mutex>& lock) {
     }
 }
 
-void runTask(const StatePointer& state, WorkQueue::Task& task) {
+/// Runs a task as the queue's on the thread that has it. Nothing may escape from a task: a queue whose task
+/// was left in the middle would never go on.
+void runAndPassOn(const StatePointer& state, const std::function<void()>& task,
+                  std::unique_lock<std::mutex>& lock) noexcept {
+    {
+        const CurrentQueueScope scope(state.get());
+        task();
+    }
+    lock.lock();
+    passOn(state, lock);
+}
+
+void runTask(const StatePointer& state, WorkQueue::Task& task) noexcept {
     const CurrentQueueScope scope(state.get());
     tRunsCountedTask = true;
     task();
@@ -233,12 +244,7 @@ void WorkQueue::runSync(const std::function<void()>& function) const {
         state_->active = true;
         lock.unlock();
     }
-    {
-        const CurrentQueueScope scope(state_.get());
-        function();
-    }
-    lock.lock();
-    passOn(state_, lock);
+    runAndPassOn(state_, function, lock);
 }
 
 bool WorkQueue::tryRunNow(const Task& task) const {
@@ -246,12 +252,7 @@ bool WorkQueue::tryRunNow(const Task& task) const {
     if (state_->active || state_->wakeLoop || !state_->items.empty()) return false;
     state_->active = true;
     lock.unlock();
-    {
-        const CurrentQueueScope scope(state_.get());
-        task();
-    }
-    lock.lock();
-    passOn(state_, lock);
+    runAndPassOn(state_, task, lock);
     return true;
 }
 
@@ -270,7 +271,6 @@ void adopt(std::function<void()> wake) {
     tCurrentQueues.push_back(state.get());
     const std::lock_guard lock(state->mutex);
     state->wakeLoop = std::move(wake);
-    state->loopThread = std::this_thread::get_id();
     if (!state->items.empty()) state->wakeLoop();
 }
 

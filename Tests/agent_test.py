@@ -2,9 +2,11 @@
 
 from __future__ import annotations
 
+import contextlib
 import os
 import pathlib
 import signal
+import sqlite3
 import subprocess
 import unittest
 
@@ -279,6 +281,54 @@ class Files(unittest.TestCase):
                 self.assertEqual(len(aside), 1)
                 self.assertTrue(aside[0].read_bytes().startswith(b"this is no database"))
                 self.assertIn(aside[0].name, world.log_text())
+
+    def edit(self, folder: pathlib.Path, statement: str):
+        with contextlib.closing(sqlite3.connect(folder / "preferences.db")) as database, database:
+            database.execute(statement)
+
+    def test_a_file_of_a_newer_version_is_left_alone_and_nothing_is_claimed(self):
+        with World() as world:
+            folder = self.prepared(world)
+            self.edit(folder, "PRAGMA user_version = 99")
+            world.start_agent()
+            with world.client() as client:
+                self.assertFalse(client.call(LIST)["success"])
+                self.assertFalse(add(client, OTHER_ACCOUNT, OTHER_PASSWORD)["success"])
+                self.assertFalse(client.call(SET_VALUE, domain="MetaInfo", key="k", value="v")["success"])
+            world.stop_agent()
+            self.edit(folder, "PRAGMA user_version = 1")
+            world.start_agent()
+            with world.client() as client:
+                self.assertEqual(client.call(LIST)["result"], [ACCOUNT])
+
+    def test_a_damaged_value_takes_no_other_down_and_is_kept(self):
+        for key, accounts in [("Version", [ACCOUNT]), ("MetaInfo", [ACCOUNT]), ("Accounts", [])]:
+            with self.subTest(key), World() as world:
+                folder = self.prepared(world)
+                self.edit(folder, f"UPDATE preferences SET value = x'00' WHERE key = '{key}'")
+                world.start_agent()
+                with world.client() as client:
+                    self.assertEqual(client.call(LIST)["result"], accounts)
+                    self.assertTrue(add(client)["success"])
+                self.assertIn(f'"{key}" is damaged', world.log_text())
+                world.stop_agent()
+                with contextlib.closing(sqlite3.connect(folder / "preferences.db")) as database:
+                    kept = database.execute(
+                        "SELECT value FROM preferences WHERE domain LIKE '%.damaged' AND key LIKE ?", (key + "-%",))
+                    self.assertEqual(kept.fetchall(), [] if key == "Version" else [(b"\0",)])
+
+    def test_a_change_that_cannot_be_stored_fails_and_spoils_nothing(self):
+        with World(server=False) as world, world.client() as client:
+            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="before", value="b")["success"])
+            half = bytes(36 << 20)
+            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="half", value=half)["success"])
+            self.assertFalse(client.call(SET_VALUE, domain="MetaInfo", key="other half", value=half)["success"])
+            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="half")["success"])
+            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="after", value="a")["success"])
+            os.kill(world.agent_pid(), signal.SIGKILL)
+            with world.client() as again:
+                meta = again.call(DATABASE)["result"]["MetaInfo"]
+            self.assertEqual((meta["before"], meta["after"]), ("b", "a"))
 
     def test_a_state_folder_that_cannot_be_had_leaves_the_agent_up(self):
         with World() as world:

@@ -24,7 +24,10 @@ inline constexpr std::string_view kErrorUnderlyingErrorKey = "HWUnderlyingError"
 namespace identity_error {
 inline constexpr int64_t kNotYet = 99;
 inline constexpr int64_t kSignInFailed = 1;
+/// No answer from the server.
 inline constexpr int64_t kNoResponse = -1;
+/// The same code, where nothing more precise is known.
+inline constexpr int64_t kUnspecified = -1;
 inline constexpr int64_t kNoAccountForRequest = -2;
 inline constexpr int64_t kAgentCommunicationFailure = -11;
 inline constexpr int64_t kInvalidParameters = -99;

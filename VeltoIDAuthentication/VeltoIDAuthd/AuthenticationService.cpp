@@ -39,37 +39,23 @@ void countFor(const String& account, const Request& request, std::string_view co
 
 Outcome ping(Request& /*request*/) { return {true, {}}; }
 
-/// False when the request names nothing that can be set.
-bool setDatabaseValue(const Request& request, bool& success) {
+/// Sets what the request names; the given answer when that is nothing that can be set.
+bool setDatabaseValue(const Request& request, bool whenNothingIsSet) {
     const String domain = request.string("domain");
     const String item = request.string("item");
     const String key = request.string("key");
     const Value value = request.value("value");
     const bool notify = getBool(&request.options(), "Dirty", true);
-    if (!domain || !key) return false;
-    if (domain == "MetaInfo") {
-        success = __VeltoIDDBSetMetaInfoValue(item, key, value);
-    } else if (item && domain == "Accounts") {
-        success = __VeltoIDDBSetAccountValue(item, key, value, notify);
-    } else if (item && domain == "Certificates") {
-        success = __VeltoIDDBSetCertificateValue(item, key, value, notify);
-    } else {
-        return false;
-    }
-    return true;
+    if (!domain || !key) return whenNothingIsSet;
+    if (domain == "MetaInfo") return __VeltoIDDBSetMetaInfoValue(item, key, value);
+    if (item && domain == "Accounts") return __VeltoIDDBSetAccountValue(item, key, value, notify);
+    if (item && domain == "Certificates") return __VeltoIDDBSetCertificateValue(item, key, value, notify);
+    return whenNothingIsSet;
 }
 
-Outcome setValueOrFail(Request& request) {
-    bool success = false;
-    setDatabaseValue(request, success);
-    return {success, {}};
-}
+Outcome setValueOrFail(Request& request) { return {setDatabaseValue(request, false), {}}; }
 
-Outcome setValueIfPossible(Request& request) {
-    bool success = true;
-    setDatabaseValue(request, success);
-    return {success, {}};
-}
+Outcome setValueIfPossible(Request& request) { return {setDatabaseValue(request, true), {}}; }
 
 /// The agent keeps one account.
 void forgetOtherAccounts(const String& added) {
@@ -148,8 +134,7 @@ void terminateAfterReply() {
             kHandlerName, kNotice,
             "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
             "request.");
-        platform::message_service::flush();
-        platform::event_loop::exitProcess(EXIT_SUCCESS);
+        platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
     });
 }
 
@@ -167,13 +152,12 @@ struct Command {
     Outcome (*run)(Request& request);
 };
 
-constexpr int64_t kPingCommand = 0x1;
 constexpr int64_t kTerminateCommand = 0x9999;
 
 constexpr Command kCommands[] = {
-    {kPingCommand, ping},     {0xFE, setValueOrFail}, {0xFF, setValueIfPossible}, {0x120, addAccount},
-    {0x130, getMyInfo},       {0x150, listAccounts},  {0x160, forgetAccount},     {0x180, verifyPassword},
-    {0x500, copyAllContents}, {0x510, status},
+    {kVeltoIDPingCommand, ping}, {0xFE, setValueOrFail}, {0xFF, setValueIfPossible}, {0x120, addAccount},
+    {0x130, getMyInfo},          {0x150, listAccounts},  {0x160, forgetAccount},     {0x180, verifyPassword},
+    {0x500, copyAllContents},    {0x510, status},
 };
 
 Outcome dispatch(Request& request) {
@@ -190,14 +174,10 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
     Request request(message);
     if (request.command() == kTerminateCommand) {
         computeRelaunchFromAccounts();
-        platform::event_loop::exitProcess(EXIT_SUCCESS);
+        platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
     }
     const Outcome outcome = dispatch(request);
     request.finish(outcome.success, outcome.error);
-}
-
-bool isAnsweredAtOnce(platform::IncomingMessage& message) {
-    return message.peekInteger("command") == kPingCommand;
 }
 
 }  // namespace veltoid

@@ -9,7 +9,4 @@ namespace veltoid {
 /// Handles one request of a client, synchronously, on the client's queue.
 void handleAuthenticationIPCMessage(platform::IncomingMessage& message);
 
-/// Whether the request is answered without waiting for anything (a ping). Bus thread.
-bool isAnsweredAtOnce(platform::IncomingMessage& message);
-
 }  // namespace veltoid

@@ -4,6 +4,8 @@
 
 #include <string_view>
 
+#include "Platform/UTF8.h"
+
 namespace veltoid {
 
 std::optional<CommandLine> parseCommandLine(int argc, char* const* argv, CommandLineError& error) {
@@ -47,7 +49,7 @@ std::optional<CommandLine> parseCommandLine(int argc, char* const* argv, Command
     for (int i = optind; i < argc; ++i) {
         const std::string_view argument(argv[i]);
         const size_t equals = argument.find('=');
-        if (equals != std::string_view::npos)
+        if (equals != std::string_view::npos && platform::isUTF8(argument))
             line.metaInfoValues.emplace_back(argument.substr(0, equals), argument.substr(equals + 1));
     }
     return line;

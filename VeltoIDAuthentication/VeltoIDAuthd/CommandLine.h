@@ -15,7 +15,7 @@ struct CommandLine {
     bool usePreferences = true;
     std::optional<std::string> authenticationServiceName;
     std::optional<std::string> preferencesDomainName;
-    /// key=value arguments, split at the first "=".
+    /// key=value arguments, split at the first "="; those that are not UTF-8 are skipped.
     std::vector<std::pair<std::string, std::string>> metaInfoValues;
     /// How many arguments follow the options, whatever their form.
     int argumentsAfterOptions = 0;

@@ -7,6 +7,7 @@
 #include "VeltoIDAuthd/AuthenticationService.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthd/Request.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {
@@ -16,6 +17,11 @@ using platform::ConnectionError;
 using platform::PeerConnection;
 
 using RequestHandler = void (*)(platform::IncomingMessage& message);
+
+/// A ping waits for nothing.
+bool isAnsweredAtOnce(platform::IncomingMessage& message) {
+    return message.peekInteger("command") == kVeltoIDPingCommand;
+}
 
 void serve(PeerConnection& peer, RequestHandler handle) {
     peer.setTargetQueue(platform::WorkQueue("client " + std::to_string(peer.processID())));

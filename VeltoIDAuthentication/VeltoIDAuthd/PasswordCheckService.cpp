@@ -1,6 +1,7 @@
 #include "VeltoIDAuthd/PasswordCheckService.h"
 
 #include "IPCHelpers/Transaction.h"
+#include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
 
 namespace veltoid {
@@ -22,11 +23,10 @@ bool updateLinkedIdentity(const Request& request, ErrorOut error) {
 }
 
 bool run(const Request& request, ErrorOut error) {
-    constexpr int64_t kPing = 1;
     constexpr int64_t kVerifyPassword = 0x180;
     constexpr int64_t kUpdateLinkedIdentity = 400;
     switch (request.command()) {
-        case kPing:
+        case kVeltoIDPingCommand:
             return true;
         case kVerifyPassword:
             return verifyRequestedPassword(request, error);
@@ -49,10 +49,10 @@ void handlePasswordCheckIPCMessage(platform::IncomingMessage& message) {
 
 bool verifyRequestedPassword(const Request& request, ErrorOut error) {
     const String password = request.string("hashedpassword");
-    return request.account() && password &&
-           __VeltoIDDoVerifyPassword(request.account(), password,
-                                     request.optionsWith("DoNotSaveSessionInfo", Value::boolean(true)),
-                                     error);
+    if (!request.account() || !password) return false;
+    const Dictionary options =
+        copyDictionarySettingValue(request.options(), "DoNotSaveSessionInfo", Value::boolean(true));
+    return __VeltoIDDoVerifyPassword(request.account(), password, options, error);
 }
 
 void setLinkedIdentityHandler(LinkedIdentityHandler handler) { linkedIdentityHandler() = std::move(handler); }

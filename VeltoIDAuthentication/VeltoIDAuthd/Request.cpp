@@ -18,12 +18,6 @@ Request::Request(platform::IncomingMessage& message) : message_(message), reques
     if (const Dictionary* given = options.asDictionary()) options_ = *given;
 }
 
-Dictionary Request::optionsWith(std::string_view key, const Value& value) const {
-    Dictionary options = options_;
-    options.set(key, value);
-    return options;
-}
-
 void Request::finish(bool success, const std::optional<Error>& error) {
     reply_.setValue("success", Value::boolean(success));
     if (!success && error) reply_.setError(*error);

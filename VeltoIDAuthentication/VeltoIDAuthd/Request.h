@@ -10,6 +10,9 @@
 
 namespace veltoid {
 
+/// The ping, of both services.
+inline constexpr int64_t kVeltoIDPingCommand = 0x1;
+
 /// One request and the reply under construction. On the client's queue.
 class Request {
   public:
@@ -21,8 +24,6 @@ class Request {
     const String& account() const { return account_; }
     /// Empty when absent.
     const Dictionary& options() const { return options_; }
-    /// The options with one entry set.
-    Dictionary optionsWith(std::string_view key, const Value& value) const;
 
     String string(std::string_view key) const {
         return request_.copyValue(key, Value::Kind::String).asString();

@@ -52,8 +52,7 @@ void keepMemoryPrivate() {
 
 void exitOnce() {
     __VeltoIDDBSynchronize();
-    platform::message_service::flush();
-    platform::event_loop::exitProcess(EXIT_SUCCESS);
+    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
 }
 
 /// The listeners save what they have, requests in work are finished, and the agent leaves.

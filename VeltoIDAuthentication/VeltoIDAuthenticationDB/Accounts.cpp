@@ -14,11 +14,14 @@ namespace {
 
 using database::Store;
 
-constexpr database::Sections kAccountsSection{true, false, false};
-
 Value now() { return Value::date(platform::Clock::shared().now()); }
 
 Error identityError(int64_t code) { return {String(kIdentityErrorDomain), code, {}}; }
+
+/// An account that is not there may only be out of reach.
+int64_t missingAccountCode(const Store& store) {
+    return store.isLoaded() ? identity_error::kUnknownAccount : identity_error::kUnspecified;
+}
 
 bool hasPassword(const Dictionary& record) {
     return record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey) ||
@@ -47,6 +50,13 @@ bool storePassword(const String& name, const String& hashedPassword, Dictionary&
     if (!record.contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
         record.set(kVeltoIDAccountHashedPasswordKeychainReferenceKey, reference);
     return true;
+}
+
+/// Stores the record and writes the section.
+bool storeRecord(Store& store, const String& name, const Dictionary& record, bool signal) {
+    Dictionary accounts = store.accounts;
+    accounts.set(name, record);
+    return store.replace(&Store::accounts, std::move(accounts), signal);
 }
 
 void markDirty(Dictionary& record) {
@@ -78,13 +88,15 @@ void removeDirtyMarks(Dictionary& section) {
 }  // namespace
 
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
-    Array all = database::perform([](const Store& store) {
+    bool loaded = false;
+    Array all = database::perform([&](const Store& store) {
+        loaded = store.isLoaded();
         Array keys;
         for (const auto& [name, record] : store.accounts) keys.append(name);
         return keys;
     });
     if (all.empty()) {
-        fillError(error, identityError(identity_error::kNoAccounts));
+        fillError(error, identityError(loaded ? identity_error::kNoAccounts : identity_error::kUnspecified));
         return false;
     }
     if (names != nullptr) *names = std::move(all);
@@ -112,7 +124,7 @@ bool __VeltoIDDBCopyVeltoIDAccount(const String& name, Dictionary* record, Error
     return database::perform([&](const Store& store) {
         const Dictionary* found = Store::find(store.accounts, name);
         if (found == nullptr) {
-            fillError(error, identityError(identity_error::kUnknownAccount));
+            fillError(error, identityError(missingAccountCode(store)));
         } else if (record != nullptr) {
             *record = *found;
         }
@@ -129,7 +141,7 @@ bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut
         return nullptr;
     });
     if (!found) {
-        fillError(error, makeError(identity_error::kNoResponse, {"Unknown error", "?", "?"}, {}, __func__,
+        fillError(error, makeError(identity_error::kUnspecified, {"Unknown error", "?", "?"}, {}, __func__,
                                    __FILE_NAME__, __LINE__));
         return false;
     }
@@ -141,6 +153,8 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
                                      const String& encDsId) {
     if (!name) return false;
     return database::perform([&](Store& store) {
+        // Before the password goes anywhere: an item that no record names would never be found again.
+        if (!store.isLoaded()) return false;
         const Dictionary* existing = Store::find(store.accounts, name);
         Dictionary record =
             existing != nullptr ? *existing : Dictionary{{kVeltoIDAccountCreationDateKey, now()}};
@@ -150,9 +164,7 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);
-        store.accounts.set(name, record);
-        store.writeSections(kAccountsSection, true);
-        return true;
+        return storeRecord(store, name, record, true);
     });
 }
 
@@ -176,9 +188,7 @@ bool __VeltoIDDBRemovePassword(const String& name) {
             removePasswordFromKeychainGivenPersistentRef(reference);
         record.remove(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
         markDirty(record);
-        store.accounts.set(name, record);
-        store.writeSections(kAccountsSection, true);
-        return true;
+        return storeRecord(store, name, record, true);
     });
 }
 
@@ -199,9 +209,7 @@ bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, b
         record.set(kVeltoIDAccountModificationDateKey, now());
         if (signal && values.boolean(kVeltoIDDirtyKey) != false)
             record.set(kVeltoIDDirtyKey, Value::boolean(true));
-        store.accounts.set(name, record);
-        store.writeSections(kAccountsSection, signal && significant);
-        return true;
+        return storeRecord(store, name, record, signal && significant);
     });
 }
 
@@ -224,12 +232,11 @@ bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
         return false;
     }
     return database::perform([&](Store& store) {
-        if (!store.accounts.remove(name.view())) {
-            fillError(error, identityError(identity_error::kUnknownAccount));
-            return false;
-        }
-        store.writeSections(kAccountsSection, true);
-        return true;
+        Dictionary accounts = store.accounts;
+        const bool existed = accounts.remove(name.view());
+        if (existed && store.replace(&Store::accounts, std::move(accounts), true)) return true;
+        fillError(error, identityError(existed ? identity_error::kUnspecified : missingAccountCode(store)));
+        return false;
     });
 }
 

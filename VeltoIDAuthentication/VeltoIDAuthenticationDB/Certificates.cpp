@@ -9,9 +9,14 @@ namespace {
 
 using database::Store;
 
-constexpr database::Sections kCertificatesSection{false, true, false};
-
 Value now() { return Value::date(platform::Clock::shared().now()); }
+
+/// Stores the entry and writes the section.
+bool storeEntry(Store& store, const String& encDsId, const Dictionary& entry, bool signal) {
+    Dictionary certificates = store.certificates;
+    certificates.set(encDsId, entry);
+    return store.replace(&Store::certificates, std::move(certificates), signal);
+}
 
 /// Copies the info's value when there is one, else removes the entry's.
 void copyOrRemove(Dictionary& entry, std::string_view key, const Value& value) {
@@ -32,12 +37,18 @@ void applyInfo(Dictionary& entry, const Dictionary& info) {
 
 }  // namespace
 
-bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut /*error*/) {
-    Array all = database::perform([](const Store& store) {
+bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
+    bool loaded = false;
+    Array all = database::perform([&](const Store& store) {
+        loaded = store.isLoaded();
         Array names;
         for (const auto& [encDsId, entry] : store.certificates) names.append(encDsId);
         return names;
     });
+    if (!loaded) {
+        fillError(error, Error{String(kIdentityErrorDomain), identity_error::kNoCertificateForAccount, {}});
+        return false;
+    }
     if (keys != nullptr) *keys = std::move(all);
     return true;
 }
@@ -55,9 +66,7 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
         }
         entry.set(kVeltoIDDirtyKey, Value::boolean(true));
         entry.set("ModificationDate", now());
-        store.certificates.set(encDsId, entry);
-        store.writeSections(kCertificatesSection, true);
-        return true;
+        return storeEntry(store, encDsId, entry, true);
     });
 }
 
@@ -75,9 +84,7 @@ bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, co
         const bool isMark = key.view() == kVeltoIDDirtyKey;
         entry.set("ModificationDate", now());
         if (signal && !isMark) entry.set(kVeltoIDDirtyKey, Value::boolean(true));
-        store.certificates.set(encDsId, entry);
-        store.writeSections(kCertificatesSection, signal && !isMark && key.view() != "ModificationDate");
-        return true;
+        return storeEntry(store, encDsId, entry, signal && !isMark && key.view() != "ModificationDate");
     });
 }
 
@@ -91,9 +98,9 @@ bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, Dictionary* entry) {
 
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {
     return database::perform([&](Store& store) {
-        if (!encDsId || !store.certificates.remove(encDsId.view())) return false;
-        store.writeSections(kCertificatesSection, true);
-        return true;
+        Dictionary certificates = store.certificates;
+        return encDsId && certificates.remove(encDsId.view()) &&
+               store.replace(&Store::certificates, std::move(certificates), true);
     });
 }
 

@@ -12,7 +12,7 @@ namespace veltoid {
 /// An issued certificate counts as valid until one day after it has expired (seconds).
 inline constexpr double kVeltoIDCertificateExpirationGrace = 86'400;
 
-/// The keys of all entries, possibly none. True.
+/// The keys of all entries, possibly none. -106 when they cannot be read.
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error = nullptr);
 
 /// Creates or updates the entry from the server's certificate result ("CertificateReference", "Expires",

@@ -8,8 +8,6 @@ namespace {
 
 using database::Store;
 
-constexpr database::Sections kMetaInfoSection{false, false, true};
-
 const Dictionary& defaults() {
     static const auto* values = new Dictionary{
         {kVeltoIDDBServerURLKey, kVeltoIDDefaultServerURL},
@@ -50,17 +48,17 @@ Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& opti
 bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const Value& value) {
     if (!key) return false;
     return database::perform([&](Store& store) {
+        Dictionary metaInfo = store.metaInfo;
         bool changed = false;
         if (section) {
-            const Dictionary* existing = Store::find(store.metaInfo, section);
+            const Dictionary* existing = Store::find(metaInfo, section);
             Dictionary own = existing != nullptr ? *existing : Dictionary();
             changed = change(own, key, value);
-            store.metaInfo.set(section, own);
+            metaInfo.set(section, own);
         } else {
-            changed = change(store.metaInfo, key, value);
+            changed = change(metaInfo, key, value);
         }
-        if (changed) store.writeSections(kMetaInfoSection, false);
-        return true;
+        return !changed || store.replace(&Store::metaInfo, std::move(metaInfo), false);
     });
 }
 

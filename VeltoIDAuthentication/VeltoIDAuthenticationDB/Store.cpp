@@ -25,11 +25,18 @@ Store& store() {
     return *shared;
 }
 
-/// The stored value, absent when there is none; nothing when the preference store cannot be read now.
-std::optional<Value> readPreference(const platform::Preferences& preferences, std::string_view key) {
+using ReadResult = platform::Preferences::ReadResult;
+
+struct StoredValue {
+    ReadResult result = ReadResult::Failed;
+    /// Absent unless found.
+    Value value;
+};
+
+StoredValue readPreference(const platform::Preferences& preferences, std::string_view key) {
     ValueBuilder builder;
-    if (preferences.read(key, builder) == platform::Preferences::ReadResult::Failed) return std::nullopt;
-    return builder.value();
+    const ReadResult result = preferences.read(key, builder);
+    return {result, result == ReadResult::Found ? builder.value() : Value()};
 }
 
 std::pair<std::string, platform::ValueWriter> preference(std::string_view key, const Value& value) {
@@ -46,6 +53,40 @@ Dictionary sectionFrom(const Value& stored, OtherEntries others) {
             if (others == OtherEntries::Keep || value.isDictionary()) section.set(name, value);
     }
     return section;
+}
+
+/// A stored section; none when it cannot be read now. A damaged one is kept aside, so that nothing that is
+/// written later takes its place.
+std::optional<Dictionary> readSection(const platform::Preferences& domain, std::string_view key,
+                                      OtherEntries others) {
+    const StoredValue stored = readPreference(domain, key);
+    if (stored.result == ReadResult::Failed) return std::nullopt;
+    if (stored.result == ReadResult::Damaged && !domain.setAside(key)) return std::nullopt;
+    return sectionFrom(stored.value, others);
+}
+
+bool isUsableVersion(const Value& version) {
+    const std::optional<int64_t> number = version.asInt64();
+    return number && static_cast<uint64_t>(*number) >= static_cast<uint64_t>(kVeltoIDDBVersion);
+}
+
+/// Keeps stored data of a usable version; otherwise starts the domain afresh. A damaged version says nothing
+/// about the data beside it and is written again. False when the store cannot be read or written now.
+bool keepOrInitialize(const platform::Preferences& domain) {
+    const StoredValue version = readPreference(domain, kVeltoIDDBVersionKey);
+    if (version.result == ReadResult::Failed) return false;
+    if (isUsableVersion(version.value)) return true;
+    const auto current = preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion));
+    if (version.result == ReadResult::Damaged) return domain.set({current});
+    const Value now = Value::date(platform::Clock::shared().now());
+    return domain.remove(domain.keys()) &&
+           domain.set({current, preference(kVeltoIDDBCreationDateKey, now)}) && domain.synchronize();
+}
+
+/// The name of a section in the domain.
+std::string_view keyOf(Dictionary Store::*section) {
+    if (section == &Store::accounts) return kVeltoIDDBAccountsKey;
+    return section == &Store::certificates ? kVeltoIDDBCertificatesKey : kVeltoIDDBMetaInfoKey;
 }
 
 /// Changes every record of the accounts by `change(name, record)`.
@@ -96,35 +137,25 @@ platform::Preferences Store::preferences() const {
 bool Store::load() {
     if (!usePreferences_) return true;
     const platform::Preferences domain = preferences();
-    const std::optional<Value> version = readPreference(domain, kVeltoIDDBVersionKey);
-    if (!version || !keepOrInitialize(domain, *version)) return false;
+    if (!keepOrInitialize(domain)) return false;
+    const auto storedAccounts = readSection(domain, kVeltoIDDBAccountsKey, OtherEntries::Drop);
+    const auto storedCertificates = readSection(domain, kVeltoIDDBCertificatesKey, OtherEntries::Drop);
+    const auto storedMetaInfo = readSection(domain, kVeltoIDDBMetaInfoKey, OtherEntries::Keep);
+    const StoredValue storedVersions = readPreference(domain, kVeltoIDDBAccessorVersionsKey);
+    if (!storedAccounts || !storedCertificates || !storedMetaInfo ||
+        storedVersions.result == ReadResult::Failed)
+        return false;
 
-    const auto storedAccounts = readPreference(domain, kVeltoIDDBAccountsKey);
-    const auto storedCertificates = readPreference(domain, kVeltoIDDBCertificatesKey);
-    const auto storedMetaInfo = readPreference(domain, kVeltoIDDBMetaInfoKey);
-    const auto storedVersions = readPreference(domain, kVeltoIDDBAccessorVersionsKey);
-    if (!storedAccounts || !storedCertificates || !storedMetaInfo || !storedVersions) return false;
-
-    accounts = sectionFrom(*storedAccounts, OtherEntries::Drop);
-    certificates = sectionFrom(*storedCertificates, OtherEntries::Drop);
-    metaInfo = sectionFrom(*storedMetaInfo, OtherEntries::Keep);
-    canWrite_ = true;
-    Array versions = storedVersions->asArray() != nullptr ? *storedVersions->asArray() : Array();
+    accounts = *storedAccounts;
+    certificates = *storedCertificates;
+    metaInfo = *storedMetaInfo;
+    loaded_ = true;
+    const Array* stored = storedVersions.value.asArray();
+    Array versions = stored != nullptr ? *stored : Array();
     const bool migrated = migrate(domain, versions);
     const bool recorded = recordAccessor(domain, versions);
-    if (migrated || recorded) writeSections({true, true, true}, false);
+    if (migrated || recorded) writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
     return true;
-}
-
-/// Keeps stored data of a usable version; otherwise starts the domain afresh. False when that fails.
-bool Store::keepOrInitialize(const platform::Preferences& domain, const Value& version) {
-    const std::optional<int64_t> number = version.asInt64();
-    if (number && static_cast<uint64_t>(*number) >= static_cast<uint64_t>(kVeltoIDDBVersion)) return true;
-    return domain.remove(domain.keys()) &&
-           domain.set(
-               {preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion)),
-                preference(kVeltoIDDBCreationDateKey, Value::date(platform::Clock::shared().now()))}) &&
-           domain.synchronize();
 }
 
 /// Puts right what the agents named in "AccessorVersions" left. True when something has to be written; the
@@ -180,16 +211,25 @@ bool Store::recordAccessor(const platform::Preferences& domain, Array versions) 
     return true;
 }
 
-void Store::writeSections(const Sections& sections, bool signal) {
-    if (usePreferences_ && canWrite_) {
-        std::vector<std::pair<std::string, platform::ValueWriter>> values;
-        if (sections.accounts) values.push_back(preference(kVeltoIDDBAccountsKey, accounts));
-        if (sections.certificates) values.push_back(preference(kVeltoIDDBCertificatesKey, certificates));
-        if (sections.metaInfo) values.push_back(preference(kVeltoIDDBMetaInfoKey, metaInfo));
-        preferences().set(values);
-        planFlush();
+bool Store::replace(Dictionary Store::*section, Dictionary changed, bool signal) {
+    if (!isLoaded()) return false;
+    std::swap(this->*section, changed);
+    if (!writeSections({section})) {
+        std::swap(this->*section, changed);
+        return false;
     }
     if (signal && changeSemaphore_) changeSemaphore_->signal();
+    return true;
+}
+
+bool Store::writeSections(std::initializer_list<Dictionary Store::*> sections) {
+    if (!usePreferences_) return true;
+    if (!loaded_) return false;
+    std::vector<std::pair<std::string, platform::ValueWriter>> values;
+    for (Dictionary Store::*section : sections) values.push_back(preference(keyOf(section), this->*section));
+    if (!preferences().set(values)) return false;
+    planFlush();
+    return true;
 }
 
 void Store::planFlush() {
@@ -198,11 +238,11 @@ void Store::planFlush() {
     queue().asyncAfter(kVeltoIDDBFlushDelay, [this] { synchronize(); });
 }
 
-bool Store::synchronize() {
+/// A flush that fails is logged by the preference store; the data survives the process all the same.
+void Store::synchronize() {
     const Transaction keepAlive("VeltoIDDBSynchronize");
     preferences().synchronize();
     pendingFlush_.reset();
-    return true;
 }
 
 }  // namespace database
@@ -216,7 +256,8 @@ void __VeltoIDDBSetPreferencesDomainName(const String& name) {
 void __VeltoIDDBSetUsePreferences(bool usePreferences) {
     database::queue().sync([&] {
         Store& store = database::store();
-        if (store.usePreferences_) store.writeSections({true, true, true}, false);
+        if (store.usePreferences_)
+            store.writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
         store.usePreferences_ = usePreferences;
     });
 }
@@ -228,7 +269,8 @@ void __VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore) {
 bool __VeltoIDDBSynchronize() {
     return database::queue().sync([] {
         Store& store = database::store();
-        return !store.usePreferences_ || store.synchronize();
+        if (store.usePreferences_) store.synchronize();
+        return true;
     });
 }
 
@@ -239,7 +281,7 @@ bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {
         if (store.usePreferences_) {
             const platform::Preferences domain = store.preferences();
             for (const std::string& key : domain.keys())
-                all.set(String(key), database::readPreference(domain, key).value_or(Value()));
+                all.set(String(key), database::readPreference(domain, key).value);
         } else {
             all = {{"Accounts", store.accounts},
                    {"Certificates", store.certificates},

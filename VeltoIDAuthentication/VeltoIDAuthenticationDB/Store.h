@@ -9,6 +9,7 @@
 // until it has run.
 #pragma once
 
+#include <initializer_list>
 #include <memory>
 #include <optional>
 
@@ -46,12 +47,6 @@ bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
 /// For the rooms of the database; their callers use the operations above and those of the other headers.
 namespace database {
 
-struct Sections {
-    bool accounts = false;
-    bool certificates = false;
-    bool metaInfo = false;
-};
-
 /// All members belong to the database queue.
 class Store {
   public:
@@ -62,9 +57,13 @@ class Store {
     /// The record or entry under a key of a section; null when there is none or it is not a Dictionary.
     static const Dictionary* find(const Dictionary& section, const String& key);
 
-    /// Hands the selected sections to the preference store, plans the flush and signals the change semaphore
-    /// if asked.
-    void writeSections(const Sections& sections, bool signal);
+    /// Whether the stored data could be loaded, or none is kept. Otherwise the sections are empty and cannot
+    /// be changed: what could not be read is never overwritten.
+    bool isLoaded() const { return !usePreferences_ || loaded_; }
+
+    /// Replaces one section by a changed one, hands it to the preference store, plans the flush, and signals
+    /// the change semaphore if asked. False, with the section as it was, when it cannot be stored.
+    bool replace(Dictionary Store::*section, Dictionary changed, bool signal);
 
   private:
     friend void veltoid::__VeltoIDDBSetPreferencesDomainName(const String& name);
@@ -76,16 +75,15 @@ class Store {
 
     platform::Preferences preferences() const;
     bool load();
-    static bool keepOrInitialize(const platform::Preferences& domain, const Value& version);
+    bool writeSections(std::initializer_list<Dictionary Store::*> sections);
     bool migrate(const platform::Preferences& domain, Array& versions);
     bool addUserUUID();
     bool recordAccessor(const platform::Preferences& domain, Array versions);
     void planFlush();
-    bool synchronize();
+    void synchronize();
 
     bool usePreferences_ = false;
-    /// Set once the stored data is loaded: what cannot be read is never overwritten.
-    bool canWrite_ = false;
+    bool loaded_ = false;
     String domainName_;
     std::unique_ptr<Transaction> pendingFlush_;
     std::optional<platform::Semaphore> changeSemaphore_;

@@ -33,8 +33,8 @@ Session signIn(const String& accountName, const String& hashedPassword, const Di
     if (!session) return nullptr;
     if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId, true);
     if (!getBool(&options, "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", false)) {
-        Dictionary fetchOptions = options;
-        fetchOptions.set("ForceValidationRecordFetch", Value::boolean(true));
+        const Dictionary fetchOptions =
+            copyDictionarySettingValue(options, "ForceValidationRecordFetch", Value::boolean(true));
         __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
     }
     return session;

@@ -1,1 +1,723 @@
+// The account engine against a real database and keychain, an identity server that is told what to answer,
+// and simulated time.
+#include <functional>
 
+#include "Platform/FakeNotifications.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDAuthenticationImpl/PasswordVerification.h"
+#include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
+#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
+#include "VeltoIDXMLServerCommunications/SignIn.h"
+
+namespace veltoid {
+namespace {
+
+const Value kOn = flag(true);
+const Value kOff = flag(false);
+const Array kEmails{"jane@velto.example"};
+
+class EngineTest : public ServerTest {
+  protected:
+    void SetUp() override {
+        ServerTest::SetUp();
+        server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(101)}});
+        server_.answer("getMyInfo",
+                       Dictionary{{"encDsId", "d1"}, {"firstNm", "Jane"}, {"ValidatedEmail", kEmails}});
+    }
+
+    /// What was posted since the last time: "added/removed", "changed".
+    std::string takePosted() {
+        std::string text;
+        for (const std::string& name : notifications_.take()) {
+            if (name == "HWVeltoIDAccountConfigurationAddedOrRemovedNotification") text += "added/removed ";
+            if (name == "HWVeltoIDAccountConfigurationChangeNotification") text += "changed ";
+        }
+        return text;
+    }
+
+    platform::FakeNotifications notifications_;
+};
+
+// --- Adding
+
+class Adding : public EngineTest {
+  protected:
+    bool add(const Dictionary& options = {}, const String& password = kPassword) {
+        encDsId_ = nullptr;
+        accountRecord_.reset();
+        error_.reset();
+        return __VeltoIDDoAddVeltoID(kName, password, options, &encDsId_, &accountRecord_, &error_);
+    }
+
+    String encDsId_;
+    std::optional<Dictionary> accountRecord_;
+    std::optional<Error> error_;
+};
+
+TEST_F(Adding, StoresTheAccountWhateverTheServerSays) {
+    struct Case {
+        const char* what;
+        Dictionary options;
+        std::function<void()> prepare;
+        const char* methods;
+        const char* encDsId;
+        bool hasRecord;
+        bool keepsPassword;
+        const char* outcome;
+    };
+    const auto nothing = [] {};
+    const Case cases[] = {
+        {"no options", {}, nothing, "authenticate authenticate getMyInfo", "d1", true, true, "succeeded."},
+        {"no information",
+         {{"VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", kOn}},
+         nothing,
+         "authenticate",
+         "d1",
+         true,
+         true,
+         "succeeded."},
+        {"no sign-in", {{"DoNotCheckPassword", kOn}}, nothing, "", nullptr, true, true, "succeeded."},
+        {"options of the wrong kind",
+         {{"DoNotCheckPassword", number(1)}},
+         nothing,
+         "authenticate authenticate getMyInfo",
+         "d1",
+         true,
+         true,
+         "succeeded."},
+        {"no information to be had",
+         {},
+         [this] { server_.refuse("getMyInfo", 500); },
+         "authenticate authenticate getMyInfo",
+         "d1",
+         true,
+         true,
+         "succeeded."},
+        {"no server",
+         {},
+         [this] { server_.refuse("authenticate", 500); },
+         "authenticate",
+         nullptr,
+         false,
+         true,
+         "failed, ERROR:"},
+        {"wrong password",
+         {},
+         [this] { server_.fault("authenticate", -20283); },
+         "authenticate",
+         nullptr,
+         false,
+         false,
+         "failed, ERROR:"},
+    };
+    for (const Case& each : cases) {
+        each.prepare();
+        EXPECT_TRUE(add(each.options)) << each.what;
+        EXPECT_EQ(error_, std::nullopt) << each.what;
+        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
+        EXPECT_EQ(encDsId_, each.encDsId ? String(each.encDsId) : String()) << each.what;
+        EXPECT_EQ(accountRecord_, each.hasRecord ? std::optional(record()) : std::nullopt) << each.what;
+        EXPECT_EQ(record().string("encDsId"), encDsId_) << each.what;
+        EXPECT_EQ(hasPassword(), each.keepsPassword) << each.what;
+        EXPECT_TRUE(log_.lines().back().text.find("VeltoIDAuth: Adding account " + std::string(kName) + " " +
+                                                  each.outcome) != std::string::npos)
+            << each.what << log_.lines().back().text;
+        const std::string posted = takePosted();
+        EXPECT_TRUE(posted.ends_with("added/removed ")) << each.what << posted;
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"ValidatedEmail", kEmails}});
+    }
+}
+
+TEST_F(Adding, FetchesTheValidationRecordAnew) {
+    createAccount();
+    setValue("VeltoIDAccountValidationRecordIdentifierKey", "v1");
+    setValue("VeltoIDAccountValidationRecordData", Data(std::vector<uint8_t>{1}));
+    ASSERT_TRUE(add({{"ForceValidationRecordFetch", kOff}}));
+    const auto calls = server_.take();
+    ASSERT_EQ(calls.back().method, "getMyInfo");
+    EXPECT_EQ(calls.back().parameters["ClientVIDVRecordIdentifier"], Value("")) << "as if there were none";
+    EXPECT_EQ(record()["FirstName"], Value("Jane"));
+}
+
+TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
+    createAccount("d1");
+    const auto readd = [&](const Dictionary& options = {}) {
+        EXPECT_TRUE(add(options, "new hash"));
+        return server_.takeMethods();
+    };
+    setValue("CertificateToken", "t");
+    EXPECT_EQ(readd(), "");
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword(record()), "new hash");
+    EXPECT_EQ(encDsId_, "d1");
+    EXPECT_EQ(accountRecord_, record());
+    EXPECT_EQ(takePosted(), "added/removed ");
+    EXPECT_EQ(
+        log_.count("VeltoIDAuth: Already existing account " + std::string(kName) + " re-added; succeeded."),
+        1);
+    EXPECT_NE(readd({{"ForceCertificateCreation", kOn}}), "");
+
+    setValue("CertificateToken", {});
+    __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERT_ISSUED"}});
+    EXPECT_EQ(readd(), "");
+    __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERTIFICATE_INVALID"}});
+    EXPECT_NE(readd(), "");
+    setValue("CertificateToken", "t");
+    setValue("encDsId", {});
+    EXPECT_EQ(readd(), "");
+    EXPECT_EQ(log_.count(" re-added; failed, "), 1) << "it has no encDsId";
+}
+
+TEST_F(Adding, WhatTheDatabaseRefusesFails) {
+    EXPECT_FALSE(__VeltoIDDoAddVeltoID(nullptr, kPassword, {}, nullptr, nullptr, &error_));
+    EXPECT_EQ(error_->code, -100);
+    std::filesystem::create_directory(platform::TemporaryStateDirectory::file("keychain.db"));
+    EXPECT_FALSE(add());
+    EXPECT_EQ(error_->code, -100);
+    EXPECT_EQ(takePosted(), "");
+    EXPECT_EQ(server_.takeMethods(), "");
+}
+
+// --- Forgetting
+
+TEST_F(EngineTest, ForgettingTakesEverythingAlong) {
+    createAccount("d1");
+    __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
+    __VeltoIDDBSetCertificateInfo("other", std::nullopt);
+    const Data reference = record().data("HashedPasswordRef");
+    std::optional<Error> error;
+    EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}, &error));
+    EXPECT_EQ(error, std::nullopt);
+    EXPECT_EQ(takePosted(), "added/removed changed ");
+    EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount(kName, nullptr));
+    EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
+    EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("other", nullptr));
+    EXPECT_FALSE(copyPasswordFromKeychainGivenPersistentRef(reference, nullptr));
+    EXPECT_TRUE(log_.contains("VeltoIDAuth: Forgetting account " + std::string(kName) + "."));
+
+    EXPECT_FALSE(__VeltoIDForgetVeltoID(kName, {}, &error));
+    EXPECT_EQ(error->code, -100);
+    EXPECT_EQ(takePosted(), "changed ");
+    error.reset();
+    EXPECT_FALSE(__VeltoIDForgetVeltoID(nullptr, {}, &error));
+    EXPECT_EQ(error->code, -100);
+    EXPECT_EQ(takePosted(), "");
+}
+
+TEST_F(EngineTest, ForgettingKeepsACertificateThatAnotherAccountShares) {
+    createAccount("d1");
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", "d1"));
+    __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
+    const Data reference = record().data("HashedPasswordRef");
+    EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+    EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
+    EXPECT_FALSE(copyPasswordFromKeychainGivenPersistentRef(reference, nullptr));
+    EXPECT_TRUE(__VeltoIDForgetVeltoID("other", {}));
+    EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
+}
+
+// --- Account information
+
+class Information : public EngineTest {
+  protected:
+    /// A complete record, validated `age` seconds ago.
+    void prepare(double age) {
+        createAccount("d1");
+        const Dictionary values = {{"ValidatedEmail", kEmails},
+                                   {"ValidationDate", date(-age)},
+                                   {"ForceValidation", Value::null()},
+                                   {"NextValidationDate", Value::null()},
+                                   {"Dirty", Value::null()}};
+        setValues(values);
+    }
+
+    bool get(const Dictionary& options, const String& name = kName) {
+        info_ = Dictionary();
+        error_.reset();
+        return __VeltoIDDoGetMyInfo(name, options, &info_, &error_);
+    }
+
+    Dictionary info_;
+    std::optional<Error> error_;
+};
+
+TEST_F(Information, IsFreshForSomeTime) {
+    struct Case {
+        const char* what;
+        double age;
+        Value own;
+        Value presumed;
+        bool isFresh;
+    };
+    const Case cases[] = {
+        {"now", 0, {}, {}, true},
+        {"two hours", 7200, {}, {}, true},
+        {"eight hours", 28'800, {}, {}, true},
+        {"more", 28'801, {}, {}, false},
+        {"from the future", -1, {}, {}, false},
+        {"its own interval", 100, number(100), {}, true},
+        {"its own interval is over", 101, number(100), {}, false},
+        {"its own is too short", 60, number(30), {}, true},
+        {"and still too short", 61, number(30), {}, false},
+        {"its own is negative", 60, number(-5), {}, true},
+        {"its own is too long", 28'801, number(1'000'000), {}, false},
+        {"its own is no number", 28'800, "5", {}, true},
+        {"presumed by the server", 100, {}, number(100), true},
+        {"presumed, over", 101, {}, number(100), false},
+        {"presumed caps its own", 31, number(50), number(30), false},
+        {"presumed is no number", 28'800, {}, "5", true},
+    };
+    for (const Case& each : cases) {
+        prepare(each.age);
+        setValue("ValidForInterval", each.own);
+        __VeltoIDDBSetMetaInfoValue(nullptr, "AccountPresumedValidInterval", each.presumed);
+        EXPECT_EQ(get({{"SkipValidation", kOn}}), each.isFresh) << each.what;
+    }
+    prepare(0);
+    setValue("ValidationDate", "today");
+    EXPECT_FALSE(get({{"SkipValidation", kOn}}));
+    EXPECT_EQ(error_->code, -100);
+}
+
+TEST_F(Information, IsAskedForWhenItMustBe) {
+    enum class State { Fresh, Stale, FreshAndIncomplete };
+    enum class Server { Up, Down, FailsSignIn, FailsMethod, RefusesPassword };
+    struct Case {
+        const char* what;
+        State state;
+        Dictionary options;
+        Server server;
+        bool answers;
+        const char* methods;
+        bool marks;
+    };
+    const Dictionary skip = {{"SkipValidation", kOn}};
+    const Dictionary defer = {{"DeferValidation", kOn}};
+    const Dictionary force = {{"ForceValidation", kOn}};
+    const Dictionary forceAll = {{"ForceValidationRecordFetch", kOn},
+                                 {"ValidateCertificateSerialNumber", kOn},
+                                 {"ForceValidation", kOn}};
+    const auto with = [](Dictionary options, const char* key) {
+        options.set(key, kOn);
+        return options;
+    };
+    constexpr const char* kAsked = "authenticate getMyInfo";
+    constexpr const char* kTried = "authenticate";
+    const Case cases[] = {
+        {"fresh", State::Fresh, {}, Server::Up, true, "", false},
+        {"fresh, forced", State::Fresh, force, Server::Up, true, kAsked, false},
+        {"fresh, record",
+         State::Fresh,
+         {{"ForceValidationRecordFetch", kOn}},
+         Server::Up,
+         true,
+         kAsked,
+         false},
+        {"fresh, serial",
+         State::Fresh,
+         {{"ValidateCertificateSerialNumber", kOn}},
+         Server::Up,
+         true,
+         kAsked,
+         false},
+        {"fresh, no Boolean", State::Fresh, {{"ForceValidation", number(1)}}, Server::Up, true, "", false},
+        {"stale", State::Stale, {}, Server::Up, true, kAsked, false},
+        {"incomplete", State::FreshAndIncomplete, {}, Server::Up, true, kAsked, false},
+        {"skip, fresh", State::Fresh, skip, Server::Up, true, "", false},
+        {"skip, stale", State::Stale, skip, Server::Up, false, "", false},
+        {"skip, incomplete", State::FreshAndIncomplete, skip, Server::Up, false, "", false},
+        {"skip before all", State::Stale, with(with(forceAll, "SkipValidation"), "DeferValidation"),
+         Server::Up, false, "", false},
+        {"defer, fresh", State::Fresh, defer, Server::Up, true, "", true},
+        {"defer, stale", State::Stale, defer, Server::Up, true, "", true},
+        {"defer, incomplete", State::FreshAndIncomplete, defer, Server::Up, false, "", false},
+        {"defer before force", State::Stale, with(forceAll, "DeferValidation"), Server::Up, true, "", true},
+        {"forced, no server", State::Fresh, force, Server::Down, true, kTried, false},
+        {"stale, no server", State::Stale, {}, Server::Down, true, kTried, true},
+        {"stale, no sign-in", State::Stale, {}, Server::FailsSignIn, true, kTried, true},
+        {"stale, no answer", State::Stale, {}, Server::FailsMethod, true, kAsked, false},
+        {"stale, wrong password", State::Stale, {}, Server::RefusesPassword, true, kTried, true},
+    };
+    for (const Case& each : cases) {
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        prepare(each.state == State::Stale ? 30'000 : 10);
+        if (each.state == State::FreshAndIncomplete) setValue("ValidatedEmail", {});
+        server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
+        server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"ValidatedEmail", kEmails}});
+        switch (each.server) {
+            case Server::Up:
+                break;
+            case Server::Down:
+                server_.refuse("authenticate", 503);
+                break;
+            case Server::FailsSignIn:
+                server_.answer("authenticate", Dictionary());
+                break;
+            case Server::FailsMethod:
+                server_.fault("getMyInfo", -5);
+                break;
+            case Server::RefusesPassword:
+                server_.fault("authenticate", -20101);
+                break;
+        }
+        EXPECT_EQ(get(each.options), each.answers) << each.what;
+        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
+        EXPECT_EQ(error_ ? error_->code : 0, each.answers ? 0 : -100) << each.what;
+        EXPECT_EQ(record()["ForceValidation"], each.marks ? kOn : Value()) << each.what;
+        EXPECT_EQ(record()["NextValidationDate"], each.marks ? date() : Value()) << each.what;
+        const bool validated = each.server == Server::Up && std::string_view(each.methods) == kAsked;
+        EXPECT_EQ(record()["ValidationDate"] == date(), validated) << each.what;
+        EXPECT_EQ(record().contains("Dirty"), each.marks || validated || !hasPassword()) << each.what;
+        EXPECT_EQ(hasPassword(), each.server != Server::RefusesPassword) << each.what;
+        EXPECT_EQ(info_.contains("encDsId"), each.answers && std::string_view(each.methods) != kTried)
+            << each.what << ": unknown when the sign-in failed";
+    }
+}
+
+TEST_F(Information, AMarkDoesNotPutOffAPlannedValidation) {
+    prepare(10);
+    setValue("NextValidationDate", date(77));
+    ASSERT_TRUE(get({{"DeferValidation", kOn}}));
+    EXPECT_EQ(record()["NextValidationDate"], date(77));
+}
+
+TEST_F(Information, AnswersWhatRecordAndCertificateEntryHold) {
+    prepare(10);
+    const Dictionary values = {{"FirstName", "Jane"},
+                               {"LastName", number(1)},
+                               {"EmailAddresess", Array{"a", "b"}},
+                               {"ValidatedPhones", "no list"},
+                               {"PrimaryEmail", "not told"}};
+    setValues(values);
+    const Dictionary expected = {{"VeltoID", kName},          {"encDsId", "d1"},
+                                 {"FirstName", "Jane"},       {"AllEmails", Array{"a", "b"}},
+                                 {"ValidatedEmail", kEmails}, {"ValidationDate", date(-10)}};
+    ASSERT_TRUE(get({}));
+    EXPECT_EQ(info_, expected);
+    __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"Expires", date(5)}, {"SerialNumber", "7"}});
+    __VeltoIDDBSetCertificateValue("d1", "CertificatePEM", "pem", false);
+    __VeltoIDDBSetCertificateValue("d1", "Date", date(1), false);
+    Dictionary withCertificate = expected;
+    withCertificate.set("CertificatePEM", "pem");
+    withCertificate.set("CertificateExpiration", date(5));
+    withCertificate.set("SerialNumber", "7");
+    withCertificate.set("CertificateDate", date(1));
+    ASSERT_TRUE(get({}));
+    EXPECT_EQ(info_, withCertificate);
+    ASSERT_TRUE(get({}, nullptr)) << "without a name, of the first account";
+    EXPECT_EQ(info_, withCertificate);
+}
+
+TEST_F(Information, WithoutAnAccountFails) {
+    EXPECT_FALSE(get({}, nullptr));
+    EXPECT_EQ(error_->code, -100);
+    EXPECT_FALSE(get({}, "nobody"));
+    EXPECT_EQ(error_->code, -108);
+    EXPECT_EQ(server_.takeMethods(), "");
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("no password", nullptr, "d1"));
+    EXPECT_FALSE(get({}, nullptr)) << "the first account is one with a password";
+    Array names{"left over"};
+    ASSERT_TRUE(__VeltoIDCopyVeltoIDs({}, &names));
+    EXPECT_EQ(names, Array{"no password"});
+    __VeltoIDDBRemoveVeltoIDAccount("no password");
+    ASSERT_TRUE(__VeltoIDCopyVeltoIDs({}, &names, &error_));
+    EXPECT_EQ(names, Array()) << "none is no error";
+}
+
+TEST_F(Information, TellsTheServerWhichRecordItHas) {
+    struct Case {
+        const char* what;
+        Dictionary options;
+        Value identifier;
+        Value data;
+        const char* sent;
+    };
+    const Value data = Data(std::vector<uint8_t>{1});
+    const Value noBytes = Data(std::vector<uint8_t>{});
+    const Case cases[] = {
+        {"both", {}, "v1", data, "v1"},
+        {"forced", {{"ForceValidationRecordFetch", kOn}}, "v1", data, ""},
+        {"no identifier", {}, {}, data, ""},
+        {"no data", {}, "v1", {}, ""},
+        {"empty data", {}, "v1", noBytes, ""},
+    };
+    __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
+    for (const Case& each : cases) {
+        prepare(30'000);
+        setValue("VeltoIDAccountValidationRecordIdentifierKey", each.identifier);
+        setValue("VeltoIDAccountValidationRecordData", each.data);
+        ASSERT_TRUE(get(each.options)) << each.what;
+        const Dictionary sent = server_.take().back().parameters;
+        EXPECT_EQ(sent["ClientVIDVRecordIdentifier"], Value(each.sent)) << each.what;
+        EXPECT_EQ(sent["CertificateSerialNumber"], Value("7")) << each.what;
+    }
+}
+
+TEST_F(Information, ChangesThatClientsSeeArePosted) {
+    constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
+    constexpr const char* kData = "VeltoIDAccountValidationRecordData";
+    constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
+    const Data data(std::vector<uint8_t>{1, 2});
+    struct Case {
+        const char* what;
+        Dictionary before;
+        Dictionary answer;
+        bool isPosted;
+    };
+    const Case cases[] = {
+        {"the same", {{"FirstName", "A"}}, {{"FirstName", "A"}}, false},
+        {"a first name", {{"FirstName", "A"}}, {{"FirstName", "B"}}, true},
+        {"a last name", {{"LastName", "A"}}, {{"LastName", "B"}}, true},
+        {"addresses", {{"EmailAddresess", Array{"a"}}}, {{"AllEmails", Array{"b"}}}, true},
+        {"validated addresses", {{"ValidatedEmail", Array{"a"}}}, {{"ValidatedEmail", Array()}}, true},
+        {"validated phones", {{"ValidatedPhones", Array{"a"}}}, {{"ValidatedPhones", Array{"b"}}}, true},
+        {"something new", {}, {{"FirstName", "B"}}, false},
+        {"something gone", {{"FirstName", "A"}}, {}, false},
+        {"something unseen", {{"PrimaryEmail", "a"}}, {{"PrimaryEmail", "b"}}, false},
+        {"another record",
+         {{kIdentifier, "v1"}},
+         {{kIdentifier, "v2"}, {kData, data}, {kNextCheck, date()}},
+         true},
+        {"the same record",
+         {{kIdentifier, "v1"}},
+         {{kIdentifier, "v1"}, {kData, data}, {kNextCheck, date()}},
+         false},
+        {"a first record", {}, {{kIdentifier, "v1"}, {kData, data}, {kNextCheck, date()}}, false},
+        {"a record's identifier alone", {{kIdentifier, "v1"}}, {{kIdentifier, "v2"}}, false},
+    };
+    for (const Case& each : cases) {
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        prepare(30'000);
+        setValue("ValidatedEmail", {});
+        setValues(each.before);
+        setValue("ForceValidation", kOn);
+        setValue("NextValidationDate", date());
+        updateAccountWithGetMyInfoResult(kName, each.answer);
+        EXPECT_EQ(takePosted(), each.isPosted ? "changed " : "") << each.what;
+        EXPECT_FALSE(record().contains("ForceValidation") || record().contains("NextValidationDate"))
+            << each.what;
+        EXPECT_EQ(record()["ValidationDate"], date()) << each.what;
+        for (const auto& [key, value] : each.answer)
+            EXPECT_EQ(record()[key == "AllEmails" ? "EmailAddresess" : key.view()], value) << each.what;
+    }
+    updateAccountWithGetMyInfoResult("nobody", {{"FirstName", "A"}});
+    EXPECT_EQ(takePosted(), "changed ") << "there was no record before";
+    EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount("nobody", nullptr));
+}
+
+TEST_F(Information, AnIncompleteValidationRecordReplacesTheStoredOneByNone) {
+    constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
+    constexpr const char* kData = "VeltoIDAccountValidationRecordData";
+    constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
+    const Data data(std::vector<uint8_t>{1, 2});
+    const Dictionary incomplete[] = {
+        {{kData, data}}, {{kData, data}, {kIdentifier, "v2"}}, {{kData, data}, {kNextCheck, date()}}};
+    for (const Dictionary& answer : incomplete) {
+        prepare(0);
+        const Dictionary before = {{kIdentifier, "v1"}, {kData, data}, {kNextCheck, date()}};
+        setValues(before);
+        updateAccountWithGetMyInfoResult(kName, answer);
+        for (const char* key : {kIdentifier, kData, kNextCheck})
+            EXPECT_FALSE(record().contains(key)) << key << testing::PrintToString(answer);
+    }
+}
+
+TEST_F(Information, TheServersWordOnTheCertificateGoesIntoItsEntry) {
+    prepare(0);
+    __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERT_ISSUED"}, {"Expires", date(1e6)}});
+    updateAccountWithGetMyInfoResult(kName, {{"encDsId", "d1"}, {"FirstName", "A"}});
+    EXPECT_FALSE(certificateEntry().contains("LastSuccessfulValidation"));
+    updateAccountWithGetMyInfoResult(kName, {{"encDsId", "d1"}, {"CertificateIsValid", kOn}});
+    EXPECT_EQ(certificateEntry()["LastSuccessfulValidation"], date());
+    EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERT_ISSUED"));
+    updateAccountWithGetMyInfoResult(kName, {{"encDsId", "d1"}, {"CertificateIsValid", kOff}});
+    EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERTIFICATE_INVALID"));
+    EXPECT_EQ(certificateEntry()["Expires"], date());
+    EXPECT_EQ(log_.count("Marking certificate for Velto ID " + std::string(kName) +
+                         " dsID=\"d1\"as invalid because the server said CertificateIsValid = false. (false"),
+              1);
+    updateAccountWithGetMyInfoResult(kName, {{"CertificateIsValid", kOff}});
+}
+
+// --- Errors of the server, passwords
+
+TEST_F(EngineTest, VerdictsOnThePasswordRemoveIt) {
+    struct Case {
+        std::optional<Error> error;
+        platform::LogPriority level;
+        const char* line;
+    };
+    const auto identity = [](int64_t code) { return Error{kIdentityErrorDomain, code, {}}; };
+    constexpr auto kNotice = platform::LogPriority::Notice;
+    const Case cases[] = {
+        {identity(-101), kNotice, "VeltoIDAuth: The password for account jane@velto.example is incorrect or"},
+        {identity(-102), kNotice, "VeltoIDAuth: The password for account jane@velto.example is incorrect or"},
+        {identity(-105), platform::LogPriority::Warning, "it no longer supports this client"},
+        {identity(-100), kNotice, nullptr},
+        {identity(-103), kNotice, nullptr},
+        {identity(-104), kNotice, nullptr},
+        {Error{kXMLErrorDomain, -101, {}}, kNotice, nullptr},
+        {std::nullopt, kNotice, nullptr},
+    };
+    for (const Case& each : cases) {
+        createAccount();
+        const size_t before = log_.lines().size();
+        handleServerError(kName, each.error);
+        EXPECT_EQ(hasPassword(), each.line == nullptr);
+        const auto lines = log_.lines();
+        ASSERT_EQ(lines.size() - before, each.line != nullptr ? 1U : 0U);
+        if (each.line == nullptr) continue;
+        EXPECT_NE(lines.back().text.find(each.line), std::string::npos) << lines.back().text;
+        EXPECT_EQ(lines.back().priority, each.level);
+    }
+}
+
+TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
+    server_.answer("authenticate",
+                   Dictionary{{"encDsId", "d1"}, {"dsSessionValidityDuration", number(1000)}});
+    const auto verify = [](const String& name, const String& password) {
+        std::optional<Error> error;
+        const bool verified =
+            __VeltoIDDoVerifyPassword(name, password, {{"DoNotUseCachedSession", kOff}}, &error);
+        EXPECT_EQ(verified, !error.has_value());
+        return error ? error->code : 0;
+    };
+    EXPECT_EQ(verify(kName, kPassword), 0);
+    EXPECT_EQ(verify(kName, kPassword), 0);
+    EXPECT_EQ(server_.takeMethods(), "authenticate authenticate");
+    EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount(kName, nullptr)) << "nothing is stored";
+    server_.fault("authenticate", -20101);
+    EXPECT_EQ(verify(kName, kPassword), -101);
+    server_.refuse("authenticate", 500);
+    EXPECT_EQ(verify(kName, kPassword), -100);
+    EXPECT_EQ(verify(nullptr, kPassword), -99);
+    EXPECT_EQ(verify(kName, nullptr), -99);
+    EXPECT_EQ(server_.takeMethods(), "authenticate authenticate");
+}
+
+// --- What an account needs next
+
+TEST_F(EngineTest, StateOfAnAccountFromWhatIsStored) {
+    const auto state = [](const String& name = kName) {
+        std::optional<Error> error;
+        const AccountState found = checkAccountAndDetermineNextAction(name, {}, &error);
+        EXPECT_EQ(error.has_value(), !name);
+        return found;
+    };
+    EXPECT_EQ(state(nullptr), AccountState::Unknown);
+    EXPECT_EQ(state(), AccountState::NoCertificate) << "no such account";
+    createAccount(nullptr);
+    EXPECT_EQ(state(), AccountState::NoEncodedDSID);
+    setValue("encDsId", "d1");
+    EXPECT_EQ(state(), AccountState::NoCertificate);
+    setValue("CertificateToken", "t");
+    EXPECT_EQ(state(), AccountState::CertificatePending);
+    ASSERT_TRUE(removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef")));
+    EXPECT_EQ(state(), AccountState::PasswordInaccessibleInKeychain);
+    EXPECT_EQ(
+        log_.count(
+            "doesn't have a password or the password has been removed from the keychain; no next action."),
+        1);
+    setValue("HashedPasswordRef", "no data");
+    EXPECT_EQ(state(), AccountState::PasswordInvalid);
+    EXPECT_EQ(log_.count(std::string("checkAccount: Velto ID ") + kName +
+                         " doesn't have a password; no next action."),
+              1);
+    EXPECT_EQ(server_.takeMethods(), "");
+}
+
+TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
+    constexpr double kFortnight = 1'209'600;
+    struct Case {
+        const char* what;
+        Dictionary values;
+        std::optional<Dictionary> entry;
+        /// Seconds from now.
+        std::optional<double> next;
+        bool isNewServer = false;
+    };
+    const Value never = Value::null();
+    const auto in = [this](double seconds) { return date(seconds); };
+    const Dictionary entry;
+    const Case cases[] = {
+        {"nothing foreseen", {}, entry, {}},
+        {"dirty", {{"Dirty", kOn}}, entry, 0},
+        {"no encDsId", {{"encDsId", never}}, {}, 0},
+        {"no encDsId, tried",
+         {{"encDsId", never}, {"LastConnectAttempt", in(-100)}, {"NextCertificateFetchDate", in(9e9)}},
+         {},
+         200},
+        {"forced validation", {{"ForceValidation", kOn}, {"NextValidationDate", in(50)}}, entry, 0},
+        {"next validation", {{"NextValidationDate", in(50)}, {"ValidationDate", in(0)}}, entry, 50},
+        {"last validation", {{"ValidationDate", in(-100)}}, entry, kFortnight - 100},
+        {"embargo",
+         {{"EarliestAllowedConnectionDate", in(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}},
+         entry,
+         1000},
+        {"embargo, an earlier expiry",
+         {{"EarliestAllowedConnectionDate", in(1000)}},
+         Dictionary{{"Expires", in(10)}, {"NextRenewalAttempt", in(5)}},
+         10},
+        {"embargo, no certificate", {{"EarliestAllowedConnectionDate", in(1000)}}, {}, 1000},
+        {"embargo is over", {{"EarliestAllowedConnectionDate", in(-1)}, {"ClientTooOld", kOn}}, entry, {}},
+        {"too old", {{"ClientTooOld", kOn}, {"ForceValidation", kOn}}, {}, 3'153'600'000},
+        {"an expiry", {}, Dictionary{{"Expires", in(500)}}, 500},
+        {"a renewal", {}, Dictionary{{"Expires", in(500)}, {"NextRenewalAttempt", in(400)}}, 400},
+        {"a validated certificate", {}, Dictionary{{"LastSuccessfulValidation", in(-50)}}, kFortnight - 50},
+        {"no certificate", {}, {}, 0},
+        {"a fetch", {{"NextCertificateFetchDate", in(30)}, {"CSRGenerationDate", in(-10)}}, {}, 30},
+        {"a request", {{"CSRGenerationDate", in(-10)}}, {}, 3590},
+        {"a request with interval",
+         {{"CSRGenerationDate", in(-10)}, {"CSRGenerationInterval", number(60)}},
+         {},
+         50},
+        {"a request from the future", {{"CSRGenerationDate", in(10)}}, {}, 0},
+        {"a record is not looked at",
+         {{"VeltoIDAccountValidationRecordNextCheckDateKey", in(40)}},
+         entry,
+         {}},
+        {"a record is looked at",
+         {{"VeltoIDAccountValidationRecordNextCheckDateKey", in(40)}},
+         entry,
+         40,
+         true},
+        {"a record without date", {{"VeltoIDAccountValidationRecordIdentifierKey", "v"}}, entry, {}, true},
+        {"no record", {}, entry, 0, true},
+    };
+    for (const Case& each : cases) {
+        const bool isNewServer = each.isNewServer;
+        server_.answer("authenticate",
+                       Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(isNewServer ? 101 : 100)}});
+        __VeltoIDDoVerifyPassword("somebody", kPassword, {});
+        ASSERT_EQ(__VeltoIDSessionGetServerVersion(), isNewServer ? 101 : 100);
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        createAccount("d1");
+        setValue("Dirty", {});
+        setValues(each.values);
+        __VeltoIDDBRemoveCertificateInfo("d1");
+        if (each.entry) {
+            __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
+            for (const auto& [key, value] : *each.entry)
+                __VeltoIDDBSetCertificateValue("d1", key, value, false);
+        }
+        std::optional<double> next = -1;
+        EXPECT_TRUE(copyNextActionDateForAccount(kName, &next)) << each.what;
+        EXPECT_EQ(next ? Value::date(*next) : Value(), each.next ? date(*each.next) : Value()) << each.what;
+    }
+    __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(100));
+    setValue("ValidationDate", date(-30));
+    setValue("VeltoIDAccountValidationRecordIdentifierKey", "v");
+    std::optional<double> next;
+    EXPECT_TRUE(copyNextActionDateForAccount(kName, &next));
+    EXPECT_EQ(next, now() + 70);
+    EXPECT_FALSE(copyNextActionDateForAccount("nobody", &next));
+    EXPECT_EQ(next, std::nullopt);
+    ASSERT_TRUE(__VeltoIDDBRemovePassword(kName));
+    EXPECT_FALSE(copyNextActionDateForAccount(kName, &next)) << "without a password nothing can be done";
+}
+
+}  // namespace
+}  // namespace veltoid

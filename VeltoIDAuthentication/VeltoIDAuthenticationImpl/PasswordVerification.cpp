@@ -1,5 +1,7 @@
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
 
+#include "Values/DictionaryAccess.h"
+#include "VeltoIDXMLServerCommunications/SessionCache.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -10,13 +12,13 @@ bool __VeltoIDDoVerifyPassword(const String& accountName, const String& hashedPa
         fillError(error, VELTOID_ERROR(identity_error::kInvalidParameters));
         return false;
     }
-    Dictionary signInOptions = options;
-    signInOptions.set("DoNotUseCachedSession", Value::boolean(true));
+    const Dictionary signInOptions =
+        copyDictionarySettingValue(options, "DoNotUseCachedSession", Value::boolean(true));
     std::optional<Error> sessionError;
     Session session = __VeltoIDSessionDoCreateSession(accountName, hashedPassword, signInOptions, nullptr,
                                                       nullptr, &sessionError);
     if (session) {
-        __VeltoIDSessionRelease(std::move(session));
+        destroySession(std::move(session));
         return true;
     }
     fillError(error, sessionError ? *sessionError : VELTOID_ERROR(identity_error::kInvalidAccountOrPassword));

@@ -1,6 +1,7 @@
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 
 #include <algorithm>
+#include <cmath>
 #include <cstdio>
 #include <cstdlib>
 #include <string>
@@ -48,12 +49,10 @@ Value commandValue(const Value& value) {
 }
 
 void applyValidityDuration(VeltoIDAuthenticationSessionInfo& session, const Value& duration) {
-    if (const auto seconds = duration.asDouble()) {
-        session.fValidityDuration = std::max(*seconds, 0.0);
-    } else if (const String text = duration.asString()) {
-        const double value = std::strtod(text.text().c_str(), nullptr);
-        session.fValidityDuration = value > 0 ? value : 0;
-    }
+    std::optional<double> seconds = duration.asDouble();
+    if (const String text = duration.asString()) seconds = std::strtod(text.text().c_str(), nullptr);
+    // No session lasts for ever, whatever the server says.
+    if (seconds) session.fValidityDuration = std::isfinite(*seconds) ? std::max(*seconds, 0.0) : 0;
 }
 
 void applyRelaunch(const Dictionary& reply) {
@@ -73,7 +72,7 @@ void applyFlushAndExit(const Dictionary& reply) {
         "xmlInvoke", kNotice,
         "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
     __VeltoIDDBSynchronize();
-    platform::event_loop::exitProcess(EXIT_SUCCESS);
+    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
 }
 
 void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& reply) {

@@ -5,6 +5,7 @@
 #include <cmath>
 #include <limits>
 
+#include "Platform/UTF8.h"
 #include "Values/Error.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 
@@ -142,8 +143,9 @@ TEST(XMLRPCHelpers, KnowsUTF8) {
     const char* const bad[] = {
         "\x80",         "\xC1\xBF",  "\xE0\x9F\xBF", "\xED\xA0\x80",     "\xF0\x8F\xBF\xBF",
         "\xF5\x80\x80", "a\xE2\x82", "\xC3(",        "\xF4\x90\x80\x80", "\xE2\x28\xA1"};
-    for (const char* text : good) EXPECT_TRUE(isUTF8(text)) << text;
-    for (const char* text : bad) EXPECT_FALSE(isUTF8(text)) << testing::PrintToString(std::string(text));
+    for (const char* text : good) EXPECT_TRUE(platform::isUTF8(text)) << text;
+    for (const char* text : bad)
+        EXPECT_FALSE(platform::isUTF8(text)) << testing::PrintToString(std::string(text));
 }
 
 TEST(XMLRPCHelpers, IdentifiersAreUUIDsAndDiffer) {

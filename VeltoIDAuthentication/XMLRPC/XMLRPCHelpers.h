@@ -21,9 +21,6 @@ String base64EncodedString(platform::Bytes bytes);
 /// text holds a non-ASCII character.
 Data dataFromBase64String(std::string_view text);
 
-/// Whether the text is well-formed UTF-8 (RFC 3629).
-bool isUTF8(std::string_view text);
-
 /// A new random UUID: 36 characters with hyphens.
 String stringByGeneratingUUID();
 

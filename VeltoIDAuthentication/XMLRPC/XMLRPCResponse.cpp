@@ -1,5 +1,6 @@
 #include "XMLRPC/XMLRPCResponse.h"
 
+#include "Platform/UTF8.h"
 #include "XMLRPC/XMLRPCEventBasedParser.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 
@@ -13,7 +14,7 @@ XMLRPCResponse::XMLRPCResponse(platform::SecretBytes data) : myBody(std::move(da
 
 String XMLRPCResponse::body() const {
     const std::string_view text = platform::textOf(myBody);
-    return isUTF8(text) ? String(text) : String();
+    return platform::isUTF8(text) ? String(text) : String();
 }
 
 const Value& XMLRPCResponse::faultEntry(std::string_view key) const {
