@@ -24,8 +24,8 @@ from collections.abc import Iterator
 from dataclasses import dataclass
 
 ROOT = pathlib.Path(__file__).resolve().parent.parent
-sys.path.insert(0, str(ROOT / "Tests"))
-from harness import (ACCOUNT, ADD, INFO, LIST, PASSWORD, PING, SERVICE, STATUS, Client, IdentityServer,  # noqa: E402
+sys.path.insert(0, str(ROOT / "scripts"))
+from world import (ACCOUNT, ADD, INFO, LIST, PASSWORD, PING, SERVICE, STATUS, Client, IdentityServer,  # noqa: E402
                      World, hashed)
 from jeepney import message_bus  # noqa: E402
 from jeepney.io.blocking import Proxy  # noqa: E402

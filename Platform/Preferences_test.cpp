@@ -78,7 +78,7 @@ TEST_F(PreferencesTest, SetsAllOrNothing) {
     }
 }
 
-TEST_F(PreferencesTest, ADamagedValueCountsAsAbsentAndHarmsNoOther) {
+TEST_F(PreferencesTest, ADamagedValueIsToldApartAndHarmsNoOther) {
     ASSERT_TRUE(domain_.set({{"bad", text("confidential")}, {"good", text("fine")}}));
     sqlite3* database = nullptr;
     ASSERT_EQ(sqlite3_open(TemporaryStateDirectory::file("preferences.db").c_str(), &database), SQLITE_OK);
@@ -88,12 +88,16 @@ TEST_F(PreferencesTest, ADamagedValueCountsAsAbsentAndHarmsNoOther) {
             std::string("UPDATE preferences SET value = ") + damaged + " WHERE key = 'bad'";
         ASSERT_EQ(sqlite3_exec(database, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << damaged;
         const FakeSystemLog log;
-        EXPECT_EQ(value(domain_, "bad"), "absent") << damaged;
+        RecordingSink sink;
+        EXPECT_EQ(domain_.read("bad", sink), Preferences::ReadResult::Damaged) << damaged;
         EXPECT_EQ(value(domain_, "good"), "\"fine\"") << damaged;
         EXPECT_TRUE(log.contains("\"bad\" is damaged")) << damaged;
         EXPECT_FALSE(log.contains("confidential")) << damaged;
     }
     sqlite3_close(database);
+    EXPECT_TRUE(domain_.setAside("bad"));
+    EXPECT_EQ(domain_.keys(), std::vector<std::string>{"good"});
+    EXPECT_EQ(Preferences("com.example.one.damaged").keys().size(), 1U);
     EXPECT_TRUE(domain_.set({{"bad", text("new")}}));
     EXPECT_EQ(value(domain_, "bad"), "\"new\"");
 }

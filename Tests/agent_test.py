@@ -8,11 +8,13 @@ import pathlib
 import signal
 import sqlite3
 import subprocess
+import sys
 import unittest
 
-from harness import (ACCOUNT, ADD, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD,
-                     PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE, VERIFY, BusError,
-                     World, agent_program, hashed)
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+from world import (ACCOUNT, ADD, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD,  # noqa: E402
+                   PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE, VERIFY, BusError,
+                   World, agent_program, hashed)
 
 ENGINE = "HWIdentityErrorDomain"
 

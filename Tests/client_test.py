@@ -6,9 +6,12 @@ import json
 import os
 import pty
 import subprocess
+import pathlib
+import sys
 import unittest
 
-from harness import ACCOUNT, PASSWORD, World, hashed
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+from world import ACCOUNT, PASSWORD, World, hashed  # noqa: E402
 
 
 def client_program() -> str:

@@ -9,9 +9,12 @@ import os
 import random
 import signal
 import threading
+import pathlib
+import sys
 import unittest
 
-from harness import ADD, DATABASE, FORGET, LIST, SET_VALUE, STATUS, BusError, World, hashed
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+from world import ADD, DATABASE, FORGET, LIST, SET_VALUE, STATUS, BusError, World, hashed  # noqa: E402
 
 ROUNDS = int(os.environ.get("VELTOID_CRASH_ROUNDS", "200"))
 LONGEST_TRAFFIC = 0.25

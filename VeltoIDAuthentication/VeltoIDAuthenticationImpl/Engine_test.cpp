@@ -19,13 +19,30 @@ const Value kOn = flag(true);
 const Value kOff = flag(false);
 const Array kEmails{"jane@velto.example"};
 
+// Keys of records.
+constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
+constexpr const char* kData = "VeltoIDAccountValidationRecordData";
+constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
+constexpr const char* kEmbargo = "EarliestAllowedConnectionDate";
+const Value kRecordData = Data(std::vector<uint8_t>{1, 2});
+
+enum class Server { Up, Down, NoSignIn, NoAnswer, RefusesPassword };
+
 class EngineTest : public ServerTest {
   protected:
     void SetUp() override {
         ServerTest::SetUp();
+        serverIs(Server::Up);
+    }
+
+    void serverIs(Server state) {
         server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(101)}});
         server_.answer("getMyInfo",
                        Dictionary{{"encDsId", "d1"}, {"firstNm", "Jane"}, {"ValidatedEmail", kEmails}});
+        if (state == Server::Down) server_.refuse("authenticate", 503);
+        if (state == Server::NoSignIn) server_.answer("authenticate", Dictionary());
+        if (state == Server::NoAnswer) server_.fault("getMyInfo", -5);
+        if (state == Server::RefusesPassword) server_.fault("authenticate", -20101);
     }
 
     /// What was posted since the last time: "added/removed", "changed".
@@ -61,81 +78,43 @@ TEST_F(Adding, StoresTheAccountWhateverTheServerSays) {
     struct Case {
         const char* what;
         Dictionary options;
-        std::function<void()> prepare;
+        Server server;
         const char* methods;
-        const char* encDsId;
-        bool hasRecord;
-        bool keepsPassword;
-        const char* outcome;
+        bool signsIn;
+        bool succeeds;
     };
-    const auto nothing = [] {};
+    const Dictionary noInformation = {{"VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", kOn}};
+    constexpr const char* kAll = "authenticate authenticate getMyInfo";
     const Case cases[] = {
-        {"no options", {}, nothing, "authenticate authenticate getMyInfo", "d1", true, true, "succeeded."},
-        {"no information",
-         {{"VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", kOn}},
-         nothing,
-         "authenticate",
-         "d1",
-         true,
-         true,
-         "succeeded."},
-        {"no sign-in", {{"DoNotCheckPassword", kOn}}, nothing, "", nullptr, true, true, "succeeded."},
-        {"options of the wrong kind",
-         {{"DoNotCheckPassword", number(1)}},
-         nothing,
-         "authenticate authenticate getMyInfo",
-         "d1",
-         true,
-         true,
-         "succeeded."},
-        {"no information to be had",
-         {},
-         [this] { server_.refuse("getMyInfo", 500); },
-         "authenticate authenticate getMyInfo",
-         "d1",
-         true,
-         true,
-         "succeeded."},
-        {"no server",
-         {},
-         [this] { server_.refuse("authenticate", 500); },
-         "authenticate",
-         nullptr,
-         false,
-         true,
-         "failed, ERROR:"},
-        {"wrong password",
-         {},
-         [this] { server_.fault("authenticate", -20283); },
-         "authenticate",
-         nullptr,
-         false,
-         false,
-         "failed, ERROR:"},
+        {"no options", {}, Server::Up, kAll, true, true},
+        {"no information", noInformation, Server::Up, "authenticate", true, true},
+        {"no sign-in", {{"DoNotCheckPassword", kOn}}, Server::Up, "", false, true},
+        {"an option of the wrong kind", {{"DoNotCheckPassword", number(1)}}, Server::Up, kAll, true, true},
+        {"no information to be had", {}, Server::NoAnswer, kAll, true, true},
+        {"no server", {}, Server::Down, "authenticate", false, false},
+        {"wrong password", {}, Server::RefusesPassword, "authenticate", false, false},
     };
     for (const Case& each : cases) {
-        each.prepare();
+        serverIs(each.server);
         EXPECT_TRUE(add(each.options)) << each.what;
         EXPECT_EQ(error_, std::nullopt) << each.what;
         EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        EXPECT_EQ(encDsId_, each.encDsId ? String(each.encDsId) : String()) << each.what;
-        EXPECT_EQ(accountRecord_, each.hasRecord ? std::optional(record()) : std::nullopt) << each.what;
+        EXPECT_EQ(encDsId_, each.signsIn ? String("d1") : String()) << each.what;
         EXPECT_EQ(record().string("encDsId"), encDsId_) << each.what;
-        EXPECT_EQ(hasPassword(), each.keepsPassword) << each.what;
-        EXPECT_TRUE(log_.lines().back().text.find("VeltoIDAuth: Adding account " + std::string(kName) + " " +
-                                                  each.outcome) != std::string::npos)
-            << each.what << log_.lines().back().text;
-        const std::string posted = takePosted();
-        EXPECT_TRUE(posted.ends_with("added/removed ")) << each.what << posted;
+        EXPECT_EQ(accountRecord_, each.succeeds ? std::optional(record()) : std::nullopt) << each.what;
+        EXPECT_EQ(hasPassword(), each.server != Server::RefusesPassword) << each.what;
+        const std::string line = std::string("VeltoIDAuth: Adding account ") + kName +
+                                 (each.succeeds ? " succeeded." : " failed, ERROR:");
+        EXPECT_NE(log_.lines().back().text.find(line), std::string::npos) << each.what;
+        EXPECT_TRUE(takePosted().ends_with("added/removed ")) << each.what;
         __VeltoIDDBRemoveVeltoIDAccount(kName);
-        server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"ValidatedEmail", kEmails}});
     }
 }
 
 TEST_F(Adding, FetchesTheValidationRecordAnew) {
     createAccount();
-    setValue("VeltoIDAccountValidationRecordIdentifierKey", "v1");
-    setValue("VeltoIDAccountValidationRecordData", Data(std::vector<uint8_t>{1}));
+    setValue(kIdentifier, "v1");
+    setValue(kData, Data(std::vector<uint8_t>{1}));
     ASSERT_TRUE(add({{"ForceValidationRecordFetch", kOff}}));
     const auto calls = server_.take();
     ASSERT_EQ(calls.back().method, "getMyInfo");
@@ -283,8 +262,8 @@ TEST_F(Information, IsFreshForSomeTime) {
 }
 
 TEST_F(Information, IsAskedForWhenItMustBe) {
-    enum class State { Fresh, Stale, FreshAndIncomplete };
-    enum class Server { Up, Down, FailsSignIn, FailsMethod, RefusesPassword };
+    enum class State { Fresh, Stale, Incomplete };
+    using enum State;
     struct Case {
         const char* what;
         State state;
@@ -294,75 +273,41 @@ TEST_F(Information, IsAskedForWhenItMustBe) {
         const char* methods;
         bool marks;
     };
-    const Dictionary skip = {{"SkipValidation", kOn}};
-    const Dictionary defer = {{"DeferValidation", kOn}};
-    const Dictionary force = {{"ForceValidation", kOn}};
-    const Dictionary forceAll = {{"ForceValidationRecordFetch", kOn},
-                                 {"ValidateCertificateSerialNumber", kOn},
-                                 {"ForceValidation", kOn}};
-    const auto with = [](Dictionary options, const char* key) {
-        options.set(key, kOn);
-        return options;
-    };
+    constexpr const char* kRecord = "ForceValidationRecordFetch";
+    constexpr const char* kSerial = "ValidateCertificateSerialNumber";
+    constexpr const char* kForce = "ForceValidation";
+    constexpr const char* kSkip = "SkipValidation";
+    constexpr const char* kDefer = "DeferValidation";
     constexpr const char* kAsked = "authenticate getMyInfo";
     constexpr const char* kTried = "authenticate";
+    const Dictionary skipBeforeAll = {
+        {kSkip, kOn}, {kDefer, kOn}, {kRecord, kOn}, {kSerial, kOn}, {kForce, kOn}};
     const Case cases[] = {
-        {"fresh", State::Fresh, {}, Server::Up, true, "", false},
-        {"fresh, forced", State::Fresh, force, Server::Up, true, kAsked, false},
-        {"fresh, record",
-         State::Fresh,
-         {{"ForceValidationRecordFetch", kOn}},
-         Server::Up,
-         true,
-         kAsked,
-         false},
-        {"fresh, serial",
-         State::Fresh,
-         {{"ValidateCertificateSerialNumber", kOn}},
-         Server::Up,
-         true,
-         kAsked,
-         false},
-        {"fresh, no Boolean", State::Fresh, {{"ForceValidation", number(1)}}, Server::Up, true, "", false},
-        {"stale", State::Stale, {}, Server::Up, true, kAsked, false},
-        {"incomplete", State::FreshAndIncomplete, {}, Server::Up, true, kAsked, false},
-        {"skip, fresh", State::Fresh, skip, Server::Up, true, "", false},
-        {"skip, stale", State::Stale, skip, Server::Up, false, "", false},
-        {"skip, incomplete", State::FreshAndIncomplete, skip, Server::Up, false, "", false},
-        {"skip before all", State::Stale, with(with(forceAll, "SkipValidation"), "DeferValidation"),
-         Server::Up, false, "", false},
-        {"defer, fresh", State::Fresh, defer, Server::Up, true, "", true},
-        {"defer, stale", State::Stale, defer, Server::Up, true, "", true},
-        {"defer, incomplete", State::FreshAndIncomplete, defer, Server::Up, false, "", false},
-        {"defer before force", State::Stale, with(forceAll, "DeferValidation"), Server::Up, true, "", true},
-        {"forced, no server", State::Fresh, force, Server::Down, true, kTried, false},
-        {"stale, no server", State::Stale, {}, Server::Down, true, kTried, true},
-        {"stale, no sign-in", State::Stale, {}, Server::FailsSignIn, true, kTried, true},
-        {"stale, no answer", State::Stale, {}, Server::FailsMethod, true, kAsked, false},
-        {"stale, wrong password", State::Stale, {}, Server::RefusesPassword, true, kTried, true},
+        {"fresh", Fresh, {}, Server::Up, true, "", false},
+        {"forced", Fresh, {{kForce, kOn}}, Server::Up, true, kAsked, false},
+        {"record", Fresh, {{kRecord, kOn}}, Server::Up, true, kAsked, false},
+        {"serial", Fresh, {{kSerial, kOn}}, Server::Up, true, kAsked, false},
+        {"no Boolean", Fresh, {{kForce, number(1)}}, Server::Up, true, "", false},
+        {"stale", Stale, {}, Server::Up, true, kAsked, false},
+        {"incomplete", Incomplete, {}, Server::Up, true, kAsked, false},
+        {"skip, fresh", Fresh, {{kSkip, kOn}}, Server::Up, true, "", false},
+        {"skip, stale", Stale, {{kSkip, kOn}}, Server::Up, false, "", false},
+        {"skip, incomplete", Incomplete, {{kSkip, kOn}}, Server::Up, false, "", false},
+        {"skip before all", Stale, skipBeforeAll, Server::Up, false, "", false},
+        {"defer, fresh", Fresh, {{kDefer, kOn}}, Server::Up, true, "", true},
+        {"defer, incomplete", Incomplete, {{kDefer, kOn}}, Server::Up, false, "", false},
+        {"defer before force", Stale, {{kDefer, kOn}, {kForce, kOn}}, Server::Up, true, "", true},
+        {"forced, no server", Fresh, {{kForce, kOn}}, Server::Down, true, kTried, false},
+        {"stale, no server", Stale, {}, Server::Down, true, kTried, true},
+        {"stale, no sign-in", Stale, {}, Server::NoSignIn, true, kTried, true},
+        {"stale, no answer", Stale, {}, Server::NoAnswer, true, kAsked, false},
+        {"stale, wrong password", Stale, {}, Server::RefusesPassword, true, kTried, true},
     };
     for (const Case& each : cases) {
         __VeltoIDDBRemoveVeltoIDAccount(kName);
-        prepare(each.state == State::Stale ? 30'000 : 10);
-        if (each.state == State::FreshAndIncomplete) setValue("ValidatedEmail", {});
-        server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
-        server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"ValidatedEmail", kEmails}});
-        switch (each.server) {
-            case Server::Up:
-                break;
-            case Server::Down:
-                server_.refuse("authenticate", 503);
-                break;
-            case Server::FailsSignIn:
-                server_.answer("authenticate", Dictionary());
-                break;
-            case Server::FailsMethod:
-                server_.fault("getMyInfo", -5);
-                break;
-            case Server::RefusesPassword:
-                server_.fault("authenticate", -20101);
-                break;
-        }
+        prepare(each.state == Stale ? 30'000 : 10);
+        if (each.state == Incomplete) setValue("ValidatedEmail", {});
+        serverIs(each.server);
         EXPECT_EQ(get(each.options), each.answers) << each.what;
         EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
         EXPECT_EQ(error_ ? error_->code : 0, each.answers ? 0 : -100) << each.what;
@@ -375,13 +320,9 @@ TEST_F(Information, IsAskedForWhenItMustBe) {
         EXPECT_EQ(info_.contains("encDsId"), each.answers && std::string_view(each.methods) != kTried)
             << each.what << ": unknown when the sign-in failed";
     }
-}
-
-TEST_F(Information, AMarkDoesNotPutOffAPlannedValidation) {
-    prepare(10);
     setValue("NextValidationDate", date(77));
-    ASSERT_TRUE(get({{"DeferValidation", kOn}}));
-    EXPECT_EQ(record()["NextValidationDate"], date(77));
+    ASSERT_TRUE(get({{kDefer, kOn}}));
+    EXPECT_EQ(record()["NextValidationDate"], date(77)) << "a mark does not put off a planned validation";
 }
 
 TEST_F(Information, AnswersWhatRecordAndCertificateEntryHold) {
@@ -435,20 +376,19 @@ TEST_F(Information, TellsTheServerWhichRecordItHas) {
         Value data;
         const char* sent;
     };
-    const Value data = Data(std::vector<uint8_t>{1});
     const Value noBytes = Data(std::vector<uint8_t>{});
     const Case cases[] = {
-        {"both", {}, "v1", data, "v1"},
-        {"forced", {{"ForceValidationRecordFetch", kOn}}, "v1", data, ""},
-        {"no identifier", {}, {}, data, ""},
+        {"both", {}, "v1", kRecordData, "v1"},
+        {"forced", {{"ForceValidationRecordFetch", kOn}}, "v1", kRecordData, ""},
+        {"no identifier", {}, {}, kRecordData, ""},
         {"no data", {}, "v1", {}, ""},
         {"empty data", {}, "v1", noBytes, ""},
     };
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
     for (const Case& each : cases) {
         prepare(30'000);
-        setValue("VeltoIDAccountValidationRecordIdentifierKey", each.identifier);
-        setValue("VeltoIDAccountValidationRecordData", each.data);
+        setValue(kIdentifier, each.identifier);
+        setValue(kData, each.data);
         ASSERT_TRUE(get(each.options)) << each.what;
         const Dictionary sent = server_.take().back().parameters;
         EXPECT_EQ(sent["ClientVIDVRecordIdentifier"], Value(each.sent)) << each.what;
@@ -457,15 +397,14 @@ TEST_F(Information, TellsTheServerWhichRecordItHas) {
 }
 
 TEST_F(Information, ChangesThatClientsSeeArePosted) {
-    constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
-    constexpr const char* kData = "VeltoIDAccountValidationRecordData";
-    constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
-    const Data data(std::vector<uint8_t>{1, 2});
     struct Case {
         const char* what;
         Dictionary before;
         Dictionary answer;
         bool isPosted;
+    };
+    const auto newRecord = [this](const char* identifier) {
+        return Dictionary{{kIdentifier, identifier}, {kData, kRecordData}, {kNextCheck, date()}};
     };
     const Case cases[] = {
         {"the same", {{"FirstName", "A"}}, {{"FirstName", "A"}}, false},
@@ -477,15 +416,9 @@ TEST_F(Information, ChangesThatClientsSeeArePosted) {
         {"something new", {}, {{"FirstName", "B"}}, false},
         {"something gone", {{"FirstName", "A"}}, {}, false},
         {"something unseen", {{"PrimaryEmail", "a"}}, {{"PrimaryEmail", "b"}}, false},
-        {"another record",
-         {{kIdentifier, "v1"}},
-         {{kIdentifier, "v2"}, {kData, data}, {kNextCheck, date()}},
-         true},
-        {"the same record",
-         {{kIdentifier, "v1"}},
-         {{kIdentifier, "v1"}, {kData, data}, {kNextCheck, date()}},
-         false},
-        {"a first record", {}, {{kIdentifier, "v1"}, {kData, data}, {kNextCheck, date()}}, false},
+        {"another record", {{kIdentifier, "v1"}}, newRecord("v2"), true},
+        {"the same record", {{kIdentifier, "v1"}}, newRecord("v1"), false},
+        {"a first record", {}, newRecord("v1"), false},
         {"a record's identifier alone", {{kIdentifier, "v1"}}, {{kIdentifier, "v2"}}, false},
     };
     for (const Case& each : cases) {
@@ -509,16 +442,12 @@ TEST_F(Information, ChangesThatClientsSeeArePosted) {
 }
 
 TEST_F(Information, AnIncompleteValidationRecordReplacesTheStoredOneByNone) {
-    constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
-    constexpr const char* kData = "VeltoIDAccountValidationRecordData";
-    constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
-    const Data data(std::vector<uint8_t>{1, 2});
-    const Dictionary incomplete[] = {
-        {{kData, data}}, {{kData, data}, {kIdentifier, "v2"}}, {{kData, data}, {kNextCheck, date()}}};
+    const Dictionary incomplete[] = {{{kData, kRecordData}},
+                                     {{kData, kRecordData}, {kIdentifier, "v2"}},
+                                     {{kData, kRecordData}, {kNextCheck, date()}}};
     for (const Dictionary& answer : incomplete) {
         prepare(0);
-        const Dictionary before = {{kIdentifier, "v1"}, {kData, data}, {kNextCheck, date()}};
-        setValues(before);
+        setValues({{kIdentifier, "v1"}, {kData, kRecordData}, {kNextCheck, date()}});
         updateAccountWithGetMyInfoResult(kName, answer);
         for (const char* key : {kIdentifier, kData, kNextCheck})
             EXPECT_FALSE(record().contains(key)) << key << testing::PrintToString(answer);
@@ -587,8 +516,9 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
     };
     EXPECT_EQ(verify(kName, kPassword), 0);
     EXPECT_EQ(verify(kName, kPassword), 0);
-    EXPECT_EQ(server_.takeMethods(), "authenticate authenticate");
-    EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount(kName, nullptr)) << "nothing is stored";
+    EXPECT_NE(__VeltoIDSessionDoCreateSession(kName, kPassword, {}), nullptr);
+    EXPECT_EQ(server_.takeMethods(), "authenticate authenticate authenticate") << "nor is a session kept";
+    EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount(kName, nullptr));
     server_.fault("authenticate", -20101);
     EXPECT_EQ(verify(kName, kPassword), -101);
     server_.refuse("authenticate", 500);
@@ -600,35 +530,6 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
 
 // --- What an account needs next
 
-TEST_F(EngineTest, StateOfAnAccountFromWhatIsStored) {
-    const auto state = [](const String& name = kName) {
-        std::optional<Error> error;
-        const AccountState found = checkAccountAndDetermineNextAction(name, {}, &error);
-        EXPECT_EQ(error.has_value(), !name);
-        return found;
-    };
-    EXPECT_EQ(state(nullptr), AccountState::Unknown);
-    EXPECT_EQ(state(), AccountState::NoCertificate) << "no such account";
-    createAccount(nullptr);
-    EXPECT_EQ(state(), AccountState::NoEncodedDSID);
-    setValue("encDsId", "d1");
-    EXPECT_EQ(state(), AccountState::NoCertificate);
-    setValue("CertificateToken", "t");
-    EXPECT_EQ(state(), AccountState::CertificatePending);
-    ASSERT_TRUE(removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef")));
-    EXPECT_EQ(state(), AccountState::PasswordInaccessibleInKeychain);
-    EXPECT_EQ(
-        log_.count(
-            "doesn't have a password or the password has been removed from the keychain; no next action."),
-        1);
-    setValue("HashedPasswordRef", "no data");
-    EXPECT_EQ(state(), AccountState::PasswordInvalid);
-    EXPECT_EQ(log_.count(std::string("checkAccount: Velto ID ") + kName +
-                         " doesn't have a password; no next action."),
-              1);
-    EXPECT_EQ(server_.takeMethods(), "");
-}
-
 TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
     constexpr double kFortnight = 1'209'600;
     struct Case {
@@ -639,52 +540,36 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
         std::optional<double> next;
         bool isNewServer = false;
     };
-    const Value never = Value::null();
+    const Value none = Value::null();
+    constexpr const char* kRequested = "CSRGenerationDate";
+    constexpr const char* kRenewal = "NextRenewalAttempt";
+    constexpr const char* kFetch = "NextCertificateFetchDate";
     const auto in = [this](double seconds) { return date(seconds); };
     const Dictionary entry;
     const Case cases[] = {
         {"nothing foreseen", {}, entry, {}},
         {"dirty", {{"Dirty", kOn}}, entry, 0},
-        {"no encDsId", {{"encDsId", never}}, {}, 0},
-        {"no encDsId, tried",
-         {{"encDsId", never}, {"LastConnectAttempt", in(-100)}, {"NextCertificateFetchDate", in(9e9)}},
-         {},
-         200},
+        {"no encDsId", {{"encDsId", none}}, {}, 0},
+        {"tried", {{"encDsId", none}, {"LastConnectAttempt", in(-100)}, {kFetch, in(999)}}, {}, 200},
         {"forced validation", {{"ForceValidation", kOn}, {"NextValidationDate", in(50)}}, entry, 0},
         {"next validation", {{"NextValidationDate", in(50)}, {"ValidationDate", in(0)}}, entry, 50},
         {"last validation", {{"ValidationDate", in(-100)}}, entry, kFortnight - 100},
-        {"embargo",
-         {{"EarliestAllowedConnectionDate", in(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}},
-         entry,
-         1000},
-        {"embargo, an earlier expiry",
-         {{"EarliestAllowedConnectionDate", in(1000)}},
-         Dictionary{{"Expires", in(10)}, {"NextRenewalAttempt", in(5)}},
-         10},
-        {"embargo, no certificate", {{"EarliestAllowedConnectionDate", in(1000)}}, {}, 1000},
-        {"embargo is over", {{"EarliestAllowedConnectionDate", in(-1)}, {"ClientTooOld", kOn}}, entry, {}},
+        {"embargo", {{kEmbargo, in(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}}, entry, 1000},
+        {"embargo, expiry", {{kEmbargo, in(99)}}, Dictionary{{"Expires", in(9)}, {kRenewal, in(5)}}, 9},
+        {"embargo, no certificate", {{kEmbargo, in(1000)}}, {}, 1000},
+        {"embargo is over", {{kEmbargo, in(-1)}, {"ClientTooOld", kOn}}, entry, {}},
         {"too old", {{"ClientTooOld", kOn}, {"ForceValidation", kOn}}, {}, 3'153'600'000},
         {"an expiry", {}, Dictionary{{"Expires", in(500)}}, 500},
-        {"a renewal", {}, Dictionary{{"Expires", in(500)}, {"NextRenewalAttempt", in(400)}}, 400},
+        {"a renewal", {}, Dictionary{{"Expires", in(500)}, {kRenewal, in(400)}}, 400},
         {"a validated certificate", {}, Dictionary{{"LastSuccessfulValidation", in(-50)}}, kFortnight - 50},
         {"no certificate", {}, {}, 0},
-        {"a fetch", {{"NextCertificateFetchDate", in(30)}, {"CSRGenerationDate", in(-10)}}, {}, 30},
-        {"a request", {{"CSRGenerationDate", in(-10)}}, {}, 3590},
-        {"a request with interval",
-         {{"CSRGenerationDate", in(-10)}, {"CSRGenerationInterval", number(60)}},
-         {},
-         50},
-        {"a request from the future", {{"CSRGenerationDate", in(10)}}, {}, 0},
-        {"a record is not looked at",
-         {{"VeltoIDAccountValidationRecordNextCheckDateKey", in(40)}},
-         entry,
-         {}},
-        {"a record is looked at",
-         {{"VeltoIDAccountValidationRecordNextCheckDateKey", in(40)}},
-         entry,
-         40,
-         true},
-        {"a record without date", {{"VeltoIDAccountValidationRecordIdentifierKey", "v"}}, entry, {}, true},
+        {"a fetch", {{kFetch, in(30)}, {kRequested, in(-10)}}, {}, 30},
+        {"a request", {{kRequested, in(-10)}}, {}, 3590},
+        {"an interval", {{kRequested, in(-10)}, {"CSRGenerationInterval", number(60)}}, {}, 50},
+        {"a request from the future", {{kRequested, in(10)}}, {}, 0},
+        {"an old server's record", {{kNextCheck, in(40)}}, entry, {}},
+        {"a record", {{kNextCheck, in(40)}}, entry, 40, true},
+        {"a record, no date", {{kIdentifier, "v"}}, entry, {}, true},
         {"no record", {}, entry, 0, true},
     };
     for (const Case& each : cases) {
@@ -709,7 +594,7 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
     }
     __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(100));
     setValue("ValidationDate", date(-30));
-    setValue("VeltoIDAccountValidationRecordIdentifierKey", "v");
+    setValue(kIdentifier, "v");
     std::optional<double> next;
     EXPECT_TRUE(copyNextActionDateForAccount(kName, &next));
     EXPECT_EQ(next, now() + 70);

@@ -1,5 +1,7 @@
 #include "VeltoIDXMLServerCommunications/Methods.h"
 
+#include <array>
+
 #include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
 #include "VeltoIDXMLServerCommunications/SessionCache.h"
 
@@ -31,86 +33,71 @@ class GetMyInfo : public ServerTest {
 TEST_F(GetMyInfo, SendsWhatTheAgentHasAlready) {
     struct Case {
         const char* what;
-        const char* argument;
-        const char* ofSession;
+        String argument;
+        String ofSession;
         Dictionary parameters;
-        Dictionary sent;
+        /// What is sent of the encDsId, the serial number and the record's identifier.
+        std::array<Value, 3> sent;
     };
     constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
-    __VeltoIDDBSetCertificateInfo("with certificate", Dictionary{{"SerialNumber", "stored"}});
+    const Dictionary given = {{"SerialNumber", "given"}, {kIdentifier, ""}, {"Other", "x"}};
+    const Dictionary wrong = {{"SerialNumber", number(1)}, {kIdentifier, number(1)}};
+    __VeltoIDDBSetCertificateInfo("certified", Dictionary{{"SerialNumber", "stored"}});
     const Case cases[] = {
         {"nothing", nullptr, nullptr, {}, {}},
-        {"the session's", nullptr, "s", {}, {{"encDsId", "s"}}},
-        {"the argument first", "a", "s", {}, {{"encDsId", "a"}}},
-        {"parameters",
-         "a",
-         "s",
-         {{"SerialNumber", "given"}, {kIdentifier, ""}, {"Other", "x"}},
-         {{"encDsId", "a"}, {"CertificateSerialNumber", "given"}, {"ClientVIDVRecordIdentifier", ""}}},
-        {"the entry's serial number first",
-         "with certificate",
-         "s",
-         {{"SerialNumber", "given"}},
-         {{"encDsId", "with certificate"}, {"CertificateSerialNumber", "stored"}}},
-        {"of the argument only",
-         nullptr,
-         "with certificate",
-         {{"SerialNumber", "given"}},
-         {{"encDsId", "with certificate"}, {"CertificateSerialNumber", "given"}}},
-        {"wrong kinds",
-         "a",
-         "s",
-         {{"SerialNumber", number(1)}, {kIdentifier, number(1)}},
-         {{"encDsId", "a"}}},
+        {"the session's", nullptr, "s", {}, {"s"}},
+        {"the argument first", "a", "s", {}, {"a"}},
+        {"parameters", "a", "s", given, {"a", "given", ""}},
+        {"the entry's serial number first", "certified", "s", given, {"certified", "stored", ""}},
+        {"of the argument only", nullptr, "certified", given, {"certified", "given", ""}},
+        {"wrong kinds", "a", "s", wrong, {"a"}},
     };
     server_.answer("getMyInfo", Dictionary{{"x", "y"}});
     const std::set<std::string> common = keysOf(createCallParameters(kName, "s1", {}));
     for (const Case& each : cases) {
-        const auto text = [](const char* given) { return given != nullptr ? String(given) : String(); };
-        ASSERT_TRUE(_VeltoIDSessionDoGetMyInfo(*session(text(each.ofSession)), text(each.argument),
-                                               each.parameters, {}, nullptr, nullptr));
+        ASSERT_TRUE(_VeltoIDSessionDoGetMyInfo(*session(each.ofSession), each.argument, each.parameters, {},
+                                               nullptr, nullptr));
         Dictionary sent = server_.take().at(0).parameters;
         EXPECT_EQ(sent["dsSession"], Value("s1")) << each.what;
         for (const std::string& key : common) EXPECT_TRUE(sent.remove(key)) << each.what << key;
-        EXPECT_EQ(sent, each.sent) << each.what;
+        EXPECT_EQ(sent, (Dictionary{{"encDsId", each.sent[0]},
+                                    {"CertificateSerialNumber", each.sent[1]},
+                                    {"ClientVIDVRecordIdentifier", each.sent[2]}}))
+            << each.what;
     }
     EXPECT_EQ(count("VeltoIDXMLGetMyInfoCount"), 7);
 }
 
 TEST_F(GetMyInfo, TakesEntriesOfTheRightKind) {
-    const Array list{"a", "b"};
-    EXPECT_EQ(resultOf({{"encDsId", "d"},
-                        {"lastNm", "Roe"},
-                        {"firstNm", "Jane"},
-                        {"ValidatedEmail", list},
-                        {"ValidatedPhones", Array()},
-                        {"PrimaryEmail", "p"},
-                        {"VeltoID", "v"},
-                        {"CertificateIsValid", flag(false)},
-                        {"AllEmails", list},
-                        {"ValidForInterval", Value::real(2.5)},
-                        {"Unknown", "x"}}),
-              (Dictionary{{"encDsId", "d"},
-                          {"LastName", "Roe"},
-                          {"FirstName", "Jane"},
-                          {"ValidatedEmail", list},
-                          {"ValidatedPhones", Array()},
-                          {"PrimaryEmail", "p"},
-                          {"VeltoID", "v"},
-                          {"CertificateIsValid", flag(false)},
-                          {"AllEmails", list},
-                          {"ValidForInterval", Value::real(2.5)}}));
-    EXPECT_EQ(resultOf({{"encDsId", number(1)},
-                        {"lastNm", number(1)},
-                        {"firstNm", list},
-                        {"ValidatedEmail", "a"},
-                        {"ValidatedPhones", flag(true)},
-                        {"PrimaryEmail", number(1)},
-                        {"VeltoID", number(1)},
-                        {"CertificateIsValid", "false"},
-                        {"AllEmails", "a"},
-                        {"ValidForInterval", "60"}}),
-              Dictionary());
+    const Value list = Array{"a", "b"};
+    struct Case {
+        const char* replyKey;
+        const char* resultKey;
+        Value right;
+        Value wrong;
+    };
+    const Case cases[] = {
+        {"encDsId", "encDsId", "d", number(1)},
+        {"lastNm", "LastName", "Roe", number(1)},
+        {"firstNm", "FirstName", "Jane", list},
+        {"ValidatedEmail", "ValidatedEmail", list, "a"},
+        {"ValidatedPhones", "ValidatedPhones", Array(), flag(true)},
+        {"PrimaryEmail", "PrimaryEmail", "p", number(1)},
+        {"VeltoID", "VeltoID", "v", list},
+        {"CertificateIsValid", "CertificateIsValid", flag(false), "false"},
+        {"AllEmails", "AllEmails", list, "a"},
+        {"ValidForInterval", "ValidForInterval", Value::real(2.5), "60"},
+    };
+    Dictionary right = {{"Unknown", "x"}};
+    Dictionary wrong = {{"Unknown", "x"}};
+    Dictionary result;
+    for (const Case& each : cases) {
+        right.set(each.replyKey, each.right);
+        wrong.set(each.replyKey, each.wrong);
+        result.set(each.resultKey, each.right);
+    }
+    EXPECT_EQ(resultOf(right), result);
+    EXPECT_EQ(resultOf(wrong), Dictionary());
 }
 
 TEST_F(GetMyInfo, AValidationRecordComesWithItsData) {

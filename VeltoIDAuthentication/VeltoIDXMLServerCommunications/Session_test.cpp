@@ -153,12 +153,19 @@ TEST_F(CommandsTest, ValidityOfTheSession) {
         double validity;
     };
     const Case cases[] = {
-        {number(60), 60}, {Value::real(1.5), 1.5},
-        {number(0), 0},   {number(-60), 0},
-        {"90", 90},       {"2.5", 2.5},
-        {"-5", 0},        {"none", 0},
-        {flag(true), 7},  {Array{number(1)}, 7},
-        {date(), 7},      {{}, 7},
+        {number(60), 60},
+        {Value::real(1.5), 1.5},
+        {number(0), 0},
+        {number(-60), 0},
+        {"90", 90},
+        {"2.5", 2.5},
+        {"-5", 0},
+        {"inf", 0},
+        {"none", 0},
+        {flag(true), 7},
+        {Array{number(1)}, 7},
+        {date(), 7},
+        {{}, 7},
     };
     for (const Case& each : cases)
         EXPECT_EQ(after({{"dsSessionValidityDuration", each.given}})->fValidityDuration, each.validity)

@@ -1,4 +1,4 @@
-"""What the end-to-end tests stand on: a private bus, the development identity server, and the agent under test.
+"""A world of its own for demo, tests and benchmarks: a private bus, the development identity server, and the agent.
 
 Everything lives in one temporary folder and is gone afterwards. The agent is started by the bus when it is first spoken
 to, like in real life, or by hand.
