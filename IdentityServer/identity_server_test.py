@@ -232,34 +232,6 @@ class WireTest(ServerTest):
                 self.assertTrue(received["error"])
         self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
 
-    def test_requests_that_are_not_for_the_door_get_a_status(self) -> None:
-        elsewhere = server.url.replace("dsxmlrpc", "other")
-        most = 16 * 1024 * 1024
-        for label, status, arguments, headers in (
-                ("GET", 405, (None, "", "GET"), {}), ("PUT", 405, (b"x", "", "PUT"), {}),
-                ("HEAD", 405, (None, "", "HEAD"), {}), ("GET elsewhere", 404, (None, elsewhere, "GET"), {}),
-                ("POST elsewhere", 404, (b"x", elsewhere), {}), ("largest", 400, (b" " * most,), {}),
-                ("too large", 413, (b" " * (most + 1),), {}),
-                ("bad length", 400, (b"x",), {"Content_Length": "-5"}),
-                ("chunked", 411, (b"",), {"Transfer_Encoding": "chunked"})):
-            with self.subTest(label):
-                self.assertEqual(exchange(*arguments, **headers)[0], status)
-
-    def test_a_client_that_asks_before_sending_is_told_to_go_on(self) -> None:
-        body = agent_document(*AGENT_MEMBERS)
-        head = (f"POST /dsservices/dsxmlrpc HTTP/1.1\r\nHost: localhost\r\nContent-Type: text/xml\r\n"
-                f"Content-Length: {len(body)}\r\nExpect: 100-continue\r\n\r\n")
-        with socket.create_connection(("127.0.0.1", urlsplit(server.url).port), TIMEOUT) as plain:
-            with trust.wrap_socket(plain, server_hostname="127.0.0.1") as connection:
-                connection.sendall(head.encode())
-                self.assertTrue(connection.recv(1024).startswith(b"HTTP/1.1 100 "))
-                connection.sendall(body)
-                self.assertTrue(connection.recv(1024).startswith(b"HTTP/1.1 200 "))
-
-    def test_a_client_that_never_speaks_holds_up_nobody(self) -> None:
-        with socket.create_connection(("127.0.0.1", urlsplit(server.url).port), TIMEOUT):
-            self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
-
 
 class InjectionTest(ServerTest):
     def observe(self) -> Any:
@@ -300,13 +272,6 @@ class InjectionTest(ServerTest):
             self.assertEqual(reply[key], changes[key])
         self.assertEqual((reply["When"].isoformat(), reply["Blob"]), ("2026-01-17T01:58:42", b"ABC"))
 
-    def test_size_is_exact_and_the_document_valid(self) -> None:
-        for size in (5000, 17 * 1024 * 1024):
-            server.next("getMyInfo", size=size)
-            _, body = exchange(xmlrpc.client.dumps((self.session,), PREFIX + "getMyInfo").encode())
-            self.assertEqual(len(body), size)
-            self.assertEqual(xmlrpc.client.loads(body)[0][0]["lastNm"], "Roe")
-
     def test_delay_comes_after_the_call_is_recorded(self) -> None:
         server.next("getMyInfo", delay=0.3, status=500)
         seen: list[Any] = []
@@ -328,23 +293,6 @@ class InjectionTest(ServerTest):
         self.assertEqual(server.pending(), [{"method": "authenticate", "times": 1}])
         server.clear_next()
         self.assertIsNone(fault_of("authenticate", SIGN_IN))
-
-    def test_calls_at_the_same_time_use_an_injection_up_exactly(self) -> None:
-        callers, calls_each, injected = 8, 10, 30
-        server.next("getMyInfo", times=injected, status=500)
-        seen: list[bool] = []
-
-        def call_often() -> None:
-            for _ in range(calls_each):
-                seen.append(self.observe() == (500, ""))
-
-        threads = [threading.Thread(target=call_often) for _ in range(callers)]
-        for thread in threads:
-            thread.start()
-        for thread in threads:
-            thread.join(TIMEOUT)
-        self.assertEqual((len(seen), sum(seen)), (callers * calls_each, injected))
-        self.assertEqual(server.counts()["getMyInfo"], callers * calls_each)
 
 
 class ControlTest(ServerTest):
@@ -374,15 +322,6 @@ class ControlTest(ServerTest):
         self.assertEqual((self.refusal("GET", "/nowhere"), self.refusal("DELETE", "/health")), (404, 405))
         self.assertEqual(server.pending(), [])
         self.assertEqual(call("authenticate", SIGN_IN)["Version"], 101)
-
-    def test_bodies_that_are_not_json_are_refused(self) -> None:
-        for body in (b"", b"{", b"\xff\xfe", b"[" * 100000):
-            connection = http.client.HTTPConnection(urlsplit(server.control).netloc, timeout=TIMEOUT)
-            connection.request("POST", "/next", body)
-            response = connection.getresponse()
-            self.assertEqual((response.status, list(json.loads(response.read()))), (400, ["error"]))
-            connection.close()
-        self.assertEqual(server.command("GET", "/health"), {"ok": True, "pid": server.pid})
 
     def test_calls_are_counted_awaited_and_forgotten(self) -> None:
         self.assertFalse(server.wait("getMyInfo", timeout=0))
@@ -431,21 +370,6 @@ class TrustTest(ServerTest):
         self.assertEqual({path.name: path.stat().st_mode & 0o777 for path in state.glob("*author*")},
                          {"authority.pem": 0o644, "authority-key.pem": 0o600})
         self.assertEqual(list(state.glob(".new-*")), [])
-
-    def test_a_server_that_cannot_start_says_why_and_an_interrupt_ends_it_well(self) -> None:
-        taken = str(urlsplit(server.url).port)
-        with tempfile.TemporaryDirectory() as state:
-            for options, reason in ((("--port", taken), "in use"), (("--host", "192.0.2.1"), "loopback"),
-                                    (("--accounts", "/nonexistent"), "No such file")):
-                command = [INTERPRETER, str(Path(__file__).parent), "--state-dir", state, *options]
-                done = subprocess.run(command, capture_output=True, text=True, timeout=TIMEOUT, check=False)
-                with self.subTest(options):
-                    self.assertNotEqual(done.returncode, 0)
-                    self.assertIn(reason, done.stderr)
-                    self.assertNotIn("Traceback", done.stderr)
-            other = IdentityServer(state).start()
-            os.kill(other.pid, signal.SIGINT)
-            self.assertEqual(other.stop(), 0)
 
 
 if __name__ == "__main__":

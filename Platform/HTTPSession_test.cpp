@@ -360,48 +360,5 @@ TEST(HTTPSession, ACancelledExchangeEndsAtOnceAndInSilence) {
     EXPECT_EQ(outcome->statuses, std::vector{200});
 }
 
-TEST(HTTPSession, LetsGoOfAReceiverThatOwnsItOnceItIsOver) {
-    const Server server;
-    for (const bool isCancelled : {true, false}) {
-        auto outcome = std::make_shared<Outcome>();
-        outcome->owned = HTTPSession::create(outcome);
-        outcome->owned->start(requestTo(server.url(isCancelled ? "/silence" : "/half")));
-        outcome->begun.wait(kForever);
-        if (isCancelled) outcome->owned->invalidateAndCancel();
-        std::shared_ptr<HTTPSession> session = outcome->owned;
-        outcome.reset();
-        waitUntilOver(session);
-    }
-}
-
-TEST(HTTPSession, TakesOneRequestOnly) {
-    const Server server;
-    const auto outcome = std::make_shared<Outcome>();
-    auto session = HTTPSession::create(outcome);
-    session->start(requestTo(server.url("/half")));
-    session->start(requestTo(server.url("/status")));
-    outcome->over.wait(kForever);
-    session->start(requestTo(server.url("/status")));
-    waitUntilOver(session);
-    EXPECT_EQ(outcome->statuses, std::vector{200});
-    EXPECT_EQ(outcome->completions, 1);
-}
-
-TEST(HTTPSession, ManyRunAtOnce) {
-    const Server server;
-    std::vector<std::shared_ptr<Outcome>> outcomes;
-    for (int i = 0; i < 20; ++i) {
-        outcomes.push_back(std::make_shared<Outcome>());
-        HTTPSession::create(outcomes.back())->start(requestTo(server.url("/half")));
-    }
-    for (const auto& outcome : outcomes) {
-        outcome->over.wait(kForever);
-        EXPECT_FALSE(outcome->error);
-        EXPECT_EQ(outcome->body, "<methodResp");
-    }
-}
-
-TEST(HTTPSession, FindsItsLibrary) { EXPECT_TRUE(isHTTPSClientAvailable()); }
-
 }  // namespace
 }  // namespace platform

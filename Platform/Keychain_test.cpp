@@ -110,29 +110,6 @@ const std::string kCorrupt = std::to_string(kKeychainItemCorrupt);
 const std::string kNotAvailable = std::to_string(kKeychainNotAvailable);
 const std::string kLocked = std::to_string(kKeychainLocked);
 
-TEST_F(KeychainTest, AnotherProcessFindsWhatWasAdded) {
-    int ends[2];
-    ASSERT_EQ(pipe(ends), 0);
-    ASSERT_TRUE(ChildProcess([&] {
-                    const auto reference = added(password("user"), kSecret);
-                    added(password("empty"), "", Accessibility::Always);
-                    return write(ends[1], reference.data(), reference.size()) == 16;
-                }).succeeded());
-    PersistentReference reference(16);
-    ASSERT_EQ(read(ends[0], reference.data(), reference.size()), 16);
-    EXPECT_EQ(valueOf(byReference(reference)), kSecret);
-    EXPECT_EQ(valueOf({password("user"), {}}), kSecret);
-    EXPECT_EQ(valueOf({password("empty"), {}}), "");
-    EXPECT_EQ(keychain::accessibilityOf(byReference(reference)), Accessibility::AfterFirstUnlock);
-    EXPECT_EQ(keychain::accessibilityOf({password("empty"), {}}), Accessibility::Always);
-    EXPECT_EQ(keychain::remove(byReference(reference)), kKeychainSuccess);
-    EXPECT_EQ(valueOf(byReference(reference)), kNotFound);
-    EXPECT_EQ(keychain::remove(byReference(reference)), kKeychainItemNotFound);
-    EXPECT_EQ(keychain::accessibilityOf(byReference(reference)), std::nullopt);
-    EXPECT_EQ(valueOf({password("empty"), {}}), "");
-    EXPECT_TRUE(log_.lines().empty());
-}
-
 TEST_F(KeychainTest, RefusesDuplicates) {
     using enum KeychainItemClass;
     const struct {
@@ -357,65 +334,6 @@ TEST_F(KeychainTest, IsNotAvailableWithoutASoundDeviceKey) {
     const FakeSystemLog log;
     EXPECT_EQ(valueOf(byReference(item)), kSecret);
     EXPECT_TRUE(log.contains("was open to other users"));
-}
-
-TEST_F(KeychainTest, ClassKeysAreTheirOwn) {
-    const auto unlocked = added(password("a"), kSecret, Accessibility::AfterFirstUnlock);
-    const auto always = added(password("b"), "public enough", Accessibility::Always);
-    const std::tuple<const char*, std::string, std::string> cases[] = {
-        {"UPDATE class_keys SET wrapping = 1 WHERE class = 2", kLocked, "public enough"},
-        {"UPDATE class_keys SET wrapped = zeroblob(60) WHERE class = 2", kNotAvailable, "public enough"},
-        {"UPDATE class_keys SET wrapped = (SELECT wrapped FROM class_keys WHERE class = 1) WHERE class = 2",
-         kNotAvailable, "public enough"},
-        {"DELETE FROM class_keys WHERE class = 1", kSecret, kCorrupt},
-    };
-    edit("CREATE TABLE kept AS SELECT * FROM class_keys");
-    for (const auto& [sql, unlockedResult, alwaysResult] : cases) {
-        edit(sql);
-        EXPECT_EQ(valueOf(byReference(unlocked)), unlockedResult) << sql;
-        EXPECT_EQ(valueOf(byReference(always)), alwaysResult) << sql;
-        edit("DELETE FROM class_keys; INSERT INTO class_keys SELECT * FROM kept");
-        EXPECT_EQ(valueOf(byReference(unlocked)), kSecret) << sql;
-    }
-}
-
-TEST_F(KeychainTest, KeepsTheDeviceKeyWhenTheDatabaseIsDamaged) {
-    ASSERT_TRUE(ChildProcess([] { return !added(password("a")).empty(); }).succeeded());
-    const fs::path key = TemporaryStateDirectory::file("keychain.key");
-    const std::string before = TemporaryStateDirectory::readFile(key);
-    fs::remove(TemporaryStateDirectory::file("keychain.db-wal"));
-    TemporaryStateDirectory::writeFile(TemporaryStateDirectory::file("keychain.db"),
-                                       "not a database at all any more");
-    EXPECT_EQ(valueOf({password("a"), {}}), kNotFound);
-    EXPECT_TRUE(log_.contains("keychain.db.corrupt-"));
-    const auto again = added(password("a"));
-    EXPECT_EQ(valueOf(byReference(again)), kSecret);
-    EXPECT_EQ(TemporaryStateDirectory::readFile(key), before);
-}
-
-TEST_F(KeychainTest, TwoProcessesBeginItTogether) {
-    for (int round = 0; round < 5; ++round) {
-        const TemporaryStateDirectory directory;
-        const auto addMany = [](const std::string& prefix) {
-            for (int i = 0; i < 10; ++i) added(password(prefix + std::to_string(i)), kSecret);
-            return true;
-        };
-        {
-            ChildProcess one([&] { return addMany("one"); });
-            ChildProcess two([&] { return addMany("two"); });
-            ASSERT_TRUE(one.succeeded() && two.succeeded());
-        }
-        EXPECT_TRUE(ChildProcess([] {
-                        for (const std::string prefix : {"one", "two"}) {
-                            for (int i = 0; i < 10; ++i) {
-                                EXPECT_EQ(valueOf({password(prefix + std::to_string(i)), {}}), kSecret);
-                            }
-                        }
-                        return true;
-                    }).succeeded());
-        expectNoSecretInFiles();
-    }
-    setenv("XDG_STATE_HOME", directory_.base().c_str(), 1);
 }
 
 }  // namespace

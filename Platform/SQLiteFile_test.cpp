@@ -188,30 +188,6 @@ TEST_F(SQLiteFileTest, MovesADamagedFileAsideAndStartsAFreshOne) {
     }
 }
 
-TEST_F(SQLiteFileTest, NeverOverwritesWhatWasMovedAside) {
-    const SimulatedClock clock(1'700'000'000);
-    for (const char* content : {"first damaged file, long enough", "second damaged file, long enough"}) {
-        // What a crashed process left in the log stays with its file.
-        EXPECT_TRUE(ChildProcess([] {
-                        auto& file = *new SQLiteFile(kFormat);
-                        return put(file, "a", "1") == Outcome::Done && file.checkpoint() &&
-                               put(file, "a", "2") == Outcome::Done;
-                    }).succeeded());
-        ASSERT_GT(fs::file_size(path().string() + "-wal"), 0U);
-        TemporaryStateDirectory::writeFile(path(), content);
-        SQLiteFile file(kFormat);
-        EXPECT_EQ(get(file, "a"), std::nullopt);
-    }
-    const auto aside = movedAside();
-    ASSERT_EQ(aside.size(), 2U);
-    EXPECT_EQ(aside[0].filename(), "test.db.corrupt-20231114-221320");
-    EXPECT_EQ(aside[1].filename(), "test.db.corrupt-20231114-221320-2");
-    for (size_t i = 0; i < aside.size(); ++i) {
-        EXPECT_TRUE(TemporaryStateDirectory::readFile(aside[i]).starts_with(i == 0 ? "first" : "second"));
-        EXPECT_TRUE(fs::exists(aside[i].string() + "-wal")) << aside[i];
-    }
-}
-
 TEST_F(SQLiteFileTest, SurvivesFlippedBytes) {
     fill();
     const std::string sound = content();
@@ -306,101 +282,6 @@ TEST_F(SQLiteFileTest, AFullDiskFailsWritesOnlyAndKeepsTheFile) {
     EXPECT_EQ(put(file, "b", "2"), Outcome::Done);
     EXPECT_EQ(log_.count("writing works again"), 1);
     EXPECT_TRUE(movedAside().empty());
-}
-
-TEST_F(SQLiteFileTest, WritesGoToTheFileThatHasTheName) {
-    SQLiteFile first(kFormat);
-    ASSERT_EQ(put(first, "a", "old"), Outcome::Done);
-    // What another process does to a file that it finds damaged.
-    for (const char* suffix : {"", "-wal", "-shm"})
-        fs::rename(path().string() + suffix, path().string() + ".aside" + suffix);
-    EXPECT_EQ(put(first, "b", "new"), Outcome::Done);
-    SQLiteFile second(kFormat);
-    EXPECT_EQ(get(second, "b"), "new");
-    EXPECT_EQ(get(first, "a"), std::nullopt);
-    // The same in the middle of a transaction.
-    int runs = 0;
-    const Outcome outcome = first.write([&](SQLiteTransaction& transaction) {
-        transaction.prepare("REPLACE INTO rows VALUES ('during', x'31')").run();
-        if (++runs == 1) fs::rename(path(), path().string() + ".aside2");
-        return true;
-    });
-    EXPECT_EQ(outcome, Outcome::Done);
-    EXPECT_EQ(get(second, "during"), "1");
-    fs::remove_all(directory_.base() / "harbwell");
-    EXPECT_EQ(put(first, "c", "newer"), Outcome::Done);
-    EXPECT_EQ(get(second, "c"), "newer");
-}
-
-TEST_F(SQLiteFileTest, CheckpointBringsAllIntoTheMainFile) {
-    SQLiteFile file(kFormat);
-    ASSERT_EQ(put(file, "a", "1"), Outcome::Done);
-    const std::string before = content();
-    ASSERT_TRUE(file.checkpoint());
-    EXPECT_NE(content(), before);
-    EXPECT_EQ(fs::file_size(path().string() + "-wal"), 0U);
-    const std::string alone = content();
-    const TemporaryStateDirectory elsewhere;
-    TemporaryStateDirectory::writeFile(path(), alone);
-    SQLiteFile copy(kFormat);
-    EXPECT_EQ(get(copy, "a"), "1");
-}
-
-TEST_F(SQLiteFileTest, AKilledProcessLosesNothingThatItWasPromised) {
-    int promised = 0;
-    for (const int lines : {1, 2, 17, 120}) {
-        int ends[2];
-        ASSERT_EQ(pipe(ends), 0);
-        ChildProcess child([&] {
-            SQLiteFile file(kFormat);
-            for (int i = promised; put(file, std::to_string(i), std::string(3000, 'v')) == Outcome::Done;
-                 ++i) {
-                if (write(ends[1], "", 1) != 1) return false;
-            }
-            return false;
-        });
-        close(ends[1]);
-        char byte = 0;
-        for (int i = 0; i < lines; ++i, ++promised) ASSERT_EQ(read(ends[0], &byte, 1), 1);
-        kill(child.id(), SIGKILL);
-        EXPECT_FALSE(child.succeeded());
-        while (read(ends[0], &byte, 1) == 1) ++promised;
-        close(ends[0]);
-        SQLiteFile file(kFormat);
-        for (int i = 0; i < promised; ++i)
-            ASSERT_EQ(get(file, std::to_string(i)), std::string(3000, 'v')) << i;
-    }
-    EXPECT_TRUE(movedAside().empty());
-}
-
-TEST_F(SQLiteFileTest, TwoProcessesCreateAndChangeItTogether) {
-    constexpr int kRounds = 100;
-    const auto count = [] {
-        SQLiteFile file(kFormat);
-        for (int i = 0; i < kRounds; ++i) {
-            const Outcome outcome = file.write([](SQLiteTransaction& transaction) {
-                transaction.prepare("INSERT OR IGNORE INTO rows VALUES ('n', 0)").run();
-                int64_t number = 0;
-                if (auto statement = transaction.prepare("SELECT value FROM rows WHERE name = 'n'");
-                    statement.step()) {
-                    number = statement.integer(0);
-                }
-                transaction.prepare("UPDATE rows SET value = ? WHERE name = 'n'")
-                    .bindInteger(number + 1)
-                    .run();
-                return true;
-            });
-            if (outcome != Outcome::Done) return false;
-        }
-        return true;
-    };
-    {
-        ChildProcess one(count);
-        ChildProcess two(count);
-        EXPECT_TRUE(one.succeeded() && two.succeeded());
-    }
-    SQLiteFile file(kFormat);
-    EXPECT_EQ(get(file, "n"), std::to_string(2 * kRounds));
 }
 
 TEST_F(SQLiteFileTest, TwoProcessesMoveADamagedFileAsideOnce) {

@@ -317,53 +317,6 @@ TEST(SemaphoreTest, WaitsForASignalItsTimeOrAJumpOfTheClock) {
     EXPECT_EQ(journal.take(), "signal@3153600000");
 }
 
-TEST(SemaphoreTest, WaitersAreServedInTheOrderInWhichTheyCame) {
-    SimulatedClock clock;
-    const Semaphore semaphore;
-    Journal journal;
-    const std::array<WorkQueue, 3> waiters = {WorkQueue("a"), WorkQueue("b"), WorkQueue("c")};
-    for (const WorkQueue& waiter : waiters) {
-        waiter.async([&] {
-            semaphore.wait(1000);
-            journal.add(waiter.label());
-        });
-        clock.settle();
-    }
-    for (int i = 0; i < 3; ++i) {
-        semaphore.signal();
-        clock.settle();
-    }
-    EXPECT_EQ(journal.take(), "a b c");
-}
-
-TEST(SimulatedClockTest, RunsAYearOfALoopThatSleeps) {
-    SimulatedClock clock(0);
-    const WorkQueue loop("loop");
-    const WorkQueue worker("worker");
-    const Semaphore wake;
-    std::vector<double> passes;
-    // As a scheduler does: it sleeps on its own queue, and has its work done on another one that is busy
-    // then.
-    loop.async([&] {
-        while (passes.size() < 10'000) {
-            if (wake.wait(3600)) return;
-            const Semaphore working;
-            worker.async([&clock, working] {
-                working.signal();
-                Semaphore().wait(60);
-            });
-            working.wait();
-            worker.sync([&] { passes.push_back(clock.now()); });
-        }
-    });
-    clock.advanceBy(365 * kDay);
-    ASSERT_EQ(passes.size(), 8616U) << "a pass each 3660 seconds";
-    for (size_t i = 0; i < passes.size(); ++i) ASSERT_EQ(passes[i], 3660.0 * static_cast<double>(i + 1));
-    EXPECT_EQ(clock.now(), 365 * kDay);
-    wake.signal();
-    clock.settle();
-}
-
 TEST(SimulatedClockTest, IsNotSettledWhileAThreadThatWasReleasedHasYetToRun) {
     SimulatedClock clock;
     const std::array<WorkQueue, 4> chain = {WorkQueue("0"), WorkQueue("1"), WorkQueue("2"), WorkQueue("3")};

@@ -18,7 +18,8 @@ TEST(Log, LinesCarryFunctionFileLineAndQueue) {
     platform::WorkQueue::main().sync([] { logLine(4, "plain", "f", 1, "y"); });
     const auto lines = log.lines();
     ASSERT_EQ(lines.size(), 5U);
-    EXPECT_TRUE(lines[0].text.starts_with("SERVER Starting logging for veltoidauthentication " + std::string(46, '*') + " euid="));
+    EXPECT_TRUE(lines[0].text.starts_with("SERVER Starting logging for veltoidauthentication " +
+                                          std::string(46, '*') + " euid="));
     EXPECT_EQ(lines[0].priority, platform::LogPriority::Info);
     EXPECT_EQ(lines[1].text, "SERVER text (work()/File.cpp #12) -");
     EXPECT_EQ(lines[2].text, "SERVER - (()/ #0) -");
@@ -29,7 +30,8 @@ TEST(Log, LinesCarryFunctionFileLineAndQueue) {
 TEST(Log, FilteredLevelsComposeNothing) {
     platform::FakeSystemLog log;
     int composed = 0;
-    for (int level = -1; level <= 8; ++level) EXPECT_EQ(logLevelEnabled(level), level >= 0 && level <= 5) << level;
+    for (int level = -1; level <= 8; ++level)
+        EXPECT_EQ(logLevelEnabled(level), level >= 0 && level <= 5) << level;
     VELTOID_LOG(kInfo, "not " << ++composed);
     VELTOID_LOG(kNotice, "once " << ++composed);
     EXPECT_EQ(composed, 1);

@@ -31,8 +31,9 @@ TEST(Base64, LinesEndAfterEveryFullLine) {
 
 TEST(Base64, DecodingSkipsWhatIsNoSymbolAndStopsAtATag) {
     const std::pair<const char*, const char*> cases[] = {
-        {"QUJD", "ABC"}, {"QUI=", "AB"},      {"QQ==", "A"},       {"QUJD\n", "ABC"}, {"QUJD<QUJD", "ABC"},
-        {"Q U\tJ\r\nD", "ABC"}, {"QUJDQ", "ABC"}, {"\xffQUJD", "ABC"}, {"QUI=QUJD", "ABABC"},
+        {"QUJD", "ABC"},   {"QUI=", "AB"},       {"QQ==", "A"},
+        {"QUJD\n", "ABC"}, {"QUJD<QUJD", "ABC"}, {"Q U\tJ\r\nD", "ABC"},
+        {"QUJDQ", "ABC"},  {"\xffQUJD", "ABC"},  {"QUI=QUJD", "ABABC"},
     };
     for (const auto& [text, expected] : cases) EXPECT_EQ(base64Decode(text), dataOf(expected)) << text;
     EXPECT_EQ(base64Decode("QQ=\n="), dataOf("A")) << "padding counts across white space";
@@ -76,7 +77,8 @@ TEST(PEM, BodyStandsBetweenTheLines) {
         {"QUJD-----END A-----", "ABC"},
     };
     for (const auto& [text, expected] : cases) EXPECT_EQ(pemBodyToData(text), dataOf(expected)) << text;
-    for (const char* text : {"", "-----BEGIN A----------END A-----", "-----END A-----\n-----BEGIN A-----", "----BEGIN"})
+    for (const char* text :
+         {"", "-----BEGIN A----------END A-----", "-----END A-----\n-----BEGIN A-----", "----BEGIN"})
         EXPECT_FALSE(pemBodyToData(text)) << text;
 }
 

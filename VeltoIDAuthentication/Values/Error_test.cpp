@@ -6,7 +6,8 @@ namespace veltoid {
 namespace {
 
 TEST(Error, SaysWhereItWasMadeAndKeepsTheGivenInformation) {
-    const Error error = makeError(-101, {"reason", nullptr, "suggestion"}, {{"more", "x"}}, "function", nullptr, 7);
+    const Error error =
+        makeError(-101, {"reason", nullptr, "suggestion"}, {{"more", "x"}}, "function", nullptr, 7);
     EXPECT_EQ(error.domain.view(), kIdentityErrorDomain);
     EXPECT_EQ(error.userInfo, (Dictionary{{"more", "x"},
                                           {kErrorFailureReasonKey, "reason"},
@@ -21,8 +22,9 @@ TEST(Error, SurvivesTheWayThroughADictionaryWithWhatLiesUnderneath) {
     const Error fault{String(kXMLErrorDomain), -20101, {{kErrorUnderlyingErrorKey, deepest}}};
     const Error error = makeError(-100, {}, {{kErrorUnderlyingErrorKey, fault}}, "f", "g", 1);
     const Dictionary dictionary = errorToDictionary(error);
-    EXPECT_EQ(dictionary.dictionary("UserInfo")->dictionary(kErrorUnderlyingErrorKey)->string("Domain").view(),
-              kXMLErrorDomain);
+    EXPECT_EQ(
+        dictionary.dictionary("UserInfo")->dictionary(kErrorUnderlyingErrorKey)->string("Domain").view(),
+        kXMLErrorDomain);
     EXPECT_EQ(dictionaryToError(dictionary), error);
 }
 
@@ -32,8 +34,10 @@ TEST(Error, DictionariesOfAnotherShapeAreNone) {
     EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}}), std::nullopt);
     EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}, {"Code", "1"}}), std::nullopt);
     EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}, {"Code", Value::real(1.5)}}), std::nullopt);
-    const auto odd = dictionaryToError(
-        Dictionary{{"Domain", "d"}, {"Code", Value::int32(1)}, {"UserInfo", Dictionary{{kErrorUnderlyingErrorKey, "text"}}}});
+    const auto odd =
+        dictionaryToError(Dictionary{{"Domain", "d"},
+                                     {"Code", Value::int32(1)},
+                                     {"UserInfo", Dictionary{{kErrorUnderlyingErrorKey, "text"}}}});
     ASSERT_TRUE(odd);
     EXPECT_EQ(odd->userInfo.string(kErrorUnderlyingErrorKey), "text") << "what is no error stays as it is";
 }
@@ -41,7 +45,9 @@ TEST(Error, DictionariesOfAnotherShapeAreNone) {
 TEST(Error, EndlessChainsEnd) {
     Dictionary chain{{"Domain", "d"}, {"Code", Value::int32(0)}};
     for (int i = 0; i < 1'000; ++i)
-        chain = {{"Domain", "d"}, {"Code", Value::int32(i)}, {"UserInfo", Dictionary{{kErrorUnderlyingErrorKey, chain}}}};
+        chain = {{"Domain", "d"},
+                 {"Code", Value::int32(i)},
+                 {"UserInfo", Dictionary{{kErrorUnderlyingErrorKey, chain}}}};
     const auto error = dictionaryToError(chain);
     ASSERT_TRUE(error);
     EXPECT_TRUE(errorToDictionary(*error).contains("UserInfo"));

@@ -152,11 +152,17 @@ TEST(DictionaryAccess, IterationStopsEarlyAndIsFalseForNothing) {
 TEST(ValueStream, EveryStoredKindComesBackFromItsStoredForm) {
     const std::array<uint8_t, 3> bytes{0, 255, 7};
     const Value value = Dictionary{
-        {"text", "Zoë"},       {"int", Value::int64(-5)}, {"big", Value::uint64(~uint64_t{0})},
-        {"real", Value::real(0.1)}, {"yes", Value::boolean(false)}, {"date", Value::date(1234.5)},
-        {"data", Data(bytes)}, {"list", Array{"a", Value::null(), Array{}, Dictionary{}}},
+        {"text", "Zoë"},
+        {"int", Value::int64(-5)},
+        {"big", Value::uint64(~uint64_t{0})},
+        {"real", Value::real(0.1)},
+        {"yes", Value::boolean(false)},
+        {"date", Value::date(1234.5)},
+        {"data", Data(bytes)},
+        {"list", Array{"a", Value::null(), Array{}, Dictionary{}}},
     };
-    const auto stored = platform::writeBinaryPropertyList([&](platform::ValueSink& sink) { writeValue(value, sink); });
+    const auto stored =
+        platform::writeBinaryPropertyList([&](platform::ValueSink& sink) { writeValue(value, sink); });
     ValueBuilder builder;
     ASSERT_TRUE(platform::readBinaryPropertyList(stored, builder));
     EXPECT_EQ(builder.value(), value);

@@ -10,7 +10,9 @@ namespace {
 
 constexpr const char* kName = "jane.roe@velto.example";
 constexpr const char* kUserUUID = "0F8FAD5B-D9CB-469F-A165-70867728950E";
-/// SHA-256 of name and device identifier, folded in half; worked out apart from this code.
+constexpr const char* kOtherUserUUID = "7C9E6679-7425-40DE-944B-E07FC1F90AE7";
+// SHA-256 of name and device identifier, folded in half; worked out apart from this code.
+constexpr const char* kOtherStableUUID = "DCB960D9-5D73-41CA-0982-B260E956DF48";
 constexpr const char* kStableUUID = "BC6E3091-6F0C-96A4-D7F8-EADEF427002A";
 
 class AccountsTest : public DatabaseTest {
@@ -105,13 +107,7 @@ TEST_F(AccountsTest, IdentifiersOfAnAccount) {
     const Case cases[] = {
         {"a new record", kName, {}, {}, kUserUUID, true, kStableUUID},
         {"whatever the case of the name", "Jane.Roe@Velto.Example", "U", {}, kUserUUID, true, kStableUUID},
-        {"another device",
-         kName,
-         "U",
-         {},
-         "7C9E6679-7425-40DE-944B-E07FC1F90AE7",
-         true,
-         "DCB960D9-5D73-41CA-0982-B260E956DF48"},
+        {"another device", kName, "U", {}, kOtherUserUUID, true, kOtherStableUUID},
         {"nothing to do", kName, "U", "S", kUserUUID, false, "S"},
         {"a new identifier makes the other one void", kName, {}, "S", kUserUUID, true, kStableUUID},
         {"wrong kinds", kName, number(1), number(2), kUserUUID, true, kStableUUID},
@@ -219,12 +215,7 @@ TEST_F(AccountsTest, SettingValues) {
         {"Null removes", {{"k", null}}, true, "written, signalled", {}, on},
         {"Null for nothing", {{"x", null}}, true, "", "a", {}},
         {"the mark alone", {{"Dirty", on}}, true, "written", "a", on},
-        {"the mark taken off with a change",
-         {{"Dirty", off}, {"k", "b"}},
-         true,
-         "written, signalled",
-         "b",
-         off},
+        {"a change without mark", {{"Dirty", off}, {"k", "b"}}, true, "written, signalled", "b", off},
         {"the mark removed", {{"Dirty", null}, {"k", "b"}}, true, "written, signalled", "b", on},
         {"the modification date alone", {{"ModificationDate", "x"}}, true, "written", "a", on},
         {"the mark, and an equal value", {{"Dirty", on}, {"k", "a"}}, true, "written, signalled", "a", on},

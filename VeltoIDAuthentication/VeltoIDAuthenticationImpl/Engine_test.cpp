@@ -150,16 +150,6 @@ TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
     EXPECT_EQ(log_.count(" re-added; failed, "), 1) << "it has no encDsId";
 }
 
-TEST_F(Adding, WhatTheDatabaseRefusesFails) {
-    EXPECT_FALSE(__VeltoIDDoAddVeltoID(nullptr, kPassword, {}, nullptr, nullptr, &error_));
-    EXPECT_EQ(error_->code, -100);
-    std::filesystem::create_directory(platform::TemporaryStateDirectory::file("keychain.db"));
-    EXPECT_FALSE(add());
-    EXPECT_EQ(error_->code, -100);
-    EXPECT_EQ(takePosted(), "");
-    EXPECT_EQ(server_.takeMethods(), "");
-}
-
 // --- Forgetting
 
 TEST_F(EngineTest, ForgettingTakesEverythingAlong) {
@@ -441,19 +431,6 @@ TEST_F(Information, ChangesThatClientsSeeArePosted) {
     EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount("nobody", nullptr));
 }
 
-TEST_F(Information, AnIncompleteValidationRecordReplacesTheStoredOneByNone) {
-    const Dictionary incomplete[] = {{{kData, kRecordData}},
-                                     {{kData, kRecordData}, {kIdentifier, "v2"}},
-                                     {{kData, kRecordData}, {kNextCheck, date()}}};
-    for (const Dictionary& answer : incomplete) {
-        prepare(0);
-        setValues({{kIdentifier, "v1"}, {kData, kRecordData}, {kNextCheck, date()}});
-        updateAccountWithGetMyInfoResult(kName, answer);
-        for (const char* key : {kIdentifier, kData, kNextCheck})
-            EXPECT_FALSE(record().contains(key)) << key << testing::PrintToString(answer);
-    }
-}
-
 TEST_F(Information, TheServersWordOnTheCertificateGoesIntoItsEntry) {
     prepare(0);
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERT_ISSUED"}, {"Expires", date(1e6)}});
@@ -472,37 +449,6 @@ TEST_F(Information, TheServersWordOnTheCertificateGoesIntoItsEntry) {
 }
 
 // --- Errors of the server, passwords
-
-TEST_F(EngineTest, VerdictsOnThePasswordRemoveIt) {
-    struct Case {
-        std::optional<Error> error;
-        platform::LogPriority level;
-        const char* line;
-    };
-    const auto identity = [](int64_t code) { return Error{kIdentityErrorDomain, code, {}}; };
-    constexpr auto kNotice = platform::LogPriority::Notice;
-    const Case cases[] = {
-        {identity(-101), kNotice, "VeltoIDAuth: The password for account jane@velto.example is incorrect or"},
-        {identity(-102), kNotice, "VeltoIDAuth: The password for account jane@velto.example is incorrect or"},
-        {identity(-105), platform::LogPriority::Warning, "it no longer supports this client"},
-        {identity(-100), kNotice, nullptr},
-        {identity(-103), kNotice, nullptr},
-        {identity(-104), kNotice, nullptr},
-        {Error{kXMLErrorDomain, -101, {}}, kNotice, nullptr},
-        {std::nullopt, kNotice, nullptr},
-    };
-    for (const Case& each : cases) {
-        createAccount();
-        const size_t before = log_.lines().size();
-        handleServerError(kName, each.error);
-        EXPECT_EQ(hasPassword(), each.line == nullptr);
-        const auto lines = log_.lines();
-        ASSERT_EQ(lines.size() - before, each.line != nullptr ? 1U : 0U);
-        if (each.line == nullptr) continue;
-        EXPECT_NE(lines.back().text.find(each.line), std::string::npos) << lines.back().text;
-        EXPECT_EQ(lines.back().priority, each.level);
-    }
-}
 
 TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
     server_.answer("authenticate",

@@ -201,11 +201,6 @@ TEST_F(CommandsTest, ARelaunchIsScheduled) {
         1);
 }
 
-TEST_F(CommandsTest, CredentialsAreNotRedirected) {
-    EXPECT_EQ(after({{"NewURL", "https://elsewhere.example"}})->fServerURL, kURL);
-    EXPECT_TRUE(log_.contains("Ignoring a new server URL"));
-}
-
 TEST_F(CommandsTest, FlushAndExitEndsTheProcessWithEverythingWritten) {
     platform::ChildProcess process([this] {
         after({{"MetaInformation", Dictionary{{"X", "last words"}}}, {"FlushAndExit", flag(true)}});
@@ -215,21 +210,6 @@ TEST_F(CommandsTest, FlushAndExitEndsTheProcessWithEverythingWritten) {
     EXPECT_EQ(meta("X"), Value("last words"));
     after({{"FlushAndExit", flag(false)}});
     after({{"FlushAndExit", number(1)}});
-}
-
-TEST_F(CommandsTest, AFailedCallBringsNoCommandsAndItsOwnError) {
-    Session called = session(0, 7);
-    const String method = std::string(kVeltoIDMethodPrefix) + "m";
-    std::optional<Dictionary> result = Dictionary();
-    std::optional<Error> error;
-    server_.fault("m", -42);
-    EXPECT_FALSE(xmlInvoke(*called, method, {}, &result, &error));
-    EXPECT_EQ(error, (Error{kXMLErrorDomain, -42, {{kErrorDescriptionKey, "because"}}}));
-    EXPECT_EQ(result, std::nullopt);
-    server_.answer("m", Array{"no dictionary"});
-    result = Dictionary();
-    EXPECT_TRUE(xmlInvoke(*called, method, {}, &result, &error));
-    EXPECT_EQ(result, std::nullopt);
 }
 
 // --- Faults
@@ -246,6 +226,7 @@ TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
         std::set<std::string> userInfo;
     };
     const auto faultOf = [](int64_t code) { return Error{kXMLErrorDomain, code, {}}; };
+    const Error sameCodeElsewhere{kIdentityErrorDomain, -20101, {}};
     const std::set<std::string> place = {"function", "file", "line"};
     const auto with = [&](std::set<std::string> keys) {
         keys.insert(place.begin(), place.end());
@@ -254,6 +235,7 @@ TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
     const std::string kReason(kErrorFailureReasonKey);
     const std::string kText(kErrorDescriptionKey);
     const std::string kCause(kErrorUnderlyingErrorKey);
+    constexpr const char* kDisabled = "This Velto ID has been disabled for security reasons.";
     constexpr const char* kIncorrect = "The Velto ID account or password are incorrect.";
     const Case cases[] = {
         {"account", faultOf(-20101), {}, -101, kIncorrect, true, with({kReason, kCause, "XMLFaultCode"})},
@@ -263,17 +245,11 @@ TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
          faultOf(-20209),
          {},
          -102,
-         "This Velto ID has been disabled for security reasons.",
+         kDisabled,
          true,
          with({kReason, kText, kCause, "XMLFaultCode"})},
         {"another fault", faultOf(-4164), {}, -100, nullptr, false, with({kCause, "XMLFaultCode"})},
-        {"the same code elsewhere",
-         Error{kIdentityErrorDomain, -20101, {}},
-         {},
-         -100,
-         nullptr,
-         false,
-         with({kCause})},
+        {"another domain", sameCodeElsewhere, {}, -100, nullptr, false, with({kCause})},
         {"the transport", transport, Dictionary(), -100, nullptr, false, with({kCause, "XMLResponse"})},
         {"a response", {}, Dictionary(), -100, nullptr, false, with({"XMLResponse"})},
         {"nothing", {}, {}, -100, nullptr, false, place},

@@ -190,6 +190,8 @@ TEST_F(SignInTest, TheServerIsLeftAloneWhileItMustBe) {
 }
 
 TEST_F(SignInTest, AnEmbargoInTheReplyHoldsForTheNextSignIn) {
+    constexpr const char* kBefore = "DoNotConnectBeforeX";
+    constexpr const char* kFor = "DoNotConnectForX";
     struct Case {
         const char* what;
         Dictionary reply;
@@ -197,16 +199,14 @@ TEST_F(SignInTest, AnEmbargoInTheReplyHoldsForTheNextSignIn) {
         std::optional<double> embargo;
     };
     const Case cases[] = {
-        {"for some time", {{"DoNotConnectForX", Value::int32(600)}}, 600},
-        {"for no time", {{"DoNotConnectForX", Value::int32(0)}}, {}},
-        {"until a date", {{"DoNotConnectBeforeX", date(50)}}, 50},
-        {"until a past date", {{"DoNotConnectBeforeX", date(-50)}}, {}},
-        {"the date comes first",
-         {{"DoNotConnectBeforeX", date(50)}, {"DoNotConnectForX", Value::int32(5)}},
-         50},
-        {"a past date, too", {{"DoNotConnectBeforeX", date(-50)}, {"DoNotConnectForX", Value::int32(5)}}, {}},
-        {"a date in words", {{"DoNotConnectBeforeX", "2100-01-01T00:00:00Z"}}, 4'102'444'800 - now()},
-        {"no date", {{"DoNotConnectBeforeX", "soon"}, {"DoNotConnectForX", Value::int32(5)}}, 5},
+        {"for some time", {{kFor, Value::int32(600)}}, 600},
+        {"for no time", {{kFor, Value::int32(0)}}, {}},
+        {"until a date", {{kBefore, date(50)}}, 50},
+        {"until a past date", {{kBefore, date(-50)}}, {}},
+        {"the date comes first", {{kBefore, date(50)}, {kFor, Value::int32(5)}}, 50},
+        {"a past date, too", {{kBefore, date(-50)}, {kFor, Value::int32(5)}}, {}},
+        {"a date in words", {{kBefore, "2100-01-01T00:00:00Z"}}, 4'102'444'800 - now()},
+        {"no date", {{kBefore, "soon"}, {kFor, Value::int32(5)}}, 5},
     };
     createAccount();
     for (const Case& each : cases) {
@@ -271,29 +271,6 @@ TEST_F(SignInTest, Failures) {
     EXPECT_FALSE(log_.contains(kPassword));
 }
 
-TEST_F(SignInTest, WithoutNamePasswordOrServerNothingIsSent) {
-    std::optional<Error> error;
-    EXPECT_EQ(__VeltoIDSessionDoCreateSession(nullptr, kPassword, {}, nullptr, nullptr, &error), nullptr);
-    EXPECT_EQ(__VeltoIDSessionDoCreateSession(kName, nullptr, {}, nullptr, nullptr, &error), nullptr);
-    EXPECT_EQ(error, std::nullopt);
-    EXPECT_EQ(counts(), "0 0 0 0 0 ");
-    const Outcome outcome = signIn({{"ServerURL", ""}});
-    EXPECT_EQ(outcome.session, nullptr);
-    EXPECT_EQ(outcome.code(), -100);
-    EXPECT_EQ(counts(), "1 0 0 0 1 ");
-    EXPECT_TRUE(server_.take().empty());
-}
-
-TEST_F(SignInTest, ACheckThatIsNotToBeSavedCountsAsUnsuccessful) {
-    server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
-    const Outcome outcome = signIn({{"DoNotSaveSessionInfo", flag(true)}});
-    EXPECT_NE(outcome.session, nullptr);
-    EXPECT_EQ(outcome.error, std::nullopt);
-    EXPECT_EQ(counts(), "1 1 0 0 1 ");
-    EXPECT_TRUE(meta("LastConnectAttempt").isAbsent());
-    EXPECT_TRUE(meta("LastSuccessfulConnect").isAbsent());
-}
-
 TEST_F(SignInTest, AnotherEncDsIdMakesCertificatesAndRecordVoid) {
     createAccount("old");
     setValue("VeltoIDAccountValidationRecordIdentifierKey", "v1");
@@ -317,6 +294,8 @@ TEST_F(SignInTest, AnotherEncDsIdMakesCertificatesAndRecordVoid) {
 }
 
 TEST_F(SignInTest, TheServersWordOnTheCertificate) {
+    constexpr const char* kIsValid = "CertificateIsValid";
+    constexpr const char* kIsNotValid = "CertificateNoLongerValid";
     struct Case {
         const char* what;
         Dictionary reply;
@@ -325,14 +304,11 @@ TEST_F(SignInTest, TheServersWordOnTheCertificate) {
     };
     const Case cases[] = {
         {"no word", {}, false, false},
-        {"valid", {{"CertificateIsValid", flag(true)}}, true, false},
-        {"valid, whatever else",
-         {{"CertificateIsValid", flag(true)}, {"CertificateNoLongerValid", "x"}},
-         true,
-         false},
-        {"not valid", {{"CertificateIsValid", flag(false)}}, false, true},
-        {"valid in the wrong kind", {{"CertificateIsValid", "true"}}, false, true},
-        {"no longer valid", {{"CertificateNoLongerValid", flag(false)}}, false, true},
+        {"valid", {{kIsValid, flag(true)}}, true, false},
+        {"valid anyway", {{kIsValid, flag(true)}, {kIsNotValid, "x"}}, true, false},
+        {"not valid", {{kIsValid, flag(false)}}, false, true},
+        {"valid in the wrong kind", {{kIsValid, "true"}}, false, true},
+        {"no longer valid", {{kIsNotValid, flag(false)}}, false, true},
     };
     createAccount("d1");
     for (const Case& each : cases) {

@@ -121,15 +121,6 @@ TEST_F(TimedSend, WaitsFiveSecondsAndDiscardsWhatComesLater) {
     EXPECT_FALSE(hasResponse_);
 }
 
-TEST_F(TimedSend, TakesAnAnswerJustInTime) {
-    send(4.75);
-    clock_.advanceBy(4.5);
-    EXPECT_FALSE(isOver_);
-    clock_.advanceBy(0.25);
-    EXPECT_TRUE(isOver_);
-    EXPECT_TRUE(hasResponse_);
-}
-
 TEST_F(TimedSend, GoesOnWhenTheDateIsSet) {
     send(3);
     clock_.jumpTo(clock_.now() + 86'400);
@@ -234,15 +225,6 @@ TEST_F(AsynchronousConnection, HandsChallengesToADelegateThatTakesThem) {
         recorder_->challengeAnswer = each.answer;
         EXPECT_EQ(linesOf(challenging), each.lines);
     }
-}
-
-TEST_F(AsynchronousConnection, LogsTheBeginningAndItsFailure) {
-    const String identifier = spawn(answer(200));
-    EXPECT_TRUE(log_.contains("The session, " + identifier.text() + ", has been established!"));
-    transport_.setAvailable(false);
-    EXPECT_EQ(spawn(answer(200)), String());
-    EXPECT_TRUE(log_.contains(", could not be established!"));
-    EXPECT_EQ(manager_.numberOfActiveConnections(), 0U);
 }
 
 TEST_F(AsynchronousConnection, TheManagerHoldsConnectionsUntilTheyAreClosed) {
