@@ -1,11 +1,7 @@
 // Requests as clients send them, and the replies that they get.
 #include "VeltoIDAuthd/AuthenticationService.h"
 
-#include <unistd.h>
-
-#include <array>
 #include <functional>
-#include <thread>
 
 #include "Platform/FakeNotifications.h"
 #include "VeltoIDAuthd/AccountStatus.h"
