@@ -320,17 +320,19 @@ class Files(unittest.TestCase):
                     self.assertEqual(kept.fetchall(), [] if key == "Version" else [(b"\0",)])
 
     def test_a_change_that_cannot_be_stored_fails_and_spoils_nothing(self):
-        with World(server=False) as world, world.client() as client:
-            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="before", value="b")["success"])
-            half = bytes(36 << 20)
-            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="half", value=half)["success"])
-            self.assertFalse(client.call(SET_VALUE, domain="MetaInfo", key="other half", value=half)["success"])
-            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="half")["success"])
-            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="after", value="a")["success"])
-            os.kill(world.agent_pid(), signal.SIGKILL)
-            with world.client() as again:
-                meta = again.call(DATABASE)["result"]["MetaInfo"]
-            self.assertEqual((meta["before"], meta["after"]), ("b", "a"))
+        half = bytes(36 << 20)
+        steps = [("before", "b", True), ("half", half, True), ("other half", half, False), ("half", 0, True),
+                 ("after", "a", True)]
+        with World(server=False) as world:
+            world.start_agent()
+            with world.client() as client:
+                for key, value, expected in steps:
+                    self.assertEqual(client.call(SET_VALUE, domain="MetaInfo", key=key, value=value),
+                                     {"success": expected}, key)
+            world.stop_agent(signal.SIGKILL)
+            world.start_agent()
+            with world.client() as client:
+                self.assertEqual(client.call(DATABASE)["result"]["MetaInfo"], {"before": "b", "half": 0, "after": "a"})
 
     def test_a_state_folder_that_cannot_be_had_leaves_the_agent_up(self):
         with World() as world:

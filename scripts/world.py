@@ -197,7 +197,8 @@ class World:
         return Client(self.bus.address, service, starts_agent)
 
     def start_agent(self, *more: str, environment: dict[str, str] | None = None) -> subprocess.Popen:
-        """Starts the agent by hand and returns when it answers."""
+        """Starts the agent by hand and returns when it answers. The bus may need a moment to see that the last is gone."""
+        self.wait_for_name(owned=False)
         self.agent = subprocess.Popen(
             [agent_program(), *self.arguments, *more], stdout=subprocess.PIPE, stderr=self.bus.log,
             env={**os.environ, **self.environment, "DBUS_SESSION_BUS_ADDRESS": self.bus.address,
@@ -205,16 +206,16 @@ class World:
         self.wait_for_name()
         return self.agent
 
-    def wait_for_name(self):
-        """Blocks until somebody owns the service's name, without making the bus start anybody."""
+    def wait_for_name(self, owned: bool = True):
+        """Blocks until somebody, or nobody, owns the service's name, without making the bus start anybody."""
         connection = open_dbus_connection(bus=self.bus.address)
         rule = MatchRule(type="signal", sender="org.freedesktop.DBus", member="NameOwnerChanged")
         rule.add_arg_condition(0, SERVICE)
         Proxy(message_bus, connection).AddMatch(rule)
         with connection.filter(rule) as changes:
-            owned = Proxy(message_bus, connection).NameHasOwner(SERVICE)[0]
-            while not owned:
-                owned = connection.recv_until_filtered(changes, timeout=20).body[2] != ""
+            has_owner = Proxy(message_bus, connection).NameHasOwner(SERVICE)[0]
+            while has_owner != owned:
+                has_owner = connection.recv_until_filtered(changes, timeout=20).body[2] != ""
         connection.close()
 
     def agent_pid(self) -> int:
