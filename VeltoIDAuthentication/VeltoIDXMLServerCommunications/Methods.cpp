@@ -44,7 +44,8 @@ std::optional<Dictionary> call(VeltoIDAuthenticationSessionInfo& session, const 
 
 void takeValidationRecord(const Dictionary& reply, Dictionary& result) {
     const Data record = base64Decode(reply.string("VIDVRecord"));
-    if (!record) return;
+    // Text that is no base64 decodes to nothing.
+    if (record.size() == 0) return;
     result.set(kVeltoIDAccountValidationRecordDataKey, record);
     result.set(kVeltoIDAccountValidationRecordIdentifierKey, reply.string("VIDVRecordIdentifier"));
     if (const auto nextCheck = dateFromValue(reply.string("VIDVRecordNextCheckDate")))
