@@ -15,6 +15,7 @@
 namespace veltoid {
 namespace {
 
+/// When the process was started (seconds since 1970).
 const double kLaunchTime = platform::Clock::shared().now();
 
 /// Null for a state that clients have no name for.
@@ -100,8 +101,6 @@ Dictionary copyStatusOfEveryAccount(const Dictionary& options) {
 }
 
 }  // namespace
-
-double launchTime() { return kLaunchTime; }
 
 Dictionary copyDeviceStatusDictionary() {
     return {{"DeviceUnlockedSinceBoot", Value::boolean(platform::hasBeenUnlockedSinceBoot())}};

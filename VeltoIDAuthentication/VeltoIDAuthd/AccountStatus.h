@@ -5,9 +5,6 @@
 
 namespace veltoid {
 
-/// When the process was started (seconds since 1970).
-double launchTime();
-
 /// "DeviceUnlockedSinceBoot".
 Dictionary copyDeviceStatusDictionary();
 
