@@ -12,9 +12,12 @@ import sys
 from pathlib import Path
 
 from accounts import BUILT_IN, Accounts
-from authority import Authority, server_context
+from authority import Authority, export_certificate, server_context
+from certificates import IssuedCertificates
+from client_certificate_page import PAGE, ClientCertificateHandler
 from control import Control, ControlHandler
 from faults import Injections
+from issuance import Issuance
 from loopback_http import LoopbackServer
 from methods import Methods
 from record import Record
@@ -61,17 +64,20 @@ def _start(options: argparse.Namespace) -> dict[str, object]:
     """Brings every port up and returns the ready line."""
     options.state_dir.mkdir(mode=0o700, parents=True, exist_ok=True)
     authority = Authority.load_or_create(options.state_dir)
-    anchor = options.state_dir / "authority.pem"
-    authority.export_anchor(anchor)
+    anchor, intermediate = options.state_dir / "authority.pem", options.state_dir / "intermediate.pem"
+    export_certificate(authority.root, anchor)
+    export_certificate(authority.intermediate, intermediate)
 
     accounts = Accounts()
     accounts.apply(json.loads(options.accounts.read_text()) if options.accounts else list(BUILT_IN))
     settings = Settings()
-    methods = Methods(accounts, ValidationRecords(authority.issue_signer()), settings)
+    stranger = Authority.create("Unknown authority")
+    issued = IssuedCertificates()
+    methods = Methods(accounts, ValidationRecords(authority.issue_signer(), settings),
+                      Issuance(authority, stranger, issued, settings), issued, settings)
     service = Service(methods, Injections(methods.names()), Record(), settings)
 
     own_names = ("localhost", "127.0.0.1")
-    stranger = Authority.create("Unknown authority")
     doors = {
         "url": (options.port, authority.issue_server(*own_names)),
         "wrongNameUrl": (0, authority.issue_server("another-host.invalid")),
@@ -83,10 +89,14 @@ def _start(options: argparse.Namespace) -> dict[str, object]:
         door = LoopbackServer(options.host, port, RpcHandler, service, context)
         door.start()
         ready[name] = f"https://localhost:{door.port}{PATH}"
-    control = LoopbackServer(options.host, options.control_port, ControlHandler, Control(service, accounts))
+    page_context = server_context(doors["url"][1], options.state_dir, clients_of=authority)
+    page = LoopbackServer(options.host, 0, ClientCertificateHandler, issued, page_context)
+    page.start()
+    control = LoopbackServer(options.host, options.control_port, ControlHandler, Control(service, accounts, issued))
     control.start()
-    return ready | {"control": f"http://{options.host}:{control.port}", "authority": str(anchor.resolve()),
-                    "pid": os.getpid()}
+    return ready | {"clientCertificateUrl": f"https://localhost:{page.port}{PAGE}",
+                    "control": f"http://{options.host}:{control.port}", "authority": str(anchor.resolve()),
+                    "intermediate": str(intermediate.resolve()), "pid": os.getpid()}
 
 
 if __name__ == "__main__":

@@ -77,6 +77,10 @@ class Accounts:
         with self._lock:
             return self._by_name.get(name.lower())
 
+    def all(self) -> list[Account]:
+        with self._lock:
+            return list(self._by_name.values())
+
     def apply(self, texts: Any) -> list[str]:
         """Adds or changes accounts from one JSON object or a list of them: all, or (ValueError) none.
 

@@ -8,6 +8,7 @@ from dataclasses import dataclass
 from typing import Any, Callable
 
 from accounts import Accounts
+from certificates import IssuedCertificates
 from loopback_http import LoopbackHandler, Refusal
 from methods import ANY
 from rpc import Service
@@ -21,6 +22,7 @@ class Control:
 
     service: Service
     accounts: Accounts
+    issued: IssuedCertificates
 
     def commands(self) -> dict[tuple[str, str], Callable[[Any], Any]]:
         service = self.service
@@ -33,6 +35,9 @@ class Control:
             ("GET", "/counts"): lambda _: service.record.counts(),
             ("POST", "/accounts"): lambda value: {"accounts": self.accounts.apply(value)},
             ("POST", "/settings"): self._settings,
+            ("DELETE", "/settings"): lambda _: service.settings.reset(),
+            ("GET", "/certificates"): lambda _: [certificate.json() for certificate in self.issued.all()],
+            ("POST", "/revoke"): self._revoke,
             ("POST", "/wait"): self._wait,
             ("GET", "/health"): lambda _: {"ok": True, "pid": os.getpid()},
         }
@@ -40,6 +45,13 @@ class Control:
     def _settings(self, value: Any) -> Any:
         self.service.settings.apply(value)
         return vars(self.service.settings)
+
+    def _revoke(self, serial: Any) -> Any:
+        certificate = self.issued.find(serial) if isinstance(serial, str) else None
+        if certificate is None:
+            raise ValueError("no certificate of this serial number")
+        certificate.revoked = True
+        return certificate.json()
 
     def _wait(self, value: Any) -> Any:
         defaults = {"method": ANY, "count": 1, "timeout": 10}

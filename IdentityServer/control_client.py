@@ -41,7 +41,8 @@ class IdentityServer:
         program = str(Path(__file__).resolve().parent)
         self._command = [INTERPRETER, program, "--state-dir", str(state_dir), *options]
         self._process: subprocess.Popen[str] | None = None
-        self.url = self.wrong_name_url = self.unknown_authority_url = self.control = self.authority = ""
+        self.url = self.wrong_name_url = self.unknown_authority_url = self.client_certificate_url = ""
+        self.control = self.authority = self.intermediate = ""
         self.pid = 0
 
     def start(self) -> IdentityServer:
@@ -53,7 +54,9 @@ class IdentityServer:
             self.stop()
             raise RuntimeError("the identity server did not get ready")
         ready = json.loads(line)
-        self.url, self.control, self.authority = ready["url"], ready["control"], ready["authority"]
+        self.url, self.control = ready["url"], ready["control"]
+        self.authority, self.intermediate = ready["authority"], ready["intermediate"]
+        self.client_certificate_url = ready["clientCertificateUrl"]
         self.wrong_name_url, self.unknown_authority_url = ready["wrongNameUrl"], ready["unknownAuthorityUrl"]
         self.pid = ready["pid"]
         return self
@@ -106,6 +109,18 @@ class IdentityServer:
     def settings(self, **settings: Any) -> dict[str, Any]:
         """Changes run-time settings; returns all of them."""
         return self.command("POST", "/settings", settings)
+
+    def reset_settings(self) -> None:
+        """Back to what they are at the start."""
+        self.command("DELETE", "/settings")
+
+    def certificates(self, account: str | None = None) -> list[dict[str, Any]]:
+        """The certificates issued since the start, oldest first, all or those of one account name."""
+        return [entry for entry in self.command("GET", "/certificates") if account in (None, entry["account"])]
+
+    def revoke(self, serial: str) -> None:
+        """Revokes a certificate behind its owner's back."""
+        self.command("POST", "/revoke", serial)
 
     def wait(self, method: str = "*", count: int = 1, timeout: float = 10) -> bool:
         """Whether `count` calls (since the record was last emptied) arrived in time."""

@@ -1,7 +1,7 @@
 """Tests of the development identity server over real TLS, against a server process of their own.
 
-Run from this directory with `/usr/bin/python3 -m unittest identity_server_test`, or by path with
-`/usr/bin/python3 IdentityServer/identity_server_test.py`.
+Run from this directory with `/usr/bin/python3 -B -m unittest identity_server_test`, or by path with
+`/usr/bin/python3 -B IdentityServer/identity_server_test.py`.
 """
 
 from __future__ import annotations
@@ -11,31 +11,22 @@ import datetime
 import hashlib
 import http.client
 import json
-import os
 import plistlib
-import signal
-import socket
 import ssl
 import subprocess
 import sys
-import tempfile
 import threading
 import time
 import unittest
 import xmlrpc.client
 from pathlib import Path
 from typing import Any
-from urllib.parse import urlsplit
 
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 
-from control_client import INTERPRETER, ControlError, IdentityServer  # noqa: E402
-
-PREFIX = "com.velto.dir.idm.web.collaboration.PersonService."
-JANE = "jane.roe@example.com"
-JANE_HASH = hashlib.sha256(b"correct horse").hexdigest()
-SIGN_IN = {"veltoConnect": JANE, "pwdHash": JANE_HASH}
-TIMEOUT = 20
+from control_client import ControlError, IdentityServer  # noqa: E402
+from server_case import (JANE, JANE_HASH, PREFIX, SIGN_IN, TIMEOUT, ServerTest, call, exchange, fault_of,  # noqa: E402
+                         server, setUpModule)
 
 # What the agent writes where implementations differ: one line, zone letter, wide integer, nil, broken base64.
 AGENT_DOCUMENT = (
@@ -54,57 +45,9 @@ AGENT_MEMBERS = (
 )
 
 
-def setUpModule() -> None:
-    global server, trust
-    directory = tempfile.TemporaryDirectory()
-    unittest.addModuleCleanup(directory.cleanup)
-    server = IdentityServer(Path(directory.name) / "state").start()
-    unittest.addModuleCleanup(server.stop)
-    trust = ssl.create_default_context(cafile=server.authority)
-
-
 def agent_document(*members: tuple[str, str, Any]) -> bytes:
     texts = (f"<member><name>{name}</name><value>{value}</value></member>" for name, value, _ in members)
     return (AGENT_DOCUMENT % "".join(texts)).encode()
-
-
-def exchange(body: bytes | None, url: str = "", verb: str = "POST", **headers: str) -> tuple[int, bytes]:
-    """One HTTPS request; status and body of the answer."""
-    address = urlsplit(url or server.url)
-    connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=trust)
-    try:
-        fields = {name.replace("_", "-"): value for name, value in headers.items()}
-        connection.request(verb, address.path, body, {"Content-Type": "text/xml"} | fields)
-        response = connection.getresponse()
-        return response.status, response.read()
-    finally:
-        connection.close()
-
-
-def call(method: str, parameters: Any, url: str = "") -> dict[str, Any]:
-    """One remote call; raises `xmlrpc.client.Fault`."""
-    status, body = exchange(xmlrpc.client.dumps((parameters,), PREFIX + method).encode(), url)
-    if status != 200:
-        raise AssertionError(f"{status}: {body!r}")
-    return xmlrpc.client.loads(body, use_builtin_types=True)[0][0]
-
-
-def fault_of(method: str, parameters: Any) -> int | None:
-    try:
-        call(method, parameters)
-    except xmlrpc.client.Fault as fault:
-        return fault.faultCode
-    return None
-
-
-class ServerTest(unittest.TestCase):
-    def setUp(self) -> None:
-        server.clear_next()
-        server.clear_received()
-        server.settings(dsSessionValidityDuration=300, Version=101, SuggestValidDuration=2592000, record=True)
-        session = call("authenticate", SIGN_IN)["dsSession"]
-        self.session = {"dsSession": session}
-        server.clear_received()
 
 
 class SignInTest(ServerTest):
@@ -158,13 +101,17 @@ class SignInTest(ServerTest):
 
 
 class MyInfoTest(ServerTest):
-    def verified(self, reply: dict[str, Any]) -> dict[str, Any]:
-        """The content of the reply's record, once its signature and its signer's authority are proved."""
+    def content(self, reply: dict[str, Any], *options: str) -> bytes:
+        """The content of the reply's record; AssertionError with the reason when openssl does not accept it."""
         record = base64.b64decode(reply["VIDVRecord"], validate=True)
-        arguments = ["openssl", "cms", "-verify", "-binary", "-inform", "DER", "-CAfile", server.authority]
+        arguments = ["openssl", "cms", "-verify", "-binary", "-inform", "DER", "-CAfile", server.authority, *options]
         done = subprocess.run(arguments, input=record, capture_output=True, check=False)
-        self.assertEqual(done.returncode, 0, done.stderr)
-        return plistlib.loads(done.stdout)
+        if done.returncode != 0:
+            raise AssertionError(done.stderr.decode())
+        return done.stdout
+
+    def verified(self, reply: dict[str, Any]) -> dict[str, Any]:
+        return plistlib.loads(self.content(reply))
 
     def test_details_come_with_a_signed_record(self) -> None:
         reply = call("getMyInfo", self.session)
@@ -198,6 +145,81 @@ class MyInfoTest(ServerTest):
         changed = call("getMyInfo", known)
         self.assertEqual({key: changed.get(key) for key in changes}, changes)
         self.assertEqual(self.verified(changed)["ValidatedPhones"], ["+15555550199"])
+
+
+    def test_records_take_the_form_that_is_set(self) -> None:
+        known = call("getMyInfo", self.session)["VIDVRecordIdentifier"]
+        for settings, start in (({"validationRecordFormat": "binary"}, b"bplist00"),
+                                ({"validationRecordFormat": "xml", "validAsOfAsText": True}, b"<?xml")):
+            with self.subTest(settings):
+                server.settings(**settings)
+                reply = call("getMyInfo", self.session | {"ClientVIDVRecordIdentifier": known})
+                self.assertTrue(self.content(reply).startswith(start))
+                self.assertEqual(self.verified(reply)["encDsId"], reply["encDsId"])
+        self.assertRegex(self.verified(reply)["ValidAsOf"], r"^\d{4}-\d\d-\d\dT\d\d:\d\d:\d\dZ$")
+        server.settings(validationRecordFormat="array")
+        self.assertIsInstance(self.verified(call("getMyInfo", self.session)), list)
+        server.settings(validationRecordFormat="text")
+        with self.assertRaises(plistlib.InvalidFileException):
+            self.verified(call("getMyInfo", self.session))
+
+    def test_records_are_tampered_with_as_set(self) -> None:
+        for form in ("xml", "binary", "array", "text"):
+            for tampering, reason in (("content", "SignerInfo_verify_content:verification failure"),
+                                      ("signature", "SignerInfo_verify:verification failure"),
+                                      ("detached", "no content")):
+                with self.subTest(form=form, tampering=tampering):
+                    server.settings(validationRecordFormat=form, validationRecordTampering=tampering)
+                    with self.assertRaisesRegex(AssertionError, reason):
+                        self.content(call("getMyInfo", self.session))
+        server.settings(validationRecordFormat="xml", validationRecordTampering="content")
+        made_out = plistlib.loads(self.content(call("getMyInfo", self.session), "-no_content_verify"))
+        age = datetime.datetime.utcnow() - made_out["ValidAsOf"]
+        self.assertLess(age, datetime.timedelta(minutes=10))
+
+
+class PeopleTest(ServerTest):
+    def test_people_are_found_by_what_was_validated_for_them(self) -> None:
+        found = lambda **criteria: [
+            (match["matched"], match["value"], match["VeltoID"], match.get("firstNm"))
+            for match in call("findPerson", self.session | {"searchCriteria": criteria})["matches"]]
+        namesake = {"name": "twin@example.com", "pwdHash": "0", "AllEmails": ["JANE@roe.example"],
+                    "PrimaryEmail": "first@example.com"}
+        server.accounts(namesake)
+        self.addCleanup(server.accounts, namesake | {"AllEmails": None, "PrimaryEmail": None})
+        john = "john.doe@example.com"
+        for criteria, expected in (
+                ({}, []), ({"email": ["nobody@example.com", ""]}, []), ({"phone": [JANE]}, []),
+                ({"email": ["first@example.com"]}, [("email", "first@example.com", "twin@example.com", None)]),
+                ({"phone": ["+15555550123"]}, [("phone", "+15555550123", JANE, "Jane")]),
+                ({"VeltoID": ["John.DOE@example.com"]}, [("VeltoID", "John.DOE@example.com", john, "John")]),
+                ({"email": [john, "jane@roe.example"], "VeltoID": [john]},
+                 [("email", john, john, "John"), ("email", "jane@roe.example", JANE, "Jane"),
+                  ("email", "jane@roe.example", "twin@example.com", None), ("VeltoID", john, john, "John")])):
+            with self.subTest(criteria):
+                self.assertEqual(found(**criteria), expected)
+        for bad in ("text", {"email": JANE}, {"email": [1]}, {"shoeSize": ["9"]}):
+            with self.subTest(bad):
+                self.assertEqual(fault_of("findPerson", self.session | {"searchCriteria": bad}), -1)
+        by_phone = self.session | {"searchCriteria": {"phone": ["+15555550123"]}}
+        self.assertNotIn("ValidInterval", call("findPerson", by_phone)["matches"][0])
+        server.settings(findPersonValidInterval=3600)
+        self.assertEqual(call("findPerson", by_phone)["matches"][0]["ValidInterval"], 3600)
+
+    def test_breadcrumbs_are_kept_by_account_machine_and_key(self) -> None:
+        place = self.session | {"machineUUID": "M", "breadcrumbKey": "K"}
+        self.assertEqual(call("fetchBreadcrumbEk", place), {})
+        for text in ("QUJD", "QUJD\nREVG"):
+            self.assertEqual(call("saveBreadcrumbEk", place | {"ek": text}), {})
+            self.assertEqual(call("fetchBreadcrumbEk", place), {"ek": text})
+        server.accounts({"name": "neighbour@example.com", "pwdHash": JANE_HASH})
+        neighbour = call("authenticate", SIGN_IN | {"veltoConnect": "neighbour@example.com"})["dsSession"]
+        for change in ({"machineUUID": "N"}, {"breadcrumbKey": "L"}, {"dsSession": neighbour}):
+            with self.subTest(change):
+                self.assertEqual(call("fetchBreadcrumbEk", place | change), {})
+        for change in ({"ek": "?"}, {"ek": "QUJD", "machineUUID": ""}, {"ek": "QUJD", "breadcrumbKey": 1}):
+            with self.subTest(change):
+                self.assertEqual(fault_of("saveBreadcrumbEk", place | change), -1)
 
 
 class WireTest(ServerTest):
@@ -316,6 +338,9 @@ class ControlTest(ServerTest):
                 ("/accounts", {"name": JANE, "disabled": "yes"}),
                 ("/accounts", {"name": JANE, "AllEmails": [1]}),
                 ("/settings", {"Version": 102, "record": 1}), ("/settings", {"x": 1}),
+                ("/settings", {"Version": 102, "issuance": "later"}), ("/settings", {"pendingPolls": -1}),
+                ("/settings", {"issuanceDelay": "5"}), ("/settings", {"issuanceDelay": float("nan")}),
+                ("/settings", {"validationRecordTampering": "none"}), ("/revoke", "00"), ("/revoke", {}),
                 ("/wait", {"count": "many"}), ("/wait", {"timeout": 1e9})):
             with self.subTest(path=path, value=value):
                 self.assertEqual(self.refusal("POST", path, value), 400)

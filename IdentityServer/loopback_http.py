@@ -1,4 +1,4 @@
-"""What both doors of the server share: threaded HTTP/1.1 on the loopback interface with bounded bodies."""
+"""What the doors of the server share: threaded HTTP/1.1 on the loopback interface with bounded bodies."""
 
 from __future__ import annotations
 
