@@ -1,6 +1,5 @@
 #include "Platform/Crypto.h"
 
-#include <openssl/err.h>
 #include <openssl/evp.h>
 #include <sys/random.h>
 
@@ -11,17 +10,14 @@
 #include <memory>
 #include <string>
 
-#include "Platform/LazyLibrary.h"
+#include "Platform/OpenSSLLibrary.h"
 #include "Platform/SystemLog.h"
 
 namespace platform {
 
 namespace {
 
-constinit const LazyLibrary library("libcrypto.so.3");
-VELTOID_LAZY_FUNCTION(library, ERR_clear_error);
-VELTOID_LAZY_FUNCTION(library, ERR_error_string_n);
-VELTOID_LAZY_FUNCTION(library, ERR_get_error);
+using openssl::library;
 VELTOID_LAZY_FUNCTION(library, EVP_aes_256_gcm);
 VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_ctrl);
 VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_free);
@@ -46,17 +42,6 @@ struct CipherContextDeleter {
 using CipherContext = std::unique_ptr<EVP_CIPHER_CTX, CipherContextDeleter>;
 
 using CipherUpdate = int (*)(EVP_CIPHER_CTX*, unsigned char*, int*, const unsigned char*, int);
-
-/// The library's own words for what just failed; its error queue is empty afterwards.
-std::string libraryReason() {
-    std::string reason;
-    while (const unsigned long code = ERR_get_error()) {
-        char text[256];
-        ERR_error_string_n(code, text, sizeof text);
-        reason.append(reason.empty() ? "" : "; ").append(text);
-    }
-    return reason.empty() ? "no reason given" : reason;
-}
 
 /// Digests and sealing fail only when memory or the library itself is broken: nothing safe can go on without
 /// them.
@@ -112,7 +97,7 @@ bool decrypt(Bytes key, Bytes additionalData, Bytes sealed, SecretBytes& plain) 
 SHA256Digest sha256(Bytes bytes) {
     SHA256Digest digest{};
     if (EVP_Digest(bytes.data(), bytes.size(), digest.data(), nullptr, EVP_sha256(), nullptr) != 1) {
-        abortOnFailure("SHA-256", libraryReason());
+        abortOnFailure("SHA-256", openssl::takeReason());
     }
     return digest;
 }
@@ -152,7 +137,7 @@ SecretBytes seal(Bytes key, Bytes additionalData, Bytes plain) {
     if (key.size() != kSealingKeyBytes) abortOnFailure("sealing", "the key has the wrong size");
     SecretBytes sealed(kNonceBytes + plain.size() + kTagBytes);
     fillRandom(std::span(sealed).first(kNonceBytes));
-    if (!encrypt(key, additionalData, plain, sealed.data())) abortOnFailure("sealing", libraryReason());
+    if (!encrypt(key, additionalData, plain, sealed.data())) abortOnFailure("sealing", openssl::takeReason());
     return sealed;
 }
 
@@ -160,7 +145,7 @@ std::optional<SecretBytes> unseal(Bytes key, Bytes additionalData, Bytes sealed)
     if (key.size() != kSealingKeyBytes || sealed.size() < kNonceBytes + kTagBytes) return std::nullopt;
     SecretBytes plain(sealed.size() - kNonceBytes - kTagBytes);
     if (!decrypt(key, additionalData, sealed, plain)) {
-        ERR_clear_error();
+        openssl::clearErrors();
         return std::nullopt;
     }
     return plain;

@@ -9,27 +9,13 @@
 #include <vector>
 
 #include "Platform/PropertyListFormat.h"
+#include "Platform/PropertyListShape.h"
 
 namespace platform {
 
 namespace {
 
 using namespace propertylist;
-
-/// Counts what passes through the sink, on either side.
-class Budget {
-  public:
-    bool spend(size_t payload) {
-        if (objects_ == 0 || payload > payload_) return false;
-        --objects_;
-        payload_ -= payload;
-        return true;
-    }
-
-  private:
-    size_t objects_ = kMaxPropertyListObjects;
-    size_t payload_ = kMaxPropertyListPayload;
-};
 
 /// Collects the events as finished leaves and lists of indexes; a container is known only when it ends, so it
 /// comes after its members and the top object is the last one.
@@ -68,19 +54,15 @@ class Writer : public ValueSink {
         addValue(addLeaf(begin), bytes.size());
     }
 
-    void fileDescriptor(int) override { failed_ = true; }
+    void fileDescriptor(int) override { shape_.fail(); }
 
-    void beginArray() override { begin(kArray); }
-    void endArray() override { end(kArray); }
-    void beginDictionary() override { begin(kDictionary); }
-    void endDictionary() override { end(kDictionary); }
+    void beginArray() override { begin(Container::Array); }
+    void endArray() override { end(Container::Array); }
+    void beginDictionary() override { begin(Container::Dictionary); }
+    void endDictionary() override { end(Container::Dictionary); }
 
     void key(std::string_view utf8) override {
-        if (failed_ || frames_.empty() || !frames_.back().expectsKey() || !budget_.spend(utf8.size())) {
-            failed_ = true;
-            return;
-        }
-        frames_.back().keys.push_back(addText(utf8));
+        if (shape_.key(utf8.size())) frames_.back().keys.push_back(addText(utf8));
     }
 
     SecretBytes finish() const;
@@ -94,11 +76,8 @@ class Writer : public ValueSink {
     };
 
     struct Frame {
-        Marker container;
         std::vector<uint32_t> keys;
         std::vector<uint32_t> values;
-
-        bool expectsKey() const { return container == kDictionary && keys.size() == values.size(); }
     };
 
     static constexpr Marker kLeaf = kNull;
@@ -138,32 +117,30 @@ class Writer : public ValueSink {
     void appendUTF16(std::string_view utf8);
 
     void addValue(uint32_t object, size_t payload) {
-        const bool second = frames_.empty() && top_.has_value();
-        if (failed_ || second || !budget_.spend(payload) ||
-            (!frames_.empty() && frames_.back().expectsKey())) {
-            failed_ = true;
-        } else if (frames_.empty()) {
+        if (shape_.value(payload)) place(object);
+    }
+
+    void place(uint32_t object) {
+        if (frames_.empty()) {
             top_ = object;
         } else {
             frames_.back().values.push_back(object);
         }
     }
 
-    void begin(Marker container) {
-        failed_ |= frames_.size() == kMaxPropertyListDepth;
-        if (!failed_) frames_.push_back({container, {}, {}});
+    void begin(Container container) {
+        if (shape_.begin(container)) frames_.emplace_back();
     }
 
-    void end(Marker container) {
-        failed_ |= frames_.empty() || frames_.back().container != container ||
-                   (container == kDictionary && !frames_.back().expectsKey());
-        if (failed_) return;
+    void end(Container container) {
+        if (!shape_.end(container)) return;
         const Frame frame = std::move(frames_.back());
         frames_.pop_back();
         const size_t begin = references_.size();
         references_.insert(references_.end(), frame.keys.begin(), frame.keys.end());
         references_.insert(references_.end(), frame.values.begin(), frame.values.end());
-        addValue(addObject({container, begin, frame.values.size()}), 0);
+        const Marker marker = container == Container::Array ? kArray : kDictionary;
+        place(addObject({marker, begin, frame.values.size()}));
     }
 
     SecretBytes leaves_;
@@ -172,9 +149,8 @@ class Writer : public ValueSink {
     std::vector<Frame> frames_;
     /// Hash of an encoded text to the object that has it.
     std::unordered_map<size_t, uint32_t> texts_;
-    std::optional<uint32_t> top_;
-    Budget budget_;
-    bool failed_ = false;
+    uint32_t top_ = 0;
+    Shape shape_;
 };
 
 void Writer::appendUTF16(std::string_view utf8) {
@@ -183,7 +159,7 @@ void Writer::appendUTF16(std::string_view utf8) {
     while (!utf8.empty()) {
         const auto point = takeCodePoint(utf8);
         if (!point) {
-            failed_ = true;
+            shape_.fail();
             return;
         }
         if (*point < 0x10000) {
@@ -221,7 +197,7 @@ uint32_t Writer::addText(std::string_view utf8) {
 }
 
 SecretBytes Writer::finish() const {
-    if (failed_ || !frames_.empty() || !top_) return {};
+    if (!shape_.isComplete()) return {};
     SecretBytes output(kHeader.begin(), kHeader.end());
     std::vector<uint64_t> offsets;
     offsets.reserve(objects_.size());
@@ -246,13 +222,13 @@ SecretBytes Writer::finish() const {
     output.push_back(static_cast<uint8_t>(offsetWidth));
     output.push_back(static_cast<uint8_t>(referenceWidth));
     appendBigEndian(output, objects_.size(), 8);
-    appendBigEndian(output, *top_, 8);
+    appendBigEndian(output, top_, 8);
     appendBigEndian(output, table, 8);
     return output;
 }
 
 /// Takes the events of the validating pass.
-class Discard : public ValueSink {
+class Discard final : public ValueSink {
   public:
     void null() override {}
     void boolean(bool) override {}
@@ -279,7 +255,9 @@ class Reader {
 
     bool open();
 
-    bool deliver(ValueSink& sink) {
+    /// The sink's own type makes the walk of the validating pass free of calls.
+    template <typename Sink>
+    bool deliver(Sink& sink) {
         budget_ = Budget();
         return visit(top_, 0, sink);
     }
@@ -298,14 +276,24 @@ class Reader {
         return taken;
     }
 
+    /// The trailer is behind every table, so that eight bytes can be read at each of its numbers.
+    static uint64_t numberAt(Bytes table, uint64_t index, size_t width) {
+        return bigEndianAt(table.data() + index * width, width);
+    }
+
     static std::optional<uint64_t> takeCount(Cursor& cursor, uint8_t marker);
     std::optional<Cursor> find(uint64_t object) const;
 
-    bool visit(uint64_t object, int depth, ValueSink& sink);
-    bool visitFixed(uint8_t marker, Cursor cursor, ValueSink& sink);
-    bool visitInteger(Bytes bytes, ValueSink& sink);
-    bool visitContainer(uint8_t marker, Cursor cursor, int depth, ValueSink& sink);
-    bool visitKey(uint64_t object, ValueSink& sink);
+    template <typename Sink>
+    bool visit(uint64_t object, int depth, Sink& sink);
+    template <typename Sink>
+    bool visitFixed(uint8_t marker, Cursor cursor, Sink& sink);
+    template <typename Sink>
+    bool visitInteger(Bytes bytes, Sink& sink);
+    template <typename Sink>
+    bool visitContainer(uint8_t marker, Cursor cursor, int depth, Sink& sink);
+    template <typename Sink>
+    bool visitKey(uint64_t object, Sink& sink);
     std::optional<std::string_view> text(uint8_t marker, Cursor cursor);
     bool decodeUTF16(Bytes units);
 
@@ -341,7 +329,7 @@ bool Reader::open() {
 
 std::optional<Reader::Cursor> Reader::find(uint64_t object) const {
     if (object >= count_) return std::nullopt;
-    const uint64_t offset = bigEndian(offsets_.subspan(object * offsetWidth_, offsetWidth_));
+    const uint64_t offset = numberAt(offsets_, object, offsetWidth_);
     if (offset < kHeader.size() || offset >= objects_.size()) return std::nullopt;
     return objects_.subspan(offset);
 }
@@ -355,7 +343,8 @@ std::optional<uint64_t> Reader::takeCount(Cursor& cursor, uint8_t marker) {
     return bytes ? std::optional(bigEndian(*bytes)) : std::nullopt;
 }
 
-bool Reader::visit(uint64_t object, int depth, ValueSink& sink) {
+template <typename Sink>
+bool Reader::visit(uint64_t object, int depth, Sink& sink) {
     auto cursor = find(object);
     if (!cursor) return false;
     const uint8_t marker = take(*cursor, 1)->front();
@@ -381,7 +370,8 @@ bool Reader::visit(uint64_t object, int depth, ValueSink& sink) {
     }
 }
 
-bool Reader::visitFixed(uint8_t marker, Cursor cursor, ValueSink& sink) {
+template <typename Sink>
+bool Reader::visitFixed(uint8_t marker, Cursor cursor, Sink& sink) {
     if ((marker & 0xF0U) == kInteger) {
         const auto bytes = (marker & 0x0FU) <= 4 ? take(cursor, size_t{1} << (marker & 0x0FU)) : std::nullopt;
         return bytes && visitInteger(*bytes, sink);
@@ -413,7 +403,8 @@ bool Reader::visitFixed(uint8_t marker, Cursor cursor, ValueSink& sink) {
     }
 }
 
-bool Reader::visitInteger(Bytes bytes, ValueSink& sink) {
+template <typename Sink>
+bool Reader::visitInteger(Bytes bytes, Sink& sink) {
     // Up to four bytes are unsigned, eight and sixteen are two's complement.
     const uint64_t low = bigEndian(bytes.last(std::min<size_t>(bytes.size(), 8)));
     const auto asSigned = static_cast<int64_t>(low);
@@ -424,24 +415,26 @@ bool Reader::visitInteger(Bytes bytes, ValueSink& sink) {
     return sink.integer(asSigned), true;
 }
 
-bool Reader::visitContainer(uint8_t marker, Cursor cursor, int depth, ValueSink& sink) {
+template <typename Sink>
+bool Reader::visitContainer(uint8_t marker, Cursor cursor, int depth, Sink& sink) {
     const bool dictionary = (marker & 0xF0U) == kDictionary;
     const auto count = takeCount(cursor, marker);
     if (depth == kMaxPropertyListDepth || !count || *count > objects_.size() || !budget_.spend(0))
         return false;
-    auto keys = dictionary ? take(cursor, *count * referenceWidth_) : Bytes();
-    auto values = take(cursor, *count * referenceWidth_);
+    const auto keys = dictionary ? take(cursor, *count * referenceWidth_) : Bytes();
+    const auto values = take(cursor, *count * referenceWidth_);
     if (!keys || !values) return false;
     dictionary ? sink.beginDictionary() : sink.beginArray();
-    while (!values->empty()) {
-        if (dictionary && !visitKey(bigEndian(*take(*keys, referenceWidth_)), sink)) return false;
-        if (!visit(bigEndian(*take(*values, referenceWidth_)), depth + 1, sink)) return false;
+    for (uint64_t i = 0; i < *count; ++i) {
+        if (dictionary && !visitKey(numberAt(*keys, i, referenceWidth_), sink)) return false;
+        if (!visit(numberAt(*values, i, referenceWidth_), depth + 1, sink)) return false;
     }
     dictionary ? sink.endDictionary() : sink.endArray();
     return true;
 }
 
-bool Reader::visitKey(uint64_t object, ValueSink& sink) {
+template <typename Sink>
+bool Reader::visitKey(uint64_t object, Sink& sink) {
     auto cursor = find(object);
     if (!cursor) return false;
     const uint8_t marker = take(*cursor, 1)->front();
@@ -491,6 +484,11 @@ bool readBinaryPropertyList(Bytes bytes, ValueSink& sink) {
     Reader reader(bytes);
     Discard nothing;
     return reader.open() && reader.deliver(nothing) && reader.deliver(sink);
+}
+
+bool readPropertyList(Bytes bytes, ValueSink& sink) {
+    return textOf(bytes).starts_with(kAnyHeader) ? readBinaryPropertyList(bytes, sink)
+                                                 : readXMLPropertyList(bytes, sink);
 }
 
 }  // namespace platform

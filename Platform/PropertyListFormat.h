@@ -1,9 +1,11 @@
 // The numbers of the binary property-list layout and the conversions that its writer and reader share.
-// Internal to PropertyList.cpp.
+// Internal to the PropertyList sources.
 #pragma once
 
 #include <algorithm>
+#include <bit>
 #include <cstdint>
+#include <cstring>
 #include <optional>
 #include <string_view>
 
@@ -12,6 +14,8 @@
 namespace platform::propertylist {
 
 inline constexpr std::string_view kHeader = "bplist00";
+/// Of whatever version.
+inline constexpr std::string_view kAnyHeader = "bplist";
 inline constexpr size_t kTrailerBytes = 32;
 inline constexpr size_t kUUIDBytes = 16;
 /// The binary form counts from 2001-01-01 00:00:00 UTC.
@@ -45,6 +49,14 @@ inline uint64_t bigEndian(Bytes bytes) {
     return value;
 }
 
+/// The number of 1 to 8 bytes at `bytes`, behind which eight bytes can be read.
+inline uint64_t bigEndianAt(const uint8_t* bytes, size_t width) {
+    uint64_t value = 0;
+    std::memcpy(&value, bytes, sizeof value);
+    if constexpr (std::endian::native == std::endian::little) value = __builtin_bswap64(value);
+    return value >> (64 - 8 * width);
+}
+
 /// The smallest of 1, 2, 4 and 8 bytes that holds the value.
 inline size_t widthOf(uint64_t value) {
     if (value <= UINT8_MAX) return 1;
@@ -53,6 +65,11 @@ inline size_t widthOf(uint64_t value) {
 }
 
 inline bool isASCII(std::string_view text) {
+    constexpr uint64_t kHighBits = 0x8080808080808080;
+    for (uint64_t eight = 0; text.size() >= sizeof eight; text.remove_prefix(sizeof eight)) {
+        std::memcpy(&eight, text.data(), sizeof eight);
+        if ((eight & kHighBits) != 0) return false;
+    }
     return std::ranges::all_of(text, [](char c) { return static_cast<uint8_t>(c) < 0x80; });
 }
 

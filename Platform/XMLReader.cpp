@@ -82,6 +82,10 @@ void onCharacters(void* context, const XML_Char* text, int length) {
     guarded(context, [=](XMLEvents& events) { events.characters({text, static_cast<size_t>(length)}); });
 }
 
+void onDocumentType(void* context, const XML_Char*, const XML_Char*, const XML_Char*, int hasDeclarations) {
+    guarded(context, [=](XMLEvents& events) { events.documentType(hasDeclarations != 0); });
+}
+
 void onEntityDeclaration(void* context, const XML_Char*, int, const XML_Char*, int, const XML_Char*,
                          const XML_Char*, const XML_Char*, const XML_Char*) {
     static_cast<Reading*>(context)->stop(kEntitiesRefused);
@@ -97,6 +101,7 @@ void installHandlers(XML_Parser parser, Reading& reading) {
     XML_SetUserData(parser, &reading);
     XML_SetElementHandler(parser, onStart, onEnd);
     XML_SetCharacterDataHandler(parser, onCharacters);
+    XML_SetStartDoctypeDeclHandler(parser, onDocumentType);
     XML_SetEntityDeclHandler(parser, onEntityDeclaration);
     XML_SetSkippedEntityHandler(parser, onSkippedEntity);
     // References to parameter entities are looked at, so that they end the reading; without a handler for

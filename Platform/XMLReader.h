@@ -16,6 +16,9 @@ namespace platform {
 class XMLEvents {
   public:
     virtual ~XMLEvents() = default;
+    /// The document type, if there is one, before the first element; `hasDeclarations` tells whether it has a
+    /// part inside the document.
+    virtual void documentType(bool /*hasDeclarations*/) {}
     virtual void startElement(std::string_view name) = 0;
     virtual void endElement(std::string_view name) = 0;
     virtual void characters(std::string_view text) = 0;

@@ -1,6 +1,8 @@
 // Digests and identifiers of texts.
 #pragma once
 
+#include <string>
+
 #include "Platform/Crypto.h"
 #include "Values/Value.h"
 
@@ -8,6 +10,9 @@ namespace veltoid {
 
 /// SHA-256 of the UTF-8 text (32 bytes); null for null.
 Data sha256OfString(const String& text);
+
+/// SHA-256 of the bytes as 64 lower-case hexadecimal digits.
+std::string sha256Text(const Data& data);
 
 /// The 16 bytes in canonical order.
 Data uuidBytes(const platform::UUIDBytes& uuid);

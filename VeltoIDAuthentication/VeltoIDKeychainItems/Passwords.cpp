@@ -1,14 +1,11 @@
 #include "VeltoIDKeychainItems/Passwords.h"
 
-#include <algorithm>
-#include <atomic>
-#include <utility>
 #include <vector>
 
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/Keychain.h"
-#include "Values/Digest.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
 
 namespace veltoid {
 namespace {
@@ -19,27 +16,13 @@ using platform::KeychainQuery;
 using platform::KeychainStatus;
 using platform::PersistentReference;
 
-std::atomic<bool> useKeychain{true};
-
-/// Reference and password of each item kept in memory; on the keychain queue only.
-std::vector<std::pair<Data, String>>& memoryItems() {
-    static auto* items = new std::vector<std::pair<Data, String>>;
+keychain_items::MemoryTable<String>& memoryItems() {
+    static auto* items = new keychain_items::MemoryTable<String>;
     return *items;
 }
 
-auto findInMemory(const Data& reference) {
-    auto& items = memoryItems();
-    return std::find_if(items.begin(), items.end(),
-                        [&](const auto& item) { return item.first == reference; });
-}
-
-Data dataOf(const PersistentReference& reference) { return Data(reference); }
-
 KeychainQuery queryForReference(const Data& reference) {
-    KeychainQuery query;
-    const auto bytes = reference.bytes();
-    query.itemList = {{PersistentReference(bytes.begin(), bytes.end())}};
-    return query;
+    return keychain_items::queryForReference(platform::KeychainItemClass::GenericPassword, reference);
 }
 
 KeychainQuery queryForAccount(const String& accountName) {
@@ -62,10 +45,6 @@ platform::SecretBytes secretBytes(const String& passwordHash) {
     return {bytes.begin(), bytes.end()};
 }
 
-std::string describeItemQuery(const Data& reference) {
-    return describeValue(Dictionary{{"class", "genp"}, {"itemList", Array{reference}}});
-}
-
 /// Changes the item's password in place; an item that was bound to this device may move with its backup from
 /// then on.
 bool updateItem(const Data& reference, const String& passwordHash) {
@@ -76,7 +55,8 @@ bool updateItem(const Data& reference, const String& passwordHash) {
         queryForReference(reference), {secretBytes(passwordHash), Accessibility::AfterFirstUnlock, {}, {}});
     if (status == platform::kKeychainSuccess) return true;
     VELTOID_LOG_FROM("addPasswordToKeychain", kNotice,
-                     "SetItemUpdate(" << describeItemQuery(reference) << ", attrs=(supressed) err=" << status
+                     "SetItemUpdate(" << keychain_items::describeItemQuery("genp", reference)
+                                      << ", attrs=(supressed) err=" << status
                                       << " so deleting and re-adding item.");
     return false;
 }
@@ -91,7 +71,7 @@ KeychainStatus addItem(const KeychainAttributes& attributes, const String& passw
     if (status == platform::kKeychainDuplicateItem &&
         platform::keychain::remove({attributes, {}}) == platform::kKeychainSuccess)
         status = platform::keychain::add(attributes, accessibility, data, &added);
-    if (status == platform::kKeychainSuccess) *reference = dataOf(added);
+    if (status == platform::kKeychainSuccess) *reference = keychain_items::dataOf(added);
     return status;
 }
 
@@ -100,7 +80,7 @@ bool addOrUpdate(const String& accountName, const String& passwordHash, const St
     std::vector<PersistentReference> found;
     KeychainStatus status = platform::keychain::copyMatchingReferences(queryForAccount(accountName), &found);
     if (status == platform::kKeychainSuccess && !found.empty()) {
-        *reference = dataOf(found.front());
+        *reference = keychain_items::dataOf(found.front());
         if (updateItem(*reference, passwordHash)) return true;
         *reference = {};
         platform::keychain::remove(queryForAccount(accountName));
@@ -114,42 +94,30 @@ bool addOrUpdate(const String& accountName, const String& passwordHash, const St
     return false;
 }
 
-bool addToMemory(const String& passwordHash, Data* reference) {
-    *reference = uuidBytes(platform::randomUUID());
-    memoryItems().emplace_back(*reference, passwordHash);
-    return true;
-}
-
 }  // namespace
-
-void setUseSystemKeychain(bool use) { useKeychain = use; }
-bool usesSystemKeychain() { return useKeychain; }
-
-platform::WorkQueue keychainQueue() {
-    static const auto* queue = new platform::WorkQueue("KeychainDispatchQueue");
-    return *queue;
-}
 
 bool addPasswordToKeychain(const String& accountName, const String& passwordHash, const String& label,
                            Data* persistentReference) {
     if (!accountName || !passwordHash) return false;
     return keychainQueue().sync([&] {
         Data reference;
-        const bool added = useKeychain ? addOrUpdate(accountName, passwordHash, label, &reference)
-                                       : addToMemory(passwordHash, &reference);
-        if (added && persistentReference != nullptr) *persistentReference = reference;
-        return added;
+        if (!usesSystemKeychain()) {
+            reference = memoryItems().add(passwordHash);
+        } else if (!addOrUpdate(accountName, passwordHash, label, &reference)) {
+            return false;
+        }
+        if (persistentReference != nullptr) *persistentReference = reference;
+        return true;
     });
 }
 
 bool copyPasswordFromKeychainGivenPersistentRef(const Data& persistentReference, String* passwordHash) {
     if (!persistentReference) return false;
     return keychainQueue().sync([&] {
-        if (!useKeychain) {
-            const auto item = findInMemory(persistentReference);
-            if (item == memoryItems().end()) return false;
-            if (passwordHash != nullptr) *passwordHash = item->second;
-            return true;
+        if (!usesSystemKeychain()) {
+            const String* found = memoryItems().find(persistentReference);
+            if (found != nullptr && passwordHash != nullptr) *passwordHash = *found;
+            return found != nullptr;
         }
         platform::SecretBytes data;
         const KeychainStatus status =
@@ -168,12 +136,7 @@ bool copyPasswordFromKeychainGivenPersistentRef(const Data& persistentReference,
 bool removePasswordFromKeychainGivenPersistentRef(const Data& persistentReference) {
     if (!persistentReference) return false;
     return keychainQueue().sync([&] {
-        if (!useKeychain) {
-            const auto item = findInMemory(persistentReference);
-            if (item == memoryItems().end()) return false;
-            memoryItems().erase(item);
-            return true;
-        }
+        if (!usesSystemKeychain()) return memoryItems().remove(persistentReference);
         const KeychainStatus status = platform::keychain::remove(queryForReference(persistentReference));
         if (status == platform::kKeychainSuccess) return true;
         VELTOID_LOG_FROM("removePasswordFromKeychainGivenPersistentRef", kError,

@@ -10,6 +10,7 @@
 #include "Platform/FakeSystemLog.h"
 #include "Platform/Keychain.h"
 #include "Platform/TemporaryStateDirectory.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
 
 namespace veltoid {
 namespace {

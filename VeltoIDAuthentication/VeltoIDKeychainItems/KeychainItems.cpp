@@ -1,0 +1,54 @@
+#include "VeltoIDKeychainItems/KeychainItems.h"
+
+#include <atomic>
+
+#include "Logging/Describe.h"
+
+namespace veltoid {
+
+namespace {
+
+std::atomic<bool> useKeychain{true};
+
+}  // namespace
+
+void setUseSystemKeychain(bool use) { useKeychain = use; }
+bool usesSystemKeychain() { return useKeychain; }
+
+platform::WorkQueue keychainQueue() {
+    static const auto* queue = new platform::WorkQueue("KeychainDispatchQueue");
+    return *queue;
+}
+
+namespace keychain_items {
+
+platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass, const Data& reference) {
+    platform::KeychainQuery query;
+    query.attributes.itemClass = itemClass;
+    const auto bytes = reference.bytes();
+    query.itemList = {{platform::PersistentReference(bytes.begin(), bytes.end())}};
+    return query;
+}
+
+std::string describeItemQuery(std::string_view itemClass, const Data& reference) {
+    return describeValue(Dictionary{{"class", itemClass}, {"itemList", Array{reference}}});
+}
+
+Data copyReference(const platform::KeychainAttributes& attributes, platform::KeychainStatus* status) {
+    std::vector<platform::PersistentReference> found;
+    const auto result = platform::keychain::copyMatchingReferences({attributes, {}}, &found);
+    if (status != nullptr) *status = result;
+    return result == platform::kKeychainSuccess ? dataOf(found.front()) : Data();
+}
+
+std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes) {
+    std::vector<platform::PersistentReference> found;
+    if (platform::keychain::copyMatchingReferences({attributes, {}}, &found) != platform::kKeychainSuccess)
+        return std::nullopt;
+    Array references;
+    for (const auto& reference : found) references.append(dataOf(reference));
+    return references;
+}
+
+}  // namespace keychain_items
+}  // namespace veltoid

@@ -1,0 +1,71 @@
+// What passwords, keys and certificates in the keychain have in common: the queue on which every operation on
+// them runs, and the substitute in memory.
+//
+// KeychainDispatchQueue never calls back into the database. Without the system keychain, passwords and keys
+// live in in-memory tables under random 16-byte references and are gone at exit.
+#pragma once
+
+#include <utility>
+#include <vector>
+
+#include "Platform/Keychain.h"
+#include "Platform/WorkQueue.h"
+#include "Values/Digest.h"
+#include "Values/Value.h"
+
+namespace veltoid {
+
+/// Access group of keys and certificates.
+inline constexpr const char* kKeychainAccessGroup =
+    "com.velto.harbwell.veltoidauthentication.keychainaccessgroup";
+
+/// Whether items go to the keychain (the default) or into memory. Called once, at start. Any thread.
+void setUseSystemKeychain(bool use);
+bool usesSystemKeychain();
+
+/// The queue of all keychain operations.
+platform::WorkQueue keychainQueue();
+
+/// For the rooms' own sources: their callers use the operations of the other headers.
+namespace keychain_items {
+
+inline Data dataOf(const platform::PersistentReference& reference) { return Data(reference); }
+
+/// The item of that class and reference.
+platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass, const Data& reference);
+
+/// The item list of the query that names one item, as a log line shows it.
+std::string describeItemQuery(std::string_view itemClass, const Data& reference);
+
+/// The reference of the first item that matches; null, with the status, when there is none.
+Data copyReference(const platform::KeychainAttributes& attributes,
+                   platform::KeychainStatus* status = nullptr);
+
+/// The references of all items that match; none when there are none.
+std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes);
+
+/// Items kept in memory instead, by reference. On the keychain queue only.
+template <typename Item>
+class MemoryTable {
+  public:
+    Data add(const Item& item) {
+        items_.emplace_back(uuidBytes(platform::randomUUID()), item);
+        return items_.back().first;
+    }
+    /// Null when there is none.
+    const Item* find(const Data& reference) const {
+        for (const auto& [known, item] : items_)
+            if (known == reference) return &item;
+        return nullptr;
+    }
+    bool remove(const Data& reference) {
+        return std::erase_if(items_, [&](const auto& item) { return item.first == reference; }) > 0;
+    }
+    const std::vector<std::pair<Data, Item>>& items() const { return items_; }
+
+  private:
+    std::vector<std::pair<Data, Item>> items_;
+};
+
+}  // namespace keychain_items
+}  // namespace veltoid
