@@ -9,9 +9,12 @@ status 0 unless something could not be run: a result over its limit is for the r
 from __future__ import annotations
 
 import argparse
+import datetime
 import json
 import os
 import pathlib
+import plistlib
+import random
 import shutil
 import statistics
 import subprocess
@@ -36,6 +39,10 @@ CLIENTS = 8
 
 # Ways to get a mount namespace of one's own, the first that is permitted.
 NAMESPACES = (("unshare", "--user", "--map-root-user", "--mount"), ("unshare", "--mount"))
+
+RECORDS = 4500  # of the property list: about 4 MB in the XML form
+READINGS = 3  # of each list, each time that the program is started
+MANY_PEOPLE, FEW_PEOPLE = 100_000, 10
 
 # After the last request the agent still writes its database (3 s) and ends the threads that it no longer needs (10 s).
 SETTLING_SECONDS = 15
@@ -163,6 +170,61 @@ def text_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
         yield timing(f"base64 {what}, 1 MB", base64[function], base64[reference], 1, " OpenSSL")
 
 
+def generated_list() -> dict:
+    """Records of the kind that the agent keeps."""
+    rng = random.Random(7)
+
+    def text(length: int) -> str:
+        return "".join(rng.choices("abcdefghijklmnopqrstuvwxyz0123456789 ", k=length))
+
+    def record() -> dict:
+        return {"VeltoID": f"{text(9)}@example.com", "FirstName": text(7), "LastName": "Zo\xeb " + text(6),
+                "encDsId": str(rng.randrange(10**9)), "AllEmails": [f"{text(12)}@example.com" for _ in range(3)],
+                "Count": rng.randrange(10**6), "Interval": rng.uniform(0, 1e6), "Valid": True, "Dirty": False,
+                "CreationDate": datetime.datetime(2014, 3, 5) + datetime.timedelta(seconds=rng.randrange(10**8)),
+                "Reference": rng.randbytes(20),
+                "Certificate": {"CertStatus": "CERT_ISSUED", "SerialNumber": rng.randrange(2**60)}}
+
+    return {f"account-{number}": record() for number in range(RECORDS)}
+
+
+def property_list_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
+    """Python's reader builds a value, so both are compared with it: the reading alone, which the limit is for, and with
+    the building of a value of ours."""
+    forms = {"XML": plistlib.FMT_XML, "binary": plistlib.FMT_BINARY}
+    contents = generated_list()
+    lists = {form: plistlib.dumps(contents, fmt=fmt, sort_keys=False) for form, fmt in forms.items()}
+    references = defaultdict(list)
+    output = ""
+    with tempfile.TemporaryDirectory() as name:
+        paths = {form: pathlib.Path(name) / form for form in forms}
+        for form, path in paths.items():
+            path.write_bytes(lists[form])
+        for _ in range(effort.runs):
+            for form, data in lists.items():
+                start = time.perf_counter()
+                plistlib.loads(data)
+                references[form].append((time.perf_counter() - start) * 1e6)
+            output += programs.run("PropertyList_bench", READINGS, *paths.values())
+    result = medians(output)
+    for form, path in paths.items():
+        size, reference = len(lists[form]), statistics.median(references[form])
+        for what, kind, limit in (("read", "events", 20), ("read and build", "values", None)):
+            ours = result[f"{path}:{kind}"]
+            yield Row(f"{what} a property list, {form}, {size / 1e6:.1f} MB", f"{size / ours:.0f} MB/s",
+                      f"{size / reference:.1f} MB/s plistlib", reference / ours, limit, at_least=True)
+
+
+def find_person_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
+    # Few and many in turn; a process has one cache.
+    output = "".join(programs.run("FindPersonCache_bench", 1, entries)
+                     for _ in range(effort.runs) for entries in (FEW_PEOPLE, MANY_PEOPLE))
+    result = medians(output)
+    many, few = result[str(MANY_PEOPLE)], result[str(FEW_PEOPLE)]
+    yield Row(f"find a person among {MANY_PEOPLE:,}", f"{many * 1000:.0f} ns",
+              f"{few * 1000:.0f} ns among {FEW_PEOPLE}", many / few, 2)
+
+
 # --- Over TLS
 
 def store_with(authority: str, folder: pathlib.Path) -> pathlib.Path:
@@ -287,7 +349,9 @@ def main() -> int:
     rest.start()
     rows = []
     failures = []
-    for what, measure in (("the bus", bus_rows), ("texts", text_rows), ("TLS", tls_rows)):
+    for what, measure in (("the bus", bus_rows), ("texts", text_rows),
+                          ("property lists", property_list_rows), ("the find-person cache", find_person_rows),
+                          ("TLS", tls_rows)):
         print(f"bench: {what}", flush=True)
         try:
             rows += measure(programs, effort)

@@ -14,11 +14,15 @@
 #include "VeltoIDAuthd/Request.h"
 #include "VeltoIDAuthenticationDB/Accounts.h"
 #include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
+#include "VeltoIDAuthenticationImpl/CertificateInformation.h"
+#include "VeltoIDAuthenticationImpl/FindPerson.h"
 
 namespace veltoid {
 namespace {
@@ -91,6 +95,30 @@ Outcome getMyInfo(Request& request) {
     return outcome;
 }
 
+Dictionary criteriaOf(const Request& request) {
+    const Value criteria = request.value("criteria");
+    const Dictionary* dictionary = criteria.asDictionary();
+    return dictionary != nullptr ? *dictionary : Dictionary();
+}
+
+Outcome findPerson(Request& request) {
+    Outcome outcome;
+    std::optional<Array> results;
+    outcome.success = __VeltoIDDoFindPerson(request.account(), request.string("hashedpassword"),
+                                            criteriaOf(request), request.options(), &results, &outcome.error);
+    countFor(request.account(), request, kVeltoIDFindCountKey);
+    if (outcome.success && results) request.answer("result", *results);
+    return outcome;
+}
+
+Outcome findCachedPerson(Request& request) {
+    const auto results = __VeltoIDDBCopyCachedFindPersonResults(criteriaOf(request));
+    countFor(request.account(), request, kVeltoIDFindCachedCountKey);
+    if (!results || results->empty()) return {};
+    request.answer("result", *results);
+    return {true, {}};
+}
+
 Outcome listAccounts(Request& request) {
     Outcome outcome;
     Array names;
@@ -112,6 +140,47 @@ Outcome forgetAccount(Request& request) {
         }
     }
     countFor(nullptr, request, kVeltoIDForgetVeltoIDCountKey);
+    return outcome;
+}
+
+/// The signed record that vouches for the account's validated items.
+Outcome copyValidationRecord(Request& request) {
+    Dictionary record;
+    if (!__VeltoIDDBCopyVeltoIDAccount(request.account(), &record)) return {};
+    Dictionary result;
+    for (const std::string_view key :
+         {kVeltoIDAccountValidationRecordDataKey, kVeltoIDAccountValidationRecordValidAsOfKey})
+        result.set(key, record[key]);
+    request.answer("result", result);
+    return {true, {}};
+}
+
+Outcome copyCertificateInformation(Request& request) {
+    if (request.string("CertificateType") == "VeltoIDValidatedItemsRecordDataCertificateType")
+        return copyValidationRecord(request);
+    Outcome outcome;
+    Dictionary result;
+    outcome.success = __VeltoIDCopyCertificateInfo(request.account(), request.string("encDsId"),
+                                                   request.options(), &result, &outcome.error);
+    if (outcome.success) request.answer("result", result);
+    return outcome;
+}
+
+Outcome setBreadcrumb(Request& request) {
+    Outcome outcome;
+    outcome.success = __VeltoIDDoSetBreadcrumb(request.account(), request.string("hashedpassword"),
+                                               request.string("identifier"), request.data("breadcrumb"),
+                                               request.options(), &outcome.error);
+    return outcome;
+}
+
+Outcome copyBreadcrumb(Request& request) {
+    Outcome outcome;
+    const Data breadcrumb =
+        __VeltoIDDoCopyBreadcrumb(request.account(), request.string("hashedpassword"),
+                                  request.string("identifier"), request.options(), &outcome.error);
+    outcome.success = static_cast<bool>(breadcrumb);
+    if (outcome.success) request.answer("breadcrumb", breadcrumb);
     return outcome;
 }
 
@@ -155,9 +224,21 @@ struct Command {
 constexpr int64_t kTerminateCommand = 0x9999;
 
 constexpr Command kCommands[] = {
-    {kVeltoIDPingCommand, ping}, {0xFE, setValueOrFail}, {0xFF, setValueIfPossible}, {0x120, addAccount},
-    {0x130, getMyInfo},          {0x150, listAccounts},  {0x160, forgetAccount},     {0x180, verifyPassword},
-    {0x500, copyAllContents},    {0x510, status},
+    {kVeltoIDPingCommand, ping},
+    {0xFE, setValueOrFail},
+    {0xFF, setValueIfPossible},
+    {0x120, addAccount},
+    {0x130, getMyInfo},
+    {0x140, findPerson},
+    {0x141, findCachedPerson},
+    {0x150, listAccounts},
+    {0x160, forgetAccount},
+    {0x170, copyCertificateInformation},
+    {0x180, verifyPassword},
+    {0x200, setBreadcrumb},
+    {0x201, copyBreadcrumb},
+    {0x500, copyAllContents},
+    {0x510, status},
 };
 
 Outcome dispatch(Request& request) {

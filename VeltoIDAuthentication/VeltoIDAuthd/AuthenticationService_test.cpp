@@ -7,6 +7,7 @@
 #include "VeltoIDAuthd/AccountStatus.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDKeychainItems/Passwords.h"
 #include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
 
@@ -147,6 +148,50 @@ TEST_F(ServiceTest, SetsDatabaseValues) {
     send(0xFE, {{"domain", "Accounts"}, {"item", kName}, {"key", "k"}, {"value", "v"}, {"options", quietly}});
     EXPECT_EQ(record()["k"], Value("v"));
     EXPECT_EQ(takeSignals(), 0);
+}
+
+TEST_F(ServiceTest, AnswersFromWhatIsStored) {
+    constexpr const char* kRecordType = "VeltoIDValidatedItemsRecordDataCertificateType";
+    constexpr const char* kRecord = "VeltoIDAccountValidationRecordData";
+    constexpr const char* kAsOf = "VeltoIDAccountValidationRecordValidAsOfKey";
+    const Value data = Data(std::vector<uint8_t>{1, 2});
+    const Dictionary criteria = {{"email", Array{"a"}}};
+    const Dictionary person = {{"matched", "email"}, {"value", "a"}};
+    EXPECT_EQ(send(0x141, {{"criteria", criteria}}), kFailure);
+    __VeltoIDDBAddFindPersonResultsToCache(Array{person});
+    const Dictionary found = send(0x141, {{"criteria", criteria}});
+    EXPECT_EQ((*found.array("result"))[0].asDictionary()->string("value"), "a");
+    EXPECT_EQ(send(0x141, {{"criteria", "email"}}), kFailure);
+
+    const Dictionary recordRequest = {{"VeltoID", kName}, {"CertificateType", kRecordType}};
+    const Dictionary certificateRequest = {{"VeltoID", kName}};
+    EXPECT_EQ(send(0x170, recordRequest), kFailure);
+    EXPECT_EQ(errorCode(send(0x170, certificateRequest)), -1);
+    createAccount("d1");
+    EXPECT_EQ(send(0x170, recordRequest), (Dictionary{{"success", kOn}, {"result", Dictionary()}}));
+    setValues({{kRecord, data}, {kAsOf, date()}});
+    EXPECT_EQ(send(0x170, recordRequest)["result"], Value(Dictionary{{kRecord, data}, {kAsOf, date()}}));
+    EXPECT_EQ(errorCode(send(0x170, certificateRequest)), -100) << "no certificate";
+    __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
+    for (const Dictionary& request : {certificateRequest, Dictionary{{"encDsId", "d1"}}}) {
+        const Dictionary reply = send(0x170, request);
+        ASSERT_TRUE(reply["result"].isDictionary());
+        EXPECT_EQ(reply.dictionary("result")->string("SerialNumber"), "7");
+    }
+}
+
+TEST_F(ServiceTest, WhatNeedsTheServerFailsWithoutOne) {
+    createAccount("d1");
+    const Dictionary request = {{"VeltoID", kName},
+                                {"hashedpassword", kPassword},
+                                {"identifier", "k"},
+                                {"criteria", Dictionary()},
+                                {"breadcrumb", Data(std::vector<uint8_t>{1})}};
+    for (const int64_t command : {0x140, 0x200, 0x201})
+        EXPECT_EQ(errorCode(send(command, request)), -100) << command;
+    EXPECT_EQ(server_.takeMethods(),
+              "authenticate findPerson authenticate saveBreadcrumbEk authenticate fetchBreadcrumbEk");
+    EXPECT_EQ(count("VeltoIDFindCount"), 1);
 }
 
 // --- Status

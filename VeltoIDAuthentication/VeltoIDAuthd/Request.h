@@ -28,6 +28,7 @@ class Request {
     String string(std::string_view key) const {
         return request_.copyValue(key, Value::Kind::String).asString();
     }
+    Data data(std::string_view key) const { return request_.copyValue(key, Value::Kind::Data).asData(); }
     Value value(std::string_view key) const { return request_.copyValue(key); }
 
     /// Adds an entry to the reply; an absent value adds nothing.

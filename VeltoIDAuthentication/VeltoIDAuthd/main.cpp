@@ -18,10 +18,11 @@
 #include "VeltoIDAuthd/Listeners.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
-#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 
 namespace veltoid {
@@ -75,6 +76,7 @@ void handleSignals() {
 void prepareDatabase(const CommandLine& line) {
     if (line.preferencesDomainName) __VeltoIDDBSetPreferencesDomainName(*line.preferencesDomainName);
     __VeltoIDDBSetUsePreferences(line.usePreferences);
+    __VeltoIDDBSetFindPersonCacheUsePreferences(line.usePreferences);
     setUseSystemKeychain(line.usePreferences);
     for (const auto& [key, value] : line.metaInfoValues)
         __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));

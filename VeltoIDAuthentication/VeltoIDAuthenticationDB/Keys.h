@@ -34,6 +34,16 @@ inline constexpr std::string_view kVeltoIDAccountLastValidationDateKey = "Valida
 inline constexpr std::string_view kVeltoIDAccountNextValidationDateKey = "NextValidationDate";
 inline constexpr std::string_view kVeltoIDAccountForceValidationKey = "ForceValidation";
 inline constexpr std::string_view kVeltoIDAccountCertificateTokenKey = "CertificateToken";
+inline constexpr std::string_view kVeltoIDAccountCertificateTokenExpirationKey = "CertificateTokenExpiration";
+inline constexpr std::string_view kVeltoIDAccountCSRGenerationDateKey = "CSRGenerationDate";
+/// Seconds.
+inline constexpr std::string_view kVeltoIDAccountCSRGenerationIntervalKey = "CSRGenerationInterval";
+inline constexpr std::string_view kVeltoIDAccountCSRCreationDateKey = "CSRCreationDate";
+inline constexpr std::string_view kVeltoIDAccountCertificateNextCertificateFetchDateKey =
+    "NextCertificateFetchDate";
+/// Seconds.
+inline constexpr std::string_view kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey =
+    "NextCertificateFetchDelta";
 inline constexpr std::string_view kVeltoIDAccountEarliestAllowedConnectionDateKey =
     "EarliestAllowedConnectionDate";
 inline constexpr std::string_view kVeltoIDAccountClientTooOldKey = "ClientTooOld";
@@ -45,6 +55,11 @@ inline constexpr std::string_view kVeltoIDAccountValidationRecordDataKey =
     "VeltoIDAccountValidationRecordData";
 inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckDateKey =
     "VeltoIDAccountValidationRecordNextCheckDateKey";
+inline constexpr std::string_view kVeltoIDAccountValidationRecordValidAsOfKey =
+    "VeltoIDAccountValidationRecordValidAsOfKey";
+/// Seconds.
+inline constexpr std::string_view kVeltoIDAccountValidationRecordSuggestedValidIntervalKey =
+    "VeltoIDAccountValidationRecordSuggestedValidIntervalKey";
 inline constexpr std::string_view kVeltoIDAccountUUIDKey = "AccountUUID";
 inline constexpr std::string_view kVeltoIDAccountStableUUIDKey = "AccountStableUUID";
 inline constexpr std::string_view kVeltoIDAccountServerURLKey = "ServerURL";
@@ -55,13 +70,18 @@ inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentRefere
     "CertificateReference";
 inline constexpr std::string_view kVeltoIDCertificatePrivateKeyPersistentReferenceKey =
     "CertificatePrivateKeyReference";
+inline constexpr std::string_view kVeltoIDCertificateIntermediateCertificateReferenceKey =
+    "IntermediateCertificateReference";
+inline constexpr std::string_view kVeltoIDCertificateNextRenewalAttemptDateKey = "NextRenewalAttempt";
 inline constexpr std::string_view kVeltoIDCertificateStatusKey = "CertStatus";
 inline constexpr std::string_view kVeltoIDCertificateExpirationDateKey = "Expires";
 inline constexpr std::string_view kVeltoIDCertificateSerialNumberKey = "SerialNumber";
 inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey =
     "LastSuccessfulValidation";
 
-/// Statuses that the certificate's validity depends on.
+/// Statuses of certificates, and of requests for one.
+inline constexpr std::string_view kVeltoIDCertificateStatusPending = "SIGNIN_PENDING";
+inline constexpr std::string_view kVeltoIDCertificateStatusFailed = "FAILED";
 inline constexpr std::string_view kVeltoIDCertificateStatusIssued = "CERT_ISSUED";
 inline constexpr std::string_view kVeltoIDCertificateStatusInvalid = "CERTIFICATE_INVALID";
 
@@ -88,6 +108,12 @@ inline constexpr std::string_view kVeltoIDMetaUnsuccessfulConnectionCountKey =
 inline constexpr std::string_view kVeltoIDXMLAuthenticateCountKey = "VeltoIDXMLAuthenticateCount";
 inline constexpr std::string_view kVeltoIDXMLSessionReusedCountKey = "VeltoIDXMLSessionReusedCount";
 inline constexpr std::string_view kVeltoIDXMLGetMyInfoCountKey = "VeltoIDXMLGetMyInfoCount";
+inline constexpr std::string_view kVeltoIDXMLFindPersonCountKey = "VeltoIDXMLFindPersonCount";
+inline constexpr std::string_view kVeltoIDXMLSendCSRCountKey = "VeltoIDXMLSendCSRCount";
+inline constexpr std::string_view kVeltoIDXMLCompleteCertCountKey = "VeltoIDXMLCompleteCertCount";
+inline constexpr std::string_view kVeltoIDXMLFetchCertCountKey = "VeltoIDXMLFetchCertCount";
+inline constexpr std::string_view kVeltoIDFindCountKey = "VeltoIDFindCount";
+inline constexpr std::string_view kVeltoIDFindCachedCountKey = "VeltoIDFindCachedCount";
 inline constexpr std::string_view kVeltoIDAddVeltoIDCountKey = "VeltoIDAddVeltoIDCount";
 inline constexpr std::string_view kVeltoIDForgetVeltoIDCountKey = "VeltoIDForgetVeltoIDCount";
 inline constexpr std::string_view kVeltoIDGetMyInfoCountKey = "VeltoIDGetMyInfoCount";

@@ -1,11 +1,14 @@
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 
 #include <algorithm>
+#include <cmath>
 
+#include "Certificates/ValidationRecord.h"
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/Clock.h"
 #include "Platform/Notifications.h"
+#include "Values/DateText.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/Accounts.h"
 #include "VeltoIDAuthenticationDB/Certificates.h"
@@ -19,7 +22,15 @@
 namespace veltoid {
 namespace {
 
+/// Share of a validation record's suggested duration after which it is looked at again.
+constexpr double kRecordCheckShare = 0.75;
+
 double now() { return platform::Clock::shared().now(); }
+
+std::optional<double> finiteNumber(const Dictionary& dictionary, std::string_view key) {
+    const auto number = dictionary.number(key);
+    return number && std::isfinite(*number) ? number : std::nullopt;
+}
 
 /// One request for an account's information.
 class InformationRequest {
@@ -173,17 +184,41 @@ bool bothPresentAndDifferent(const Value& before, const Value& after) {
     return !before.isAbsent() && !after.isAbsent() && before != after;
 }
 
-/// Record data is kept only with an identifier and a date at which it is looked at again; otherwise the
-/// stored one goes. True when the account has another record than before.
+/// What the signed record says of itself goes into the values; the date at which to look at it again, if it
+/// tells one.
+std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values) {
+    const Data content = verifyValidationRecord(signedRecord);
+    const auto payload = content ? parseValidationRecordPayload(content) : std::nullopt;
+    if (!payload) return std::nullopt;
+    const auto validAsOf = dateFromValue((*payload)["ValidAsOf"]);
+    const auto duration = finiteNumber(*payload, "SuggestValidDuration");
+    values.set(kVeltoIDAccountValidationRecordValidAsOfKey, validAsOf ? Value::date(*validAsOf) : Value());
+    values.set(kVeltoIDAccountValidationRecordSuggestedValidIntervalKey,
+               duration ? Value::real(*duration) : Value());
+    if (!validAsOf) return std::nullopt;
+    return *validAsOf + kRecordCheckShare * duration.value_or(0);
+}
+
+/// Record data is kept only with an identifier and a date at which it is looked at again, from the server or
+/// from the record itself; otherwise the stored one goes. True when the account has another record than
+/// before.
 bool applyValidationRecord(const Dictionary& before, const Dictionary& answer, Dictionary& values) {
-    constexpr std::string_view kRecordKeys[] = {kVeltoIDAccountValidationRecordIdentifierKey,
-                                                kVeltoIDAccountValidationRecordDataKey,
-                                                kVeltoIDAccountValidationRecordNextCheckDateKey};
     const String identifier = answer.string(kVeltoIDAccountValidationRecordIdentifierKey);
-    const bool complete = identifier && answer.data(kVeltoIDAccountValidationRecordDataKey) &&
-                          answer.date(kVeltoIDAccountValidationRecordNextCheckDateKey);
-    if (!complete)
-        for (const std::string_view key : kRecordKeys) values.set(key, Value::null());
+    const Data data = answer.data(kVeltoIDAccountValidationRecordDataKey);
+    auto nextCheck = answer.date(kVeltoIDAccountValidationRecordNextCheckDateKey);
+    for (const std::string_view key :
+         {kVeltoIDAccountValidationRecordIdentifierKey, kVeltoIDAccountValidationRecordDataKey,
+          kVeltoIDAccountValidationRecordNextCheckDateKey})
+        values.set(key, Value::null());
+    if (identifier && data) {
+        const auto suggested = applyPayload(data, values);
+        if (!nextCheck) nextCheck = suggested;
+        if (nextCheck) {
+            values.set(kVeltoIDAccountValidationRecordIdentifierKey, identifier);
+            values.set(kVeltoIDAccountValidationRecordDataKey, data);
+            values.set(kVeltoIDAccountValidationRecordNextCheckDateKey, Value::date(*nextCheck));
+        }
+    }
     return bothPresentAndDifferent(before.string(kVeltoIDAccountValidationRecordIdentifierKey), identifier);
 }
 

@@ -8,6 +8,8 @@
 #include "VeltoIDAuthenticationDB/Certificates.h"
 #include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
+#include "VeltoIDAuthenticationImpl/Cleanup.h"
 #include "VeltoIDAuthenticationImpl/NotificationNames.h"
 #include "VeltoIDKeychainItems/Passwords.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
@@ -26,12 +28,11 @@ bool isAlreadyOnItsWay(const String& accountName, const Dictionary& options) {
 
 /// Signs in and fetches the account's information; null, with the error, when the sign-in failed.
 Session signIn(const String& accountName, const String& hashedPassword, const Dictionary& options,
-               ErrorOut error) {
-    String encDsId;
+               String* encDsId, ErrorOut error) {
     Session session =
-        __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, &encDsId, nullptr, error);
+        __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, encDsId, nullptr, error);
     if (!session) return nullptr;
-    if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId, true);
+    if (*encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, *encDsId, true);
     if (!getBool(&options, "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", false)) {
         const Dictionary fetchOptions =
             copyDictionarySettingValue(options, "ForceValidationRecordFetch", Value::boolean(true));
@@ -40,15 +41,25 @@ Session signIn(const String& accountName, const String& hashedPassword, const Di
     return session;
 }
 
+/// Whether the add itself asks for a certificate instead of leaving that to the account check.
+bool createsRequest(const String& encDsId, const Dictionary& options) {
+    if (!encDsId || getBool(&options, "DoNotCreateCSR", false) ||
+        getBool(&options, "CreateCSRAsynchronously", true))
+        return false;
+    return getBool(&options, "ForceCertificateCreation", false) || !hasValidCertificateEntry(encDsId);
+}
+
 struct AddOutcome {
     std::optional<Dictionary> record;
+    /// As far as the server has told it.
+    String encDsId;
     bool succeeded = false;
 };
 
 AddOutcome copyOutcome(const String& accountName, ErrorOut error) {
     Dictionary record;
     if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return {};
-    return {record, true};
+    return {record, record.string(kVeltoIDAccountDSIDKey), true};
 }
 
 AddOutcome readd(const String& accountName) {
@@ -64,11 +75,19 @@ AddOutcome readd(const String& accountName) {
 
 AddOutcome addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options) {
     std::optional<Error> held;
+    String encDsId;
     Session session;
-    AddOutcome outcome;
-    const bool checksPassword = !getBool(&options, "DoNotCheckPassword", false);
-    if (checksPassword) session = signIn(accountName, hashedPassword, options, &held);
-    if (session || !checksPassword) outcome = copyOutcome(accountName, &held);
+    bool proceeds = getBool(&options, "DoNotCheckPassword", false);
+    if (!proceeds) {
+        session = signIn(accountName, hashedPassword, options, &encDsId, &held);
+        proceeds = session != nullptr;
+    }
+    if (proceeds && createsRequest(encDsId, options)) {
+        encDsId = nullptr;
+        proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held);
+    }
+    AddOutcome outcome{{}, encDsId, false};
+    if (proceeds) outcome = copyOutcome(accountName, &held);
     VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
                      "VeltoIDAuth: Adding account " << accountName.view() << " "
                                                     << (outcome.succeeded ? "succeeded." : "failed, ")
@@ -77,10 +96,20 @@ AddOutcome addAnew(const String& accountName, const String& hashedPassword, cons
     return outcome;
 }
 
-/// The certificate entry goes unless another account has the same encDsId.
-void forgetCertificate(const String& encDsId) {
-    if (!encDsId || __VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr)) return;
-    __VeltoIDDBRemoveCertificateInfo(encDsId);
+/// The record with its password item, and the certificate unless another account has the same encDsId.
+void forget(const String& accountName, const Dictionary& record, const DroppedItems& dropped) {
+    const CustodyLock custody;
+    cleanUpAccountsAndCertificates(custody);
+    // The pending request's key has no certificate that anybody could still want it for.
+    discardPendingKey(custody, accountName);
+    __VeltoIDDBRemoveVeltoIDAccount(accountName);
+    const String encDsId = record.string(kVeltoIDAccountDSIDKey);
+    if (!encDsId || !__VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr)) {
+        discardCertificate(custody, encDsId, dropped);
+        discardStrayItems(custody, accountName, dropped);
+    }
+    if (const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+        removePasswordFromKeychainGivenPersistentRef(reference);
 }
 
 }  // namespace
@@ -95,21 +124,20 @@ bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPasswo
                                    ? readd(accountName)
                                    : addAnew(accountName, hashedPassword, options);
     platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
-    if (encDsId != nullptr && outcome.record) *encDsId = outcome.record->string(kVeltoIDAccountDSIDKey);
+    if (encDsId != nullptr) *encDsId = outcome.encDsId;
     if (accountRecord != nullptr) *accountRecord = outcome.record;
     return true;
 }
 
-bool __VeltoIDForgetVeltoID(const String& accountName, const Dictionary& /*options*/, ErrorOut error) {
+bool __VeltoIDForgetVeltoID(const String& accountName, const Dictionary& options, ErrorOut error) {
     if (accountName) {
         VELTOID_LOG(kNotice, "VeltoIDAuth: Forgetting account " << accountName.view() << ".");
         auto& notifications = platform::Notifications::shared();
         Dictionary record;
         if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) {
-            __VeltoIDDBRemoveVeltoIDAccount(accountName);
-            forgetCertificate(record.string(kVeltoIDAccountDSIDKey));
-            if (const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-                removePasswordFromKeychainGivenPersistentRef(reference);
+            forget(accountName, record,
+                   {getBool(&options, "RemoveCertificateFromKeychain", true),
+                    getBool(&options, "RemovePrivateKeyFromKeychain", true)});
             notifications.post(kVeltoIDAccountAddedOrRemovedNotification);
             notifications.post(kVeltoIDAccountChangeNotification);
             return true;

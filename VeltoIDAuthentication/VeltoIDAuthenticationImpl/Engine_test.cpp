@@ -3,8 +3,11 @@
 #include <functional>
 
 #include "Platform/FakeNotifications.h"
+#include "Tests/Support/TestAuthority.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
+#include "VeltoIDAuthenticationImpl/FindPerson.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
 #include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
@@ -43,6 +46,13 @@ class EngineTest : public ServerTest {
         if (state == Server::NoSignIn) server_.answer("authenticate", Dictionary());
         if (state == Server::NoAnswer) server_.fault("getMyInfo", -5);
         if (state == Server::RefusesPassword) server_.fault("authenticate", -20101);
+    }
+
+    /// An entry that is of use.
+    static void storeCertificateEntry(const char* encDsId) {
+        const Data reference(std::vector<uint8_t>{1});
+        __VeltoIDDBSetCertificateInfo(encDsId, Dictionary{{"CertificateReference", reference}});
+        __VeltoIDDBSetCertificateValue(encDsId, "CertificatePrivateKeyReference", reference, false);
     }
 
     /// What was posted since the last time: "added/removed", "changed".
@@ -154,8 +164,8 @@ TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
 
 TEST_F(EngineTest, ForgettingTakesEverythingAlong) {
     createAccount("d1");
-    __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
-    __VeltoIDDBSetCertificateInfo("other", std::nullopt);
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("other", nullptr, "other"));
+    for (const char* encDsId : {"d1", "other"}) storeCertificateEntry(encDsId);
     const Data reference = record().data("HashedPasswordRef");
     std::optional<Error> error;
     EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}, &error));
@@ -179,7 +189,7 @@ TEST_F(EngineTest, ForgettingTakesEverythingAlong) {
 TEST_F(EngineTest, ForgettingKeepsACertificateThatAnotherAccountShares) {
     createAccount("d1");
     ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", "d1"));
-    __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
+    storeCertificateEntry("d1");
     const Data reference = record().data("HashedPasswordRef");
     EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
     EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
@@ -446,6 +456,103 @@ TEST_F(Information, TheServersWordOnTheCertificateGoesIntoItsEntry) {
                          " dsID=\"d1\"as invalid because the server said CertificateIsValid = false. (false"),
               1);
     updateAccountWithGetMyInfoResult(kName, {{"CertificateIsValid", kOff}});
+}
+
+TEST_F(Information, AValidationRecordIsKeptWithTheDateToLookAtItAgain) {
+    const testing_support::TestAuthority authority;
+    const auto signedRecord = [&](const std::string& entries, bool isGood = true) {
+        auto bytes = authority.sign("<plist><dict>" + entries + "</dict></plist>");
+        if (!isGood) bytes.back() ^= 1;
+        return Data(bytes);
+    };
+    const std::string asOf = "<key>ValidAsOf</key><date>2025-06-15T00:00:00Z</date>";
+    const std::string day = "<key>SuggestValidDuration</key><real>86400</real>";
+    constexpr double kAsOf = 1'749'945'600;
+    const Value none;
+    struct Case {
+        const char* what;
+        Data data;
+        Value given;
+        Value nextCheck;
+        Value validAsOf;
+        Value duration;
+    };
+    const Value validAsOf = Value::date(kAsOf);
+    const Case cases[] = {
+        {"all of it", signedRecord(asOf + day), none, Value::date(kAsOf + 64'800), validAsOf, number(86'400)},
+        {"no duration", signedRecord(asOf), none, validAsOf, validAsOf, none},
+        {"no date", signedRecord(day), none, none, none, number(86'400)},
+        {"a text", signedRecord("<key>ValidAsOf</key><string>2025-06-14 16:00:00 -0800</string>"), none,
+         validAsOf, validAsOf, none},
+        {"no dictionary", Data(authority.sign("<plist><array/></plist>")), none, none, none, none},
+        {"not signed so", signedRecord(asOf + day, false), none, none, none, none},
+        {"no record", Data(std::vector<uint8_t>{1}), none, none, none, none},
+        {"the server's date", signedRecord(asOf + day), date(99), date(99), validAsOf, number(86'400)},
+        {"only the server's", signedRecord(asOf, false), date(99), date(99), none, none},
+        {"no number", signedRecord(asOf + "<key>SuggestValidDuration</key><real>nan</real>"), none, validAsOf,
+         validAsOf, none},
+    };
+    for (const Case& each : cases) {
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        prepare(0);
+        setValues({{kIdentifier, "old"}, {kData, kRecordData}, {kNextCheck, date(7)}});
+        updateAccountWithGetMyInfoResult(
+            kName, {{kIdentifier, "new"}, {kData, each.data}, {kNextCheck, each.given}});
+        EXPECT_EQ(record()[kNextCheck], each.nextCheck) << each.what;
+        EXPECT_EQ(record()[kData], each.nextCheck.isAbsent() ? none : Value(each.data)) << each.what;
+        EXPECT_EQ(record().contains(kIdentifier), !each.nextCheck.isAbsent()) << each.what;
+        EXPECT_EQ(record()["VeltoIDAccountValidationRecordValidAsOfKey"], each.validAsOf) << each.what;
+        EXPECT_EQ(record()["VeltoIDAccountValidationRecordSuggestedValidIntervalKey"], each.duration)
+            << each.what;
+        EXPECT_EQ(takePosted(), "changed ") << each.what;
+    }
+}
+
+// --- People and breadcrumbs
+
+TEST_F(EngineTest, PeopleAreFoundOnBehalfOfAnAccount) {
+    const auto find = [this](const String& name, const String& password) {
+        std::optional<Error> error;
+        std::optional<Array> results;
+        const bool found =
+            __VeltoIDDoFindPerson(name, password, {{"email", Array{"a"}}}, {}, &results, &error);
+        EXPECT_EQ(found, !error);
+        EXPECT_EQ(results, found ? std::optional(Array{"somebody"}) : std::nullopt);
+        return error ? error->code : 0;
+    };
+    server_.answer("findPerson", Dictionary{{"matches", Array{"somebody"}}});
+    EXPECT_EQ(find(nullptr, "any"), -2) << "no account at all";
+    EXPECT_EQ(find("nobody", nullptr), -100);
+    EXPECT_EQ(find("nobody", "any"), 0) << "the server knows better";
+    createAccount("d1");
+    (void)server_.take();
+    EXPECT_EQ(find(nullptr, nullptr), 0);
+    EXPECT_EQ(server_.take().front().parameters["pwdHash"], Value(kPassword));
+    EXPECT_EQ(find(kName, "given"), 0);
+    EXPECT_EQ(server_.take().front().parameters["pwdHash"], Value("given"));
+    serverIs(Server::RefusesPassword);
+    EXPECT_EQ(find(nullptr, nullptr), -101);
+    EXPECT_FALSE(hasPassword());
+}
+
+TEST_F(EngineTest, ABreadcrumbIsStoredAndFetched) {
+    const Data data(platform::bytesOf("ABC"));
+    std::optional<Error> error;
+    server_.answer("saveBreadcrumbEk", Dictionary{{"x", "y"}});
+    server_.answer("fetchBreadcrumbEk", Dictionary{{"ek", "QUJD"}});
+    EXPECT_TRUE(__VeltoIDDoSetBreadcrumb(kName, kPassword, "k", data, {}, &error));
+    EXPECT_EQ(__VeltoIDDoCopyBreadcrumb(kName, kPassword, "k", {}, &error), data);
+    EXPECT_EQ(error, std::nullopt);
+    server_.answer("fetchBreadcrumbEk", Dictionary{{"x", "y"}});
+    EXPECT_FALSE(__VeltoIDDoCopyBreadcrumb(kName, kPassword, "k", {}, &error));
+    EXPECT_EQ(error->code, -100);
+    server_.fault("saveBreadcrumbEk", -20209);
+    EXPECT_FALSE(__VeltoIDDoSetBreadcrumb(kName, kPassword, "k", data, {}, &error));
+    EXPECT_EQ(error->code, -102);
+    (void)server_.take();
+    EXPECT_FALSE(__VeltoIDDoCopyBreadcrumb(kName, nullptr, "k", {}, &error));
+    EXPECT_EQ(error->code, -100);
+    EXPECT_EQ(server_.takeMethods(), "");
 }
 
 // --- Errors of the server, passwords

@@ -2,6 +2,7 @@
 // goes over the wire is real; the connection is not.
 #pragma once
 
+#include <functional>
 #include <map>
 #include <mutex>
 #include <string>
@@ -33,8 +34,13 @@ class FakeIdentityServer {
     }
 
     // What every call of the method gets from now on. Unset methods get a fault.
-    void answer(const std::string& method, const Value& reply) {
-        set(method, {200, "<params><param>" + encoded(reply) + "</param></params>"});
+    void answer(const std::string& method, const Value& reply) { set(method, success(reply)); }
+    /// A reply that depends on the parameters of the call.
+    void answerWith(const std::string& method, std::function<Value(const Dictionary& parameters)> reply) {
+        const std::lock_guard lock(mutex_);
+        answers_[method] = [reply = std::move(reply)](const Dictionary& parameters) {
+            return success(reply(parameters));
+        };
     }
     void fault(const std::string& method, int64_t code) {
         const Dictionary fault = {{"faultCode", Value::int64(code)}, {"faultString", "because"}};
@@ -58,6 +64,10 @@ class FakeIdentityServer {
   private:
     using StatusAndContent = std::pair<int, std::string>;
 
+    static StatusAndContent success(const Value& reply) {
+        return {200, "<params><param>" + encoded(reply) + "</param></params>"};
+    }
+
     static std::string encoded(const Value& value) {
         const auto text = XMLRPCDefaultEncoder::encodeObject(value);
         return {text.begin(), text.end()};
@@ -65,7 +75,7 @@ class FakeIdentityServer {
 
     void set(const std::string& method, StatusAndContent answer) {
         const std::lock_guard lock(mutex_);
-        answers_[method] = std::move(answer);
+        answers_[method] = [answer = std::move(answer)](const Dictionary&) { return answer; };
     }
 
     platform::FakeHTTPAnswer serve(const platform::HTTPRequest& request) {
@@ -81,15 +91,17 @@ class FakeIdentityServer {
         calls_.push_back({request.url, method, parameters != nullptr ? *parameters : Dictionary()});
         const auto found = answers_.find(method);
         platform::FakeHTTPAnswer answer;
-        answer.status = found != answers_.end() ? found->second.first : 404;
-        if (found != answers_.end())
-            answer.body = "<methodResponse>" + found->second.second + "</methodResponse>";
+        answer.status = 404;
+        if (found == answers_.end()) return answer;
+        const auto [status, content] = found->second(calls_.back().parameters);
+        answer.status = status;
+        answer.body = "<methodResponse>" + content + "</methodResponse>";
         return answer;
     }
 
     platform::FakeHTTPTransport transport_;
     std::mutex mutex_;
-    std::map<std::string, StatusAndContent> answers_;
+    std::map<std::string, std::function<StatusAndContent(const Dictionary&)>> answers_;
     std::vector<Call> calls_;
 };
 

@@ -63,7 +63,7 @@ void applyRelaunch(const Dictionary& reply) {
                      "Received 'NextLaunchTimeInterval' == " << interval
                                                              << " from server, so setting NextLaunchDate to "
                                                              << describeValue(Value::date(date)));
-    relaunchScheduler()(date, true);
+    requestRelaunch(date);
 }
 
 void applyFlushAndExit(const Dictionary& reply) {
@@ -93,6 +93,8 @@ void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& 
 }  // namespace
 
 void setRelaunchScheduler(RelaunchScheduler scheduler) { relaunchScheduler() = std::move(scheduler); }
+
+void requestRelaunch(double date) { relaunchScheduler()(date, /*force=*/true); }
 
 Dictionary createCallParameters(const String& accountName, const String& sessionID,
                                 const Dictionary& options) {

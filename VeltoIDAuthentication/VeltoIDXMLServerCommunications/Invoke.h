@@ -21,6 +21,9 @@ inline constexpr int64_t kVeltoIDAuthProtocolVersion = 101;
 /// once, at start.
 void setRelaunchScheduler(std::function<void(std::optional<double> date, bool force)> scheduler);
 
+/// Asks the process to be running at the date (seconds since 1970). Any queue.
+void requestRelaunch(double date);
+
 /// A new dictionary of what every call carries: session identifier (when given), protocol and framework
 /// version, time, system, and the meta and account information that the server has asked for.
 Dictionary createCallParameters(const String& accountName, const String& sessionID,

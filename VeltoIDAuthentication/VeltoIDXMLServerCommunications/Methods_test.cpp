@@ -2,6 +2,7 @@
 
 #include <array>
 
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
 #include "VeltoIDXMLServerCommunications/SessionCache.h"
 
@@ -170,6 +171,183 @@ TEST_F(GetMyInfo, AFailedCallSpoilsTheSession) {
     EXPECT_EQ(working->fValidityDuration, 50) << "commands of any reply are applied";
     __VeltoIDSessionRelease(std::move(working));
     EXPECT_NE(takeCachedSession(kName, kPassword, "https://server.example"), nullptr);
+}
+
+// --- The other methods
+
+class Methods : public GetMyInfo {
+  protected:
+    /// The parameters of the last call beyond those that every call has.
+    Dictionary takeOwnParameters() {
+        Dictionary sent = server_.take().back().parameters;
+        for (const std::string& key : keysOf(createCallParameters(kName, "s1", {}))) sent.remove(key);
+        return sent;
+    }
+    CertificateAnswer fetched(const Dictionary& reply) {
+        server_.answer("fetchCert", reply);
+        CertificateAnswer answer;
+        EXPECT_TRUE(__VeltoIDSessionDoFetchCSRResult(*session(), "d1", "t1", {}, &answer, nullptr));
+        return answer;
+    }
+};
+
+TEST_F(Methods, SendWhatTheyAreGiven) {
+    for (const char* method : {"findPerson", "createCert", "fetchCert", "downloadCertComplete", "revokeCert",
+                               "saveBreadcrumbEk", "fetchBreadcrumbEk"})
+        server_.answer(method, Dictionary{{"x", "y"}});
+    setValue("AccountUUID", "U");
+    const Data data(platform::bytesOf("ABC"));
+    const Dictionary criteria = {{"email", Array{"a@b", "c@d"}}};
+    const Value lifetime = Value::real(1'209'600);
+    struct Case {
+        const char* what;
+        std::function<bool(VeltoIDAuthenticationSessionInfo&)> call;
+        Dictionary sent;
+        const char* counter;
+    };
+    const Case cases[] = {
+        {"find",
+         [&](auto& s) { return __VeltoIDSessionDoFindPerson(s, criteria, {}, nullptr, nullptr); },
+         {{"searchCriteria", criteria}},
+         "VeltoIDXMLFindPersonCount"},
+        {"request",
+         [](auto& s) { return __VeltoIDSessionDoSendCSR(s, "d1", "pem", {}, nullptr, nullptr, nullptr); },
+         {{"CSR", "pem"}, {"encDsId", "d1"}, {"RequestedCertificateLifetimeInSeconds", lifetime}},
+         "VeltoIDXMLSendCSRCount"},
+        {"request with delays",
+         [](auto& s) {
+             return __VeltoIDSessionDoSendCSR(
+                 s, "d1", "pem", {{"__CERT_FETCH_DELAY_MIN", "5"}, {"__CERT_FETCH_DELAY_MAX", number(10)}},
+                 nullptr, nullptr, nullptr);
+         },
+         {{"__CERT_FETCH_DELAY_MIN", "5"},
+          {"CSR", "pem"},
+          {"encDsId", "d1"},
+          {"RequestedCertificateLifetimeInSeconds", lifetime}},
+         "VeltoIDXMLSendCSRCount"},
+        {"fetch",
+         [](auto& s) { return __VeltoIDSessionDoFetchCSRResult(s, "d1", "t1", {}, nullptr, nullptr); },
+         {{"CertificateToken", "t1"}, {"encDsId", "d1"}},
+         "VeltoIDXMLFetchCertCount"},
+        {"complete",
+         [](auto& s) { return __VeltoIDSessionDoCompleteCertificate(s, "d1", "t1", {}, nullptr); },
+         {{"CertificateToken", "t1"}, {"encDsId", "d1"}},
+         "VeltoIDXMLCompleteCertCount"},
+        {"fetch by number",
+         [](auto& s) {
+             return __VeltoIDSessionDoFetchCertificateBySerialNumber(s, "7", {}, nullptr, nullptr);
+         },
+         {{"certSerialNumber", "7"}},
+         "VeltoIDXMLFetchCertCount"},
+        {"revoke",
+         [](auto& s) { return __VeltoIDSessionDoRevokeCertificate(s, "7", {}, nullptr); },
+         {{"SerialNumber", "7"}},
+         nullptr},
+        {"set breadcrumb",
+         [&](auto& s) { return __VeltoIDSessionDoSetBreadcrumb(s, "k", data, {}, nullptr); },
+         {{"machineUUID", "U"}, {"breadcrumbKey", "k"}, {"ek", "QUJD"}},
+         nullptr},
+        {"get breadcrumb",
+         [](auto& s) { return !__VeltoIDSessionDoCopyBreadcrumb(s, "k", {}, nullptr); },
+         {{"machineUUID", "U"}, {"breadcrumbKey", "k"}},
+         nullptr},
+    };
+    for (const Case& each : cases) {
+        const auto counted = [&] { return each.counter != nullptr ? count(each.counter) : 0; };
+        const int64_t before = counted();
+        Session working = session();
+        EXPECT_TRUE(each.call(*working)) << each.what;
+        EXPECT_EQ(takeOwnParameters(), each.sent) << each.what;
+        EXPECT_EQ(working->fSessionID, "s1") << each.what << ": not spoiled";
+        EXPECT_EQ(counted(), before + (each.counter != nullptr ? 1 : 0)) << each.what;
+    }
+    for (const auto& [stored, sent] : {std::pair(number(60), 60.0), std::pair(Value("60"), 1'209'600.0)}) {
+        __VeltoIDDBSetMetaInfoValue(nullptr, "VeltoIDMetaDefaultCertificateRequestedLifetime", stored);
+        EXPECT_TRUE(cases[1].call(*session()));
+        EXPECT_EQ(takeOwnParameters()["RequestedCertificateLifetimeInSeconds"], Value::real(sent));
+    }
+    for (const char* method : {"findPerson", "createCert", "fetchCert", "downloadCertComplete", "revokeCert",
+                               "saveBreadcrumbEk", "fetchBreadcrumbEk"})
+        server_.fault(method, -9);
+    for (const Case& each : cases) {
+        Session failing = session();
+        const bool isCopy = std::string_view(each.what) == "get breadcrumb";
+        EXPECT_EQ(each.call(*failing), isCopy) << each.what;
+        EXPECT_EQ(failing->fSessionID, String()) << each.what << ": spoiled";
+    }
+}
+
+TEST_F(Methods, TakeWhatIsOfUseInACertificateAnswer) {
+    const Dictionary dsCert = {{"Certificate", "pem"},
+                               {"CertType", "t"},
+                               {"SerialNumber", "7"},
+                               {"CertStatus", "CERT_ISSUED"},
+                               {"IntermediateCert", "above"},
+                               {"Expires", "2014-03-05T17:04:00Z"},
+                               {"Other", "x"}};
+    const Dictionary result = {{"Certificate", "pem"},
+                               {"CertType", "t"},
+                               {"SerialNumber", "7"},
+                               {"CertStatus", "CERT_ISSUED"},
+                               {"IntermediateCertificate", "above"},
+                               {"Expires", Value::date(1'394'039'040)}};
+    EXPECT_EQ(fetched({{"dsCert", dsCert}}).result, result);
+    EXPECT_EQ(fetched({{"dsCert", Array{dsCert, Dictionary()}}}).result, result);
+    EXPECT_EQ(fetched({{"dsCert", dsCert}, {"Delay", Value::real(2.5)}}).delay, Value::real(2.5));
+    EXPECT_EQ(fetched({{"dsCert", Dictionary{{"Expires", date(5)}, {"SerialNumber", number(7)}}}}).result,
+              (Dictionary{{"Expires", date(5)}}));
+    for (const Value& none : {Value(Array()), Value(Array{"x", dsCert}), Value("x"),
+                              Value(Dictionary{{"CertStatus", number(1)}, {"Expires", "soon"}})})
+        EXPECT_EQ(fetched({{"dsCert", none}, {"Delay", "soon"}}).result, std::nullopt);
+
+    String token;
+    CertificateAnswer answer;
+    server_.answer("createCert",
+                   Dictionary{{"CertificateToken", "t"}, {"dsCert", dsCert}, {"Delay", number(5)}});
+    EXPECT_TRUE(__VeltoIDSessionDoSendCSR(*session(), "d1", "pem", {}, &token, &answer, nullptr));
+    EXPECT_EQ(token, "t");
+    EXPECT_EQ(answer.result, result);
+    EXPECT_EQ(answer.delay, number(5));
+
+    server_.fault("fetchCert", -4164);
+    Session pending = session();
+    EXPECT_TRUE(__VeltoIDSessionDoFetchCSRResult(*pending, "d1", "t1", {}, &answer, nullptr));
+    EXPECT_EQ(answer.result, (Dictionary{{"CertificateToken", "t1"}, {"CertStatus", "SIGNIN_PENDING"}}));
+    EXPECT_EQ(answer.delay, number(300));
+    EXPECT_EQ(pending->fSessionID, "s1");
+    std::optional<Error> error;
+    EXPECT_FALSE(__VeltoIDSessionDoFetchCertificateBySerialNumber(*session(), "7", {}, nullptr, &error));
+    EXPECT_EQ(error->code, -100) << "that fault is a failure everywhere else";
+}
+
+TEST_F(Methods, HandOutWhatWasFound) {
+    const Array people{Dictionary{{"matched", "email"}, {"value", "a@b"}}, "nobody"};
+    std::optional<Array> matches;
+    server_.answer("findPerson", Dictionary{{"matches", people}});
+    EXPECT_TRUE(__VeltoIDSessionDoFindPerson(*session(), {}, {}, &matches, nullptr));
+    EXPECT_EQ(matches, people);
+    EXPECT_EQ(__VeltoIDDBCopyCachedFindPersonResults({{"email", Array{"a@b"}}})->size(), 1U);
+    server_.answer("findPerson", Dictionary{{"matches", "none"}});
+    EXPECT_TRUE(__VeltoIDSessionDoFindPerson(*session(), {}, {}, &matches, nullptr));
+    EXPECT_EQ(matches, std::nullopt);
+
+    String certificate;
+    server_.answer("fetchCert", Dictionary{{"Certificate", "pem"}});
+    EXPECT_TRUE(__VeltoIDSessionDoFetchCertificateBySerialNumber(*session(), "7", {}, &certificate, nullptr));
+    EXPECT_EQ(certificate, "pem");
+
+    for (const auto& [reply, expected] :
+         {std::pair<Value, Data>(Dictionary{{"ek", "QUJD"}}, Data(platform::bytesOf("ABC"))),
+          {Dictionary{{"ek", "!"}}, {}},
+          {Dictionary{{"ek", number(1)}}, {}},
+          {"hello", {}}}) {
+        server_.answer("fetchBreadcrumbEk", reply);
+        std::optional<Error> error;
+        Session working = session();
+        EXPECT_EQ(__VeltoIDSessionDoCopyBreadcrumb(*working, "k", {}, &error), expected);
+        EXPECT_EQ(error, std::nullopt);
+        EXPECT_EQ(working->fSessionID, "s1") << "nothing stored is no failure";
+    }
 }
 
 }  // namespace

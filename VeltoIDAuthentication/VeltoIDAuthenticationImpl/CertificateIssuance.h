@@ -1,0 +1,61 @@
+// How an account gets its client certificate: a signing request goes to the server, which answers with the
+// certificate or with a token; the token is asked with until the certificate is issued or refused; every
+// answer is applied to the account's record and to its certificate entry.
+//
+// What the record says while that goes on: "CertificateToken" with "CertificateTokenExpiration" (a request is
+// pending), "NextCertificateFetchDate" and "NextCertificateFetchDelta" (when to ask next, and how far to put
+// it off then), "CSRGenerationDate" and "CSRGenerationInterval" (when the next request may be made),
+// "CertificatePrivateKeyReference" (the pending request's key). When the certificate is there, all of it
+// goes, and the entry has certificate, intermediate certificate and key.
+//
+// All operations run on the caller's queue and block while the server is asked (up to 5 seconds for each
+// call).
+#pragma once
+
+#include <optional>
+
+#include "Values/Error.h"
+#include "Values/Value.h"
+#include "VeltoIDAuthenticationImpl/CertificateCustody.h"
+#include "VeltoIDXMLServerCommunications/Methods.h"
+
+namespace veltoid {
+
+// Seconds.
+inline constexpr double kVeltoIDCertificateTokenLifetime = 1'209'600;
+inline constexpr double kVeltoIDCSRGenerationInterval = 3'600;
+/// After a refusal, or a token that expired, until the next request.
+inline constexpr double kVeltoIDCSRRetryDelay = 3'600;
+/// Longer waits than this that a record asks for are not believed.
+inline constexpr double kVeltoIDLongestFetchDelay = 604'800;
+
+/// Longer tokens are refused: they would be stored and logged.
+inline constexpr size_t kVeltoIDMaxCertificateTokenBytes = size_t{16} << 10U;
+
+/// Generates a key pair, sends a certificate signing request and applies the answer: the certificate, a
+/// token, or a refusal. Keys made for an attempt that fails are deleted. The error (also passed to
+/// handleServerError) is the session's, else one of the status-code domain or -100. The encDsId is handed out
+/// as far as it is known.
+bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
+                                                   String* encDsId, ErrorOut error = nullptr);
+
+/// Applies what the server says of the request: by "CertStatus" the certificate is stored, the next fetch put
+/// off, the token given up, or, for anything else, the token kept until it expires. True when the certificate
+/// is stored or the request pending. Otherwise -100, and nothing of a request that was given up stays in the
+/// keychain. A certificate for another key than the pending one counts as a refusal.
+bool updateAccountWithCertificateResult(const CustodyLock& custody, const String& accountName,
+                                        const String& encDsId, const CertificateAnswer& answer,
+                                        ErrorOut error = nullptr);
+
+/// Asks the server for the certificate that the account's token stands for, and applies the answer. True also
+/// when there is no token, or no session could be opened (the next fetch is put off). Error 99: it is not
+/// time yet (with "NextCertificateFetchDate", unless `force` is set), or the request is still pending.
+bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, bool force, const Dictionary& options,
+                                           ErrorOut error = nullptr);
+
+/// Signs in to learn and store the account's encDsId. The error is always filled: the session's, 99 within
+/// 300 s of the record's "LastConnectAttempt", or -100.
+void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dictionary& options,
+                                           ErrorOut error = nullptr);
+
+}  // namespace veltoid

@@ -1,0 +1,247 @@
+// Applying what the server says of a certificate request.
+#include <algorithm>
+#include <cmath>
+
+#include "Certificates/CertificateRequest.h"
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Platform/Clock.h"
+#include "Platform/Notifications.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
+#include "VeltoIDAuthenticationImpl/FetchDelays.h"
+#include "VeltoIDAuthenticationImpl/NotificationNames.h"
+#include "VeltoIDKeychainItems/Certificates.h"
+#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
+
+namespace veltoid {
+namespace {
+
+constexpr const char* kFunction = "updateAccountWithCertificateResult";
+constexpr const char* kIntermediateLabel = "Velto ID authorization intermediate certificate";
+/// Share of a certificate's remaining lifetime after which it is renewed.
+constexpr double kRenewalShare = 0.75;
+
+double now() { return platform::Clock::shared().now(); }
+
+/// One answer and the account that it is for.
+class CertificateResult {
+  public:
+    CertificateResult(const CustodyLock& custody, const String& accountName, const String& encDsId,
+                      const CertificateAnswer& answer)
+        : custody_(custody),
+          accountName_(accountName),
+          encDsId_(encDsId),
+          result_(answer.result.value_or(Dictionary())),
+          delay_(answer.delay) {
+        __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
+    }
+
+    bool apply() {
+        const String status = result_.string(kVeltoIDCertificateStatusKey);
+        if (status == kVeltoIDCertificateStatusIssued) return isForAnotherKey() ? giveUp() : applyIssued();
+        if (status == kVeltoIDCertificateStatusPending) return applyPending();
+        return status == kVeltoIDCertificateStatusFailed ? giveUp() : applyUnknown();
+    }
+
+  private:
+    // --- Issued
+
+    bool applyIssued() {
+        VELTOID_LOG_FROM(kFunction, kNotice,
+                         "VeltoIDAuth: Adding certificate for "
+                             << accountName_.view() << ", " << encDsId_.view() << " to keychain, serial#="
+                             << result_.string(kVeltoIDCertificateSerialNumberKey).view());
+        Dictionary before;
+        __VeltoIDDBCopyCertificateInfo(encDsId_, &before);
+        const bool stored = storeEntry() && storeCertificate() && storeIntermediate() && movePrivateKey();
+        if (stored) {
+            planRenewal();
+            Dictionary after;
+            __VeltoIDDBCopyCertificateInfo(encDsId_, &after);
+            discardReplacedItems(custody_, before, after);
+        } else {
+            discardPendingKey(custody_, accountName_);
+        }
+        endRequest();
+        return stored;
+    }
+
+    /// Everything that the server said of the certificate stays with it.
+    bool storeEntry() {
+        if (!__VeltoIDDBSetCertificateInfo(encDsId_, result_)) return false;
+        for (const auto& [key, value] : result_) setInEntry(key, value);
+        setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now() - 1));
+        return true;
+    }
+
+    bool setInEntry(const String& key, const Value& value) {
+        return __VeltoIDDBSetCertificateValue(encDsId_, key, value, true);
+    }
+
+    /// Text that is no certificate is passed over: the entry tells that there is none.
+    bool storeCertificate() {
+        const auto certificate = certificateFromPEM(result_.string("Certificate"));
+        if (!certificate) return true;
+        Data reference;
+        if (!addCertificateToKeychain(*certificate, certificateLabelForAccount(accountName_), &reference))
+            return false;
+        setInEntry(kVeltoIDCertificateCertificatePersistentReferenceKey, reference);
+        platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
+        return true;
+    }
+
+    bool storeIntermediate() {
+        const auto certificate = certificateFromPEM(result_.string("IntermediateCertificate"));
+        Data reference;
+        if (certificate && (copyPersistentRefForCertificate(*certificate, &reference) ||
+                            addCertificateToKeychain(*certificate, kIntermediateLabel, &reference)))
+            setInEntry(kVeltoIDCertificateIntermediateCertificateReferenceKey, reference);
+        return true;
+    }
+
+    bool movePrivateKey() {
+        const Data reference = record_.data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
+        if (!reference) return true;
+        return setInEntry(kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference) &&
+               setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::null()}}, false);
+    }
+
+    void planRenewal() {
+        const auto expires = result_.date(kVeltoIDCertificateExpirationDateKey);
+        if (expires && *expires > now())
+            setInEntry(kVeltoIDCertificateNextRenewalAttemptDateKey,
+                       Value::date(now() + kRenewalShare * (*expires - now())));
+    }
+
+    /// Last, so that an agent that is killed before asks for the certificate once more.
+    void endRequest() {
+        setInRecord({{kVeltoIDAccountCertificateTokenKey, Value::null()},
+                     {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
+                     {kVeltoIDAccountCSRGenerationDateKey, Value::null()},
+                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
+                     {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
+                     {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()},
+                     {kVeltoIDAccountCSRCreationDateKey, Value::null()}},
+                    true);
+    }
+
+    /// Nobody could prove to own such a certificate.
+    bool isForAnotherKey() const {
+        const auto certificate = certificateFromPEM(result_.string("Certificate"));
+        Key pending;
+        if (!certificate ||
+            !copyKeyFromKeychainGivenPersistentRef(
+                record_.data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey), &pending) ||
+            pending.publicPart == Data(certificate->publicKey))
+            return false;
+        VELTOID_LOG_FROM(kFunction, kError,
+                         "The certificate that the server issued for "
+                             << accountName_.view() << " is not for the key that was requested.");
+        return true;
+    }
+
+    // --- Pending
+
+    bool applyPending() {
+        const double delay = pendingDelay(delay_, record_);
+        const double nextFetch = now() + (delay > 0 ? delay : 1);
+        const bool stored = setInRecord(
+            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, true);
+        if (stored)
+            setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
+                          Value::real(delayAfterPending(delay))}},
+                        false);
+        setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::null()},
+                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()}},
+                    false);
+        requestRelaunch(nextFetch);
+        return stored;
+    }
+
+    // --- Refused, or anything else
+
+    bool giveUp() {
+        VELTOID_LOG_FROM(kFunction, kNotice,
+                         "VeltoIDAuth: Failed generating certificate for "
+                             << accountName_.view() << ", " << encDsId_.view() << ", certToken=" << token()
+                             << ".");
+        VELTOID_LOG_FROM(kFunction, kWarning,
+                         "Certificate issuance request for "
+                             << accountName_.view() << " dsID=" << encDsId_.view() << " certToken=" << token()
+                             << " failed to be issued by the server.");
+        dropRequest();
+        return false;
+    }
+
+    bool applyUnknown() {
+        VELTOID_LOG_FROM(kFunction, kNotice,
+                         "VeltoIDAuth: Unknown state after trying to fetch certifitate for "
+                             << accountName_.view() << ", " << encDsId_.view() << " ");
+        VELTOID_LOG_FROM(kFunction, kWarning,
+                         "UNKNOWN Certificate issuance request for "
+                             << accountName_.view() << " dsID=" << encDsId_.view() << " certToken=" << token()
+                             << ", status=" << statusText() << ".");
+        const auto expiration = record_.date(kVeltoIDAccountCertificateTokenExpirationKey);
+        if (expiration && *expiration < now()) {
+            dropRequest();
+        } else {
+            putOffFetch();
+        }
+        return false;
+    }
+
+    /// Back to no request at all; the next one is made in an hour at the earliest.
+    void dropRequest() {
+        setInRecord({{kVeltoIDAccountCertificateTokenKey, Value::null()},
+                     {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
+                     {kVeltoIDAccountCSRGenerationDateKey, Value::date(now() + kVeltoIDCSRRetryDelay)},
+                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
+                     {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
+                     {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}},
+                    true);
+        discardPendingKey(custody_, accountName_);
+    }
+
+    void putOffFetch() {
+        const double delta = storedFetchDelta(record_).value_or(kLongestPollingDelay);
+        setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
+                      Value::date(now() + (delta > 0 ? delta : kLongestPollingDelay))},
+                     {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
+                      Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}},
+                    true);
+    }
+
+    std::string_view token() const { return record_.string(kVeltoIDAccountCertificateTokenKey).view(); }
+
+    std::string statusText() const {
+        const Value& status = result_[kVeltoIDCertificateStatusKey];
+        return status.isString() ? status.asString().text() : describeValue(status);
+    }
+
+    bool setInRecord(const Dictionary& values, bool dirty) {
+        return __VeltoIDDBSetAccountValues(accountName_, values, dirty);
+    }
+
+    const CustodyLock& custody_;
+    const String& accountName_;
+    const String& encDsId_;
+    const Dictionary result_;
+    const Value& delay_;
+    Dictionary record_;
+};
+
+}  // namespace
+
+bool updateAccountWithCertificateResult(const CustodyLock& custody, const String& accountName,
+                                        const String& encDsId, const CertificateAnswer& answer,
+                                        ErrorOut error) {
+    if (CertificateResult(custody, accountName, encDsId, answer).apply()) return true;
+    fillError(error, VELTOID_ERROR(identity_error::kUnknown));
+    return false;
+}
+
+}  // namespace veltoid

@@ -1,0 +1,64 @@
+#include "VeltoIDAuthenticationImpl/Cleanup.h"
+
+#include <set>
+#include <string>
+
+#include "Logging/Log.h"
+#include "Platform/Clock.h"
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+
+namespace veltoid {
+namespace {
+
+/// The encDsIds of all accounts; lifts their embargoes on the way.
+std::set<std::string> encDsIdsOfAccounts() {
+    std::set<std::string> encDsIds;
+    Array names;
+    __VeltoIDDBCopyVeltoIDs(&names);
+    for (const Value& name : names) {
+        Dictionary record;
+        if (!__VeltoIDDBCopyVeltoIDAccount(name.asString(), &record)) continue;
+        if (const String encDsId = record.string(kVeltoIDAccountDSIDKey)) encDsIds.insert(encDsId.text());
+        const auto embargo = record.date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
+        if (embargo && *embargo < platform::Clock::shared().now())
+            __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountEarliestAllowedConnectionDateKey,
+                                       Value::null(), false);
+    }
+    return encDsIds;
+}
+
+bool isOfUse(const String& encDsId) {
+    Dictionary entry;
+    return __VeltoIDDBCopyCertificateInfo(encDsId, &entry) &&
+           entry.string(kVeltoIDCertificateStatusKey) != kVeltoIDCertificateStatusInvalid &&
+           entry.contains(kVeltoIDCertificateCertificatePersistentReferenceKey) &&
+           entry.contains(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
+}
+
+}  // namespace
+
+bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& /*options*/, ErrorOut /*error*/) {
+    cleanUpAccountsAndCertificates(CustodyLock());
+    return true;
+}
+
+void cleanUpAccountsAndCertificates(const CustodyLock& custody) {
+    const std::set<std::string> owned = encDsIdsOfAccounts();
+    Array encDsIds;
+    __VeltoIDDBCopyCertificateKeys(&encDsIds);
+    for (const Value& key : encDsIds) {
+        const String encDsId = key.asString();
+        if (owned.contains(encDsId.text()) && isOfUse(encDsId)) continue;
+        String accountName;
+        __VeltoIDDBCopyVeltoIDForDSID(encDsId, &accountName);
+        VELTOID_LOG_FROM("__VeltoIDCleanupAccountsAndCertificates", kNotice,
+                         "Removing certificate and private key  from keychain, and certificate from db, for "
+                         "account "
+                             << accountName.view() << " / dsID=" << encDsId.view());
+        discardCertificate(custody, encDsId);
+    }
+}
+
+}  // namespace veltoid

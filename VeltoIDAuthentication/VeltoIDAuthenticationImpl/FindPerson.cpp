@@ -1,0 +1,45 @@
+#include "VeltoIDAuthenticationImpl/FindPerson.h"
+
+#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
+#include "VeltoIDXMLServerCommunications/Methods.h"
+#include "VeltoIDXMLServerCommunications/SignIn.h"
+
+namespace veltoid {
+namespace {
+
+/// The first account that could sign in; null without one.
+String firstAccount() {
+    const auto record = __VeltoIDDBCopyFirstVeltoIDAccount(true, true);
+    return record ? record->string(kVeltoIDAccountNameKey) : String();
+}
+
+String storedPassword(const String& accountName) {
+    Dictionary record;
+    return __VeltoIDDBCopyVeltoIDAccount(accountName, &record) ? __VeltoIDDBCopyHashedPassword(record)
+                                                               : String();
+}
+
+}  // namespace
+
+bool __VeltoIDDoFindPerson(const String& accountName, const String& hashedPassword,
+                           const Dictionary& criteria, const Dictionary& options,
+                           std::optional<Array>* results, ErrorOut error) {
+    const String name = accountName ? accountName : firstAccount();
+    if (!name) {
+        fillError(error, VELTOID_ERROR(identity_error::kNoAccountForRequest));
+        return false;
+    }
+    const String password = accountName && hashedPassword ? hashedPassword : storedPassword(name);
+    std::optional<Error> held;
+    Session session = __VeltoIDSessionDoCreateSession(name, password, options, nullptr, nullptr, &held);
+    const bool found = session && __VeltoIDSessionDoFindPerson(*session, criteria, options, results, &held);
+    __VeltoIDSessionRelease(std::move(session));
+    if (found) return true;
+    handleServerError(name, held);
+    fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
+    return false;
+}
+
+}  // namespace veltoid
