@@ -2,6 +2,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "veltoidctl/AgentConnection.h"
 #include "veltoidctl/Password.h"
@@ -23,6 +24,31 @@ struct Arguments {
     bool refresh = false;
     /// Store the account without signing in.
     bool withoutSigningIn = false;
+    /// Ask for a certificate at once.
+    bool withCertificate = false;
+
+    /// Print the certificate; the chain has the intermediate certificate as well.
+    bool pem = false;
+    bool chain = false;
+    /// The signed record of validated items instead.
+    bool validationRecord = false;
+    /// Export as PKCS#12 instead of PEM, under a password or none.
+    bool pkcs12 = false;
+    bool withoutPassword = false;
+
+    std::string criterion;
+    std::vector<std::string> values;
+    /// Look only at what the agent remembers.
+    bool cached = false;
+
+    /// A breadcrumb's name.
+    std::string key;
+
+    /// Files; "-" is standard input or output.
+    std::string input = "-";
+    std::string output = "-";
+    /// Replace a file, or write to a terminal.
+    bool force = false;
 };
 
 /// Each asks the agent, prints the answer (as text, or the whole reply as JSON) and returns the exit status.
@@ -33,6 +59,11 @@ int list(AgentConnection& agent, const Arguments& arguments);
 int info(AgentConnection& agent, const Arguments& arguments);
 int status(AgentConnection& agent, const Arguments& arguments);
 int verify(AgentConnection& agent, const Arguments& arguments);
+int find(AgentConnection& agent, const Arguments& arguments);
+int certificate(AgentConnection& agent, const Arguments& arguments);
+int exportCertificate(AgentConnection& agent, const Arguments& arguments);
+int setBreadcrumb(AgentConnection& agent, const Arguments& arguments);
+int getBreadcrumb(AgentConnection& agent, const Arguments& arguments);
 int database(AgentConnection& agent, const Arguments& arguments);
 
 }  // namespace veltoidctl

@@ -7,17 +7,29 @@
 
 namespace veltoidctl {
 
-void JsonBuilder::data(platform::Bytes bytes) { add(veltoid::xmlrpcBase64Encode(bytes, false).text()); }
-
-void JsonBuilder::date(double seconds) {
+std::optional<std::string> dateText(double seconds) {
     std::tm calendar{};
     const auto whole = static_cast<time_t>(std::floor(seconds));
     char text[64];
     if (!std::isfinite(seconds) || std::abs(seconds) > 6e16 || gmtime_r(&whole, &calendar) == nullptr ||
-        std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", &calendar) == 0) {
-        add(seconds);
+        std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", &calendar) == 0)
+        return std::nullopt;
+    return text;
+}
+
+veltoid::Data dataIn(const Json& dictionary, const char* key) {
+    const auto found = dictionary.find(key);
+    if (found == dictionary.end() || !found->is_string()) return {};
+    return veltoid::xmlrpcBase64Decode(found->get_ref<const std::string&>());
+}
+
+void JsonBuilder::data(platform::Bytes bytes) { add(veltoid::xmlrpcBase64Encode(bytes, false).text()); }
+
+void JsonBuilder::date(double seconds) {
+    if (const auto text = dateText(seconds)) {
+        add(*text);
     } else {
-        add(std::string(text));
+        add(seconds);
     }
 }
 

@@ -61,9 +61,8 @@ class QuietTerminal {
     termios before_{};
 };
 
-platform::SecretText promptFor(const std::string& account) {
-    const QuietTerminal terminal;
-    terminal.say("Password for " + account + ": ");
+platform::SecretText ask(const QuietTerminal& terminal, const std::string& question) {
+    terminal.say(question);
     return readLine(terminal.descriptor());
 }
 
@@ -91,7 +90,16 @@ platform::SecretText readPasswordHash(PasswordSource source, const std::string& 
         case PasswordSource::Prompt:
             break;
     }
-    return hashOf(promptFor(account));
+    return hashOf(ask(QuietTerminal(), "Password for " + account + ": "));
+}
+
+platform::SecretText readNewPassword(PasswordSource source, const std::string& purpose) {
+    if (source != PasswordSource::Prompt) return readLine(STDIN_FILENO);
+    const QuietTerminal terminal;
+    platform::SecretText password = ask(terminal, "New password for " + purpose + ": ");
+    if (ask(terminal, "\nOnce more: ") != password)
+        throw std::runtime_error("the passwords are not the same");
+    return password;
 }
 
 }  // namespace veltoidctl

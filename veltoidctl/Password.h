@@ -20,4 +20,8 @@ enum class PasswordSource {
 /// Throws std::runtime_error when there is no terminal to ask at, or no line.
 platform::SecretText readPasswordHash(PasswordSource source, const std::string& account);
 
+/// A password as it is, for something new: at the terminal it is asked for twice. Throws std::runtime_error
+/// like readPasswordHash, and when it was not the same twice.
+platform::SecretText readNewPassword(PasswordSource source, const std::string& purpose);
+
 }  // namespace veltoidctl

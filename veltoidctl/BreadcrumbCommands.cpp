@@ -1,0 +1,63 @@
+// The commands about breadcrumbs: small pieces of data that the identity server keeps for account and device.
+#include <iostream>
+
+#include "veltoidctl/Commands.h"
+#include "veltoidctl/Files.h"
+#include "veltoidctl/JsonBuilder.h"
+#include "veltoidctl/Printing.h"
+#include "veltoidctl/Request.h"
+
+namespace veltoidctl {
+namespace {
+
+constexpr const char* kKey = "identifier";
+constexpr const char* kData = "breadcrumb";
+
+void printHexadecimal(platform::Bytes bytes) {
+    constexpr char kDigits[] = "0123456789abcdef";
+    for (const uint8_t byte : bytes) std::cout << kDigits[byte >> 4U] << kDigits[byte & 15U];
+    std::cout << "\n";
+}
+
+}  // namespace
+
+int setBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
+    const platform::SecretBytes data = readInput(arguments.input);
+    const Request request{.command = kSetBreadcrumbCommand,
+                          .account = arguments.account,
+                          .passwordHash = readPasswordHash(arguments.password, arguments.account),
+                          .entries = [&](platform::ValueSink& sink) {
+                              sink.key(kKey);
+                              sink.string(arguments.key);
+                              sink.key(kData);
+                              sink.data(data);
+                          }};
+    return present(send(agent, request), arguments, "breadcrumb set", [&](const Json&) {
+        std::cout << "the server keeps " << data.size() << " bytes under " << arguments.key << "\n";
+    });
+}
+
+int getBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
+    const bool hasFile = arguments.output != kStandardStream;
+    // A terminal gets it in a form that is fit for one.
+    const bool isShown = !hasFile && (arguments.json || standardOutputIsTerminal());
+    const PrivateOutput output(arguments.output, arguments.force || isShown);
+    const Request request{.command = kGetBreadcrumbCommand,
+                          .account = arguments.account,
+                          .passwordHash = readPasswordHash(arguments.password, arguments.account),
+                          .entries = [&](platform::ValueSink& sink) {
+                              sink.key(kKey);
+                              sink.string(arguments.key);
+                          }};
+    const Json reply = send(agent, request);
+    const veltoid::Data data = dataIn(reply, kData);
+    if (data && !isShown) output.write(data.bytes());
+    return present(
+        reply, arguments, "breadcrumb get",
+        [&](const Json&) {
+            if (isShown) printHexadecimal(data.bytes());
+        },
+        "nothing is kept under " + arguments.key);
+}
+
+}  // namespace veltoidctl

@@ -1,0 +1,33 @@
+// Certificates and their private keys in the forms that other programs read.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "Platform/Certificate.h"
+#include "VeltoIDKeychainItems/Keys.h"
+
+namespace veltoidctl {
+
+/// From now on every block that OpenSSL frees in this process is wiped first: its decoders leave copies of
+/// keys behind. Before the first use of OpenSSL, else throws std::runtime_error.
+void wipeWhatOpenSSLFrees();
+
+std::string pemOf(const platform::Certificate& certificate);
+
+/// What is exported: a key, its certificate, and, if known, the certificate of whoever signed that.
+struct Identity {
+    veltoid::Key privateKey;
+    platform::Certificate certificate;
+    std::optional<platform::Certificate> intermediate;
+};
+
+/// One PEM text: PKCS#8 key, certificate, intermediate certificate. Programs that want two files, one for the
+/// key, take it twice.
+platform::SecretBytes pemOf(const Identity& identity);
+
+/// PKCS#12 (RFC 7292) under the password, which may be empty. Throws std::runtime_error when OpenSSL refuses.
+platform::SecretBytes pkcs12Of(const Identity& identity, const platform::SecretText& password,
+                               const std::string& name);
+
+}  // namespace veltoidctl

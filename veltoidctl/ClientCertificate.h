@@ -1,0 +1,47 @@
+// An account's certificate: what the agent knows of it, and the items themselves, which client and agent have
+// in the same keychain.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "Platform/Certificate.h"
+#include "VeltoIDKeychainItems/Keys.h"
+#include "veltoidctl/AgentConnection.h"
+
+namespace veltoidctl {
+
+inline constexpr const char* kIntermediateReference = "IntermediateCertificateReference";
+
+struct ClientCertificate {
+    /// The agent's answer to the question for it.
+    Json reply = Json::object();
+    /// What the agent's database has: the account's record and the certificate's entry; empty objects else.
+    Json record = Json::object();
+    Json entry = Json::object();
+    /// None when there is none, or this user's keychain does not give it out.
+    std::optional<platform::Certificate> certificate = {};
+    std::optional<platform::Certificate> intermediate = {};
+
+    bool isIssued() const;
+    /// A request for one is on its way.
+    bool isPending() const;
+    bool hasIntermediate() const { return entry.contains(kIntermediateReference); }
+    /// Why the agent has none.
+    std::string whyThereIsNone() const;
+    /// For the end of a line: when the agent asks next for a pending one; empty when that is not known.
+    std::string nextLook() const;
+};
+
+/// Throws Unreachable.
+ClientCertificate fetchCertificate(AgentConnection& agent, const std::string& account);
+
+/// The private key, from the keychain. Throws std::runtime_error when it is not there, or belongs to another
+/// certificate.
+veltoid::Key privateKeyOf(const ClientCertificate& certificate);
+
+/// Throws std::runtime_error when it could not be read.
+const platform::Certificate& needed(const std::optional<platform::Certificate>& certificate,
+                                    const char* whatItIs);
+
+}  // namespace veltoidctl

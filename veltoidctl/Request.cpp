@@ -1,0 +1,32 @@
+#include "veltoidctl/Request.h"
+
+namespace veltoidctl {
+
+Json send(AgentConnection& agent, const Request& request) {
+    return agent.send([&](platform::ValueSink& sink) {
+        sink.beginDictionary();
+        sink.key("command");
+        sink.integer(request.command);
+        if (!request.account.empty()) {
+            sink.key("VeltoID");
+            sink.string(request.account);
+        }
+        if (!request.passwordHash.empty()) {
+            sink.key("hashedpassword");
+            sink.string(request.passwordHash);
+        }
+        if (request.entries) request.entries(sink);
+        sink.key("options");
+        sink.beginDictionary();
+        for (const auto& [option, value] : request.options) {
+            sink.key(option);
+            sink.boolean(value);
+        }
+        sink.endDictionary();
+        sink.endDictionary();
+    });
+}
+
+bool succeeded(const Json& reply) { return reply.value("success", false); }
+
+}  // namespace veltoidctl
