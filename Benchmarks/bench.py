@@ -225,6 +225,45 @@ def find_person_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
               f"{few * 1000:.0f} ns among {FEW_PEOPLE}", many / few, 2)
 
 
+# --- Certificates
+
+def signed_record(folder: pathlib.Path) -> pathlib.Path:
+    """A validation record of about 2 KB, signed as the identity server signs."""
+    statement = {"VeltoID": ACCOUNT, "encDsId": "000123-08-4f1c2a9e5b7d", "SuggestValidDuration": 2592000,
+                 "ValidAsOf": datetime.datetime(2026, 1, 2, 3, 4, 5),
+                 "ValidatedEmail": [f"jane.roe{number}@example.com" for number in range(12)],
+                 "ValidatedPhones": [f"+1555555012{number}" for number in range(6)]}
+    key, certificate, payload, record = (folder / name for name in ("key", "certificate", "payload", "record"))
+    payload.write_bytes(plistlib.dumps(statement))
+    for command in (("req", "-x509", "-newkey", "ec", "-pkeyopt", "ec_paramgen_curve:P-256", "-nodes", "-subj",
+                     "/CN=Signer", "-keyout", key, "-out", certificate),
+                    ("cms", "-sign", "-binary", "-nodetach", "-outform", "DER", "-signer", certificate, "-inkey", key,
+                     "-in", payload, "-out", record)):
+        subprocess.run(["openssl", *map(str, command)], check=True, stderr=subprocess.DEVNULL)
+    return record
+
+
+def certificate_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
+    sides = ("ours", "bare")
+
+    def paired(what: str, pairs: list[dict[str, float]], limit: float) -> Row:
+        ours, reference = (statistics.median(pair[side] for pair in pairs) for side in sides)
+        ratio = statistics.median(pair["ours"] / pair["bare"] for pair in pairs)
+        return Row(what, duration(ours), f"{duration(reference)} bare OpenSSL", ratio, limit)
+
+    def measured(kind: str, *arguments) -> dict[str, float]:
+        return {side: next(iter(medians(programs.run("Certificates_bench", kind, side, *arguments)).values()))
+                for side in sides}
+
+    # The same key for both sides each time: what they differ in is a fraction of what keys differ in.
+    yield paired("certification request with a new key", [measured("request", seed) for seed in range(effort.runs)],
+                 1.05)
+    with tempfile.TemporaryDirectory() as name:
+        record = signed_record(pathlib.Path(name))
+        yield paired(f"verify and read a record, {record.stat().st_size / 1000:.1f} KB",
+                     [measured("verify", 1, record) for _ in range(effort.runs)], 1.3)
+
+
 # --- Over TLS
 
 def store_with(authority: str, folder: pathlib.Path) -> pathlib.Path:
@@ -351,7 +390,7 @@ def main() -> int:
     failures = []
     for what, measure in (("the bus", bus_rows), ("texts", text_rows),
                           ("property lists", property_list_rows), ("the find-person cache", find_person_rows),
-                          ("TLS", tls_rows)):
+                          ("certificates", certificate_rows), ("TLS", tls_rows)):
         print(f"bench: {what}", flush=True)
         try:
             rows += measure(programs, effort)

@@ -2,13 +2,13 @@
 
 #include <curl/curl.h>
 #include <dlfcn.h>
-#include <openssl/crypto.h>
 
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
 #include <string>
 
+#include "Platform/OpenSSLLibrary.h"
 #include "Platform/SystemLog.h"
 
 namespace platform {
@@ -41,9 +41,6 @@ struct CurlLibrary {
     decltype(&::curl_url_get) urlGet = nullptr;
     decltype(&::curl_free) free = nullptr;
 
-    /// Of the OpenSSL that the library is built on.
-    decltype(&::OPENSSL_init_crypto) initCrypto = nullptr;
-
     /// Loaded and initialised on the first call and kept for the life of the process; null when the library
     /// or one of the functions is missing. Any thread.
     static const CurlLibrary* shared();
@@ -58,8 +55,13 @@ class SymbolReader {
 
     template <typename Function>
     void find(Function& function, const char* name) {
-        function = reinterpret_cast<Function>(dlsym(library_, name));
-        if (function == nullptr && missing_ == nullptr) missing_ = name;
+        function = reinterpret_cast<Function>(require(name));
+    }
+
+    void* require(const char* name) {
+        void* address = dlsym(library_, name);
+        if (address == nullptr && missing_ == nullptr) missing_ = name;
+        return address;
     }
 
     const char* missing() const { return missing_; }
@@ -92,7 +94,8 @@ const char* findAll(void* library, CurlLibrary& curl) {
     symbols.find(curl.urlSet, "curl_url_set");
     symbols.find(curl.urlGet, "curl_url_get");
     symbols.find(curl.free, "curl_free");
-    symbols.find(curl.initCrypto, "OPENSSL_init_crypto");
+    // There are builds on other TLS libraries.
+    symbols.require("OPENSSL_init_crypto");
     return symbols.missing();
 }
 
@@ -110,9 +113,8 @@ const CurlLibrary* load() {
         VELTOID_PLATFORM_LOG(Error, std::string(kLibraryName) + " lacks " + missing);
         return nullptr;
     }
-    // An exchange may be under way when the process exits: OpenSSL, which the library is built on, must not
-    // take its tables down underneath it. Only the first caller of OpenSSL in a process can choose that.
-    curl.initCrypto(OPENSSL_INIT_NO_ATEXIT, nullptr);
+    // Before the library makes use of it.
+    openssl::prepare();
     if (curl.globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
         VELTOID_PLATFORM_LOG(Error, "cannot initialise the HTTPS client library");
         return nullptr;

@@ -12,10 +12,14 @@
 #include <cstring>
 
 #include "Platform/BusConnection.h"
+#include "Platform/ServiceManager.h"
 #include "Platform/WorkQueue.h"
 
 namespace platform::event_loop {
 namespace {
+
+/// A service manager that is busy longer does not keep an ending process (seconds).
+constexpr double kLongestHandOver = 2;
 
 sd_event* loop = nullptr;
 int wakeDescriptor = -1;
@@ -78,13 +82,15 @@ void run() {
 sd_event* handle() { return loop; }
 
 void exitAfterPendingWork(int status) {
+    const WorkQueue mainQueue = WorkQueue::main();
     const auto leave = [status] {
+        ServiceManager::shared().announceStopping();
         bus::flush();
         exitProcess(status);
     };
-    if (WorkQueue::main().isCurrent()) leave();
-    WorkQueue::main().sync(leave);
-    std::abort();  // not reached
+    mainQueue.async([leave] { ServiceManager::shared().whenHandedOver(leave); });
+    mainQueue.asyncAfter(kLongestHandOver, leave);
+    if (!mainQueue.isCurrent()) Semaphore().wait();
 }
 
 void exitProcess(int status) {

@@ -21,9 +21,9 @@ void onSignal(int signal, std::function<void()> handler);
 /// The loop, for the bus connection; null before `prepare`.
 sd_event* handle();
 
-/// Ends the process from any thread once the main queue has done what it was asked for so far, replies and
-/// relaunch included. The caller does not return.
-[[noreturn]] void exitAfterPendingWork(int status);
+/// Ends the process once the main queue has done what it was asked for so far, replies and relaunch included.
+/// From any thread: it does not return, except to a task of the main queue, which has to come to its end.
+void exitAfterPendingWork(int status);
 
 /// Ends the process at once from any thread: standard output is flushed, no destructor or exit handler runs,
 /// so that other threads may go on until the end.

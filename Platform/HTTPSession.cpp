@@ -7,6 +7,7 @@
 #include <mutex>
 
 #include "Platform/CurlExchange.h"
+#include "Platform/Transactions.h"
 
 namespace platform {
 namespace {
@@ -26,6 +27,8 @@ class CurlSession : public HTTPSession,
             if (started_ || cancelled_) return;
             started_ = true;
         }
+        // In flight until its last event has been delivered.
+        transactions::began();
         const auto shared = std::make_shared<const HTTPRequest>(std::move(request));
         queue_.async([self = shared_from_this(), shared] { self->run(*shared); });
     }
@@ -46,6 +49,10 @@ class CurlSession : public HTTPSession,
         const std::optional<HTTPError> error = exchange.run(cancelled_);
         setExchange(nullptr);
         completed(error);
+        if (eventQueue_)
+            eventQueue_->async(transactions::ended);
+        else
+            transactions::ended();
     }
 
     void setExchange(CurlExchange* exchange) {

@@ -22,6 +22,7 @@ void* LazyLibrary::addressOf(const char* function) const {
     // Opened anew for each function: the loader finds the name among those that are loaded and counts.
     void* library = dlopen(soname_, RTLD_LAZY | RTLD_LOCAL);
     if (library == nullptr) abortOnMissing(soname_);
+    if (prepare_ != nullptr) prepare_();
     void* address = dlsym(library, function);
     if (address == nullptr) abortOnMissing(function);
     return address;

@@ -17,7 +17,9 @@ namespace platform {
 /// The library by its fixed soname, kept for the life of the process.
 class LazyLibrary {
   public:
-    explicit constexpr LazyLibrary(const char* soname) : soname_(soname) {}
+    /// `prepare` is called before each address is given out, hence before any function is called.
+    explicit constexpr LazyLibrary(const char* soname, void (*prepare)() = nullptr)
+        : soname_(soname), prepare_(prepare) {}
 
     /// The address of a function; ends the process with a log line when the library or the function is
     /// missing, like the dynamic linker with a library that is linked. Any thread.
@@ -25,6 +27,7 @@ class LazyLibrary {
 
   private:
     const char* soname_;
+    void (*prepare_)();
 };
 
 /// A function of a library, called like the function itself.

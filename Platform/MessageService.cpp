@@ -4,14 +4,16 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <map>
-#include <mutex>
 #include <utility>
 #include <vector>
 
 #include "Platform/BusConnection.h"
 #include "Platform/BusMessage.h"
+#include "Platform/ServiceManager.h"
 #include "Platform/SystemLog.h"
+#include "Platform/Transactions.h"
 
 namespace platform {
 namespace {
@@ -44,9 +46,43 @@ void sendReply(sd_bus_message* request, const ValueWriter& writer) {
                                "The reply does not fit into a message.");
 }
 
+/// Giving up the names: what is left until nothing that was sent to them is unanswered.
+struct Release {
+    /// Requests that are not dropped yet; those that are have queued their reply on the main queue before.
+    std::atomic<long> openRequests{0};
+    std::atomic<bool> began{false};
+    /// Main thread only.
+    long namesHeld = 0;
+    std::function<void()> done;
+
+    static Release& shared() {
+        static auto* release = new Release;
+        return *release;
+    }
+
+    /// Main thread.
+    void look() {
+        if (began && namesHeld == 0 && openRequests == 0 && done) std::exchange(done, nullptr)();
+    }
+};
+
+/// Holds a transaction from its arrival on: its handler opens one of its own only when its turn has come.
 class BusRequest : public IncomingMessage {
   public:
-    explicit BusRequest(sd_bus_message* message) : message_(sd_bus_message_ref(message), releaseMessage) {}
+    explicit BusRequest(sd_bus_message* message) : message_(sd_bus_message_ref(message), releaseMessage) {
+        transactions::began();
+        ++Release::shared().openRequests;
+    }
+
+    ~BusRequest() override {
+        Release& release = Release::shared();
+        if (--release.openRequests == 0 && release.began)
+            WorkQueue::main().async([&release] { release.look(); });
+        transactions::ended();
+    }
+
+    BusRequest(const BusRequest&) = delete;
+    BusRequest& operator=(const BusRequest&) = delete;
 
     std::optional<int64_t> peekInteger(std::string_view key) override {
         return bus::peekInteger(message_.get(), key);
@@ -56,7 +92,8 @@ class BusRequest : public IncomingMessage {
     void reply(ValueWriter writer) override {
         if (std::exchange(replied_, true)) return;
         const WorkQueue mainQueue = WorkQueue::main();
-        if (mainQueue.isCurrent()) {
+        // Replies of the peer's earlier requests may still wait on the main queue: none is overtaken.
+        if (mainQueue.isCurrent() && mainQueue.isEmpty()) {
             sendReply(message_.get(), writer);
         } else {
             mainQueue.async(
@@ -131,6 +168,7 @@ class BusListener;
 struct Services {
     std::vector<std::shared_ptr<BusListener>> listeners;
     bool objectAdded = false;
+    long namesAskedFor = 0;
 
     static Services& shared() {
         static auto* services = new Services;
@@ -169,9 +207,19 @@ class BusListener : public Listener {
         int result = bus != nullptr ? addObject(bus) : -ENOTCONN;
         if (result >= 0)
             result = sd_bus_request_name_async(bus, nullptr, name_.c_str(), 0, nameRequested, this);
-        if (result >= 0) return;
+        if (result >= 0) {
+            ++Services::shared().namesAskedFor;
+            return;
+        }
         bus::logFailure("registering a service", result);
         notify(ConnectionError::Invalid);
+    }
+
+    /// False when there is nothing to wait for.
+    bool releaseName() const {
+        sd_bus* bus = bus::connection();
+        return bus != nullptr &&
+               sd_bus_release_name_async(bus, nullptr, name_.c_str(), nameReleased, nullptr) >= 0;
     }
 
     /// The peer of that bus name, new when this is its first message; null when it may not speak to the
@@ -204,9 +252,18 @@ class BusListener : public Listener {
         uint32_t outcome = 0;
         const bool answered = sd_bus_message_is_method_error(reply, nullptr) <= 0 &&
                               sd_bus_message_read(reply, "u", &outcome) > 0;
+        if (--Services::shared().namesAskedFor == 0) ServiceManager::shared().announceReady();
         if (answered && outcome == kPrimaryOwner) return 0;
         VELTOID_PLATFORM_LOG(Error, "The service name " + listener->name_ + " cannot be had on this bus.");
         listener->notify(ConnectionError::Invalid);
+        return 0;
+    }
+
+    static int nameReleased(sd_bus_message* /*reply*/, void* /*context*/, sd_bus_error* /*error*/) noexcept {
+        Release& release = Release::shared();
+        --release.namesHeld;
+        // What came before this reply has been dispatched.
+        release.look();
         return 0;
     }
 
@@ -299,6 +356,15 @@ void onConnectionLost(std::function<void()> handler) {
 void announceTermination() {
     const auto listeners = Services::shared().listeners;
     for (const auto& listener : listeners) listener->notify(ConnectionError::TerminationImminent);
+}
+
+void releaseNames(std::function<void()> done) {
+    Release& release = Release::shared();
+    release.done = std::move(done);
+    release.began = true;
+    for (const auto& listener : Services::shared().listeners)
+        if (listener->releaseName()) ++release.namesHeld;
+    WorkQueue::main().async([&release] { release.look(); });
 }
 
 }  // namespace message_service

@@ -92,6 +92,11 @@ void onConnectionLost(std::function<void()> handler);
 /// Tells every listener that the process is about to be ended. Main queue.
 void announceTermination();
 
+/// Gives up the services' names: what is sent to them from then on makes the bus start the next agent. What
+/// was sent before is still handled; `done` is called on the main queue when that has been answered or
+/// dropped. Main queue, once.
+void releaseNames(std::function<void()> done);
+
 }  // namespace message_service
 
 }  // namespace platform

@@ -10,7 +10,7 @@
 #include "Platform/FakeSystemLog.h"
 #include "Platform/KeyPair.h"
 #include "Platform/SimulatedClock.h"
-#include "Tests/Support/TestAuthority.h"
+#include "TestSupport/TestAuthority.h"
 
 namespace platform {
 namespace {

@@ -256,6 +256,11 @@ bool WorkQueue::tryRunNow(const Task& task) const {
     return true;
 }
 
+bool WorkQueue::isEmpty() const {
+    const std::lock_guard lock(state_->mutex);
+    return state_->items.empty();
+}
+
 const std::string& WorkQueue::label() const { return state_->label; }
 
 bool WorkQueue::isCurrent() const { return isOnQueue(state_.get()); }

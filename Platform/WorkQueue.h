@@ -50,6 +50,9 @@ class WorkQueue {
     /// Runs `task` on the caller's thread as this queue's task if the queue is idle; otherwise does nothing.
     bool tryRunNow(const Task& task) const;
 
+    /// Whether nothing waits to be run. A task that runs right now does not count.
+    bool isEmpty() const;
+
     const std::string& label() const;
 
     /// Whether the caller runs on this queue right now.

@@ -15,7 +15,7 @@ ROOT = pathlib.Path(__file__).resolve().parent.parent
 BUILD = ROOT / "build" / "release"
 os.environ.setdefault("VELTOID_AGENT", str(BUILD / "VeltoIDAuthentication" / "VeltoIDAuthd" / "veltoidauthd"))
 sys.path.insert(0, str(ROOT / "scripts"))
-from world import ACCOUNT, INTERFACE, OBJECT, PASSWORD, SERVICE, World  # noqa: E402
+from world import ACCOUNT, INTERFACE, OBJECT, OTHER_ACCOUNT, PASSWORD, SERVICE, World  # noqa: E402
 
 
 def say(text: str):
@@ -26,15 +26,17 @@ class Story:
     def __init__(self, world: World):
         self.world = world
 
-    def run(self, *command: str, stdin: str | None = None, expected: int = 0, shown: str | None = None) -> str:
-        """Runs a command as a person would, prints what it prints, and insists on its exit status."""
+    def run(self, *command: str, stdin: str | None = None, expected: int | None = 0,
+            shown: str | None = None) -> str:
+        """Runs a command as a person would, prints what it prints, and insists on its exit status (None: any but 0)."""
         print(f"\n    $ {shown or shlex.join(command)}", flush=True)
         program = str(BUILD / "veltoidctl" / "veltoidctl") if command[0] == "veltoidctl" else command[0]
         result = subprocess.run([program, *command[1:]], input=stdin, text=True, stdout=subprocess.PIPE,
                                 stderr=subprocess.STDOUT, check=False,
-                                env={**os.environ, "DBUS_SESSION_BUS_ADDRESS": self.world.bus.address})
+                                env={**os.environ, **self.world.environment,
+                                     "DBUS_SESSION_BUS_ADDRESS": self.world.bus.address})
         print(textwrap.indent(result.stdout.rstrip(), "    "), flush=True)
-        if result.returncode != expected:
+        if result.returncode != expected and (expected is not None or result.returncode == 0):
             sys.exit(f"demo: expected exit status {expected}, got {result.returncode}")
         return result.stdout
 
@@ -51,7 +53,17 @@ class Story:
         select.select([process], [], [], 15)
         os.close(process)
 
+    def with_password(self, *command: str, password: str = PASSWORD, expected: int = 0) -> str:
+        return self.run(*command, "--password-stdin", stdin=password + "\n", expected=expected,
+                        shown=f"echo {password!r} | {shlex.join(command)} --password-stdin")
+
     def tell(self):
+        self.tell_of_the_account()
+        self.tell_of_the_certificate()
+        self.tell_of_people()
+        self.tell_of_the_end()
+
+    def tell_of_the_account(self):
         world, url = self.world, self.world.server.url
         say(f"A message bus of our own is up, and beside it an identity server at {url}: a separate program in Python "
             "that answers XML-RPC over TLS with a certificate of its own test authority. The agent is not running: the "
@@ -61,9 +73,7 @@ class Story:
 
         say("That was a ping. Now an account. The password is hashed by the client, so the agent never sees it; the agent "
             "puts the hash into its keychain, signs in, and learns the account's directory identifier (encDsId).")
-        added = self.run("veltoidctl", "add", ACCOUNT, "--password-stdin", stdin=PASSWORD + "\n",
-                         shown=f"echo {PASSWORD!r} | veltoidctl add {ACCOUNT} --password-stdin")
-        self.insist(added, "signed in as")
+        self.insist(self.with_password("veltoidctl", "add", ACCOUNT), "signed in as")
         details = self.run("veltoidctl", "info", ACCOUNT)
         self.insist(details, "Jane", "Roe", ACCOUNT, "jane@roe.example", "encDsId")
         self.insist(self.run("veltoidctl", "status"), "NoCertificate", "next action")
@@ -83,14 +93,46 @@ class Story:
             sys.exit("demo: the agent was not restarted")
         print(f"\n    (process {before} before, {after} now)")
 
+    def tell_of_the_certificate(self):
+        world = self.world
+        say("Others need not take the account's word for anything: the agent makes a key, asks the server for a certificate "
+            "of it, and keeps both. The key never leaves this machine.")
+        self.insist(self.with_password("veltoidctl", "add", ACCOUNT, "--certificate"), "it has a certificate")
+        self.insist(self.run("veltoidctl", "certificate", ACCOUNT), f"CN={ACCOUNT}", "CERT_ISSUED", "next renewal")
+        self.insist(self.run("veltoidctl", "status"), "CertificateAssumedOK")
+        certificate, identity = str(world.folder / "jane.pem"), str(world.folder / "jane-with-key.pem")
+        pathlib.Path(certificate).write_text(self.run("veltoidctl", "certificate", ACCOUNT, "--pem"))
+        verified = self.run("openssl", "verify", "-purpose", "sslclient", "-CAfile", world.server.authority, "-untrusted",
+                            world.server.intermediate, certificate)
+        self.insist(verified, f"{certificate}: OK")
+
+        say("Any TLS client can prove with it whose it is. Here curl shows it to a page of the server that lets nobody in "
+            "without one and tells what it has seen; without the certificate there is no connection.")
+        self.run("veltoidctl", "certificate", "export", ACCOUNT, "--pem", identity)
+        page = ("curl", "--silent", "--show-error", "--cacert", world.server.authority)
+        self.insist(self.run(*page, "--cert", identity, world.server.client_certificate_url), f"CN={ACCOUNT}")
+        self.run(*page, world.server.client_certificate_url, expected=None)
+
+    def tell_of_people(self):
+        world = self.world
+        say("The server also knows other people. Who was found once is known without it; and small pieces of data can be "
+            "left with it, such as what one device has to tell another.")
+        self.insist(self.run("veltoidctl", "find", "VeltoID", OTHER_ACCOUNT), "John", "Doe")
+        self.insist(self.run("veltoidctl", "find", "VeltoID", OTHER_ACCOUNT, "--cached"), "John", "Doe")
+        note = world.folder / "note"
+        note.write_text("to whom it may concern\n")
+        self.with_password("veltoidctl", "breadcrumb", "set", ACCOUNT, "note", "--input", str(note))
+        self.insist(self.with_password("veltoidctl", "breadcrumb", "get", ACCOUNT, "note"), note.read_text())
+
+    def tell_of_the_end(self):
+        world = self.world
         say("A wrong password is refused by the server, and told apart from a server that cannot be reached. The server "
             "has spoken against the account, so the stored password goes too: the account needs its owner.")
-        refused = self.run("veltoidctl", "verify", ACCOUNT, "--password-stdin", stdin="wrong horse\n", expected=1,
-                           shown=f"echo 'wrong horse' | veltoidctl verify {ACCOUNT} --password-stdin")
+        refused = self.with_password("veltoidctl", "verify", ACCOUNT, password="wrong horse", expected=1)
         self.insist(refused, "-101")
         self.insist(self.run("veltoidctl", "status"), "PasswordInvalid")
 
-        say("Finally the account is forgotten, with its password item and everything known of it.")
+        say("Finally the account is forgotten, with its password, key and certificate and everything known of it.")
         self.run("veltoidctl", "forget", ACCOUNT)
         self.insist(self.run("veltoidctl", "list"), "no accounts")
         files = sorted(file.name for file in world.state_files().iterdir())

@@ -36,6 +36,7 @@ OTHER_PASSWORD = "battery staple"
 
 PING, SET_VALUE, SET_VALUE_QUIETLY = 0x1, 0xFE, 0xFF
 ADD, INFO, LIST, FORGET, VERIFY, DATABASE, STATUS, TERMINATE = 0x120, 0x130, 0x150, 0x160, 0x180, 0x500, 0x510, 0x9999
+FIND, FIND_CACHED, CERTIFICATE, SET_BREADCRUMB, GET_BREADCRUMB, CHECK = 0x140, 0x141, 0x170, 0x200, 0x201, 0x501
 
 BUS_CONFIGURATION = """<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN"
  "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">
@@ -136,6 +137,41 @@ class Client:
         self.close()
 
 
+class NameOwner:
+    """Follows who owns a name, without making the bus start anybody. Misses no change between two waits."""
+
+    def __init__(self, address: str, name: str = SERVICE):
+        self.connection = open_dbus_connection(bus=address)
+        rule = MatchRule(type="signal", sender="org.freedesktop.DBus", member="NameOwnerChanged")
+        rule.add_arg_condition(0, name)
+        Proxy(message_bus, self.connection).AddMatch(rule)
+        self.changes = self.connection.filter(rule, bufsize=10000)
+        self.queue = self.changes.__enter__()
+        self.owned = bool(Proxy(message_bus, self.connection).NameHasOwner(name)[0])
+        self.owners_gone = 0
+
+    def wait(self, owned: bool = True, timeout: float = 20):
+        """Blocks until somebody, or nobody, owns the name; TimeoutError when that does not come."""
+        while self.owned != owned:
+            self.owned = self.connection.recv_until_filtered(self.queue, timeout=timeout).body[2] != ""
+            self.owners_gone += not self.owned
+
+    def __enter__(self):
+        return self
+
+    def __exit__(self, *_):
+        self.changes.__exit__(None, None, None)
+        self.connection.close()
+
+
+def complaint_of_a_sanitizer(log: str) -> str | None:
+    """The agent's process is not the test's: what a sanitizer has to say about it stands in its log."""
+    for mark in ("ThreadSanitizer", "AddressSanitizer", "runtime error:"):
+        if mark in log:
+            return log[max(log.index(mark) - 100, 0):][:4000]
+    return None
+
+
 class Bus:
     """A private message bus that can start the agent."""
 
@@ -165,13 +201,15 @@ class Bus:
 class World:
     """Bus, identity server and agent; a context manager."""
 
-    def __init__(self, *agent_arguments: str, server: bool = True):
+    def __init__(self, *agent_arguments: str, server: bool = True, environment: dict[str, str] | None = None):
         self.folder = pathlib.Path(tempfile.mkdtemp(prefix="veltoid-"))
         self.server = IdentityServer(self.folder / "server").start() if server else None
-        self.environment = {"XDG_STATE_HOME": str(self.folder / "state"), "XDG_RUNTIME_DIR": str(self.folder)}
+        self.environment = {"XDG_STATE_HOME": str(self.folder / "state"), "XDG_RUNTIME_DIR": str(self.folder),
+                            "XDG_CONFIG_HOME": str(self.folder / "config"), **(environment or {})}
         arguments = ["--authentication", "--checkpassword", *agent_arguments]
         if self.server:
             self.environment["SSL_CERT_FILE"] = str(self.server.authority)
+            self.trust_identity_authority()
             arguments.append(f"ServerURL={self.server.url}")
         self.arguments = arguments
         self.bus = Bus(self.folder, self.environment, arguments)
@@ -186,12 +224,16 @@ class World:
         self.bus.stop()
         if self.server:
             self.server.stop()
-        log = self.log_text()
+        complaint = complaint_of_a_sanitizer(self.log_text())
         shutil.rmtree(self.folder, ignore_errors=True)
-        # The agent's process is not the test's: what a sanitizer has to say about it stands in its log.
-        for mark in ("ThreadSanitizer", "AddressSanitizer", "runtime error:"):
-            if mark in log:
-                raise AssertionError(log[log.index(mark) - 100:][:4000])
+        if complaint:
+            raise AssertionError(complaint)
+
+    def trust_identity_authority(self):
+        """Makes the server's authority the one that client certificates are evaluated against."""
+        file = self.folder / "config" / "harbwell" / "identity-authority.pem"
+        file.parent.mkdir(parents=True)
+        shutil.copy(self.server.authority, file)
 
     def client(self, service: str = SERVICE, starts_agent: bool = True) -> Client:
         return Client(self.bus.address, service, starts_agent)
@@ -208,15 +250,8 @@ class World:
 
     def wait_for_name(self, owned: bool = True):
         """Blocks until somebody, or nobody, owns the service's name, without making the bus start anybody."""
-        connection = open_dbus_connection(bus=self.bus.address)
-        rule = MatchRule(type="signal", sender="org.freedesktop.DBus", member="NameOwnerChanged")
-        rule.add_arg_condition(0, SERVICE)
-        Proxy(message_bus, connection).AddMatch(rule)
-        with connection.filter(rule) as changes:
-            has_owner = Proxy(message_bus, connection).NameHasOwner(SERVICE)[0]
-            while has_owner != owned:
-                has_owner = connection.recv_until_filtered(changes, timeout=20).body[2] != ""
-        connection.close()
+        with NameOwner(self.bus.address) as owner:
+            owner.wait(owned)
 
     def agent_pid(self) -> int:
         with self.client() as client:

@@ -1,14 +1,9 @@
 #include "veltoidctl/CertificateExport.h"
 
-#include <malloc.h>
-#include <openssl/crypto.h>
 #include <openssl/err.h>
 #include <openssl/pkcs12.h>
 #include <openssl/x509.h>
 
-#include <algorithm>
-#include <cstdlib>
-#include <cstring>
 #include <memory>
 #include <stdexcept>
 
@@ -20,28 +15,6 @@ namespace {
 /// For each of key, certificates and integrity. Readers refuse files that would keep them busy for too long:
 /// common ones stop at 300,000 for one and 600,000 for all.
 constexpr int kPasswordIterations = 100'000;
-
-void wipeAndFree(void* block) {
-    if (block == nullptr) return;
-    platform::wipe(block, malloc_usable_size(block));
-    std::free(block);
-}
-
-void* allocate(size_t size, const char* /*file*/, int /*line*/) { return std::malloc(size); }
-
-void* reallocate(void* block, size_t size, const char* /*file*/, int /*line*/) {
-    if (size == 0) {
-        wipeAndFree(block);
-        return nullptr;
-    }
-    void* larger = std::malloc(size);
-    if (larger == nullptr || block == nullptr) return larger;
-    std::memcpy(larger, block, std::min(size, malloc_usable_size(block)));
-    wipeAndFree(block);
-    return larger;
-}
-
-void release(void* block, const char* /*file*/, int /*line*/) { wipeAndFree(block); }
 
 struct Deleter {
     void operator()(EVP_PKEY* key) const { EVP_PKEY_free(key); }
@@ -89,11 +62,6 @@ void appendPEM(Text& text, const std::string& label, platform::Bytes der) {
 constexpr const char* kCertificateLabel = "CERTIFICATE";
 
 }  // namespace
-
-void wipeWhatOpenSSLFrees() {
-    if (CRYPTO_set_mem_functions(allocate, reallocate, release) != 1)
-        throw std::runtime_error("OpenSSL is in use already");
-}
 
 std::string pemOf(const platform::Certificate& certificate) {
     std::string text;

@@ -9,10 +9,6 @@
 
 namespace veltoidctl {
 
-/// From now on every block that OpenSSL frees in this process is wiped first: its decoders leave copies of
-/// keys behind. Before the first use of OpenSSL, else throws std::runtime_error.
-void wipeWhatOpenSSLFrees();
-
 std::string pemOf(const platform::Certificate& certificate);
 
 /// What is exported: a key, its certificate, and, if known, the certificate of whoever signed that.

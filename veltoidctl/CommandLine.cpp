@@ -32,8 +32,13 @@ class Commands {
         takesPassword(added);
         auto* withoutSigningIn = added->add_flag("--no-sign-in", arguments_.withoutSigningIn,
                                                  "store it without asking the server");
-        added->add_flag("--certificate", arguments_.withCertificate, "ask for its certificate at once")
-            ->excludes(withoutSigningIn);
+        auto* atOnce =
+            added->add_flag("--certificate", arguments_.withCertificate, "ask for its certificate at once")
+                ->excludes(withoutSigningIn);
+        added->add_option("--wait", arguments_.waitSeconds, "wait so many seconds until the agent has got it")
+            ->check(CLI::Range(0.0, 3'600.0))
+            ->excludes(withoutSigningIn)
+            ->excludes(atOnce);
 
         takesAccount(add(application_, "forget", "take an account off this device", forget));
         add(application_, "list", "list the accounts", list);
@@ -114,7 +119,8 @@ class Commands {
     }
 
     void addAgentCommands() {
-        add(application_, "status", "show the accounts' states and what happens next", status);
+        add(application_, "status", "show the accounts' states and what happens next", status)
+            ->add_flag("--check", arguments_.examine, "examine them anew, certificates and server included");
         add(application_, "database", "dump the account database", database);
         add(application_, "ping", "see whether the agent answers", ping);
     }

@@ -15,6 +15,7 @@ void printStatusOf(const std::string& account, const Json& status) {
                           {"AccountRequiresUserAction", "  needs you"},
                           {"NextActionTime", "  next action"},
                           {"NextFetchAttempt", "  next fetch"},
+                          {"CertificateRequestsHeldUntil", "  requests held until"},
                           {"ValidationDate", "  validated"}});
 }
 
@@ -38,7 +39,7 @@ void printOutcome(const ClientCertificate& found, const Arguments& arguments) {
 std::string shortcoming(const Json& reply, const Arguments& arguments, const ClientCertificate& found) {
     if (!reply.contains("encDsId") && !arguments.withoutSigningIn)
         return "is stored on this device, but could not be signed in";
-    if (arguments.withCertificate && !found.isIssued() && !found.isPending())
+    if (arguments.wantsCertificate() && !found.isIssued() && !found.isPending())
         return "is signed in, but got no certificate";
     return {};
 }
@@ -64,9 +65,10 @@ int add(AgentConnection& agent, const Arguments& arguments) {
                     .passwordHash = readPasswordHash(arguments.password, arguments.account)};
     if (arguments.withoutSigningIn) request.options.emplace_back("DoNotCheckPassword", true);
     if (arguments.withCertificate) request.options.emplace_back("CreateCSRAsynchronously", false);
+    if (arguments.waitSeconds > 0) request.options.emplace_back("certwaitduration", arguments.waitSeconds);
     Json reply = send(agent, request);
     ClientCertificate found;
-    if (arguments.withCertificate && succeeded(reply)) {
+    if (arguments.wantsCertificate() && succeeded(reply)) {
         found = fetchCertificate(agent, arguments.account);
         reply["certificate"] = found.reply.value("result", Json::object());
         reply["certificateIsPending"] = found.isPending();
@@ -116,7 +118,9 @@ int info(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int status(AgentConnection& agent, const Arguments& arguments) {
-    return present(send(agent, {.command = kStatusCommand}), arguments, "status", [](const Json& reply) {
+    Request request{.command = kStatusCommand};
+    if (arguments.examine) request.options = {{"CheckNetwork", true}, {"ForceValidation", true}};
+    return present(send(agent, request), arguments, "status", [](const Json& reply) {
         const Json status = reply.value("status", Json::object());
         printEntries(status, {{"pid", "agent process"},
                               {"LaunchTime", "running since"},

@@ -26,6 +26,12 @@ struct Arguments {
     bool withoutSigningIn = false;
     /// Ask for a certificate at once.
     bool withCertificate = false;
+    /// Let the agent get it, and wait for it so long (seconds).
+    double waitSeconds = 0;
+    /// Have the accounts examined anew, certificates and server included.
+    bool examine = false;
+
+    bool wantsCertificate() const { return withCertificate || waitSeconds > 0; }
 
     /// Print the certificate; the chain has the intermediate certificate as well.
     bool pem = false;

@@ -20,7 +20,11 @@ Json send(AgentConnection& agent, const Request& request) {
         sink.beginDictionary();
         for (const auto& [option, value] : request.options) {
             sink.key(option);
-            sink.boolean(value);
+            if (const bool* flag = std::get_if<bool>(&value)) {
+                sink.boolean(*flag);
+            } else {
+                sink.real(std::get<double>(value));
+            }
         }
         sink.endDictionary();
         sink.endDictionary();

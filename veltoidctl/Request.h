@@ -5,6 +5,7 @@
 #include <functional>
 #include <string>
 #include <utility>
+#include <variant>
 #include <vector>
 
 #include "Platform/SecureMemory.h"
@@ -32,7 +33,7 @@ struct Request {
     /// Empty: the request carries none. So with the password hash.
     std::string account = {};
     platform::SecretText passwordHash = {};
-    std::vector<std::pair<std::string, bool>> options = {};
+    std::vector<std::pair<std::string, std::variant<bool, double>>> options = {};
     /// Writes the keys and values that only this command has.
     std::function<void(platform::ValueSink&)> entries = {};
 };

@@ -3,8 +3,9 @@
 
 #include <clocale>
 #include <iostream>
+#include <stdexcept>
 
-#include "veltoidctl/CertificateExport.h"
+#include "Platform/OpenSSLLibrary.h"
 #include "veltoidctl/CommandLine.h"
 
 namespace veltoidctl {
@@ -15,14 +16,14 @@ namespace {
 void keepSecrets() {
     const rlimit none{0, 0};
     setrlimit(RLIMIT_CORE, &none);
-    wipeWhatOpenSSLFrees();
+    if (!platform::openssl::prepare()) throw std::runtime_error("OpenSSL is in use already");
 }
 
 int run(int argc, char** argv) {
     const auto parsed = parseCommandLine(argc, argv);
     if (const int* status = std::get_if<int>(&parsed)) return *status;
     const auto& invocation = std::get<Invocation>(parsed);
-    AgentConnection agent(invocation.service, invocation.timeout);
+    AgentConnection agent(invocation.service, invocation.timeout + invocation.arguments.waitSeconds);
     return invocation.command(agent, invocation.arguments);
 }
 

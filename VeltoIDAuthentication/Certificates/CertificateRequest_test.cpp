@@ -5,7 +5,7 @@
 #include <sstream>
 
 #include "Platform/KeyPair.h"
-#include "Tests/Support/TestAuthority.h"
+#include "TestSupport/TestAuthority.h"
 #include "VeltoIDKeychainItems/Keys.h"
 
 namespace veltoid {

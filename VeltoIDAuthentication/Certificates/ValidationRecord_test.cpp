@@ -5,7 +5,7 @@
 #include <random>
 
 #include "Platform/PropertyList.h"
-#include "Tests/Support/TestAuthority.h"
+#include "TestSupport/TestAuthority.h"
 #include "Values/ValueStream.h"
 
 namespace veltoid {

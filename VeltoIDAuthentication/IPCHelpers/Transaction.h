@@ -20,6 +20,12 @@ class Transaction {
         open_ = false;
     }
 
+    /// For one who gives it up while waiting.
+    void reopen() {
+        if (!open_) platform::transactions::began();
+        open_ = true;
+    }
+
     const std::string& name() const { return name_; }
 
   private:

@@ -11,6 +11,7 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDAuthenticationImpl/RequestPacing.h"
 
 namespace veltoid {
 namespace {
@@ -68,7 +69,7 @@ std::optional<bool> userActionOverride() {
 std::optional<bool> requiresUserAction(AccountState state) {
     if (const auto override = userActionOverride()) return override;
     if (state == AccountState::PasswordInaccessibleInKeychain)
-        return platform::hasBeenUnlockedSinceBoot() ? std::optional(true) : std::nullopt;
+        return platform::LockState::shared().hasBeenUnlockedSinceBoot() ? std::optional(true) : std::nullopt;
     return state == AccountState::PasswordInvalid;
 }
 
@@ -86,6 +87,8 @@ Dictionary copyAccountStatus(const String& name, const Dictionary& options) {
     if (state == AccountState::CertificatePending)
         if (const auto nextFetch = record.date("NextCertificateFetchDate"))
             status.set("NextFetchAttempt", Value::date(*nextFetch));
+    if (const auto held = requestsHeldUntil(record))
+        status.set(kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::date(*held));
     if (const auto required = requiresUserAction(state))
         status.set("AccountRequiresUserAction", Value::boolean(*required));
     return status;
@@ -103,7 +106,8 @@ Dictionary copyStatusOfEveryAccount(const Dictionary& options) {
 }  // namespace
 
 Dictionary copyDeviceStatusDictionary() {
-    return {{"DeviceUnlockedSinceBoot", Value::boolean(platform::hasBeenUnlockedSinceBoot())}};
+    return {{"DeviceUnlockedSinceBoot",
+             Value::boolean(platform::LockState::shared().hasBeenUnlockedSinceBoot())}};
 }
 
 Dictionary copyAccountStatusesDictionary(const Dictionary& options) {

@@ -5,9 +5,11 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
+#include "Platform/Clock.h"
 #include "Platform/EventLoop.h"
 #include "Values/DictionaryAccess.h"
 #include "Values/LowerCase.h"
+#include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/AccountStatus.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -23,11 +25,17 @@
 #include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/FindPerson.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
 namespace {
 
 constexpr const char* kHandlerName = "handleAuthenticationIPCMessage";
+
+// How long an add that waits for its certificate lets pass between two looks at the account (seconds). The
+// account check, which does the work, makes a pass every five seconds at the most.
+constexpr double kShortestWait = 0.25;
+constexpr double kLongestWait = 3;
 
 /// Long enough for the reply to leave before the process ends (seconds).
 constexpr double kTerminationDelay = 0.1;
@@ -71,6 +79,41 @@ void forgetOtherAccounts(const String& added) {
             __VeltoIDForgetVeltoID(name.asString(), {{"RemovePrivateKeyFromKeychain", Value::boolean(true)}});
 }
 
+/// Lets some time pass before the account is looked at again: until its next action, but not for long.
+void waitForNextAction(const String& accountName) {
+    const double now = platform::Clock::shared().now();
+    std::optional<double> next;
+    if (!copyNextActionDateForAccount(accountName, &next) || !next || *next <= now)
+        next = now + kShortestWait;
+    const platform::Semaphore nobodySignals;
+    (void)nobodySignals.wait(std::clamp(*next - now, kShortestWait, kLongestWait));
+}
+
+/// Waits for the account's certificate as long as option "certwaitduration" says; false when there will be
+/// none without somebody's doing. While the certificate is on its way this is a success.
+bool waitForCertificate(const Request& request) {
+    const double duration = getDouble(&request.options(), "certwaitduration", 0);
+    if (!(duration > 0)) return true;
+    Dictionary options = request.options();
+    options.set("CheckNetwork", Value::boolean(true));
+    const auto& clock = platform::Clock::shared();
+    for (const double deadline = clock.now() + duration; clock.now() <= deadline;) {
+        wakeAccountCheck();
+        switch (checkAccountAndDetermineNextAction(request.account(), options)) {
+            case AccountState::NoEncodedDSID:
+            case AccountState::PasswordInaccessibleInKeychain:
+            case AccountState::PasswordInvalid:
+                return false;
+            case AccountState::CertificateOK:
+            case AccountState::CertificateAssumedOK:
+                return true;
+            default:
+                waitForNextAction(request.account());
+        }
+    }
+    return true;
+}
+
 Outcome addAccount(Request& request) {
     Outcome outcome;
     String encDsId;
@@ -82,7 +125,9 @@ Outcome addAccount(Request& request) {
     __VeltoIDDBSetAccountValue(request.account(), kVeltoIDAccountLastValidationDateKey, Value::null(), true);
     request.answer("encDsId", encDsId);
     if (record) request.answer("accountinfo", *record);
+    wakeAccountCheck();
     forgetOtherAccounts(request.account());
+    outcome.success = waitForCertificate(request);
     return outcome;
 }
 
@@ -197,6 +242,12 @@ Outcome copyAllContents(Request& request) {
     return {success, {}};
 }
 
+Outcome check(Request& request) {
+    const AccountState state = checkAccountAndDetermineNextAction(request.account(), request.options());
+    request.answer("status", Value::int64(static_cast<int64_t>(state)));
+    return {true, {}};
+}
+
 void terminateAfterReply() {
     platform::WorkQueue::main().asyncAfter(kTerminationDelay, [] {
         VELTOID_LOG_FROM(
@@ -238,6 +289,7 @@ constexpr Command kCommands[] = {
     {0x200, setBreadcrumb},
     {0x201, copyBreadcrumb},
     {0x500, copyAllContents},
+    {0x501, check},
     {0x510, status},
 };
 

@@ -11,10 +11,12 @@
 #include "Logging/Log.h"
 #include "Platform/Clock.h"
 #include "Platform/EventLoop.h"
-#include "Platform/MessageService.h"
+#include "Platform/Succession.h"
 #include "Platform/SystemLog.h"
-#include "Platform/Transactions.h"
+#include "Platform/WorkQueue.h"
+#include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/CommandLine.h"
+#include "VeltoIDAuthd/Leaving.h"
 #include "VeltoIDAuthd/Listeners.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/Accounts.h"
@@ -30,9 +32,6 @@ namespace {
 
 /// A relaunch is asked for at start, so that an agent that dies early comes back (seconds).
 constexpr double kRelaunchAfterStart = 30;
-
-/// How long open transactions may hold up the end after SIGTERM (seconds).
-constexpr double kLongestTermination = 10;
 
 /// Memory of this process holds password hashes: it is never written to a core file, nor open to debuggers.
 void keepMemoryPrivate() {
@@ -51,26 +50,9 @@ void keepMemoryPrivate() {
     platform::event_loop::exitProcess(-1);
 }
 
-void exitOnce() {
-    __VeltoIDDBSynchronize();
-    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
-}
-
-/// The listeners save what they have, requests in work are finished, and the agent leaves.
-void terminate() {
-    platform::message_service::announceTermination();
-    platform::transactions::whenNoneIsOpen(exitOnce);
-    platform::WorkQueue::main().asyncAfter(kLongestTermination, exitOnce);
-}
-
-/// Without its bus the agent can be reached by nobody and hold up the end of a log-in session: it leaves as
-/// on SIGTERM.
-void leaveWithTheBus() { platform::message_service::onConnectionLost(terminate); }
-
-void handleSignals() {
+void flushOnInterrupt() {
     static const auto* flushQueue = new platform::WorkQueue("flush on interrupt");
     platform::event_loop::onSignal(SIGINT, [] { flushQueue->async([] { __VeltoIDDBSynchronize(); }); });
-    platform::event_loop::onSignal(SIGTERM, terminate);
 }
 
 void prepareDatabase(const CommandLine& line) {
@@ -85,19 +67,21 @@ void prepareDatabase(const CommandLine& line) {
 void startServices(const CommandLine& line) {
     if (line.runsAuthentication()) {
         scheduleRelaunch(platform::Clock::shared().now() + kRelaunchAfterStart, true);
+        startAccountCheck(kVeltoIDFirstAccountCheckDelay);
         registerAuthenticationListener(
             line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
     }
     if (line.checkPassword) registerPasswordCheckListener();
 }
 
-/// Every account is validated at its next check.
+/// Every account is validated, at once unless the account check is about to start anyway.
 void forceValidationOfEveryAccount() {
     Array names;
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names)
         __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true),
                                    true);
+    startAccountCheck(0);
 }
 
 }  // namespace
@@ -113,10 +97,11 @@ int main(int argc, char** argv) {
     CommandLineError error;
     const auto line = parseCommandLine(argc, argv, error);
     if (!line) exitWithUsage(argc, argv, error);
+    if (line->usePreferences) platform::succession::waitForPrevious();
     prepareDatabase(*line);
     setRelaunchScheduler(scheduleRelaunch);
-    handleSignals();
-    leaveWithTheBus();
+    flushOnInterrupt();
+    prepareLeaving();
     startServices(*line);
     if (line->leaks) forceValidationOfEveryAccount();
     platform::event_loop::run();

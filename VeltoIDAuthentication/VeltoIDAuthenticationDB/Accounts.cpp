@@ -240,6 +240,20 @@ bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
     });
 }
 
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, Dictionary* removed) {
+    return database::perform([&](Store& store) {
+        const Dictionary* existing = Store::find(store.accounts, name);
+        if (existing == nullptr) return false;
+        *removed = *existing;
+        Dictionary accounts = store.accounts;
+        accounts.remove(name.view());
+        if (!store.replace(&Store::accounts, std::move(accounts), true)) return false;
+        if (const Data reference = removed->data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+            removePasswordFromKeychainGivenPersistentRef(reference);
+        return true;
+    });
+}
+
 std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates) {
     return database::perform([&](Store& store) -> std::optional<Array> {
         Array names;

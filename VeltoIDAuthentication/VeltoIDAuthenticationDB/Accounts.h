@@ -52,6 +52,10 @@ Value __VeltoIDDBCopyAccountValue(const String& name, const String& key);
 /// record: -108.
 bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error = nullptr);
 
+/// Removes the record with its password item, in one step: a new record of that name would take the item up.
+/// Hands the record out; false without one, or when the change cannot be stored.
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, Dictionary* removed);
+
 /// The names of the dirty records; none when there are none. With `clear` the marks of all records go (of
 /// certificate entries too with `includeCertificates`), in memory until the section is next written.
 std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates);

@@ -38,6 +38,10 @@ inline constexpr std::string_view kVeltoIDAccountCertificateTokenExpirationKey =
 inline constexpr std::string_view kVeltoIDAccountCSRGenerationDateKey = "CSRGenerationDate";
 /// Seconds.
 inline constexpr std::string_view kVeltoIDAccountCSRGenerationIntervalKey = "CSRGenerationInterval";
+/// Dates of the last requests that were sent, and until when further ones are held up.
+inline constexpr std::string_view kVeltoIDAccountCertificateRequestDatesKey = "CertificateRequestDates";
+inline constexpr std::string_view kVeltoIDAccountCertificateRequestsHeldUntilKey =
+    "CertificateRequestsHeldUntil";
 inline constexpr std::string_view kVeltoIDAccountCSRCreationDateKey = "CSRCreationDate";
 inline constexpr std::string_view kVeltoIDAccountCertificateNextCertificateFetchDateKey =
     "NextCertificateFetchDate";
@@ -55,6 +59,9 @@ inline constexpr std::string_view kVeltoIDAccountValidationRecordDataKey =
     "VeltoIDAccountValidationRecordData";
 inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckDateKey =
     "VeltoIDAccountValidationRecordNextCheckDateKey";
+/// Seconds.
+inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckIntervalKey =
+    "VeltoIDAccountValidationRecordNextCheckIntervalKey";
 inline constexpr std::string_view kVeltoIDAccountValidationRecordValidAsOfKey =
     "VeltoIDAccountValidationRecordValidAsOfKey";
 /// Seconds.
@@ -78,6 +85,8 @@ inline constexpr std::string_view kVeltoIDCertificateExpirationDateKey = "Expire
 inline constexpr std::string_view kVeltoIDCertificateSerialNumberKey = "SerialNumber";
 inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey =
     "LastSuccessfulValidation";
+
+inline constexpr std::string_view kVeltoIDCertificateLastValidationAttemptDateKey = "LastValidationAttempt";
 
 /// Statuses of certificates, and of requests for one.
 inline constexpr std::string_view kVeltoIDCertificateStatusPending = "SIGNIN_PENDING";

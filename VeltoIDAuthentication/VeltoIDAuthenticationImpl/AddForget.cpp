@@ -11,7 +11,6 @@
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
 #include "VeltoIDAuthenticationImpl/NotificationNames.h"
-#include "VeltoIDKeychainItems/Passwords.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -97,19 +96,19 @@ AddOutcome addAnew(const String& accountName, const String& hashedPassword, cons
 }
 
 /// The record with its password item, and the certificate unless another account has the same encDsId.
-void forget(const String& accountName, const Dictionary& record, const DroppedItems& dropped) {
+void forget(const String& accountName, const DroppedItems& dropped) {
     const CustodyLock custody;
     cleanUpAccountsAndCertificates(custody);
     // The pending request's key has no certificate that anybody could still want it for.
     discardPendingKey(custody, accountName);
-    __VeltoIDDBRemoveVeltoIDAccount(accountName);
+    // The record as it is now: others may have forgotten it, or added it again, since it was looked for.
+    Dictionary record;
+    if (!__VeltoIDDBRemoveVeltoIDAccountAndPassword(accountName, &record)) return;
     const String encDsId = record.string(kVeltoIDAccountDSIDKey);
     if (!encDsId || !__VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr)) {
         discardCertificate(custody, encDsId, dropped);
         discardStrayItems(custody, accountName, dropped);
     }
-    if (const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-        removePasswordFromKeychainGivenPersistentRef(reference);
 }
 
 }  // namespace
@@ -135,9 +134,8 @@ bool __VeltoIDForgetVeltoID(const String& accountName, const Dictionary& options
         auto& notifications = platform::Notifications::shared();
         Dictionary record;
         if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) {
-            forget(accountName, record,
-                   {getBool(&options, "RemoveCertificateFromKeychain", true),
-                    getBool(&options, "RemovePrivateKeyFromKeychain", true)});
+            forget(accountName, {getBool(&options, "RemoveCertificateFromKeychain", true),
+                                 getBool(&options, "RemovePrivateKeyFromKeychain", true)});
             notifications.post(kVeltoIDAccountAddedOrRemovedNotification);
             notifications.post(kVeltoIDAccountChangeNotification);
             return true;

@@ -9,6 +9,7 @@
 #include "VeltoIDAuthenticationDB/Accounts.h"
 #include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationImpl/FetchDelays.h"
+#include "VeltoIDAuthenticationImpl/RequestPacing.h"
 #include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
 #include "VeltoIDKeychainItems/Keys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -47,7 +48,9 @@ class SigningRequest {
 
     bool run() {
         Dictionary record;
-        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_)) return false;
+        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_) ||
+            !admitRequest(accountName_, record, &held_))
+            return false;
         const String password = __VeltoIDDBCopyHashedPassword(record);
         VELTOID_LOG_FROM(kRequestFunction, kNotice,
                          "VeltoIDAuth: Creating CSR for " << accountName_.view() << ".");
@@ -102,6 +105,7 @@ class SigningRequest {
 
     bool send(VeltoIDAuthenticationSessionInfo& session) {
         const double sent = now();
+        noteRequest(accountName_);
         String token;
         CertificateAnswer answer;
         if (!__VeltoIDSessionDoSendCSR(session, encDsId_, request_, options_, &token, &answer, &held_))
@@ -262,6 +266,7 @@ void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dict
     if (wasTriedRecently(record)) {
         held = VELTOID_ERROR(identity_error::kNotYet);
     } else if (const String password = __VeltoIDDBCopyHashedPassword(record)) {
+        __VeltoIDDBSetAccountValue(accountName, kVeltoIDMetaLastConnectAttemptKey, Value::date(now()), false);
         String encDsId;
         Session session =
             __VeltoIDSessionDoCreateSession(accountName, password, options, &encDsId, nullptr, &held);

@@ -3,22 +3,17 @@
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
 #include "Certificates/CertificateRequest.h"
-#include "Platform/FakeNotifications.h"
-#include "Platform/KeyPair.h"
-#include "Tests/Support/TestAuthority.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
-#include "VeltoIDKeychainItems/Certificates.h"
+#include "VeltoIDAuthenticationImpl/RequestPacing.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
-#include "VeltoIDKeychainItems/Keys.h"
-#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
 
 namespace veltoid {
 namespace {
 
 using testing_support::pemOf;
-using testing_support::TestAuthority;
 
 constexpr double kDay = 86'400;
 constexpr const char* kToken = "CertificateToken";
@@ -32,79 +27,7 @@ constexpr const char* kKeyReference = "CertificatePrivateKeyReference";
 constexpr const char* kCertificateReference = "CertificateReference";
 constexpr const char* kIntermediateReference = "IntermediateCertificateReference";
 
-class IssuanceTest : public ServerTest {
-  protected:
-    void SetUp() override {
-        ServerTest::SetUp();
-        createAccount("d1");
-        setValue("Dirty", {});
-        server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
-        server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}});
-        server_.answer("downloadCertComplete", Dictionary{{"done", "yes"}});
-        setRelaunchScheduler([this](std::optional<double> date, bool force) {
-            EXPECT_TRUE(force);
-            relaunches_.push_back(*date - now());
-        });
-    }
-    void TearDown() override {
-        setRelaunchScheduler([](std::optional<double>, bool) {});
-        ServerTest::TearDown();
-    }
-
-    /// What the server says of a certificate that it has just issued for the last request.
-    Dictionary issued(const Dictionary& changes = {}) {
-        const auto certificate = intermediate_.issue(requested_);
-        Dictionary dsCert = {
-            {"Certificate", pemOf(certificate)}, {"IntermediateCert", pemOf(intermediate_.certificate())},
-            {"CertStatus", "CERT_ISSUED"},       {"SerialNumber", "1A2B3C"},
-            {"Expires", date(100 * kDay)},       {"CertType", "client"}};
-        for (const auto& [key, value] : changes) {
-            if (value.isNull())
-                dsCert.remove(key.view());
-            else
-                dsCert.set(key, value);
-        }
-        return dsCert;
-    }
-
-    /// The server takes requests and answers with what `reply` makes.
-    void onRequest(std::function<Dictionary()> reply) {
-        server_.answerWith("createCert", [this, reply = std::move(reply)](const Dictionary& parameters) {
-            requested_ = testing_support::readRequest(parameters.string("CSR").text()).publicKey;
-            EXPECT_EQ(parameters["encDsId"], Value("d1"));
-            return reply();
-        });
-    }
-    void issueAtOnce() {
-        onRequest([this] { return Dictionary{{"dsCert", issued()}}; });
-    }
-
-    bool request(const Dictionary& options = {}) {
-        error_.reset();
-        return __VeltoIDDoCreateCertificateRequestForVeltoID(kName, options, nullptr, &error_);
-    }
-    bool fetch(bool force = false) {
-        error_.reset();
-        return __VeltoIDDoFetchCertificateForVeltoID(kName, force, {}, &error_);
-    }
-    bool update(const std::optional<Dictionary>& result, const Value& delay = {}) {
-        error_.reset();
-        return updateAccountWithCertificateResult(CustodyLock(), kName, "d1", {result, delay}, &error_);
-    }
-    int64_t takeCode() const { return error_ ? error_->code : 0; }
-    /// Seconds from now of a Date in the record.
-    double in(const char* key) const { return record().date(key).value_or(-1e12) - now(); }
-
-    static size_t keys() { return copyAllKeysFromKeychain().value_or(Array()).size(); }
-    static size_t certificates() { return copyAllCertificatesFromKeychain().value_or(Array()).size(); }
-
-    platform::FakeNotifications notifications_;
-    const TestAuthority root_{"Root"};
-    const TestAuthority intermediate_{"Intermediate", &root_};
-    testing_support::Bytes requested_;
-    std::vector<double> relaunches_;
-    std::optional<Error> error_;
-};
+using IssuanceTest = CertificateTest;
 
 TEST_F(IssuanceTest, ACertificateThatIsIssuedAtOnceIsKeptWithAllThatBelongsToIt) {
     issueAtOnce();
@@ -300,6 +223,7 @@ TEST_F(IssuanceTest, TheDelayOfATokenIsBelievedUpToADay) {
     for (const auto& [delay, stored] :
          {Case{number(0), 0}, Case{number(86'400), 86'400}, Case{number(100'000), 15}, Case{number(-5), 15},
           Case{Value::real(0.5), 0.5}, Case{Value::real(1e300), 15}}) {
+        clock_.advanceBy(3'600);
         onRequest([delay = delay] { return Dictionary{{"CertificateToken", "t"}, {"Delay", delay}}; });
         ASSERT_TRUE(request());
         EXPECT_EQ(in(kFetchDate), stored);
@@ -597,6 +521,30 @@ TEST_F(IssuanceTest, CleaningUpTakesWhatIsOfNoUse) {
     clock_.advanceBy(2);
     EXPECT_TRUE(__VeltoIDCleanupAccountsAndCertificates({}));
     EXPECT_FALSE(record().contains("EarliestAllowedConnectionDate"));
+}
+
+TEST_F(IssuanceTest, AnAccountThatAsksOverAndOverIsHeldUp) {
+    issueAtOnce();
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_TRUE(request()) << i;
+        clock_.advanceBy(600);
+    }
+    (void)server_.take();
+    setValue(kInterval, number(7'200));
+    EXPECT_FALSE(request()) << "the fourth within an hour";
+    EXPECT_EQ(takeCode(), 99);
+    EXPECT_EQ(server_.takeMethods(), "");
+    EXPECT_EQ(keys(), 1U) << "what there is stays";
+    EXPECT_EQ(record()["CertificateRequestsHeldUntil"], date(7'200));
+    EXPECT_EQ(nextRequestDate(record()), now() + 7'200);
+    clock_.advanceBy(7'000);
+    EXPECT_FALSE(request());
+    EXPECT_EQ(log_.count(" certificates within an hour and wants another one"), 1);
+    clock_.advanceBy(200);
+    EXPECT_TRUE(request());
+    EXPECT_EQ(requestsHeldUntil(record()), std::nullopt);
+    setValue("CertificateRequestsHeldUntil", date(1e9));
+    EXPECT_TRUE(request()) << "no clock that was right has noted that";
 }
 
 }  // namespace

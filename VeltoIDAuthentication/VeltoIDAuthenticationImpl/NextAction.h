@@ -8,25 +8,44 @@
 
 namespace veltoid {
 
-/// State of an account, as far as it can be told from what is stored on the device.
+/// State of an account; it tells what is to be done next.
 enum class AccountState : int {
     NoEncodedDSID = -6,
     PasswordInaccessibleInKeychain = -5,
+    /// There is none, or the server refuses it.
     PasswordInvalid = -4,
     NoCertificate = -3,
     CertificateRevoked = -2,
     CertificateExpired = -1,
+    /// No decision.
     Unknown = 0,
+    /// Evaluated now.
     CertificateOK = 1,
+    /// Not evaluated now, but not long ago.
     CertificateAssumedOK = 2,
     CertificateShouldBeRenewed = 3,
     CertificateMustBeRenewed = 4,
     ValidationRecordNeedsToBeUpdated = 5,
+    /// A request for one is pending.
     CertificatePending = 10,
 };
 
-/// The state of the account; Unknown comes with an error (-100) when no account was given, and without one
-/// for an account whose certificate would have to be examined. Caller's queue; no network.
+/// Servers of this version and later give out validation records.
+inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
+
+/// How long the account's information, and its certificate, count as validated (seconds).
+double accountValidationInterval(const String& accountName);
+double certificateValidationInterval(const String& accountName);
+
+/// Examines the account in this order: password, encDsId, pending request, information, certificate (status,
+/// dates, the server's word on it, its items in the keychain, its trust), renewal, validation record. Without
+/// an account Unknown with an error (-100); any other state comes without one.
+///
+/// Options (Booleans, default false): "CheckNetwork" (the server may be asked, unless the account is under an
+/// embargo), "ForceValidation" (evaluate the certificate even if that was done not long ago);
+/// "PreExpirationInterval" (a Number of seconds). What is stored changes only as far as the examination goes:
+/// dates of attempts, due dates put off, what the server says. Caller's queue; blocks while the server is
+/// asked.
 AccountState checkAccountAndDetermineNextAction(const String& accountName, const Dictionary& options,
                                                 ErrorOut error = nullptr);
 

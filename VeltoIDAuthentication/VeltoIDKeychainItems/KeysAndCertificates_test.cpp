@@ -4,7 +4,7 @@
 #include "Platform/KeyPair.h"
 #include "Platform/Keychain.h"
 #include "Platform/TemporaryStateDirectory.h"
-#include "Tests/Support/TestAuthority.h"
+#include "TestSupport/TestAuthority.h"
 #include "VeltoIDKeychainItems/Certificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDKeychainItems/Keys.h"

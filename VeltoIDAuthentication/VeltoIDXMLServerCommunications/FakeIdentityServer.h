@@ -34,18 +34,19 @@ class FakeIdentityServer {
     }
 
     // What every call of the method gets from now on. Unset methods get a fault.
-    void answer(const std::string& method, const Value& reply) { set(method, success(reply)); }
-    /// A reply that depends on the parameters of the call.
+    void answer(const std::string& method, const Value& reply) { set(method, answerOf(reply)); }
+    /// A reply that depends on the parameters of the call; an Error is a fault with its code, or, in domain
+    /// kNoAnswer, that HTTP status.
     void answerWith(const std::string& method, std::function<Value(const Dictionary& parameters)> reply) {
         const std::lock_guard lock(mutex_);
         answers_[method] = [reply = std::move(reply)](const Dictionary& parameters) {
-            return success(reply(parameters));
+            return answerOf(reply(parameters));
         };
     }
-    void fault(const std::string& method, int64_t code) {
-        const Dictionary fault = {{"faultCode", Value::int64(code)}, {"faultString", "because"}};
-        set(method, {200, "<fault>" + encoded(fault) + "</fault>"});
-    }
+    static constexpr const char* kNoAnswer = "no answer";
+    static Value noAnswer() { return Error{kNoAnswer, 503, {}}; }
+    static Value faultOf(int64_t code) { return Error{"fault", code, {}}; }
+    void fault(const std::string& method, int64_t code) { set(method, answerOf(faultOf(code))); }
     void refuse(const std::string& method, int status) { set(method, {status, ""}); }
 
     /// The calls since the last time.
@@ -64,8 +65,12 @@ class FakeIdentityServer {
   private:
     using StatusAndContent = std::pair<int, std::string>;
 
-    static StatusAndContent success(const Value& reply) {
-        return {200, "<params><param>" + encoded(reply) + "</param></params>"};
+    static StatusAndContent answerOf(const Value& reply) {
+        const Error* error = reply.asError();
+        if (error == nullptr) return {200, "<params><param>" + encoded(reply) + "</param></params>"};
+        if (error->domain == kNoAnswer) return {static_cast<int>(error->code), ""};
+        const Dictionary fault = {{"faultCode", Value::int64(error->code)}, {"faultString", "because"}};
+        return {200, "<fault>" + encoded(fault) + "</fault>"};
     }
 
     static std::string encoded(const Value& value) {

@@ -1,4 +1,4 @@
-#include "Tests/Support/TestAuthority.h"
+#include "TestSupport/TestAuthority.h"
 
 #include <openssl/bio.h>
 #include <openssl/cms.h>

@@ -1,0 +1,155 @@
+// The agent's account check through years of an identity server's good and bad days, in simulated time:
+// everything but the connection and the clock is real. VELTOID_YEARS says how many (default 1;
+// sanitizers pass less).
+#include <cstdlib>
+
+#include "TestSupport/SimulatedIdentityServer.h"
+#include "VeltoIDAuthd/AccountCheck.h"
+#include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
+
+namespace veltoid {
+namespace {
+
+using testing_support::Period;
+using testing_support::SimulatedIdentityServer;
+
+constexpr double kHour = 3'600;
+constexpr double kDay = 24 * kHour;
+/// Between two looks at the agent from outside.
+constexpr double kLook = 4 * kHour;
+
+double yearsToPass() {
+    const char* text = std::getenv("VELTOID_YEARS");  // NOLINT(concurrency-mt-unsafe): no other thread yet
+#ifdef VELTOID_SANITIZED
+    constexpr double kDefault = 0.2;
+#else
+    constexpr double kDefault = 1;
+#endif
+    return text != nullptr ? std::strtod(text, nullptr) : kDefault;
+}
+
+/// Drives the agent through the time and looks at it at every pass, and every few hours between them.
+class SimulatedYear : public CertificateTest {
+  protected:
+    void SetUp() override {
+        CertificateTest::SetUp();
+        setRelaunchScheduler(scheduleRelaunch);
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        observeAccountCheck([this] { atPass(); });
+    }
+    void TearDown() override {
+        doNotCompareWithDisk();
+        for (const std::string& name : names_) __VeltoIDForgetVeltoID(name, {});
+        EXPECT_EQ(keys() + certificates(), 0U) << "years leave no item behind";
+        CertificateTest::TearDown();
+    }
+
+    void live(const SimulatedIdentityServer::Configuration& configuration, int accounts) {
+        SimulatedIdentityServer server(server_, clock_, configuration);
+        trust(server.root());
+        for (int i = 0; i < accounts; ++i) {
+            names_.push_back("account" + std::to_string(i) + "@velto.example");
+            ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(names_.back(), kPassword, nullptr));
+        }
+        startAccountCheck(kVeltoIDFirstAccountCheckDelay);
+        const double begin = now();
+        const double end = begin + configuration.years * 365 * kDay;
+        while (now() < end && !HasFailure()) {
+            clock_.advanceBy(kLook);
+            clock_.settle();
+            (void)server_.take();
+            expectTimelyRelaunch();
+            if (now() > begin + 2 * kDay) expectCertificates(server);
+        }
+        EXPECT_EQ(server.signInsDuringEmbargo(), 0);
+        for (const std::string& name : names_) expectSpacing(server.requests(name));
+        const auto& events = server.events();
+        std::printf(
+            "%d passes, %d certificates, %d refusals, %d revocations, %d embargoes, %d calls without answer, "
+            "%d records tried again\n",
+            passes_, events.issued, events.refused, events.revoked, events.embargoes, events.unreachable,
+            retries_);
+        EXPECT_LT(passes_, configuration.years * 365 * 24 * accounts) << "less than one an hour";
+    }
+
+  private:
+    /// On the account check's queue.
+    void atPass() {
+        ++passes_;
+        EXPECT_TRUE(!lastPass_ || now() - *lastPass_ >= 5) << "passes keep their distance";
+        lastPass_ = now();
+        for (const std::string& name : names_) expectGrowingRetries(name);
+    }
+
+    /// A validation record that cannot be had is tried after 180 s, and then half as long again each time, up
+    /// to a random cap between one and two days.
+    void expectGrowingRetries(const std::string& name) {
+        const double before = retryIntervals_[name];
+        const double interval =
+            __VeltoIDDBCopyAccountValue(name, kVeltoIDAccountValidationRecordNextCheckIntervalKey)
+                .asDouble()
+                .value_or(0);
+        EXPECT_TRUE(interval == before || interval == 0 || interval == 1.5 * std::max(before, 180.0) ||
+                    (interval >= kDay && interval <= 2 * kDay && 1.5 * before >= interval))
+            << interval << " after " << before;
+        if (interval != before && interval > 0) ++retries_;
+        retryIntervals_[name] = interval;
+    }
+
+    /// Were the agent ended now, it would be back in time.
+    void expectTimelyRelaunch() {
+        std::optional<double> earliest;
+        const Array accounts = copyAccountsNeedingAction(&earliest);
+        const auto next = nextLaunchDate();
+        if (accounts.empty() || !earliest) return;
+        // What is due already is either about to be looked at or put off, for a day at the most.
+        EXPECT_TRUE(next && *next <= std::max(*earliest, now() + kDay))
+            << (next ? *next - now() : -1) << " instead of " << *earliest - now();
+    }
+
+    void expectCertificates(const SimulatedIdentityServer& server) {
+        // Time to notice that something is wrong (half a day between evaluations), and for a refused request.
+        if (!server.wasGood({now() - 3.5 * kDay, now()})) return;
+        for (const std::string& name : names_)
+            EXPECT_TRUE(__VeltoIDDBHasValidCertificate(name))
+                << name << " at " << now() << describeEntry(name);
+    }
+
+    static std::string describeEntry(const std::string& name) {
+        Dictionary record;
+        Dictionary entry;
+        __VeltoIDDBCopyVeltoIDAccount(name, &record);
+        __VeltoIDDBCopyCertificateInfo(record.string("encDsId"), &entry);
+        entry.remove("Certificate");
+        entry.remove("IntermediateCertificate");
+        record.remove("VeltoIDAccountValidationRecordData");
+        return describeValue(record) + describeValue(entry);
+    }
+
+    static void expectSpacing(const std::vector<double>& requests) {
+        for (size_t i = 1; i < requests.size(); ++i)
+            EXPECT_GE(requests[i] - requests[i - 1], kHour) << "one request in an interval";
+    }
+
+    std::vector<std::string> names_;
+    std::optional<double> lastPass_;
+    int passes_ = 0;
+    std::map<std::string, double> retryIntervals_;
+    int retries_ = 0;
+};
+
+TEST_F(SimulatedYear, OneAccountKeepsItsCertificate) { live({.seed = 1, .years = yearsToPass()}, 1); }
+
+TEST_F(SimulatedYear, FiveAccountsKeepTheirs) {
+    live({.seed = 2, .years = yearsToPass(), .certificateLifetime = 90 * kDay}, 5);
+}
+
+TEST_F(SimulatedYear, WithoutBadDaysHardlyAnythingHappens) {
+    live({.seed = 3, .years = yearsToPass() / 2, .hasBadDays = false}, 1);
+}
+
+}  // namespace
+}  // namespace veltoid

@@ -1,0 +1,164 @@
+// The status of an account in every state, each brought about as it comes about.
+#include "VeltoIDAuthd/AccountStatus.h"
+
+#include "Platform/FakeLockState.h"
+#include "VeltoIDAuthd/AccountActions.h"
+#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
+#include "VeltoIDKeychainItems/Passwords.h"
+
+namespace veltoid {
+namespace {
+
+constexpr double kDay = 86'400;
+
+class AccountStatusTest : public CertificateTest {
+  protected:
+    void SetUp() override {
+        CertificateTest::SetUp();
+        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        issueAtOnce();
+    }
+    void TearDown() override {
+        doNotCompareWithDisk();
+        CertificateTest::TearDown();
+    }
+
+    /// Adds the account, as a client does.
+    void add(bool withCertificate) {
+        const Dictionary options = {{"CreateCSRAsynchronously", flag(!withCertificate)}};
+        EXPECT_TRUE(__VeltoIDDoAddVeltoID(kName, kPassword, options, nullptr, nullptr));
+        (void)__VeltoIDDBCopyDirtyVeltoIDs(true, true);
+    }
+    void check() const { checkAccount(kName, record()); }
+
+    static Dictionary statusOf(const Dictionary& options) {
+        return *copyAccountStatusesDictionary(options).dictionary("AccountStatuses")->dictionary(kName);
+    }
+};
+
+TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
+    struct Case {
+        const char* state;
+        std::function<void()> comeAbout;
+        bool asksTheServer;
+        bool requiresAction;
+        /// When something happens next, from now; none: nothing will.
+        std::optional<double> next;
+    };
+    const auto after = [this](double seconds) { clock_.advanceBy(seconds); };
+    const auto setEntry = [](const char* key, const Value& value) {
+        __VeltoIDDBSetCertificateValue("d1", key, value, false);
+    };
+    const Case cases[] = {
+        {"NoEncodedDSID",
+         [&] {
+             server_.refuse("authenticate", 503);
+             add(false);
+             check();
+             (void)__VeltoIDDBCopyDirtyVeltoIDs(true, true);
+         },
+         false, false, 0},
+        {"PasswordInaccessibleInKeychain",
+         [&] {
+             add(true);
+             removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef"));
+         },
+         false, true, 14 * kDay - 1},
+        {"PasswordInvalid",
+         [&] {
+             add(true);
+             server_.fault("authenticate", -20101);
+             after(15 * kDay);
+             check();
+         },
+         true,
+         true,
+         {}},
+        {"NoCertificate", [&] { add(false); }, false, false, 0},
+        {"CertificateRevoked",
+         [&] {
+             add(true);
+             server_.answer("authenticate",
+                            Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", flag(false)}});
+             after(15 * kDay);
+         },
+         true, false, -kDay - 1},
+        {"CertificateExpired",
+         [&] {
+             add(true);
+             after(101 * kDay);
+         },
+         false, false, -87 * kDay - 1},
+        {"Unknown",
+         [&] {
+             add(true);
+             std::filesystem::remove(directory_.base() / "harbwell" / "identity-authority.pem");
+             setEntry("Dirty", flag(true));
+         },
+         true, false, 14 * kDay - 1},
+        {"CertificateOK",
+         [&] {
+             add(true);
+             setEntry("Dirty", flag(true));
+         },
+         true, false, 14 * kDay - 1},
+        {"CertificateAssumedOK", [&] { add(true); }, false, false, 14 * kDay - 1},
+        {"CertificateShouldBeRenewed",
+         [&] {
+             add(true);
+             setEntry("LastSuccessfulValidation", date(75 * kDay));
+             after(75 * kDay + 1);
+         },
+         false, false, -61 * kDay - 1},
+        {"VeltoIDValidationRecordNeedsToBeUpdated",
+         [&] {
+             server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(101)}});
+             add(true);
+         },
+         false, false, 0},
+        {"CertificatePending",
+         [&] {
+             onRequest([] { return Dictionary{{"CertificateToken", "t"}, {"Delay", number(70)}}; });
+             add(true);
+         },
+         false, false, 70},
+    };
+    for (const Case& each : cases) {
+        server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(100)}});
+        issueAtOnce();
+        trust(root_);
+        each.comeAbout();
+        const Dictionary status = statusOf({{"CheckNetwork", flag(each.asksTheServer)}});
+        EXPECT_EQ(status["AccountState"], Value(each.state));
+        EXPECT_EQ(status["AccountRequiresUserAction"], flag(each.requiresAction)) << each.state;
+        EXPECT_EQ(status["NextActionTime"], each.next ? date(*each.next) : Value()) << each.state;
+        EXPECT_EQ(status.contains("NextFetchAttempt"), std::string_view(each.state) == "CertificatePending");
+        __VeltoIDForgetVeltoID(kName, {});
+        clock_.advanceBy(2 * kDay);
+    }
+}
+
+TEST_F(AccountStatusTest, SaysNothingOfAPasswordThatMayYetBecomeReadable) {
+    const platform::FakeLockState lock(false);
+    add(false);
+    removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef"));
+    EXPECT_EQ(statusOf({})["AccountState"], Value("PasswordInaccessibleInKeychain"));
+    EXPECT_FALSE(statusOf({}).contains("AccountRequiresUserAction"));
+    EXPECT_EQ(copyAccountStatusesDictionary({})["DeviceUnlockedSinceBoot"], flag(false));
+}
+
+TEST_F(AccountStatusTest, TellsWhatHasChangedAndWhatIsHeldUp) {
+    add(false);
+    EXPECT_FALSE(copyAccountStatusesDictionary({}).contains("DirtyAccounts"));
+    setValue("Dirty", flag(true));
+    for (const char* key : {"DirtyAccounts", "DirtyAccountsAndCertificates"})
+        EXPECT_EQ(copyAccountStatusesDictionary({})[key], Value(Array{kName})) << "told, not taken";
+    for (int i = 0; i < 3; ++i) EXPECT_TRUE(request());
+    EXPECT_FALSE(statusOf({}).contains("CertificateRequestsHeldUntil"));
+    EXPECT_FALSE(request());
+    EXPECT_EQ(statusOf({})["CertificateRequestsHeldUntil"], date(kDay));
+}
+
+}  // namespace
+}  // namespace veltoid

@@ -1,0 +1,98 @@
+#include "VeltoIDAuthd/Leaving.h"
+
+#include <charconv>
+#include <cmath>
+#include <csignal>
+#include <cstdlib>
+#include <string_view>
+#include <utility>
+
+#include "Logging/Log.h"
+#include "Platform/EventLoop.h"
+#include "Platform/MessageService.h"
+#include "Platform/ServiceManager.h"
+#include "Platform/Succession.h"
+#include "Platform/Transactions.h"
+#include "Platform/WorkQueue.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+
+namespace veltoid {
+namespace {
+
+constexpr const char* kIdleExitVariable = "HARBWELL_IDLE_EXIT";
+
+/// How long the agent stays without anything to do (seconds).
+constexpr double kDefaultIdleExit = 30;
+
+/// How long open transactions may hold up the end after SIGTERM (seconds).
+constexpr double kLongestTermination = 10;
+
+/// 0 for never.
+double idleExitSeconds() {
+    const char* text = std::getenv(kIdleExitVariable);
+    if (text == nullptr) return kDefaultIdleExit;
+    const std::string_view number = text;
+    double seconds = 0;
+    const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), seconds);
+    if (error == std::errc() && end == number.data() + number.size() && std::isfinite(seconds) &&
+        seconds >= 0)
+        return seconds;
+    VELTOID_LOG_FROM("idleExitSeconds", kError,
+                     kIdleExitVariable << " is not a number of seconds; using " << kDefaultIdleExit << ".");
+    return kDefaultIdleExit;
+}
+
+void endProcess() {
+    __VeltoIDDBSynchronize();
+    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
+}
+
+/// Everything that was sent to the agent is answered. What it stored is made durable now, since it would keep
+/// the agent for a while otherwise; other work is finished.
+void endWhenWorkIsDone() {
+    __VeltoIDDBSynchronize();
+    platform::transactions::whenNoneIsOpen([] {
+        if (platform::transactions::openCount() > 0)
+            endWhenWorkIsDone();
+        else
+            endProcess();
+    });
+}
+
+void leave() {
+    static bool leaving = false;
+    if (std::exchange(leaving, true)) return;
+    // Before the names are free: a start that is asked for while the service manager believes that the agent
+    // runs would come to nothing.
+    platform::ServiceManager::shared().announceStopping();
+    platform::succession::holdUpNext();
+    platform::message_service::announceTermination();
+    platform::message_service::releaseNames(endWhenWorkIsDone);
+}
+
+void terminate() {
+    leave();
+    platform::WorkQueue::main().asyncAfter(kLongestTermination, endProcess);
+}
+
+void leaveWhenIdle(double seconds) {
+    platform::transactions::whenNoneWasOpenFor(seconds, [seconds] {
+        platform::ServiceManager::shared().canStartAgain([seconds](bool can) {
+            if (can && platform::transactions::openCount() == 0)
+                leave();
+            else
+                leaveWhenIdle(seconds);
+        });
+    });
+}
+
+}  // namespace
+
+void prepareLeaving() {
+    platform::event_loop::onSignal(SIGTERM, terminate);
+    // Without its bus it can be reached by nobody and hold up the end of a log-in session.
+    platform::message_service::onConnectionLost(terminate);
+    if (const double seconds = idleExitSeconds(); seconds > 0) leaveWhenIdle(seconds);
+}
+
+}  // namespace veltoid
