@@ -16,8 +16,8 @@ class LockState {
     /// True once the keychain's "after first unlock" key can be had.
     virtual bool hasBeenUnlockedSinceBoot() const = 0;
 
-    /// From now on calls `handler` on the main queue whenever the state changes; replaces an earlier handler. Null
-    /// ends that.
+    /// From now on calls `handler` on the main queue whenever the state changes; replaces an earlier handler.
+    /// Null ends that.
     virtual void onChange(std::function<void()> handler) = 0;
 };
 
