@@ -22,6 +22,10 @@ def say(text: str):
     print("\n" + textwrap.fill(text, 96), flush=True)
 
 
+def serial_of(shown: str) -> str:
+    return next(line.split()[1] for line in shown.splitlines() if line.strip().startswith("serial:"))
+
+
 class Story:
     def __init__(self, world: World):
         self.world = world
@@ -61,6 +65,7 @@ class Story:
         self.tell_of_the_account()
         self.tell_of_the_certificate()
         self.tell_of_people()
+        self.tell_of_the_agents_own_doing()
         self.tell_of_the_end()
 
     def tell_of_the_account(self):
@@ -76,7 +81,7 @@ class Story:
         self.insist(self.with_password("veltoidctl", "add", ACCOUNT), "signed in as")
         details = self.run("veltoidctl", "info", ACCOUNT)
         self.insist(details, "Jane", "Roe", ACCOUNT, "jane@roe.example", "encDsId")
-        self.insist(self.run("veltoidctl", "status"), "NoCertificate", "next action")
+        self.insist(self.run("veltoidctl", "status"), "next action")
         counts = world.server.counts()
         sent = world.server.received()[0]["parameters"]["pwdHash"]
         say(f"The server has seen {counts['authenticate']} sign-ins and {counts['getMyInfo']} requests for details. It was "
@@ -123,6 +128,27 @@ class Story:
         note.write_text("to whom it may concern\n")
         self.with_password("veltoidctl", "breadcrumb", "set", ACCOUNT, "note", "--input", str(note))
         self.insist(self.with_password("veltoidctl", "breadcrumb", "get", ACCOUNT, "note"), note.read_text())
+
+    def tell_of_the_agents_own_doing(self):
+        server = self.world.server
+        say("So far everything was asked for. Now the account is forgotten and added again, nobody asks for a certificate, "
+            "and the server has started to issue them for two minutes only: the agent's account check gets one by itself, "
+            "which the client waits for, and replaces it when three quarters of its time are over. This takes a minute and "
+            "a half.")
+        self.run("veltoidctl", "forget", ACCOUNT)
+        server.settings(certificateLifetime=120)
+        self.insist(self.with_password("veltoidctl", "add", ACCOUNT, "--wait", "60"), "it has a certificate")
+        self.insist(self.run("veltoidctl", "status", "--check"), "CertificateOK")
+        first = self.run("veltoidctl", "certificate", ACCOUNT)
+        requests = server.counts()["createCert"]
+        if not server.wait("createCert", requests + 1, 110):
+            sys.exit("demo: the certificate was not renewed")
+        # The next pass asks the server about the new certificate.
+        server.wait("getMyInfo", server.counts()["getMyInfo"] + 1, 20)
+        second = self.run("veltoidctl", "certificate", ACCOUNT)
+        if serial_of(first) == serial_of(second):
+            sys.exit("demo: the certificate is still the same")
+        server.reset_settings()
 
     def tell_of_the_end(self):
         world = self.world
