@@ -15,11 +15,13 @@ import os
 import pathlib
 import sqlite3
 import statistics
+import sys
 import time
 import unittest
 from collections import Counter
 from dataclasses import dataclass
 
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
 from load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, mix, sleep_until,
                           success_with, wait_for_certificate)
 from world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, World, hashed
