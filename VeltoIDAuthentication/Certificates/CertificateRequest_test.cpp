@@ -93,8 +93,7 @@ TEST(CertificateFromPEM, IsReadOrNone) {
     EXPECT_EQ(certificate->notAfter, 4'070'908'800);
     EXPECT_EQ(certificate->publicKey, pair->publicKey);
 
-    auto cut = der;
-    cut.resize(der.size() - 1);
+    const testing_support::Bytes cut(der.begin(), der.end() - 1);
     auto longer = der;
     longer.push_back(0);
     testing_support::CertificateContent undated;

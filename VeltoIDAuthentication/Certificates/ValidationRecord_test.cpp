@@ -23,8 +23,8 @@ TEST(ValidationRecord, YieldsItsContentWhenTheSignatureVerifies) {
     for (const std::string& content : {std::string(kPayload), std::string("a\nb\r\n\0c", 7), std::string()})
         EXPECT_EQ(verifyValidationRecord(Data(authority.sign(content))), dataOf(content));
 
-    auto cut = authority.sign(kPayload);
-    cut.resize(cut.size() - 1);
+    const auto whole = authority.sign(kPayload);
+    const testing_support::Bytes cut(whole.begin(), whole.end() - 1);
     auto longer = authority.sign(kPayload);
     longer.push_back(0);
     for (const auto& record :
