@@ -1,7 +1,5 @@
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
-#include <algorithm>
-
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
@@ -22,7 +20,6 @@ constexpr const char* kRequestFunction = "__VeltoIDDoCreateCertificateRequestFor
 
 // Seconds.
 constexpr double kDefaultDelayAfterFailedSignIn = 10;
-constexpr double kBackOffFactor = 1.5;
 constexpr double kReconnectInterval = 300;
 
 double now() { return platform::Clock::shared().now(); }
@@ -189,7 +186,7 @@ void putOffFetchAfterFailedSignIn(const String& accountName, const Dictionary& r
         accountName,
         {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(now() + delta)},
          {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-          Value::real(std::min(delta * kBackOffFactor, randomPollingDelay()))}},
+          Value::real(delayAfterFailedSignIn(delta))}},
         false);
 }
 

@@ -34,6 +34,8 @@ double delayAfterPending(double delay) {
     return delay < kLongestPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
 }
 
+double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
+
 std::optional<double> storedFetchDelta(const Dictionary& record) {
     return finite(record.number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey));
 }

@@ -16,6 +16,9 @@ double randomPollingDelay();
 /// The delay to note after a wait of `delay`.
 double delayAfterPending(double delay);
 
+/// The delay to note after one whose fetch ended with a sign-in that failed; never longer than a random one.
+double delayAfterFailedSignIn(double delay);
+
 /// The record's "NextCertificateFetchDelta", if that is a finite number.
 std::optional<double> storedFetchDelta(const Dictionary& record);
 
