@@ -14,6 +14,7 @@
 #include "Platform/Succession.h"
 #include "Platform/Transactions.h"
 #include "Platform/WorkQueue.h"
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {
@@ -42,15 +43,21 @@ double idleExitSeconds() {
     return kDefaultIdleExit;
 }
 
-void endProcess() {
+/// Now, instead of when it was planned for.
+void makeDurable() {
     __VeltoIDDBSynchronize();
+    __VeltoIDDBWriteFindPersonCache();
+}
+
+void endProcess() {
+    makeDurable();
     platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
 }
 
 /// Everything that was sent to the agent is answered. What it stored is made durable now, since it would keep
 /// the agent for a while otherwise; other work is finished.
 void endWhenWorkIsDone() {
-    __VeltoIDDBSynchronize();
+    makeDurable();
     platform::transactions::whenNoneIsOpen([] {
         if (platform::transactions::openCount() > 0)
             endWhenWorkIsDone();
