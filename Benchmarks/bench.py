@@ -10,6 +10,7 @@ from __future__ import annotations
 
 import argparse
 import datetime
+import functools
 import json
 import os
 import pathlib
@@ -27,9 +28,10 @@ from collections.abc import Iterator
 from dataclasses import dataclass
 
 ROOT = pathlib.Path(__file__).resolve().parent.parent
-sys.path.insert(0, str(ROOT / "scripts"))
+sys.path[:0] = [str(ROOT / "scripts"), str(ROOT / "Tests")]
 from world import (ACCOUNT, ADD, INFO, LIST, PASSWORD, PING, SERVICE, STATUS, Client, IdentityServer,  # noqa: E402
                      World, hashed)
+from load_test import CLIENTS as LOAD_CLIENTS, ping_times  # noqa: E402
 from jeepney import message_bus  # noqa: E402
 from jeepney.io.blocking import Proxy  # noqa: E402
 
@@ -44,8 +46,8 @@ RECORDS = 4500  # of the property list: about 4 MB in the XML form
 READINGS = 3  # of each list, each time that the program is started
 MANY_PEOPLE, FEW_PEOPLE = 100_000, 10
 
-# After the last request the agent still writes its database (3 s) and ends the threads that it no longer needs (10 s).
-SETTLING_SECONDS = 15
+# The agent first looks at its accounts 10 s after its start, and ends threads that had nothing to do for 10 s.
+SETTLING_SECONDS = 25
 
 
 @dataclass(frozen=True)
@@ -57,9 +59,10 @@ class Effort:
     parallel_milliseconds: int = 400
     calls: int = 15
     idle_seconds: int = 30
+    rush_seconds: int = 60
 
 
-QUICK = Effort(cold_starts=10, runs=5, pings=200, parallel_milliseconds=200, calls=5, idle_seconds=10)
+QUICK = Effort(cold_starts=10, runs=5, pings=200, parallel_milliseconds=200, calls=5, idle_seconds=10, rush_seconds=10)
 
 
 @dataclass(frozen=True)
@@ -139,6 +142,11 @@ def bus_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
         ours, reference = load("parallel", effort.runs, CLIENTS, effort.parallel_milliseconds)
         yield Row(f"ping, {CLIENTS} clients", f"{ours:,.0f}/s", f"{reference:,.0f}/s minimal service",
                   ours / reference, 0.8, at_least=True)
+
+
+def load_rows(effort: Effort) -> Iterator[Row]:
+    calm, rush = ping_times(effort.rush_seconds)
+    yield timing(f"ping, 99 of 100, {LOAD_CLIENTS} clients, with flood and wait", rush, calm, 5, " without")
 
 
 # --- Texts
@@ -384,18 +392,24 @@ def main() -> int:
     os.environ["VELTOID_AGENT"] = str(programs.agent)
     os.environ["HARBWELL_IDLE_EXIT"] = "0"  # the agent at rest is there to be looked at
 
-    rest = Rest(programs, effort)
-    rest.start()
     rows = []
     failures = []
+
+    def add(what: str, measure):
+        print(f"bench: {what}", flush=True)
+        try:
+            rows.extend(measure())
+        except Exception as error:  # the rest is still worth having
+            failures.append(f"{what}: {error}")
+
+    # All processors are needed for this one.
+    add("many clients", lambda: load_rows(effort))
+    rest = Rest(programs, effort)
+    rest.start()
     for what, measure in (("the bus", bus_rows), ("texts", text_rows),
                           ("property lists", property_list_rows), ("the find-person cache", find_person_rows),
                           ("certificates", certificate_rows), ("TLS", tls_rows)):
-        print(f"bench: {what}", flush=True)
-        try:
-            rows += measure(programs, effort)
-        except Exception as error:  # the rest is still worth having
-            failures.append(f"{what}: {error}")
+        add(what, functools.partial(measure, programs, effort))
     print("bench: waiting for the agent at rest", flush=True)
     rest.join()
     rows += rest.rows

@@ -17,8 +17,22 @@ inline constexpr const char* kNotificationInterface = "com.velto.harbwell.veltoi
 /// once).
 sd_bus* connection();
 
+/// Calls `serve` after each portion that was read from the bus. While it answers true it is called again
+/// though nothing new may have come. Once, before the connection is used.
+void afterReading(std::function<bool()> serve);
+
+/// Has `serve` called soon.
+void serveSoon();
+
+/// What was sent and the bus has not read yet, in bytes of the kernel's memory.
+size_t unreadBytes();
+
 /// Emits Posted(name); nothing happens without a connection that was opened before.
 void emitPosted(const std::string& name);
+
+/// Calls `handler` for the rest of the process when somebody posts that name, and once when the bus has begun
+/// to tell of it: what was posted before that is for the handler to find out.
+void onPosted(const std::string& name, std::function<void()> handler);
 
 /// Hands everything that was sent to the bus.
 void flush();

@@ -61,7 +61,10 @@ void prepare() {
     if (const int result = sd_event_default(&loop); result < 0) fail("creating", -result);
     wakeDescriptor = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (wakeDescriptor < 0) fail("creating wake descriptor", errno);
-    const int result = sd_event_add_io(loop, nullptr, wakeDescriptor, EPOLLIN, woken, nullptr);
+    sd_event_source* wake = nullptr;
+    int result = sd_event_add_io(loop, &wake, wakeDescriptor, EPOLLIN, woken, nullptr);
+    // Before new messages: among the tasks are replies, which later ones must not overtake.
+    if (result >= 0) result = sd_event_source_set_priority(wake, SD_EVENT_PRIORITY_IMPORTANT);
     if (result < 0) fail("watching wake descriptor", -result);
     main_queue::adopt(wakeLoop);
 }

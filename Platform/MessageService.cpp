@@ -11,6 +11,7 @@
 
 #include "Platform/BusConnection.h"
 #include "Platform/BusMessage.h"
+#include "Platform/BusPeer.h"
 #include "Platform/ServiceManager.h"
 #include "Platform/SystemLog.h"
 #include "Platform/Transactions.h"
@@ -106,62 +107,6 @@ class BusRequest : public IncomingMessage {
     bool replied_ = false;
 };
 
-/// Main thread, except that events run on the target queue.
-class BusPeer : public PeerConnection {
-  public:
-    BusPeer(pid_t processID, uid_t userID) : processID_(processID), userID_(userID) {}
-    ~BusPeer() override { sd_bus_track_unref(track_); }
-    BusPeer(const BusPeer&) = delete;
-    BusPeer& operator=(const BusPeer&) = delete;
-
-    pid_t processID() const override { return processID_; }
-    uid_t userID() const override { return userID_; }
-    void setTargetQueue(WorkQueue queue) override { queue_ = std::move(queue); }
-    void setEventHandler(std::function<void(const PeerEvent&)> handler) override {
-        handler_ = std::make_shared<std::function<void(const PeerEvent&)>>(std::move(handler));
-    }
-    void setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) override {
-        answeredAtOnce_ = std::move(test);
-    }
-
-    void resume() override {
-        resumed_ = true;
-        for (PeerEvent& event : std::exchange(waiting_, {})) deliver(std::move(event));
-    }
-
-    void deliver(PeerEvent event) {
-        if (!resumed_) {
-            waiting_.push_back(std::move(event));
-            return;
-        }
-        if (!handler_) return;
-        const auto* message = std::get_if<std::shared_ptr<IncomingMessage>>(&event);
-        const bool atOnce = message != nullptr && answeredAtOnce_ && answeredAtOnce_(**message);
-        const WorkQueue::Task task = [handler = handler_, event = std::move(event)] { (*handler)(event); };
-        if (!atOnce || !queue_.tryRunNow(task)) queue_.async(task);
-    }
-
-    /// Calls `gone`, possibly more than once, when the bus says that the name has left it. The context lives
-    /// as long as this peer.
-    template <typename Context>
-    void watch(sd_bus* bus, sd_bus_track_handler_t gone, std::shared_ptr<Context> context) {
-        watchContext_ = context;
-        if (sd_bus_track_new(bus, &track_, gone, context.get()) >= 0)
-            sd_bus_track_add_name(track_, context->name.c_str());
-    }
-
-  private:
-    const pid_t processID_;
-    const uid_t userID_;
-    WorkQueue queue_ = WorkQueue::main();
-    std::shared_ptr<std::function<void(const PeerEvent&)>> handler_;
-    std::function<bool(IncomingMessage&)> answeredAtOnce_;
-    std::vector<PeerEvent> waiting_;
-    bool resumed_ = false;
-    std::shared_ptr<void> watchContext_;
-    sd_bus_track* track_ = nullptr;
-};
-
 class BusListener;
 
 /// The named services of this process. Main thread only.
@@ -205,6 +150,7 @@ class BusListener : public Listener {
     void resume() override {
         sd_bus* bus = bus::connection();
         int result = bus != nullptr ? addObject(bus) : -ENOTCONN;
+        if (result >= 0 && name_.empty()) return;
         if (result >= 0)
             result = sd_bus_request_name_async(bus, nullptr, name_.c_str(), 0, nameRequested, this);
         if (result >= 0) {
@@ -218,7 +164,7 @@ class BusListener : public Listener {
     /// False when there is nothing to wait for.
     bool releaseName() const {
         sd_bus* bus = bus::connection();
-        return bus != nullptr &&
+        return bus != nullptr && !name_.empty() &&
                sd_bus_release_name_async(bus, nullptr, name_.c_str(), nameReleased, nullptr) >= 0;
     }
 
@@ -239,6 +185,7 @@ class BusListener : public Listener {
 
     static int addObject(sd_bus* bus) {
         if (std::exchange(Services::shared().objectAdded, true)) return 0;
+        bus::afterReading(BusPeer::serveWaiting);
         const int result = sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kMessageInterface,
                                                     kMessageInterfaceTable, nullptr);
         if (result < 0) return result;
@@ -289,7 +236,7 @@ class BusListener : public Listener {
     void watchPeer(const std::string& name) {
         const auto peer = peers_.find(name);
         if (peer == peers_.end()) return;
-        peer->second->watch(bus::connection(), peerGone, std::make_shared<Watch>(Watch{this, name}));
+        peer->second->watch(bus::connection(), name, peerGone, std::make_shared<Watch>(Watch{this, name}));
     }
 
     static int peerGone(sd_bus_track* /*track*/, void* context) noexcept {
@@ -313,14 +260,17 @@ class BusListener : public Listener {
     std::map<std::string, std::shared_ptr<BusPeer>, std::less<>> peers_;
 };
 
-/// Messages to the connection's unique name go to the first service.
+/// Messages to the connection's unique name go to the one without a name, else to the first service.
 BusListener* listenerFor(sd_bus_message* message) {
     const auto& listeners = Services::shared().listeners;
+    const auto called = [&](std::string_view name) {
+        const auto found = std::find_if(listeners.begin(), listeners.end(),
+                                        [&](const auto& listener) { return listener->name() == name; });
+        return found != listeners.end() ? found->get() : nullptr;
+    };
     const char* destination = sd_bus_message_get_destination(message);
-    const auto named = std::find_if(listeners.begin(), listeners.end(), [&](const auto& listener) {
-        return destination != nullptr && listener->name() == destination;
-    });
-    if (named != listeners.end()) return named->get();
+    if (BusListener* named = destination != nullptr ? called(destination) : nullptr) return named;
+    if (BusListener* nameless = called("")) return nameless;
     return listeners.empty() ? nullptr : listeners.front().get();
 }
 

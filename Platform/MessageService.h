@@ -76,6 +76,7 @@ using ListenerEvent = std::variant<ConnectionError, std::shared_ptr<PeerConnecti
 class Listener {
   public:
     virtual ~Listener() = default;
+    /// One without a name is reached through the connection's unique name.
     static std::shared_ptr<Listener> create(std::string serviceName,
                                             std::function<void(const ListenerEvent&)> handler);
 

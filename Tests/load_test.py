@@ -13,6 +13,7 @@ import contextlib
 import multiprocessing
 import os
 import pathlib
+import signal
 import sqlite3
 import statistics
 import sys
@@ -22,9 +23,9 @@ from collections import Counter
 from dataclasses import dataclass
 
 sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
-from load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, mix, sleep_until,
-                          success_with, wait_for_certificate)
-from world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, World, hashed
+from load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, is_success, mix,
+                          sleep_until, success_with, wait_for_certificate)
+from world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, PING, World, hashed
 from jeepney import message_bus
 from jeepney.io.blocking import Proxy
 
@@ -148,6 +149,28 @@ class ManyClients(LoadCase):
         print(f"answered: {dict(load.total('answered'))}\nsucceeded: {dict(load.total('succeeded'))}\n"
               f"resident: {load.memory[0] >> 20} MB before the rush, {load.memory[1] >> 20} MB after it\n"
               f"99 of 100 pings: {calm / 1000:.1f} ms calm, {rush / 1000:.1f} ms in the rush, ratio {rush / calm:.2f}")
+
+
+class Turns(unittest.TestCase):
+    AHEAD = 100
+
+    def test_who_asks_once_does_not_wait_for_who_asks_ahead(self):
+        with World(server=False) as world, contextlib.ExitStack() as stack:
+            agent = world.start_agent()
+            ahead, other = (stack.enter_context(Conversation(world.bus.address)) for _ in range(2))
+            for client in (ahead, other):
+                client.time_ping()
+            agent.send_signal(signal.SIGSTOP)
+            for client, requests in ((ahead, self.AHEAD), (other, 1)):
+                for _ in range(requests):
+                    client.ask("ping", is_success, PING)
+                # Its reply tells that the bus has passed the requests on.
+                Proxy(message_bus, client.connection).GetId()
+            agent.send_signal(signal.SIGCONT)
+            # The agent numbers its replies.
+            sent = {client: [client.take() for _ in range(len(client.awaited))] for client in (other, ahead)}
+            overtaken = sum(serial > sent[other][0] for serial in sent[ahead])
+            self.assertGreater(overtaken, self.AHEAD / 4)
 
 
 class OneAccount(LoadCase):

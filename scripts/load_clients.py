@@ -30,8 +30,9 @@ LONGEST_WAIT = 30  # for the certificate
 # Longer than anything takes: who waits so long for a reply has lost it.
 PATIENCE = 120
 
-# So far may the flood be ahead of the agent: more would only fill the bus.
-MOST_UNANSWERED = 10_000
+# So far may the flood be ahead of the agent. The bus looks through all the calls without reply for each message: with
+# many more of them it is the bus that everybody waits for.
+MOST_UNANSWERED = 1_000
 BURST = 20
 
 # In a message.
@@ -97,8 +98,8 @@ class Conversation(Client):
         self.awaited.append((serial, name, check))
         self.connection.sock.sendall(data)
 
-    def take(self):
-        """The next reply: it answers the oldest request, and passes its check."""
+    def take(self) -> int:
+        """The next reply, which has to answer the oldest request and pass its check; the agent's number for it."""
         serial, name, check = self.awaited.popleft()
         message = self.receive(name)
         answers = message.header.fields[HeaderFields.reply_serial]
@@ -112,6 +113,7 @@ class Conversation(Client):
         self.findings.succeeded[name] += reply["success"]
         if not check(reply):
             raise Trouble(f"{name}: the reply is {reply}")
+        return message.header.serial
 
     def receive(self, name: str):
         """The next message that is not one of the bus's own."""

@@ -9,7 +9,7 @@ namespace veltoid {
 inline constexpr const char* kVeltoIDAuthenticationServiceName = "com.velto.harbwell.veltoid.authentication";
 inline constexpr const char* kVeltoIDPasswordCheckServiceName = "com.velto.harbwell.veltoid.checkpassword";
 
-/// Main queue, once each.
+/// Main queue, once each. The authentication service may be there a second time without a name.
 void registerAuthenticationListener(const std::string& serviceName);
 void registerPasswordCheckListener();
 
