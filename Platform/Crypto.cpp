@@ -29,6 +29,7 @@ VELTOID_LAZY_FUNCTION(library, EVP_Digest);
 VELTOID_LAZY_FUNCTION(library, EVP_EncryptFinal_ex);
 VELTOID_LAZY_FUNCTION(library, EVP_EncryptInit_ex2);
 VELTOID_LAZY_FUNCTION(library, EVP_EncryptUpdate);
+VELTOID_LAZY_FUNCTION(library, EVP_PBE_scrypt);
 VELTOID_LAZY_FUNCTION(library, EVP_sha256);
 
 constexpr size_t kNonceBytes = 12;
@@ -149,6 +150,17 @@ std::optional<SecretBytes> unseal(Bytes key, Bytes additionalData, Bytes sealed)
         return std::nullopt;
     }
     return plain;
+}
+
+std::optional<SecretBytes> deriveKey(Bytes passphrase, Bytes salt, const ScryptCost& cost) {
+    if (cost.logN == 0 || cost.logN >= 32) return std::nullopt;
+    SecretBytes key(kSealingKeyBytes);
+    if (EVP_PBE_scrypt(textOf(passphrase).data(), passphrase.size(), salt.data(), salt.size(),
+                       uint64_t{1} << cost.logN, cost.blockSize, cost.parallelism, kMostScryptBytes,
+                       key.data(), key.size()) == 1)
+        return key;
+    openssl::clearErrors();
+    return std::nullopt;
 }
 
 }  // namespace platform

@@ -32,4 +32,18 @@ SecretBytes seal(Bytes key, Bytes additionalData, Bytes plain);
 /// None when key, additional data or sealed bytes are not the ones that were sealed together.
 std::optional<SecretBytes> unseal(Bytes key, Bytes additionalData, Bytes sealed);
 
+/// How costly it is to try a passphrase (RFC 7914): memory of 128 * 2^logN * blockSize bytes, and time.
+struct ScryptCost {
+    uint8_t logN = 16;
+    uint8_t blockSize = 8;
+    uint8_t parallelism = 1;
+};
+
+/// Deriving takes at most so much memory; a cost beyond it is refused.
+inline constexpr size_t kMostScryptBytes = size_t{256} << 20U;
+
+/// A key of kSealingKeyBytes that only who knows the passphrase can derive. None when the cost is refused or
+/// there is no memory for it.
+std::optional<SecretBytes> deriveKey(Bytes passphrase, Bytes salt, const ScryptCost& cost);
+
 }  // namespace platform

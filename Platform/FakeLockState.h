@@ -30,6 +30,10 @@ class FakeLockState : public LockState {
         unlocked_ = true;
         if (handler_) WorkQueue::main().async(handler_);
     }
+    void lock() {
+        const std::lock_guard lock(mutex_);
+        unlocked_ = false;
+    }
     bool isWatched() const {
         const std::lock_guard lock(mutex_);
         return handler_ != nullptr;

@@ -7,6 +7,7 @@
 #include <string>
 
 #include "Platform/Crypto.h"
+#include "Platform/KeychainClassKeys.h"
 #include "Platform/KeychainSealing.h"
 #include "Platform/SQLiteFile.h"
 #include "Platform/SystemLog.h"
@@ -261,5 +262,30 @@ std::optional<Accessibility> accessibilityOf(const KeychainQuery& query) {
     });
     return status == kKeychainSuccess ? accessibility : std::nullopt;
 }
+
+std::optional<Protection> protection() {
+    Protection result = Protection::NoPassphrase;
+    const KeychainStatus status =
+        readItems([&](SQLiteTransaction& transaction) { return readProtection(transaction, result); });
+    return status == kKeychainSuccess ? std::optional(result) : std::nullopt;
+}
+
+KeychainStatus setPassphrase(Bytes passphrase) {
+    return changeItems(
+        [&](SQLiteTransaction& transaction) { return wrapByPassphrase(transaction, passphrase); });
+}
+
+KeychainStatus removePassphrase() {
+    const KeychainStatus status = changeItems(wrapByDeviceKey);
+    if (status == kKeychainSuccess) (void)lock();
+    return status;
+}
+
+KeychainStatus unlock(Bytes passphrase) {
+    return readItems(
+        [&](SQLiteTransaction& transaction) { return unlockByPassphrase(transaction, passphrase); });
+}
+
+KeychainStatus lock() { return readItems(lockClassKey); }
 
 }  // namespace platform::keychain

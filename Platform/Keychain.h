@@ -3,7 +3,7 @@
 //
 // The value is sealed with AES-256-GCM under a class key; the item's id and attributes are the additional
 // data, so that a swapped or edited row is refused as corrupt. The class keys are wrapped by a device key in
-// keychain.key (0600).
+// keychain.key (0600), or that of "after first unlock" by a passphrase.
 #pragma once
 
 #include <cstdint>
@@ -30,6 +30,8 @@ inline constexpr KeychainStatus kKeychainNotAvailable = -25291;
 inline constexpr KeychainStatus kKeychainItemCorrupt = -26275;
 /// The class key is not available until the device is unlocked.
 inline constexpr KeychainStatus kKeychainLocked = -25308;
+/// Not the passphrase.
+inline constexpr KeychainStatus kKeychainWrongPassphrase = -25293;
 
 /// The values of these two are stored: they do not change.
 enum class KeychainItemClass : int { GenericPassword = 0, Key = 1, Certificate = 2 };
@@ -93,6 +95,25 @@ KeychainStatus remove(const KeychainQuery& query);
 
 /// The stored accessibility of the first matching item.
 std::optional<Accessibility> accessibilityOf(const KeychainQuery& query);
+
+// --- The passphrase. With one, items other than the always accessible ones can be had only after it was
+// given; what opens them is then in the kernel's keyring of the user until the device is switched off or
+// locked again.
+
+enum class Protection { NoPassphrase, Locked, Unlocked };
+
+/// None when the keychain cannot be read.
+std::optional<Protection> protection();
+
+/// Takes the place of an earlier one; the keychain must not be locked, and stays unlocked.
+KeychainStatus setPassphrase(Bytes passphrase);
+
+/// From now on the device key alone opens everything; the keychain must not be locked.
+KeychainStatus removePassphrase();
+
+/// Nothing happens to a keychain without a passphrase.
+KeychainStatus unlock(Bytes passphrase);
+KeychainStatus lock();
 
 }  // namespace keychain
 

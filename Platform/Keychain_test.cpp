@@ -6,11 +6,13 @@
 #include <algorithm>
 #include <cstdio>
 #include <filesystem>
+#include <functional>
 #include <set>
 #include <string>
 #include <vector>
 
 #include "Platform/FakeSystemLog.h"
+#include "Platform/KernelKeyring.h"
 #include "Platform/KeychainSealing.h"
 #include "Platform/TemporaryStateDirectory.h"
 
@@ -334,6 +336,95 @@ TEST_F(KeychainTest, IsNotAvailableWithoutASoundDeviceKey) {
     const FakeSystemLog log;
     EXPECT_EQ(valueOf(byReference(item)), kSecret);
     EXPECT_TRUE(log.contains("was open to other users"));
+}
+
+class PassphraseTest : public KeychainTest {
+  protected:
+    void SetUp() override {
+        if (!kernel_keyring::store("veltoid test", bytesOf("x")) || !kernel_keyring::remove("veltoid test"))
+            GTEST_SKIP() << "the kernel's keyring is not permitted here";
+    }
+    ~PassphraseTest() override {
+        if (IsSkipped()) return;
+        EXPECT_EQ(keychain::lock(), kKeychainSuccess) << "nothing of this is to stay in the kernel";
+    }
+
+    const std::string passphrase_ = "open, " + kSecret;
+};
+
+TEST_F(PassphraseTest, OpensAndClosesAllButTheAlwaysAccessible) {
+    using enum keychain::Protection;
+    const auto item = byReference(added(password("a")));
+    const auto always = byReference(added(password("b"), kSecret, Accessibility::Always));
+    const auto set = [](std::string_view text) { return keychain::setPassphrase(bytesOf(text)); };
+    const auto unlock = [](std::string_view text) { return keychain::unlock(bytesOf(text)); };
+    const struct {
+        const char* step;
+        std::function<KeychainStatus()> action;
+        KeychainStatus expected;
+        keychain::Protection after;
+    } steps[] = {
+        {"nothing to unlock", [&] { return unlock("anything"); }, kKeychainSuccess, NoPassphrase},
+        {"nothing to lock", keychain::lock, kKeychainSuccess, NoPassphrase},
+        {"nothing to remove", keychain::removePassphrase, kKeychainSuccess, NoPassphrase},
+        {"set", [&] { return set(passphrase_); }, kKeychainSuccess, Unlocked},
+        {"lock", keychain::lock, kKeychainSuccess, Locked},
+        {"set while locked", [&] { return set("another"); }, kKeychainLocked, Locked},
+        {"remove while locked", keychain::removePassphrase, kKeychainLocked, Locked},
+        {"wrong", [&] { return unlock("Open, " + kSecret); }, kKeychainWrongPassphrase, Locked},
+        {"none", [&] { return unlock(""); }, kKeychainWrongPassphrase, Locked},
+        {"right", [&] { return unlock(passphrase_); }, kKeychainSuccess, Unlocked},
+        {"change", [&] { return set("another"); }, kKeychainSuccess, Unlocked},
+        {"lock again", keychain::lock, kKeychainSuccess, Locked},
+        {"the old one", [&] { return unlock(passphrase_); }, kKeychainWrongPassphrase, Locked},
+        {"the new one", [&] { return unlock("another"); }, kKeychainSuccess, Unlocked},
+        {"remove", keychain::removePassphrase, kKeychainSuccess, NoPassphrase},
+        {"lock no more", keychain::lock, kKeychainSuccess, NoPassphrase},
+    };
+    for (const auto& [step, action, expected, after] : steps) {
+        EXPECT_EQ(action(), expected) << step;
+        EXPECT_EQ(keychain::protection(), after) << step;
+        EXPECT_EQ(valueOf(item), after == Locked ? kLocked : kSecret) << step;
+        EXPECT_EQ(keychain::add(password(step), Accessibility::AfterFirstUnlock, bytesOf("x"), nullptr),
+                  after == Locked ? kKeychainLocked : kKeychainSuccess)
+            << step;
+        EXPECT_EQ(valueOf(always), kSecret) << step;
+        expectNoSecretInFiles();
+    }
+}
+
+TEST_F(PassphraseTest, DamageIsToldFromAWrongPassphrase) {
+    const auto item = byReference(added(password("a")));
+    ASSERT_EQ(keychain::setPassphrase(bytesOf(passphrase_)), kKeychainSuccess);
+    const struct {
+        const char* change;
+        KeychainStatus unlocking;
+    } cases[] = {
+        {"wrapped = x''", kKeychainNotAvailable},
+        {"wrapped = 'text'", kKeychainNotAvailable},
+        {"wrapped = substr(wrapped, 1, 20)", kKeychainNotAvailable},
+        {"wrapped = x'02' || substr(wrapped, 2)", kKeychainNotAvailable},
+        {"wrapped = x'01000801' || substr(wrapped, 5)", kKeychainNotAvailable},
+        {"wrapped = x'01ff0801' || substr(wrapped, 5)", kKeychainNotAvailable},
+        {"wrapped = x'011fffff' || substr(wrapped, 5)", kKeychainNotAvailable},
+        {"wrapped = x'01100001' || substr(wrapped, 5)", kKeychainNotAvailable},
+        {"wrapped = x'010a0801' || substr(wrapped, 5)", kKeychainWrongPassphrase},
+        {"wrapped = substr(wrapped, 1, length(wrapped) - 1)", kKeychainWrongPassphrase},
+        {"wrapped = substr(wrapped, 1, 21)", kKeychainWrongPassphrase},
+        {"wrapped = zeroblob(16777216)", kKeychainNotAvailable},
+        {"wrapping = 0", kKeychainSuccess},
+        {"wrapping = 9", kKeychainSuccess},
+    };
+    edit("CREATE TABLE sound AS SELECT * FROM class_keys");
+    for (const auto& [change, unlocking] : cases) {
+        edit(std::string("UPDATE class_keys SET ") + change + " WHERE class = 2");
+        EXPECT_NE(valueOf(item), kSecret) << change;
+        EXPECT_EQ(keychain::unlock(bytesOf(passphrase_)), unlocking) << change;
+        EXPECT_NE(valueOf(item), kSecret) << change;
+        edit("INSERT OR REPLACE INTO class_keys SELECT * FROM sound");
+    }
+    EXPECT_EQ(keychain::unlock(bytesOf(passphrase_)), kKeychainSuccess);
+    EXPECT_EQ(valueOf(item), kSecret);
 }
 
 }  // namespace

@@ -1,15 +1,41 @@
 #include "Platform/LockState.h"
 
 #include <atomic>
+#include <utility>
+
+#include "Platform/BusConnection.h"
+#include "Platform/Keychain.h"
+#include "Platform/WorkQueue.h"
 
 namespace platform {
 namespace {
 
-/// The key is wrapped by the device key alone: the device counts as unlocked from the start, for good.
-class AlwaysUnlocked : public LockState {
+class KeychainLockState : public LockState {
   public:
-    bool hasBeenUnlockedSinceBoot() const override { return true; }
-    void onChange(std::function<void()>) override {}
+    bool hasBeenUnlockedSinceBoot() const override {
+        return keychain::protection() != keychain::Protection::Locked;
+    }
+
+    void onChange(std::function<void()> handler) override {
+        WorkQueue::main().async([this, handler = std::move(handler)] {
+            handler_ = handler;
+            if (!handler_) return;
+            if (std::exchange(isListening_, true))
+                look();
+            else
+                bus::onPosted(kUnlockedNotification, [this] { look(); });
+        });
+    }
+
+  private:
+    /// What is posted may come from anybody, and may have been posted before anybody listened.
+    void look() const {
+        if (handler_ && hasBeenUnlockedSinceBoot()) handler_();
+    }
+
+    /// Main thread only.
+    std::function<void()> handler_;
+    bool isListening_ = false;
 };
 
 std::atomic<LockState*> replacement{nullptr};
@@ -18,8 +44,8 @@ std::atomic<LockState*> replacement{nullptr};
 
 LockState& LockState::shared() {
     if (LockState* state = replacement.load(std::memory_order_acquire)) return *state;
-    static auto* unlocked = new AlwaysUnlocked;
-    return *unlocked;
+    static auto* real = new KeychainLockState;
+    return *real;
 }
 
 void LockState::replaceShared(LockState* state) { replacement.store(state, std::memory_order_release); }

@@ -14,7 +14,9 @@ import unittest
 sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
 from world import (ACCOUNT, ADD, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD,  # noqa: E402
                    PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE, VERIFY, BusError,
-                   World, agent_program, hashed)
+                   NameOwner, World, agent_program, hashed)
+from jeepney import message_bus  # noqa: E402
+from jeepney.io.blocking import Proxy  # noqa: E402
 
 ENGINE = "HWIdentityErrorDomain"
 
@@ -376,6 +378,21 @@ class Process(unittest.TestCase):
                 self.assertTrue(client.call(PING)["success"])
             self.assertIsNone(agent.poll())
             self.assertEqual(world.stop_agent(), 0)
+
+    def test_without_the_authentication_service_leaks_mode_answers_under_no_name(self):
+        with World(server=False) as world:
+            environment = {**os.environ, **world.environment, "DBUS_SESSION_BUS_ADDRESS": world.bus.address}
+            with NameOwner(world.bus.address, PASSWORD_SERVICE) as owner, \
+                    subprocess.Popen([agent_program(), "--leaks", "--checkpassword"], env=environment) as agent:
+                self.addCleanup(agent.kill)
+                owner.wait(True)
+                with world.client(PASSWORD_SERVICE) as named:
+                    name = Proxy(message_bus, named.connection).GetNameOwner(PASSWORD_SERVICE)[0]
+                    self.assertFalse(named.call(LIST)["success"])
+                with world.client(name) as nameless:
+                    self.assertTrue(nameless.call(SET_VALUE, domain="MetaInfo", key="k", value=1)["success"])
+                agent.terminate()
+                self.assertEqual(agent.wait(timeout=20), 0)
 
     def test_an_unknown_option_prints_the_usage(self):
         run = subprocess.run([agent_program(), "-x"], capture_output=True, text=True, check=False)

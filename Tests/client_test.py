@@ -13,11 +13,13 @@ import stat
 import subprocess
 import pathlib
 import sys
+import time
 import unittest
 import urllib.request
 
 sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
-from world import ACCOUNT, PASSWORD, World, hashed  # noqa: E402
+from systemd_world import wait_until  # noqa: E402
+from world import ACCOUNT, PASSWORD, STATUS, World, hashed  # noqa: E402
 
 
 def client_program() -> str:
@@ -137,6 +139,57 @@ class CommandLine(unittest.TestCase):
         status, shown = self.at_terminal("verify", ACCOUNT, dialogue=[(b"Password for", PASSWORD)])
         self.assertEqual(status, 0, shown)
         self.assertNotIn(PASSWORD.encode(), shown)
+
+    def set_passphrase(self, passphrase: str):
+        """Until the test ends."""
+        if "keyring is not available" in self.run_client("keychain", "set-passphrase", "--password-stdin",
+                                                         stdin=passphrase).stderr:
+            self.skipTest("the kernel's keyring is not permitted here")
+        self.addCleanup(self.run_client, "keychain", "remove-passphrase")
+        self.addCleanup(self.run_client, "keychain", "unlock", "--password-stdin", stdin=passphrase)
+
+    def test_a_passphrase_keeps_the_secrets_until_it_is_given(self):
+        self.add_account()
+        self.run_table([(["keychain", "status"], "", 0, "no passphrase"),
+                        (["keychain", "lock"], "", 1, "no passphrase"),
+                        (["keychain", "unlock"], "", 0, "no passphrase")])
+        self.set_passphrase("open")
+        readable = (["info", "--refresh"], "", 0, "Jane")
+        self.run_table([
+            (["keychain", "status"], "", 0, "unlocked"), readable,
+            (["keychain", "lock"], "", 0, "is locked"),
+            (["keychain", "status", "--json"], "", 0, '"locked"'),
+            (["status"], "", 0, "PasswordInaccessibleInKeychain"),
+            (["status"], "", 0, "unlocked since boot:  no"),
+            (["add", "kim@example.com", "--no-sign-in", "--password-stdin"], "x", 1, "(HWIdentityErrorDomain"),
+            (["list"], "", 0, ACCOUNT),
+            (["keychain", "set-passphrase", "--password-stdin"], "mine", 1, "is locked"),
+            (["keychain", "remove-passphrase"], "", 1, "is locked"),
+            (["keychain", "unlock", "--password-stdin"], "opem", 1, "not the passphrase"),
+            (["keychain", "unlock", "--password-stdin"], "", 1, "there is no password"),
+            (["keychain", "unlock", "--password-stdin"], "open\n", 0, "is unlocked"), readable])
+        secret = "at the terminal"
+        status, shown = self.at_terminal("keychain", "set-passphrase",
+                                         dialogue=[(b"keychain:", secret), (b"more:", secret)])
+        self.assertEqual(status, 0, shown)
+        self.assertNotIn(secret.encode(), shown)
+        self.run_table([(["keychain", "lock"], "", 0, ""),
+                        (["keychain", "unlock", "--password-stdin"], "open", 1, "not the passphrase")])
+        self.assertEqual(self.at_terminal("keychain", "unlock", dialogue=[(b"keychain:", secret)])[0], 0)
+        self.run_table([(["keychain", "remove-passphrase"], "", 0, "no passphrase"), readable])
+
+    def test_an_agent_that_waits_for_the_passphrase_is_told(self):
+        self.add_account()
+        self.set_passphrase("open")
+        self.run_table([(["keychain", "lock"], "", 0, "")])
+        self.world.end_agent_of_the_bus()
+        with self.world.client() as client:
+            # It begins ten seconds after its start, and then waits for a day at a time.
+            wait_until(lambda: client.call(STATUS)["status"]["NextLaunchTime"]["date"] > time.time() + 80_000, 60,
+                       "not waiting")
+        self.world.server.clear_received()
+        self.run_table([(["keychain", "unlock", "--password-stdin"], "open", 0, "is unlocked")])
+        self.assertTrue(self.world.server.wait("createCert", timeout=60))
 
     def test_adding_says_what_became_of_the_certificate(self):
         for issuance, status, said, then, later in [

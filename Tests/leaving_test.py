@@ -11,7 +11,8 @@ import unittest
 from concurrent.futures import ThreadPoolExecutor
 
 sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
-from world import ACCOUNT, ADD, DATABASE, PASSWORD, SET_VALUE, NameOwner, World, hashed  # noqa: E402
+from world import (ACCOUNT, ADD, DATABASE, PASSWORD, SET_VALUE, STATUS, TERMINATE, BusError, NameOwner,  # noqa: E402
+                   World, hashed)
 
 
 class Writer:
@@ -88,15 +89,44 @@ class PlainBus(unittest.TestCase):
     def test_ends_in_the_middle_of_requests_lose_none(self):
         with World(server=False) as world, NameOwner(world.bus.address) as owner:
             with Writer(world.client(), "one") as one, Writer(world.client(), "other") as other:
-                for _ in range(20):
-                    one.wait_for(10)
-                    other.wait_for(10)
-                    owner.wait(True)
-                    os.kill(world.agent_pid(), signal.SIGTERM)
-                    owner.wait(False)
-            self.assertGreaterEqual(owner.owners_gone, 20)
+                for _ in range(10):
+                    for end in self.end_by_signal, self.end_by_command, self.end_by_option:
+                        one.wait_for(10)
+                        other.wait_for(10)
+                        owner.wait(True)
+                        end(world)
+                        owner.wait(False)
+            self.assertGreaterEqual(owner.owners_gone, 30)
             with world.client() as client:
                 self.assertEqual((one.lost(client), other.lost(client)), ({}, {}))
+
+    @staticmethod
+    def end_by_signal(world):
+        os.kill(world.agent_pid(), signal.SIGTERM)
+
+    def end_by_command(self, world):
+        with world.client() as client, self.assertRaises(BusError):
+            client.call(TERMINATE)
+
+    @staticmethod
+    def end_by_option(world):
+        with world.client() as client:
+            client.call(STATUS, options={"VeltoIDAuthenticationStatusTerminateServer": True})
+
+    def test_a_request_without_end_does_not_keep_a_terminated_agent(self):
+        with World() as world, world.client() as client, ThreadPoolExecutor() as pool:
+            agent = world.start_agent()
+            self.assertTrue(client.call(SET_VALUE, domain="MetaInfo", key="k", value=1)["success"])
+            world.server.settings(issuance="never")
+            adding = pool.submit(client.call, ADD, VeltoID=ACCOUNT, hashedpassword=hashed(PASSWORD), timeout=90,
+                                 options={"certwaitduration": 60})
+            self.assertTrue(world.server.wait("getMyInfo"))
+            agent.send_signal(signal.SIGTERM)
+            self.assertEqual(agent.wait(timeout=45), 0)
+            self.assertRaises(BusError, adding.result)
+            with world.client() as other:
+                database = other.call(DATABASE)["result"]
+            self.assertEqual((database["MetaInfo"]["k"], [*database["Accounts"]]), (1, [ACCOUNT]))
 
     def test_the_next_agent_waits_for_what_the_one_before_still_stores(self):
         with World() as world, NameOwner(world.bus.address) as owner, world.client() as client, \

@@ -60,4 +60,11 @@ Json AgentConnection::send(const platform::ValueWriter& writer) {
     return builder.take();
 }
 
+void AgentConnection::post(const std::string& notification) {
+    const int result =
+        sd_bus_emit_signal(bus_, platform::bus::kObjectPath, platform::bus::kNotificationInterface, "Posted",
+                           "s", notification.c_str());
+    if (result < 0) throw Unreachable(std::string("the bus failed: ") + strerror(-result));
+}
+
 }  // namespace veltoidctl

@@ -32,6 +32,9 @@ class AgentConnection {
     /// as base64 text. The request's memory is wiped. Throws Unreachable.
     Json send(const platform::ValueWriter& writer);
 
+    /// Tells whoever listens, a running agent above all. Throws Unreachable.
+    void post(const std::string& notification);
+
   private:
     std::string service_;
     double timeoutSeconds_;

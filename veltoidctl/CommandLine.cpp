@@ -21,6 +21,7 @@ class Commands {
         addFind();
         addCertificate();
         addBreadcrumb();
+        addKeychain();
         addAgentCommands();
     }
 
@@ -116,6 +117,19 @@ class Commands {
         takesAccountAndKey(set);
         set->add_option("--input", arguments_.input, "the file to store; else standard input")
             ->type_name("FILE");
+    }
+
+    void addKeychain() {
+        CLI::App* group = application_->add_subcommand(
+            "keychain", "the passphrase of the accounts' secrets on this device");
+        group->require_subcommand(1);
+        add(group, "status", "show whether there is a passphrase, and whether it was given", keychainStatus);
+        takesPlainPassword(add(group, "set-passphrase",
+                               "protect the secrets by a passphrase, or by another one", setPassphrase));
+        add(group, "remove-passphrase", "protect them by the device alone again", removePassphrase);
+        takesPlainPassword(add(group, "unlock", "give the passphrase, for until the device is switched off",
+                               unlockKeychain));
+        add(group, "lock", "have it given again before the agent can use the secrets", lockKeychain);
     }
 
     void addAgentCommands() {

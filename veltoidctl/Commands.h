@@ -72,4 +72,11 @@ int setBreadcrumb(AgentConnection& agent, const Arguments& arguments);
 int getBreadcrumb(AgentConnection& agent, const Arguments& arguments);
 int database(AgentConnection& agent, const Arguments& arguments);
 
+/// The passphrase of the keychain that the agent of this user has.
+int keychainStatus(AgentConnection& agent, const Arguments& arguments);
+int setPassphrase(AgentConnection& agent, const Arguments& arguments);
+int removePassphrase(AgentConnection& agent, const Arguments& arguments);
+int unlockKeychain(AgentConnection& agent, const Arguments& arguments);
+int lockKeychain(AgentConnection& agent, const Arguments& arguments);
+
 }  // namespace veltoidctl

@@ -86,11 +86,10 @@ platform::SecretText readPasswordHash(PasswordSource source, const std::string& 
         case PasswordSource::HashedStandardInput:
             return readLine(STDIN_FILENO);
         case PasswordSource::StandardInput:
-            return hashOf(readLine(STDIN_FILENO));
         case PasswordSource::Prompt:
             break;
     }
-    return hashOf(ask(QuietTerminal(), "Password for " + account + ": "));
+    return hashOf(readPassword(source, "Password for " + account + ": "));
 }
 
 platform::SecretText readNewPassword(PasswordSource source, const std::string& purpose) {
@@ -100,6 +99,10 @@ platform::SecretText readNewPassword(PasswordSource source, const std::string& p
     if (ask(terminal, "\nOnce more: ") != password)
         throw std::runtime_error("the passwords are not the same");
     return password;
+}
+
+platform::SecretText readPassword(PasswordSource source, const std::string& question) {
+    return source == PasswordSource::Prompt ? ask(QuietTerminal(), question) : readLine(STDIN_FILENO);
 }
 
 }  // namespace veltoidctl

@@ -24,4 +24,7 @@ platform::SecretText readPasswordHash(PasswordSource source, const std::string& 
 /// like readPasswordHash, and when it was not the same twice.
 platform::SecretText readNewPassword(PasswordSource source, const std::string& purpose);
 
+/// A password as it is. Throws like readPasswordHash.
+platform::SecretText readPassword(PasswordSource source, const std::string& question);
+
 }  // namespace veltoidctl

@@ -7,6 +7,7 @@
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
 #include "Platform/Clock.h"
+#include "Platform/LockState.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/Accounts.h"
 #include "VeltoIDAuthenticationDB/Certificates.h"
@@ -86,6 +87,7 @@ void checkAccount(const String& accountName, const Dictionary& record) {
         case AccountState::NoEncodedDSID:
             return __VeltoIDDoFetchEncodedDSIDForVeltoID(accountName, options);
         case AccountState::PasswordInaccessibleInKeychain:
+            if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return;
             __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountHashedPasswordKeychainReferenceKey,
                                        Value::null(), true);
             return;

@@ -90,12 +90,12 @@ struct Plan {
 class AccountCheckLoop {
   public:
     [[noreturn]] void run() {
-        waitForFirstUnlock();
+        waitForUnlock();
         while (true) pass();
     }
 
   private:
-    void waitForFirstUnlock() {
+    void waitForUnlock() {
         auto& lockState = platform::LockState::shared();
         if (lockState.hasBeenUnlockedSinceBoot()) return;
         lockState.onChange([&lockState] {
@@ -151,6 +151,8 @@ class AccountCheckLoop {
         const Plan next = plan();
         if (!sleepUntilTimeFor(next)) return;
         keepDistance();
+        // Locked again meanwhile, it would take passwords that it cannot read for lost.
+        waitForUnlock();
         if (next.accounts.empty()) {
             __VeltoIDCleanupAccountsAndCertificates({});
         } else {

@@ -74,6 +74,15 @@ TEST_F(AccountCheckTest, TheDeviceHasToBeUnlockedFirst) {
     lock.unlock();
     EXPECT_NE(methodsIn(6), "");
     EXPECT_FALSE(lock.isWatched());
+
+    lock.lock();
+    __VeltoIDDBSetAccountValue(kName, "Dirty", flag(true), true);
+    clock_.advanceBy(1.5 * kDay);
+    EXPECT_TRUE(lock.isWatched());
+    EXPECT_LE(relaunch(), 0.5 * kDay + 10);
+    lock.unlock();
+    clock_.advanceBy(6);
+    EXPECT_TRUE(certificateEntry().contains("LastSuccessfulValidation")) << "what was due is done";
 }
 
 TEST_F(AccountCheckTest, PassesKeepTheirDistance) {

@@ -6,11 +6,11 @@
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
 #include "Platform/Clock.h"
-#include "Platform/EventLoop.h"
 #include "Values/DictionaryAccess.h"
 #include "Values/LowerCase.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/AccountStatus.h"
+#include "VeltoIDAuthd/Leaving.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthd/Request.h"
@@ -254,7 +254,7 @@ void terminateAfterReply() {
             kHandlerName, kNotice,
             "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
             "request.");
-        platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
+        leaveByCommand();
     });
 }
 
@@ -307,7 +307,7 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
     Request request(message);
     if (request.command() == kTerminateCommand) {
         computeRelaunchFromAccounts();
-        platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
+        return leaveByCommand();
     }
     const Outcome outcome = dispatch(request);
     request.finish(outcome.success, outcome.error);

@@ -25,8 +25,9 @@ constexpr const char* kIdleExitVariable = "HARBWELL_IDLE_EXIT";
 /// How long the agent stays without anything to do (seconds).
 constexpr double kDefaultIdleExit = 30;
 
-/// How long open transactions may hold up the end after SIGTERM (seconds).
+/// How long open transactions may hold up the end after SIGTERM, and after a command (seconds).
 constexpr double kLongestTermination = 10;
+constexpr double kLongestCommandedEnd = 1;
 
 /// 0 for never.
 double idleExitSeconds() {
@@ -77,10 +78,12 @@ void leave() {
     platform::message_service::releaseNames(endWhenWorkIsDone);
 }
 
-void terminate() {
+void leaveWithin(double seconds) {
     leave();
-    platform::WorkQueue::main().asyncAfter(kLongestTermination, endProcess);
+    platform::WorkQueue::main().asyncAfter(seconds, endProcess);
 }
+
+void terminate() { leaveWithin(kLongestTermination); }
 
 void leaveWhenIdle(double seconds) {
     platform::transactions::whenNoneWasOpenFor(seconds, [seconds] {
@@ -100,6 +103,10 @@ void prepareLeaving() {
     // Without its bus it can be reached by nobody and hold up the end of a log-in session.
     platform::message_service::onConnectionLost(terminate);
     if (const double seconds = idleExitSeconds(); seconds > 0) leaveWhenIdle(seconds);
+}
+
+void leaveByCommand() {
+    platform::WorkQueue::main().async([] { leaveWithin(kLongestCommandedEnd); });
 }
 
 }  // namespace veltoid

@@ -8,4 +8,7 @@ namespace veltoid {
 /// Serves SIGTERM, the end of the bus, and idleness. Main queue, once, before the services are registered.
 void prepareLeaving();
 
+/// Has the agent leave now. Others' requests may hold that up for a second. Any queue.
+void leaveByCommand();
+
 }  // namespace veltoid

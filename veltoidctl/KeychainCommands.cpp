@@ -1,0 +1,98 @@
+// The passphrase goes no further than this process, which opens the keychain by itself; the agent is told
+// afterwards.
+#include <iostream>
+
+#include "Platform/Keychain.h"
+#include "Platform/LockState.h"
+#include "veltoidctl/Commands.h"
+#include "veltoidctl/Printing.h"
+#include "veltoidctl/Request.h"
+
+namespace veltoidctl {
+namespace {
+
+using platform::keychain::Protection;
+
+constexpr const char* kQuestion = "Passphrase of the keychain: ";
+
+const char* nameOf(Protection protection) {
+    switch (protection) {
+        case Protection::NoPassphrase:
+            return "no passphrase";
+        case Protection::Locked:
+            return "locked";
+        case Protection::Unlocked:
+            break;
+    }
+    return "unlocked";
+}
+
+std::string reasonFor(platform::KeychainStatus status) {
+    switch (status) {
+        case platform::kKeychainWrongPassphrase:
+            return "that is not the passphrase";
+        case platform::kKeychainLocked:
+            return "the keychain is locked; `veltoidctl keychain unlock` comes first";
+        default:
+            return "the keychain or the kernel's keyring is not available";
+    }
+}
+
+int presentOutcome(platform::KeychainStatus status, const Arguments& arguments, const std::string& what,
+                   const char* done) {
+    const Json reply{{"success", status == platform::kKeychainSuccess}};
+    return present(
+        reply, arguments, what, [done](const Json&) { std::cout << done << "\n"; }, reasonFor(status));
+}
+
+/// A running agent may wait for this, and one that is not running has work now.
+void tellAgent(AgentConnection& agent) {
+    agent.post(platform::kUnlockedNotification);
+    send(agent, {.command = kPingCommand});
+}
+
+}  // namespace
+
+int keychainStatus(AgentConnection& /*agent*/, const Arguments& arguments) {
+    const auto protection = platform::keychain::protection();
+    Json reply{{"success", protection.has_value()}};
+    if (protection) reply["protection"] = nameOf(*protection);
+    return present(
+        reply, arguments, "keychain status",
+        [](const Json& shown) { std::cout << textOf(shown["protection"]) << "\n"; },
+        "the keychain cannot be read");
+}
+
+int setPassphrase(AgentConnection& /*agent*/, const Arguments& arguments) {
+    const auto passphrase = readNewPassword(arguments.password, "the keychain");
+    return presentOutcome(
+        platform::keychain::setPassphrase(platform::bytesOf(passphrase)), arguments,
+        "keychain set-passphrase",
+        "the keychain has this passphrase, and is unlocked until the device is switched off");
+}
+
+int removePassphrase(AgentConnection& /*agent*/, const Arguments& arguments) {
+    return presentOutcome(platform::keychain::removePassphrase(), arguments, "keychain remove-passphrase",
+                          "the keychain has no passphrase");
+}
+
+int unlockKeychain(AgentConnection& agent, const Arguments& arguments) {
+    if (platform::keychain::protection() == Protection::NoPassphrase)
+        return presentOutcome(platform::kKeychainSuccess, arguments, "keychain unlock",
+                              "the keychain has no passphrase");
+    const auto passphrase = readPassword(arguments.password, kQuestion);
+    const auto status = platform::keychain::unlock(platform::bytesOf(passphrase));
+    const int outcome = presentOutcome(status, arguments, "keychain unlock", "the keychain is unlocked");
+    if (outcome == kDone) tellAgent(agent);
+    return outcome;
+}
+
+int lockKeychain(AgentConnection& /*agent*/, const Arguments& arguments) {
+    if (platform::keychain::protection() == Protection::NoPassphrase) {
+        const Json refusal{{"success", false}};
+        return present(refusal, arguments, "keychain lock", {}, "the keychain has no passphrase");
+    }
+    return presentOutcome(platform::keychain::lock(), arguments, "keychain lock", "the keychain is locked");
+}
+
+}  // namespace veltoidctl
