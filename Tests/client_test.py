@@ -161,7 +161,7 @@ class CommandLine(unittest.TestCase):
             (["keychain", "status", "--json"], "", 0, '"locked"'),
             (["status"], "", 0, "PasswordInaccessibleInKeychain"),
             (["status"], "", 0, "unlocked since boot:  no"),
-            (["add", "kim@example.com", "--no-sign-in", "--password-stdin"], "x", 1, "(HWIdentityErrorDomain"),
+            (["add", "kim@example.com", "--no-sign-in", "--password-stdin"], "x", 1, "is locked"),
             (["list"], "", 0, ACCOUNT),
             (["keychain", "set-passphrase", "--password-stdin"], "mine", 1, "is locked"),
             (["keychain", "remove-passphrase"], "", 1, "is locked"),

@@ -2,6 +2,7 @@
 
 #include <iostream>
 
+#include "Platform/Keychain.h"
 #include "veltoidctl/ClientCertificate.h"
 #include "veltoidctl/Printing.h"
 #include "veltoidctl/Request.h"
@@ -33,6 +34,13 @@ void printOutcome(const ClientCertificate& found, const Arguments& arguments) {
     } else if (found.isPending()) {
         std::cout << found.whyThereIsNone() << "\n";
     }
+}
+
+/// Why the agent could not take it, where the agent's own answer is only a number.
+std::string likelyReason() {
+    return platform::keychain::protection() == platform::keychain::Protection::Locked
+               ? "the keychain is locked; `veltoidctl keychain unlock` comes first"
+               : "the agent could not do it";
 }
 
 /// What somebody who added the account would miss; empty when nothing is.
@@ -73,10 +81,13 @@ int add(AgentConnection& agent, const Arguments& arguments) {
         reply["certificate"] = found.reply.value("result", Json::object());
         reply["certificateIsPending"] = found.isPending();
     }
-    const int status = present(reply, arguments, "add", [&](const Json&) {
-        printAdded(reply, arguments);
-        printOutcome(found, arguments);
-    });
+    const int status = present(
+        reply, arguments, "add",
+        [&](const Json&) {
+            printAdded(reply, arguments);
+            printOutcome(found, arguments);
+        },
+        succeeded(reply) ? "" : likelyReason());
     const std::string missing = shortcoming(reply, arguments, found);
     if (status != kDone || missing.empty()) return status;
     if (!arguments.json)
