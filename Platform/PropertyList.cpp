@@ -259,7 +259,8 @@ class Reader {
     template <typename Sink>
     bool deliver(Sink& sink) {
         budget_ = Budget();
-        return visit(top_, 0, sink);
+        isValid_ = visit(top_, 0, sink);
+        return isValid_;
     }
 
   private:
@@ -306,6 +307,8 @@ class Reader {
     uint64_t top_ = 0;
     SecretText scratch_;
     Budget budget_;
+    /// A walk has come to its end: the texts need no second look.
+    bool isValid_ = false;
 };
 
 bool Reader::open() {
@@ -451,7 +454,7 @@ std::optional<std::string_view> Reader::text(uint8_t marker, Cursor cursor) {
     if (!count || *count > cursor.size()) return std::nullopt;
     const auto bytes = take(cursor, ascii ? *count : 2 * *count);
     if (!bytes || bytes->size() > kMaxPropertyListPayload ||
-        (ascii ? !isASCII(textOf(*bytes)) : !decodeUTF16(*bytes))) {
+        (ascii ? !isValid_ && !isASCII(textOf(*bytes)) : !decodeUTF16(*bytes))) {
         return std::nullopt;
     }
     const std::string_view value = ascii ? textOf(*bytes) : std::string_view(scratch_);

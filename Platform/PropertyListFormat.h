@@ -66,11 +66,19 @@ inline size_t widthOf(uint64_t value) {
 
 inline bool isASCII(std::string_view text) {
     constexpr uint64_t kHighBits = 0x8080808080808080;
-    for (uint64_t eight = 0; text.size() >= sizeof eight; text.remove_prefix(sizeof eight)) {
-        std::memcpy(&eight, text.data(), sizeof eight);
-        if ((eight & kHighBits) != 0) return false;
-    }
-    return std::ranges::all_of(text, [](char c) { return static_cast<uint8_t>(c) < 0x80; });
+    constexpr size_t kAtOnce = sizeof(uint64_t);
+    if (text.size() < kAtOnce)
+        return std::ranges::all_of(text, [](char c) { return static_cast<uint8_t>(c) < 0x80; });
+    uint64_t seen = 0;
+    const auto look = [&](size_t at) {
+        uint64_t eight = 0;
+        std::memcpy(&eight, text.data() + at, kAtOnce);
+        seen |= eight;
+    };
+    for (size_t at = 0; at + kAtOnce <= text.size(); at += kAtOnce) look(at);
+    // The rest, together with some that were seen.
+    look(text.size() - kAtOnce);
+    return (seen & kHighBits) == 0;
 }
 
 /// Takes one code point from the front of `text`; none when it does not start with well-formed UTF-8 (RFC

@@ -196,6 +196,16 @@ TEST(PropertyList, RefusesHostileLists) {
         chain.push_back({0x08});
         EXPECT_EQ(readBack(listOf(chain)) == "refused", depth > kMaxPropertyListDepth) << depth;
     }
+    for (uint8_t length = 1; length <= 40; ++length) {
+        std::vector<uint8_t> text(3 + length, 0x7F);
+        text[0] = 0x5F, text[1] = 0x10, text[2] = length;
+        EXPECT_NE(readBack(listOf({text})), "refused") << int{length};
+        for (size_t at = 3; at < text.size(); ++at) {
+            text[at] = 0x80;
+            EXPECT_EQ(readBack(listOf({text})), "refused") << at << " of " << int{length};
+            text[at] = 0x7F;
+        }
+    }
     SecretBytes strayOffset = listOf({{0x08}});
     for (const int offset : {0, 7, 9, 255}) {
         strayOffset[9] = static_cast<uint8_t>(offset);
