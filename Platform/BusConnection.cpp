@@ -60,13 +60,15 @@ void enable(sd_event_source* source, int whether) {
 
 /// Sends what waits to be sent, and reads and dispatches what has come.
 void process(State& state) {
-    int result = 1;
+    int result = state.ended ? 0 : 1;
     for (int left = kReadAtOnce; left > 0 && result > 0; --left) result = sd_bus_process(state.bus, nullptr);
     if (result < 0) {
         if (!state.ended) logFailure("reading", result);
-        for (sd_event_source* source : {state.arrival, state.timeout}) enable(source, SD_EVENT_OFF);
+        sd_bus_close(state.bus);
         connectionEnded();
     }
+    if (state.ended)
+        for (sd_event_source* source : {state.arrival, state.timeout}) enable(source, SD_EVENT_OFF);
     enable(state.more, state.serve && state.serve() ? SD_EVENT_ON : SD_EVENT_OFF);
 }
 
@@ -106,6 +108,8 @@ int watch(State& state) {
         result = sd_event_add_time(loop, &state.timeout, CLOCK_MONOTONIC, 0, 0, timedOut, &state);
     if (result >= 0) result = sd_event_source_set_enabled(state.timeout, SD_EVENT_OFF);
     if (result >= 0) result = sd_event_add_defer(loop, &state.more, moreIsWaiting, &state);
+    // It is always pending while it is on, and would go before everything else.
+    if (result >= 0) result = sd_event_source_set_priority(state.more, SD_EVENT_PRIORITY_IDLE);
     if (result >= 0) result = sd_event_source_set_prepare(state.arrival, prepareWait);
     return result;
 }

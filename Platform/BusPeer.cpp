@@ -14,13 +14,14 @@ namespace {
 /// cannot be known before.
 constexpr int kServedAtOnce = 32;
 
-/// So many events of a peer are kept in memory; more wait on the bus, and everybody behind them.
+/// So many events of a peer wait for their turn. More are handled out of turn, so that memory is not theirs
+/// alone; those that are for the peer's own queue wait there.
 constexpr size_t kMostWaiting = 16'384;
 
-/// A peer with more events waiting is sending ahead. It rests while the bus has not read so much of what was
-/// sent to it: what goes to the others would stand in line behind its replies. The kernel counts 768 bytes
-/// for a small reply; with twice as many, others wait half as long again, with half as many a peer that is
-/// alone is slowed down by half.
+/// A peer with more events waiting is sending ahead. It rests while the bus has not read so much of what the
+/// agent has sent: what goes to the others would stand in line behind its replies. The kernel counts 768
+/// bytes for a small reply; with twice as many, others wait half as long again, with half as many a peer that
+/// is alone is slowed down by half.
 constexpr size_t kSendingAhead = 8;
 constexpr size_t kMostUnread = 12 << 10;
 constexpr double kRestSeconds = 0.0003;

@@ -63,7 +63,7 @@ void prepare() {
     if (wakeDescriptor < 0) fail("creating wake descriptor", errno);
     sd_event_source* wake = nullptr;
     int result = sd_event_add_io(loop, &wake, wakeDescriptor, EPOLLIN, woken, nullptr);
-    // Before new messages: among the tasks are replies, which later ones must not overtake.
+    // Before new messages: their replies would have to stand behind those that wait here.
     if (result >= 0) result = sd_event_source_set_priority(wake, SD_EVENT_PRIORITY_IMPORTANT);
     if (result < 0) fail("watching wake descriptor", -result);
     main_queue::adopt(wakeLoop);
@@ -72,7 +72,9 @@ void prepare() {
 void onSignal(int signal, std::function<void()> handler) {
     // Lives as long as the process, like the signal's source.
     auto* kept = new std::function<void()>(std::move(handler));
-    const int result = sd_event_add_signal(loop, nullptr, signal, signalled, kept);
+    sd_event_source* source = nullptr;
+    int result = sd_event_add_signal(loop, &source, signal, signalled, kept);
+    if (result >= 0) result = sd_event_source_set_priority(source, SD_EVENT_PRIORITY_IMPORTANT);
     if (result < 0) fail("watching signal", -result);
 }
 

@@ -28,23 +28,24 @@ long serialOf(const std::string& name) {
     return syscall(SYS_keyctl, KEYCTL_SEARCH, KEY_SPEC_USER_KEYRING, kKeyType, name.c_str(), 0);
 }
 
-/// Only who possesses a key may read it, which not every session's processes do: services are in none.
-void possessUserKeyring() {
-    (void)syscall(SYS_keyctl, KEYCTL_LINK, KEY_SPEC_USER_KEYRING, KEY_SPEC_THREAD_KEYRING);
-}
+/// Everything for who possesses the key; viewing, reading and finding it for every process of the user. The
+/// bits are those of keyctl_setperm(3).
+constexpr unsigned kPermissions = 0x3f0b0000;
 
 }  // namespace
 
 bool store(const std::string& name, Bytes secret) {
-    return syscall(SYS_add_key, kKeyType, name.c_str(), secret.data(), secret.size(),
-                   KEY_SPEC_USER_KEYRING) >= 0 ||
-           refused("storing a key");
+    // Only who possesses a key may say who else may read it, and services possess nothing of their user's.
+    (void)syscall(SYS_keyctl, KEYCTL_LINK, KEY_SPEC_USER_KEYRING, KEY_SPEC_PROCESS_KEYRING);
+    const long serial =
+        syscall(SYS_add_key, kKeyType, name.c_str(), secret.data(), secret.size(), KEY_SPEC_USER_KEYRING);
+    if (serial < 0) return refused("storing a key");
+    return syscall(SYS_keyctl, KEYCTL_SETPERM, serial, kPermissions) >= 0 || refused("sharing a key");
 }
 
 std::optional<SecretBytes> find(const std::string& name) {
     const long serial = serialOf(name);
     if (serial < 0) return std::nullopt;
-    possessUserKeyring();
     SecretBytes secret(kMaxSecretBytes);
     const long size = syscall(SYS_keyctl, KEYCTL_READ, serial, secret.data(), secret.size());
     if (size < 0) (void)refused("reading a key");

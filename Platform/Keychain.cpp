@@ -5,8 +5,10 @@
 #include <functional>
 #include <span>
 #include <string>
+#include <utility>
 
 #include "Platform/Crypto.h"
+#include "Platform/KernelKeyring.h"
 #include "Platform/KeychainClassKeys.h"
 #include "Platform/KeychainSealing.h"
 #include "Platform/SQLiteFile.h"
@@ -186,6 +188,53 @@ KeychainStatus change(SQLiteTransaction& transaction, Row row, const Changes& ch
     return kKeychainSuccess;
 }
 
+using OpenedItems = std::vector<std::pair<Row, SecretBytes>>;
+
+/// The items that are not always accessible. One that does not unseal stays as it is.
+KeychainStatus openAll(SQLiteTransaction& transaction, OpenedItems& items) {
+    for (const auto itemClass :
+         {KeychainItemClass::GenericPassword, KeychainItemClass::Key, KeychainItemClass::Certificate}) {
+        KeychainQuery query;
+        query.attributes.itemClass = itemClass;
+        for (Row& row : find(transaction, query)) {
+            if (row.identity.accessibility == Accessibility::Always) continue;
+            SecretBytes value;
+            const KeychainStatus status = unsealRow(transaction, row, value);
+            if (status == kKeychainItemCorrupt) continue;
+            if (status != kKeychainSuccess) return status;
+            items.emplace_back(std::move(row), std::move(value));
+        }
+    }
+    return kKeychainSuccess;
+}
+
+KeychainStatus sealAll(SQLiteTransaction& transaction, const OpenedItems& items) {
+    for (const auto& [row, value] : items) {
+        SecretBytes sealed;
+        const KeychainStatus status = sealItem(transaction, row.identity, value, sealed);
+        if (status != kKeychainSuccess) return status;
+        transaction.prepare("UPDATE items SET sealed = ? WHERE sequence = ?")
+            .bindBlob(sealed)
+            .bindInteger(row.sequence)
+            .run();
+    }
+    return kKeychainSuccess;
+}
+
+/// Whoever has an earlier copy of the file, and what opened that, is to learn nothing from this one.
+KeychainStatus replaceClassKey(const Work& replace) {
+    std::string keptBefore;
+    const KeychainStatus status = changeItems([&](SQLiteTransaction& transaction) {
+        OpenedItems items;
+        keptBefore = keptKeyName(transaction);
+        KeychainStatus step = openAll(transaction, items);
+        if (step == kKeychainSuccess) step = replace(transaction);
+        return step == kKeychainSuccess ? sealAll(transaction, items) : step;
+    });
+    if (status == kKeychainSuccess && !keptBefore.empty()) (void)kernel_keyring::remove(keptBefore);
+    return status;
+}
+
 bool tooLong(Bytes value) {
     if (value.size() <= kMaxKeychainItemBytes) return false;
     VELTOID_PLATFORM_LOG(Error, "keychain: a value of " + std::to_string(value.size()) + " bytes is refused");
@@ -271,21 +320,25 @@ std::optional<Protection> protection() {
 }
 
 KeychainStatus setPassphrase(Bytes passphrase) {
-    return changeItems(
-        [&](SQLiteTransaction& transaction) { return wrapByPassphrase(transaction, passphrase); });
+    return replaceClassKey(
+        [&](SQLiteTransaction& transaction) { return replaceByPassphrase(transaction, passphrase); });
 }
 
-KeychainStatus removePassphrase() {
-    const KeychainStatus status = changeItems(wrapByDeviceKey);
-    if (status == kKeychainSuccess) (void)lock();
-    return status;
-}
+KeychainStatus removePassphrase() { return replaceClassKey(replaceByDeviceKey); }
 
 KeychainStatus unlock(Bytes passphrase) {
     return readItems(
         [&](SQLiteTransaction& transaction) { return unlockByPassphrase(transaction, passphrase); });
 }
 
-KeychainStatus lock() { return readItems(lockClassKey); }
+KeychainStatus lock() {
+    std::string kept;
+    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
+        kept = keptKeyName(transaction);
+        return kKeychainSuccess;
+    });
+    if (status != kKeychainSuccess) return status;
+    return kept.empty() || kernel_keyring::remove(kept) ? kKeychainSuccess : kKeychainNotAvailable;
+}
 
 }  // namespace platform::keychain

@@ -87,13 +87,19 @@ KeychainStatus openWithDeviceKey(SQLiteTransaction& transaction, ClassKey which,
 
 // --- Under a passphrase
 
-/// What the kernel keeps an opened keychain's key by.
-std::string keyringName(SQLiteTransaction& transaction) {
-    return "veltoid keychain " + transaction.directory();
-}
-
 bool isWellFormed(Bytes wrapped) {
     return wrapped.size() > kHeaderBytes && wrapped.front() == kPassphraseVersion;
+}
+
+/// No two passphrases that were set share a salt, and it stays the same for every process.
+std::string keyringName(Bytes wrapped) {
+    constexpr char kDigits[] = "0123456789abcdef";
+    std::string name = "veltoid keychain ";
+    for (const uint8_t byte : wrapped.subspan(kSaltAt, kSaltBytes)) {
+        name += kDigits[byte >> 4U];
+        name += kDigits[byte & 0x0FU];
+    }
+    return name;
 }
 
 std::optional<SecretBytes> derive(Bytes passphrase, Bytes header) {
@@ -117,8 +123,7 @@ std::optional<SecretBytes> openWith(Bytes derivedKey, ClassKey which, Bytes wrap
 KeychainStatus openWithKeyring(SQLiteTransaction& transaction, ClassKey which, Bytes wrapped,
                                SecretBytes& key) {
     if (!isWellFormed(wrapped)) return unusable(transaction, which, "is damaged");
-    const auto kept = kernel_keyring::find(keyringName(transaction));
-    // One that was kept for an earlier passphrase opens nothing.
+    const auto kept = kernel_keyring::find(keyringName(wrapped));
     auto opened = kept && kept->size() == kSealingKeyBytes ? openWith(*kept, which, wrapped) : std::nullopt;
     if (!opened) return kKeychainLocked;
     key = std::move(*opened);
@@ -150,38 +155,46 @@ KeychainStatus classKey(SQLiteTransaction& transaction, ClassKey which, SecretBy
 }
 
 KeychainStatus readProtection(SQLiteTransaction& transaction, Protection& protection) {
-    const auto row = rowOf(transaction, ClassKey::AfterFirstUnlock);
-    if (transaction.failed()) return kKeychainNotAvailable;
-    protection = Protection::NoPassphrase;
-    if (!row || row->wrapping != Wrapping::Passphrase) return kKeychainSuccess;
+    bool found = false;
     SecretBytes key;
-    const KeychainStatus status = openWithKeyring(transaction, ClassKey::AfterFirstUnlock, row->wrapped, key);
-    protection = status == kKeychainSuccess ? Protection::Unlocked : Protection::Locked;
+    const KeychainStatus status = readClassKey(transaction, ClassKey::AfterFirstUnlock, found, key);
+    protection = status == kKeychainLocked          ? Protection::Locked
+                 : keptKeyName(transaction).empty() ? Protection::NoPassphrase
+                                                    : Protection::Unlocked;
     return status == kKeychainLocked ? kKeychainSuccess : status;
 }
 
-KeychainStatus wrapByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
+KeychainStatus replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
     constexpr ClassKey kWhich = ClassKey::AfterFirstUnlock;
     SecretBytes key;
     if (const KeychainStatus status = classKey(transaction, kWhich, key); status != kKeychainSuccess)
         return status;
+    fillRandom(key);
     const ScryptCost cost;
     SecretBytes wrapped = {kPassphraseVersion, cost.logN, cost.blockSize, cost.parallelism};
     wrapped.resize(kHeaderBytes);
     fillRandom(std::span(wrapped).subspan(kSaltAt));
     const auto derived = derive(passphrase, wrapped);
     // Without a keyring nobody could ever unlock it.
-    if (!derived || !kernel_keyring::store(keyringName(transaction), *derived)) return kKeychainNotAvailable;
+    if (!derived || !kernel_keyring::store(keyringName(wrapped), *derived)) return kKeychainNotAvailable;
     const SecretBytes sealed = seal(*derived, passphraseContext(kWhich, wrapped), key);
     wrapped.insert(wrapped.end(), sealed.begin(), sealed.end());
     return store(transaction, kWhich, Wrapping::Passphrase, wrapped);
 }
 
-KeychainStatus wrapByDeviceKey(SQLiteTransaction& transaction) {
+KeychainStatus replaceByDeviceKey(SQLiteTransaction& transaction) {
     SecretBytes key;
     const KeychainStatus status = classKey(transaction, ClassKey::AfterFirstUnlock, key);
-    return status == kKeychainSuccess ? storeUnderDeviceKey(transaction, ClassKey::AfterFirstUnlock, key)
-                                      : status;
+    if (status != kKeychainSuccess) return status;
+    fillRandom(key);
+    return storeUnderDeviceKey(transaction, ClassKey::AfterFirstUnlock, key);
+}
+
+std::string keptKeyName(SQLiteTransaction& transaction) {
+    const auto row = rowOf(transaction, ClassKey::AfterFirstUnlock);
+    return row && row->wrapping == Wrapping::Passphrase && isWellFormed(row->wrapped)
+               ? keyringName(row->wrapped)
+               : std::string();
 }
 
 KeychainStatus unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
@@ -193,12 +206,8 @@ KeychainStatus unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphra
     const auto derived = derive(passphrase, row->wrapped);
     if (!derived) return unusable(transaction, kWhich, "takes more memory than there is to open");
     if (!openWith(*derived, kWhich, row->wrapped)) return kKeychainWrongPassphrase;
-    return kernel_keyring::store(keyringName(transaction), *derived) ? kKeychainSuccess
-                                                                     : kKeychainNotAvailable;
-}
-
-KeychainStatus lockClassKey(SQLiteTransaction& transaction) {
-    return kernel_keyring::remove(keyringName(transaction)) ? kKeychainSuccess : kKeychainNotAvailable;
+    return kernel_keyring::store(keyringName(row->wrapped), *derived) ? kKeychainSuccess
+                                                                      : kKeychainNotAvailable;
 }
 
 }  // namespace platform::keychain

@@ -5,6 +5,8 @@
 // once. All operations are part of a transaction of the keychain's file.
 #pragma once
 
+#include <string>
+
 #include "Platform/Keychain.h"
 #include "Platform/SQLiteFile.h"
 
@@ -31,9 +33,15 @@ KeychainStatus classKey(SQLiteTransaction& transaction, ClassKey which, SecretBy
 // --- The key of the class "after first unlock"; see Keychain.h
 
 KeychainStatus readProtection(SQLiteTransaction& transaction, Protection& protection);
-KeychainStatus wrapByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
-KeychainStatus wrapByDeviceKey(SQLiteTransaction& transaction);
+
+/// A new key takes the place of the one that there is, which has to be at hand: what it has sealed has to be
+/// read before, and sealed again after it.
+KeychainStatus replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
+KeychainStatus replaceByDeviceKey(SQLiteTransaction& transaction);
+
 KeychainStatus unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
-KeychainStatus lockClassKey(SQLiteTransaction& transaction);
+
+/// What the kernel keeps the passphrase's key by while the keychain is unlocked; empty without a passphrase.
+std::string keptKeyName(SQLiteTransaction& transaction);
 
 }  // namespace platform::keychain

@@ -15,6 +15,8 @@ class LockState {
   public:
     virtual ~LockState() = default;
     static LockState& shared();
+    /// From now on the device counts as unlocked: for a process without a keychain.
+    static void assumeUnlocked();
     /// Tests only: the caller keeps `state` alive until it is replaced by null.
     static void replaceShared(LockState* state);
 

@@ -74,6 +74,7 @@ class WholeJob(unittest.TestCase):
         with World("--noprefsfile") as world, world.client() as client:
             self.assertTrue(add(client)["success"])
             self.assertEqual(set(client.call(DATABASE)["result"]), {"Accounts", "Certificates", "MetaInfo"})
+            self.assertTrue(client.call(STATUS)["status"]["DeviceUnlockedSinceBoot"])
             self.assertFalse((world.folder / "state").exists())
 
     def test_the_password_service_verifies_and_nothing_else(self):

@@ -3,8 +3,10 @@
 from __future__ import annotations
 
 import contextlib
+import ctypes
 import json
 import os
+import platform
 import pty
 import resource
 import shutil
@@ -24,6 +26,13 @@ from world import ACCOUNT, PASSWORD, STATUS, World, hashed  # noqa: E402
 
 def client_program() -> str:
     return os.environ["VELTOID_CLIENT"]
+
+
+def keyring_is_permitted() -> bool:
+    """Asks the kernel itself: add_key(2) to the user keyring, which is number -4."""
+    number = {"x86_64": 248, "aarch64": 217}.get(platform.machine())
+    secret = b"x"
+    return number is not None and ctypes.CDLL(None).syscall(number, b"user", b"veltoid test", secret, len(secret), -4) >= 0
 
 
 class CommandLine(unittest.TestCase):
@@ -142,9 +151,9 @@ class CommandLine(unittest.TestCase):
 
     def set_passphrase(self, passphrase: str):
         """Until the test ends."""
-        if "keyring is not available" in self.run_client("keychain", "set-passphrase", "--password-stdin",
-                                                         stdin=passphrase).stderr:
+        if not keyring_is_permitted():
             self.skipTest("the kernel's keyring is not permitted here")
+        self.run_table([(["keychain", "set-passphrase", "--password-stdin"], passphrase, 0, "has this passphrase")])
         self.addCleanup(self.run_client, "keychain", "remove-passphrase")
         self.addCleanup(self.run_client, "keychain", "unlock", "--password-stdin", stdin=passphrase)
 
@@ -154,7 +163,7 @@ class CommandLine(unittest.TestCase):
                         (["keychain", "lock"], "", 1, "no passphrase"),
                         (["keychain", "unlock"], "", 0, "no passphrase")])
         self.set_passphrase("open")
-        readable = (["info", "--refresh"], "", 0, "Jane")
+        readable = (["status"], "", 0, "NoCertificate")
         self.run_table([
             (["keychain", "status"], "", 0, "unlocked"), readable,
             (["keychain", "lock"], "", 0, "is locked"),
@@ -162,6 +171,7 @@ class CommandLine(unittest.TestCase):
             (["status"], "", 0, "PasswordInaccessibleInKeychain"),
             (["status"], "", 0, "unlocked since boot:  no"),
             (["add", "kim@example.com", "--no-sign-in", "--password-stdin"], "x", 1, "is locked"),
+            (["add", ACCOUNT, "--no-sign-in", "--password-stdin"], "x", 1, "is locked"),
             (["list"], "", 0, ACCOUNT),
             (["keychain", "set-passphrase", "--password-stdin"], "mine", 1, "is locked"),
             (["keychain", "remove-passphrase"], "", 1, "is locked"),

@@ -69,7 +69,7 @@ veltoid::Key privateKeyOf(const ClientCertificate& certificate) {
         dataIn(certificate.reply.value("result", Json::object()), "CertificatePrivateKeyReference");
     veltoid::Key key;
     if (!veltoid::copyKeyFromKeychainGivenPersistentRef(reference, &key) || !key.isPrivate)
-        throw std::runtime_error("the private key is not in this user's keychain");
+        throw std::runtime_error(reasonUnlessLocked("the private key is not in this user's keychain"));
     if (key.publicPart != veltoid::Data(certificate.certificate->publicKey))
         throw std::runtime_error("the private key in the keychain is not the certificate's");
     return key;

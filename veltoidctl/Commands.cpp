@@ -2,7 +2,6 @@
 
 #include <iostream>
 
-#include "Platform/Keychain.h"
 #include "veltoidctl/ClientCertificate.h"
 #include "veltoidctl/Printing.h"
 #include "veltoidctl/Request.h"
@@ -34,13 +33,6 @@ void printOutcome(const ClientCertificate& found, const Arguments& arguments) {
     } else if (found.isPending()) {
         std::cout << found.whyThereIsNone() << "\n";
     }
-}
-
-/// Why the agent could not take it, where the agent's own answer is only a number.
-std::string likelyReason() {
-    return platform::keychain::protection() == platform::keychain::Protection::Locked
-               ? "the keychain is locked; `veltoidctl keychain unlock` comes first"
-               : "the agent could not do it";
 }
 
 /// What somebody who added the account would miss; empty when nothing is.
@@ -87,7 +79,7 @@ int add(AgentConnection& agent, const Arguments& arguments) {
             printAdded(reply, arguments);
             printOutcome(found, arguments);
         },
-        succeeded(reply) ? "" : likelyReason());
+        succeeded(reply) ? "" : reasonUnlessLocked("the agent could not do it"));
     const std::string missing = shortcoming(reply, arguments, found);
     if (status != kDone || missing.empty()) return status;
     if (!arguments.json)

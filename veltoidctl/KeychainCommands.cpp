@@ -28,14 +28,8 @@ const char* nameOf(Protection protection) {
 }
 
 std::string reasonFor(platform::KeychainStatus status) {
-    switch (status) {
-        case platform::kKeychainWrongPassphrase:
-            return "that is not the passphrase";
-        case platform::kKeychainLocked:
-            return "the keychain is locked; `veltoidctl keychain unlock` comes first";
-        default:
-            return "the keychain or the kernel's keyring is not available";
-    }
+    if (status == platform::kKeychainWrongPassphrase) return "that is not the passphrase";
+    return reasonUnlessLocked("the keychain or the kernel's keyring is not available");
 }
 
 int presentOutcome(platform::KeychainStatus status, const Arguments& arguments, const std::string& what,

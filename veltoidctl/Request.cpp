@@ -1,5 +1,7 @@
 #include "veltoidctl/Request.h"
 
+#include "Platform/Keychain.h"
+
 namespace veltoidctl {
 
 Json send(AgentConnection& agent, const Request& request) {
@@ -32,5 +34,11 @@ Json send(AgentConnection& agent, const Request& request) {
 }
 
 bool succeeded(const Json& reply) { return reply.value("success", false); }
+
+std::string reasonUnlessLocked(const std::string& reason) {
+    return platform::keychain::protection() == platform::keychain::Protection::Locked
+               ? "the keychain is locked; `veltoidctl keychain unlock` comes first"
+               : reason;
+}
 
 }  // namespace veltoidctl

@@ -43,4 +43,7 @@ Json send(AgentConnection& agent, const Request& request);
 
 bool succeeded(const Json& reply);
 
+/// Why something could not be had: that the keychain is locked, if it is, else `reason`.
+std::string reasonUnlessLocked(const std::string& reason);
+
 }  // namespace veltoidctl

@@ -18,6 +18,7 @@
 #include "VeltoIDAuthenticationImpl/FetchDelays.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/RequestPacing.h"
+#include "VeltoIDKeychainItems/Passwords.h"
 
 namespace veltoid {
 namespace {
@@ -42,6 +43,16 @@ void fetchPendingCertificate(const String& accountName, const Dictionary& record
     const auto date = record.date(kVeltoIDAccountCertificateNextCertificateFetchDateKey);
     if (date && *date >= now() && *date <= now() + kDay) return;
     __VeltoIDDoFetchCertificateForVeltoID(accountName, false, options);
+}
+
+/// The keychain may have been unlocked, or locked, since the account was examined.
+void dropLostPassword(const String& accountName, const Dictionary& record) {
+    const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+    if (!platform::LockState::shared().hasBeenUnlockedSinceBoot() ||
+        copyPasswordFromKeychainGivenPersistentRef(reference, nullptr))
+        return;
+    __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountHashedPasswordKeychainReferenceKey, Value::null(),
+                               true);
 }
 
 /// The account is of no use until somebody gives it its password again.
@@ -87,10 +98,7 @@ void checkAccount(const String& accountName, const Dictionary& record) {
         case AccountState::NoEncodedDSID:
             return __VeltoIDDoFetchEncodedDSIDForVeltoID(accountName, options);
         case AccountState::PasswordInaccessibleInKeychain:
-            if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return;
-            __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountHashedPasswordKeychainReferenceKey,
-                                       Value::null(), true);
-            return;
+            return dropLostPassword(accountName, record);
         case AccountState::PasswordInvalid:
             return dropPassword(accountName, record);
         case AccountState::CertificateRevoked:

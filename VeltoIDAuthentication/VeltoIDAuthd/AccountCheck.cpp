@@ -90,8 +90,10 @@ struct Plan {
 class AccountCheckLoop {
   public:
     [[noreturn]] void run() {
-        waitForUnlock();
-        while (true) pass();
+        while (true) {
+            waitForUnlock();
+            pass();
+        }
     }
 
   private:
@@ -151,13 +153,19 @@ class AccountCheckLoop {
         const Plan next = plan();
         if (!sleepUntilTimeFor(next)) return;
         keepDistance();
-        // Locked again meanwhile, it would take passwords that it cannot read for lost.
-        waitForUnlock();
+        if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return giveBack(next);
         if (next.accounts.empty()) {
             __VeltoIDCleanupAccountsAndCertificates({});
         } else {
             check(next.accounts);
         }
+    }
+
+    /// The plan is for later: the keychain was locked while the loop slept.
+    static void giveBack(const Plan& plan) {
+        if (!plan.isForChanged) return;
+        for (const Value& name : plan.accounts)
+            __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDDirtyKey, Value::boolean(true), false);
     }
 
     /// False when the sleep has ended before its time, by a change or by the clock: the plan may be another

@@ -11,6 +11,7 @@
 #include "Logging/Log.h"
 #include "Platform/Clock.h"
 #include "Platform/EventLoop.h"
+#include "Platform/LockState.h"
 #include "Platform/Succession.h"
 #include "Platform/SystemLog.h"
 #include "Platform/WorkQueue.h"
@@ -61,6 +62,7 @@ void prepareDatabase(const CommandLine& line) {
     __VeltoIDDBSetUsePreferences(line.usePreferences);
     __VeltoIDDBSetFindPersonCacheUsePreferences(line.usePreferences);
     setUseSystemKeychain(line.usePreferences);
+    if (!line.usePreferences) platform::LockState::assumeUnlocked();
     for (const auto& [key, value] : line.metaInfoValues)
         __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
 }

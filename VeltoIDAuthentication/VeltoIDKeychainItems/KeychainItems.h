@@ -37,6 +37,11 @@ platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass,
 /// The item list of the query that names one item, as a log line shows it.
 std::string describeItemQuery(std::string_view itemClass, const Data& reference);
 
+/// Whether what failed with that status may be had later: no reason to replace an item.
+inline bool mayPass(platform::KeychainStatus status) {
+    return status == platform::kKeychainLocked || status == platform::kKeychainNotAvailable;
+}
+
 /// The reference of the first item that matches; null, with the status, when there is none.
 Data copyReference(const platform::KeychainAttributes& attributes,
                    platform::KeychainStatus* status = nullptr);

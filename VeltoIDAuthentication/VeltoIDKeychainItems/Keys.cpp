@@ -37,12 +37,11 @@ Accessibility accessibilityOf(const Key& key) {
 }
 
 /// Same key, so only what surrounds it can differ.
-bool updateItem(const Data& reference, const Key& key, const std::string& label) {
+KeychainStatus updateItem(const Data& reference, const Key& key, const std::string& label) {
     const auto bytes = key.encoded.bytes();
     return platform::keychain::update(keychain_items::queryForReference(KeychainItemClass::Key, reference),
                                       {platform::SecretBytes(bytes.begin(), bytes.end()),
-                                       accessibilityOf(key), label, kKeychainAccessGroup}) ==
-           platform::kKeychainSuccess;
+                                       accessibilityOf(key), label, kKeychainAccessGroup});
 }
 
 /// A duplicate that the search did not show makes room once.
@@ -66,12 +65,14 @@ bool addItem(const Key& key, const std::string& label, Data* reference) {
 bool addOrUpdate(const Key& key, const std::string& label, Data* reference) {
     KeychainStatus status = platform::kKeychainSuccess;
     const Data found = keychain_items::copyReference(identityOf(key), &status);
-    if (found && updateItem(found, key, label)) {
-        *reference = found;
-        return true;
+    if (found) {
+        status = updateItem(found, key, label);
+        if (status == platform::kKeychainSuccess) *reference = found;
+        if (status == platform::kKeychainSuccess || keychain_items::mayPass(status))
+            return status == platform::kKeychainSuccess;
+        // Damaged: the key at hand replaces it.
+        platform::keychain::remove({identityOf(key), {}});
     }
-    // An item that cannot be updated is damaged: the key at hand replaces it.
-    if (found) platform::keychain::remove({identityOf(key), {}});
     if (!found && status != platform::kKeychainItemNotFound) return false;
     return addItem(key, label, reference);
 }

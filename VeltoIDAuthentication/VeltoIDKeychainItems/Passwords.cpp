@@ -47,18 +47,18 @@ platform::SecretBytes secretBytes(const String& passwordHash) {
 
 /// Changes the item's password in place; an item that was bound to this device may move with its backup from
 /// then on.
-bool updateItem(const Data& reference, const String& passwordHash) {
+KeychainStatus updateItem(const Data& reference, const String& passwordHash) {
     VELTOID_LOG_FROM("addPasswordToKeychain", kError,
                      "Password already in keychain; updating it to (new) value.  persistentRef="
                          << describeValue(reference));
     const KeychainStatus status = platform::keychain::update(
         queryForReference(reference), {secretBytes(passwordHash), Accessibility::AfterFirstUnlock, {}, {}});
-    if (status == platform::kKeychainSuccess) return true;
+    if (status == platform::kKeychainSuccess || keychain_items::mayPass(status)) return status;
     VELTOID_LOG_FROM("addPasswordToKeychain", kNotice,
                      "SetItemUpdate(" << keychain_items::describeItemQuery("genp", reference)
                                       << ", attrs=(supressed) err=" << status
                                       << " so deleting and re-adding item.");
-    return false;
+    return status;
 }
 
 /// Adds a fresh item; a duplicate that the search by account did not find makes room for it once.
@@ -81,10 +81,13 @@ bool addOrUpdate(const String& accountName, const String& passwordHash, const St
     KeychainStatus status = platform::keychain::copyMatchingReferences(queryForAccount(accountName), &found);
     if (status == platform::kKeychainSuccess && !found.empty()) {
         *reference = keychain_items::dataOf(found.front());
-        if (updateItem(*reference, passwordHash)) return true;
+        status = updateItem(*reference, passwordHash);
+        if (status == platform::kKeychainSuccess) return true;
         *reference = {};
-        platform::keychain::remove(queryForAccount(accountName));
-        status = platform::kKeychainItemNotFound;
+        if (!keychain_items::mayPass(status)) {
+            platform::keychain::remove(queryForAccount(accountName));
+            status = platform::kKeychainItemNotFound;
+        }
     }
     if (status == platform::kKeychainItemNotFound)
         status = addItem(creationAttributes(accountName, label), passwordHash, reference);
