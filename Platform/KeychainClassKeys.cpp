@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "Platform/Crypto.h"
+#include "Platform/HexText.h"
 #include "Platform/KernelKeyring.h"
 #include "Platform/KeychainDeviceKey.h"
 #include "Platform/SystemLog.h"
@@ -93,13 +94,7 @@ bool isWellFormed(Bytes wrapped) {
 
 /// No two passphrases that were set share a salt, and it stays the same for every process.
 std::string keyringName(Bytes wrapped) {
-    constexpr char kDigits[] = "0123456789abcdef";
-    std::string name = "veltoid keychain ";
-    for (const uint8_t byte : wrapped.subspan(kSaltAt, kSaltBytes)) {
-        name += kDigits[byte >> 4U];
-        name += kDigits[byte & 0x0FU];
-    }
-    return name;
+    return "veltoid keychain " + hexText(wrapped.subspan(kSaltAt, kSaltBytes));
 }
 
 std::optional<SecretBytes> derive(Bytes passphrase, Bytes header) {

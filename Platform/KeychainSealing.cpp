@@ -3,6 +3,7 @@
 #include <string_view>
 
 #include "Platform/Crypto.h"
+#include "Platform/HexText.h"
 #include "Platform/KeychainClassKeys.h"
 #include "Platform/SystemLog.h"
 
@@ -20,16 +21,6 @@ void appendField(std::vector<uint8_t>& output, std::optional<std::string_view> f
     if (!field) return;
     appendNumber(output, field->size(), 8);
     output.insert(output.end(), field->begin(), field->end());
-}
-
-std::string hexText(Bytes bytes) {
-    constexpr char kDigits[] = "0123456789abcdef";
-    std::string text;
-    for (const uint8_t byte : bytes) {
-        text += kDigits[byte >> 4U];
-        text += kDigits[byte & 0x0FU];
-    }
-    return text;
 }
 
 ClassKey classKeyOf(Accessibility accessibility) {

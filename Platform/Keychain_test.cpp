@@ -7,7 +7,6 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <cstdio>
 #include <filesystem>
 #include <functional>
 #include <set>
@@ -15,6 +14,7 @@
 #include <vector>
 
 #include "Platform/FakeSystemLog.h"
+#include "Platform/HexText.h"
 #include "Platform/KeychainSealing.h"
 #include "Platform/TemporaryStateDirectory.h"
 
@@ -67,16 +67,6 @@ std::string valueOf(const KeychainQuery& query) {
     if (status == kKeychainSuccess) return std::string(textOf(data));
     EXPECT_EQ(textOf(data), "untouched");
     return std::to_string(status);
-}
-
-std::string hexText(const PersistentReference& reference) {
-    std::string text;
-    for (const uint8_t byte : reference) {
-        char digits[3];
-        (void)std::snprintf(digits, sizeof digits, "%02x", byte);
-        text += digits;
-    }
-    return text;
 }
 
 class KeychainTest : public testing::Test {

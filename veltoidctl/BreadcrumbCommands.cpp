@@ -1,6 +1,7 @@
 // The commands about breadcrumbs: small pieces of data that the identity server keeps for account and device.
 #include <iostream>
 
+#include "Platform/HexText.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Files.h"
 #include "veltoidctl/JsonBuilder.h"
@@ -12,12 +13,6 @@ namespace {
 
 constexpr const char* kKey = "identifier";
 constexpr const char* kData = "breadcrumb";
-
-void printHexadecimal(platform::Bytes bytes) {
-    constexpr char kDigits[] = "0123456789abcdef";
-    for (const uint8_t byte : bytes) std::cout << kDigits[byte >> 4U] << kDigits[byte & 15U];
-    std::cout << "\n";
-}
 
 }  // namespace
 
@@ -55,7 +50,7 @@ int getBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
     return present(
         reply, arguments, "breadcrumb get",
         [&](const Json&) {
-            if (isShown) printHexadecimal(data.bytes());
+            if (isShown) std::cout << platform::hexText(data.bytes()) << "\n";
         },
         "nothing is kept under " + arguments.key);
 }

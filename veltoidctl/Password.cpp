@@ -9,6 +9,7 @@
 #include <stdexcept>
 
 #include "Platform/Crypto.h"
+#include "Platform/HexText.h"
 
 namespace veltoidctl {
 namespace {
@@ -67,14 +68,8 @@ platform::SecretText ask(const QuietTerminal& terminal, const std::string& quest
 }
 
 platform::SecretText hashOf(const platform::SecretText& password) {
-    constexpr char kDigits[] = "0123456789abcdef";
     platform::SHA256Digest digest = platform::sha256(platform::bytesOf(password));
-    platform::SecretText text;
-    text.reserve(2 * digest.size());
-    for (const uint8_t byte : digest) {
-        text += kDigits[byte >> 4U];
-        text += kDigits[byte & 15U];
-    }
+    auto text = platform::hexText<platform::SecretText>(digest);
     platform::wipe(digest.data(), digest.size());
     return text;
 }

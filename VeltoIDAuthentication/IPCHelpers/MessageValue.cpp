@@ -5,6 +5,8 @@
 #include <cstdio>
 #include <ctime>
 
+#include "Platform/HexText.h"
+
 namespace veltoid {
 
 const MessageValue* MessageDictionary::find(std::string_view key) const {
@@ -82,16 +84,6 @@ std::string describeDate(double seconds) {
     return {text, static_cast<size_t>(length)};
 }
 
-std::string describeData(const Data& data) {
-    constexpr char kDigits[] = "0123456789abcdef";
-    std::string text;
-    for (const uint8_t byte : data.bytes()) {
-        text += kDigits[byte >> 4U];
-        text += kDigits[byte & 15U];
-    }
-    return text;
-}
-
 std::string describeDictionary(const MessageDictionary& dictionary) {
     std::string text = "{" + std::to_string(dictionary.entries.size()) + " ";
     for (const auto& [key, element] : dictionary.entries) text += key.text() + "=" + describe(element) + ", ";
@@ -166,7 +158,7 @@ std::string describe(const MessageValue& value) {
             [](uint64_t integer) { return std::to_string(integer) + "U"; },
             [](double real) { return "ipc object:" + decimal(real) + " "; },
             [](const String& text) { return "\"" + text.text() + "\""; },
-            [](const Data& data) { return describeData(data); },
+            [](const Data& data) { return platform::hexText(data.bytes()); },
             [](MessageDate date) { return describeDate(date.seconds); },
             [](const MessageArray& array) { return describeArray(array); },
             [](const MessageDictionary& dictionary) { return describeDictionary(dictionary); },

@@ -1,5 +1,7 @@
 #include "Values/Digest.h"
 
+#include "Platform/HexText.h"
+
 namespace veltoid {
 
 Data sha256OfString(const String& text) {
@@ -7,16 +9,7 @@ Data sha256OfString(const String& text) {
     return Data(platform::sha256(platform::bytesOf(text.view())));
 }
 
-std::string sha256Text(const Data& data) {
-    constexpr char kDigits[] = "0123456789abcdef";
-    std::string text;
-    text.reserve(2 * std::tuple_size_v<platform::SHA256Digest>);
-    for (const uint8_t byte : platform::sha256(data.bytes())) {
-        text += kDigits[byte >> 4U];
-        text += kDigits[byte & 0x0FU];
-    }
-    return text;
-}
+std::string sha256Text(const Data& data) { return platform::hexText(platform::sha256(data.bytes())); }
 
 Data uuidBytes(const platform::UUIDBytes& uuid) { return Data(uuid); }
 
