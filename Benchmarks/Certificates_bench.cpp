@@ -28,7 +28,7 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "Certificates/ValidationRecord.h"
-#include "Platform/OpenSSLLibrary.h"
+#include "Platform/crypto/OpenSSLLibrary.h"
 
 namespace {
 

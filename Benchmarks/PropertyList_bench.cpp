@@ -10,7 +10,7 @@
 #include <utility>
 #include <vector>
 
-#include "Platform/PropertyList.h"
+#include "Platform/propertylist/PropertyList.h"
 #include "Values/ValueStream.h"
 
 namespace {

@@ -28,7 +28,7 @@ from collections.abc import Iterator
 from dataclasses import dataclass
 
 ROOT = pathlib.Path(__file__).resolve().parent.parent
-sys.path[:0] = [str(ROOT / "scripts"), str(ROOT / "Tests")]
+sys.path[:0] = [str(ROOT / "Tests" / "harness"), str(ROOT / "Tests")]
 from world import (ACCOUNT, ADD, INFO, LIST, PASSWORD, PING, SERVICE, STATUS, Client, IdentityServer,  # noqa: E402
                      World, hashed)
 from load_test import CLIENTS as LOAD_CLIENTS, ping_times  # noqa: E402

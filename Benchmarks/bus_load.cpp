@@ -21,7 +21,7 @@
 #include <thread>
 #include <vector>
 
-#include "Platform/BusConnection.h"
+#include "Platform/bus/BusConnection.h"
 
 namespace {
 

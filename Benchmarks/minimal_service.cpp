@@ -7,7 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "Platform/BusConnection.h"
+#include "Platform/bus/BusConnection.h"
 
 namespace {
 

@@ -9,7 +9,7 @@
 #include <memory>
 
 #include "IPCHelpers/IPCMessage.h"
-#include "Platform/BusMessage.h"
+#include "Platform/bus/BusMessage.h"
 
 namespace {
 

@@ -4,10 +4,10 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "Certificates/ValidationRecord.h"
-#include "Platform/KeyPair.h"
-#include "Platform/SignedMessage.h"
+#include "Platform/crypto/KeyPair.h"
+#include "Platform/crypto/SignedMessage.h"
 #include "Values/Base64.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 
 namespace {
 

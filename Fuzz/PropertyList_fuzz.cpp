@@ -4,9 +4,9 @@
 #include <cstdlib>
 #include <string>
 
-#include "Platform/PropertyList.h"
-#include "Platform/PropertyListPlainXML.h"
-#include "Platform/XMLReader.h"
+#include "Platform/propertylist/PropertyList.h"
+#include "Platform/propertylist/PropertyListPlainXML.h"
+#include "Platform/xml/XMLReader.h"
 
 namespace {
 

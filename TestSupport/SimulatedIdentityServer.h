@@ -8,9 +8,9 @@
 #include <string>
 #include <vector>
 
+#include "TestSupport/FakeIdentityServer.h"
 #include "TestSupport/TestAuthority.h"
 #include "Values/Base64.h"
-#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
 
 namespace veltoid::testing_support {
 

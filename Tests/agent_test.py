@@ -11,7 +11,7 @@ import subprocess
 import sys
 import unittest
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
 from world import (ACCOUNT, ADD, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD,  # noqa: E402
                    PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE, VERIFY, BusError,
                    NameOwner, World, agent_program, hashed)

@@ -13,7 +13,7 @@ import subprocess
 import sys
 import unittest
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
 from world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB,  # noqa: E402
                    INFO, OTHER_ACCOUNT, PASSWORD, PING, SET_BREADCRUMB, VERIFY, World, hashed)
 

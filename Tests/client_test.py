@@ -19,7 +19,7 @@ import time
 import unittest
 import urllib.request
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
 from systemd_world import wait_until  # noqa: E402
 from world import ACCOUNT, PASSWORD, STATUS, World, hashed  # noqa: E402
 

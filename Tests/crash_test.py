@@ -13,7 +13,7 @@ import pathlib
 import sys
 import unittest
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
 from world import ADD, DATABASE, FORGET, LIST, SET_VALUE, STATUS, BusError, World, hashed  # noqa: E402
 
 ROUNDS = int(os.environ.get("VELTOID_CRASH_ROUNDS", "200"))

@@ -22,7 +22,7 @@ import unittest
 from collections import Counter
 from dataclasses import dataclass
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent.parent / "scripts"))
+sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
 from load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, is_success, mix,
                           sleep_until, success_with, wait_for_certificate)
 from world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, PING, World, hashed

@@ -3,11 +3,11 @@
 // sanitizers pass less).
 #include <cstdlib>
 
+#include "TestSupport/CertificateFixture.h"
 #include "TestSupport/SimulatedIdentityServer.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
-#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {

@@ -10,7 +10,7 @@ import sys
 import time
 import unittest
 
-from leaving_test import Writer
+from shutdown_test import Writer
 from systemd_world import TIMER, UNIT, UserSession, run_inside
 from world import (ACCOUNT, ADD, INTERFACE, OBJECT, PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS,
                    TERMINATE, BusError, NameOwner, hashed)

@@ -4,8 +4,8 @@
 
 #include <memory>
 
-#include "Platform/BusConnection.h"
-#include "Platform/BusMessage.h"
+#include "Platform/bus/BusConnection.h"
+#include "Platform/bus/BusMessage.h"
 #include "veltoidctl/JsonBuilder.h"
 
 namespace veltoidctl {

@@ -5,7 +5,7 @@
 #include <stdexcept>
 #include <string>
 
-#include "Platform/ValueSink.h"
+#include "Platform/encoding/ValueSink.h"
 
 struct sd_bus;
 

@@ -1,12 +1,12 @@
 // The commands about breadcrumbs: small pieces of data that the identity server keeps for account and device.
 #include <iostream>
 
-#include "Platform/HexText.h"
+#include "Platform/encoding/HexText.h"
+#include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Files.h"
 #include "veltoidctl/JsonBuilder.h"
 #include "veltoidctl/Printing.h"
-#include "veltoidctl/Request.h"
 
 namespace veltoidctl {
 namespace {

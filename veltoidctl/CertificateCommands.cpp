@@ -2,13 +2,13 @@
 #include <iostream>
 #include <stdexcept>
 
+#include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/CertificateExport.h"
 #include "veltoidctl/ClientCertificate.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Files.h"
 #include "veltoidctl/JsonBuilder.h"
 #include "veltoidctl/Printing.h"
-#include "veltoidctl/Request.h"
 
 namespace veltoidctl {
 namespace {

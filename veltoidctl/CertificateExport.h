@@ -4,8 +4,8 @@
 #include <optional>
 #include <string>
 
-#include "Platform/Certificate.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "Platform/crypto/Certificate.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 
 namespace veltoidctl {
 

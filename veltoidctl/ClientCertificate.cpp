@@ -3,10 +3,10 @@
 #include <stdexcept>
 
 #include "Values/LowerCase.h"
-#include "VeltoIDKeychainItems/Certificates.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
+#include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/JsonBuilder.h"
 #include "veltoidctl/Printing.h"
-#include "veltoidctl/Request.h"
 
 namespace veltoidctl {
 namespace {

@@ -2,9 +2,9 @@
 
 #include <iostream>
 
+#include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/ClientCertificate.h"
 #include "veltoidctl/Printing.h"
-#include "veltoidctl/Request.h"
 
 namespace veltoidctl {
 namespace {

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "Platform/ValueSink.h"
+#include "Platform/encoding/ValueSink.h"
 #include "Values/Value.h"
 #include "veltoidctl/AgentConnection.h"
 

@@ -2,11 +2,11 @@
 // afterwards.
 #include <iostream>
 
-#include "Platform/Keychain.h"
-#include "Platform/LockState.h"
+#include "Platform/keychain/Keychain.h"
+#include "Platform/keychain/LockState.h"
+#include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Printing.h"
-#include "veltoidctl/Request.h"
 
 namespace veltoidctl {
 namespace {

@@ -8,8 +8,8 @@
 #include <cstring>
 #include <stdexcept>
 
-#include "Platform/Crypto.h"
-#include "Platform/HexText.h"
+#include "Platform/crypto/Crypto.h"
+#include "Platform/encoding/HexText.h"
 
 namespace veltoidctl {
 namespace {

@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 
 namespace veltoidctl {
 

@@ -3,7 +3,7 @@
 #include <iomanip>
 #include <iostream>
 
-#include "veltoidctl/Request.h"
+#include "veltoidctl/AgentRequest.h"
 
 namespace veltoidctl {
 namespace {

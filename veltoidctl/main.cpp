@@ -5,8 +5,8 @@
 #include <iostream>
 #include <stdexcept>
 
-#include "Platform/OpenSSLLibrary.h"
-#include "veltoidctl/CommandLine.h"
+#include "Platform/crypto/OpenSSLLibrary.h"
+#include "veltoidctl/ClientCommandLine.h"
 
 namespace veltoidctl {
 namespace {

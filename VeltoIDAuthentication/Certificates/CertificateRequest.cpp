@@ -1,6 +1,6 @@
 #include "Certificates/CertificateRequest.h"
 
-#include "Platform/KeyPair.h"
+#include "Platform/crypto/KeyPair.h"
 #include "Values/Base64.h"
 #include "Values/PEM.h"
 

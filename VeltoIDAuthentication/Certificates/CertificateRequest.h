@@ -4,9 +4,9 @@
 
 #include <optional>
 
-#include "Platform/Certificate.h"
+#include "Platform/crypto/Certificate.h"
 #include "Values/Value.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 
 namespace veltoid {
 

@@ -4,9 +4,9 @@
 
 #include <sstream>
 
-#include "Platform/KeyPair.h"
+#include "Platform/crypto/KeyPair.h"
 #include "TestSupport/TestAuthority.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 
 namespace veltoid {
 namespace {

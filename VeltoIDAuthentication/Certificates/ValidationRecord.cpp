@@ -1,7 +1,7 @@
 #include "Certificates/ValidationRecord.h"
 
-#include "Platform/PropertyList.h"
-#include "Platform/SignedMessage.h"
+#include "Platform/crypto/SignedMessage.h"
+#include "Platform/propertylist/PropertyList.h"
 #include "Values/ValueStream.h"
 
 namespace veltoid {

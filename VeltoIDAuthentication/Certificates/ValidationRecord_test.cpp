@@ -4,7 +4,7 @@
 
 #include <random>
 
-#include "Platform/PropertyList.h"
+#include "Platform/propertylist/PropertyList.h"
 #include "TestSupport/TestAuthority.h"
 #include "Values/ValueStream.h"
 

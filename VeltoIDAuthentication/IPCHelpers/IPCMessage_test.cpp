@@ -7,7 +7,7 @@
 #include <vector>
 
 #include "IPCHelpers/Transaction.h"
-#include "Platform/FakeSystemLog.h"
+#include "TestSupport/FakeSystemLog.h"
 #include "Values/SecurityObject.h"
 #include "Values/ValueStream.h"
 

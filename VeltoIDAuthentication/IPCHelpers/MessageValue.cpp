@@ -5,7 +5,7 @@
 #include <cstdio>
 #include <ctime>
 
-#include "Platform/HexText.h"
+#include "Platform/encoding/HexText.h"
 
 namespace veltoid {
 

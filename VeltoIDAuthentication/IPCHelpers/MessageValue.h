@@ -8,7 +8,7 @@
 #include <variant>
 #include <vector>
 
-#include "Platform/ValueSink.h"
+#include "Platform/encoding/ValueSink.h"
 #include "Values/Value.h"
 
 namespace veltoid {

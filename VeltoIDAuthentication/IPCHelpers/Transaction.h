@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "Platform/Transactions.h"
+#include "Platform/runtime/Transactions.h"
 
 namespace veltoid {
 

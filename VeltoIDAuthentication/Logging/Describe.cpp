@@ -8,7 +8,7 @@
 #include <sstream>
 #include <vector>
 
-#include "Platform/Clock.h"
+#include "Platform/runtime/Clock.h"
 #include "Values/Error.h"
 #include "Values/SecurityObject.h"
 

@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <ctime>
 
-#include "Platform/SimulatedClock.h"
+#include "TestSupport/SimulatedClock.h"
 #include "Values/Error.h"
 #include "Values/SecurityObject.h"
 

@@ -6,9 +6,9 @@
 #include <cstring>
 #include <mutex>
 
-#include "Platform/SystemLog.h"
-#include "Platform/Transactions.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/runtime/SystemLog.h"
+#include "Platform/runtime/Transactions.h"
+#include "Platform/runtime/WorkQueue.h"
 
 namespace veltoid {
 namespace {

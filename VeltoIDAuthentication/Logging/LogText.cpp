@@ -5,7 +5,7 @@
 #include <vector>
 
 #include "Logging/Describe.h"
-#include "Platform/Clock.h"
+#include "Platform/runtime/Clock.h"
 
 namespace veltoid {
 namespace {

@@ -4,7 +4,7 @@
 #include <optional>
 #include <string>
 
-#include "Platform/WorkQueue.h"
+#include "Platform/runtime/WorkQueue.h"
 #include "Values/Value.h"
 
 namespace veltoid {

@@ -3,9 +3,9 @@
 #include <gtest/gtest.h>
 
 #include "Logging/LogText.h"
-#include "Platform/FakeSystemLog.h"
-#include "Platform/SimulatedClock.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/SimulatedClock.h"
 
 namespace veltoid {
 namespace {

@@ -2,7 +2,7 @@
 // library's.
 #pragma once
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 #include "Values/Value.h"
 
 namespace veltoid {

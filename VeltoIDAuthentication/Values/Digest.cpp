@@ -1,6 +1,6 @@
 #include "Values/Digest.h"
 
-#include "Platform/HexText.h"
+#include "Platform/encoding/HexText.h"
 
 namespace veltoid {
 

@@ -3,7 +3,7 @@
 
 #include <string>
 
-#include "Platform/Crypto.h"
+#include "Platform/crypto/Crypto.h"
 #include "Values/Value.h"
 
 namespace veltoid {

@@ -5,7 +5,7 @@
 #include <limits>
 #include <new>
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 #include "Values/Error.h"
 #include "Values/SecurityObject.h"
 

@@ -3,7 +3,7 @@
 
 #include <vector>
 
-#include "Platform/ValueSink.h"
+#include "Platform/encoding/ValueSink.h"
 #include "Values/Value.h"
 
 namespace veltoid {

@@ -7,7 +7,7 @@
 #include <map>
 #include <random>
 
-#include "Platform/PropertyList.h"
+#include "Platform/propertylist/PropertyList.h"
 #include "Values/DateText.h"
 #include "Values/DictionaryAccess.h"
 #include "Values/LowerCase.h"

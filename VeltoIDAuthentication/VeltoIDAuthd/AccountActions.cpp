@@ -6,19 +6,19 @@
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
-#include "Platform/Clock.h"
-#include "Platform/LockState.h"
+#include "Platform/keychain/LockState.h"
+#include "Platform/runtime/Clock.h"
 #include "Values/DictionaryAccess.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
-#include "VeltoIDAuthenticationImpl/FetchDelays.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
-#include "VeltoIDAuthenticationImpl/RequestPacing.h"
-#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDAuthenticationImpl/PollBackOff.h"
+#include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {
@@ -128,7 +128,7 @@ bool renewCertificateForAccount(const String& accountName, const String& encDsId
         VELTOID_LOG(kNotice, "Removing certificate for Velto ID "
                                  << describeAccountForLog(accountName) << " dsID=" << describeValue(encDsId)
                                  << " because it has expired or been revoked.");
-        discardCertificate(CustodyLock(), encDsId);
+        discardCertificate(OwnershipLock(), encDsId);
     } else {
         const double interval = metaSeconds("CertificateRenewalInterval", kRenewalInterval);
         __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateNextRenewalAttemptDateKey,

@@ -1,11 +1,11 @@
 // The account check in simulated time: when it looks at an account, and what it does then.
 #include "VeltoIDAuthd/AccountCheck.h"
 
-#include "Platform/FakeLockState.h"
+#include "TestSupport/CertificateFixture.h"
+#include "TestSupport/FakeLockState.h"
 #include "Values/Base64.h"
 #include "VeltoIDAuthd/AccountActions.h"
 #include "VeltoIDAuthd/Relaunch.h"
-#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {

@@ -3,15 +3,15 @@
 #include <unistd.h>
 
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
-#include "Platform/LockState.h"
+#include "Platform/keychain/LockState.h"
+#include "Platform/runtime/Clock.h"
 #include "VeltoIDAuthd/Relaunch.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
-#include "VeltoIDAuthenticationImpl/RequestPacing.h"
+#include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 
 namespace veltoid {
 namespace {

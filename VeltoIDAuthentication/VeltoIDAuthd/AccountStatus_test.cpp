@@ -1,11 +1,11 @@
 // The status of an account in every state, each brought about as it comes about.
 #include "VeltoIDAuthd/AccountStatus.h"
 
-#include "Platform/FakeLockState.h"
+#include "TestSupport/CertificateFixture.h"
+#include "TestSupport/FakeLockState.h"
 #include "VeltoIDAuthd/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
-#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
-#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {

@@ -5,20 +5,20 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
+#include "Platform/runtime/Clock.h"
 #include "Values/DictionaryAccess.h"
 #include "Values/LowerCase.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/AccountStatus.h"
-#include "VeltoIDAuthd/Leaving.h"
+#include "VeltoIDAuthd/ClientRequest.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
-#include "VeltoIDAuthd/Request.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthd/Shutdown.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
@@ -254,7 +254,7 @@ void terminateAfterReply() {
             kHandlerName, kNotice,
             "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
             "request.");
-        leaveByCommand();
+        shutDownByCommand();
     });
 }
 
@@ -307,7 +307,7 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
     Request request(message);
     if (request.command() == kTerminateCommand) {
         computeRelaunchFromAccounts();
-        return leaveByCommand();
+        return shutDownByCommand();
     }
     const Outcome outcome = dispatch(request);
     request.finish(outcome.success, outcome.error);

@@ -2,7 +2,7 @@
 // or the database, and packs the answer.
 #pragma once
 
-#include "Platform/MessageService.h"
+#include "Platform/bus/MessageService.h"
 
 namespace veltoid {
 

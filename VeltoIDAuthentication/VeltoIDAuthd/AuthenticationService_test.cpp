@@ -3,13 +3,13 @@
 
 #include <functional>
 
-#include "Platform/FakeNotifications.h"
+#include "TestSupport/FakeIdentityServer.h"
+#include "TestSupport/FakeNotifications.h"
 #include "VeltoIDAuthd/AccountStatus.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
-#include "VeltoIDKeychainItems/Passwords.h"
-#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {

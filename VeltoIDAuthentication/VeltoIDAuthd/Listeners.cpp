@@ -3,11 +3,11 @@
 #include <memory>
 
 #include "IPCHelpers/Transaction.h"
-#include "Platform/MessageService.h"
+#include "Platform/bus/MessageService.h"
 #include "VeltoIDAuthd/AuthenticationService.h"
+#include "VeltoIDAuthd/ClientRequest.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
-#include "VeltoIDAuthd/Request.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {

@@ -4,8 +4,8 @@
 
 #include <functional>
 
-#include "Platform/MessageService.h"
-#include "VeltoIDAuthd/Request.h"
+#include "Platform/bus/MessageService.h"
+#include "VeltoIDAuthd/ClientRequest.h"
 
 namespace veltoid {
 

@@ -6,10 +6,10 @@
 #include <mutex>
 
 #include "IPCHelpers/Transaction.h"
-#include "Platform/Clock.h"
-#include "Platform/ServiceManager.h"
-#include "Platform/WorkQueue.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "Platform/bus/ServiceManager.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 

@@ -1,8 +1,8 @@
 #include "VeltoIDAuthd/Relaunch.h"
 
-#include "Platform/ServiceManager.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/DatabaseFixture.h"
+#include "Platform/bus/ServiceManager.h"
+#include "TestSupport/DatabaseFixture.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 namespace {

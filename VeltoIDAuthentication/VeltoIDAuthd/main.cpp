@@ -9,21 +9,21 @@
 #include <cstdlib>
 
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
-#include "Platform/EventLoop.h"
-#include "Platform/LockState.h"
-#include "Platform/Succession.h"
-#include "Platform/SystemLog.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/bus/EventLoop.h"
+#include "Platform/keychain/LockState.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/InstanceLock.h"
+#include "Platform/runtime/SystemLog.h"
+#include "Platform/runtime/WorkQueue.h"
 #include "VeltoIDAuthd/AccountCheck.h"
-#include "VeltoIDAuthd/CommandLine.h"
-#include "VeltoIDAuthd/Leaving.h"
+#include "VeltoIDAuthd/AgentCommandLine.h"
 #include "VeltoIDAuthd/Listeners.h"
 #include "VeltoIDAuthd/Relaunch.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthd/Shutdown.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -103,11 +103,11 @@ int main(int argc, char** argv) {
     CommandLineError error;
     const auto line = parseCommandLine(argc, argv, error);
     if (!line) exitWithUsage(argc, argv, error);
-    if (line->usePreferences) platform::succession::waitForPrevious();
+    if (line->usePreferences) platform::instance_lock::waitForPrevious();
     prepareDatabase(*line);
     setRelaunchScheduler(scheduleRelaunch);
     flushOnInterrupt();
-    prepareLeaving();
+    prepareShutdown();
     startServices(*line);
     if (line->leaks) workForLeakChecker();
     platform::event_loop::run();

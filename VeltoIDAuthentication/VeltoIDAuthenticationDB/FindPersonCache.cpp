@@ -10,10 +10,10 @@
 #include <vector>
 
 #include "IPCHelpers/Transaction.h"
-#include "Platform/Clock.h"
-#include "Platform/Preferences.h"
-#include "Platform/PropertyList.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/propertylist/PropertyList.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "Platform/storage/Preferences.h"
 #include "Values/ValueStream.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 

@@ -5,7 +5,7 @@
 #include <limits>
 #include <thread>
 
-#include "VeltoIDAuthenticationDB/DatabaseFixture.h"
+#include "TestSupport/DatabaseFixture.h"
 
 namespace veltoid {
 namespace {

@@ -1,6 +1,6 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {

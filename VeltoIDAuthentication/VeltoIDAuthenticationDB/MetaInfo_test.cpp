@@ -2,7 +2,7 @@
 
 #include <limits>
 
-#include "VeltoIDAuthenticationDB/DatabaseFixture.h"
+#include "TestSupport/DatabaseFixture.h"
 
 namespace veltoid {
 namespace {

@@ -4,11 +4,11 @@
 #include <atomic>
 #include <vector>
 
-#include "Platform/Clock.h"
+#include "Platform/runtime/Clock.h"
 #include "Values/Digest.h"
 #include "Values/ValueStream.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace database {

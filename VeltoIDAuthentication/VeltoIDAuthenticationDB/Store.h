@@ -14,8 +14,8 @@
 #include <optional>
 
 #include "IPCHelpers/Transaction.h"
-#include "Platform/Preferences.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "Platform/storage/Preferences.h"
 #include "Values/Error.h"
 #include "Values/Value.h"
 

@@ -3,9 +3,9 @@
 #include <filesystem>
 #include <thread>
 
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/DatabaseFixture.h"
+#include "TestSupport/DatabaseFixture.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 
 namespace veltoid {

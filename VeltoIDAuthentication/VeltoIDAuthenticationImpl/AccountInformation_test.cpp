@@ -1,7 +1,7 @@
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 
+#include "TestSupport/EngineFixture.h"
 #include "TestSupport/TestAuthority.h"
-#include "VeltoIDAuthenticationImpl/EngineFixture.h"
 
 namespace veltoid {
 namespace {

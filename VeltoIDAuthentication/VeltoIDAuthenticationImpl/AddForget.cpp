@@ -2,11 +2,11 @@
 
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
-#include "Platform/Notifications.h"
+#include "Platform/bus/Notifications.h"
 #include "Values/DictionaryAccess.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
@@ -97,17 +97,17 @@ AddOutcome addAnew(const String& accountName, const String& hashedPassword, cons
 
 /// The record with its password item, and the certificate unless another account has the same encDsId.
 void forget(const String& accountName, const DroppedItems& dropped) {
-    const CustodyLock custody;
-    cleanUpAccountsAndCertificates(custody);
+    const OwnershipLock ownership;
+    cleanUpAccountsAndCertificates(ownership);
     // The pending request's key has no certificate that anybody could still want it for.
-    discardPendingKey(custody, accountName);
+    discardPendingKey(ownership, accountName);
     // The record as it is now: others may have forgotten it, or added it again, since it was looked for.
     Dictionary record;
     if (!__VeltoIDDBRemoveVeltoIDAccountAndPassword(accountName, &record)) return;
     const String encDsId = record.string(kVeltoIDAccountDSIDKey);
     if (!encDsId || !__VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr)) {
-        discardCertificate(custody, encDsId, dropped);
-        discardStrayItems(custody, accountName, dropped);
+        discardCertificate(ownership, encDsId, dropped);
+        discardStrayItems(ownership, accountName, dropped);
     }
 }
 

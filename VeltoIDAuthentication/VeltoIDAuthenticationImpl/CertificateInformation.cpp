@@ -1,9 +1,9 @@
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
-#include "VeltoIDKeychainItems/Certificates.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 
 namespace veltoid {

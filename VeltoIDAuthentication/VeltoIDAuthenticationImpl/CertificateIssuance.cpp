@@ -3,13 +3,13 @@
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
-#include "VeltoIDAuthenticationImpl/FetchDelays.h"
-#include "VeltoIDAuthenticationImpl/RequestPacing.h"
+#include "Platform/runtime/Clock.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "VeltoIDAuthenticationImpl/PollBackOff.h"
+#include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
@@ -40,13 +40,13 @@ bool isPending(const Dictionary& result) {
 /// One certificate signing request, from the key to what the server answered at once.
 class SigningRequest {
   public:
-    SigningRequest(const CustodyLock& custody, const String& accountName, const Dictionary& options)
-        : custody_(custody), accountName_(accountName), options_(options) {}
+    SigningRequest(const OwnershipLock& ownership, const String& accountName, const Dictionary& options)
+        : ownership_(ownership), accountName_(accountName), options_(options) {}
 
     bool run() {
         Dictionary record;
         if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_) ||
-            !admitRequest(accountName_, record, &held_))
+            !admitCertificateRequest(accountName_, record, &held_))
             return false;
         const String password = __VeltoIDDBCopyHashedPassword(record);
         VELTOID_LOG_FROM(kRequestFunction, kNotice,
@@ -77,7 +77,7 @@ class SigningRequest {
             setInRecord(
                 {{kVeltoIDAccountCSRGenerationIntervalKey, Value::real(kVeltoIDCSRGenerationInterval)}},
                 true);
-        discardPendingKey(custody_, accountName_);
+        discardPendingKey(ownership_, accountName_);
     }
 
     bool adoptEncDsId(const Dictionary& record) {
@@ -102,7 +102,7 @@ class SigningRequest {
 
     bool send(VeltoIDAuthenticationSessionInfo& session) {
         const double sent = now();
-        noteRequest(accountName_);
+        noteCertificateRequest(accountName_);
         String token;
         CertificateAnswer answer;
         if (!__VeltoIDSessionDoSendCSR(session, encDsId_, request_, options_, &token, &answer, &held_))
@@ -116,7 +116,7 @@ class SigningRequest {
         }
         if (!keepPrivateKey()) return false;
         if (answer.result && !(token && isPending(*answer.result)))
-            return updateAccountWithCertificateResult(custody_, accountName_, encDsId_, answer, &held_);
+            return updateAccountWithCertificateResult(ownership_, accountName_, encDsId_, answer, &held_);
         return token ? keepToken(token, answer.delay) : true;
     }
 
@@ -153,7 +153,7 @@ class SigningRequest {
 
     /// Nothing of a failed attempt stays in the keychain.
     void discardKeys() {
-        discardPendingKey(custody_, accountName_);
+        discardPendingKey(ownership_, accountName_);
         for (const Key* key : {&publicKey_, &privateKey_})
             if (Data reference; copyPersistentRefForKey(*key, &reference))
                 removeKeyFromKeychainGivenPersistentRef(reference);
@@ -163,7 +163,7 @@ class SigningRequest {
         return __VeltoIDDBSetAccountValues(accountName_, values, dirty);
     }
 
-    const CustodyLock& custody_;
+    const OwnershipLock& ownership_;
     const String& accountName_;
     const Dictionary& options_;
     String encDsId_;
@@ -191,7 +191,7 @@ void putOffFetchAfterFailedSignIn(const String& accountName, const Dictionary& r
 }
 
 /// Asks with the token and applies the answer.
-bool fetch(const CustodyLock& custody, VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
+bool fetch(const OwnershipLock& ownership, VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
            const String& token, const Dictionary& options, std::optional<Error>* held) {
     const String accountName = session.fAccountName;
     CertificateAnswer answer;
@@ -203,7 +203,7 @@ bool fetch(const CustodyLock& custody, VeltoIDAuthenticationSessionInfo& session
         __VeltoIDSessionDoCompleteCertificate(session, encDsId, token, options, nullptr);
         return false;
     }
-    if (!updateAccountWithCertificateResult(custody, accountName, encDsId, answer, held)) return false;
+    if (!updateAccountWithCertificateResult(ownership, accountName, encDsId, answer, held)) return false;
     if (isPending(*answer.result)) {
         *held = VELTOID_ERROR(identity_error::kNotYet);
         return false;
@@ -221,8 +221,8 @@ bool wasTriedRecently(const Dictionary& record) {
 
 bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
                                                    String* encDsId, ErrorOut error) {
-    const CustodyLock custody;
-    SigningRequest request(custody, accountName, options);
+    const OwnershipLock ownership;
+    SigningRequest request(ownership, accountName, options);
     const bool succeeded = request.run();
     if (encDsId != nullptr && request.encDsId()) *encDsId = request.encDsId();
     return succeeded || fail(accountName, request.error(), error);
@@ -230,7 +230,7 @@ bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, co
 
 bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, bool force, const Dictionary& options,
                                            ErrorOut error) {
-    const CustodyLock custody;
+    const OwnershipLock ownership;
     std::optional<Error> held;
     Dictionary record;
     if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, &held)) return fail(accountName, held, error);
@@ -250,7 +250,7 @@ bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, bool force
         putOffFetchAfterFailedSignIn(accountName, record);
         return true;
     }
-    const bool succeeded = fetch(custody, *session, encDsId, token, options, &held);
+    const bool succeeded = fetch(ownership, *session, encDsId, token, options, &held);
     __VeltoIDSessionRelease(std::move(session));
     return succeeded || fail(accountName, held, error);
 }

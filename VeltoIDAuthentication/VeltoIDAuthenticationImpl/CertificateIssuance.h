@@ -16,7 +16,7 @@
 
 #include "Values/Error.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationImpl/CertificateCustody.h"
+#include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
 
 namespace veltoid {
@@ -43,7 +43,7 @@ bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, co
 /// off, the token given up, or, for anything else, the token kept until it expires. True when the certificate
 /// is stored or the request pending. Otherwise -100, and nothing of a request that was given up stays in the
 /// keychain. A certificate for another key than the pending one counts as a refusal.
-bool updateAccountWithCertificateResult(const CustodyLock& custody, const String& accountName,
+bool updateAccountWithCertificateResult(const OwnershipLock& ownership, const String& accountName,
                                         const String& encDsId, const CertificateAnswer& answer,
                                         ErrorOut error = nullptr);
 

@@ -3,11 +3,11 @@
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
 #include "Certificates/CertificateRequest.h"
+#include "TestSupport/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
-#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
-#include "VeltoIDAuthenticationImpl/RequestPacing.h"
+#include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 
 namespace veltoid {

@@ -5,16 +5,16 @@
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
-#include "Platform/Notifications.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "Platform/bus/Notifications.h"
+#include "Platform/runtime/Clock.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
-#include "VeltoIDAuthenticationImpl/FetchDelays.h"
 #include "VeltoIDAuthenticationImpl/NotificationNames.h"
-#include "VeltoIDKeychainItems/Certificates.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDAuthenticationImpl/PollBackOff.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 
 namespace veltoid {
@@ -30,9 +30,9 @@ double now() { return platform::Clock::shared().now(); }
 /// One answer and the account that it is for.
 class CertificateResult {
   public:
-    CertificateResult(const CustodyLock& custody, const String& accountName, const String& encDsId,
+    CertificateResult(const OwnershipLock& ownership, const String& accountName, const String& encDsId,
                       const CertificateAnswer& answer)
-        : custody_(custody),
+        : ownership_(ownership),
           accountName_(accountName),
           encDsId_(encDsId),
           result_(answer.result.value_or(Dictionary())),
@@ -62,9 +62,9 @@ class CertificateResult {
             planRenewal();
             Dictionary after;
             __VeltoIDDBCopyCertificateInfo(encDsId_, &after);
-            discardReplacedItems(custody_, before, after);
+            discardReplacedItems(ownership_, before, after);
         } else {
-            discardPendingKey(custody_, accountName_);
+            discardPendingKey(ownership_, accountName_);
         }
         endRequest();
         return stored;
@@ -203,7 +203,7 @@ class CertificateResult {
                      {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}},
                     true);
-        discardPendingKey(custody_, accountName_);
+        discardPendingKey(ownership_, accountName_);
     }
 
     void putOffFetch() {
@@ -226,7 +226,7 @@ class CertificateResult {
         return __VeltoIDDBSetAccountValues(accountName_, values, dirty);
     }
 
-    const CustodyLock& custody_;
+    const OwnershipLock& ownership_;
     const String& accountName_;
     const String& encDsId_;
     const Dictionary result_;
@@ -236,10 +236,10 @@ class CertificateResult {
 
 }  // namespace
 
-bool updateAccountWithCertificateResult(const CustodyLock& custody, const String& accountName,
+bool updateAccountWithCertificateResult(const OwnershipLock& ownership, const String& accountName,
                                         const String& encDsId, const CertificateAnswer& answer,
                                         ErrorOut error) {
-    if (CertificateResult(custody, accountName, encDsId, answer).apply()) return true;
+    if (CertificateResult(ownership, accountName, encDsId, answer).apply()) return true;
     fillError(error, VELTOID_ERROR(identity_error::kUnknown));
     return false;
 }

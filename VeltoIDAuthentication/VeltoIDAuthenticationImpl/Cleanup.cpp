@@ -4,10 +4,10 @@
 #include <string>
 
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "Platform/runtime/Clock.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace {
@@ -40,11 +40,11 @@ bool isOfUse(const String& encDsId) {
 }  // namespace
 
 bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& /*options*/, ErrorOut /*error*/) {
-    cleanUpAccountsAndCertificates(CustodyLock());
+    cleanUpAccountsAndCertificates(OwnershipLock());
     return true;
 }
 
-void cleanUpAccountsAndCertificates(const CustodyLock& custody) {
+void cleanUpAccountsAndCertificates(const OwnershipLock& ownership) {
     const std::set<std::string> owned = encDsIdsOfAccounts();
     Array encDsIds;
     __VeltoIDDBCopyCertificateKeys(&encDsIds);
@@ -57,7 +57,7 @@ void cleanUpAccountsAndCertificates(const CustodyLock& custody) {
                          "Removing certificate and private key  from keychain, and certificate from db, for "
                          "account "
                              << accountName.view() << " / dsID=" << encDsId.view());
-        discardCertificate(custody, encDsId);
+        discardCertificate(ownership, encDsId);
     }
 }
 

@@ -3,7 +3,7 @@
 
 #include "Values/Error.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationImpl/CertificateCustody.h"
+#include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 
 namespace veltoid {
 
@@ -12,7 +12,7 @@ namespace veltoid {
 /// True. Caller's queue.
 bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& options, ErrorOut error = nullptr);
 
-/// The same for callers that hold the custody lock.
-void cleanUpAccountsAndCertificates(const CustodyLock& custody);
+/// The same for callers that hold the ownership lock.
+void cleanUpAccountsAndCertificates(const OwnershipLock& ownership);
 
 }  // namespace veltoid

@@ -1,7 +1,7 @@
 // The account engine: adding and forgetting, people and breadcrumbs, passwords, dates.
+#include "TestSupport/EngineFixture.h"
 #include "VeltoIDAuthenticationImpl/AddForget.h"
 #include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
-#include "VeltoIDAuthenticationImpl/EngineFixture.h"
 #include "VeltoIDAuthenticationImpl/FindPerson.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"

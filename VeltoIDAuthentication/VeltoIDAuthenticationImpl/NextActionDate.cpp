@@ -1,10 +1,10 @@
-#include "Platform/Clock.h"
+#include "Platform/runtime/Clock.h"
 #include "Values/DictionaryAccess.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
-#include "VeltoIDAuthenticationImpl/RequestPacing.h"
+#include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {

@@ -1,9 +1,9 @@
 // What the examination of an account finds, and what it changes on the way.
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
-#include "VeltoIDAuthenticationImpl/CertificateFixture.h"
+#include "TestSupport/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
-#include "VeltoIDKeychainItems/Passwords.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {

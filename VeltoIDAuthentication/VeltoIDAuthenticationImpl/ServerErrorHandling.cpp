@@ -1,7 +1,7 @@
 #include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
 
 #include "Logging/Log.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 

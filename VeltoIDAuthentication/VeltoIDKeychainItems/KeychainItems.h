@@ -8,8 +8,8 @@
 #include <utility>
 #include <vector>
 
-#include "Platform/Keychain.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/keychain/Keychain.h"
+#include "Platform/runtime/WorkQueue.h"
 #include "Values/Digest.h"
 #include "Values/Value.h"
 

@@ -1,13 +1,13 @@
 #include <gtest/gtest.h>
 
-#include "Platform/FakeSystemLog.h"
-#include "Platform/KeyPair.h"
-#include "Platform/Keychain.h"
-#include "Platform/TemporaryStateDirectory.h"
+#include "Platform/crypto/KeyPair.h"
+#include "Platform/keychain/Keychain.h"
+#include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/TemporaryStateDirectory.h"
 #include "TestSupport/TestAuthority.h"
-#include "VeltoIDKeychainItems/Certificates.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
-#include "VeltoIDKeychainItems/Keys.h"
+#include "VeltoIDKeychainItems/KeychainKeys.h"
 
 namespace veltoid {
 namespace {

@@ -8,13 +8,13 @@
 
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
-#include "Platform/Clock.h"
-#include "Platform/EventLoop.h"
-#include "Platform/SystemVersion.h"
+#include "Platform/bus/EventLoop.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/SystemVersion.h"
 #include "Values/DictionaryAccess.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "XMLRPC/XMLRPCShim.h"
 

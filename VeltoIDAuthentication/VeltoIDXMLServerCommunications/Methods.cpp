@@ -4,11 +4,11 @@
 
 #include "Values/Base64.h"
 #include "Values/DateText.h"
-#include "VeltoIDAuthenticationDB/Accounts.h"
-#include "VeltoIDAuthenticationDB/Certificates.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
-#include "VeltoIDAuthenticationDB/Keys.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 

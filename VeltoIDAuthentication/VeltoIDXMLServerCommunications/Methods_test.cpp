@@ -2,8 +2,8 @@
 
 #include <array>
 
+#include "TestSupport/FakeIdentityServer.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
-#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
 #include "VeltoIDXMLServerCommunications/SessionCache.h"
 
 namespace veltoid {

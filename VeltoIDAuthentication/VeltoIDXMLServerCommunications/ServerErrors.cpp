@@ -1,6 +1,6 @@
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 
-#include "VeltoIDAuthenticationDB/Accounts.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 namespace {

@@ -5,7 +5,7 @@
 #include <utility>
 #include <vector>
 
-#include "Platform/Clock.h"
+#include "Platform/runtime/Clock.h"
 #include "VeltoIDXMLServerCommunications/SessionCache.h"
 
 namespace veltoid {

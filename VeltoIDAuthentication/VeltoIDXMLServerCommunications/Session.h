@@ -8,7 +8,7 @@
 
 #include <memory>
 
-#include "Platform/WorkQueue.h"
+#include "Platform/runtime/WorkQueue.h"
 #include "Values/Value.h"
 
 namespace veltoid {

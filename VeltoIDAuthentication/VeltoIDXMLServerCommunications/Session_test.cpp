@@ -1,7 +1,7 @@
 #include "VeltoIDXMLServerCommunications/Session.h"
 
-#include "Platform/SystemVersion.h"
-#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
+#include "Platform/runtime/SystemVersion.h"
+#include "TestSupport/FakeIdentityServer.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SessionCache.h"

@@ -2,7 +2,7 @@
 
 #include <thread>
 
-#include "VeltoIDXMLServerCommunications/FakeIdentityServer.h"
+#include "TestSupport/FakeIdentityServer.h"
 
 namespace veltoid {
 namespace {

@@ -2,8 +2,8 @@
 
 #include <mutex>
 
-#include "Platform/Clock.h"
-#include "Platform/SystemLog.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/SystemLog.h"
 #include "XMLRPC/XMLRPCConnectionManager.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 

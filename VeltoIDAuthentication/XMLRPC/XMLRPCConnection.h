@@ -5,7 +5,7 @@
 #include <memory>
 #include <optional>
 
-#include "Platform/HTTPSession.h"
+#include "Platform/net/HTTPSession.h"
 #include "Values/Error.h"
 #include "XMLRPC/XMLRPCRequest.h"
 #include "XMLRPC/XMLRPCResponse.h"

@@ -2,9 +2,9 @@
 
 #include <gtest/gtest.h>
 
-#include "Platform/FakeHTTPSession.h"
-#include "Platform/FakeSystemLog.h"
-#include "Platform/SimulatedClock.h"
+#include "TestSupport/FakeHTTPSession.h"
+#include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/SimulatedClock.h"
 #include "XMLRPC/XMLRPCConnectionManager.h"
 
 namespace veltoid {

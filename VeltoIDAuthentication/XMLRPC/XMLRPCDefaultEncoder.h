@@ -3,7 +3,7 @@
 
 #include <optional>
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 #include "Values/Value.h"
 
 namespace veltoid {

@@ -5,7 +5,7 @@
 #include <cmath>
 #include <limits>
 
-#include "Platform/UTF8.h"
+#include "Platform/encoding/UTF8.h"
 #include "Values/Error.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 

@@ -1,7 +1,7 @@
 // Reads XML-RPC responses: the value in them, and whether it is a fault.
 #pragma once
 
-#include "Platform/XMLReader.h"
+#include "Platform/xml/XMLReader.h"
 #include "XMLRPC/XMLRPCEventBasedParserDelegate.h"
 
 namespace veltoid {

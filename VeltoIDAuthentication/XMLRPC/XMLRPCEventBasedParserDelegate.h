@@ -10,7 +10,7 @@
 #include <array>
 #include <vector>
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 #include "Values/Value.h"
 
 namespace veltoid {

@@ -1,7 +1,7 @@
 // Texts and bytes of the XML-RPC wire form.
 #pragma once
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 #include "Values/Value.h"
 
 namespace veltoid {

@@ -1,6 +1,6 @@
 #include "XMLRPC/XMLRPCRequest.h"
 
-#include "Platform/Preferences.h"
+#include "Platform/storage/Preferences.h"
 #include "Values/ValueStream.h"
 
 namespace veltoid {

@@ -3,7 +3,7 @@
 
 #include <memory>
 
-#include "Platform/HTTPSession.h"
+#include "Platform/net/HTTPSession.h"
 #include "XMLRPC/XMLRPCDefaultEncoder.h"
 
 namespace veltoid {

@@ -5,7 +5,7 @@
 #include <cstdlib>
 #include <filesystem>
 
-#include "Platform/Preferences.h"
+#include "Platform/storage/Preferences.h"
 
 namespace veltoid {
 namespace {

@@ -1,6 +1,6 @@
 #include "XMLRPC/XMLRPCResponse.h"
 
-#include "Platform/UTF8.h"
+#include "Platform/encoding/UTF8.h"
 #include "XMLRPC/XMLRPCEventBasedParser.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 

@@ -1,7 +1,7 @@
 // The outcome of an XML-RPC call as the server gave it.
 #pragma once
 
-#include "Platform/SecureMemory.h"
+#include "Platform/runtime/SecureMemory.h"
 #include "Values/Value.h"
 
 namespace veltoid {

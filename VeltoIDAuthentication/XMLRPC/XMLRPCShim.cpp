@@ -5,8 +5,8 @@
 #include <limits>
 
 #include "Logging/Describe.h"
-#include "Platform/SystemLog.h"
-#include "Platform/WorkQueue.h"
+#include "Platform/runtime/SystemLog.h"
+#include "Platform/runtime/WorkQueue.h"
 #include "Values/DictionaryAccess.h"
 #include "XMLRPC/XMLRPCConnection.h"
 #include "XMLRPC/XMLRPCScalarTexts.h"

@@ -4,8 +4,8 @@
 
 #include <limits>
 
-#include "Platform/FakeHTTPSession.h"
-#include "Platform/FakeSystemLog.h"
+#include "TestSupport/FakeHTTPSession.h"
+#include "TestSupport/FakeSystemLog.h"
 #include "XMLRPC/XMLRPCConnection.h"
 
 namespace veltoid {

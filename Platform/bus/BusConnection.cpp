@@ -1,0 +1,189 @@
+#include "Platform/bus/BusConnection.h"
+
+#include <linux/sockios.h>
+#include <sys/ioctl.h>
+#include <systemd/sd-bus.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <utility>
+#include <vector>
+
+#include "Platform/bus/EventLoop.h"
+#include "Platform/runtime/SystemLog.h"
+
+namespace platform::bus {
+namespace {
+
+/// Messages that are read in one go: an iteration of the event loop for each would cost a third of a ping.
+constexpr int kReadAtOnce = 64;
+
+/// Main thread only.
+struct State {
+    sd_bus* bus = nullptr;
+    bool tried = false;
+    bool ended = false;
+    std::function<bool()> serve;
+    std::vector<std::function<void()>> disconnectHandlers;
+    sd_event_source* arrival = nullptr;
+    sd_event_source* timeout = nullptr;
+    sd_event_source* more = nullptr;
+
+    static State& shared() {
+        static auto* state = new State;
+        return *state;
+    }
+};
+
+void connectionEnded() {
+    State& state = State::shared();
+    if (std::exchange(state.ended, true)) return;
+    VELTOID_PLATFORM_LOG(Error, "The message bus has ended the connection.");
+    for (const auto& handler : state.disconnectHandlers) handler();
+}
+
+int disconnected(sd_bus_message* /*message*/, void* /*context*/, sd_bus_error* /*error*/) noexcept {
+    connectionEnded();
+    return 0;
+}
+
+int posted(sd_bus_message* /*message*/, void* context, sd_bus_error* /*error*/) noexcept {
+    (*static_cast<std::function<void()>*>(context))();
+    return 0;
+}
+
+void enable(sd_event_source* source, int whether) {
+    if (const int result = sd_event_source_set_enabled(source, whether); result < 0)
+        logFailure("watching", result);
+}
+
+/// Sends what waits to be sent, and reads and dispatches what has come.
+void process(State& state) {
+    int result = state.ended ? 0 : 1;
+    for (int left = kReadAtOnce; left > 0 && result > 0; --left) result = sd_bus_process(state.bus, nullptr);
+    if (result < 0) {
+        if (!state.ended) logFailure("reading", result);
+        sd_bus_close(state.bus);
+        connectionEnded();
+    }
+    if (state.ended)
+        for (sd_event_source* source : {state.arrival, state.timeout}) enable(source, SD_EVENT_OFF);
+    enable(state.more, state.serve && state.serve() ? SD_EVENT_ON : SD_EVENT_OFF);
+}
+
+int arrived(sd_event_source* /*source*/, int /*descriptor*/, uint32_t /*events*/, void* context) noexcept {
+    process(*static_cast<State*>(context));
+    return 0;
+}
+
+int timedOut(sd_event_source* /*source*/, uint64_t /*microseconds*/, void* context) noexcept {
+    process(*static_cast<State*>(context));
+    return 0;
+}
+
+int moreIsWaiting(sd_event_source* /*source*/, void* context) noexcept {
+    process(*static_cast<State*>(context));
+    return 0;
+}
+
+/// What the connection waits for, before each wait.
+int prepareWait(sd_event_source* /*source*/, void* context) noexcept {
+    const State& state = *static_cast<State*>(context);
+    if (state.ended) return 0;
+    if (const int events = sd_bus_get_events(state.bus); events >= 0)
+        sd_event_source_set_io_events(state.arrival, static_cast<uint32_t>(events));
+    uint64_t until = 0;
+    const bool hasTimeout = sd_bus_get_timeout(state.bus, &until) > 0;
+    if (hasTimeout) sd_event_source_set_time(state.timeout, until);
+    enable(state.timeout, hasTimeout ? SD_EVENT_ONESHOT : SD_EVENT_OFF);
+    return 0;
+}
+
+/// Instead of sd_bus_attach_event, which goes through the event loop for each message.
+int watch(State& state) {
+    sd_event* loop = event_loop::handle();
+    int result = sd_event_add_io(loop, &state.arrival, sd_bus_get_fd(state.bus), 0, arrived, &state);
+    if (result >= 0)
+        result = sd_event_add_time(loop, &state.timeout, CLOCK_MONOTONIC, 0, 0, timedOut, &state);
+    if (result >= 0) result = sd_event_source_set_enabled(state.timeout, SD_EVENT_OFF);
+    if (result >= 0) result = sd_event_add_defer(loop, &state.more, moreIsWaiting, &state);
+    // It is always pending while it is on, and would go before everything else.
+    if (result >= 0) result = sd_event_source_set_priority(state.more, SD_EVENT_PRIORITY_IDLE);
+    if (result >= 0) result = sd_event_source_set_prepare(state.arrival, prepareWait);
+    return result;
+}
+
+/// The bus that started the agent says which one it is; by hand it is the user's.
+int openBus(sd_bus** bus) {
+    const char* starter = std::getenv("DBUS_STARTER_BUS_TYPE");
+    return starter != nullptr && std::strcmp(starter, "system") == 0 ? sd_bus_open_system(bus)
+                                                                     : sd_bus_open_user(bus);
+}
+
+int watchDisconnect(sd_bus* bus) {
+    return sd_bus_match_signal_async(bus, nullptr, "org.freedesktop.DBus.Local",
+                                     "/org/freedesktop/DBus/Local", "org.freedesktop.DBus.Local",
+                                     "Disconnected", disconnected, nullptr, nullptr);
+}
+
+}  // namespace
+
+void logFailure(const char* operation, int result) {
+    VELTOID_PLATFORM_LOG(Error, std::string("Message bus: ") + operation + ": " + std::strerror(-result));
+}
+
+sd_bus* connection() {
+    State& state = State::shared();
+    if (state.tried) return state.bus;
+    state.tried = true;
+
+    int result = openBus(&state.bus);
+    if (result >= 0) result = watchDisconnect(state.bus);
+    if (result >= 0) result = watch(state);
+    if (result < 0) {
+        logFailure("connecting", result);
+        state.bus = sd_bus_unref(state.bus);
+    }
+    return state.bus;
+}
+
+void afterReading(std::function<bool()> serve) { State::shared().serve = std::move(serve); }
+
+size_t unreadBytes() {
+    sd_bus* bus = State::shared().bus;
+    int bytes = 0;
+    if (bus == nullptr || ioctl(sd_bus_get_fd(bus), SIOCOUTQ, &bytes) < 0) return 0;
+    return static_cast<size_t>(bytes);
+}
+
+void serveSoon() { enable(State::shared().more, SD_EVENT_ON); }
+
+void emitPosted(const std::string& name) {
+    sd_bus* bus = State::shared().bus;
+    if (bus == nullptr) return;
+    const int result =
+        sd_bus_emit_signal(bus, kObjectPath, kNotificationInterface, "Posted", "s", name.c_str());
+    if (result < 0) logFailure("posting a notification", result);
+}
+
+void onPosted(const std::string& name, std::function<void()> handler) {
+    sd_bus* bus = connection();
+    if (bus == nullptr) return;
+    const std::string rule = "type='signal',path='" + std::string(kObjectPath) + "',interface='" +
+                             kNotificationInterface + "',member='Posted',arg0='" + name + "'";
+    // Lives as long as the process, like the match.
+    auto* kept = new std::function<void()>(std::move(handler));
+    const int result = sd_bus_add_match_async(bus, nullptr, rule.c_str(), posted, posted, kept);
+    if (result < 0) logFailure("listening", result);
+}
+
+void flush() {
+    if (sd_bus* bus = State::shared().bus) sd_bus_flush(bus);
+}
+
+void onDisconnect(std::function<void()> handler) {
+    State::shared().disconnectHandlers.push_back(std::move(handler));
+}
+
+}  // namespace platform::bus

@@ -1,0 +1,109 @@
+#include "Platform/bus/BusPeer.h"
+
+#include <systemd/sd-bus.h>
+
+#include <utility>
+#include <vector>
+
+#include "Platform/bus/BusConnection.h"
+
+namespace platform {
+namespace {
+
+/// Events that are handled between two readings from the bus: fewer than are read, since whose turn it is
+/// cannot be known before.
+constexpr int kServedAtOnce = 32;
+
+/// So many events of a peer wait for their turn. More are handled out of turn, so that memory is not theirs
+/// alone; those that are for the peer's own queue wait there.
+constexpr size_t kMostWaiting = 16'384;
+
+/// A peer with more events waiting is sending ahead. It rests while the bus has not read so much of what the
+/// agent has sent: what goes to the others would stand in line behind its replies. The kernel counts 768
+/// bytes for a small reply; with twice as many, others wait half as long again, with half as many a peer that
+/// is alone is slowed down by half.
+constexpr size_t kSendingAhead = 8;
+constexpr size_t kMostUnread = 12 << 10;
+constexpr double kRestSeconds = 0.0003;
+
+}  // namespace
+
+/// The peers that have events waiting, each in one of the two. Main thread only.
+struct BusPeer::Turns {
+    std::deque<std::shared_ptr<BusPeer>> peers;
+    std::vector<std::shared_ptr<BusPeer>> resting;
+
+    static Turns& shared() {
+        static auto* turns = new Turns;
+        return *turns;
+    }
+
+    void rest(std::shared_ptr<BusPeer> peer) {
+        if (resting.empty()) {
+            WorkQueue::main().asyncAfter(kRestSeconds, [this] {
+                for (auto& rested : std::exchange(resting, {})) peers.push_back(std::move(rested));
+                bus::serveSoon();
+            });
+        }
+        resting.push_back(std::move(peer));
+    }
+};
+
+bool BusPeer::serveWaiting() {
+    Turns& turns = Turns::shared();
+    for (int left = kServedAtOnce; left > 0 && !turns.peers.empty(); --left) {
+        std::shared_ptr<BusPeer> peer = std::move(turns.peers.front());
+        turns.peers.pop_front();
+        if (peer->sendsAhead() && bus::unreadBytes() > kMostUnread) {
+            turns.rest(std::move(peer));
+            continue;
+        }
+        peer->handleOldest();
+        if (!peer->waiting_.empty()) turns.peers.push_back(std::move(peer));
+    }
+    return !turns.peers.empty();
+}
+
+BusPeer::~BusPeer() { sd_bus_track_unref(track_); }
+
+void BusPeer::setEventHandler(std::function<void(const PeerEvent&)> handler) {
+    handler_ = std::make_shared<std::function<void(const PeerEvent&)>>(std::move(handler));
+}
+
+void BusPeer::setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) {
+    answeredAtOnce_ = std::move(test);
+}
+
+void BusPeer::resume() {
+    if (std::exchange(resumed_, true) || waiting_.empty()) return;
+    Turns::shared().peers.push_back(shared_from_this());
+    bus::serveSoon();
+}
+
+void BusPeer::deliver(PeerEvent event) {
+    waiting_.push_back(std::move(event));
+    if (!resumed_) return;
+    if (waiting_.size() == 1) Turns::shared().peers.push_back(shared_from_this());
+    if (waiting_.size() > kMostWaiting) handleOldest();
+}
+
+void BusPeer::watch(sd_bus* bus, const std::string& name, sd_bus_track_handler_t gone,
+                    std::shared_ptr<void> context) {
+    watchContext_ = std::move(context);
+    if (sd_bus_track_new(bus, &track_, gone, watchContext_.get()) >= 0)
+        sd_bus_track_add_name(track_, name.c_str());
+}
+
+bool BusPeer::sendsAhead() const { return waiting_.size() > kSendingAhead; }
+
+void BusPeer::handleOldest() {
+    const PeerEvent event = std::move(waiting_.front());
+    waiting_.pop_front();
+    if (!handler_) return;
+    const auto* message = std::get_if<std::shared_ptr<IncomingMessage>>(&event);
+    const bool atOnce = message != nullptr && answeredAtOnce_ && answeredAtOnce_(**message);
+    const WorkQueue::Task task = [handler = handler_, event] { (*handler)(event); };
+    if (!atOnce || !queue_.tryRunNow(task)) queue_.async(task);
+}
+
+}  // namespace platform

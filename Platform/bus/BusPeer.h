@@ -1,0 +1,63 @@
+// A client's connection to one of the services, and whose turn it is when many of them want something: one
+// event of each at a time, so that a client that sends much waits for itself and not everybody for it. Main
+// thread, except that events are handled on the target queue.
+#pragma once
+
+#include <sys/types.h>
+
+#include <deque>
+#include <functional>
+#include <memory>
+#include <string>
+
+#include "Platform/bus/MessageService.h"
+#include "Platform/runtime/WorkQueue.h"
+
+struct sd_bus;
+struct sd_bus_track;
+
+namespace platform {
+
+class BusPeer : public PeerConnection, public std::enable_shared_from_this<BusPeer> {
+  public:
+    BusPeer(pid_t processID, uid_t userID) : processID_(processID), userID_(userID) {}
+    ~BusPeer() override;
+    BusPeer(const BusPeer&) = delete;
+    BusPeer& operator=(const BusPeer&) = delete;
+
+    pid_t processID() const override { return processID_; }
+    uid_t userID() const override { return userID_; }
+    void setTargetQueue(WorkQueue queue) override { queue_ = std::move(queue); }
+    void setEventHandler(std::function<void(const PeerEvent&)> handler) override;
+    void setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) override;
+    void resume() override;
+
+    /// Has the event handled when its turn has come, after those that were delivered before.
+    void deliver(PeerEvent event);
+
+    /// Handles events of the peers that have some; true when others are left that may be handled now.
+    static bool serveWaiting();
+
+    /// Calls `gone`, possibly more than once, when the bus says that the name has left it. The context is
+    /// kept as long as this peer.
+    void watch(sd_bus* bus, const std::string& name, int (*gone)(sd_bus_track*, void*),
+               std::shared_ptr<void> context);
+
+  private:
+    struct Turns;
+
+    void handleOldest();
+    bool sendsAhead() const;
+
+    const pid_t processID_;
+    const uid_t userID_;
+    WorkQueue queue_ = WorkQueue::main();
+    std::shared_ptr<std::function<void(const PeerEvent&)>> handler_;
+    std::function<bool(IncomingMessage&)> answeredAtOnce_;
+    std::deque<PeerEvent> waiting_;
+    bool resumed_ = false;
+    std::shared_ptr<void> watchContext_;
+    sd_bus_track* track_ = nullptr;
+};
+
+}  // namespace platform

@@ -1,0 +1,323 @@
+// systemd, if the agent runs as its unit. The relaunch is one transient timer, and its date is one of the
+// wall clock: a suspended device and a clock that is set come out right. A transient timer starts the service
+// of its own name, which is installed as another name of the agent's.
+//
+// systemd creates a unit but does not change it: a timer that is still there has to be stopped first. What is
+// asked for becomes a job, and only the job's end tells whether it was done. One such exchange is under way
+// at most; an interval that is set meanwhile is handed over after it.
+#include "Platform/bus/ServiceManager.h"
+
+#include <systemd/sd-bus.h>
+#include <systemd/sd-daemon.h>
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <cmath>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <memory>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "Platform/bus/BusConnection.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/SystemLog.h"
+#include "Platform/runtime/Transactions.h"
+
+namespace platform {
+namespace {
+
+constexpr const char* kManagerName = "org.freedesktop.systemd1";
+constexpr const char* kManagerPath = "/org/freedesktop/systemd1";
+constexpr const char* kManagerInterface = "org.freedesktop.systemd1.Manager";
+constexpr const char* kUnitPathPrefix = "/org/freedesktop/systemd1/unit";
+constexpr const char* kUnitExists = "org.freedesktop.systemd1.UnitExists";
+constexpr const char* kNoSuchUnit = "org.freedesktop.systemd1.NoSuchUnit";
+constexpr const char* kJobDone = "done";
+constexpr const char* kServiceUnit = "veltoidauthd.service";
+constexpr const char* kTimerUnit = "veltoidauthd-relaunch.timer";
+
+/// A date that has passed by the time the manager reads it never comes: what is nearer than this (seconds)
+/// is handed over as a delay.
+constexpr double kNearestDate = 5;
+constexpr double kShortestDelay = 1;
+
+constexpr uint64_t kMicrosecondsPerSecond = 1'000'000;
+constexpr uint64_t kTimerAccuracy = 100'000;
+
+/// Somebody else may create the timer at the same time; only so often is it stopped to make room.
+constexpr int kMostStops = 3;
+
+using Message = std::unique_ptr<sd_bus_message, decltype(&sd_bus_message_unref)>;
+using MessageHandler = int (*)(sd_bus_message* message, void* context, sd_bus_error* error);
+
+std::string calendarDate(double date) {
+    const double whole = std::floor(date);
+    const auto seconds = static_cast<time_t>(whole);
+    const auto microseconds = static_cast<uint64_t>((date - whole) * kMicrosecondsPerSecond);
+    tm utc{};
+    gmtime_r(&seconds, &utc);
+    std::array<char, 32> text{};
+    const size_t length = std::strftime(text.data(), text.size(), "%Y-%m-%d %H:%M:%S.", &utc);
+    const std::string fraction = std::to_string(kMicrosecondsPerSecond + microseconds).substr(1);
+    return std::string(text.data(), length) + fraction + " UTC";
+}
+
+/// The manager is only spoken to: asking the bus to start one would start nothing that manages this process.
+Message callTo(sd_bus* bus, const char* method) {
+    sd_bus_message* call = nullptr;
+    if (sd_bus_message_new_method_call(bus, &call, kManagerName, kManagerPath, kManagerInterface, method) >=
+        0)
+        sd_bus_message_set_auto_start(call, 0);
+    return {call, sd_bus_message_unref};
+}
+
+int appendTimer(sd_bus_message* call, double date) {
+    const double left = date - Clock::shared().now();
+    int result = sd_bus_message_append(call, "ss", kTimerUnit, "replace");
+    if (result >= 0) result = sd_bus_message_open_container(call, 'a', "(sv)");
+    if (result >= 0)
+        result = sd_bus_message_append(call, "(sv)(sv)(sv)(sv)",                                       //
+                                       "Description", "s", "Starts the Velto ID account agent again",  //
+                                       "AccuracyUSec", "t", kTimerAccuracy,                            //
+                                       "RemainAfterElapse", "b", 0,                                    //
+                                       "CollectMode", "s", "inactive-or-failed");
+    if (result >= 0 && left < kNearestDate)
+        result = sd_bus_message_append(
+            call, "(sv)", "TimersMonotonic", "a(st)", 1, "OnActiveSec",
+            static_cast<uint64_t>(std::max(left, kShortestDelay) * kMicrosecondsPerSecond));
+    else if (result >= 0)
+        result = sd_bus_message_append(call, "(sv)", "TimersCalendar", "a(ss)", 1, "OnCalendar",
+                                       calendarDate(date).c_str());
+    if (result >= 0) result = sd_bus_message_close_container(call);
+    return result >= 0 ? sd_bus_message_append(call, "a(sa(sv))", 0) : result;
+}
+
+bool isServiceUnit(sd_bus_message* reply) {
+    const char* unit = nullptr;
+    char* expected = nullptr;
+    const bool same =
+        sd_bus_message_is_method_error(reply, nullptr) <= 0 && sd_bus_message_read(reply, "o", &unit) >= 0 &&
+        sd_bus_path_encode(kUnitPathPrefix, kServiceUnit, &expected) >= 0 && std::strcmp(unit, expected) == 0;
+    std::free(expected);
+    return same;
+}
+
+/// Every callback comes with this object, which lives as long as the process.
+class Systemd : public ServiceManager {
+  public:
+    Systemd() {
+        bus::onDisconnect([this] {
+            if (!job_.path.empty()) fail("the message bus is gone");
+        });
+    }
+
+    uint32_t setStartInterval(uint32_t seconds) override {
+        const uint32_t previous = std::exchange(interval_, seconds);
+        if (!mayBeUnit()) return previous;
+        date_ = Clock::shared().now() + seconds;
+        changed_ = true;
+        handedOver_ = false;
+        if (!underWay_) begin();
+        return previous;
+    }
+
+    void whenHandedOver(const std::function<void()>& function) override {
+        if (underWay_)
+            waiting_.push_back(function);
+        else
+            function();
+    }
+
+    void canStartAgain(const std::function<void(bool)>& answer) override {
+        if (!mayBeUnit() || !handedOver_) {
+            answer(false);
+            return;
+        }
+        answers_.push_back(answer);
+        if (answers_.size() == 1 && askForOwnUnit(onAnswer) < 0) giveAnswers(false);
+    }
+
+    void announceReady() override { sd_notify(0, "READY=1"); }
+    void announceStopping() override { sd_notify(0, "STOPPING=1"); }
+
+  private:
+    /// Children of other units inherit these as well: the manager knows better.
+    static bool mayBeUnit() {
+        return std::getenv("INVOCATION_ID") != nullptr && std::getenv("NOTIFY_SOCKET") != nullptr;
+    }
+
+    // --- One exchange: own unit (once), create the timer, and when it is there stop it and create it again
+
+    void begin() {
+        underWay_ = true;
+        stops_ = 0;
+        transactions::began();
+        const int result = isUnit_ ? createTimer() : askForOwnUnit(onOwnUnit);
+        if (result < 0) fail(std::strerror(-result));
+    }
+
+    void end() {
+        underWay_ = false;
+        job_ = {};
+        jobRemoved_ = sd_bus_slot_unref(jobRemoved_);
+        transactions::ended();
+        for (const auto& function : std::exchange(waiting_, {})) function();
+    }
+
+    void fail(const std::string& reason) {
+        if (!std::exchange(reported_, true))
+            VELTOID_PLATFORM_LOG(Error, "The service manager does not start the agent again: " + reason);
+        end();
+    }
+
+    void fail(sd_bus_message* reply) {
+        const sd_bus_error* error = sd_bus_message_get_error(reply);
+        fail(error->message != nullptr ? error->message : error->name);
+    }
+
+    int sendWith(const Message& call, int appended, MessageHandler handle) {
+        return appended < 0 ? appended : sd_bus_call_async(nullptr, nullptr, call.get(), handle, this, 0);
+    }
+
+    int askForOwnUnit(MessageHandler handle) {
+        sd_bus* bus = bus::connection();
+        if (bus == nullptr) return -ENOTCONN;
+        const Message call = callTo(bus, "GetUnitByPID");
+        constexpr uint32_t kCaller = 0;
+        return sendWith(call, sd_bus_message_append(call.get(), "u", kCaller), handle);
+    }
+
+    int createTimer() {
+        changed_ = false;
+        const int result = watchJobs();
+        const Message call = callTo(bus::connection(), "StartTransientUnit");
+        return result < 0 ? result : sendWith(call, appendTimer(call.get(), date_), onCreating);
+    }
+
+    int stopTimer() {
+        const Message call = callTo(bus::connection(), "StopUnit");
+        return sendWith(call, sd_bus_message_append(call.get(), "ss", kTimerUnit, "replace"), onStopping);
+    }
+
+    /// systemd reports the end of a job to whoever has asked for it.
+    int watchJobs() {
+        if (jobRemoved_ != nullptr) return 0;
+        return sd_bus_match_signal_async(bus::connection(), &jobRemoved_, nullptr, kManagerPath,
+                                         kManagerInterface, "JobRemoved", onJobRemoved, nullptr, this);
+    }
+
+    void proceed(int result) {
+        if (result < 0) fail(std::strerror(-result));
+    }
+
+    // --- What the manager says
+
+    static int onOwnUnit(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
+        auto& self = *static_cast<Systemd*>(context);
+        self.isUnit_ = isServiceUnit(reply);
+        if (self.isUnit_)
+            self.proceed(self.createTimer());
+        else
+            self.end();
+        return 0;
+    }
+
+    static int onCreating(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
+        auto& self = *static_cast<Systemd*>(context);
+        if (sd_bus_message_is_method_error(reply, kUnitExists) > 0 && self.stops_++ < kMostStops)
+            self.proceed(self.stopTimer());
+        else
+            self.waitForJob(reply, &Systemd::created);
+        return 0;
+    }
+
+    static int onStopping(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
+        auto& self = *static_cast<Systemd*>(context);
+        if (sd_bus_message_is_method_error(reply, kNoSuchUnit) > 0)
+            self.proceed(self.createTimer());  // it has just elapsed
+        else
+            self.waitForJob(reply, &Systemd::stopped);
+        return 0;
+    }
+
+    void waitForJob(sd_bus_message* reply, void (Systemd::*then)(const std::string& outcome)) {
+        const char* job = nullptr;
+        if (sd_bus_message_is_method_error(reply, nullptr) > 0) return fail(reply);
+        if (const int result = sd_bus_message_read(reply, "o", &job); result < 0) return proceed(result);
+        job_ = {job, then};
+    }
+
+    static int onJobRemoved(sd_bus_message* signal, void* context, sd_bus_error* /*error*/) noexcept {
+        auto& self = *static_cast<Systemd*>(context);
+        uint32_t id = 0;
+        const char* job = nullptr;
+        const char* unit = nullptr;
+        const char* outcome = nullptr;
+        if (sd_bus_message_read(signal, "uoss", &id, &job, &unit, &outcome) < 0 || job != self.job_.path)
+            return 0;
+        (self.*std::exchange(self.job_, {}).then)(outcome);
+        return 0;
+    }
+
+    void created(const std::string& outcome) {
+        if (outcome != kJobDone) return fail("the timer's job is " + outcome);
+        if (changed_) {
+            stops_ = 0;
+            return proceed(createTimer());
+        }
+        handedOver_ = true;
+        end();
+    }
+
+    void stopped(const std::string& /*outcome*/) { proceed(createTimer()); }
+
+    static int onAnswer(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
+        static_cast<Systemd*>(context)->giveAnswers(isServiceUnit(reply));
+        return 0;
+    }
+
+    void giveAnswers(bool can) {
+        for (const auto& answer : std::exchange(answers_, {})) answer(can && handedOver_);
+    }
+
+    /// What is waited for, and what its end leads to.
+    struct Job {
+        std::string path;
+        void (Systemd::*then)(const std::string& outcome) = nullptr;
+    };
+
+    uint32_t interval_ = 0;
+    double date_ = 0;
+    /// The interval was set after the last timer was asked for.
+    bool changed_ = false;
+    /// There is a timer for the interval, or no interval.
+    bool handedOver_ = true;
+    bool underWay_ = false;
+    bool isUnit_ = false;
+    bool reported_ = false;
+    int stops_ = 0;
+    Job job_;
+    sd_bus_slot* jobRemoved_ = nullptr;
+    std::vector<std::function<void()>> waiting_;
+    std::vector<std::function<void(bool)>> answers_;
+};
+
+std::atomic<ServiceManager*> replacement{nullptr};
+
+}  // namespace
+
+ServiceManager& ServiceManager::shared() {
+    if (ServiceManager* manager = replacement.load(std::memory_order_acquire)) return *manager;
+    static auto* systemd = new Systemd;
+    return *systemd;
+}
+
+void ServiceManager::replaceShared(ServiceManager* manager) {
+    replacement.store(manager, std::memory_order_release);
+}
+
+}  // namespace platform

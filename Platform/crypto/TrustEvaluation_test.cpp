@@ -1,0 +1,110 @@
+#include "Platform/crypto/TrustEvaluation.h"
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <filesystem>
+#include <fstream>
+#include <functional>
+
+#include "Platform/crypto/KeyPair.h"
+#include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/SimulatedClock.h"
+#include "TestSupport/TestAuthority.h"
+
+namespace platform {
+namespace {
+
+using veltoid::testing_support::CertificateContent;
+using veltoid::testing_support::pemOf;
+using veltoid::testing_support::TestAuthority;
+
+class TrustTest : public testing::Test {
+  protected:
+    TrustTest() {
+        std::string name = (std::filesystem::temp_directory_path() / "veltoid-config-XXXXXX").string();
+        EXPECT_NE(mkdtemp(name.data()), nullptr);
+        configuration_ = name;
+        std::filesystem::create_directory(configuration_ / "harbwell");
+        setenv("XDG_CONFIG_HOME", name.c_str(), 1);
+    }
+    ~TrustTest() override { std::filesystem::remove_all(configuration_); }
+
+    void setAuthorities(const std::string& pem) const {
+        std::ofstream(configuration_ / "harbwell" / "identity-authority.pem") << pem;
+    }
+
+    Certificate issue(const CertificateContent& content = {}) const {
+        return *readCertificate(intermediate_.issue(key_.publicKey, content));
+    }
+
+    SimulatedClock clock_{1'750'000'000};  // 2025-06-15
+    FakeSystemLog log_;
+    std::filesystem::path configuration_;
+    const KeyPair key_ = *generateRSAKeyPair(2048);
+    const TestAuthority root_{"Root"};
+    const TestAuthority intermediate_{"Intermediate", &root_};
+    const TestAuthority stranger_{"Intermediate"};
+    const Certificate above_ = *readCertificate(intermediate_.certificate());
+    const Certificate wrong_ = *readCertificate(stranger_.certificate());
+};
+
+TEST_F(TrustTest, FollowsThePathToAnAuthority) {
+    const std::string root = pemOf(root_.certificate());
+    const std::string both = pemOf(stranger_.certificate()) + "\nsome words\n" + root;
+    const CertificateContent over{.notBefore = "20200101000000Z", .notAfter = "20210101000000Z"};
+    const CertificateContent early{.notBefore = "20300101000000Z", .notAfter = "20310101000000Z"};
+    const Certificate good = issue();
+    Certificate broken = good;
+    broken.der.back() ^= 1;
+    using enum TrustResult;
+    struct Case {
+        const char* what;
+        std::string authorities;
+        Certificate certificate;
+        std::vector<Certificate> intermediates;
+        TrustResult result;
+    };
+    const Case cases[] = {
+        {"a path", root, good, {above_}, Unspecified},
+        {"among others", both, good, {wrong_, above_}, Unspecified},
+        {"an intermediate authority", pemOf(intermediate_.certificate()), good, {}, Unspecified},
+        {"no intermediate", root, good, {}, FatalFailure},
+        {"the wrong intermediate", root, good, {wrong_}, FatalFailure},
+        {"another authority of that name", pemOf(stranger_.certificate()), good, {above_}, FatalFailure},
+        {"a bad signature", root, broken, {above_}, FatalFailure},
+        {"over", root, issue(over), {above_}, RecoverableFailure},
+        {"not yet", root, issue(early), {above_}, RecoverableFailure},
+        {"over, and no path", root, issue(over), {}, FatalFailure},
+    };
+    for (const Case& each : cases) {
+        setAuthorities(each.authorities);
+        EXPECT_EQ(evaluateTrust(each.certificate, each.intermediates), each.result) << each.what;
+    }
+}
+
+TEST_F(TrustTest, DeniesWhatIsRevokedOrRejected) {
+    const std::string root = pemOf(root_.certificate());
+    const Certificate good = issue();
+    const Certificate revoked = issue({.serialNumber = 7});
+    setAuthorities(root + intermediate_.revocationList({7}));
+    EXPECT_EQ(evaluateTrust(good, {{above_}}), TrustResult::Unspecified);
+    EXPECT_EQ(evaluateTrust(revoked, {{above_}}), TrustResult::Deny);
+    setAuthorities(root + TestAuthority("Other").revocationList({7}));
+    EXPECT_EQ(evaluateTrust(good, {{above_}}), TrustResult::Unspecified)
+        << "that list is another authority's";
+    setAuthorities(root_.rejectedCertificate());
+    EXPECT_EQ(evaluateTrust(good, {{above_}}), TrustResult::Deny);
+}
+
+TEST_F(TrustTest, SaysNothingWithoutAuthorities) {
+    for (const std::string& text : {std::string(), std::string("hello"), std::string(5U << 20U, 'x'),
+                                    pemOf(veltoid::testing_support::Bytes{1, 2, 3})}) {
+        setAuthorities(text);
+        EXPECT_EQ(evaluateTrust(issue(), {}), std::nullopt);
+    }
+    EXPECT_EQ(log_.count("no certificate can be evaluated: "), 4);
+}
+
+}  // namespace
+}  // namespace platform

@@ -1,0 +1,344 @@
+#include "Platform/keychain/Keychain.h"
+
+#include <algorithm>
+#include <exception>
+#include <functional>
+#include <span>
+#include <string>
+#include <utility>
+
+#include "Platform/crypto/Crypto.h"
+#include "Platform/keychain/KernelKeyring.h"
+#include "Platform/keychain/KeychainClassKeys.h"
+#include "Platform/keychain/KeychainSealing.h"
+#include "Platform/runtime/SystemLog.h"
+#include "Platform/storage/SQLiteFile.h"
+
+namespace platform::keychain {
+
+namespace {
+
+using Outcome = SQLiteFile::Outcome;
+
+constexpr size_t kReferenceBytes = 16;
+
+// `sequence` keeps the order of creation. Absent texts are NULL, which no unique index compares: coalesce
+// makes two absent ones equal, and different from an empty text. An absent application value identifies
+// nothing and stays NULL.
+constexpr const char* kSchema =
+    "CREATE TABLE items ("
+    "  sequence INTEGER PRIMARY KEY,"
+    "  id BLOB NOT NULL UNIQUE,"
+    "  class INTEGER NOT NULL,"
+    "  account TEXT, service TEXT, label TEXT, description TEXT, access_group TEXT,"
+    "  key_class TEXT, application_value TEXT,"
+    "  accessibility INTEGER NOT NULL,"
+    "  sealed BLOB NOT NULL"
+    ");"
+    "CREATE UNIQUE INDEX passwords ON items (coalesce(account, x''), coalesce(service, x'')) WHERE class = 0;"
+    "CREATE UNIQUE INDEX objects ON items (class, coalesce(key_class, x''), application_value) WHERE class "
+    "<> 0;";
+
+/// The store; never destroyed, so that exit from any thread is safe.
+SQLiteFile& file() {
+    static const std::string schema = std::string(kSchema) + kClassKeysSchema;
+    static auto& shared = *new SQLiteFile({"keychain.db", 0x48574B43 /* "HWKC" */, 1, schema.c_str()});
+    return shared;
+}
+
+struct Row {
+    int64_t sequence = 0;
+    ItemIdentity identity;
+};
+
+using Work = std::function<KeychainStatus(SQLiteTransaction&)>;
+
+/// Runs the work as a transaction that counts only when it succeeds.
+KeychainStatus perform(Outcome (SQLiteFile::*kind)(const SQLiteFile::Work&), const Work& work) {
+    try {
+        KeychainStatus status = kKeychainNotAvailable;
+        const Outcome outcome = (file().*kind)([&](SQLiteTransaction& transaction) {
+            status = work(transaction);
+            return status == kKeychainSuccess;
+        });
+        if (outcome == Outcome::Duplicate) return kKeychainDuplicateItem;
+        return outcome == Outcome::Failed ? kKeychainNotAvailable : status;
+    } catch (const std::exception& exception) {
+        VELTOID_PLATFORM_LOG(Error, std::string("keychain: ") + exception.what());
+        return kKeychainNotAvailable;
+    }
+}
+
+KeychainStatus readItems(const Work& work) { return perform(&SQLiteFile::read, work); }
+
+KeychainStatus changeItems(const Work& work) {
+    const KeychainStatus status = perform(&SQLiteFile::write, work);
+    // Not the item's failure: it is stored, and the store logs why it could not be made durable yet.
+    if (status == kKeychainSuccess) (void)file().checkpoint();
+    return status;
+}
+
+bool matches(const KeychainAttributes& query, const KeychainAttributes& item) {
+    const auto agrees = [](const std::optional<std::string>& wanted, const std::optional<std::string>& has) {
+        return !wanted || wanted == has;
+    };
+    return query.itemClass == item.itemClass && agrees(query.account, item.account) &&
+           agrees(query.service, item.service) && agrees(query.label, item.label) &&
+           agrees(query.description, item.description) && agrees(query.accessGroup, item.accessGroup) &&
+           agrees(query.keyClass, item.keyClass) && agrees(query.applicationValue, item.applicationValue);
+}
+
+Row rowOf(SQLiteStatement& statement) {
+    const Bytes id = statement.blob(1);
+    Row row;
+    row.sequence = statement.integer(0);
+    row.identity.id.assign(id.begin(), id.end());
+    KeychainAttributes& attributes = row.identity.attributes;
+    attributes.itemClass = static_cast<KeychainItemClass>(statement.integer(2));
+    attributes.account = statement.optionalText(3);
+    attributes.service = statement.optionalText(4);
+    attributes.label = statement.optionalText(5);
+    attributes.description = statement.optionalText(6);
+    attributes.accessGroup = statement.optionalText(7);
+    attributes.keyClass = statement.optionalText(8);
+    attributes.applicationValue = statement.optionalText(9);
+    row.identity.accessibility = static_cast<Accessibility>(statement.integer(10));
+    return row;
+}
+
+void collect(SQLiteStatement& statement, const KeychainAttributes& query, std::vector<Row>& rows) {
+    while (statement.step()) {
+        Row row = rowOf(statement);
+        if (matches(query, row.identity.attributes)) rows.push_back(std::move(row));
+    }
+}
+
+/// The matching items, oldest first.
+std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query) {
+    std::vector<Row> rows;
+    if (!query.itemList) {
+        auto statement = transaction.prepare(
+            "SELECT sequence, id, class, account, service, label, description, access_group, key_class,"
+            " application_value, accessibility FROM items WHERE class = ? ORDER BY sequence");
+        statement.bindInteger(static_cast<int>(query.attributes.itemClass));
+        collect(statement, query.attributes, rows);
+        return rows;
+    }
+    for (const PersistentReference& reference : *query.itemList) {
+        auto statement = transaction.prepare(
+            "SELECT sequence, id, class, account, service, label, description, access_group, key_class,"
+            " application_value, accessibility FROM items WHERE id = ?");
+        statement.bindBlob(reference);
+        collect(statement, query.attributes, rows);
+    }
+    std::ranges::sort(rows, {}, &Row::sequence);
+    const auto same = [](const Row& one, const Row& other) { return one.sequence == other.sequence; };
+    rows.erase(std::unique(rows.begin(), rows.end(), same), rows.end());
+    return rows;
+}
+
+KeychainStatus unsealRow(SQLiteTransaction& transaction, const Row& row, SecretBytes& value) {
+    auto statement = transaction.prepare("SELECT sealed FROM items WHERE sequence = ?");
+    if (!statement.bindInteger(row.sequence).step()) return kKeychainNotAvailable;
+    return unsealItem(transaction, row.identity, statement.blob(0), value);
+}
+
+KeychainStatus insert(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed) {
+    const KeychainAttributes& attributes = identity.attributes;
+    transaction
+        .prepare(
+            "INSERT INTO items (id, class, account, service, label, description, access_group, key_class,"
+            " application_value, accessibility, sealed) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)")
+        .bindBlob(identity.id)
+        .bindInteger(static_cast<int>(attributes.itemClass))
+        .bindOptionalText(attributes.account)
+        .bindOptionalText(attributes.service)
+        .bindOptionalText(attributes.label)
+        .bindOptionalText(attributes.description)
+        .bindOptionalText(attributes.accessGroup)
+        .bindOptionalText(attributes.keyClass)
+        .bindOptionalText(attributes.applicationValue)
+        .bindInteger(static_cast<int>(identity.accessibility))
+        .bindBlob(sealed)
+        .run();
+    return kKeychainSuccess;
+}
+
+/// Seals anew, since the attributes are part of the seal.
+KeychainStatus change(SQLiteTransaction& transaction, Row row, const Changes& changes) {
+    SecretBytes value;
+    KeychainStatus status = unsealRow(transaction, row, value);
+    if (status != kKeychainSuccess) return status;
+    if (changes.data) value = *changes.data;
+    if (changes.accessibility) row.identity.accessibility = *changes.accessibility;
+    if (changes.label) row.identity.attributes.label = changes.label;
+    if (changes.accessGroup) row.identity.attributes.accessGroup = changes.accessGroup;
+    SecretBytes sealed;
+    status = sealItem(transaction, row.identity, value, sealed);
+    if (status != kKeychainSuccess) return status;
+    transaction
+        .prepare(
+            "UPDATE items SET label = ?, access_group = ?, accessibility = ?, sealed = ? WHERE sequence = ?")
+        .bindOptionalText(row.identity.attributes.label)
+        .bindOptionalText(row.identity.attributes.accessGroup)
+        .bindInteger(static_cast<int>(row.identity.accessibility))
+        .bindBlob(sealed)
+        .bindInteger(row.sequence)
+        .run();
+    return kKeychainSuccess;
+}
+
+using OpenedItems = std::vector<std::pair<Row, SecretBytes>>;
+
+/// The items that are not always accessible. One that does not unseal stays as it is.
+KeychainStatus openAll(SQLiteTransaction& transaction, OpenedItems& items) {
+    for (const auto itemClass :
+         {KeychainItemClass::GenericPassword, KeychainItemClass::Key, KeychainItemClass::Certificate}) {
+        KeychainQuery query;
+        query.attributes.itemClass = itemClass;
+        for (Row& row : find(transaction, query)) {
+            if (row.identity.accessibility == Accessibility::Always) continue;
+            SecretBytes value;
+            const KeychainStatus status = unsealRow(transaction, row, value);
+            if (status == kKeychainItemCorrupt) continue;
+            if (status != kKeychainSuccess) return status;
+            items.emplace_back(std::move(row), std::move(value));
+        }
+    }
+    return kKeychainSuccess;
+}
+
+KeychainStatus sealAll(SQLiteTransaction& transaction, const OpenedItems& items) {
+    for (const auto& [row, value] : items) {
+        SecretBytes sealed;
+        const KeychainStatus status = sealItem(transaction, row.identity, value, sealed);
+        if (status != kKeychainSuccess) return status;
+        transaction.prepare("UPDATE items SET sealed = ? WHERE sequence = ?")
+            .bindBlob(sealed)
+            .bindInteger(row.sequence)
+            .run();
+    }
+    return kKeychainSuccess;
+}
+
+/// Whoever has an earlier copy of the file, and what opened that, is to learn nothing from this one.
+KeychainStatus replaceClassKey(const Work& replace) {
+    std::string keptBefore;
+    const KeychainStatus status = changeItems([&](SQLiteTransaction& transaction) {
+        OpenedItems items;
+        keptBefore = keptKeyName(transaction);
+        KeychainStatus step = openAll(transaction, items);
+        if (step == kKeychainSuccess) step = replace(transaction);
+        return step == kKeychainSuccess ? sealAll(transaction, items) : step;
+    });
+    if (status == kKeychainSuccess && !keptBefore.empty()) (void)kernel_keyring::remove(keptBefore);
+    return status;
+}
+
+bool tooLong(Bytes value) {
+    if (value.size() <= kMaxKeychainItemBytes) return false;
+    VELTOID_PLATFORM_LOG(Error, "keychain: a value of " + std::to_string(value.size()) + " bytes is refused");
+    return true;
+}
+
+}  // namespace
+
+KeychainStatus copyMatchingReferences(const KeychainQuery& query,
+                                      std::vector<PersistentReference>* references) {
+    std::vector<PersistentReference> found;
+    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
+        found.clear();
+        for (Row& row : find(transaction, query)) found.push_back(std::move(row.identity.id));
+        return found.empty() ? kKeychainItemNotFound : kKeychainSuccess;
+    });
+    if (status == kKeychainSuccess && references != nullptr) *references = std::move(found);
+    return status;
+}
+
+KeychainStatus copyMatchingData(const KeychainQuery& query, SecretBytes* data) {
+    SecretBytes value;
+    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
+        const auto rows = find(transaction, query);
+        return rows.empty() ? kKeychainItemNotFound : unsealRow(transaction, rows.front(), value);
+    });
+    if (status == kKeychainSuccess && data != nullptr) *data = std::move(value);
+    return status;
+}
+
+KeychainStatus add(const KeychainAttributes& attributes, Accessibility accessibility, Bytes data,
+                   PersistentReference* reference) {
+    if (tooLong(data)) return kKeychainNotAvailable;
+    ItemIdentity identity{PersistentReference(kReferenceBytes), attributes, accessibility};
+    fillRandom(identity.id);
+    const KeychainStatus status = changeItems([&](SQLiteTransaction& transaction) {
+        SecretBytes sealed;
+        const KeychainStatus sealing = sealItem(transaction, identity, data, sealed);
+        return sealing == kKeychainSuccess ? insert(transaction, identity, sealed) : sealing;
+    });
+    if (status == kKeychainSuccess && reference != nullptr) *reference = std::move(identity.id);
+    return status;
+}
+
+KeychainStatus update(const KeychainQuery& query, const Changes& changes) {
+    if (changes.data && tooLong(*changes.data)) return kKeychainNotAvailable;
+    return changeItems([&](SQLiteTransaction& transaction) {
+        const auto rows = find(transaction, query);
+        KeychainStatus status = rows.empty() ? kKeychainItemNotFound : kKeychainSuccess;
+        for (const Row& row : rows) {
+            if (status == kKeychainSuccess) status = change(transaction, row, changes);
+        }
+        return status;
+    });
+}
+
+KeychainStatus remove(const KeychainQuery& query) {
+    return changeItems([&](SQLiteTransaction& transaction) {
+        const auto rows = find(transaction, query);
+        for (const Row& row : rows) {
+            transaction.prepare("DELETE FROM items WHERE sequence = ?").bindInteger(row.sequence).run();
+        }
+        return rows.empty() ? kKeychainItemNotFound : kKeychainSuccess;
+    });
+}
+
+std::optional<Accessibility> accessibilityOf(const KeychainQuery& query) {
+    std::optional<Accessibility> accessibility;
+    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
+        const auto rows = find(transaction, query);
+        if (rows.empty()) return kKeychainItemNotFound;
+        accessibility = rows.front().identity.accessibility;
+        return kKeychainSuccess;
+    });
+    return status == kKeychainSuccess ? accessibility : std::nullopt;
+}
+
+std::optional<Protection> protection() {
+    Protection result = Protection::NoPassphrase;
+    const KeychainStatus status =
+        readItems([&](SQLiteTransaction& transaction) { return readProtection(transaction, result); });
+    return status == kKeychainSuccess ? std::optional(result) : std::nullopt;
+}
+
+KeychainStatus setPassphrase(Bytes passphrase) {
+    return replaceClassKey(
+        [&](SQLiteTransaction& transaction) { return replaceByPassphrase(transaction, passphrase); });
+}
+
+KeychainStatus removePassphrase() { return replaceClassKey(replaceByDeviceKey); }
+
+KeychainStatus unlock(Bytes passphrase) {
+    return readItems(
+        [&](SQLiteTransaction& transaction) { return unlockByPassphrase(transaction, passphrase); });
+}
+
+KeychainStatus lock() {
+    std::string kept;
+    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
+        kept = keptKeyName(transaction);
+        return kKeychainSuccess;
+    });
+    if (status != kKeychainSuccess) return status;
+    return kept.empty() || kernel_keyring::remove(kept) ? kKeychainSuccess : kKeychainNotAvailable;
+}
+
+}  // namespace platform::keychain

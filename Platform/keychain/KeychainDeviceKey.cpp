@@ -1,0 +1,157 @@
+#include "Platform/keychain/KeychainDeviceKey.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <string_view>
+#include <vector>
+
+#include "Platform/crypto/Crypto.h"
+#include "Platform/runtime/StateDirectory.h"
+#include "Platform/runtime/SystemLog.h"
+
+namespace platform::keychain {
+namespace {
+
+// keychain.key: magic, version (big-endian), the first bytes of the key's SHA-256 (so that damage is told
+// from a wrong key), key.
+constexpr std::string_view kKeyFileMagic = "HWDEVKEY";
+constexpr uint32_t kKeyFileVersion = 1;
+constexpr size_t kVersionBytes = 4;
+constexpr size_t kCheckBytes = 4;
+constexpr size_t kKeyFileBytes = kKeyFileMagic.size() + kVersionBytes + kCheckBytes + kSealingKeyBytes;
+
+void appendVersion(std::vector<uint8_t>& output) {
+    for (size_t i = kVersionBytes; i-- > 0;)
+        output.push_back(static_cast<uint8_t>(kKeyFileVersion >> (8 * i)));
+}
+
+/// The file's descriptor, closed at the end.
+class File {
+  public:
+    File(const std::string& path, int flags, mode_t mode = 0)
+        : descriptor_(::open(path.c_str(), flags | O_CLOEXEC, mode)) {}
+    ~File() {
+        if (isOpen()) ::close(descriptor_);
+    }
+    File(const File&) = delete;
+    File& operator=(const File&) = delete;
+
+    bool isOpen() const { return descriptor_ >= 0; }
+    int descriptor() const { return descriptor_; }
+
+    /// Reads until the span is full or the file ends; none on an error (errno).
+    std::optional<size_t> read(std::span<uint8_t> bytes) const {
+        size_t done = 0;
+        while (done < bytes.size()) {
+            const ssize_t got = ::read(descriptor_, bytes.data() + done, bytes.size() - done);
+            if (got < 0 && errno == EINTR) continue;
+            if (got < 0) return std::nullopt;
+            if (got == 0) break;
+            done += static_cast<size_t>(got);
+        }
+        return done;
+    }
+
+    bool writeDurably(Bytes bytes) const {
+        while (!bytes.empty()) {
+            const ssize_t put = ::write(descriptor_, bytes.data(), bytes.size());
+            if (put < 0 && errno == EINTR) continue;
+            if (put < 0) return false;
+            bytes = bytes.subspan(static_cast<size_t>(put));
+        }
+        return fsync(descriptor_) == 0;
+    }
+
+  private:
+    int descriptor_;
+};
+
+std::nullopt_t refuse(const std::string& path, const std::string& reason) {
+    VELTOID_PLATFORM_LOG(Error, path + ": " + reason + "; the keychain is not available");
+    return std::nullopt;
+}
+
+SecretBytes checkOf(Bytes key) {
+    const SHA256Digest digest = sha256(key);
+    return {digest.begin(), digest.begin() + kCheckBytes};
+}
+
+SecretBytes encodeKeyFile(Bytes key) {
+    std::vector<uint8_t> header(kKeyFileMagic.begin(), kKeyFileMagic.end());
+    appendVersion(header);
+    SecretBytes bytes(header.begin(), header.end());
+    const SecretBytes check = checkOf(key);
+    bytes.insert(bytes.end(), check.begin(), check.end());
+    bytes.insert(bytes.end(), key.begin(), key.end());
+    return bytes;
+}
+
+std::optional<SecretBytes> decodeKeyFile(const std::string& path, Bytes bytes) {
+    if (bytes.size() < kKeyFileBytes || !textOf(bytes).starts_with(kKeyFileMagic)) {
+        return refuse(path, "is not a device key");
+    }
+    uint32_t version = 0;
+    for (const uint8_t byte : bytes.subspan(kKeyFileMagic.size(), kVersionBytes))
+        version = version << 8U | byte;
+    if (version != kKeyFileVersion) return refuse(path, "has the unknown version " + std::to_string(version));
+    const Bytes key = bytes.last(kSealingKeyBytes);
+    if (bytes.size() != kKeyFileBytes ||
+        !std::ranges::equal(checkOf(key), bytes.subspan(kKeyFileMagic.size() + kVersionBytes, kCheckBytes))) {
+        return refuse(path, "is damaged");
+    }
+    return SecretBytes(key.begin(), key.end());
+}
+
+std::optional<SecretBytes> readKeyFile(const std::string& path, const File& file) {
+    struct stat information {};
+    if (fstat(file.descriptor(), &information) == 0 && (information.st_mode & (S_IRWXG | S_IRWXO)) != 0) {
+        VELTOID_PLATFORM_LOG(Warning, path + ": was open to other users; its mode is corrected");
+        (void)fchmod(file.descriptor(), S_IRUSR | S_IWUSR);
+    }
+    SecretBytes bytes(kKeyFileBytes + 1);
+    const auto size = file.read(bytes);
+    if (!size) return refuse(path, std::string("cannot be read: ") + std::strerror(errno));
+    bytes.resize(*size);
+    return decodeKeyFile(path, bytes);
+}
+
+/// The file appears under its name only when it is complete, and not at all when another one is there
+/// already: a link, unlike a rename, replaces nothing.
+bool createKeyFile(const std::string& directory, const std::string& path) {
+    const DirectoryLock lock(directory);
+    SecretBytes key(kSealingKeyBytes);
+    fillRandom(key);
+    const std::string temporary = path + ".new";
+    // One may be left from a process that was killed while at it.
+    (void)unlink(temporary.c_str());
+    const File file(temporary, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, S_IRUSR | S_IWUSR);
+    const bool linked = file.isOpen() && file.writeDurably(encodeKeyFile(key)) &&
+                        (link(temporary.c_str(), path.c_str()) == 0 || errno == EEXIST);
+    const int reason = errno;
+    (void)unlink(temporary.c_str());
+    errno = reason;
+    return linked && syncDirectory(directory);
+}
+
+}  // namespace
+
+std::optional<SecretBytes> deviceKey(const std::string& directory, bool mayCreate) {
+    const std::string path = directory + "/keychain.key";
+    for (const bool lastTry : {!mayCreate, true}) {
+        const File file(path, O_RDONLY | O_NOFOLLOW);
+        if (file.isOpen()) return readKeyFile(path, file);
+        if (errno != ENOENT) return refuse(path, std::string("cannot be opened: ") + std::strerror(errno));
+        if (lastTry) break;
+        if (!createKeyFile(directory, path))
+            return refuse(path, std::string("cannot be created: ") + std::strerror(errno));
+    }
+    return refuse(path,
+                  "is missing, and with it what opens the stored items: restore it, or remove keychain.db");
+}
+
+}  // namespace platform::keychain

@@ -1,0 +1,70 @@
+#include "Platform/keychain/KeychainSealing.h"
+
+#include <string_view>
+
+#include "Platform/crypto/Crypto.h"
+#include "Platform/encoding/HexText.h"
+#include "Platform/keychain/KeychainClassKeys.h"
+#include "Platform/runtime/SystemLog.h"
+
+namespace platform::keychain {
+
+namespace {
+
+void appendNumber(std::vector<uint8_t>& output, uint64_t number, size_t width) {
+    for (size_t i = width; i-- > 0;) output.push_back(static_cast<uint8_t>(number >> (8 * i)));
+}
+
+/// Presence, length, bytes: no two lists of fields have the same encoding.
+void appendField(std::vector<uint8_t>& output, std::optional<std::string_view> field) {
+    output.push_back(field ? 1 : 0);
+    if (!field) return;
+    appendNumber(output, field->size(), 8);
+    output.insert(output.end(), field->begin(), field->end());
+}
+
+ClassKey classKeyOf(Accessibility accessibility) {
+    return accessibility == Accessibility::Always ? ClassKey::Always : ClassKey::AfterFirstUnlock;
+}
+
+}  // namespace
+
+std::vector<uint8_t> encodeIdentity(const ItemIdentity& identity) {
+    const KeychainAttributes& attributes = identity.attributes;
+    std::vector<uint8_t> output;
+    appendNumber(output, static_cast<uint64_t>(attributes.itemClass), 1);
+    appendNumber(output, static_cast<uint64_t>(identity.accessibility), 1);
+    appendField(output, textOf(identity.id));
+    for (const auto* field :
+         {&attributes.account, &attributes.service, &attributes.label, &attributes.description,
+          &attributes.accessGroup, &attributes.keyClass, &attributes.applicationValue}) {
+        appendField(output, *field);
+    }
+    return output;
+}
+
+KeychainStatus sealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes value,
+                        SecretBytes& sealed) {
+    SecretBytes key;
+    const KeychainStatus status = classKey(transaction, classKeyOf(identity.accessibility), key);
+    if (status == kKeychainSuccess) sealed = seal(key, encodeIdentity(identity), value);
+    return status;
+}
+
+KeychainStatus unsealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed,
+                          SecretBytes& value) {
+    SecretBytes key;
+    bool found = false;
+    const KeychainStatus status = readClassKey(transaction, classKeyOf(identity.accessibility), found, key);
+    if (status != kKeychainSuccess) return status;
+    auto plain = found ? unseal(key, encodeIdentity(identity), sealed) : std::nullopt;
+    if (!plain) {
+        VELTOID_PLATFORM_LOG(Error, "keychain item " + hexText(identity.id) +
+                                        " does not unseal: it is damaged or was changed from outside");
+        return kKeychainItemCorrupt;
+    }
+    value = std::move(*plain);
+    return kKeychainSuccess;
+}
+
+}  // namespace platform::keychain

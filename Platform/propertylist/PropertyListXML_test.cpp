@@ -1,0 +1,281 @@
+#include <gtest/gtest.h>
+
+#include <array>
+#include <limits>
+#include <string>
+#include <utility>
+
+#include "Platform/propertylist/PropertyList.h"
+#include "Platform/propertylist/PropertyListPlainXML.h"
+#include "Platform/xml/XMLReader.h"
+#include "TestSupport/PropertyListCases.h"
+
+namespace platform {
+namespace {
+
+using namespace std::literals;
+
+std::string readBack(std::string_view document) { return readBack(bytesOf(document), readXMLPropertyList); }
+
+std::string list(std::string_view content) { return "<plist>" + std::string(content) + "</plist>"; }
+
+void writeSample(ValueSink& sink) {
+    const std::array<uint8_t, 5> data = {0, 127, 128, 254, 255};
+    sink.beginDictionary();
+    sink.key("booleans"), sink.beginArray(), sink.boolean(true), sink.boolean(false), sink.endArray();
+    sink.key("integers"), sink.beginArray();
+    for (const int64_t value : {int64_t{0}, int64_t{-1}, INT64_MAX, INT64_MIN}) sink.integer(value);
+    sink.unsignedInteger(UINT64_MAX), sink.unsignedInteger(uint64_t{1} << 63U), sink.endArray();
+    sink.key("reals"), sink.beginArray();
+    for (const double value :
+         {0.1, -0.0, 1e300, 5e-324, std::numeric_limits<double>::max(),
+          std::numeric_limits<double>::infinity(), -std::numeric_limits<double>::infinity(),
+          std::numeric_limits<double>::quiet_NaN()}) {
+        sink.real(value);
+    }
+    sink.endArray();
+    sink.key("dates"), sink.beginArray();
+    for (const double seconds : {0.0, 1394039040.0, -1.0, -62135596800.0, 253402300799.0}) sink.date(seconds);
+    sink.endArray();
+    sink.key("data"), sink.beginArray();
+    for (size_t size = 0; size <= data.size(); ++size) sink.data(Bytes(data).first(size));
+    sink.endArray();
+    sink.key("texts"), sink.beginArray();
+    for (const std::string_view text : {"", " a\tb\n", "\r\n\r", "<&>\"']]>", "\x7F\u0080\u07FF\u0800\uFFFD",
+                                        "Zoë \U00010000\U0010FFFF", "&amp;"}) {
+        sink.string(text);
+    }
+    sink.endArray();
+    sink.key("Schlüssel <1>"), sink.beginDictionary(), sink.endDictionary();
+    sink.key(""), sink.beginArray(), sink.endArray();
+    sink.endDictionary();
+}
+
+TEST(XMLPropertyList, EveryKindReadsBackAsWritten) {
+    for (const auto& writer : {ValueWriter(writeSample), nested(kMaxPropertyListDepth)}) {
+        const SecretBytes document = writeXMLPropertyList(writer);
+        EXPECT_EQ(readBack(textOf(document)), written(writer));
+        EXPECT_EQ(readBack(document, readPropertyList), written(writer));
+        EXPECT_EQ(readBack(writeBinaryPropertyList(writer), readPropertyList), written(writer));
+    }
+    const auto inexact = writeXMLPropertyList([](ValueSink& sink) {
+        sink.beginArray();
+        sink.unsignedInteger(7), sink.singleReal(0.1F), sink.date(1.75), sink.date(-0.25);
+        sink.endArray();
+    });
+    EXPECT_EQ(readBack(textOf(inexact)), written([](ValueSink& sink) {
+                  sink.beginArray();
+                  sink.integer(7), sink.real(static_cast<double>(0.1F)), sink.date(1), sink.date(-1);
+                  sink.endArray();
+              }));
+}
+
+TEST(XMLPropertyList, RefusesToWriteWhatXMLCannotSay) {
+    const std::array<uint8_t, 16> uuid{};
+    const std::pair<const char*, ValueWriter> cases[] = {
+        {"null", [](ValueSink& s) { s.null(); }},
+        {"a UUID", [&](ValueSink& s) { s.uuid(uuid); }},
+        {"a zero byte", [](ValueSink& s) { s.string("a\0b"sv); }},
+        {"a control character", [](ValueSink& s) { s.string("\x1B"); }},
+        {"a control character in a key",
+         [](ValueSink& s) { s.beginDictionary(), s.key("\x01"), s.boolean(true), s.endDictionary(); }},
+        {"no character", [](ValueSink& s) { s.string("\uFFFE"); }},
+        {"the year 0", [](ValueSink& s) { s.date(-62135596801); }},
+        {"the year 10000", [](ValueSink& s) { s.date(253402300800); }},
+        {"no date", [](ValueSink& s) { s.date(std::numeric_limits<double>::quiet_NaN()); }},
+    };
+    for (const auto& [name, writer] : cases) EXPECT_TRUE(writeXMLPropertyList(writer).empty()) << name;
+}
+
+TEST(XMLPropertyList, ReadsOtherWritersForms) {
+    const std::string prolog =
+        "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
+        "<!DOCTYPE plist PUBLIC \"-//Somebody//DTD PLIST 1.0//EN\" "
+        "\"http://example.com/DTDs/PropertyList-1.0.dtd\">\n";
+    std::string utf16 = "\xFE\xFF";
+    for (const char c : list("<string>x</string>")) utf16 += {'\0', c};
+    const std::pair<std::string, const char*> cases[] = {
+        {prolog + "<plist version=\"1.0\">\n<true/>\n</plist>\n", "true"},
+        {"<!DOCTYPE plist SYSTEM 'plist.dtd'>" + list("<true></true>"), "true"},
+        {"\xEF\xBB\xBF" + list("<false/>"), "false"},
+        {utf16, "\"x\""},
+        {"<?xml version='1.0' encoding='ISO-8859-1'?>" + list("<string>\xEB</string>"), "\"ë\""},
+        {list("<!-- a --><?b?><string>a<!-- b -->c<![CDATA[<d>]]>&#x65;&lt;</string>"), "\"ac<d>e<\""},
+        {list("<string> a\r\nb </string>"), "\" a\nb \""},
+        {list("<dict x='y' ><key>k</key ><true\n/></dict>"), "{ k\"k\" true }"},
+        {list("<integer> +7\n</integer>"), "i7"},
+        {list("<integer>0xFFFFFFFFFFFFFFFF</integer>"), "u18446744073709551615"},
+        {list("<integer>-0X10</integer>"), "i-16"},
+        {list("<real> 1.5E0 </real>"), "r3ff8000000000000"},
+        {list("<real>+infinity</real>"), "r7ff0000000000000"},
+        {list("<date>1970-01-01T00:00:01Z</date>"), "d3ff0000000000000"},
+        {list("<date>2000-02-29T00:00:00Z</date>"), "d41cc5d8600000000"},
+        {list("<data>\n\tAQ ID\n\tBA==\n</data>"), "x01020304"},
+        {list("<dict><key>k</key><true/><key>k</key><false/></dict>"), "{ k\"k\" true k\"k\" false }"},
+    };
+    for (const auto& [document, text] : cases) {
+        EXPECT_EQ(readBack(document), text) << document;
+        EXPECT_EQ(readBack(bytesOf(document), readPropertyList), text) << document;
+    }
+}
+
+TEST(XMLPropertyList, RefusesWhatIsNoList) {
+    const std::string laughs = "<!DOCTYPE plist [<!ENTITY a 'ha'><!ENTITY b '&a;&a;&a;&a;&a;&a;&a;&a;'>]>";
+    std::string tooDeep = "<true/>";
+    for (int i = 0; i <= kMaxPropertyListDepth; ++i) tooDeep = "<array>" + tooDeep + "</array>";
+    const std::string documents[] = {
+        "",
+        " ",
+        "x",
+        "<plist/>",
+        list(""),
+        list("<true/><true/>"),
+        list("x<true/>"),
+        list("<true/>x"),
+        // Elements.
+        "<true/>",
+        "<dict><key>k</key></dict>",
+        list(list("<true/>")),
+        "<Plist><true/></Plist>",
+        list("<array>"),
+        list("<array></dict>"),
+        list("<null/>"),
+        list("<True/>"),
+        list("<string><true/></string>"),
+        list("<true><true/></true>"),
+        list("<true>x</true>"),
+        list("<key>k</key>"),
+        list("<array>x</array>"),
+        list("<array><key>k</key></array>"),
+        list(tooDeep),
+        // Dictionaries.
+        list("<dict><true/></dict>"),
+        list("<dict><key>k</key></dict>"),
+        list("<dict><key>k</key><key>l</key><true/></dict>"),
+        list("<dict><key>k</key><true/><true/></dict>"),
+        // Scalars.
+        list("<integer></integer>"),
+        list("<integer>-</integer>"),
+        list("<integer>--1</integer>"),
+        list("<integer>+-1</integer>"),
+        list("<integer>0x</integer>"),
+        list("<integer>1 2</integer>"),
+        list("<integer>1.0</integer>"),
+        list("<integer>F</integer>"),
+        list("<integer>18446744073709551616</integer>"),
+        list("<integer>-9223372036854775809</integer>"),
+        list("<integer>0x10000000000000000</integer>"),
+        list("<real></real>"),
+        list("<real>1,5</real>"),
+        list("<real>1.5x</real>"),
+        list("<real>+-1</real>"),
+        list("<real>nan(1)</real>"),
+        list("<real>1e999</real>"),
+        list("<real>0x1p3</real>"),
+        list("<date></date>"),
+        list("<date>2014-03-05T17:04:00</date>"),
+        list("<date>2014-03-05T17:04:00+0000</date>"),
+        list("<date>2014-03-05T17:04:60Z</date>"),
+        list("<date>2014-03-05T24:00:00Z</date>"),
+        list("<date>2014-02-29T00:00:00Z</date>"),
+        list("<date>2014-13-01T00:00:00Z</date>"),
+        list("<date>0000-01-01T00:00:00Z</date>"),
+        list("<date>+014-03-05T17:04:00Z</date>"),
+        list("<data>A</data>"),
+        list("<data>AQ</data>"),
+        list("<data>AQI</data>"),
+        list("<data>AQ=</data>"),
+        list("<data>AQ==AQ==</data>"),
+        list("<data>AQ===</data>"),
+        list("<data>====</data>"),
+        list("<data>A*I=</data>"),
+        list("<data>AQI-</data>"),
+        // Characters and entities.
+        list("<string>\x80</string>"),
+        list("<string>\xC0\xAF</string>"),
+        list("<string>\xED\xA0\x80</string>"),
+        list("<string>\x01</string>"),
+        list("<string>\uFFFF</string>"),
+        list("<string>a\0</string>"s),
+        list("<string>&#0;</string>"),
+        list("<string>]]></string>"),
+        list("<string>&b;</string>"),
+        laughs + list("<string>&b;</string>"),
+        laughs + list("<true/>"),
+        "<!DOCTYPE plist [<!ELEMENT plist ANY>]>" + list("<true/>"),
+        "<!DOCTYPE plist []>" + list("<true/>"),
+        "<!DOCTYPE plist SYSTEM 'p.dtd'>" + list("<string>&b;</string>"),
+        // Forms that are binary lists, nearly.
+        "bplist00",
+        "bplist00" + list("<true/>"),
+    };
+    for (const std::string& document : documents) {
+        EXPECT_EQ(readBack(document), "refused") << document;
+        EXPECT_EQ(readBack(bytesOf(document), readPropertyList), "refused") << document;
+    }
+}
+
+TEST(XMLPropertyList, RefusesWhatGoesOverTheLimits) {
+    const auto times = [](size_t count, std::string_view text) {
+        std::string repeated;
+        for (; count > 0; --count) repeated += text;
+        return list("<array>" + repeated + "</array>");
+    };
+    // The array itself is an object, too.
+    EXPECT_EQ(readBack(times(kMaxPropertyListObjects, "<true/>")), "refused");
+    const std::string quarter(kMaxPropertyListPayload / 4, 'x');
+    EXPECT_NE(readBack(times(4, "<string>" + quarter + "</string>")), "refused");
+    EXPECT_EQ(readBack(times(4, "<string>" + quarter + "</string><string>x</string>")), "refused");
+    EXPECT_EQ(readBack(list("<data>" + std::string(2 * kMaxPropertyListPayload + 1, ' ') + "</data>")),
+              "refused");
+}
+
+/// Writes the events down, pieces of one text together.
+class EventText : public XMLEvents {
+  public:
+    void documentType(bool hasDeclarations) override { text += hasDeclarations ? "!declarations" : "!"; }
+    void startElement(std::string_view name) override { text.append("<").append(name).append(">"); }
+    void endElement(std::string_view name) override { text.append("</").append(name).append(">"); }
+    void characters(std::string_view characters) override {
+        for (const char c : characters) (text += '\'') += c;
+    }
+
+    std::string text;
+};
+
+/// What both readers make of a document: whatever the short cut reads, the parser reads alike.
+void expectSameEvents(std::string_view document) {
+    EventText plain;
+    if (!propertylist::readPlainXML(document, plain)) return;
+    EventText general;
+    ASSERT_TRUE(XMLReader(bytesOf(document)).read(general)) << document;
+    ASSERT_EQ(plain.text, general.text) << document;
+}
+
+TEST(XMLPropertyList, DamagedDocumentsAreRefusedWholeOrAreOtherLists) {
+    const SecretBytes bytes = writeXMLPropertyList(writeSample);
+    const std::string sound(textOf(bytes));
+    EventText events;
+    EXPECT_TRUE(propertylist::readPlainXML(sound, events)) << "the short cut does not know our own form";
+    const size_t end = sound.rfind('>');
+    for (size_t size = 0; size <= end; ++size) {
+        // A copy of exactly this size, so that reading beyond it is seen.
+        const SecretBytes cut(bytes.begin(), bytes.begin() + static_cast<ptrdiff_t>(size));
+        ASSERT_EQ(readBack(textOf(cut)), "refused") << size;
+    }
+    for (size_t at = 0; at < sound.size(); ++at) {
+        for (unsigned bit = 0; bit < 8; ++bit) {
+            std::string flipped = sound;
+            flipped[at] = static_cast<char>(flipped[at] ^ (1 << bit));
+            expectSameEvents(flipped);
+            const std::string text = readBack(flipped);
+            if (text == "refused") continue;
+            const auto again =
+                writeXMLPropertyList([&](ValueSink& sink) { readXMLPropertyList(bytesOf(flipped), sink); });
+            ASSERT_EQ(readBack(textOf(again)), text) << flipped;
+        }
+    }
+}
+
+}  // namespace
+}  // namespace platform

@@ -1,0 +1,44 @@
+#include "Platform/runtime/InstanceLock.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <string>
+
+#include "Platform/runtime/StateDirectory.h"
+
+namespace platform::instance_lock {
+namespace {
+
+/// Locked while somebody is leaving; the kernel unlocks it when the process is gone. Never removed: who comes
+/// and who goes have to meet at the same file.
+int openLock(int flags) {
+    const std::string directory = stateDirectory();
+    if (directory.empty()) return -1;
+    return open((directory + "/leaving.lock").c_str(), O_RDWR | O_CLOEXEC | flags, S_IRUSR | S_IWUSR);
+}
+
+void lock(int descriptor, int how) {
+    while (flock(descriptor, how) != 0 && errno == EINTR) {
+    }
+}
+
+}  // namespace
+
+void holdUpNext() {
+    // Shared: agents of several services may leave at the same time. Kept open until the process ends.
+    static const int descriptor = openLock(O_CREAT);
+    if (descriptor >= 0) lock(descriptor, LOCK_SH);
+}
+
+void waitForPrevious() {
+    const int descriptor = openLock(0);
+    if (descriptor < 0) return;
+    lock(descriptor, LOCK_EX);
+    close(descriptor);
+}
+
+}  // namespace platform::instance_lock

@@ -1,0 +1,29 @@
+// The directory in which this user's state on this machine is kept: $XDG_STATE_HOME/harbwell/<machine-id>, by
+// default below ~/.local/state.
+#pragma once
+
+#include <string>
+
+namespace platform {
+
+/// The directory of this user's state on this machine, created with mode 0700 when missing; empty when it
+/// cannot be.
+std::string stateDirectory();
+
+/// Makes the directory's entries durable; false with errno set.
+bool syncDirectory(const std::string& directory);
+
+/// Holds a directory for this process: creating and replacing files in it is for one at a time. Where the
+/// file system has no such locks the holder goes on without.
+class DirectoryLock {
+  public:
+    explicit DirectoryLock(const std::string& directory);
+    ~DirectoryLock();
+    DirectoryLock(const DirectoryLock&) = delete;
+    DirectoryLock& operator=(const DirectoryLock&) = delete;
+
+  private:
+    int descriptor_;
+};
+
+}  // namespace platform

@@ -1,0 +1,154 @@
+#include "Platform/storage/Preferences.h"
+
+#include <exception>
+
+#include "Platform/propertylist/PropertyList.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/SystemLog.h"
+#include "Platform/storage/SQLiteFile.h"
+
+namespace platform {
+
+namespace {
+
+using Outcome = SQLiteFile::Outcome;
+
+constexpr SQLiteFile::Format kFormat = {
+    "preferences.db",
+    0x48575046,  // "HWPF"
+    1,
+    "CREATE TABLE preferences ("
+    "  domain TEXT NOT NULL,"
+    "  key TEXT NOT NULL,"
+    "  value BLOB NOT NULL,"
+    "  PRIMARY KEY (domain, key)"
+    ") WITHOUT ROWID",
+};
+
+/// Never destroyed, so that exit from any thread is safe.
+SQLiteFile& file() {
+    static auto& shared = *new SQLiteFile(kFormat);
+    return shared;
+}
+
+/// Runs one operation of the interface, out of which nothing is thrown.
+template <typename Operation>
+bool guarded(const std::string& domain, const char* name, Operation operation) {
+    try {
+        return operation();
+    } catch (const std::exception& exception) {
+        VELTOID_PLATFORM_LOG(Error,
+                             "preferences of " + domain + ": " + name + " failed: " + exception.what());
+        return false;
+    }
+}
+
+}  // namespace
+
+Preferences::ReadResult Preferences::read(std::string_view key, ValueSink& sink) const {
+    auto result = ReadResult::Failed;
+    guarded(domain_, "read", [&] {
+        SecretBytes value;
+        const Outcome outcome = file().read([&](SQLiteTransaction& transaction) {
+            auto statement =
+                transaction.prepare("SELECT value FROM preferences WHERE domain = ? AND key = ?");
+            statement.bindText(domain_).bindText(key);
+            if (!statement.step()) return false;
+            const Bytes stored = statement.blob(0);
+            value.assign(stored.begin(), stored.end());
+            return true;
+        });
+        if (outcome == Outcome::Failed) return false;
+        // The sink is served outside the transaction: it may take its time, and may use preferences itself.
+        if (outcome != Outcome::Done) {
+            result = ReadResult::Absent;
+            return true;
+        }
+        const bool readable = readBinaryPropertyList(value, sink);
+        result = readable ? ReadResult::Found : ReadResult::Damaged;
+        if (!readable)
+            VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the value of \"" + std::string(key) +
+                                            "\" is damaged");
+        return true;
+    });
+    return result;
+}
+
+std::vector<std::string> Preferences::keys() const {
+    std::vector<std::string> keys;
+    const bool done = guarded(domain_, "keys", [&] {
+        return file().read([&](SQLiteTransaction& transaction) {
+            keys.clear();
+            auto statement = transaction.prepare("SELECT key FROM preferences WHERE domain = ? ORDER BY key");
+            statement.bindText(domain_);
+            while (statement.step()) keys.emplace_back(statement.text(0));
+            return true;
+        }) == Outcome::Done;
+    });
+    if (!done) keys.clear();
+    return keys;
+}
+
+bool Preferences::set(const std::vector<std::pair<std::string, ValueWriter>>& values) const {
+    return guarded(domain_, "set", [&] {
+        std::vector<std::pair<std::string_view, SecretBytes>> rows;
+        for (const auto& [key, writer] : values) {
+            rows.emplace_back(key, writeBinaryPropertyList(writer));
+            if (!rows.back().second.empty()) continue;
+            VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the value for \"" + key +
+                                            "\" has no stored form; nothing is set");
+            return false;
+        }
+        return file().write([&](SQLiteTransaction& transaction) {
+            for (const auto& [key, value] : rows) {
+                transaction.prepare("REPLACE INTO preferences (domain, key, value) VALUES (?, ?, ?)")
+                    .bindText(domain_)
+                    .bindText(key)
+                    .bindBlob(value)
+                    .run();
+            }
+            return true;
+        }) == Outcome::Done;
+    });
+}
+
+bool Preferences::remove(const std::vector<std::string>& keys) const {
+    return guarded(domain_, "remove", [&] {
+        return file().write([&](SQLiteTransaction& transaction) {
+            for (const auto& key : keys) {
+                transaction.prepare("DELETE FROM preferences WHERE domain = ? AND key = ?")
+                    .bindText(domain_)
+                    .bindText(key)
+                    .run();
+            }
+            return true;
+        }) == Outcome::Done;
+    });
+}
+
+bool Preferences::setAside(std::string_view key) const {
+    return guarded(domain_, "setAside", [&] {
+        const auto date = static_cast<int64_t>(Clock::shared().now());
+        const std::string asideKey = std::string(key) + "-" + std::to_string(date);
+        const Outcome outcome = file().write([&](SQLiteTransaction& transaction) {
+            transaction
+                .prepare("UPDATE OR REPLACE preferences SET domain = ?, key = ? WHERE domain = ? AND key = ?")
+                .bindText(domain_ + ".damaged")
+                .bindText(asideKey)
+                .bindText(domain_)
+                .bindText(key)
+                .run();
+            return true;
+        });
+        if (outcome == Outcome::Done)
+            VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the damaged value is kept as \"" +
+                                            asideKey + "\" of " + domain_ + ".damaged");
+        return outcome == Outcome::Done;
+    });
+}
+
+bool Preferences::synchronize() const {
+    return guarded(domain_, "synchronize", [] { return file().checkpoint(); });
+}
+
+}  // namespace platform

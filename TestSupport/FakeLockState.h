@@ -1,0 +1,48 @@
+// A device that a test locks and unlocks.
+#pragma once
+
+#include <mutex>
+#include <utility>
+
+#include "Platform/keychain/LockState.h"
+#include "Platform/runtime/WorkQueue.h"
+
+namespace platform {
+
+class FakeLockState : public LockState {
+  public:
+    explicit FakeLockState(bool unlocked) : unlocked_(unlocked) { replaceShared(this); }
+    ~FakeLockState() override { replaceShared(nullptr); }
+    FakeLockState(const FakeLockState&) = delete;
+    FakeLockState& operator=(const FakeLockState&) = delete;
+
+    bool hasBeenUnlockedSinceBoot() const override {
+        const std::lock_guard lock(mutex_);
+        return unlocked_;
+    }
+    void onChange(std::function<void()> handler) override {
+        const std::lock_guard lock(mutex_);
+        handler_ = std::move(handler);
+    }
+
+    void unlock() {
+        const std::lock_guard lock(mutex_);
+        unlocked_ = true;
+        if (handler_) WorkQueue::main().async(handler_);
+    }
+    void lock() {
+        const std::lock_guard lock(mutex_);
+        unlocked_ = false;
+    }
+    bool isWatched() const {
+        const std::lock_guard lock(mutex_);
+        return handler_ != nullptr;
+    }
+
+  private:
+    mutable std::mutex mutex_;
+    bool unlocked_;
+    std::function<void()> handler_;
+};
+
+}  // namespace platform

@@ -1,0 +1,35 @@
+// Collects posted notifications for a test.
+#pragma once
+
+#include <mutex>
+#include <utility>
+#include <vector>
+
+#include "Platform/bus/Notifications.h"
+
+namespace platform {
+
+class FakeNotifications : public Notifications {
+  public:
+    FakeNotifications() { replaceShared(this); }
+    ~FakeNotifications() override { replaceShared(nullptr); }
+    FakeNotifications(const FakeNotifications&) = delete;
+    FakeNotifications& operator=(const FakeNotifications&) = delete;
+
+    void post(std::string name) override {
+        const std::lock_guard lock(mutex_);
+        names_.push_back(std::move(name));
+    }
+
+    /// What was posted since the last call.
+    std::vector<std::string> take() {
+        const std::lock_guard lock(mutex_);
+        return std::exchange(names_, {});
+    }
+
+  private:
+    std::mutex mutex_;
+    std::vector<std::string> names_;
+};
+
+}  // namespace platform

@@ -1,0 +1,28 @@
+#include "VeltoIDAuthd/ClientRequest.h"
+
+namespace veltoid {
+namespace {
+
+MessageObject readMessage(platform::IncomingMessage& message) {
+    MessageValueBuilder builder;
+    message.read(builder);
+    return std::make_shared<MessageValue>(builder.take());
+}
+
+}  // namespace
+
+Request::Request(platform::IncomingMessage& message) : message_(message), request_(readMessage(message)) {
+    command_ = request_.copyValue("command", Value::Kind::Number).asInt64().value_or(0);
+    account_ = request_.copyAccountName("VeltoID");
+    const Value options = request_.copyValue("options");
+    if (const Dictionary* given = options.asDictionary()) options_ = *given;
+}
+
+void Request::finish(bool success, const std::optional<Error>& error) {
+    reply_.setValue("success", Value::boolean(success));
+    if (!success && error) reply_.setError(*error);
+    message_.reply(
+        [reply = reply_.message()](platform::ValueSink& sink) { writeMessageValue(*reply, sink); });
+}
+
+}  // namespace veltoid

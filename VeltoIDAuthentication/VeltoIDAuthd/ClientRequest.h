@@ -1,0 +1,49 @@
+// What both services' requests have in common: command, account, options, and the reply.
+#pragma once
+
+#include <optional>
+
+#include "IPCHelpers/IPCMessage.h"
+#include "Platform/bus/MessageService.h"
+#include "Values/Error.h"
+#include "Values/Value.h"
+
+namespace veltoid {
+
+/// The ping, of both services.
+inline constexpr int64_t kVeltoIDPingCommand = 0x1;
+
+/// One request and the reply under construction. On the client's queue.
+class Request {
+  public:
+    /// Reads the message.
+    explicit Request(platform::IncomingMessage& message);
+
+    int64_t command() const { return command_; }
+    /// Lower-cased; null when absent.
+    const String& account() const { return account_; }
+    /// Empty when absent.
+    const Dictionary& options() const { return options_; }
+
+    String string(std::string_view key) const {
+        return request_.copyValue(key, Value::Kind::String).asString();
+    }
+    Data data(std::string_view key) const { return request_.copyValue(key, Value::Kind::Data).asData(); }
+    Value value(std::string_view key) const { return request_.copyValue(key); }
+
+    /// Adds an entry to the reply; an absent value adds nothing.
+    void answer(const String& key, const Value& value) { reply_.setValue(key, value); }
+
+    /// Sends the reply with "success", and with "error" when the outcome is a failure that has one.
+    void finish(bool success, const std::optional<Error>& error);
+
+  private:
+    platform::IncomingMessage& message_;
+    IPCMessage request_;
+    IPCMessage reply_;
+    int64_t command_ = 0;
+    String account_;
+    Dictionary options_;
+};
+
+}  // namespace veltoid

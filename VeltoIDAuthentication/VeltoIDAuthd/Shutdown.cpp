@@ -1,0 +1,112 @@
+#include "VeltoIDAuthd/Shutdown.h"
+
+#include <charconv>
+#include <cmath>
+#include <csignal>
+#include <cstdlib>
+#include <string_view>
+#include <utility>
+
+#include "Logging/Log.h"
+#include "Platform/bus/EventLoop.h"
+#include "Platform/bus/MessageService.h"
+#include "Platform/bus/ServiceManager.h"
+#include "Platform/runtime/InstanceLock.h"
+#include "Platform/runtime/Transactions.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+
+namespace veltoid {
+namespace {
+
+constexpr const char* kIdleExitVariable = "HARBWELL_IDLE_EXIT";
+
+/// How long the agent stays without anything to do (seconds).
+constexpr double kDefaultIdleExit = 30;
+
+/// How long open transactions may hold up the end after SIGTERM, and after a command (seconds).
+constexpr double kLongestTermination = 10;
+constexpr double kLongestCommandedEnd = 1;
+
+/// 0 for never.
+double idleExitSeconds() {
+    const char* text = std::getenv(kIdleExitVariable);
+    if (text == nullptr) return kDefaultIdleExit;
+    const std::string_view number = text;
+    double seconds = 0;
+    const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), seconds);
+    if (error == std::errc() && end == number.data() + number.size() && std::isfinite(seconds) &&
+        seconds >= 0)
+        return seconds;
+    VELTOID_LOG_FROM("idleExitSeconds", kError,
+                     kIdleExitVariable << " is not a number of seconds; using " << kDefaultIdleExit << ".");
+    return kDefaultIdleExit;
+}
+
+/// Now, instead of when it was planned for.
+void makeDurable() {
+    __VeltoIDDBSynchronize();
+    __VeltoIDDBWriteFindPersonCache();
+}
+
+void endProcess() {
+    makeDurable();
+    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
+}
+
+/// Everything that was sent to the agent is answered. What it stored is made durable now, since it would keep
+/// the agent for a while otherwise; other work is finished.
+void endWhenWorkIsDone() {
+    makeDurable();
+    platform::transactions::whenNoneIsOpen([] {
+        if (platform::transactions::openCount() > 0)
+            endWhenWorkIsDone();
+        else
+            endProcess();
+    });
+}
+
+void leave() {
+    static bool leaving = false;
+    if (std::exchange(leaving, true)) return;
+    // Before the names are free: a start that is asked for while the service manager believes that the agent
+    // runs would come to nothing.
+    platform::ServiceManager::shared().announceStopping();
+    platform::instance_lock::holdUpNext();
+    platform::message_service::announceTermination();
+    platform::message_service::releaseNames(endWhenWorkIsDone);
+}
+
+void shutDownWithin(double seconds) {
+    leave();
+    platform::WorkQueue::main().asyncAfter(seconds, endProcess);
+}
+
+void terminate() { shutDownWithin(kLongestTermination); }
+
+void shutDownWhenIdle(double seconds) {
+    platform::transactions::whenNoneWasOpenFor(seconds, [seconds] {
+        platform::ServiceManager::shared().canStartAgain([seconds](bool can) {
+            if (can && platform::transactions::openCount() == 0)
+                leave();
+            else
+                shutDownWhenIdle(seconds);
+        });
+    });
+}
+
+}  // namespace
+
+void prepareShutdown() {
+    platform::event_loop::onSignal(SIGTERM, terminate);
+    // Without its bus it can be reached by nobody and hold up the end of a log-in session.
+    platform::message_service::onConnectionLost(terminate);
+    if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
+}
+
+void shutDownByCommand() {
+    platform::WorkQueue::main().async([] { shutDownWithin(kLongestCommandedEnd); });
+}
+
+}  // namespace veltoid

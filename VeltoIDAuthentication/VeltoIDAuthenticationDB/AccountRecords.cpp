@@ -1,0 +1,308 @@
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+
+#include "Logging/Log.h"
+#include "Platform/runtime/Clock.h"
+#include "Values/Digest.h"
+#include "Values/LowerCase.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
+
+namespace veltoid {
+namespace {
+
+using database::Store;
+
+Value now() { return Value::date(platform::Clock::shared().now()); }
+
+Error identityError(int64_t code) { return {String(kIdentityErrorDomain), code, {}}; }
+
+/// An account that is not there may only be out of reach.
+int64_t missingAccountCode(const Store& store) {
+    return store.isLoaded() ? identity_error::kUnknownAccount : identity_error::kUnspecified;
+}
+
+bool hasPassword(const Dictionary& record) {
+    return record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey) ||
+           record.string(kVeltoIDAccountHashedPasswordKey);
+}
+
+/// Whether the keychain holds exactly this password for the record.
+bool keychainHoldsPassword(const Dictionary& record, const String& hashedPassword) {
+    const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+    String stored;
+    return reference && copyPasswordFromKeychainGivenPersistentRef(reference, &stored) &&
+           stored == hashedPassword;
+}
+
+/// Brings the password into the keychain and its reference into the record.
+bool storePassword(const String& name, const String& hashedPassword, Dictionary& record) {
+    if (keychainHoldsPassword(record, hashedPassword)) {
+        VELTOID_LOG_FROM("__VeltoIDDBCreateVeltoIDAccount", kNotice,
+                         "Password being added for account "
+                             << name.view()
+                             << " matches password on keychain, so skipping over addPasswordToKeychain");
+        return true;
+    }
+    Data reference;
+    if (!addPasswordToKeychain(name, hashedPassword, nullptr, &reference)) return false;
+    if (!record.contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+        record.set(kVeltoIDAccountHashedPasswordKeychainReferenceKey, reference);
+    return true;
+}
+
+/// Stores the record and writes the section.
+bool storeRecord(Store& store, const String& name, const Dictionary& record, bool signal) {
+    Dictionary accounts = store.accounts;
+    accounts.set(name, record);
+    return store.replace(&Store::accounts, std::move(accounts), signal);
+}
+
+void markDirty(Dictionary& record) {
+    record.set(kVeltoIDDirtyKey, Value::boolean(true));
+    record.set(kVeltoIDAccountModificationDateKey, now());
+}
+
+/// Applies one entry; true when it changes the record. Setting a key to Null that is not there changes
+/// nothing.
+bool applyEntry(Dictionary& record, const String& key, const Value& value) {
+    const Value& stored = record[key.view()];
+    if (stored == value) return false;
+    if (value.isNull()) return record.remove(key.view());
+    record.set(key, value);
+    return true;
+}
+
+void removeDirtyMarks(Dictionary& section) {
+    const Dictionary before = section;
+    for (const auto& [key, value] : before) {
+        const Dictionary* entry = value.asDictionary();
+        if (entry == nullptr || !entry->contains(kVeltoIDDirtyKey)) continue;
+        Dictionary cleaned = *entry;
+        cleaned.remove(kVeltoIDDirtyKey);
+        section.set(key, cleaned);
+    }
+}
+
+}  // namespace
+
+bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
+    bool loaded = false;
+    Array all = database::perform([&](const Store& store) {
+        loaded = store.isLoaded();
+        Array keys;
+        for (const auto& [name, record] : store.accounts) keys.append(name);
+        return keys;
+    });
+    if (all.empty()) {
+        fillError(error, identityError(loaded ? identity_error::kNoAccounts : identity_error::kUnspecified));
+        return false;
+    }
+    if (names != nullptr) *names = std::move(all);
+    return true;
+}
+
+std::optional<Dictionary> __VeltoIDDBCopyFirstVeltoIDAccount(bool requirePassword, bool requireDSID) {
+    return database::perform([&](const Store& store) -> std::optional<Dictionary> {
+        for (const auto& [name, value] : store.accounts) {
+            const Dictionary* record = value.asDictionary();
+            if (record == nullptr || (requirePassword && !hasPassword(*record)) ||
+                (requireDSID && !record->string(kVeltoIDAccountDSIDKey)))
+                continue;
+            return *record;
+        }
+        return std::nullopt;
+    });
+}
+
+bool __VeltoIDDBCopyVeltoIDAccount(const String& name, Dictionary* record, ErrorOut error) {
+    if (!name) {
+        fillError(error, identityError(identity_error::kInvalidParameters));
+        return false;
+    }
+    return database::perform([&](const Store& store) {
+        const Dictionary* found = Store::find(store.accounts, name);
+        if (found == nullptr) {
+            fillError(error, identityError(missingAccountCode(store)));
+        } else if (record != nullptr) {
+            *record = *found;
+        }
+        return found != nullptr;
+    });
+}
+
+bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error) {
+    const String found = database::perform([&](const Store& store) -> String {
+        for (const auto& [key, value] : store.accounts) {
+            const Dictionary* record = value.asDictionary();
+            if (encDsId && record != nullptr && record->string(kVeltoIDAccountDSIDKey) == encDsId) return key;
+        }
+        return nullptr;
+    });
+    if (!found) {
+        fillError(error, makeError(identity_error::kUnspecified, {"Unknown error", "?", "?"}, {}, __func__,
+                                   __FILE_NAME__, __LINE__));
+        return false;
+    }
+    if (name != nullptr) *name = found;
+    return true;
+}
+
+bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword,
+                                     const String& encDsId) {
+    if (!name) return false;
+    return database::perform([&](Store& store) {
+        // Before the password goes anywhere: an item that no record names would never be found again.
+        if (!store.isLoaded()) return false;
+        const Dictionary* existing = Store::find(store.accounts, name);
+        Dictionary record =
+            existing != nullptr ? *existing : Dictionary{{kVeltoIDAccountCreationDateKey, now()}};
+        record.set(kVeltoIDAccountNameKey, name);
+        record.set(kVeltoIDAccountDSIDKey, encDsId);
+        if (hashedPassword && !storePassword(name, hashedPassword, record)) return false;
+        if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
+            database::deriveAccountUUIDs(name, record, store.metaInfo);
+        markDirty(record);
+        return storeRecord(store, name, record, true);
+    });
+}
+
+String __VeltoIDDBCopyHashedPassword(const Dictionary& record) {
+    String password;
+    const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+    if (reference && copyPasswordFromKeychainGivenPersistentRef(reference, &password)) return password;
+    return record.string(kVeltoIDAccountHashedPasswordKey);
+}
+
+bool __VeltoIDDBRemovePassword(const String& name) {
+    return database::perform([&](Store& store) {
+        const Dictionary* existing = Store::find(store.accounts, name);
+        if (existing == nullptr) return false;
+        if (!existing->contains(kVeltoIDAccountHashedPasswordKey) &&
+            !existing->contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+            return true;
+        Dictionary record = *existing;
+        record.remove(kVeltoIDAccountHashedPasswordKey);
+        if (const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+            removePasswordFromKeychainGivenPersistentRef(reference);
+        record.remove(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+        markDirty(record);
+        return storeRecord(store, name, record, true);
+    });
+}
+
+bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, bool signal) {
+    if (!name || values.empty()) return false;
+    return database::perform([&](Store& store) {
+        const Dictionary* existing = Store::find(store.accounts, name);
+        if (existing == nullptr) return false;
+        Dictionary record = *existing;
+        bool changed = false;
+        bool significant = false;
+        for (const auto& [key, value] : values) {
+            changed = applyEntry(record, key, value) || changed;
+            significant = significant || (key.view() != kVeltoIDAccountModificationDateKey &&
+                                          key.view() != kVeltoIDDirtyKey);
+        }
+        if (!changed) return true;
+        record.set(kVeltoIDAccountModificationDateKey, now());
+        if (signal && values.boolean(kVeltoIDDirtyKey) != false)
+            record.set(kVeltoIDDirtyKey, Value::boolean(true));
+        return storeRecord(store, name, record, signal && significant);
+    });
+}
+
+bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, bool signal) {
+    if (!key) return false;
+    return __VeltoIDDBSetAccountValues(name, {{key.view(), value.isAbsent() ? Value::null() : value}},
+                                       signal);
+}
+
+Value __VeltoIDDBCopyAccountValue(const String& name, const String& key) {
+    return database::perform([&](const Store& store) {
+        const Dictionary* record = Store::find(store.accounts, name);
+        return record != nullptr && key ? (*record)[key.view()] : Value();
+    });
+}
+
+bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
+    if (!name) {
+        fillError(error, Error{String(kOSStatusErrorDomain), -1, {}});
+        return false;
+    }
+    return database::perform([&](Store& store) {
+        Dictionary accounts = store.accounts;
+        const bool existed = accounts.remove(name.view());
+        if (existed && store.replace(&Store::accounts, std::move(accounts), true)) return true;
+        fillError(error, identityError(existed ? identity_error::kUnspecified : missingAccountCode(store)));
+        return false;
+    });
+}
+
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, Dictionary* removed) {
+    return database::perform([&](Store& store) {
+        const Dictionary* existing = Store::find(store.accounts, name);
+        if (existing == nullptr) return false;
+        *removed = *existing;
+        Dictionary accounts = store.accounts;
+        accounts.remove(name.view());
+        if (!store.replace(&Store::accounts, std::move(accounts), true)) return false;
+        if (const Data reference = removed->data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
+            removePasswordFromKeychainGivenPersistentRef(reference);
+        return true;
+    });
+}
+
+std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates) {
+    return database::perform([&](Store& store) -> std::optional<Array> {
+        Array names;
+        for (const auto& [name, value] : store.accounts) {
+            const Dictionary* record = value.asDictionary();
+            if (record != nullptr && record->boolean(kVeltoIDDirtyKey).value_or(false)) names.append(name);
+        }
+        if (clear) removeDirtyMarks(store.accounts);
+        if (clear && includeCertificates) removeDirtyMarks(store.certificates);
+        if (names.empty()) return std::nullopt;
+        return names;
+    });
+}
+
+bool __VeltoIDDBDeriveAccountUUIDs(const String& name, Dictionary& record) {
+    return database::perform(
+        [&](const Store& store) { return database::deriveAccountUUIDs(name, record, store.metaInfo); });
+}
+
+bool __VeltoIDDBHasValidCertificate(const String& name) {
+    Dictionary record;
+    if (!__VeltoIDDBCopyVeltoIDAccount(name, &record)) return false;
+    return hasValidCertificateEntry(record.string(kVeltoIDAccountDSIDKey));
+}
+
+bool __VeltoIDDBHasCertificateToken(const String& name) {
+    return __VeltoIDDBCopyAccountValue(name, kVeltoIDAccountCertificateTokenKey).isString();
+}
+
+namespace database {
+
+bool deriveAccountUUIDs(const String& name, Dictionary& record, const Dictionary& metaInfo) {
+    bool changed = false;
+    if (!record.string(kVeltoIDAccountUUIDKey)) {
+        record.set(kVeltoIDAccountUUIDKey, randomUUIDText());
+        record.remove(kVeltoIDAccountStableUUIDKey);
+        changed = true;
+    }
+    const String userUUID = metaInfo.string(kVeltoIDMetaUserUUIDKey);
+    if (userUUID && !record.string(kVeltoIDAccountStableUUIDKey)) {
+        const Data digest = sha256OfString(lowerCased(name).text() + userUUID.text());
+        platform::UUIDBytes folded{};
+        for (size_t i = 0; i < folded.size(); ++i)
+            folded[i] = static_cast<uint8_t>(digest.bytes()[2 * i] ^ digest.bytes()[2 * i + 1]);
+        record.set(kVeltoIDAccountStableUUIDKey, platform::canonicalUUIDText(folded));
+        changed = true;
+    }
+    return changed;
+}
+
+}  // namespace database
+}  // namespace veltoid

@@ -1,0 +1,45 @@
+// Who owns the key and certificate items of the keychain.
+//
+// An item lives as long as a record or certificate entry refers to it: the reference in the record while a
+// request is pending ("CertificatePrivateKeyReference"), the references in the entry afterwards. Whoever
+// drops a reference drops the item here. Between making an item and storing its reference nobody else may
+// look, so all of this happens under one lock.
+#pragma once
+
+#include "Values/Value.h"
+
+namespace veltoid {
+
+/// Held by whatever makes, stores or drops key and certificate items, server calls in between included. Taken
+/// before any queue; not recursive.
+class OwnershipLock {
+  public:
+    OwnershipLock();
+    ~OwnershipLock();
+    OwnershipLock(const OwnershipLock&) = delete;
+    OwnershipLock& operator=(const OwnershipLock&) = delete;
+};
+
+/// What is dropped of an entry; by default all.
+struct DroppedItems {
+    bool certificate = true;
+    bool privateKey = true;
+};
+
+/// Deletes the private key of the account's pending request and the record's reference to it.
+void discardPendingKey(const OwnershipLock& ownership, const String& accountName);
+
+/// Deletes the items that `before` refers to and `after` does not. An intermediate certificate goes only when
+/// no stored entry refers to it.
+void discardReplacedItems(const OwnershipLock& ownership, const Dictionary& before, const Dictionary& after);
+
+/// Removes the encDsId's certificate entry, if there is one, with its items.
+void discardCertificate(const OwnershipLock& ownership, const String& encDsId,
+                        const DroppedItems& dropped = {});
+
+/// Deletes the account's items that nothing refers to any more, such as one that was made just before the
+/// agent was killed. For an account that is being forgotten.
+void discardStrayItems(const OwnershipLock& ownership, const String& accountName,
+                       const DroppedItems& dropped);
+
+}  // namespace veltoid

@@ -1,0 +1,55 @@
+#include "VeltoIDAuthenticationImpl/PollBackOff.h"
+
+#include <algorithm>
+#include <cmath>
+#include <cstring>
+
+#include "Platform/crypto/Crypto.h"
+#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
+
+namespace veltoid {
+namespace {
+
+constexpr double kBackOffFactor = 1.5;
+constexpr double kDefaultPendingDelay = 60;
+constexpr double kDelayForUnbelievableOnes = 15;
+
+std::optional<double> finite(std::optional<double> number) {
+    return number && std::isfinite(*number) ? number : std::nullopt;
+}
+
+}  // namespace
+
+double randomPollingDelay() {
+    constexpr uint32_t kHighest = 0x7FFF'FFFF;
+    uint8_t bytes[sizeof(uint32_t)];
+    platform::fillRandom(bytes);
+    uint32_t number = 0;
+    std::memcpy(&number, bytes, sizeof number);
+    return kLongestPollingDelay + kLongestPollingDelay * (number & kHighest) / kHighest;
+}
+
+double delayAfterPending(double delay) {
+    return delay < kLongestPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
+}
+
+double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
+
+std::optional<double> storedFetchDelta(const Dictionary& record) {
+    return finite(record.number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey));
+}
+
+double pendingDelay(const Value& delay, const Dictionary& record) {
+    const auto given = finite(delay.asDouble());
+    const double seconds = given ? *given : storedFetchDelta(record).value_or(kDefaultPendingDelay);
+    return std::min(seconds, kVeltoIDLongestFetchDelay);
+}
+
+std::optional<double> tokenDelay(const Value& delay) {
+    const auto seconds = delay.asDouble();
+    if (!seconds) return std::nullopt;
+    return *seconds >= 0 && *seconds <= kLongestPollingDelay ? *seconds : kDelayForUnbelievableOnes;
+}
+
+}  // namespace veltoid

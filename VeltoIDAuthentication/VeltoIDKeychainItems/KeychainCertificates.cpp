@@ -1,0 +1,140 @@
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
+
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Values/Digest.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
+
+namespace veltoid {
+namespace {
+
+using platform::Accessibility;
+using platform::Certificate;
+using platform::KeychainAttributes;
+using platform::KeychainItemClass;
+using platform::KeychainStatus;
+
+KeychainAttributes allCertificates() {
+    KeychainAttributes attributes;
+    attributes.itemClass = KeychainItemClass::Certificate;
+    return attributes;
+}
+
+KeychainAttributes identityOf(const Certificate& certificate) {
+    KeychainAttributes attributes = allCertificates();
+    attributes.applicationValue = sha256Text(Data(certificate.der));
+    return attributes;
+}
+
+bool updateItem(const Data& reference, const Certificate& certificate, const String& label) {
+    const KeychainStatus status = platform::keychain::update(
+        keychain_items::queryForReference(KeychainItemClass::Certificate, reference),
+        {platform::SecretBytes(certificate.der.begin(), certificate.der.end()), Accessibility::Always,
+         label.text(), kKeychainAccessGroup});
+    if (status == platform::kKeychainSuccess) return true;
+    const Dictionary attributes = {{"accessGroup", kKeychainAccessGroup}, {"label", label}};
+    VELTOID_LOG_FROM("addCertificateToKeychain", kNotice,
+                     "SetItemUpdate(" << keychain_items::describeItemQuery("cert", reference)
+                                      << ", attrs=" << describeValue(attributes) << " err=" << status
+                                      << " so deleting and re-adding item.");
+    return false;
+}
+
+bool addItem(const Certificate& certificate, const String& label, Data* reference) {
+    KeychainAttributes attributes = identityOf(certificate);
+    attributes.label = label.text();
+    attributes.accessGroup = kKeychainAccessGroup;
+    platform::PersistentReference added;
+    const KeychainStatus status =
+        platform::keychain::add(attributes, Accessibility::Always, certificate.der, &added);
+    if (status == platform::kKeychainSuccess) {
+        *reference = keychain_items::dataOf(added);
+        return true;
+    }
+    VELTOID_LOG_FROM("addCertificateToKeychain", kError,
+                     "Certificate " << describeValue(label) << " not added to keychain; err=" << status);
+    return false;
+}
+
+bool addOrUpdate(const Certificate& certificate, const String& label, Data* reference) {
+    if (const Data found = keychain_items::copyReference(identityOf(certificate))) {
+        if (updateItem(found, certificate, label)) {
+            *reference = found;
+            return true;
+        }
+        platform::keychain::remove({identityOf(certificate), {}});
+    }
+    return addItem(certificate, label, reference);
+}
+
+}  // namespace
+
+bool addCertificateToKeychain(const Certificate& certificate, const String& label,
+                              Data* persistentReference) {
+    if (!label) return false;
+    return keychainQueue().sync([&] {
+        Data reference;
+        if (!usesSystemKeychain() || !addOrUpdate(certificate, label, &reference)) return false;
+        if (persistentReference != nullptr) *persistentReference = reference;
+        return true;
+    });
+}
+
+bool copyPersistentRefForCertificate(const Certificate& certificate, Data* persistentReference) {
+    return keychainQueue().sync([&] {
+        const Data reference =
+            usesSystemKeychain() ? keychain_items::copyReference(identityOf(certificate)) : Data();
+        if (reference && persistentReference != nullptr) *persistentReference = reference;
+        return static_cast<bool>(reference);
+    });
+}
+
+bool copyCertificateFromKeychainGivenPersistentRef(const Data& persistentReference,
+                                                   std::optional<Certificate>* certificate) {
+    if (!persistentReference) return false;
+    return keychainQueue().sync([&] {
+        platform::SecretBytes data;
+        const auto query =
+            keychain_items::queryForReference(KeychainItemClass::Certificate, persistentReference);
+        if (!usesSystemKeychain() ||
+            platform::keychain::copyMatchingData(query, &data) != platform::kKeychainSuccess)
+            return false;
+        if (certificate != nullptr) *certificate = platform::readCertificate(data);
+        return true;
+    });
+}
+
+bool removeCertificateFromKeychainGivenPersistentRef(const Data& persistentReference) {
+    if (!persistentReference) return false;
+    return keychainQueue().sync([&] {
+        // Kept in memory there is none: it counts as gone.
+        if (!usesSystemKeychain()) return true;
+        const KeychainStatus status = platform::keychain::remove(
+            keychain_items::queryForReference(KeychainItemClass::Certificate, persistentReference));
+        if (status == platform::kKeychainSuccess || status == platform::kKeychainItemNotFound) return true;
+        VELTOID_LOG_FROM("removeCertificateFromKeychainGivenPersistentRef", kError,
+                         "Error #" << status
+                                   << " from keychain::remove(), "
+                                      "removeCertificateFromKeychainGivenPersistentRef #"
+                                   << __LINE__);
+        return false;
+    });
+}
+
+std::optional<Array> copyAllCertificatesFromKeychain() {
+    return keychainQueue().sync([]() -> std::optional<Array> {
+        if (!usesSystemKeychain()) return std::nullopt;
+        return keychain_items::copyReferences(allCertificates());
+    });
+}
+
+std::optional<Array> copyCertificatesFromKeychainGivenLabel(const String& label) {
+    return keychainQueue().sync([&]() -> std::optional<Array> {
+        if (!usesSystemKeychain()) return std::nullopt;
+        KeychainAttributes attributes = allCertificates();
+        attributes.label = label.text();
+        return keychain_items::copyReferences(attributes);
+    });
+}
+
+}  // namespace veltoid

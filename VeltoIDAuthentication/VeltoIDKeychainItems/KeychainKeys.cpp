@@ -1,0 +1,178 @@
+#include "VeltoIDKeychainItems/KeychainKeys.h"
+
+#include "Logging/Log.h"
+#include "Platform/crypto/KeyPair.h"
+#include "Values/Digest.h"
+#include "Values/SecurityObject.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
+
+namespace veltoid {
+namespace {
+
+using platform::Accessibility;
+using platform::KeychainAttributes;
+using platform::KeychainItemClass;
+using platform::KeychainStatus;
+
+keychain_items::MemoryTable<Key>& memoryItems() {
+    static auto* items = new keychain_items::MemoryTable<Key>;
+    return *items;
+}
+
+/// What identifies the key among those of its class.
+KeychainAttributes identityOf(const Key& key) {
+    KeychainAttributes attributes;
+    attributes.itemClass = KeychainItemClass::Key;
+    attributes.keyClass = key.isPrivate ? "private" : "public";
+    attributes.applicationValue = sha256Text(key.publicPart);
+    return attributes;
+}
+
+std::string labelOf(const String& owner, const String& kind) {
+    return "Velto ID " + owner.text() + " " + kind.text();
+}
+
+Accessibility accessibilityOf(const Key& key) {
+    return key.isPrivate ? Accessibility::AfterFirstUnlock : Accessibility::Always;
+}
+
+/// Same key, so only what surrounds it can differ.
+KeychainStatus updateItem(const Data& reference, const Key& key, const std::string& label) {
+    const auto bytes = key.encoded.bytes();
+    return platform::keychain::update(keychain_items::queryForReference(KeychainItemClass::Key, reference),
+                                      {platform::SecretBytes(bytes.begin(), bytes.end()),
+                                       accessibilityOf(key), label, kKeychainAccessGroup});
+}
+
+/// A duplicate that the search did not show makes room once.
+bool addItem(const Key& key, const std::string& label, Data* reference) {
+    KeychainAttributes attributes = identityOf(key);
+    attributes.label = label;
+    attributes.accessGroup = kKeychainAccessGroup;
+    platform::PersistentReference added;
+    const auto add = [&] {
+        return platform::keychain::add(attributes, accessibilityOf(key), key.encoded.bytes(), &added);
+    };
+    KeychainStatus status = add();
+    if (status == platform::kKeychainDuplicateItem &&
+        platform::keychain::remove({identityOf(key), {}}) == platform::kKeychainSuccess)
+        status = add();
+    if (status != platform::kKeychainSuccess) return false;
+    *reference = keychain_items::dataOf(added);
+    return true;
+}
+
+bool addOrUpdate(const Key& key, const std::string& label, Data* reference) {
+    KeychainStatus status = platform::kKeychainSuccess;
+    const Data found = keychain_items::copyReference(identityOf(key), &status);
+    if (found) {
+        status = updateItem(found, key, label);
+        if (status == platform::kKeychainSuccess) *reference = found;
+        if (status == platform::kKeychainSuccess || keychain_items::mayPass(status))
+            return status == platform::kKeychainSuccess;
+        // Damaged: the key at hand replaces it.
+        platform::keychain::remove({identityOf(key), {}});
+    }
+    if (!found && status != platform::kKeychainItemNotFound) return false;
+    return addItem(key, label, reference);
+}
+
+}  // namespace
+
+Key Key::privateKey(platform::Bytes pkcs8) {
+    const auto publicPart = platform::publicKeyOf(pkcs8);
+    if (!publicPart) return {};
+    return {true, Data(pkcs8), Data(*publicPart)};
+}
+
+Key Key::publicKey(platform::Bytes publicKeyInfo) {
+    if (!platform::isPublicKey(publicKeyInfo)) return {};
+    return {false, Data(publicKeyInfo), Data(publicKeyInfo)};
+}
+
+Value Key::description() const {
+    if (!encoded) return {};
+    const std::string text = (isPrivate ? "private " : "public ") + sha256Text(publicPart);
+    return Value::object({KeyDescription{text}});
+}
+
+bool addKeyToKeychain(const String& owner, const String& kind, const Key& key, Data* persistentReference) {
+    const bool kindIsPrivate = !kind || kind == kPrivateKeyKind;
+    if (!key || key.isPrivate != kindIsPrivate) return false;
+    return keychainQueue().sync([&] {
+        Data reference;
+        if (!usesSystemKeychain()) {
+            reference = memoryItems().add(key);
+        } else if (!addOrUpdate(key, labelOf(owner, kind), &reference)) {
+            return false;
+        }
+        if (persistentReference != nullptr) *persistentReference = reference;
+        return true;
+    });
+}
+
+bool copyPersistentRefForKey(const Key& key, Data* persistentReference) {
+    if (!key) return false;
+    return keychainQueue().sync([&] {
+        Data reference;
+        if (usesSystemKeychain()) {
+            reference = keychain_items::copyReference(identityOf(key));
+        } else {
+            for (const auto& [known, item] : memoryItems().items())
+                if (!reference && item == key) reference = known;
+        }
+        if (reference && persistentReference != nullptr) *persistentReference = reference;
+        return static_cast<bool>(reference);
+    });
+}
+
+bool copyKeyFromKeychainGivenPersistentRef(const Data& persistentReference, Key* key) {
+    if (!persistentReference) return false;
+    return keychainQueue().sync([&] {
+        if (!usesSystemKeychain()) {
+            const Key* found = memoryItems().find(persistentReference);
+            if (found != nullptr && key != nullptr) *key = *found;
+            return found != nullptr;
+        }
+        platform::SecretBytes data;
+        const auto query = keychain_items::queryForReference(KeychainItemClass::Key, persistentReference);
+        if (platform::keychain::copyMatchingData(query, &data) != platform::kKeychainSuccess) return false;
+        if (key == nullptr) return true;
+        Key read = Key::privateKey(data);
+        if (!read) read = Key::publicKey(data);
+        if (read) *key = std::move(read);
+        return true;
+    });
+}
+
+bool removeKeyFromKeychainGivenPersistentRef(const Data& persistentReference) {
+    if (!persistentReference) return false;
+    return keychainQueue().sync([&] {
+        if (!usesSystemKeychain()) return memoryItems().remove(persistentReference);
+        return platform::keychain::remove(keychain_items::queryForReference(
+                   KeychainItemClass::Key, persistentReference)) == platform::kKeychainSuccess;
+    });
+}
+
+std::optional<Array> copyAllKeysFromKeychain() {
+    return keychainQueue().sync([]() -> std::optional<Array> {
+        KeychainAttributes keys;
+        keys.itemClass = KeychainItemClass::Key;
+        if (usesSystemKeychain()) return keychain_items::copyReferences(keys);
+        Array references;
+        for (const auto& [reference, key] : memoryItems().items()) references.append(reference);
+        return references.empty() ? std::nullopt : std::optional(references);
+    });
+}
+
+std::optional<Array> copyKeysFromKeychainGivenOwner(const String& owner, const String& kind) {
+    return keychainQueue().sync([&]() -> std::optional<Array> {
+        if (!usesSystemKeychain()) return std::nullopt;
+        KeychainAttributes keys;
+        keys.itemClass = KeychainItemClass::Key;
+        keys.label = labelOf(owner, kind);
+        return keychain_items::copyReferences(keys);
+    });
+}
+
+}  // namespace veltoid

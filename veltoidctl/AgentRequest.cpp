@@ -1,0 +1,44 @@
+#include "veltoidctl/AgentRequest.h"
+
+#include "Platform/keychain/Keychain.h"
+
+namespace veltoidctl {
+
+Json send(AgentConnection& agent, const Request& request) {
+    return agent.send([&](platform::ValueSink& sink) {
+        sink.beginDictionary();
+        sink.key("command");
+        sink.integer(request.command);
+        if (!request.account.empty()) {
+            sink.key("VeltoID");
+            sink.string(request.account);
+        }
+        if (!request.passwordHash.empty()) {
+            sink.key("hashedpassword");
+            sink.string(request.passwordHash);
+        }
+        if (request.entries) request.entries(sink);
+        sink.key("options");
+        sink.beginDictionary();
+        for (const auto& [option, value] : request.options) {
+            sink.key(option);
+            if (const bool* flag = std::get_if<bool>(&value)) {
+                sink.boolean(*flag);
+            } else {
+                sink.real(std::get<double>(value));
+            }
+        }
+        sink.endDictionary();
+        sink.endDictionary();
+    });
+}
+
+bool succeeded(const Json& reply) { return reply.value("success", false); }
+
+std::string reasonUnlessLocked(const std::string& reason) {
+    return platform::keychain::protection() == platform::keychain::Protection::Locked
+               ? "the keychain is locked; `veltoidctl keychain unlock` comes first"
+               : reason;
+}
+
+}  // namespace veltoidctl
