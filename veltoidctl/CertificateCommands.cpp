@@ -2,6 +2,7 @@
 #include <iostream>
 #include <stdexcept>
 
+#include "Platform/encoding/CalendarText.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/CertificateExport.h"
 #include "veltoidctl/ClientCertificate.h"
@@ -26,8 +27,10 @@ Json describe(const ClientCertificate& found) {
         shown["Subject"] = found.certificate->subject;
         shown["Issuer"] = found.certificate->issuer;
         shown["SerialNumber"] = found.certificate->serialNumber;
-        if (const auto start = dateText(found.certificate->notBefore)) shown["ValidFrom"] = *start;
-        if (const auto end = dateText(found.certificate->notAfter)) shown["Expires"] = *end;
+        if (const auto start = platform::calendarText(found.certificate->notBefore, platform::kISO8601))
+            shown["ValidFrom"] = *start;
+        if (const auto end = platform::calendarText(found.certificate->notAfter, platform::kISO8601))
+            shown["Expires"] = *end;
     }
     if (found.entry.contains("NextRenewalAttempt"))
         shown["NextRenewalAttempt"] = found.entry["NextRenewalAttempt"];

@@ -1,7 +1,6 @@
 // Values of a reply as JSON.
 #pragma once
 
-#include <optional>
 #include <string>
 #include <vector>
 
@@ -10,9 +9,6 @@
 #include "veltoidctl/AgentConnection.h"
 
 namespace veltoidctl {
-
-/// ISO 8601 text at UTC; none for seconds beyond what a calendar has.
-std::optional<std::string> dateText(double seconds);
 
 /// The bytes behind a key of a reply; null without them.
 veltoid::Data dataIn(const Json& dictionary, const char* key);

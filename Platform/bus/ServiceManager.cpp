@@ -11,18 +11,17 @@
 #include <systemd/sd-daemon.h>
 
 #include <algorithm>
-#include <array>
 #include <atomic>
 #include <cmath>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 #include <memory>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "Platform/bus/BusConnection.h"
+#include "Platform/encoding/CalendarText.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Platform/runtime/Transactions.h"
@@ -54,16 +53,11 @@ constexpr int kMostStops = 3;
 using Message = std::unique_ptr<sd_bus_message, decltype(&sd_bus_message_unref)>;
 using MessageHandler = int (*)(sd_bus_message* message, void* context, sd_bus_error* error);
 
+/// Of the form of systemd.time(7).
 std::string calendarDate(double date) {
-    const double whole = std::floor(date);
-    const auto seconds = static_cast<time_t>(whole);
-    const auto microseconds = static_cast<uint64_t>((date - whole) * kMicrosecondsPerSecond);
-    tm utc{};
-    gmtime_r(&seconds, &utc);
-    std::array<char, 32> text{};
-    const size_t length = std::strftime(text.data(), text.size(), "%Y-%m-%d %H:%M:%S.", &utc);
+    const auto microseconds = static_cast<uint64_t>((date - std::floor(date)) * kMicrosecondsPerSecond);
     const std::string fraction = std::to_string(kMicrosecondsPerSecond + microseconds).substr(1);
-    return std::string(text.data(), length) + fraction + " UTC";
+    return calendarText(date, "%Y-%m-%d %H:%M:%S.").value_or("") + fraction + " UTC";
 }
 
 /// The manager is only spoken to: asking the bus to start one would start nothing that manages this process.

@@ -32,7 +32,7 @@ class Preferences {
         Failed,
     };
 
-    /// Writes the value under `key` into the sink when it is found, otherwise nothing.
+    /// Writes the value under `key` into the sink. What has reached the sink counts only when it was found.
     ReadResult read(std::string_view key, ValueSink& sink) const;
 
     /// Empty, too, when the store cannot be read now.
