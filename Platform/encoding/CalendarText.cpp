@@ -40,12 +40,9 @@ CalendarDate calendarDate(double seconds) {
     const sys_days midnight = floor<days>(time);
     const year_month_day day(midnight);
     const hh_mm_ss clock(time - midnight);
-    return {static_cast<int>(day.year()),
-            static_cast<unsigned>(day.month()),
-            static_cast<unsigned>(day.day()),
-            clock.hours().count(),
-            clock.minutes().count(),
-            clock.seconds().count()};
+    return {static_cast<int>(day.year()),     static_cast<unsigned>(day.month()),
+            static_cast<unsigned>(day.day()), clock.hours().count(),
+            clock.minutes().count(),          clock.seconds().count()};
 }
 
 std::optional<std::string> calendarText(double seconds, const char* format) {

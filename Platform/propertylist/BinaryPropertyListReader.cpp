@@ -15,11 +15,13 @@ namespace {
 
 using namespace propertylist;
 
-/// Delivers the list under the top object while it is being checked. Cycles end at the depth limit, shared objects at
-/// the budget.
+/// Delivers the list under the top object while it is being checked. Cycles end at the depth limit, shared
+/// objects at the budget.
 class Reader {
   public:
-    Reader(Bytes bytes, ValueSink& sink) : bytes_(bytes), sink_(sink) { scratch_.reserve(kScratchCharacters); }
+    Reader(Bytes bytes, ValueSink& sink) : bytes_(bytes), sink_(sink) {
+        scratch_.reserve(kScratchCharacters);
+    }
 
     bool read() { return open() && visit(top_, 0); }
 

@@ -70,9 +70,10 @@ bool readDate(std::string_view text, ValueSink& sink) {
     if (!std::ranges::equal(text, kPattern, fits)) return false;
     const auto field = [text](size_t at, size_t size) { return *wholeNumber<int>(text.substr(at, size)); };
     // Leap seconds have no place in this form.
-    const auto seconds = field(17, 2) < 60 ? secondsOf({field(0, 4), field(5, 2), field(8, 2), field(11, 2),
-                                                        field(14, 2), field(17, 2)})
-                                           : std::nullopt;
+    const auto seconds =
+        field(17, 2) < 60
+            ? secondsOf({field(0, 4), field(5, 2), field(8, 2), field(11, 2), field(14, 2), field(17, 2)})
+            : std::nullopt;
     if (seconds) sink.date(*seconds);
     return seconds.has_value();
 }
@@ -105,8 +106,8 @@ Element elementNamed(std::string_view name) {
     return found != std::end(kNames) ? found->second : Element::None;
 }
 
-/// Makes values out of the elements and texts of a document. The reading ends when the document has shown itself to be
-/// no list.
+/// Makes values out of the elements and texts of a document. The reading ends when the document has shown
+/// itself to be no list.
 class ListReader : public XMLEvents {
   public:
     ListReader(Bytes document, ValueSink& sink) : document_(document), sink_(sink) {
