@@ -13,11 +13,11 @@
 #include "Logging/Describe.h"
 #include "Platform/runtime/Transactions.h"
 #include "Platform/storage/Preferences.h"
+#include "Protocol/RecordKeys.h"
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/SimulatedClock.h"
 #include "TestSupport/TemporaryStateDirectory.h"
 #include "Values/ValueStream.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {

@@ -5,7 +5,7 @@
 
 namespace veltoidctl {
 
-veltoid::Data dataIn(const Json& dictionary, const char* key) {
+veltoid::Data dataIn(const Json& dictionary, std::string_view key) {
     const auto found = dictionary.find(key);
     if (found == dictionary.end() || !found->is_string()) return {};
     return veltoid::xmlrpcBase64Decode(found->get_ref<const std::string&>());

@@ -6,12 +6,12 @@
 
 #include "Platform/encoding/ValueSink.h"
 #include "Values/Value.h"
-#include "veltoidctl/AgentConnection.h"
+#include "veltoidctl/Json.h"
 
 namespace veltoidctl {
 
 /// The bytes behind a key of a reply; null without them.
-veltoid::Data dataIn(const Json& dictionary, const char* key);
+veltoid::Data dataIn(const Json& dictionary, std::string_view key);
 
 /// Dates become ISO 8601 text at UTC, data and UUIDs base64 text; file descriptors null.
 class JsonBuilder : public platform::ValueSink {

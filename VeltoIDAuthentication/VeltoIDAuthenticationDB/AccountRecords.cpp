@@ -2,10 +2,10 @@
 
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
 #include "Values/LowerCase.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 

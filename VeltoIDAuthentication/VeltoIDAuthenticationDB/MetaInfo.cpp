@@ -1,6 +1,6 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {

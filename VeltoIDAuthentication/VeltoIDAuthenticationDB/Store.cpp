@@ -5,10 +5,10 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
 #include "Values/ValueStream.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace database {

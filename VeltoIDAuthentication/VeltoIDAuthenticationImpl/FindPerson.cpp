@@ -1,7 +1,7 @@
 #include "VeltoIDAuthenticationImpl/FindPerson.h"
 
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"

@@ -4,9 +4,9 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 

@@ -5,7 +5,7 @@
 #include <cstring>
 
 #include "Platform/crypto/Crypto.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
 namespace veltoid {

@@ -11,10 +11,10 @@
 #include "Platform/bus/EventLoop.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/SystemVersion.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "XMLRPC/XMLRPCShim.h"
 

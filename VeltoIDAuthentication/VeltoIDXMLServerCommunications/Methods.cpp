@@ -2,13 +2,13 @@
 
 #include <span>
 
+#include "Protocol/RecordKeys.h"
 #include "Values/Base64.h"
 #include "Values/DateText.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 
