@@ -3,7 +3,7 @@
 #include <iostream>
 
 #include "Platform/keychain/Keychain.h"
-#include "Platform/keychain/LockState.h"
+#include "Protocol/Names.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Printing.h"
@@ -41,7 +41,7 @@ int presentOutcome(platform::KeychainStatus status, const Arguments& arguments, 
 
 /// A running agent may wait for this, and one that is not running has work now.
 void tellAgent(AgentConnection& agent) {
-    agent.post(platform::kUnlockedNotification);
+    agent.post(veltoid::kVeltoIDUnlockedNotification);
     send(agent, {.command = kPingCommand});
 }
 
