@@ -31,7 +31,7 @@ function(veltoid_test_program name)
   cmake_parse_arguments(ARG "" "" "SOURCES;DEPENDS" ${ARGN})
   add_executable(${name} ${ARG_SOURCES})
   target_include_directories(${name} PRIVATE ${PROJECT_SOURCE_DIR} ${PROJECT_SOURCE_DIR}/VeltoIDAuthentication)
-  target_link_libraries(${name} PRIVATE ${ARG_DEPENDS} GTest::gtest GTest::gtest_main)
+  target_link_libraries(${name} PRIVATE ${ARG_DEPENDS} TestMain)
   # GoogleTest's macros trip these two in perfectly good tests.
   target_compile_options(${name} PRIVATE -Wno-undef -Wno-shadow)
   veltoid_precompile(${name} precompiled_test)

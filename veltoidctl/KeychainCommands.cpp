@@ -3,9 +3,9 @@
 #include <iostream>
 
 #include "Platform/keychain/Keychain.h"
-#include "Platform/keychain/LockState.h"
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
+#include "Protocol/Names.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Printing.h"
@@ -43,7 +43,7 @@ int presentOutcome(platform::KeychainStatus status, const Arguments& arguments, 
 
 /// A running agent may wait for this, and one that is not running has work now.
 void tellAgent(AgentConnection& agent) {
-    agent.post(platform::kUnlockedNotification);
+    agent.post(veltoid::kVeltoIDUnlockedNotification);
     send(agent, {.command = veltoid::command::kPing});
 }
 

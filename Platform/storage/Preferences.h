@@ -1,5 +1,5 @@
 // Preference domains: named sets of keys with one value each, for this user on this machine, kept in one
-// SQLite file ($XDG_STATE_HOME/harbwell/<machine-id>/preferences.db; default ~/.local/state). Opened on first
+// SQLite file (preferences.db of the state directory). Opened on first
 // use.
 //
 // A file that cannot be read as a database is moved aside (never deleted) and logged; one written by a newer

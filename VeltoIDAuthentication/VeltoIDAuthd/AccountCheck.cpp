@@ -8,8 +8,9 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Platform/keychain/LockState.h"
-#include "Platform/net/OptionalLibrary.h"
+#include "Platform/net/HTTPSession.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/AccountActions.h"
@@ -32,18 +33,21 @@ double now() { return platform::Clock::shared().now(); }
 
 double relaunchInterval() { return metaSeconds("DefaultRelaunchInterval", kDefaultRelaunchInterval); }
 
-/// Signals that come while nobody waits are kept.
-const platform::Semaphore& checkSemaphore() {
-    static const auto* semaphore = new platform::Semaphore;
-    return *semaphore;
-}
+struct CheckState {
+    /// Signals that come while the loop does not wait are kept.
+    const platform::Semaphore semaphore;
+    const platform::WorkQueue queue{"accountCheckDispatch"};
+    std::atomic<bool> isStarted{false};
+    std::function<void()> onPass;
 
-std::atomic<bool> isStarted{false};
+    void lifetimeEnds() { semaphore.signal(); }
+};
 
-std::function<void()>& passObserver() {
-    static auto* observer = new std::function<void()>;
-    return *observer;
-}
+CheckState& state() { return platform::Lifetime::current().state<CheckState>(); }
+
+const platform::Semaphore& checkSemaphore() { return state().semaphore; }
+
+bool isEnding() { return platform::Lifetime::current().isEnding(); }
 
 /// Accounts that a pass left as due as it found them.
 class Deferrals {
@@ -89,8 +93,8 @@ struct Plan {
 /// The loop's state belongs to its queue.
 class AccountCheckLoop {
   public:
-    [[noreturn]] void run() {
-        while (true) {
+    void run() {
+        while (!isEnding()) {
             waitForUnlock();
             pass();
         }
@@ -104,7 +108,7 @@ class AccountCheckLoop {
             wakeAccountCheck();
             lockState.onChange(nullptr);
         });
-        while (!lockState.hasBeenUnlockedSinceBoot()) {
+        while (!lockState.hasBeenUnlockedSinceBoot() && !isEnding()) {
             scheduleRelaunch(now() + kDay, true);
             (void)wait(kDay);
         }
@@ -122,7 +126,7 @@ class AccountCheckLoop {
     /// Waits until a pass is allowed again; what signals meanwhile is looked at by that pass.
     void keepDistance() {
         const platform::Semaphore nobodySignals;
-        while (lastPass_) {
+        while (lastPass_ && !isEnding()) {
             const double missing = *lastPass_ + kVeltoIDLeastTimeBetweenPasses - now();
             // A clock that was set back is no reason to wait for longer.
             if (missing <= 0 || missing > kVeltoIDLeastTimeBetweenPasses) break;
@@ -153,7 +157,7 @@ class AccountCheckLoop {
         const Plan next = plan();
         if (!sleepUntilTimeFor(next)) return;
         keepDistance();
-        if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return giveBack(next);
+        if (isEnding() || !platform::LockState::shared().hasBeenUnlockedSinceBoot()) return giveBack(next);
         if (next.accounts.empty()) {
             __VeltoIDCleanupAccountsAndCertificates({});
         } else {
@@ -161,7 +165,7 @@ class AccountCheckLoop {
         }
     }
 
-    /// The plan is for later: the keychain was locked while the loop slept.
+    /// The plan is for later: the keychain was locked while the loop slept, or the agent ends.
     static void giveBack(const Plan& plan) {
         if (!plan.isForChanged) return;
         for (const Value& name : plan.accounts)
@@ -182,7 +186,7 @@ class AccountCheckLoop {
     }
 
     void check(const Array& accounts) {
-        if (passObserver()) passObserver()();
+        if (state().onPass) state().onPass();
         for (const Value& name : accounts) {
             const String accountName = name.asString();
             Dictionary record;
@@ -201,20 +205,16 @@ class AccountCheckLoop {
 
 }  // namespace
 
-void startAccountCheck(double firstDelaySeconds) {
-    static std::once_flag once;
-    std::call_once(once, [firstDelaySeconds] {
-        __VeltoIDDBSetChangeSemaphore(checkSemaphore());
-        isStarted = true;
-        static const auto* queue = new platform::WorkQueue("accountCheckDispatch");
-        queue->asyncAfter(firstDelaySeconds, [] { AccountCheckLoop().run(); });
-    });
+void startAccountCheck(double firstDelaySeconds, std::function<void()> onPass) {
+    CheckState& check = state();
+    if (check.isStarted.exchange(true)) return;
+    check.onPass = std::move(onPass);
+    __VeltoIDDBSetChangeSemaphore(check.semaphore);
+    check.queue.asyncAfter(firstDelaySeconds, [] { AccountCheckLoop().run(); });
 }
 
-void observeAccountCheck(std::function<void()> observer) { passObserver() = std::move(observer); }
-
 void wakeAccountCheck() {
-    if (isStarted) checkSemaphore().signal();
+    if (state().isStarted) checkSemaphore().signal();
 }
 
 }  // namespace veltoid

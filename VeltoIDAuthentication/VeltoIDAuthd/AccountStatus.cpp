@@ -16,9 +16,6 @@
 namespace veltoid {
 namespace {
 
-/// When the process was started (seconds since 1970).
-const double kLaunchTime = platform::Clock::shared().now();
-
 /// What the override says; none without one.
 std::optional<bool> userActionOverride() {
     const String text = __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaAccountRequiresUserActionKey,
@@ -86,7 +83,7 @@ Dictionary copyAccountStatusesDictionary(const Dictionary& options) {
     for (const std::string_view key :
          {kVeltoIDMetaLastSuccessfulConnectKey, kVeltoIDMetaLastConnectAttemptKey})
         status.set(key, __VeltoIDDBCopyMetaInfoValue(nullptr, options, key));
-    status.set("LaunchTime", Value::date(kLaunchTime));
+    status.set("LaunchTime", Value::date(launchDate()));
     if (const auto next = nextLaunchDate()) status.set("NextLaunchTime", Value::date(*next));
     status.set("pid", Value::int64(getpid()));
     for (const auto& [key, value] : copyDeviceStatusDictionary()) status.set(key, value);

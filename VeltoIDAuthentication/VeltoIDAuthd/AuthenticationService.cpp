@@ -6,6 +6,7 @@
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "Values/LowerCase.h"
@@ -97,7 +98,8 @@ bool waitForCertificate(const Request& request) {
     Dictionary options = request.options();
     options.set("CheckNetwork", Value::boolean(true));
     const auto& clock = platform::Clock::shared();
-    for (const double deadline = clock.now() + duration; clock.now() <= deadline;) {
+    const auto& lifetime = platform::Lifetime::current();
+    for (const double deadline = clock.now() + duration; clock.now() <= deadline && !lifetime.isEnding();) {
         wakeAccountCheck();
         switch (checkAccountAndDetermineNextAction(request.account(), options)) {
             case AccountState::NoEncodedDSID:

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
 #include "Values/ValueStream.h"
@@ -12,18 +13,30 @@
 
 namespace veltoid {
 namespace database {
+
+struct StoreState {
+    Store store;
+    const platform::WorkQueue queue{"VeltoIDDBQueue"};
+    std::atomic<bool> isLoaded{false};
+
+    /// What waits to be flushed is flushed now.
+    void lifetimeEnds() {
+        queue.async([this] {
+            if (store.pendingFlush_) store.synchronize();
+        });
+    }
+};
+
 namespace {
+
+StoreState& state() { return platform::Lifetime::current().state<StoreState>(); }
+Store& store() { return state().store; }
 
 // Agents up to these accessor versions left something behind that the load puts right.
 constexpr double kLastWithCertificatesInRecords = 478;
 constexpr double kLastWithVersionsInMetaInfo = 481;
 constexpr double kLastWithoutUserUUID = 508;
 constexpr double kLastWithCertificateLists = 617;
-
-Store& store() {
-    static auto* shared = new Store;
-    return *shared;
-}
 
 using ReadResult = platform::Preferences::ReadResult;
 
@@ -110,20 +123,17 @@ bool descendingNumbers(const Value& a, const Value& b) {
 
 }  // namespace
 
-platform::WorkQueue queue() {
-    static const auto* shared = new platform::WorkQueue("VeltoIDDBQueue");
-    return *shared;
-}
+platform::WorkQueue queue() { return state().queue; }
 
 Store& loadedStore() {
-    static std::atomic<bool> loaded{false};
-    if (!loaded.load(std::memory_order_acquire)) {
-        queue().sync([] {
-            if (!loaded.load(std::memory_order_relaxed))
-                loaded.store(store().load(), std::memory_order_release);
+    StoreState& current = state();
+    if (!current.isLoaded.load(std::memory_order_acquire)) {
+        current.queue.sync([&] {
+            if (!current.isLoaded.load(std::memory_order_relaxed))
+                current.isLoaded.store(current.store.load(), std::memory_order_release);
         });
     }
-    return store();
+    return current.store;
 }
 
 const Dictionary* Store::find(const Dictionary& section, const String& key) {

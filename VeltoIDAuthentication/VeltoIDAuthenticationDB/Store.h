@@ -72,6 +72,7 @@ class Store {
     friend bool veltoid::__VeltoIDDBSynchronize();
     friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
     friend Store& loadedStore();
+    friend struct StoreState;
 
     platform::Preferences preferences() const;
     bool load();

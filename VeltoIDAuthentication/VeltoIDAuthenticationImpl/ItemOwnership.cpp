@@ -3,6 +3,7 @@
 #include <algorithm>
 
 #include "Certificates/CertificateRequest.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
@@ -18,9 +19,12 @@ constexpr std::string_view kPrivateKeyKey = kVeltoIDCertificatePrivateKeyPersist
 constexpr std::string_view kIntermediateKey = kVeltoIDCertificateIntermediateCertificateReferenceKey;
 
 /// A semaphore, so that time stands still neither for the one who waits nor for the one who is waited for.
+struct Ownership {
+    const platform::Semaphore semaphore{1};
+};
+
 const platform::Semaphore& ownershipSemaphore() {
-    static const auto* semaphore = new platform::Semaphore(1);
-    return *semaphore;
+    return platform::Lifetime::current().state<Ownership>().semaphore;
 }
 
 /// The reference under the key, if the other dictionary has another one or none.

@@ -124,14 +124,8 @@ class CommandsTest : public SessionTest {
   protected:
     void SetUp() override {
         SessionTest::SetUp();
-        setRelaunchScheduler([this](std::optional<double> date, bool force) {
-            EXPECT_TRUE(force);
-            relaunches_.push_back(date.value_or(-1) - now());
-        });
-    }
-    void TearDown() override {
-        setRelaunchScheduler([](std::optional<double>, bool) {});
-        SessionTest::TearDown();
+        setProcessHooks({.scheduleRelaunch = [this](double date) { relaunches_.push_back(date - now()); },
+                         .endProcess = [] { _exit(EXIT_SUCCESS); }});
     }
 
     /// The session after a call that got this reply.
