@@ -8,7 +8,6 @@
 #include "Platform/runtime/EventLoop.h"
 #include "Platform/runtime/InstanceLock.h"
 #include "Platform/runtime/WorkQueue.h"
-#include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/Listeners.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthd/Shutdown.h"
@@ -50,14 +49,15 @@ void prepareDatabase(const CommandLine& line) {
         __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
 }
 
-void startServices(const CommandLine& line, const LinkedIdentityHandler& linkedIdentity) {
+void startServices(const Agent::Configuration& configuration) {
+    const CommandLine& line = configuration.line;
     if (line.runsAuthentication()) {
         scheduleRelaunch(platform::Clock::shared().now() + kRelaunchAfterStart, true);
-        startAccountCheck(kVeltoIDFirstAccountCheckDelay);
+        startAccountCheck(configuration.firstCheckDelay);
         registerAuthenticationListener(
             line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
     }
-    if (line.checkPassword) registerPasswordCheckListener(linkedIdentity);
+    if (line.checkPassword) registerPasswordCheckListener(configuration.linkedIdentity);
 }
 
 /// Every account is validated, at once unless the account check is about to start anyway, and whoever knows
@@ -85,7 +85,7 @@ Agent::Agent(const Configuration& configuration)
     setProcessHooks({[](double date) { scheduleRelaunch(date, true); }, endAfterPendingWork});
     flushOnInterrupt();
     prepareShutdown();
-    startServices(line, configuration.linkedIdentity);
+    startServices(configuration);
     if (line.leaks) workForLeakChecker();
 }
 
