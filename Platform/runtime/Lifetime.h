@@ -1,16 +1,16 @@
-// Everything that lives as long as the agent hangs off one Lifetime, which the process creates and ends. There is one
-// at a time; tests and simulations have many, one after the other.
+// Everything that lives as long as the agent hangs off one Lifetime, which the process creates and ends.
+// There is one at a time; tests and simulations have many, one after the other.
 //
 // A room reaches its state through one function of its own,
 //
 //     RoomState& state() { return platform::Lifetime::current().state<RoomState>(); }
 //
-// which makes the state on first use. A state may have two more operations: `void lifetimeEnds()` wakes what waits for
-// something that will not come any more, and `void runDry()` is for the work queues alone.
+// which makes the state on first use. A state may have two more operations: `void lifetimeEnds()` wakes what
+// waits for something that will not come any more, and `void runDry()` is for the work queues alone.
 //
-// Ending: states hear lifetimeEnds; the work queues run what is queued until nothing is left, while delayed tasks are
-// dropped and timed waits end early; then states are destroyed. Both the calls and the destruction go in the reverse
-// order of creation, on the thread that ends the lifetime.
+// Ending: states hear lifetimeEnds; the work queues run what is queued until nothing is left, while delayed
+// tasks are dropped and timed waits end early; then states are destroyed. Both the calls and the destruction
+// go in the reverse order of creation, on the thread that ends the lifetime.
 #pragma once
 
 #include <algorithm>
@@ -107,9 +107,9 @@ class Lifetime {
     template <class T>
     static Entry entryFor(std::shared_ptr<T> object) {
         Entry entry{slotOf<T>(), std::move(object)};
-        if constexpr (requires(T& state) { state.lifetimeEnds(); })
+        if constexpr (requires(T & state) { state.lifetimeEnds(); })
             entry.lifetimeEnds = [](void* state) { static_cast<T*>(state)->lifetimeEnds(); };
-        if constexpr (requires(T& state) { state.runDry(); })
+        if constexpr (requires(T & state) { state.runDry(); })
             entry.runDry = [](void* state) { static_cast<T*>(state)->runDry(); };
         return entry;
     }

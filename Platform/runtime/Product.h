@@ -1,5 +1,5 @@
-// The names by which the product that runs on this platform is known to the system. The process defines them and gives
-// them to the lifetime (Lifetime.h).
+// The names by which the product that runs on this platform is known to the system. The process defines them
+// and gives them to the lifetime (Lifetime.h).
 #pragma once
 
 namespace platform {
