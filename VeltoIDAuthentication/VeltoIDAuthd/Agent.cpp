@@ -50,14 +50,15 @@ void prepareDatabase(const CommandLine& line) {
         __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
 }
 
-void startServices(const CommandLine& line, const LinkedIdentityHandler& linkedIdentity) {
+void startServices(const Agent::Configuration& configuration) {
+    const CommandLine& line = configuration.line;
     if (line.runsAuthentication()) {
         scheduleRelaunch(platform::Clock::shared().now() + kRelaunchAfterStart, true);
-        startAccountCheck(kVeltoIDFirstAccountCheckDelay);
+        startAccountCheck(configuration.firstCheckDelay);
         registerAuthenticationListener(
             line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
     }
-    if (line.checkPassword) registerPasswordCheckListener(linkedIdentity);
+    if (line.checkPassword) registerPasswordCheckListener(configuration.linkedIdentity);
 }
 
 /// Every account is validated, at once unless the account check is about to start anyway, and whoever knows
@@ -85,7 +86,7 @@ Agent::Agent(const Configuration& configuration)
     setProcessHooks({[](double date) { scheduleRelaunch(date, true); }, endAfterPendingWork});
     flushOnInterrupt();
     prepareShutdown();
-    startServices(line, configuration.linkedIdentity);
+    startServices(configuration);
     if (line.leaks) workForLeakChecker();
 }
 

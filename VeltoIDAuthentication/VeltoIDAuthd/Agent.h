@@ -6,6 +6,7 @@
 #include "Platform/keychain/LockState.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Protocol/Product.h"
+#include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/AgentCommandLine.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 
@@ -20,6 +21,8 @@ class Agent {
         /// What stands in for the platform's own parts.
         platform::Lifetime::Parts parts = {};
         LinkedIdentityHandler linkedIdentity = {};
+        /// Seconds until the first account check.
+        double firstCheckDelay = kVeltoIDFirstAccountCheckDelay;
     };
 
     /// Opens the database and starts the services; nothing is served before `run`. Waits for an earlier agent

@@ -230,7 +230,7 @@ void FindPersonCache::dropEnded() {
 void FindPersonCache::planWrite() {
     if (pendingWrite_) return;
     pendingWrite_ = std::make_unique<Transaction>("VeltoIDFindPersonCache");
-    writeQueue_.asyncAfter(kVeltoIDDBFlushDelay, [this] { write(); });
+    writeQueue_.asyncAfter(database::flushDelay(), [this] { write(); });
 }
 
 /// The entries are shared, so that the lock is held for no longer than it takes to count them.

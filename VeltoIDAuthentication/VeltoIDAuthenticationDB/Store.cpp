@@ -125,6 +125,8 @@ bool descendingNumbers(const Value& a, const Value& b) {
 
 platform::WorkQueue queue() { return state().queue; }
 
+double flushDelay() { return platform::Lifetime::current().isEnding() ? 0 : kVeltoIDDBFlushDelay; }
+
 Store& loadedStore() {
     StoreState& current = state();
     if (!current.isLoaded.load(std::memory_order_acquire)) {
@@ -245,7 +247,7 @@ bool Store::writeSections(std::initializer_list<Dictionary Store::*> sections) {
 void Store::planFlush() {
     if (pendingFlush_) return;
     pendingFlush_ = std::make_unique<Transaction>("VeltoIDDBFlush");
-    queue().asyncAfter(kVeltoIDDBFlushDelay, [this] { synchronize(); });
+    queue().asyncAfter(flushDelay(), [this] { synchronize(); });
 }
 
 /// A flush that fails is logged by the preference store; the data survives the process all the same.

@@ -92,6 +92,9 @@ class Store {
 
 platform::WorkQueue queue();
 
+/// How long what has changed waits for more to be written with it; not at all when the lifetime ends.
+double flushDelay();
+
 /// The store, loaded. The first caller loads it before its body is queued; others wait for that. While the
 /// preference store cannot be read, the sections are empty and nothing is written, and each call tries to
 /// load again.
