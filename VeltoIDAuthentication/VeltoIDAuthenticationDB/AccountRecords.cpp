@@ -2,8 +2,7 @@
 
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
-#include "Values/Digest.h"
-#include "Values/LowerCase.h"
+#include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
@@ -283,26 +282,4 @@ bool __VeltoIDDBHasCertificateToken(const String& name) {
     return __VeltoIDDBCopyAccountValue(name, kVeltoIDAccountCertificateTokenKey).isString();
 }
 
-namespace database {
-
-bool deriveAccountUUIDs(const String& name, Dictionary& record, const Dictionary& metaInfo) {
-    bool changed = false;
-    if (!record.string(kVeltoIDAccountUUIDKey)) {
-        record.set(kVeltoIDAccountUUIDKey, randomUUIDText());
-        record.remove(kVeltoIDAccountStableUUIDKey);
-        changed = true;
-    }
-    const String userUUID = metaInfo.string(kVeltoIDMetaUserUUIDKey);
-    if (userUUID && !record.string(kVeltoIDAccountStableUUIDKey)) {
-        const Data digest = sha256OfString(lowerCased(name).text() + userUUID.text());
-        platform::UUIDBytes folded{};
-        for (size_t i = 0; i < folded.size(); ++i)
-            folded[i] = static_cast<uint8_t>(digest.bytes()[2 * i] ^ digest.bytes()[2 * i + 1]);
-        record.set(kVeltoIDAccountStableUUIDKey, platform::canonicalUUIDText(folded));
-        changed = true;
-    }
-    return changed;
-}
-
-}  // namespace database
 }  // namespace veltoid

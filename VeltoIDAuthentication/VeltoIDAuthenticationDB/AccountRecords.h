@@ -60,8 +60,8 @@ bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, Dictionary* 
 /// certificate entries too with `includeCertificates`), in memory until the section is next written.
 std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates);
 
-/// Adds "AccountUUID" (random, once) and "AccountStableUUID" (from the name in lower case and the device's
-/// "UserUUID", once that exists) to the record where missing. True when it added one.
+/// Adds the account's identifiers to the record where they are missing (AccountUUIDs.h). True when it added
+/// one.
 bool __VeltoIDDBDeriveAccountUUIDs(const String& name, Dictionary& record);
 
 /// Whether the account's encDsId has a valid certificate entry.
@@ -69,11 +69,4 @@ bool __VeltoIDDBHasValidCertificate(const String& name);
 
 /// Whether a certificate request of the account is pending.
 bool __VeltoIDDBHasCertificateToken(const String& name);
-
-namespace database {
-
-/// The body of __VeltoIDDBDeriveAccountUUIDs, for callers that are on the queue or loading.
-bool deriveAccountUUIDs(const String& name, Dictionary& record, const Dictionary& metaInfo);
-
-}  // namespace database
 }  // namespace veltoid

@@ -72,6 +72,11 @@ inline constexpr std::string_view kVeltoIDAccountStableUUIDKey = "AccountStableU
 inline constexpr std::string_view kVeltoIDAccountServerURLKey = "ServerURL";
 inline constexpr std::string_view kVeltoIDDirtyKey = "Dirty";
 
+// What earlier agents kept in account records.
+inline constexpr std::string_view kVeltoIDAccountOldCertificateKey = "Certificate";
+inline constexpr std::string_view kVeltoIDAccountOldCertificatesKey = "Certificates";
+inline constexpr std::string_view kVeltoIDAccountOldPrivateKeyKey = "PrivateKey";
+
 // Certificate entries.
 inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentReferenceKey =
     "CertificateReference";

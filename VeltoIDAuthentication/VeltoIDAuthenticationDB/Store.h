@@ -76,8 +76,6 @@ class Store {
     platform::Preferences preferences() const;
     bool load();
     bool writeSections(std::initializer_list<Dictionary Store::*> sections);
-    bool migrate(const platform::Preferences& domain, Array& versions);
-    bool addUserUUID();
     bool recordAccessor(const platform::Preferences& domain, Array versions);
     void planFlush();
     void synchronize();

@@ -176,7 +176,7 @@ class SigningRequest {
 /// When the next fetch is allowed, if that is later than now and can be believed.
 std::optional<double> laterFetchDate(const Dictionary& record) {
     const auto date = record.date(kVeltoIDAccountCertificateNextCertificateFetchDateKey);
-    if (!date || *date <= now() || *date > now() + kVeltoIDLongestFetchDelay) return std::nullopt;
+    if (!date || *date <= now() || *date > now() + kMaxFetchDelay) return std::nullopt;
     return date;
 }
 

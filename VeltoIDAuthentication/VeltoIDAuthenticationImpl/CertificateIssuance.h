@@ -26,8 +26,6 @@ inline constexpr double kVeltoIDCertificateTokenLifetime = 1'209'600;
 inline constexpr double kVeltoIDCSRGenerationInterval = 3'600;
 /// After a refusal, or a token that expired, until the next request.
 inline constexpr double kVeltoIDCSRRetryDelay = 3'600;
-/// Longer waits than this that a record asks for are not believed.
-inline constexpr double kVeltoIDLongestFetchDelay = 604'800;
 
 /// Longer tokens are refused: they would be stored and logged.
 inline constexpr size_t kVeltoIDMaxCertificateTokenBytes = size_t{16} << 10U;

@@ -207,9 +207,9 @@ class CertificateResult {
     }
 
     void putOffFetch() {
-        const double delta = storedFetchDelta(record_).value_or(kLongestPollingDelay);
+        const double delta = storedFetchDelta(record_).value_or(kMaxPollingDelay);
         setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
-                      Value::date(now() + (delta > 0 ? delta : kLongestPollingDelay))},
+                      Value::date(now() + (delta > 0 ? delta : kMaxPollingDelay))},
                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
                       Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}},
                     true);

@@ -6,7 +6,6 @@
 
 #include "Platform/crypto/Crypto.h"
 #include "VeltoIDAuthenticationDB/RecordKeys.h"
-#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
 namespace veltoid {
 namespace {
@@ -27,11 +26,11 @@ double randomPollingDelay() {
     platform::fillRandom(bytes);
     uint32_t number = 0;
     std::memcpy(&number, bytes, sizeof number);
-    return kLongestPollingDelay + kLongestPollingDelay * (number & kHighest) / kHighest;
+    return kMaxPollingDelay + kMaxPollingDelay * (number & kHighest) / kHighest;
 }
 
 double delayAfterPending(double delay) {
-    return delay < kLongestPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
+    return delay < kMaxPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
 }
 
 double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
@@ -43,13 +42,13 @@ std::optional<double> storedFetchDelta(const Dictionary& record) {
 double pendingDelay(const Value& delay, const Dictionary& record) {
     const auto given = finite(delay.asDouble());
     const double seconds = given ? *given : storedFetchDelta(record).value_or(kDefaultPendingDelay);
-    return std::min(seconds, kVeltoIDLongestFetchDelay);
+    return std::min(seconds, kMaxFetchDelay);
 }
 
 std::optional<double> tokenDelay(const Value& delay) {
     const auto seconds = delay.asDouble();
     if (!seconds) return std::nullopt;
-    return *seconds >= 0 && *seconds <= kLongestPollingDelay ? *seconds : kDelayForUnbelievableOnes;
+    return *seconds >= 0 && *seconds <= kMaxPollingDelay ? *seconds : kDelayForUnbelievableOnes;
 }
 
 }  // namespace veltoid

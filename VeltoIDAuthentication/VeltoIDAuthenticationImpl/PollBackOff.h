@@ -8,7 +8,10 @@
 namespace veltoid {
 
 /// Up to here waits grow by half each time; from here on they are spread at random over the second day.
-inline constexpr double kLongestPollingDelay = 86'400;
+inline constexpr double kMaxPollingDelay = 86'400;
+
+/// Longer waits than this, whether the server or a record asks for them, are not believed.
+inline constexpr double kMaxFetchDelay = 604'800;
 
 /// A random delay between one and two days, so that devices that fail together do not come back together.
 double randomPollingDelay();
