@@ -19,39 +19,6 @@ namespace {
 /// When the process was started (seconds since 1970).
 const double kLaunchTime = platform::Clock::shared().now();
 
-/// Null for a state that clients have no name for.
-String nameOf(AccountState state) {
-    switch (state) {
-        case AccountState::NoEncodedDSID:
-            return "NoEncodedDSID";
-        case AccountState::PasswordInaccessibleInKeychain:
-            return "PasswordInaccessibleInKeychain";
-        case AccountState::PasswordInvalid:
-            return "PasswordInvalid";
-        case AccountState::NoCertificate:
-            return "NoCertificate";
-        case AccountState::CertificateRevoked:
-            return "CertificateRevoked";
-        case AccountState::CertificateExpired:
-            return "CertificateExpired";
-        case AccountState::Unknown:
-            return "Unknown";
-        case AccountState::CertificateOK:
-            return "CertificateOK";
-        case AccountState::CertificateAssumedOK:
-            return "CertificateAssumedOK";
-        case AccountState::CertificateShouldBeRenewed:
-            return "CertificateShouldBeRenewed";
-        case AccountState::CertificateMustBeRenewed:
-            return "CertificateMustBeRenewed";
-        case AccountState::ValidationRecordNeedsToBeUpdated:
-            return "VeltoIDValidationRecordNeedsToBeUpdated";
-        case AccountState::CertificatePending:
-            return "CertificatePending";
-    }
-    return nullptr;
-}
-
 /// What the override says; none without one.
 std::optional<bool> userActionOverride() {
     const String text = __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaAccountRequiresUserActionKey,

@@ -4,10 +4,9 @@
 
 #include <string>
 
-namespace veltoid {
+#include "Protocol/Names.h"
 
-inline constexpr const char* kVeltoIDAuthenticationServiceName = "com.velto.harbwell.veltoid.authentication";
-inline constexpr const char* kVeltoIDPasswordCheckServiceName = "com.velto.harbwell.veltoid.checkpassword";
+namespace veltoid {
 
 /// Main queue, once each. The authentication service may be there a second time without a name.
 void registerAuthenticationListener(const std::string& serviceName);

@@ -3,6 +3,7 @@
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
+#include "Protocol/Names.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
@@ -10,7 +11,6 @@
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
-#include "VeltoIDAuthenticationImpl/NotificationNames.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {

@@ -3,32 +3,11 @@
 
 #include <optional>
 
+#include "Protocol/AccountState.h"
 #include "Values/Error.h"
 #include "Values/Value.h"
 
 namespace veltoid {
-
-/// State of an account; it tells what is to be done next.
-enum class AccountState : int {
-    NoEncodedDSID = -6,
-    PasswordInaccessibleInKeychain = -5,
-    /// There is none, or the server refuses it.
-    PasswordInvalid = -4,
-    NoCertificate = -3,
-    CertificateRevoked = -2,
-    CertificateExpired = -1,
-    /// No decision.
-    Unknown = 0,
-    /// Evaluated now.
-    CertificateOK = 1,
-    /// Not evaluated now, but not long ago.
-    CertificateAssumedOK = 2,
-    CertificateShouldBeRenewed = 3,
-    CertificateMustBeRenewed = 4,
-    ValidationRecordNeedsToBeUpdated = 5,
-    /// A request for one is pending.
-    CertificatePending = 10,
-};
 
 /// Servers of this version and later give out validation records.
 inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
