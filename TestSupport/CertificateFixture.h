@@ -28,13 +28,10 @@ class CertificateTest : public ServerTest {
         server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}});
         server_.answer("downloadCertComplete", Dictionary{{"done", "yes"}});
         trust(root_);
-        setRelaunchScheduler([this](std::optional<double> date, bool force) {
-            EXPECT_TRUE(force);
-            relaunches_.push_back(*date - now());
-        });
+        setRelaunchScheduler([this](double date) { relaunches_.push_back(date - now()); });
     }
     void TearDown() override {
-        setRelaunchScheduler([](std::optional<double>, bool) {});
+        setRelaunchScheduler([](double) {});
         ServerTest::TearDown();
     }
 
@@ -80,9 +77,9 @@ class CertificateTest : public ServerTest {
         error_.reset();
         return __VeltoIDDoCreateCertificateRequestForVeltoID(kName, options, nullptr, &error_);
     }
-    bool fetch(bool force = false) {
+    bool fetch(FetchTime time = FetchTime::WhenDue) {
         error_.reset();
-        return __VeltoIDDoFetchCertificateForVeltoID(kName, force, {}, &error_);
+        return __VeltoIDDoFetchCertificateForVeltoID(kName, time, {}, &error_);
     }
     bool update(const std::optional<Dictionary>& result, const Value& delay = {}) {
         error_.reset();

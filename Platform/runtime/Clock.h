@@ -41,4 +41,7 @@ class Clock {
     virtual void workEnded() {}
 };
 
+/// The absolute time of the process's clock.
+inline double now() { return Clock::shared().now(); }
+
 }  // namespace platform

@@ -1,5 +1,5 @@
-// The numbers of the requests that clients send, under "command". Tests in other languages read them from here, one
-// constant a line.
+// The numbers of the requests that clients send, under "command". Tests in other languages read them from
+// here, one constant a line.
 #pragma once
 
 #include <cstdint>

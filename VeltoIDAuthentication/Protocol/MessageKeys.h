@@ -1,4 +1,5 @@
-// The keys of requests and replies. Replies also carry whole account records, whose keys are the database's own.
+// The keys of requests and replies. Replies also carry whole account records, whose keys are the database's
+// own.
 #pragma once
 
 #include <string_view>

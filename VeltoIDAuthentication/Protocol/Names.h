@@ -1,5 +1,5 @@
-// The names under which this system is known outside its process: on the message bus, to the service manager, in the
-// file system and in the kernel's keyring. Packaging/ spells those that its files need once more.
+// The names under which this system is known outside its process: on the message bus, to the service manager,
+// in the file system and in the kernel's keyring. Packaging/ spells those that its files need once more.
 #pragma once
 
 namespace veltoid {

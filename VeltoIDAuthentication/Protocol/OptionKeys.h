@@ -1,5 +1,5 @@
-// The keys of the options that requests carry. Meta information is looked up in the options first, so that every key of
-// it may stand there as well.
+// The keys of the options that requests carry. Meta information is looked up in the options first, so that
+// every key of it may stand there as well.
 #pragma once
 
 #include <string_view>
@@ -10,7 +10,8 @@ namespace veltoid::option {
 inline constexpr std::string_view kCheckNetwork = "CheckNetwork";
 inline constexpr std::string_view kDirty = "Dirty";
 inline constexpr std::string_view kDoNotCheckPassword = "DoNotCheckPassword";
-inline constexpr std::string_view kDoNotFetchInformation = "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord";
+inline constexpr std::string_view kDoNotFetchInformation =
+    "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord";
 inline constexpr std::string_view kDoNotCreateRequest = "DoNotCreateCSR";
 inline constexpr std::string_view kCreateRequestAsynchronously = "CreateCSRAsynchronously";
 inline constexpr std::string_view kForceCertificateCreation = "ForceCertificateCreation";

@@ -4,6 +4,7 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Platform/bus/MessageService.h"
+#include "Protocol/Commands.h"
 #include "VeltoIDAuthd/AuthenticationService.h"
 #include "VeltoIDAuthd/ClientRequest.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
@@ -20,7 +21,7 @@ using RequestHandler = void (*)(platform::IncomingMessage& message);
 
 /// A ping waits for nothing.
 bool isAnsweredAtOnce(platform::IncomingMessage& message) {
-    return message.peekInteger("command") == kVeltoIDPingCommand;
+    return message.peekInteger("command") == command::kPing;
 }
 
 void serve(PeerConnection& peer, RequestHandler handle) {

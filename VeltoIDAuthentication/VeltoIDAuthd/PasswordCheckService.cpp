@@ -1,6 +1,9 @@
 #include "VeltoIDAuthd/PasswordCheckService.h"
 
 #include "IPCHelpers/Transaction.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
 
@@ -18,19 +21,17 @@ LinkedIdentityHandler& linkedIdentityHandler() {
 }
 
 bool updateLinkedIdentity(const Request& request, ErrorOut error) {
-    const Data reference = request.value("identityReferenceData").asData();
+    const Data reference = request.value(message::kIdentityReference).asData();
     return reference && linkedIdentityHandler()(reference, error);
 }
 
 bool run(const Request& request, ErrorOut error) {
-    constexpr int64_t kVerifyPassword = 0x180;
-    constexpr int64_t kUpdateLinkedIdentity = 400;
     switch (request.command()) {
-        case kVeltoIDPingCommand:
+        case command::kPing:
             return true;
-        case kVerifyPassword:
+        case command::kVerify:
             return verifyRequestedPassword(request, error);
-        case kUpdateLinkedIdentity:
+        case command::kUpdateLinkedIdentity:
             return updateLinkedIdentity(request, error);
         default:
             return false;
@@ -48,10 +49,10 @@ void handlePasswordCheckIPCMessage(platform::IncomingMessage& message) {
 }
 
 bool verifyRequestedPassword(const Request& request, ErrorOut error) {
-    const String password = request.string("hashedpassword");
+    const String password = request.string(message::kHashedPassword);
     if (!request.account() || !password) return false;
     const Dictionary options =
-        copyDictionarySettingValue(request.options(), "DoNotSaveSessionInfo", Value::boolean(true));
+        copyDictionarySettingValue(request.options(), option::kDoNotSaveSessionInfo, Value::boolean(true));
     return __VeltoIDDoVerifyPassword(request.account(), password, options, error);
 }
 

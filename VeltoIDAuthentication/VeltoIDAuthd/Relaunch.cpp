@@ -9,15 +9,16 @@
 #include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "Values/Error.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/Store.h"
-#include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 
 namespace veltoid {
 namespace {
 
 constexpr double kNoParticularTime = 1e10;
-constexpr double kLongestInterval = std::numeric_limits<uint32_t>::max();
+constexpr double kMaxInterval = std::numeric_limits<uint32_t>::max();
 
 /// Changed on the main queue only; the lock is for the status, which reads it from a client's queue.
 struct NextLaunch {
@@ -31,26 +32,26 @@ struct NextLaunch {
 };
 
 /// Main queue.
-void handOver(double requested, bool force) {
-    const double now = platform::Clock::shared().now();
+void handOver(double requested, RelaunchDate rule) {
+    const double now = platform::now();
     const double target = requested > 0 ? requested : now + kNoParticularTime;
     NextLaunch& next = NextLaunch::shared();
     const std::lock_guard lock(next.mutex);
-    if (!force && next.date && target > *next.date) return;
+    if (rule == RelaunchDate::OnlyIfEarlier && next.date && target > *next.date) return;
     const double delta = target - now;
     next.date.reset();
     if (delta < 0) return;
     next.date = now + delta;
     platform::ServiceManager::shared().setStartInterval(
-        delta >= kLongestInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
+        delta >= kMaxInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
 }
 
 }  // namespace
 
-void scheduleRelaunch(std::optional<double> date, bool force) {
+void scheduleRelaunch(std::optional<double> date, RelaunchDate rule) {
     const auto keepAlive = std::make_shared<Transaction>("scheduleRelaunch");
-    platform::WorkQueue::main().async([keepAlive, requested = date.value_or(0), force] {
-        handOver(requested, force);
+    platform::WorkQueue::main().async([keepAlive, requested = date.value_or(0), rule] {
+        handOver(requested, rule);
         keepAlive->close();
     });
 }
@@ -66,14 +67,14 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
         needing.append(name);
         if (!earliest || *date < *earliest) earliest = date;
     }
-    if (earliestDate != nullptr) *earliestDate = earliest;
+    fill(earliestDate, earliest);
     return needing;
 }
 
 void computeRelaunchFromAccounts() {
     std::optional<double> earliest;
     const Array accounts = copyAccountsNeedingAction(&earliest);
-    if (!accounts.empty() && earliest) scheduleRelaunch(earliest, true);
+    if (!accounts.empty() && earliest) scheduleRelaunch(earliest);
     __VeltoIDDBSynchronize();
 }
 

@@ -69,7 +69,7 @@ void prepareDatabase(const CommandLine& line) {
 
 void startServices(const CommandLine& line) {
     if (line.runsAuthentication()) {
-        scheduleRelaunch(platform::Clock::shared().now() + kRelaunchAfterStart, true);
+        scheduleRelaunch(platform::now() + kRelaunchAfterStart);
         startAccountCheck(kVeltoIDFirstAccountCheckDelay);
         registerAuthenticationListener(
             line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
@@ -84,7 +84,7 @@ void workForLeakChecker() {
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names)
         __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true),
-                                   true);
+                                   Notify::Yes);
     startAccountCheck(0);
     registerAuthenticationListener({});
     (void)platform::Semaphore().wait(kLeaksPause);
@@ -105,7 +105,7 @@ int main(int argc, char** argv) {
     if (!line) exitWithUsage(argc, argv, error);
     if (line->usePreferences) platform::instance_lock::waitForPrevious();
     prepareDatabase(*line);
-    setRelaunchScheduler(scheduleRelaunch);
+    setRelaunchScheduler([](double date) { scheduleRelaunch(date); });
     flushOnInterrupt();
     prepareShutdown();
     startServices(*line);

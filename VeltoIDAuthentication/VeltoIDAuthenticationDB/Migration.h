@@ -12,8 +12,8 @@ struct MigrationOutcome {
     bool versionsCut = false;
 };
 
-/// Changes accounts and meta information as the accessor versions in `versions` require, latest first. An agent
-/// so old that its data was rewritten by all later ones cuts the list after itself.
+/// Changes accounts and meta information as the accessor versions in `versions` require, latest first. An
+/// agent so old that its data was rewritten by all later ones cuts the list after itself.
 MigrationOutcome migrate(Dictionary& accounts, Dictionary& metaInfo, Array& versions);
 
 }  // namespace veltoid::database

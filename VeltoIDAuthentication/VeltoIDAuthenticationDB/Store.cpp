@@ -71,7 +71,7 @@ bool keepOrInitialize(const platform::Preferences& domain) {
     if (isUsableVersion(version.value)) return true;
     const auto current = preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion));
     if (version.result == ReadResult::Damaged) return domain.set({current});
-    const Value now = Value::date(platform::Clock::shared().now());
+    const Value now = Value::date(platform::now());
     return domain.remove(domain.keys()) &&
            domain.set({current, preference(kVeltoIDDBCreationDateKey, now)}) && domain.synchronize();
 }
@@ -147,14 +147,20 @@ bool Store::recordAccessor(const platform::Preferences& domain, Array versions) 
     return true;
 }
 
-bool Store::replace(Dictionary Store::*section, Dictionary changed, bool signal) {
+bool Store::set(Dictionary Store::*section, const String& key, const Dictionary& entry, Notify notify) {
+    Dictionary changed = this->*section;
+    changed.set(key, entry);
+    return replace(section, std::move(changed), notify);
+}
+
+bool Store::replace(Dictionary Store::*section, Dictionary changed, Notify notify) {
     if (!isLoaded()) return false;
     std::swap(this->*section, changed);
     if (!writeSections({section})) {
         std::swap(this->*section, changed);
         return false;
     }
-    if (signal && changeSemaphore_) changeSemaphore_->signal();
+    if (notify == Notify::Yes && changeSemaphore_) changeSemaphore_->signal();
     return true;
 }
 
@@ -219,9 +225,9 @@ bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {
             for (const std::string& key : domain.keys())
                 all.set(String(key), database::readPreference(domain, key).value);
         } else {
-            all = {{"Accounts", store.accounts},
-                   {"Certificates", store.certificates},
-                   {"MetaInfo", store.metaInfo}};
+            all = {{kVeltoIDDBAccountsKey, store.accounts},
+                   {kVeltoIDDBUnstoredCertificatesKey, store.certificates},
+                   {kVeltoIDDBMetaInfoKey, store.metaInfo}};
         }
         return all;
     });

@@ -5,7 +5,6 @@
 #include <cstring>
 
 #include "Platform/crypto/Crypto.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace {
@@ -35,11 +34,11 @@ double delayAfterPending(double delay) {
 
 double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
 
-std::optional<double> storedFetchDelta(const Dictionary& record) {
-    return finite(record.number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey));
+std::optional<double> storedFetchDelta(const AccountRecord& record) {
+    return finite(record.nextCertificateFetchDelta());
 }
 
-double pendingDelay(const Value& delay, const Dictionary& record) {
+double pendingDelay(const Value& delay, const AccountRecord& record) {
     const auto given = finite(delay.asDouble());
     const double seconds = given ? *given : storedFetchDelta(record).value_or(kDefaultPendingDelay);
     return std::min(seconds, kMaxFetchDelay);

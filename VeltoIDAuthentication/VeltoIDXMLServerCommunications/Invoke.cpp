@@ -16,15 +16,16 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDXMLServerCommunications/WireKeys.h"
 #include "XMLRPC/XMLRPCShim.h"
 
 namespace veltoid {
 namespace {
 
-using RelaunchScheduler = std::function<void(std::optional<double>, bool)>;
+using RelaunchScheduler = std::function<void(double)>;
 
 RelaunchScheduler& relaunchScheduler() {
-    static auto* scheduler = new RelaunchScheduler([](std::optional<double>, bool) {});
+    static auto* scheduler = new RelaunchScheduler([](double) {});
     return *scheduler;
 }
 
@@ -56,9 +57,9 @@ void applyValidityDuration(VeltoIDAuthenticationSessionInfo& session, const Valu
 }
 
 void applyRelaunch(const Dictionary& reply) {
-    const int32_t interval = getInt32(&reply, "NextLaunchTimeInterval", 0);
+    const int32_t interval = getInt32(&reply, wire::kNextLaunchInterval, 0);
     if (interval < 1) return;
-    const double date = platform::Clock::shared().now() + interval;
+    const double date = platform::now() + interval;
     VELTOID_LOG_FROM("xmlInvoke", kNotice,
                      "Received 'NextLaunchTimeInterval' == " << interval
                                                              << " from server, so setting NextLaunchDate to "
@@ -67,7 +68,7 @@ void applyRelaunch(const Dictionary& reply) {
 }
 
 void applyFlushAndExit(const Dictionary& reply) {
-    if (!getBool(&reply, "FlushAndExit", false)) return;
+    if (!getBool(&reply, wire::kFlushAndExit, false)) return;
     VELTOID_LOG_FROM(
         "xmlInvoke", kNotice,
         "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
@@ -76,16 +77,16 @@ void applyFlushAndExit(const Dictionary& reply) {
 }
 
 void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& reply) {
-    applyValidityDuration(session, reply["dsSessionValidityDuration"]);
-    if (reply.contains("NewURL"))
+    applyValidityDuration(session, reply[wire::kSessionValidity]);
+    if (reply.contains(wire::kNewURL))
         VELTOID_LOG_FROM("xmlInvoke", kNotice,
                          "Ignoring a new server URL in a reply: credentials are not redirected by a reply.");
-    if (const Dictionary* metaInformation = reply.dictionary("MetaInformation"))
+    if (const Dictionary* metaInformation = reply.dictionary(wire::kMetaInformation))
         for (const auto& [key, value] : *metaInformation)
             __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
-    if (const Dictionary* accountInformation = reply.dictionary("AccountInformation"))
+    if (const Dictionary* accountInformation = reply.dictionary(wire::kAccountInformation))
         for (const auto& [key, value] : *accountInformation)
-            __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), false);
+            __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), Notify::No);
     applyRelaunch(reply);
     applyFlushAndExit(reply);
 }
@@ -94,25 +95,26 @@ void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& 
 
 void setRelaunchScheduler(RelaunchScheduler scheduler) { relaunchScheduler() = std::move(scheduler); }
 
-void requestRelaunch(double date) { relaunchScheduler()(date, /*force=*/true); }
+void requestRelaunch(double date) { relaunchScheduler()(date); }
 
 Dictionary createCallParameters(const String& accountName, const String& sessionID,
                                 const Dictionary& options) {
     Dictionary parameters;
-    parameters.set("dsSession", sessionID);
-    parameters.set("VeltoIDAuthProtocolVersion", Value::int64(kVeltoIDAuthProtocolVersion));
-    parameters.set("TamrixVersion", frameworkVersionText());
-    parameters.set("ClientTime", Value::date(platform::Clock::shared().now()));
+    parameters.set(wire::kSession, sessionID);
+    parameters.set(wire::kProtocolVersion, Value::int64(kVeltoIDAuthProtocolVersion));
+    parameters.set(wire::kFrameworkVersion, frameworkVersionText());
+    parameters.set(wire::kClientTime, Value::date(platform::now()));
     const platform::SystemVersion& system = platform::systemVersion();
-    if (system.productName) parameters.set("ProductName", *system.productName);
-    if (system.buildVersion) parameters.set("SystemVersion", *system.buildVersion);
+    if (system.productName) parameters.set(wire::kProductName, *system.productName);
+    if (system.buildVersion) parameters.set(wire::kSystemVersion, *system.buildVersion);
     if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerMetaInformationItemsKey)) {
         if (auto information = __VeltoIDDBCopyMetaInformation(accountName, options))
-            parameters.set("MetaInformation", *information);
+            parameters.set(wire::kMetaInformation, *information);
     }
     if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerAccountInformationItemsKey)) {
-        Dictionary record;
-        if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) parameters.set("AccountInformation", record);
+        AccountRecord record;
+        if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record))
+            parameters.set(wire::kAccountInformation, record.values());
     }
     return parameters;
 }

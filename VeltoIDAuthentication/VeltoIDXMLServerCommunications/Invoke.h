@@ -19,7 +19,7 @@ inline constexpr int64_t kVeltoIDAuthProtocolVersion = 101;
 
 /// Hands down what the process does when a reply asks for a relaunch at a date (seconds since 1970). Set
 /// once, at start.
-void setRelaunchScheduler(std::function<void(std::optional<double> date, bool force)> scheduler);
+void setRelaunchScheduler(std::function<void(double date)> scheduler);
 
 /// Asks the process to be running at the date (seconds since 1970). Any queue.
 void requestRelaunch(double date);
