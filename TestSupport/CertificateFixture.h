@@ -73,9 +73,9 @@ class CertificateTest : public ServerTest {
         error_.reset();
         return __VeltoIDDoCreateCertificateRequestForVeltoID(kName, options, nullptr, &error_);
     }
-    bool fetch(bool force = false) {
+    bool fetch(FetchTime time = FetchTime::WhenDue) {
         error_.reset();
-        return __VeltoIDDoFetchCertificateForVeltoID(kName, force, {}, &error_);
+        return __VeltoIDDoFetchCertificateForVeltoID(kName, time, {}, &error_);
     }
     bool update(const std::optional<Dictionary>& result, const Value& delay = {}) {
         error_.reset();

@@ -44,7 +44,7 @@ class EngineTest : public ServerTest {
     static void storeCertificateEntry(const char* encDsId) {
         const Data reference(std::vector<uint8_t>{1});
         __VeltoIDDBSetCertificateInfo(encDsId, Dictionary{{"CertificateReference", reference}});
-        __VeltoIDDBSetCertificateValue(encDsId, "CertificatePrivateKeyReference", reference, false);
+        __VeltoIDDBSetCertificateValue(encDsId, "CertificatePrivateKeyReference", reference, Notify::No);
     }
 
     /// What was posted since the last time: "added/removed", "changed".

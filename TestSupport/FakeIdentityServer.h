@@ -120,21 +120,21 @@ class ServerTest : public DatabaseTest {
         ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, kPassword, encDsId));
     }
     static Dictionary record() {
-        Dictionary record;
+        AccountRecord record;
         __VeltoIDDBCopyVeltoIDAccount(kName, &record);
-        return record;
+        return record.values();
     }
     static Dictionary certificateEntry(const String& encDsId = "d1") {
-        Dictionary entry;
+        CertificateEntry entry;
         __VeltoIDDBCopyCertificateInfo(encDsId, &entry);
-        return entry;
+        return entry.values();
     }
     static void setValue(const char* key, const Value& value) {
-        ASSERT_TRUE(__VeltoIDDBSetAccountValue(kName, key, value, false));
+        ASSERT_TRUE(__VeltoIDDBSetAccountValue(kName, key, value, Notify::No));
     }
     static void setValues(const Dictionary& values) {
         for (const auto& [key, value] : values)
-            ASSERT_TRUE(__VeltoIDDBSetAccountValue(kName, key, value, false));
+            ASSERT_TRUE(__VeltoIDDBSetAccountValue(kName, key, value, Notify::No));
     }
     static bool hasPassword() { return record().contains("HashedPasswordRef"); }
 

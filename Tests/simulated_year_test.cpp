@@ -7,7 +7,8 @@
 #include "TestSupport/SimulatedIdentityServer.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/Relaunch.h"
-#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/AddAccount.h"
+#include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
@@ -37,7 +38,7 @@ class SimulatedYear : public CertificateTest {
   protected:
     void SetUp() override {
         CertificateTest::SetUp();
-        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date, true); }});
+        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date); }});
         __VeltoIDDBRemoveVeltoIDAccount(kName);
     }
     void TearDown() override {
@@ -121,14 +122,16 @@ class SimulatedYear : public CertificateTest {
     }
 
     static std::string describeEntry(const std::string& name) {
-        Dictionary record;
-        Dictionary entry;
+        AccountRecord record;
+        CertificateEntry entry;
         __VeltoIDDBCopyVeltoIDAccount(name, &record);
-        __VeltoIDDBCopyCertificateInfo(record.string("encDsId"), &entry);
-        entry.remove("Certificate");
-        entry.remove("IntermediateCertificate");
-        record.remove("VeltoIDAccountValidationRecordData");
-        return describeValue(record) + describeValue(entry);
+        __VeltoIDDBCopyCertificateInfo(record.encDsId(), &entry);
+        Dictionary ofRecord = record.values();
+        Dictionary ofEntry = entry.values();
+        ofEntry.remove(kVeltoIDCertificateCertificateKey);
+        ofEntry.remove(kVeltoIDCertificateIntermediateCertificateKey);
+        ofRecord.remove(kVeltoIDAccountValidationRecordDataKey);
+        return describeValue(ofRecord) + describeValue(ofEntry);
     }
 
     static void expectSpacing(const std::vector<double>& requests) {

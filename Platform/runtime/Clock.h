@@ -48,4 +48,7 @@ class Clock {
     virtual void endTimers() = 0;
 };
 
+/// The absolute time of the process's clock.
+inline double now() { return Clock::shared().now(); }
+
 }  // namespace platform

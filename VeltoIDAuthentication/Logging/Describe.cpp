@@ -109,7 +109,7 @@ void appendData(std::string& text, std::span<const uint8_t> bytes) {
 }
 
 void appendDate(std::string& text, double date) {
-    const double distance = date - platform::Clock::shared().now();
+    const double distance = date - platform::now();
     std::ostringstream relative;
     if (distance >= -1 && distance <= 0) {
         relative << "now-ish ";

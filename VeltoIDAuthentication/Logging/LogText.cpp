@@ -82,7 +82,7 @@ std::string describeQueueForLog(const platform::WorkQueue* queue) {
 
 std::string describeDispatchTime(std::optional<double> time) {
     if (!time) return "forever";
-    const double left = *time - platform::Clock::shared().now();
+    const double left = *time - platform::now();
     if (left <= 0) return "now";
     std::ostringstream text;
     text << left << "s";

@@ -15,6 +15,8 @@ inline constexpr std::string_view kVeltoIDDBCreationDateKey = "CreationDate";
 inline constexpr std::string_view kVeltoIDDBAccountsKey = "Accounts";
 inline constexpr std::string_view kVeltoIDDBCertificatesKey = "AuthCertificates";
 inline constexpr std::string_view kVeltoIDDBMetaInfoKey = "MetaInfo";
+/// What the certificates are called where nothing is stored.
+inline constexpr std::string_view kVeltoIDDBUnstoredCertificatesKey = "Certificates";
 inline constexpr std::string_view kVeltoIDDBAccessorVersionsKey = "AccessorVersions";
 
 // Account records.
@@ -73,6 +75,11 @@ inline constexpr std::string_view kVeltoIDAccountStableUUIDKey = "AccountStableU
 inline constexpr std::string_view kVeltoIDAccountServerURLKey = "ServerURL";
 inline constexpr std::string_view kVeltoIDDirtyKey = "Dirty";
 
+// What earlier agents kept in account records.
+inline constexpr std::string_view kVeltoIDAccountOldCertificateKey = "Certificate";
+inline constexpr std::string_view kVeltoIDAccountOldCertificatesKey = "Certificates";
+inline constexpr std::string_view kVeltoIDAccountOldPrivateKeyKey = "PrivateKey";
+
 // Certificate entries.
 inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentReferenceKey =
     "CertificateReference";
@@ -86,8 +93,15 @@ inline constexpr std::string_view kVeltoIDCertificateExpirationDateKey = "Expire
 inline constexpr std::string_view kVeltoIDCertificateSerialNumberKey = "SerialNumber";
 inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey =
     "LastSuccessfulValidation";
-
 inline constexpr std::string_view kVeltoIDCertificateLastValidationAttemptDateKey = "LastValidationAttempt";
+inline constexpr std::string_view kVeltoIDCertificateCreationDateKey = "CreationDate";
+inline constexpr std::string_view kVeltoIDCertificateModificationDateKey = "ModificationDate";
+inline constexpr std::string_view kVeltoIDCertificateTypeKey = "CertType";
+inline constexpr std::string_view kVeltoIDCertificateDateKey = "Date";
+/// Certificates as PEM text: an answer of the server has the first two, an entry may have the last.
+inline constexpr std::string_view kVeltoIDCertificateCertificateKey = "Certificate";
+inline constexpr std::string_view kVeltoIDCertificateIntermediateCertificateKey = "IntermediateCertificate";
+inline constexpr std::string_view kVeltoIDCertificatePEMKey = "CertificatePEM";
 
 /// Statuses of certificates, and of requests for one.
 inline constexpr std::string_view kVeltoIDCertificateStatusPending = "SIGNIN_PENDING";
@@ -101,6 +115,18 @@ inline constexpr std::string_view kVeltoIDDBServerURLKey = "ServerURL";
 inline constexpr std::string_view kVeltoIDMetaPreExpirationIntervalKey = "PreExpirationInterval";
 inline constexpr std::string_view kVeltoIDMetaAccountPresumedValidIntervalKey =
     "AccountPresumedValidInterval";
+// Intervals, in seconds.
+inline constexpr std::string_view kVeltoIDMetaAccountValidationIntervalKey = "AccountValidationInterval";
+inline constexpr std::string_view kVeltoIDMetaCertificateValidationIntervalKey =
+    "CertificateValidationInterval";
+inline constexpr std::string_view kVeltoIDMetaCertificateRenewalIntervalKey = "CertificateRenewalInterval";
+inline constexpr std::string_view kVeltoIDMetaCertificateAssumedOKIntervalKey =
+    "CertificateValidationAssumedOKInterval";
+inline constexpr std::string_view kVeltoIDMetaRelaunchIntervalKey = "DefaultRelaunchInterval";
+inline constexpr std::string_view kVeltoIDMetaValidationRecordRetryIntervalKey =
+    "VeltoIDMetaInfoValidationRecordRenewalAttemptInterval";
+inline constexpr std::string_view kVeltoIDMetaCertificateLifetimeKey =
+    "VeltoIDMetaDefaultCertificateRequestedLifetime";
 inline constexpr std::string_view kVeltoIDMetaSendServerMetaInformationItemsKey =
     "VeltoIDMetaSendServerMetaInformationItems";
 inline constexpr std::string_view kVeltoIDMetaSendServerAccountInformationItemsKey =
@@ -130,18 +156,18 @@ inline constexpr std::string_view kVeltoIDGetMyInfoCountKey = "VeltoIDGetMyInfoC
 
 /// What may be reported to the server, when the server asks for it.
 inline constexpr std::array<std::string_view, 12> kVeltoIDReportableMetaInformation = {
-    "LastConnectAttempt",
-    "LastSuccessfulConnect",
-    "AccountPresumedValidInterval",
-    "AccountValidationInterval",
-    "CertificateValidationInterval",
-    "CertificateRenewalInterval",
-    "UserUUID",
-    "CertificateValidationAssumedOKInterval",
-    "DefaultRelaunchInterval",
-    "VeltoIDMetaInfoValidationRecordRenewalAttemptInterval",
-    "VeltoIDMetaSendServerMetaInformationItems",
-    "VeltoIDMetaSendServerAccountInformationItems",
+    kVeltoIDMetaLastConnectAttemptKey,
+    kVeltoIDMetaLastSuccessfulConnectKey,
+    kVeltoIDMetaAccountPresumedValidIntervalKey,
+    kVeltoIDMetaAccountValidationIntervalKey,
+    kVeltoIDMetaCertificateValidationIntervalKey,
+    kVeltoIDMetaCertificateRenewalIntervalKey,
+    kVeltoIDMetaUserUUIDKey,
+    kVeltoIDMetaCertificateAssumedOKIntervalKey,
+    kVeltoIDMetaRelaunchIntervalKey,
+    kVeltoIDMetaValidationRecordRetryIntervalKey,
+    kVeltoIDMetaSendServerMetaInformationItemsKey,
+    kVeltoIDMetaSendServerAccountInformationItemsKey,
 };
 
 }  // namespace veltoid

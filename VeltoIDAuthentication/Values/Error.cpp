@@ -7,7 +7,7 @@ constexpr std::string_view kDomainKey = "Domain";
 constexpr std::string_view kCodeKey = "Code";
 constexpr std::string_view kUserInfoKey = "UserInfo";
 
-/// An error inside an error inside an error: deeper chains are cut, whoever made them.
+/// Errors may have underlying errors, and those again; deeper chains are cut.
 constexpr int kMaxUnderlyingErrors = 16;
 
 Dictionary toDictionary(const Error& error, int depth) {
@@ -39,6 +39,10 @@ std::optional<Error> fromDictionary(const Value& value, int depth) {
 }
 
 }  // namespace
+
+Value::Value(veltoid::Error error) { *this = boxed(Kind::Error, std::move(error)); }
+
+const Error* Value::asError() const { return unboxed<veltoid::Error>(Kind::Error); }
 
 Error makeError(int64_t code, const ErrorTexts& texts, const Dictionary& userInfo, const char* function,
                 const char* file, int line) {

@@ -63,6 +63,9 @@ struct ErrorTexts {
     String recoverySuggestion;
 };
 
+/// An error of kIdentityErrorDomain with nothing but its code.
+inline Error identityError(int64_t code) { return {String(kIdentityErrorDomain), code, {}}; }
+
 /// An error of kIdentityErrorDomain whose user information is a copy of `userInfo` plus the given texts and
 /// "function", "file" ("-" when null) and "line". Any thread.
 Error makeError(int64_t code, const ErrorTexts& texts, const Dictionary& userInfo, const char* function,
@@ -75,10 +78,13 @@ Dictionary errorToDictionary(const Error& error);
 /// Dictionary is kept as it is.
 std::optional<Error> dictionaryToError(const Value& dictionary);
 
-/// Fills the out-parameter when there is one.
-inline void fillError(ErrorOut out, std::optional<Error> error) {
-    if (out != nullptr) *out = std::move(error);
+/// Fills an out-parameter when there is one.
+template <typename Output>
+void fill(Output* out, Output value) {
+    if (out != nullptr) *out = std::move(value);
 }
+
+inline void fillError(ErrorOut out, std::optional<Error> error) { fill(out, std::move(error)); }
 
 }  // namespace veltoid
 

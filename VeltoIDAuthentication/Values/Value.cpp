@@ -3,11 +3,8 @@
 #include <algorithm>
 #include <cmath>
 #include <limits>
-#include <new>
 
 #include "Platform/runtime/SecureMemory.h"
-#include "Values/Error.h"
-#include "Values/SecurityObject.h"
 
 namespace veltoid {
 namespace detail {
@@ -30,10 +27,6 @@ struct URLText {
     String text;
     String base;
     friend bool operator==(const URLText&, const URLText&) = default;
-};
-
-struct BoxNode : Counted {
-    std::variant<URLText, std::array<uint8_t, 16>, Error, SecurityObject> content;
 };
 
 template <>
@@ -103,19 +96,6 @@ Value::Value(Dictionary dictionary) : kind_(Kind::Dictionary) {
     new (&payload_.dictionary) veltoid::Dictionary(std::move(dictionary));
 }
 
-Value Value::boxed(Kind kind, detail::BoxNode* node) {
-    Value value;
-    new (&value.payload_.box) Box(node);
-    value.kind_ = kind;
-    return value;
-}
-
-Value::Value(Error error) {
-    auto* node = new detail::BoxNode;
-    node->content = std::move(error);
-    *this = boxed(Kind::Error, node);
-}
-
 Value Value::null() {
     Value value;
     value.kind_ = Kind::Null;
@@ -170,23 +150,13 @@ Value Value::date(double seconds) {
 
 Value Value::url(String text, String base) {
     if (!text) return {};
-    auto* node = new detail::BoxNode;
-    node->content = detail::URLText{std::move(text), std::move(base)};
-    return boxed(Kind::URL, node);
+    return boxed(Kind::URL, detail::URLText{std::move(text), std::move(base)});
 }
 
 Value Value::uuid(std::span<const uint8_t, 16> bytes) {
     std::array<uint8_t, 16> copy{};
     std::copy(bytes.begin(), bytes.end(), copy.begin());
-    auto* node = new detail::BoxNode;
-    node->content = copy;
-    return boxed(Kind::UUID, node);
-}
-
-Value Value::object(SecurityObject object) {
-    auto* node = new detail::BoxNode;
-    node->content = std::move(object);
-    return boxed(Kind::Object, node);
+    return boxed(Kind::UUID, copy);
 }
 
 Value::Value(const Value& other) noexcept : kind_(other.kind_), numberKind_(other.numberKind_) {
@@ -257,23 +227,14 @@ std::optional<double> Value::asDate() const {
     return payload_.real;
 }
 
-const Error* Value::asError() const {
-    return kind_ == Kind::Error ? std::get_if<veltoid::Error>(&payload_.box->content) : nullptr;
-}
-
-const SecurityObject* Value::asObject() const {
-    return kind_ == Kind::Object ? std::get_if<SecurityObject>(&payload_.box->content) : nullptr;
-}
-
 std::optional<std::pair<String, String>> Value::asURL() const {
-    if (kind_ != Kind::URL) return std::nullopt;
-    const auto& url = std::get<detail::URLText>(payload_.box->content);
-    return std::pair(url.text, url.base);
+    const auto* url = unboxed<detail::URLText>(Kind::URL);
+    return url != nullptr ? std::optional(std::pair(url->text, url->base)) : std::nullopt;
 }
 
 std::optional<std::array<uint8_t, 16>> Value::asUUID() const {
-    if (kind_ != Kind::UUID) return std::nullopt;
-    return std::get<std::array<uint8_t, 16>>(payload_.box->content);
+    const auto* uuid = unboxed<std::array<uint8_t, 16>>(Kind::UUID);
+    return uuid != nullptr ? std::optional(*uuid) : std::nullopt;
 }
 
 std::optional<NumberKind> Value::numberKind() const {
@@ -361,7 +322,7 @@ bool operator==(const Value& a, const Value& b) {
         case Value::Kind::Dictionary:
             return a.payload_.dictionary == b.payload_.dictionary;
         default:
-            return a.payload_.box->content == b.payload_.box->content;
+            return a.payload_.box->equals(*b.payload_.box.get());
     }
 }
 

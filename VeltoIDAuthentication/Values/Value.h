@@ -1,8 +1,8 @@
 // Values: what records, options, requests, replies and server parameters are made of.
 //
 // A Value is a small handle on something immutable: copying one, or a whole section of the database, costs a
-// reference. Array and Dictionary are handles too; changing one copies its entries once if somebody else
-// holds them. Texts and data are wiped when their last handle goes, since any of them may be a secret.
+// reference. Array and Dictionary are handles too; changing one copies its entries first if another handle
+// shares them. Texts and data are wiped when their last handle goes, since any of them may be a secret.
 //
 // A value of the wrong type counts as absent: typed getters return null, none or a default and never throw.
 // Handles of the same content may be used from different threads; one handle belongs to one thread at a time.
@@ -14,6 +14,7 @@
 #include <cstring>
 #include <initializer_list>
 #include <memory>
+#include <new>
 #include <optional>
 #include <span>
 #include <string>
@@ -44,7 +45,23 @@ struct BytesNode : Counted {
 
 struct ArrayNode;
 struct DictionaryNode;
-struct BoxNode;
+
+/// Content behind one pointer. Its unit alone knows the type: what is not part of this header defines how it
+/// becomes a value itself.
+struct BoxNode : Counted {
+    virtual ~BoxNode() = default;
+    /// `other` holds content of the same type.
+    virtual bool equals(const BoxNode& other) const = 0;
+};
+
+template <typename Content>
+struct Boxed final : BoxNode {
+    explicit Boxed(Content boxedContent) : content(std::move(boxedContent)) {}
+    bool equals(const BoxNode& other) const override {
+        return content == static_cast<const Boxed&>(other).content;
+    }
+    const Content content;
+};
 
 /// Frees a node whose last reference has gone.
 template <typename Node>
@@ -331,7 +348,19 @@ class Value {
         Box box;
     };
 
-    static Value boxed(Kind kind, detail::BoxNode* node);
+    template <typename Content>
+    static Value boxed(Kind kind, Content content) {
+        Value value;
+        new (&value.payload_.box) Box(new detail::Boxed<Content>(std::move(content)));
+        value.kind_ = kind;
+        return value;
+    }
+    /// The content of a value of this kind, else null.
+    template <typename Content>
+    const Content* unboxed(Kind kind) const {
+        return kind_ == kind ? &static_cast<const detail::Boxed<Content>*>(payload_.box.get())->content
+                             : nullptr;
+    }
 
     /// Every member is one word or a single counted pointer, so that the bytes can move without a count
     /// changing.

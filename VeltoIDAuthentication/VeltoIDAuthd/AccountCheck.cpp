@@ -13,12 +13,13 @@
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/RecordKeys.h"
-#include "VeltoIDAuthd/AccountActions.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDAuthenticationImpl/AccountActions.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
-#include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
 namespace {
@@ -29,9 +30,10 @@ constexpr double kDefaultRelaunchInterval = 1'209'600;
 constexpr double kFirstDeferral = 60;
 constexpr double kDeferralGrowth = 1.5;
 
-double now() { return platform::Clock::shared().now(); }
-
-double relaunchInterval() { return metaSeconds("DefaultRelaunchInterval", kDefaultRelaunchInterval); }
+double relaunchInterval() {
+    return metaInterval(nullptr, {}, kVeltoIDMetaRelaunchIntervalKey, kDefaultRelaunchInterval,
+                        UnreadableInterval::Zero);
+}
 
 struct CheckState {
     /// Signals that come while the loop does not wait are kept.
@@ -64,14 +66,14 @@ class Deferrals {
         const bool isForeseen = copyNextActionDateForAccount(accountName, &next) && next;
         const bool isChanged =
             __VeltoIDDBCopyAccountValue(accountName, kVeltoIDDirtyKey).asBoolean().value_or(false);
-        if (!isForeseen || isChanged || *next > now()) {
+        if (!isForeseen || isChanged || *next > platform::now()) {
             deferrals_.erase(accountName.text());
             return;
         }
         Deferral& deferral = deferrals_[accountName.text()];
         deferral.interval =
             deferral.interval > 0 ? std::min(deferral.interval * kDeferralGrowth, kDay) : kFirstDeferral;
-        deferral.until = now() + deferral.interval;
+        deferral.until = platform::now() + deferral.interval;
     }
 
   private:
@@ -86,7 +88,7 @@ class Deferrals {
 struct Plan {
     Array accounts;
     std::optional<double> date;
-    /// The accounts' marks are taken: nobody else will look at them.
+    /// The accounts' marks are taken: no other pass will find them.
     bool isForChanged = false;
 };
 
@@ -109,7 +111,7 @@ class AccountCheckLoop {
             lockState.onChange(nullptr);
         });
         while (!lockState.hasBeenUnlockedSinceBoot() && !isEnding()) {
-            scheduleRelaunch(now() + kDay, true);
+            scheduleRelaunch(platform::now() + kDay);
             (void)wait(kDay);
         }
         lockState.onChange(nullptr);
@@ -125,23 +127,23 @@ class AccountCheckLoop {
 
     /// Waits until a pass is allowed again; what signals meanwhile is looked at by that pass.
     void keepDistance() {
-        const platform::Semaphore nobodySignals;
+        const platform::Semaphore neverSignalled;
         while (lastPass_ && !isEnding()) {
-            const double missing = *lastPass_ + kVeltoIDLeastTimeBetweenPasses - now();
+            const double missing = *lastPass_ + kMinTimeBetweenPasses - platform::now();
             // A clock that was set back is no reason to wait for longer.
-            if (missing <= 0 || missing > kVeltoIDLeastTimeBetweenPasses) break;
+            if (missing <= 0 || missing > kMinTimeBetweenPasses) break;
             transaction_.close();
-            (void)nobodySignals.wait(missing);
+            (void)neverSignalled.wait(missing);
             transaction_.reopen();
         }
         while (checkSemaphore().wait(0)) {
         }
-        lastPass_ = now();
+        lastPass_ = platform::now();
     }
 
     Plan plan() const {
-        if (auto changed = __VeltoIDDBCopyDirtyVeltoIDs(true, true))
-            return {std::move(*changed), now(), true};
+        if (auto changed = __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll))
+            return {std::move(*changed), platform::now(), true};
         std::optional<double> ignored;
         Plan plan{copyAccountsNeedingAction(&ignored), {}, false};
         for (const Value& name : plan.accounts) {
@@ -169,30 +171,30 @@ class AccountCheckLoop {
     static void giveBack(const Plan& plan) {
         if (!plan.isForChanged) return;
         for (const Value& name : plan.accounts)
-            __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDDirtyKey, Value::boolean(true), false);
+            __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDDirtyKey, Value::boolean(true), Notify::No);
     }
 
     /// False when the sleep has ended before its time, by a change or by the clock: the plan may be another
     /// one now.
     bool sleepUntilTimeFor(const Plan& next) {
         if (next.accounts.empty() || !next.date || !platform::isHTTPSClientAvailable()) {
-            scheduleRelaunch(now() + relaunchInterval(), true);
+            scheduleRelaunch(platform::now() + relaunchInterval());
             return wait(platform::kForever);
         }
-        const double most = std::max(relaunchInterval(), kVeltoIDLeastTimeBetweenPasses);
-        scheduleRelaunch(*next.date, true);
-        (void)wait(std::clamp(*next.date - now(), kVeltoIDLeastTimeBetweenPasses, most));
-        return next.isForChanged || *next.date <= now();
+        const double most = std::max(relaunchInterval(), kMinTimeBetweenPasses);
+        scheduleRelaunch(*next.date);
+        (void)wait(std::clamp(*next.date - platform::now(), kMinTimeBetweenPasses, most));
+        return next.isForChanged || *next.date <= platform::now();
     }
 
     void check(const Array& accounts) {
         if (state().onPass) state().onPass();
         for (const Value& name : accounts) {
             const String accountName = name.asString();
-            Dictionary record;
-            if (!accountName || !__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) continue;
-            __VeltoIDDBSetAccountValue(accountName, kVeltoIDDirtyKey, Value::null(), false);
-            checkAccount(accountName, record);
+            AccountRecord record;
+            if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) continue;
+            __VeltoIDDBSetAccountValue(accountName, kVeltoIDDirtyKey, Value::null(), Notify::No);
+            checkAccount(record);
             deferrals_.note(accountName);
         }
     }

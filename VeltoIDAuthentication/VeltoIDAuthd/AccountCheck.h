@@ -5,7 +5,7 @@
 // the semaphore that notifying changes of the database signal. While it waits no transaction is open, so that
 // the agent may be ended meanwhile: it has handed the service manager the date at which it must be back.
 //
-// Two passes are never less than kVeltoIDLeastTimeBetweenPasses apart. An account that is still due after a
+// Two passes are never less than kMinTimeBetweenPasses apart. An account that is still due after a
 // pass that could do nothing for it is put off for longer and longer, unless it is changed: its dates alone
 // would keep the agent awake.
 #pragma once
@@ -15,7 +15,7 @@
 namespace veltoid {
 
 // Seconds.
-inline constexpr double kVeltoIDLeastTimeBetweenPasses = 5;
+inline constexpr double kMinTimeBetweenPasses = 5;
 inline constexpr double kVeltoIDFirstAccountCheckDelay = 10;
 
 /// Starts the loop, once; the first pass comes after `firstDelaySeconds` (at once when not positive). The

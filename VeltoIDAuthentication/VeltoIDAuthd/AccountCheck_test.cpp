@@ -4,8 +4,8 @@
 #include "TestSupport/CertificateFixture.h"
 #include "TestSupport/FakeLockState.h"
 #include "Values/Base64.h"
-#include "VeltoIDAuthd/AccountActions.h"
 #include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
@@ -21,7 +21,7 @@ class AccountCheckTest : public CertificateTest {
   protected:
     void SetUp() override {
         CertificateTest::SetUp();
-        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date, true); }});
+        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date); }});
     }
     void TearDown() override {
         // What the loop has taken of marks is on disk later.
@@ -42,7 +42,7 @@ class AccountCheckTest : public CertificateTest {
         clock_.advanceBy(seconds);
         return server_.takeMethods();
     }
-    void check() { checkAccount(kName, record()); }
+    void check() { checkAccount({kName, record()}); }
 };
 
 TEST_F(AccountCheckTest, WithoutAccountsItSleepsUntilThereIsOne) {
@@ -80,7 +80,7 @@ TEST_F(LockedDeviceTest, TheDeviceHasToBeUnlockedFirst) {
     EXPECT_FALSE(lock.isWatched());
 
     lock.lock();
-    __VeltoIDDBSetAccountValue(kName, "Dirty", flag(true), true);
+    __VeltoIDDBSetAccountValue(kName, "Dirty", flag(true), Notify::Yes);
     clock_.advanceBy(1.5 * kDay);
     EXPECT_TRUE(lock.isWatched());
     EXPECT_LE(relaunch(), 0.5 * kDay + 10);
@@ -96,7 +96,7 @@ TEST_F(AccountCheckTest, PassesKeepTheirDistance) {
     (void)methodsIn(6);
     for (int i = 0; i < 100; ++i) {
         setValues({{"LastConnectAttempt", Value::null()}});
-        __VeltoIDDBSetAccountValue(kName, "x", number(i), true);
+        __VeltoIDDBSetAccountValue(kName, "x", number(i), Notify::Yes);
         wakeAccountCheck();
         clock_.advanceBy(0.1);
     }
@@ -116,7 +116,7 @@ TEST_F(AccountCheckTest, AnAccountThatAPassCannotHelpIsPutOff) {
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
     issueAtOnce();
     setValue("CSRGenerationDate", Value::null());
-    __VeltoIDDBSetAccountValue(kName, "x", "y", true);
+    __VeltoIDDBSetAccountValue(kName, "x", "y", Notify::Yes);
     EXPECT_NE(methodsIn(11).find("createCert"), std::string::npos) << "a change counts at once";
 }
 
@@ -143,17 +143,17 @@ TEST_F(AccountCheckTest, EveryStateHasItsConsequence) {
 
     check();
     EXPECT_NE(server_.takeMethods().find("createCert"), std::string::npos) << "no certificate";
-    __VeltoIDDBSetCertificateValue("d1", "Dirty", flag(true), false);
+    __VeltoIDDBSetCertificateValue("d1", "Dirty", flag(true), Notify::No);
     check();
     EXPECT_EQ(certificateEntry()["LastSuccessfulValidation"], date());
     EXPECT_EQ(certificateEntry()["Dirty"], flag(false)) << "evaluated and good";
 
-    __VeltoIDDBSetCertificateValue("d1", "NextRenewalAttempt", date(-1), false);
+    __VeltoIDDBSetCertificateValue("d1", "NextRenewalAttempt", date(-1), Notify::No);
     const Value key = certificateEntry()["CertificatePrivateKeyReference"];
     check();
     EXPECT_NE(certificateEntry()["CertificatePrivateKeyReference"], key) << "renewed";
 
-    __VeltoIDDBSetCertificateValue("d1", "CertStatus", "CERTIFICATE_INVALID", false);
+    __VeltoIDDBSetCertificateValue("d1", "CertStatus", "CERTIFICATE_INVALID", Notify::No);
     server_.fault("createCert", -1);
     check();
     EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr)) << "revoked";
@@ -179,7 +179,7 @@ TEST_F(AccountCheckTest, EveryStateHasItsConsequence) {
 }
 
 TEST_F(AccountCheckTest, AValidationRecordIsTriedLessAndLessOften) {
-    const auto fetch = [this] { fetchValidationRecordForAccount(kName, record(), {}); };
+    const auto fetch = [this] { fetchValidationRecordForAccount({kName, record()}, {}); };
     server_.fault("getMyInfo", -1);
     double expected = 180;
     for (int i = 0; i < 20; ++i) {

@@ -5,11 +5,13 @@
 #include "Logging/Log.h"
 #include "Platform/keychain/LockState.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/MessageKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 
@@ -39,22 +41,23 @@ std::optional<bool> requiresUserAction(AccountState state) {
 
 Dictionary copyAccountStatus(const String& name, const Dictionary& options) {
     Dictionary status;
-    Dictionary record;
+    AccountRecord record;
     if (__VeltoIDDBCopyVeltoIDAccount(name, &record))
-        status.set(kVeltoIDAccountLastValidationDateKey, record[kVeltoIDAccountLastValidationDateKey]);
+        status.set(kVeltoIDAccountLastValidationDateKey,
+                   record.values()[kVeltoIDAccountLastValidationDateKey]);
     std::optional<double> nextAction;
     if (copyNextActionDateForAccount(name, &nextAction) && nextAction)
-        status.set("NextActionTime", Value::date(*nextAction));
+        status.set(message::kNextActionTime, Value::date(*nextAction));
 
     const AccountState state = checkAccountAndDetermineNextAction(name, options);
-    status.set("AccountState", nameOf(state));
+    status.set(message::kAccountState, nameOf(state));
     if (state == AccountState::CertificatePending)
-        if (const auto nextFetch = record.date("NextCertificateFetchDate"))
-            status.set("NextFetchAttempt", Value::date(*nextFetch));
+        if (const auto nextFetch = record.nextCertificateFetch())
+            status.set(message::kNextFetchAttempt, Value::date(*nextFetch));
     if (const auto held = requestsHeldUntil(record))
         status.set(kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::date(*held));
     if (const auto required = requiresUserAction(state))
-        status.set("AccountRequiresUserAction", Value::boolean(*required));
+        status.set(message::kRequiresUserAction, Value::boolean(*required));
     return status;
 }
 
@@ -70,22 +73,23 @@ Dictionary copyStatusOfEveryAccount(const Dictionary& options) {
 }  // namespace
 
 Dictionary copyDeviceStatusDictionary() {
-    return {{"DeviceUnlockedSinceBoot",
+    return {{message::kUnlockedSinceBoot,
              Value::boolean(platform::LockState::shared().hasBeenUnlockedSinceBoot())}};
 }
 
 Dictionary copyAccountStatusesDictionary(const Dictionary& options) {
     Dictionary status;
-    status.set("AccountStatuses", copyStatusOfEveryAccount(options));
-    if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(false, false)) status.set("DirtyAccounts", *dirty);
-    if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(false, true))
-        status.set("DirtyAccountsAndCertificates", *dirty);
+    status.set(message::kAccountStatuses, copyStatusOfEveryAccount(options));
+    if (const auto dirty = __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::Keep)) {
+        status.set(message::kDirtyAccounts, *dirty);
+        status.set(message::kDirtyAccountsAndCertificates, *dirty);
+    }
     for (const std::string_view key :
          {kVeltoIDMetaLastSuccessfulConnectKey, kVeltoIDMetaLastConnectAttemptKey})
         status.set(key, __VeltoIDDBCopyMetaInfoValue(nullptr, options, key));
-    status.set("LaunchTime", Value::date(launchDate()));
-    if (const auto next = nextLaunchDate()) status.set("NextLaunchTime", Value::date(*next));
-    status.set("pid", Value::int64(getpid()));
+    status.set(message::kLaunchTime, Value::date(launchDate()));
+    if (const auto next = nextLaunchDate()) status.set(message::kNextLaunchTime, Value::date(*next));
+    status.set(message::kProcessID, Value::int64(getpid()));
     for (const auto& [key, value] : copyDeviceStatusDictionary()) status.set(key, value);
     return status;
 }

@@ -3,8 +3,9 @@
 
 #include "TestSupport/CertificateFixture.h"
 #include "TestSupport/FakeLockState.h"
-#include "VeltoIDAuthd/AccountActions.h"
-#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/AccountActions.h"
+#include "VeltoIDAuthenticationImpl/AddAccount.h"
+#include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
@@ -27,10 +28,10 @@ class AccountStatusTest : public CertificateTest {
     /// Adds the account, as a client does.
     void add(bool withCertificate) {
         const Dictionary options = {{"CreateCSRAsynchronously", flag(!withCertificate)}};
-        EXPECT_TRUE(__VeltoIDDoAddVeltoID(kName, kPassword, options, nullptr, nullptr));
-        (void)__VeltoIDDBCopyDirtyVeltoIDs(true, true);
+        EXPECT_TRUE(__VeltoIDDoAddVeltoID(kName, kPassword, options, nullptr));
+        (void)__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll);
     }
-    void check() const { checkAccount(kName, record()); }
+    void check() const { checkAccount({kName, record()}); }
 
     static Dictionary statusOf(const Dictionary& options) {
         return *copyAccountStatusesDictionary(options).dictionary("AccountStatuses")->dictionary(kName);
@@ -48,7 +49,7 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
     };
     const auto after = [this](double seconds) { clock_.advanceBy(seconds); };
     const auto setEntry = [](const char* key, const Value& value) {
-        __VeltoIDDBSetCertificateValue("d1", key, value, false);
+        __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
     };
     const Case cases[] = {
         {"NoEncodedDSID",
@@ -56,7 +57,7 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
              server_.refuse("authenticate", 503);
              add(false);
              check();
-             (void)__VeltoIDDBCopyDirtyVeltoIDs(true, true);
+             (void)__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll);
          },
          false, false, 0},
         {"PasswordInaccessibleInKeychain",

@@ -53,7 +53,7 @@ void prepareDatabase(const CommandLine& line) {
 void startServices(const Agent::Configuration& configuration) {
     const CommandLine& line = configuration.line;
     if (line.runsAuthentication()) {
-        scheduleRelaunch(platform::Clock::shared().now() + kRelaunchAfterStart, true);
+        scheduleRelaunch(platform::now() + kRelaunchAfterStart);
         startAccountCheck(configuration.firstCheckDelay);
         registerAuthenticationListener(
             line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
@@ -68,7 +68,7 @@ void workForLeakChecker() {
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names)
         __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true),
-                                   true);
+                                   Notify::Yes);
     startAccountCheck(0);
     registerAuthenticationListener({});
     (void)platform::Semaphore().wait(kLeaksPause);
@@ -83,7 +83,7 @@ Agent::Agent(const Configuration& configuration)
     const CommandLine& line = configuration.line;
     if (line.usePreferences) platform::instance_lock::waitForPrevious();
     prepareDatabase(line);
-    setProcessHooks({[](double date) { scheduleRelaunch(date, true); }, endAfterPendingWork});
+    setProcessHooks({[](double date) { scheduleRelaunch(date); }, endAfterPendingWork});
     flushOnInterrupt();
     prepareShutdown();
     startServices(configuration);

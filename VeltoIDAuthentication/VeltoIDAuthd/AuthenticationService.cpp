@@ -1,15 +1,17 @@
 #include "VeltoIDAuthd/AuthenticationService.h"
 
 #include <algorithm>
-#include <cstdlib>
 
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
-#include "Values/LowerCase.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/AccountStatus.h"
 #include "VeltoIDAuthd/ClientRequest.h"
@@ -22,21 +24,17 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
-#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/FindPerson.h"
+#include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
 namespace {
 
 constexpr const char* kHandlerName = "handleAuthenticationIPCMessage";
-
-// How long an add that waits for its certificate lets pass between two looks at the account (seconds). The
-// account check, which does the work, makes a pass every five seconds at the most.
-constexpr double kShortestWait = 0.25;
-constexpr double kLongestWait = 3;
 
 /// Long enough for the reply to leave before the process ends (seconds).
 constexpr double kTerminationDelay = 0.1;
@@ -52,84 +50,33 @@ void countFor(const String& account, const Request& request, std::string_view co
 
 Outcome ping(Request& /*request*/) { return {true, {}}; }
 
-/// Sets what the request names; the given answer when that is nothing that can be set.
-bool setDatabaseValue(const Request& request, bool whenNothingIsSet) {
-    const String domain = request.string("domain");
-    const String item = request.string("item");
-    const String key = request.string("key");
-    const Value value = request.value("value");
-    const bool notify = getBool(&request.options(), "Dirty", true);
-    if (!domain || !key) return whenNothingIsSet;
-    if (domain == "MetaInfo") return __VeltoIDDBSetMetaInfoValue(item, key, value);
-    if (item && domain == "Accounts") return __VeltoIDDBSetAccountValue(item, key, value, notify);
-    if (item && domain == "Certificates") return __VeltoIDDBSetCertificateValue(item, key, value, notify);
-    return whenNothingIsSet;
+/// Sets what the request names; none when that is nothing that can be set.
+std::optional<bool> setDatabaseValue(const Request& request) {
+    const String section = request.string(message::kSection);
+    const String item = request.string(message::kItem);
+    const String key = request.string(message::kKey);
+    const Value value = request.value(message::kValue);
+    const Notify notify = getBool(&request.options(), option::kDirty, true) ? Notify::Yes : Notify::No;
+    if (!section || !key) return std::nullopt;
+    if (section == message::kMetaInfoSection) return __VeltoIDDBSetMetaInfoValue(item, key, value);
+    if (item && section == message::kAccountsSection)
+        return __VeltoIDDBSetAccountValue(item, key, value, notify);
+    if (item && section == message::kCertificatesSection)
+        return __VeltoIDDBSetCertificateValue(item, key, value, notify);
+    return std::nullopt;
 }
 
-Outcome setValueOrFail(Request& request) { return {setDatabaseValue(request, false), {}}; }
+Outcome setValueOrFail(Request& request) { return {setDatabaseValue(request).value_or(false), {}}; }
 
-Outcome setValueIfPossible(Request& request) { return {setDatabaseValue(request, true), {}}; }
-
-/// The agent keeps one account.
-void forgetOtherAccounts(const String& added) {
-    Array names;
-    __VeltoIDDBCopyVeltoIDs(&names);
-    const String addedInLowerCase = lowerCased(added);
-    for (const Value& name : names)
-        if (name.isString() && lowerCased(name.asString()) != addedInLowerCase)
-            __VeltoIDForgetVeltoID(name.asString(), {{"RemovePrivateKeyFromKeychain", Value::boolean(true)}});
-}
-
-/// Lets some time pass before the account is looked at again: until its next action, but not for long.
-void waitForNextAction(const String& accountName) {
-    const double now = platform::Clock::shared().now();
-    std::optional<double> next;
-    if (!copyNextActionDateForAccount(accountName, &next) || !next || *next <= now)
-        next = now + kShortestWait;
-    const platform::Semaphore nobodySignals;
-    (void)nobodySignals.wait(std::clamp(*next - now, kShortestWait, kLongestWait));
-}
-
-/// Waits for the account's certificate as long as option "certwaitduration" says; false when there will be
-/// none without somebody's doing. While the certificate is on its way this is a success.
-bool waitForCertificate(const Request& request) {
-    const double duration = getDouble(&request.options(), "certwaitduration", 0);
-    if (!(duration > 0)) return true;
-    Dictionary options = request.options();
-    options.set("CheckNetwork", Value::boolean(true));
-    const auto& clock = platform::Clock::shared();
-    const auto& lifetime = platform::Lifetime::current();
-    for (const double deadline = clock.now() + duration; clock.now() <= deadline && !lifetime.isEnding();) {
-        wakeAccountCheck();
-        switch (checkAccountAndDetermineNextAction(request.account(), options)) {
-            case AccountState::NoEncodedDSID:
-            case AccountState::PasswordInaccessibleInKeychain:
-            case AccountState::PasswordInvalid:
-                return false;
-            case AccountState::CertificateOK:
-            case AccountState::CertificateAssumedOK:
-                return true;
-            default:
-                waitForNextAction(request.account());
-        }
-    }
-    return true;
-}
+Outcome setValueIfPossible(Request& request) { return {setDatabaseValue(request).value_or(true), {}}; }
 
 Outcome addAccount(Request& request) {
     Outcome outcome;
-    String encDsId;
-    std::optional<Dictionary> record;
-    outcome.success = __VeltoIDDoAddVeltoID(request.account(), request.string("hashedpassword"),
-                                            request.options(), &encDsId, &record, &outcome.error);
-    countFor(nullptr, request, kVeltoIDAddVeltoIDCountKey);
-    if (!outcome.success) return outcome;
-    __VeltoIDDBSetAccountValue(request.account(), kVeltoIDAccountLastValidationDateKey, Value::null(), true);
-    request.answer("encDsId", encDsId);
-    if (record) request.answer("accountinfo", *record);
-    wakeAccountCheck();
-    forgetOtherAccounts(request.account());
-    outcome.success = waitForCertificate(request);
+    AddedAccount added;
+    outcome.success = addOnlyAccount(request.account(), request.string(message::kHashedPassword),
+                                     request.options(), wakeAccountCheck, &added, &outcome.error);
+    request.answer(message::kEncDsId, added.encDsId);
+    if (added.record) request.answer(message::kAddedAccount, *added.record);
     return outcome;
 }
 
@@ -138,12 +85,12 @@ Outcome getMyInfo(Request& request) {
     Dictionary info;
     outcome.success = __VeltoIDDoGetMyInfo(request.account(), request.options(), &info, &outcome.error);
     countFor(request.account(), request, kVeltoIDGetMyInfoCountKey);
-    if (outcome.success) request.answer("info", info);
+    if (outcome.success) request.answer(message::kInfo, info);
     return outcome;
 }
 
 Dictionary criteriaOf(const Request& request) {
-    const Value criteria = request.value("criteria");
+    const Value criteria = request.value(message::kCriteria);
     const Dictionary* dictionary = criteria.asDictionary();
     return dictionary != nullptr ? *dictionary : Dictionary();
 }
@@ -151,10 +98,10 @@ Dictionary criteriaOf(const Request& request) {
 Outcome findPerson(Request& request) {
     Outcome outcome;
     std::optional<Array> results;
-    outcome.success = __VeltoIDDoFindPerson(request.account(), request.string("hashedpassword"),
+    outcome.success = __VeltoIDDoFindPerson(request.account(), request.string(message::kHashedPassword),
                                             criteriaOf(request), request.options(), &results, &outcome.error);
     countFor(request.account(), request, kVeltoIDFindCountKey);
-    if (outcome.success && results) request.answer("result", *results);
+    if (outcome.success && results) request.answer(message::kResult, *results);
     return outcome;
 }
 
@@ -162,7 +109,7 @@ Outcome findCachedPerson(Request& request) {
     const auto results = __VeltoIDDBCopyCachedFindPersonResults(criteriaOf(request));
     countFor(request.account(), request, kVeltoIDFindCachedCountKey);
     if (!results || results->empty()) return {};
-    request.answer("result", *results);
+    request.answer(message::kResult, *results);
     return {true, {}};
 }
 
@@ -170,21 +117,19 @@ Outcome listAccounts(Request& request) {
     Outcome outcome;
     Array names;
     outcome.success = __VeltoIDCopyVeltoIDs(request.options(), &names, &outcome.error);
-    if (outcome.success) request.answer("result", names);
+    if (outcome.success) request.answer(message::kResult, names);
     return outcome;
 }
 
 Outcome forgetAccount(Request& request) {
     Outcome outcome;
-    Dictionary record;
-    if (__VeltoIDDBCopyVeltoIDAccount(request.account(), &record, &outcome.error)) {
-        const String name = record.string(kVeltoIDAccountNameKey);
-        outcome.success = __VeltoIDForgetVeltoID(name, request.options(), &outcome.error);
-        if (outcome.success) {
-            request.answer("VeltoID", name);
-            request.answer("encDSID", record.string(kVeltoIDAccountDSIDKey));
-            request.answer("accountInfo", record);
-        }
+    AccountRecord record;
+    if (__VeltoIDDBCopyVeltoIDAccount(request.account(), &record, &outcome.error))
+        outcome.success = __VeltoIDForgetVeltoID(record.accountName(), request.options(), &outcome.error);
+    if (outcome.success) {
+        request.answer(message::kAccount, record.accountName());
+        request.answer(message::kForgottenEncDsId, record.encDsId());
+        request.answer(message::kForgottenAccount, record.values());
     }
     countFor(nullptr, request, kVeltoIDForgetVeltoIDCountKey);
     return outcome;
@@ -192,42 +137,42 @@ Outcome forgetAccount(Request& request) {
 
 /// The signed record that vouches for the account's validated items.
 Outcome copyValidationRecord(Request& request) {
-    Dictionary record;
+    AccountRecord record;
     if (!__VeltoIDDBCopyVeltoIDAccount(request.account(), &record)) return {};
     Dictionary result;
     for (const std::string_view key :
          {kVeltoIDAccountValidationRecordDataKey, kVeltoIDAccountValidationRecordValidAsOfKey})
-        result.set(key, record[key]);
-    request.answer("result", result);
+        result.set(key, record.values()[key]);
+    request.answer(message::kResult, result);
     return {true, {}};
 }
 
 Outcome copyCertificateInformation(Request& request) {
-    if (request.string("CertificateType") == "VeltoIDValidatedItemsRecordDataCertificateType")
+    if (request.string(message::kCertificateType) == message::kValidationRecordType)
         return copyValidationRecord(request);
     Outcome outcome;
     Dictionary result;
-    outcome.success = __VeltoIDCopyCertificateInfo(request.account(), request.string("encDsId"),
+    outcome.success = __VeltoIDCopyCertificateInfo(request.account(), request.string(message::kEncDsId),
                                                    request.options(), &result, &outcome.error);
-    if (outcome.success) request.answer("result", result);
+    if (outcome.success) request.answer(message::kResult, result);
     return outcome;
 }
 
 Outcome setBreadcrumb(Request& request) {
     Outcome outcome;
-    outcome.success = __VeltoIDDoSetBreadcrumb(request.account(), request.string("hashedpassword"),
-                                               request.string("identifier"), request.data("breadcrumb"),
-                                               request.options(), &outcome.error);
+    outcome.success = __VeltoIDDoSetBreadcrumb(
+        request.account(), request.string(message::kHashedPassword), request.string(message::kBreadcrumbKey),
+        request.data(message::kBreadcrumb), request.options(), &outcome.error);
     return outcome;
 }
 
 Outcome copyBreadcrumb(Request& request) {
     Outcome outcome;
     const Data breadcrumb =
-        __VeltoIDDoCopyBreadcrumb(request.account(), request.string("hashedpassword"),
-                                  request.string("identifier"), request.options(), &outcome.error);
+        __VeltoIDDoCopyBreadcrumb(request.account(), request.string(message::kHashedPassword),
+                                  request.string(message::kBreadcrumbKey), request.options(), &outcome.error);
     outcome.success = static_cast<bool>(breadcrumb);
-    if (outcome.success) request.answer("breadcrumb", breadcrumb);
+    if (outcome.success) request.answer(message::kBreadcrumb, breadcrumb);
     return outcome;
 }
 
@@ -240,13 +185,13 @@ Outcome verifyPassword(Request& request) {
 Outcome copyAllContents(Request& request) {
     std::optional<Dictionary> contents;
     const bool success = __VeltoIDDBCopyAllContents(&contents);
-    if (contents) request.answer("result", *contents);
+    if (contents) request.answer(message::kResult, *contents);
     return {success, {}};
 }
 
 Outcome check(Request& request) {
     const AccountState state = checkAccountAndDetermineNextAction(request.account(), request.options());
-    request.answer("status", Value::int64(static_cast<int64_t>(state)));
+    request.answer(message::kStatus, Value::int64(static_cast<int64_t>(state)));
     return {true, {}};
 }
 
@@ -261,10 +206,10 @@ void terminateAfterReply() {
 }
 
 Outcome status(Request& request) {
-    const bool terminates = getBool(&request.options(), "VeltoIDAuthenticationStatusTerminateServer", false);
+    const bool terminates = getBool(&request.options(), option::kTerminateServer, false);
     if (terminates) computeRelaunchFromAccounts();
-    request.answer("status", terminates ? copyDeviceStatusDictionary()
-                                        : copyAccountStatusesDictionary(request.options()));
+    request.answer(message::kStatus, terminates ? copyDeviceStatusDictionary()
+                                                : copyAccountStatusesDictionary(request.options()));
     if (terminates) terminateAfterReply();
     return {true, {}};
 }
@@ -274,32 +219,29 @@ struct Command {
     Outcome (*run)(Request& request);
 };
 
-constexpr int64_t kTerminateCommand = 0x9999;
-
 constexpr Command kCommands[] = {
-    {kVeltoIDPingCommand, ping},
-    {0xFE, setValueOrFail},
-    {0xFF, setValueIfPossible},
-    {0x120, addAccount},
-    {0x130, getMyInfo},
-    {0x140, findPerson},
-    {0x141, findCachedPerson},
-    {0x150, listAccounts},
-    {0x160, forgetAccount},
-    {0x170, copyCertificateInformation},
-    {0x180, verifyPassword},
-    {0x200, setBreadcrumb},
-    {0x201, copyBreadcrumb},
-    {0x500, copyAllContents},
-    {0x501, check},
-    {0x510, status},
+    {command::kPing, ping},
+    {command::kSetValue, setValueOrFail},
+    {command::kSetValueQuietly, setValueIfPossible},
+    {command::kAdd, addAccount},
+    {command::kInfo, getMyInfo},
+    {command::kFind, findPerson},
+    {command::kFindCached, findCachedPerson},
+    {command::kList, listAccounts},
+    {command::kForget, forgetAccount},
+    {command::kCertificate, copyCertificateInformation},
+    {command::kVerify, verifyPassword},
+    {command::kSetBreadcrumb, setBreadcrumb},
+    {command::kGetBreadcrumb, copyBreadcrumb},
+    {command::kDatabase, copyAllContents},
+    {command::kCheck, check},
+    {command::kStatus, status},
 };
 
 Outcome dispatch(Request& request) {
-    const auto* command = std::find_if(std::begin(kCommands), std::end(kCommands), [&](const Command& known) {
-        return known.number == request.command();
-    });
-    return command != std::end(kCommands) ? command->run(request) : Outcome();
+    const auto* found = std::find_if(std::begin(kCommands), std::end(kCommands),
+                                     [&](const Command& known) { return known.number == request.command(); });
+    return found != std::end(kCommands) ? found->run(request) : Outcome();
 }
 
 }  // namespace
@@ -307,7 +249,7 @@ Outcome dispatch(Request& request) {
 void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
     const Transaction guard(kHandlerName);
     Request request(message);
-    if (request.command() == kTerminateCommand) {
+    if (request.command() == command::kTerminate) {
         computeRelaunchFromAccounts();
         return shutDownByCommand();
     }

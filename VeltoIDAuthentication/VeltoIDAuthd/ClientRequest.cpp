@@ -1,5 +1,7 @@
 #include "VeltoIDAuthd/ClientRequest.h"
 
+#include "Protocol/MessageKeys.h"
+
 namespace veltoid {
 namespace {
 
@@ -12,14 +14,14 @@ MessageObject readMessage(platform::IncomingMessage& message) {
 }  // namespace
 
 Request::Request(platform::IncomingMessage& message) : message_(message), request_(readMessage(message)) {
-    command_ = request_.copyValue("command", Value::Kind::Number).asInt64().value_or(0);
-    account_ = request_.copyAccountName("VeltoID");
-    const Value options = request_.copyValue("options");
+    command_ = request_.copyValue(message::kCommand, Value::Kind::Number).asInt64().value_or(0);
+    account_ = request_.copyAccountName(message::kAccount);
+    const Value options = request_.copyValue(message::kOptions);
     if (const Dictionary* given = options.asDictionary()) options_ = *given;
 }
 
 void Request::finish(bool success, const std::optional<Error>& error) {
-    reply_.setValue("success", Value::boolean(success));
+    reply_.setValue(message::kSuccess, Value::boolean(success));
     if (!success && error) reply_.setError(*error);
     message_.reply(
         [reply = reply_.message()](platform::ValueSink& sink) { writeMessageValue(*reply, sink); });

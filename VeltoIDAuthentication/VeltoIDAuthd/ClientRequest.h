@@ -10,9 +10,6 @@
 
 namespace veltoid {
 
-/// The ping, of both services.
-inline constexpr int64_t kVeltoIDPingCommand = 0x1;
-
 /// One request and the reply under construction. On the client's queue.
 class Request {
   public:

@@ -4,6 +4,7 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Platform/bus/MessageService.h"
+#include "Protocol/Commands.h"
 #include "VeltoIDAuthd/AuthenticationService.h"
 #include "VeltoIDAuthd/ClientRequest.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -19,7 +20,7 @@ using RequestHandler = std::function<void(platform::IncomingMessage& message)>;
 
 /// A ping waits for nothing.
 bool isAnsweredAtOnce(platform::IncomingMessage& message) {
-    return message.peekInteger("command") == kVeltoIDPingCommand;
+    return message.peekInteger("command") == command::kPing;
 }
 
 void serve(PeerConnection& peer, const RequestHandler& handle) {

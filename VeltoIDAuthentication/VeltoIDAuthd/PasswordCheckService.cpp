@@ -1,6 +1,9 @@
 #include "VeltoIDAuthd/PasswordCheckService.h"
 
 #include "IPCHelpers/Transaction.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
 
@@ -13,20 +16,18 @@ bool linkedIdentityUnsupported(ErrorOut error) {
 }
 
 bool updateLinkedIdentity(const Request& request, const LinkedIdentityHandler& update, ErrorOut error) {
-    const Data reference = request.value("identityReferenceData").asData();
+    const Data reference = request.value(message::kIdentityReference).asData();
     if (!reference) return false;
     return update ? update(reference, error) : linkedIdentityUnsupported(error);
 }
 
 bool run(const Request& request, const LinkedIdentityHandler& linkedIdentity, ErrorOut error) {
-    constexpr int64_t kVerifyPassword = 0x180;
-    constexpr int64_t kUpdateLinkedIdentity = 400;
     switch (request.command()) {
-        case kVeltoIDPingCommand:
+        case command::kPing:
             return true;
-        case kVerifyPassword:
+        case command::kVerify:
             return verifyRequestedPassword(request, error);
-        case kUpdateLinkedIdentity:
+        case command::kUpdateLinkedIdentity:
             return updateLinkedIdentity(request, linkedIdentity, error);
         default:
             return false;
@@ -45,10 +46,10 @@ void handlePasswordCheckIPCMessage(platform::IncomingMessage& message,
 }
 
 bool verifyRequestedPassword(const Request& request, ErrorOut error) {
-    const String password = request.string("hashedpassword");
+    const String password = request.string(message::kHashedPassword);
     if (!request.account() || !password) return false;
     const Dictionary options =
-        copyDictionarySettingValue(request.options(), "DoNotSaveSessionInfo", Value::boolean(true));
+        copyDictionarySettingValue(request.options(), option::kDoNotSaveSessionInfo, Value::boolean(true));
     return __VeltoIDDoVerifyPassword(request.account(), password, options, error);
 }
 

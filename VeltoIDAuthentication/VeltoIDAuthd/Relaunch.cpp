@@ -10,15 +10,16 @@
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "Values/Error.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/Store.h"
-#include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 
 namespace veltoid {
 namespace {
 
 constexpr double kNoParticularTime = 1e10;
-constexpr double kLongestInterval = std::numeric_limits<uint32_t>::max();
+constexpr double kMaxInterval = std::numeric_limits<uint32_t>::max();
 
 /// The next date is changed on the main queue only; the lock is for the status, which reads it from a
 /// client's queue.
@@ -31,27 +32,27 @@ struct Launches {
 Launches& launches() { return platform::Lifetime::current().state<Launches>(); }
 
 /// Main queue.
-void handOver(double requested, bool force) {
-    const double now = platform::Clock::shared().now();
+void handOver(double requested, RelaunchDate rule) {
+    const double now = platform::now();
     const double target = requested > 0 ? requested : now + kNoParticularTime;
     auto& [begun, mutex, next] = launches();
     const std::lock_guard lock(mutex);
-    if (!force && next && target > *next) return;
+    if (rule == RelaunchDate::OnlyIfEarlier && next && target > *next) return;
     const double delta = target - now;
     next.reset();
     if (delta < 0) return;
     next = now + delta;
     platform::ServiceManager::shared().setStartInterval(
-        delta >= kLongestInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
+        delta >= kMaxInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
 }
 
 }  // namespace
 
-void scheduleRelaunch(std::optional<double> date, bool force) {
+void scheduleRelaunch(std::optional<double> date, RelaunchDate rule) {
     (void)launches();
     const auto keepAlive = std::make_shared<Transaction>("scheduleRelaunch");
-    platform::WorkQueue::main().async([keepAlive, requested = date.value_or(0), force] {
-        handOver(requested, force);
+    platform::WorkQueue::main().async([keepAlive, requested = date.value_or(0), rule] {
+        handOver(requested, rule);
         keepAlive->close();
     });
 }
@@ -67,14 +68,14 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
         needing.append(name);
         if (!earliest || *date < *earliest) earliest = date;
     }
-    if (earliestDate != nullptr) *earliestDate = earliest;
+    fill(earliestDate, earliest);
     return needing;
 }
 
 void computeRelaunchFromAccounts() {
     std::optional<double> earliest;
     const Array accounts = copyAccountsNeedingAction(&earliest);
-    if (!accounts.empty() && earliest) scheduleRelaunch(earliest, true);
+    if (!accounts.empty() && earliest) scheduleRelaunch(earliest);
     __VeltoIDDBSynchronize();
 }
 

@@ -8,10 +8,12 @@
 
 namespace veltoid {
 
-/// Asks for a relaunch at `date` (seconds since 1970; none or not positive: no particular time). Without
-/// `force` a date that is later than the one already asked for changes nothing. Any queue: the work is done
-/// on the main queue, inside a transaction.
-void scheduleRelaunch(std::optional<double> date, bool force);
+/// Whether a date takes the place of an earlier one that was asked for before.
+enum class RelaunchDate { Replaces, OnlyIfEarlier };
+
+/// Asks for a relaunch at `date` (seconds since 1970; none or not positive: no particular time). Any queue:
+/// the work is done on the main queue, inside a transaction.
+void scheduleRelaunch(std::optional<double> date, RelaunchDate rule = RelaunchDate::Replaces);
 
 /// The names of the accounts for which an action is foreseen, and the earliest of their dates. Any queue but
 /// the main one's dependants: reads the database.

@@ -28,7 +28,7 @@ class RelaunchTest : public DatabaseTest {
         Dictionary values = {{"Dirty", Value::null()}, {"LastConnectAttempt", date(1e12)}};
         // Under an embargo nothing but its end counts.
         if (action) values.set("EarliestAllowedConnectionDate", date(*action));
-        ASSERT_TRUE(__VeltoIDDBSetAccountValues(name, values, false));
+        ASSERT_TRUE(__VeltoIDDBSetAccountValues(name, values, Notify::No));
     }
 
     FakeServiceManager manager_;
@@ -64,7 +64,8 @@ TEST_F(RelaunchTest, TheServiceManagerIsAskedForTheEarliestUnlessForced) {
     };
     EXPECT_EQ(nextLaunchDate(), std::nullopt);
     for (const Case& each : cases) {
-        scheduleRelaunch(each.date ? std::optional(now() + *each.date) : std::nullopt, each.force);
+        scheduleRelaunch(each.date ? std::optional(now() + *each.date) : std::nullopt,
+                         each.force ? RelaunchDate::Replaces : RelaunchDate::OnlyIfEarlier);
         clock_.settle();
         EXPECT_EQ(manager_.take(), each.handed) << each.what;
         EXPECT_EQ(nextLaunchDate(), each.next ? std::optional(now() + *each.next) : std::nullopt)
@@ -81,7 +82,7 @@ TEST_F(RelaunchTest, ATransactionIsOpenUntilTheServiceManagerIsAsked) {
         opened.wait();
     });
     started.wait();
-    scheduleRelaunch(now() + 5, true);
+    scheduleRelaunch(now() + 5);
     EXPECT_EQ(platform::transactions::openCount(), 1);
     EXPECT_EQ(manager_.take(), std::nullopt);
     opened.signal();
@@ -105,7 +106,7 @@ TEST_F(RelaunchTest, AccountsThatNeedAnActionAndWhen) {
 }
 
 TEST_F(RelaunchTest, TheEarliestActionIsWhenTheAgentComesBack) {
-    scheduleRelaunch(now() + 10, true);
+    scheduleRelaunch(now() + 10);
     computeRelaunchFromAccounts();
     clock_.settle();
     EXPECT_EQ(manager_.take(), 10U) << "without accounts what was asked for stays";

@@ -5,6 +5,7 @@
 #include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
 #include "Values/LowerCase.h"
+#include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
@@ -14,18 +15,24 @@ namespace {
 
 using database::Store;
 
-Value now() { return Value::date(platform::Clock::shared().now()); }
-
-Error identityError(int64_t code) { return {String(kIdentityErrorDomain), code, {}}; }
-
 /// An account that is not there may only be out of reach.
 int64_t missingAccountCode(const Store& store) {
     return store.isLoaded() ? identity_error::kUnknownAccount : identity_error::kUnspecified;
 }
 
-bool hasPassword(const Dictionary& record) {
-    return record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey) ||
-           record.string(kVeltoIDAccountHashedPasswordKey);
+/// The record of a name; none when there is none.
+std::optional<AccountRecord> recordOf(const Store& store, const String& name) {
+    const Dictionary* found = Store::find(store.accounts, name);
+    return found != nullptr ? std::optional(AccountRecord(name, *found)) : std::nullopt;
+}
+
+/// The first record that the condition holds for.
+template <typename Condition>
+std::optional<AccountRecord> firstRecord(const Store& store, Condition condition) {
+    for (const auto& [name, value] : store.accounts)
+        if (const Dictionary* values = value.asDictionary())
+            if (AccountRecord record(name, *values); condition(record)) return record;
+    return std::nullopt;
 }
 
 /// Whether the keychain holds exactly this password for the record.
@@ -52,16 +59,9 @@ bool storePassword(const String& name, const String& hashedPassword, Dictionary&
     return true;
 }
 
-/// Stores the record and writes the section.
-bool storeRecord(Store& store, const String& name, const Dictionary& record, bool signal) {
-    Dictionary accounts = store.accounts;
-    accounts.set(name, record);
-    return store.replace(&Store::accounts, std::move(accounts), signal);
-}
-
 void markDirty(Dictionary& record) {
     record.set(kVeltoIDDirtyKey, Value::boolean(true));
-    record.set(kVeltoIDAccountModificationDateKey, now());
+    record.set(kVeltoIDAccountModificationDateKey, Value::date(platform::now()));
 }
 
 /// Applies one entry; true when it changes the record. Setting a key to Null that is not there changes
@@ -103,49 +103,41 @@ bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     return true;
 }
 
-std::optional<Dictionary> __VeltoIDDBCopyFirstVeltoIDAccount(bool requirePassword, bool requireDSID) {
-    return database::perform([&](const Store& store) -> std::optional<Dictionary> {
-        for (const auto& [name, value] : store.accounts) {
-            const Dictionary* record = value.asDictionary();
-            if (record == nullptr || (requirePassword && !hasPassword(*record)) ||
-                (requireDSID && !record->string(kVeltoIDAccountDSIDKey)))
-                continue;
-            return *record;
-        }
-        return std::nullopt;
+std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountRequirements& required) {
+    return database::perform([&](const Store& store) {
+        return firstRecord(store, [&](const AccountRecord& record) {
+            return (!required.password || record.hasPassword()) && (!required.encDsId || record.encDsId());
+        });
     });
 }
 
-bool __VeltoIDDBCopyVeltoIDAccount(const String& name, Dictionary* record, ErrorOut error) {
+bool __VeltoIDDBCopyVeltoIDAccount(const String& name, AccountRecord* record, ErrorOut error) {
     if (!name) {
         fillError(error, identityError(identity_error::kInvalidParameters));
         return false;
     }
     return database::perform([&](const Store& store) {
-        const Dictionary* found = Store::find(store.accounts, name);
-        if (found == nullptr) {
+        auto found = recordOf(store, name);
+        if (!found) {
             fillError(error, identityError(missingAccountCode(store)));
         } else if (record != nullptr) {
-            *record = *found;
+            *record = std::move(*found);
         }
-        return found != nullptr;
+        return found.has_value();
     });
 }
 
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error) {
-    const String found = database::perform([&](const Store& store) -> String {
-        for (const auto& [key, value] : store.accounts) {
-            const Dictionary* record = value.asDictionary();
-            if (encDsId && record != nullptr && record->string(kVeltoIDAccountDSIDKey) == encDsId) return key;
-        }
-        return nullptr;
+    const auto found = database::perform([&](const Store& store) {
+        return firstRecord(
+            store, [&](const AccountRecord& record) { return encDsId && record.encDsId() == encDsId; });
     });
     if (!found) {
         fillError(error, makeError(identity_error::kUnspecified, {"Unknown error", "?", "?"}, {}, __func__,
                                    __FILE_NAME__, __LINE__));
         return false;
     }
-    if (name != nullptr) *name = found;
+    if (name != nullptr) *name = found->accountName();
     return true;
 }
 
@@ -156,23 +148,23 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         // Before the password goes anywhere: an item that no record names would never be found again.
         if (!store.isLoaded()) return false;
         const Dictionary* existing = Store::find(store.accounts, name);
-        Dictionary record =
-            existing != nullptr ? *existing : Dictionary{{kVeltoIDAccountCreationDateKey, now()}};
+        Dictionary record = existing != nullptr
+                                ? *existing
+                                : Dictionary{{kVeltoIDAccountCreationDateKey, Value::date(platform::now())}};
         record.set(kVeltoIDAccountNameKey, name);
         record.set(kVeltoIDAccountDSIDKey, encDsId);
         if (hashedPassword && !storePassword(name, hashedPassword, record)) return false;
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);
-        return storeRecord(store, name, record, true);
+        return store.set(&Store::accounts, name, record, Notify::Yes);
     });
 }
 
-String __VeltoIDDBCopyHashedPassword(const Dictionary& record) {
+String __VeltoIDDBCopyHashedPassword(const AccountRecord& record) {
     String password;
-    const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
-    if (reference && copyPasswordFromKeychainGivenPersistentRef(reference, &password)) return password;
-    return record.string(kVeltoIDAccountHashedPasswordKey);
+    if (copyPasswordFromKeychainGivenPersistentRef(record.passwordReference(), &password)) return password;
+    return record.ownPasswordHash();
 }
 
 bool __VeltoIDDBRemovePassword(const String& name) {
@@ -188,11 +180,11 @@ bool __VeltoIDDBRemovePassword(const String& name) {
             removePasswordFromKeychainGivenPersistentRef(reference);
         record.remove(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
         markDirty(record);
-        return storeRecord(store, name, record, true);
+        return store.set(&Store::accounts, name, record, Notify::Yes);
     });
 }
 
-bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, bool signal) {
+bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, Notify notify) {
     if (!name || values.empty()) return false;
     return database::perform([&](Store& store) {
         const Dictionary* existing = Store::find(store.accounts, name);
@@ -206,17 +198,17 @@ bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, b
                                           key.view() != kVeltoIDDirtyKey);
         }
         if (!changed) return true;
-        record.set(kVeltoIDAccountModificationDateKey, now());
-        if (signal && values.boolean(kVeltoIDDirtyKey) != false)
+        record.set(kVeltoIDAccountModificationDateKey, Value::date(platform::now()));
+        if (notify == Notify::Yes && values.boolean(kVeltoIDDirtyKey) != false)
             record.set(kVeltoIDDirtyKey, Value::boolean(true));
-        return storeRecord(store, name, record, signal && significant);
+        return store.set(&Store::accounts, name, record, significant ? notify : Notify::No);
     });
 }
 
-bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, bool signal) {
+bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, Notify notify) {
     if (!key) return false;
     return __VeltoIDDBSetAccountValues(name, {{key.view(), value.isAbsent() ? Value::null() : value}},
-                                       signal);
+                                       notify);
 }
 
 Value __VeltoIDDBCopyAccountValue(const String& name, const String& key) {
@@ -234,35 +226,34 @@ bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
     return database::perform([&](Store& store) {
         Dictionary accounts = store.accounts;
         const bool existed = accounts.remove(name.view());
-        if (existed && store.replace(&Store::accounts, std::move(accounts), true)) return true;
+        if (existed && store.replace(&Store::accounts, std::move(accounts), Notify::Yes)) return true;
         fillError(error, identityError(existed ? identity_error::kUnspecified : missingAccountCode(store)));
         return false;
     });
 }
 
-bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, Dictionary* removed) {
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, AccountRecord* removed) {
     return database::perform([&](Store& store) {
-        const Dictionary* existing = Store::find(store.accounts, name);
-        if (existing == nullptr) return false;
-        *removed = *existing;
+        const auto record = recordOf(store, name);
+        if (!record) return false;
         Dictionary accounts = store.accounts;
         accounts.remove(name.view());
-        if (!store.replace(&Store::accounts, std::move(accounts), true)) return false;
-        if (const Data reference = removed->data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-            removePasswordFromKeychainGivenPersistentRef(reference);
+        if (!store.replace(&Store::accounts, std::move(accounts), Notify::Yes)) return false;
+        removePasswordFromKeychainGivenPersistentRef(record->passwordReference());
+        *removed = *record;
         return true;
     });
 }
 
-std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates) {
+std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks marks) {
     return database::perform([&](Store& store) -> std::optional<Array> {
         Array names;
         for (const auto& [name, value] : store.accounts) {
             const Dictionary* record = value.asDictionary();
-            if (record != nullptr && record->boolean(kVeltoIDDirtyKey).value_or(false)) names.append(name);
+            if (record != nullptr && AccountRecord(name, *record).isDirty()) names.append(name);
         }
-        if (clear) removeDirtyMarks(store.accounts);
-        if (clear && includeCertificates) removeDirtyMarks(store.certificates);
+        if (marks != DirtyMarks::Keep) removeDirtyMarks(store.accounts);
+        if (marks == DirtyMarks::ClearAll) removeDirtyMarks(store.certificates);
         if (names.empty()) return std::nullopt;
         return names;
     });
@@ -274,35 +265,12 @@ bool __VeltoIDDBDeriveAccountUUIDs(const String& name, Dictionary& record) {
 }
 
 bool __VeltoIDDBHasValidCertificate(const String& name) {
-    Dictionary record;
-    if (!__VeltoIDDBCopyVeltoIDAccount(name, &record)) return false;
-    return hasValidCertificateEntry(record.string(kVeltoIDAccountDSIDKey));
+    AccountRecord record;
+    return __VeltoIDDBCopyVeltoIDAccount(name, &record) && hasValidCertificateEntry(record.encDsId());
 }
 
 bool __VeltoIDDBHasCertificateToken(const String& name) {
     return __VeltoIDDBCopyAccountValue(name, kVeltoIDAccountCertificateTokenKey).isString();
 }
 
-namespace database {
-
-bool deriveAccountUUIDs(const String& name, Dictionary& record, const Dictionary& metaInfo) {
-    bool changed = false;
-    if (!record.string(kVeltoIDAccountUUIDKey)) {
-        record.set(kVeltoIDAccountUUIDKey, randomUUIDText());
-        record.remove(kVeltoIDAccountStableUUIDKey);
-        changed = true;
-    }
-    const String userUUID = metaInfo.string(kVeltoIDMetaUserUUIDKey);
-    if (userUUID && !record.string(kVeltoIDAccountStableUUIDKey)) {
-        const Data digest = sha256OfString(lowerCased(name).text() + userUUID.text());
-        platform::UUIDBytes folded{};
-        for (size_t i = 0; i < folded.size(); ++i)
-            folded[i] = static_cast<uint8_t>(digest.bytes()[2 * i] ^ digest.bytes()[2 * i + 1]);
-        record.set(kVeltoIDAccountStableUUIDKey, platform::canonicalUUIDText(folded));
-        changed = true;
-    }
-    return changed;
-}
-
-}  // namespace database
 }  // namespace veltoid

@@ -2,7 +2,7 @@
 // name.
 //
 // Bodies run on the database queue; records come out as copies. "Writes" means to the preference store
-// (Store.h); with `signal` the change semaphore is signalled too. Errors are of domain HWIdentityErrorDomain
+// (Store.h); Notify.h says what else a change may do. Errors are of domain HWIdentityErrorDomain
 // unless said otherwise.
 #pragma once
 
@@ -10,18 +10,25 @@
 
 #include "Values/Error.h"
 #include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/AccountRecord.h"
+#include "VeltoIDAuthenticationDB/Notify.h"
 
 namespace veltoid {
 
 /// The names of all accounts; -107 when there is none.
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error = nullptr);
 
-/// A copy of the first record that has a password (a reference or a hash of its own) and an encDsId, as far
-/// as required.
-std::optional<Dictionary> __VeltoIDDBCopyFirstVeltoIDAccount(bool requirePassword, bool requireDSID);
+/// What an account must have to be found.
+struct AccountRequirements {
+    bool password = false;
+    bool encDsId = false;
+};
+
+/// The first record that has what is required.
+std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountRequirements& required);
 
 /// -99 for no name, -108 for no record.
-bool __VeltoIDDBCopyVeltoIDAccount(const String& name, Dictionary* record, ErrorOut error = nullptr);
+bool __VeltoIDDBCopyVeltoIDAccount(const String& name, AccountRecord* record, ErrorOut error = nullptr);
 
 /// The name of the first account with that encDsId; -1 with texts when there is none.
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error = nullptr);
@@ -32,18 +39,19 @@ bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut
 bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword, const String& encDsId);
 
 /// The password hash of a record: from the keychain, else the record's own. Runs on the caller's thread.
-String __VeltoIDDBCopyHashedPassword(const Dictionary& record);
+String __VeltoIDDBCopyHashedPassword(const AccountRecord& record);
 
 /// Drops password and reference, deletes the keychain item, marks dirty, writes with signal. False without a
 /// record.
 bool __VeltoIDDBRemovePassword(const String& name);
 
-/// Sets every key whose value differs; Null removes. A change stamps "ModificationDate", with `signal` marks
-/// the record dirty (unless the values say otherwise), and is written. False without name, values or record.
-bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, bool signal);
+/// Sets every key whose value differs; Null removes. A change stamps "ModificationDate", marks the record
+/// dirty when it notifies (unless the values say otherwise), and is written. False without name, values or
+/// record.
+bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, Notify notify);
 
 /// The same for one key; an absent value removes it.
-bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, bool signal);
+bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, Notify notify);
 
 /// The stored value, of whatever kind; absent when there is none.
 Value __VeltoIDDBCopyAccountValue(const String& name, const String& key);
@@ -54,14 +62,17 @@ bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error = nullpt
 
 /// Removes the record with its password item, in one step: a new record of that name would take the item up.
 /// Hands the record out; false without one, or when the change cannot be stored.
-bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, Dictionary* removed);
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, AccountRecord* removed);
 
-/// The names of the dirty records; none when there are none. With `clear` the marks of all records go (of
-/// certificate entries too with `includeCertificates`), in memory until the section is next written.
-std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(bool clear, bool includeCertificates);
+/// What becomes of the marks of changed records, and with ClearAll of changed certificate entries.
+enum class DirtyMarks { Keep, ClearOfAccounts, ClearAll };
 
-/// Adds "AccountUUID" (random, once) and "AccountStableUUID" (from the name in lower case and the device's
-/// "UserUUID", once that exists) to the record where missing. True when it added one.
+/// The names of the dirty records; none when there are none. Marks are cleared in memory until the section is
+/// next written.
+std::optional<Array> __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks marks);
+
+/// Adds the account's identifiers to the record where they are missing (AccountUUIDs.h). True when it added
+/// one.
 bool __VeltoIDDBDeriveAccountUUIDs(const String& name, Dictionary& record);
 
 /// Whether the account's encDsId has a valid certificate entry.
@@ -69,11 +80,4 @@ bool __VeltoIDDBHasValidCertificate(const String& name);
 
 /// Whether a certificate request of the account is pending.
 bool __VeltoIDDBHasCertificateToken(const String& name);
-
-namespace database {
-
-/// The body of __VeltoIDDBDeriveAccountUUIDs, for callers that are on the queue or loading.
-bool deriveAccountUUIDs(const String& name, Dictionary& record, const Dictionary& metaInfo);
-
-}  // namespace database
 }  // namespace veltoid

@@ -18,9 +18,9 @@ constexpr const char* kStableUUID = "BC6E3091-6F0C-96A4-D7F8-EADEF427002A";
 class AccountsTest : public DatabaseTest {
   protected:
     static Dictionary record(const char* name = kName) {
-        Dictionary record;
+        AccountRecord record;
         EXPECT_TRUE(__VeltoIDDBCopyVeltoIDAccount(name, &record));
-        return record;
+        return record.values();
     }
 
     static void create(const char* name = kName, const char* password = nullptr,
@@ -30,7 +30,7 @@ class AccountsTest : public DatabaseTest {
     }
 
     static void setValues(const char* name, const Dictionary& values) {
-        ASSERT_TRUE(__VeltoIDDBSetAccountValues(name, values, false));
+        ASSERT_TRUE(__VeltoIDDBSetAccountValues(name, values, Notify::No));
     }
 };
 
@@ -78,7 +78,7 @@ TEST_F(AccountsTest, ThePasswordGoesToTheKeychainOnce) {
 
     create(kName, "hash two");
     EXPECT_EQ(record().data("HashedPasswordRef"), reference);
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword(record()), "hash two");
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, record()}), "hash two");
     EXPECT_FALSE(log_.contains("hash one") || log_.contains("hash two"));
 }
 
@@ -156,7 +156,7 @@ TEST_F(AccountsTest, ErrorsOfLookUps) {
         EXPECT_EQ(error->userInfo[kErrorRecoverySuggestionKey], Value("?"));
         EXPECT_EQ(error->userInfo["function"], Value("__VeltoIDDBCopyVeltoIDForDSID"));
     }
-    EXPECT_FALSE(__VeltoIDDBSetAccountValues("x", {{"a", "b"}}, true));
+    EXPECT_FALSE(__VeltoIDDBSetAccountValues("x", {{"a", "b"}}, Notify::Yes));
     EXPECT_FALSE(__VeltoIDDBRemovePassword("x"));
     EXPECT_FALSE(__VeltoIDDBRemovePassword(nullptr));
     EXPECT_TRUE(__VeltoIDDBCopyAccountValue("x", "a").isAbsent());
@@ -174,8 +174,8 @@ TEST_F(AccountsTest, FindsAccounts) {
     setValues("wrong dsid", {{"encDsId", number(3)}});
 
     const auto first = [](bool password, bool dsid) {
-        const auto found = __VeltoIDDBCopyFirstVeltoIDAccount(password, dsid);
-        return found ? found->string("VeltoID").text() : "none";
+        const auto found = __VeltoIDDBCopyFirstVeltoIDAccount({password, dsid});
+        return found ? found->accountName().text() : "none";
     };
     EXPECT_EQ(first(false, false), "nothing");
     EXPECT_EQ(first(true, false), "own hash");
@@ -229,7 +229,8 @@ TEST_F(AccountsTest, SettingValues) {
         double changedAt = 0;
         EXPECT_EQ(effectsOf([&] {
                       changedAt = now();
-                      EXPECT_TRUE(__VeltoIDDBSetAccountValues(kName, each.values, each.signal));
+                      EXPECT_TRUE(__VeltoIDDBSetAccountValues(kName, each.values,
+                                                              each.signal ? Notify::Yes : Notify::No));
                   }),
                   each.effects)
             << each.what;
@@ -238,18 +239,18 @@ TEST_F(AccountsTest, SettingValues) {
         EXPECT_EQ(record()["Dirty"], each.dirty) << each.what;
         EXPECT_EQ(record()["ModificationDate"], changed ? Value::date(changedAt) : modified) << each.what;
     }
-    EXPECT_FALSE(__VeltoIDDBSetAccountValues(kName, {}, true));
-    EXPECT_FALSE(__VeltoIDDBSetAccountValues(nullptr, {{"k", "v"}}, true));
+    EXPECT_FALSE(__VeltoIDDBSetAccountValues(kName, {}, Notify::Yes));
+    EXPECT_FALSE(__VeltoIDDBSetAccountValues(nullptr, {{"k", "v"}}, Notify::Yes));
 }
 
 TEST_F(AccountsTest, SettingOneValue) {
     create();
-    EXPECT_EQ(effectsOf([] { EXPECT_TRUE(__VeltoIDDBSetAccountValue(kName, "k", "v", true)); }),
+    EXPECT_EQ(effectsOf([] { EXPECT_TRUE(__VeltoIDDBSetAccountValue(kName, "k", "v", Notify::Yes)); }),
               "written, signalled");
     EXPECT_EQ(__VeltoIDDBCopyAccountValue(kName, "k"), Value("v"));
-    EXPECT_TRUE(__VeltoIDDBSetAccountValue(kName, "k", {}, false));
+    EXPECT_TRUE(__VeltoIDDBSetAccountValue(kName, "k", {}, Notify::No));
     EXPECT_TRUE(__VeltoIDDBCopyAccountValue(kName, "k").isAbsent());
-    EXPECT_FALSE(__VeltoIDDBSetAccountValue(kName, nullptr, "v", true));
+    EXPECT_FALSE(__VeltoIDDBSetAccountValue(kName, nullptr, "v", Notify::Yes));
     EXPECT_TRUE(__VeltoIDDBCopyAccountValue(kName, nullptr).isAbsent());
     EXPECT_TRUE(__VeltoIDDBCopyAccountValue(nullptr, "k").isAbsent());
 }
@@ -258,14 +259,17 @@ TEST_F(AccountsTest, ThePasswordOfARecord) {
     create(kName, "from keychain");
     const Data reference = record().data("HashedPasswordRef");
     const Data unknown(std::vector<uint8_t>(16, 7));
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({{"HashedPasswordRef", reference}, {"HashedPassword", "own"}}),
-              "from keychain");
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({{"HashedPasswordRef", unknown}, {"HashedPassword", "own"}}),
-              "own");
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({{"HashedPasswordRef", "text"}, {"HashedPassword", "own"}}),
-              "own");
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({{"HashedPasswordRef", unknown}}), String());
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({{"HashedPassword", number(1)}}), String());
+    EXPECT_EQ(
+        __VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", reference}, {"HashedPassword", "own"}}}),
+        "from keychain");
+    EXPECT_EQ(
+        __VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", unknown}, {"HashedPassword", "own"}}}),
+        "own");
+    EXPECT_EQ(
+        __VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", "text"}, {"HashedPassword", "own"}}}),
+        "own");
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", unknown}}}), String());
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, {{"HashedPassword", number(1)}}}), String());
 }
 
 TEST_F(AccountsTest, RemovingThePassword) {
@@ -290,19 +294,21 @@ TEST_F(AccountsTest, DirtyAccounts) {
     ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
     setValues("b", {{"Dirty", flag(false)}});
     setValues("c", {{"Dirty", "true"}});
-    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(false, true), Array{"a"});
-    EXPECT_EQ(effectsOf([] { EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(true, false), Array{"a"}); }), "")
+    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::Keep), Array{"a"});
+    EXPECT_EQ(
+        effectsOf([] { EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearOfAccounts), Array{"a"}); }),
+        "")
         << "in memory only, until the section is next written";
-    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(true, false), std::nullopt);
+    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearOfAccounts), std::nullopt);
     EXPECT_FALSE(record("b").contains("Dirty") || record("c").contains("Dirty"));
-    Dictionary entry;
+    CertificateEntry entry;
     ASSERT_TRUE(__VeltoIDDBCopyCertificateInfo("d", &entry));
-    EXPECT_TRUE(entry.contains("Dirty"));
-    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(true, true), std::nullopt);
+    EXPECT_TRUE(entry.isDirty());
+    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll), std::nullopt);
     ASSERT_TRUE(__VeltoIDDBCopyCertificateInfo("d", &entry));
-    EXPECT_FALSE(entry.contains("Dirty"));
+    EXPECT_FALSE(entry.isDirty());
     setValues("a", {{"x", "y"}});
-    ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "x", "y", false));
+    ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "x", "y", Notify::No));
 }
 
 TEST_F(AccountsTest, CertificateStateOfAnAccount) {

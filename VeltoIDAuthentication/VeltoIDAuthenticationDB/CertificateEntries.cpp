@@ -9,15 +9,6 @@ namespace {
 
 using database::Store;
 
-Value now() { return Value::date(platform::Clock::shared().now()); }
-
-/// Stores the entry and writes the section.
-bool storeEntry(Store& store, const String& encDsId, const Dictionary& entry, bool signal) {
-    Dictionary certificates = store.certificates;
-    certificates.set(encDsId, entry);
-    return store.replace(&Store::certificates, std::move(certificates), signal);
-}
-
 /// Copies the info's value when there is one, else removes the entry's.
 void copyOrRemove(Dictionary& entry, std::string_view key, const Value& value) {
     if (value.isAbsent()) {
@@ -46,7 +37,7 @@ bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
         return names;
     });
     if (!loaded) {
-        fillError(error, Error{String(kIdentityErrorDomain), identity_error::kNoCertificateForAccount, {}});
+        fillError(error, identityError(identity_error::kNoCertificateForAccount));
         return false;
     }
     if (keys != nullptr) *keys = std::move(all);
@@ -57,7 +48,10 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
     if (!encDsId) return false;
     return database::perform([&](Store& store) {
         const Dictionary* existing = Store::find(store.certificates, encDsId);
-        Dictionary entry = existing != nullptr ? *existing : Dictionary{{"CreationDate", now()}};
+        Dictionary entry =
+            existing != nullptr
+                ? *existing
+                : Dictionary{{kVeltoIDCertificateCreationDateKey, Value::date(platform::now())}};
         if (info) {
             entry.set(kVeltoIDAccountDSIDKey, encDsId);
             applyInfo(entry, *info);
@@ -65,13 +59,13 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
             entry = Dictionary();
         }
         entry.set(kVeltoIDDirtyKey, Value::boolean(true));
-        entry.set("ModificationDate", now());
-        return storeEntry(store, encDsId, entry, true);
+        entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));
+        return store.set(&Store::certificates, encDsId, entry, Notify::Yes);
     });
 }
 
 bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
-                                    bool signal) {
+                                    Notify notify) {
     if (!encDsId || !key) return false;
     return database::perform([&](Store& store) {
         const Dictionary* existing = Store::find(store.certificates, encDsId);
@@ -82,16 +76,18 @@ bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, co
         copyOrRemove(entry, key.view(), removes ? Value() : value);
 
         const bool isMark = key.view() == kVeltoIDDirtyKey;
-        entry.set("ModificationDate", now());
-        if (signal && !isMark) entry.set(kVeltoIDDirtyKey, Value::boolean(true));
-        return storeEntry(store, encDsId, entry, signal && !isMark && key.view() != "ModificationDate");
+        entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));
+        if (isMark) notify = Notify::No;
+        if (notify == Notify::Yes) entry.set(kVeltoIDDirtyKey, Value::boolean(true));
+        if (key.view() == kVeltoIDCertificateModificationDateKey) notify = Notify::No;
+        return store.set(&Store::certificates, encDsId, entry, notify);
     });
 }
 
-bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, Dictionary* entry) {
+bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* entry) {
     return database::perform([&](const Store& store) {
         const Dictionary* found = Store::find(store.certificates, encDsId);
-        if (found != nullptr && entry != nullptr) *entry = *found;
+        if (found != nullptr && entry != nullptr) *entry = CertificateEntry(encDsId, *found);
         return found != nullptr;
     });
 }
@@ -100,16 +96,15 @@ bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {
     return database::perform([&](Store& store) {
         Dictionary certificates = store.certificates;
         return encDsId && certificates.remove(encDsId.view()) &&
-               store.replace(&Store::certificates, std::move(certificates), true);
+               store.replace(&Store::certificates, std::move(certificates), Notify::Yes);
     });
 }
 
 bool hasValidCertificateEntry(const String& encDsId) {
-    Dictionary entry;
-    if (!encDsId || !__VeltoIDDBCopyCertificateInfo(encDsId, &entry)) return false;
-    if (entry.string(kVeltoIDCertificateStatusKey).view() != kVeltoIDCertificateStatusIssued) return false;
-    const std::optional<double> expires = entry.date(kVeltoIDCertificateExpirationDateKey);
-    return !expires || *expires > platform::Clock::shared().now() - kVeltoIDCertificateExpirationGrace;
+    CertificateEntry entry;
+    if (!__VeltoIDDBCopyCertificateInfo(encDsId, &entry) || !entry.isIssued()) return false;
+    const auto expires = entry.expires();
+    return !expires || *expires > platform::now() - kVeltoIDCertificateExpirationGrace;
 }
 
 }  // namespace veltoid

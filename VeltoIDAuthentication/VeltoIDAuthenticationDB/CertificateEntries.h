@@ -6,6 +6,8 @@
 
 #include "Values/Error.h"
 #include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/CertificateEntry.h"
+#include "VeltoIDAuthenticationDB/Notify.h"
 
 namespace veltoid {
 
@@ -16,17 +18,17 @@ inline constexpr double kVeltoIDCertificateExpirationGrace = 86'400;
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error = nullptr);
 
 /// Creates or updates the entry from the server's certificate result ("CertificateReference", "Expires",
-/// "CertStatus", "SerialNumber"); without one the entry is emptied. Marks it dirty and writes with signal.
+/// "CertStatus", "SerialNumber"); without one the entry is emptied. Marks it dirty, writes and notifies.
 /// False without encDsId.
 bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Dictionary>& info);
 
-/// Sets one value, an absent or Null one removing it; a change stamps "ModificationDate", with `signal` marks
-/// the entry dirty, and is written. False without encDsId, key or entry.
+/// Sets one value, an absent or Null one removing it; a change stamps "ModificationDate", marks the entry
+/// dirty when it notifies, and is written. False without encDsId, key or entry.
 bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
-                                    bool signal);
+                                    Notify notify);
 
 /// True and a copy of the entry when there is one.
-bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, Dictionary* entry);
+bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* entry);
 
 /// True when an entry was removed.
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId);

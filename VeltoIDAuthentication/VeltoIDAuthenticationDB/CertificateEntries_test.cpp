@@ -9,9 +9,9 @@ namespace {
 class CertificatesTest : public DatabaseTest {
   protected:
     static Dictionary entry(const char* encDsId = "d") {
-        Dictionary entry;
+        CertificateEntry entry;
         EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo(encDsId, &entry));
-        return entry;
+        return entry.values();
     }
 };
 
@@ -36,7 +36,7 @@ TEST_F(CertificatesTest, AnEntryTakesWhatTheResultHolds) {
                                    {"SerialNumber", "7"},
                                    {"Dirty", flag(true)},
                                    {"ModificationDate", Value::date(created + kVeltoIDDBFlushDelay)}}));
-    ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "CertType", "stays", false));
+    ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "CertType", "stays", Notify::No));
     const double updated = now();
     EXPECT_TRUE(__VeltoIDDBSetCertificateInfo(
         "d", Dictionary{
@@ -74,14 +74,15 @@ TEST_F(CertificatesTest, SettingAValue) {
     };
     for (const Case& each : cases) {
         ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
-        ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", "a", false));
-        ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "Dirty", {}, false));
+        ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", "a", Notify::No));
+        ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "Dirty", {}, Notify::No));
         const Value modified = entry()["ModificationDate"];
         double changedAt = 0;
         clock_.advanceBy(10);
         EXPECT_EQ(effectsOf([&] {
                       changedAt = now();
-                      EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", each.key, each.value, each.signal));
+                      EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", each.key, each.value,
+                                                                 each.signal ? Notify::Yes : Notify::No));
                   }),
                   each.effects)
             << each.what;
@@ -90,11 +91,11 @@ TEST_F(CertificatesTest, SettingAValue) {
                   std::string_view(each.effects).empty() ? modified : Value::date(changedAt))
             << each.what;
     }
-    EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", Value::null(), false));
+    EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", Value::null(), Notify::No));
     EXPECT_FALSE(entry().contains("k"));
-    EXPECT_FALSE(__VeltoIDDBSetCertificateValue("e", "k", "a", true));
-    EXPECT_FALSE(__VeltoIDDBSetCertificateValue(nullptr, "k", "a", true));
-    EXPECT_FALSE(__VeltoIDDBSetCertificateValue("d", nullptr, "a", true));
+    EXPECT_FALSE(__VeltoIDDBSetCertificateValue("e", "k", "a", Notify::Yes));
+    EXPECT_FALSE(__VeltoIDDBSetCertificateValue(nullptr, "k", "a", Notify::Yes));
+    EXPECT_FALSE(__VeltoIDDBSetCertificateValue("d", nullptr, "a", Notify::Yes));
 }
 
 TEST_F(CertificatesTest, KeysAndRemoval) {

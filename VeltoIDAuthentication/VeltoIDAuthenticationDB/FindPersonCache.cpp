@@ -142,7 +142,7 @@ FindPersonCache& cache() { return platform::Lifetime::current().state<FindPerson
 void FindPersonCache::add(const Array& results) {
     const std::lock_guard lock(mutex_);
     seed();
-    const Value now = Value::date(platform::Clock::shared().now());
+    const Value now = Value::date(platform::now());
     for (const Value& result : results) {
         if (!result.isDictionary()) continue;
         Dictionary person = *result.asDictionary();
@@ -158,7 +158,7 @@ void FindPersonCache::add(const Array& results) {
 Array FindPersonCache::find(const Dictionary& criteria) {
     const std::lock_guard lock(mutex_);
     seed();
-    const double now = platform::Clock::shared().now();
+    const double now = platform::now();
     Array found;
     for (const auto& [criterion, wanted] : criteria) {
         const Array* values = wanted.asArray();
@@ -220,7 +220,7 @@ void FindPersonCache::drop(Entries::iterator entry) {
 }
 
 void FindPersonCache::dropEnded() {
-    const double now = platform::Clock::shared().now();
+    const double now = platform::now();
     for (auto entry = entries_.begin(); entry != entries_.end();) {
         const auto current = entry++;
         if (current->hasEndedBy(now)) drop(current);

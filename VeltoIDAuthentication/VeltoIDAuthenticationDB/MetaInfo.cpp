@@ -1,5 +1,8 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 
+#include <cmath>
+#include <limits>
+
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
@@ -58,7 +61,7 @@ bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const
         } else {
             changed = change(metaInfo, key, value);
         }
-        return !changed || store.replace(&Store::metaInfo, std::move(metaInfo), false);
+        return !changed || store.replace(&Store::metaInfo, std::move(metaInfo), Notify::No);
     });
 }
 
@@ -70,6 +73,17 @@ int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Diction
                                           static_cast<uint64_t>(delta));
     __VeltoIDDBSetMetaInfoValue(section, key, Value::int64(sum));
     return sum;
+}
+
+double metaInterval(const String& section, const Dictionary& options, std::string_view key,
+                    double defaultValue, UnreadableInterval unreadable) {
+    const bool isZero = unreadable == UnreadableInterval::Zero;
+    const Value stored = __VeltoIDDBCopyMetaInfoValue(
+        section, options, key, isZero ? std::nullopt : std::optional(Value::Kind::Number));
+    if (stored.isAbsent()) return defaultValue;
+    const double seconds = stored.asDouble().value_or(std::numeric_limits<double>::quiet_NaN());
+    if (std::isfinite(seconds)) return seconds;
+    return isZero ? 0 : defaultValue;
 }
 
 std::optional<Dictionary> __VeltoIDDBCopyMetaInformation(const String& section, const Dictionary& options) {

@@ -1,6 +1,6 @@
 // Meta information: device-wide values, intervals and switches from the server, counters, and per-account
 // sections of the same keys. Look-ups fall back to built-in defaults. Bodies run on the database queue;
-// writes never signal.
+// writes never notify.
 #pragma once
 
 #include <optional>
@@ -31,6 +31,14 @@ bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const
 /// key.
 int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options,
                                             const String& key, int64_t delta);
+
+/// What an interval counts as that is set to something other than a number.
+enum class UnreadableInterval { Default, Zero };
+
+/// The Number of seconds under `key`, looked up as above; the default when there is none. One that is not
+/// finite counts as something other than a number.
+double metaInterval(const String& section, const Dictionary& options, std::string_view key,
+                    double defaultValue, UnreadableInterval unreadable = UnreadableInterval::Default);
 
 /// The reportable meta information that has values; none when none has.
 std::optional<Dictionary> __VeltoIDDBCopyMetaInformation(const String& section, const Dictionary& options);

@@ -10,6 +10,7 @@
 #include "Values/Digest.h"
 #include "Values/ValueStream.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/Migration.h"
 
 namespace veltoid {
 namespace database {
@@ -31,12 +32,6 @@ namespace {
 
 StoreState& state() { return platform::Lifetime::current().state<StoreState>(); }
 Store& store() { return state().store; }
-
-// Agents up to these accessor versions left something behind that the load puts right.
-constexpr double kLastWithCertificatesInRecords = 478;
-constexpr double kLastWithVersionsInMetaInfo = 481;
-constexpr double kLastWithoutUserUUID = 508;
-constexpr double kLastWithCertificateLists = 617;
 
 using ReadResult = platform::Preferences::ReadResult;
 
@@ -91,7 +86,7 @@ bool keepOrInitialize(const platform::Preferences& domain) {
     if (isUsableVersion(version.value)) return true;
     const auto current = preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion));
     if (version.result == ReadResult::Damaged) return domain.set({current});
-    const Value now = Value::date(platform::Clock::shared().now());
+    const Value now = Value::date(platform::now());
     return domain.remove(domain.keys()) &&
            domain.set({current, preference(kVeltoIDDBCreationDateKey, now)}) && domain.synchronize();
 }
@@ -100,25 +95,6 @@ bool keepOrInitialize(const platform::Preferences& domain) {
 std::string_view keyOf(Dictionary Store::*section) {
     if (section == &Store::accounts) return kVeltoIDDBAccountsKey;
     return section == &Store::certificates ? kVeltoIDDBCertificatesKey : kVeltoIDDBMetaInfoKey;
-}
-
-/// Changes every record of the accounts by `change(name, record)`.
-template <typename Change>
-void changeEveryRecord(Dictionary& accounts, Change change) {
-    const Dictionary before = accounts;
-    for (const auto& [name, value] : before) {
-        Dictionary record = *value.asDictionary();
-        change(name, record);
-        accounts.set(name, record);
-    }
-}
-
-/// Numbers in descending order, before everything else.
-bool descendingNumbers(const Value& a, const Value& b) {
-    const std::optional<double> x = a.asDouble();
-    const std::optional<double> y = b.asDouble();
-    if (x && y) return *x > *y;
-    return x.has_value() && !y.has_value();
 }
 
 }  // namespace
@@ -164,52 +140,14 @@ bool Store::load() {
     loaded_ = true;
     const Array* stored = storedVersions.value.asArray();
     Array versions = stored != nullptr ? *stored : Array();
-    const bool migrated = migrate(domain, versions);
-    const bool recorded = recordAccessor(domain, versions);
-    if (migrated || recorded) writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
-    return true;
-}
-
-/// Puts right what the agents named in "AccessorVersions" left. True when something has to be written; the
-/// versions are cut where they were cut in the domain.
-bool Store::migrate(const platform::Preferences& domain, Array& versions) {
-    std::vector<Value> sorted(versions.begin(), versions.end());
-    std::stable_sort(sorted.begin(), sorted.end(), descendingNumbers);
-
-    bool changed = false;
-    for (size_t i = 0; i < sorted.size(); ++i) {
-        const double version = sorted[i].asDouble().value_or(0);
-        if (!(version > 0)) continue;
-        if (version <= kLastWithCertificatesInRecords) {
-            changeEveryRecord(accounts, [](const String&, Dictionary& record) {
-                record.set(kVeltoIDDirtyKey, Value::boolean(true));
-                record.remove("Certificate");
-                record.remove("PrivateKey");
-            });
-            sorted.resize(i + 1);
-            versions = Array();
-            for (const Value& kept : sorted) versions.append(kept);
-            domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
-            domain.synchronize();
-        } else if (version <= kLastWithVersionsInMetaInfo) {
-            metaInfo.remove(kVeltoIDDBAccessorVersionsKey);
-        } else if (version <= kLastWithoutUserUUID) {
-            changed = addUserUUID() || changed;
-        } else if (version <= kLastWithCertificateLists) {
-            changeEveryRecord(accounts,
-                              [](const String&, Dictionary& record) { record.remove("Certificates"); });
-        }
+    const MigrationOutcome migrated = migrate(accounts, metaInfo, versions);
+    if (migrated.versionsCut) {
+        domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
+        domain.synchronize();
     }
-    return changed;
-}
-
-/// Gives the device its identifier, and every account the one derived from it. False when the device has one.
-bool Store::addUserUUID() {
-    if (metaInfo.contains(kVeltoIDMetaUserUUIDKey)) return false;
-    metaInfo.set(kVeltoIDMetaUserUUIDKey, randomUUIDText());
-    changeEveryRecord(accounts, [this](const String& name, Dictionary& record) {
-        deriveAccountUUIDs(name, record, metaInfo);
-    });
+    const bool recorded = recordAccessor(domain, versions);
+    if (migrated.sectionsChanged || recorded)
+        writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
     return true;
 }
 
@@ -223,14 +161,20 @@ bool Store::recordAccessor(const platform::Preferences& domain, Array versions) 
     return true;
 }
 
-bool Store::replace(Dictionary Store::*section, Dictionary changed, bool signal) {
+bool Store::set(Dictionary Store::*section, const String& key, const Dictionary& entry, Notify notify) {
+    Dictionary changed = this->*section;
+    changed.set(key, entry);
+    return replace(section, std::move(changed), notify);
+}
+
+bool Store::replace(Dictionary Store::*section, Dictionary changed, Notify notify) {
     if (!isLoaded()) return false;
     std::swap(this->*section, changed);
     if (!writeSections({section})) {
         std::swap(this->*section, changed);
         return false;
     }
-    if (signal && changeSemaphore_) changeSemaphore_->signal();
+    if (notify == Notify::Yes && changeSemaphore_) changeSemaphore_->signal();
     return true;
 }
 
@@ -295,9 +239,9 @@ bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {
             for (const std::string& key : domain.keys())
                 all.set(String(key), database::readPreference(domain, key).value);
         } else {
-            all = {{"Accounts", store.accounts},
-                   {"Certificates", store.certificates},
-                   {"MetaInfo", store.metaInfo}};
+            all = {{kVeltoIDDBAccountsKey, store.accounts},
+                   {kVeltoIDDBUnstoredCertificatesKey, store.certificates},
+                   {kVeltoIDDBMetaInfoKey, store.metaInfo}};
         }
         return all;
     });

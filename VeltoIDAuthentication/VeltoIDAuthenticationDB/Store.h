@@ -18,6 +18,7 @@
 #include "Platform/storage/Preferences.h"
 #include "Values/Error.h"
 #include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/Notify.h"
 
 namespace veltoid {
 
@@ -63,7 +64,10 @@ class Store {
 
     /// Replaces one section by a changed one, hands it to the preference store, plans the flush, and signals
     /// the change semaphore if asked. False, with the section as it was, when it cannot be stored.
-    bool replace(Dictionary Store::*section, Dictionary changed, bool signal);
+    bool replace(Dictionary Store::*section, Dictionary changed, Notify notify);
+
+    /// The same with one entry of the section set.
+    bool set(Dictionary Store::*section, const String& key, const Dictionary& entry, Notify notify);
 
   private:
     friend void veltoid::__VeltoIDDBSetPreferencesDomainName(const String& name);
@@ -77,8 +81,6 @@ class Store {
     platform::Preferences preferences() const;
     bool load();
     bool writeSections(std::initializer_list<Dictionary Store::*> sections);
-    bool migrate(const platform::Preferences& domain, Array& versions);
-    bool addUserUUID();
     bool recordAccessor(const platform::Preferences& domain, Array versions);
     void planFlush();
     void synchronize();

@@ -22,9 +22,9 @@ Array accountNames() {
 }
 
 Dictionary account(const char* name) {
-    Dictionary record;
+    AccountRecord record;
     EXPECT_TRUE(__VeltoIDDBCopyVeltoIDAccount(name, &record));
-    return record;
+    return record.values();
 }
 
 /// An account's record in a copy of the domain.
@@ -199,7 +199,7 @@ TEST_F(StoreTest, SectionsOfTheWrongFormLoadAsFarAsTheyAreRight) {
 TEST_F(StoreTest, WritesAreFlushedTogetherAndKeepTheAgentAliveUntilThen) {
     ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("a", nullptr, nullptr));
     const auto write = [&](int64_t value) {
-        EXPECT_TRUE(__VeltoIDDBSetAccountValue("a", "n", number(value), false));
+        EXPECT_TRUE(__VeltoIDDBSetAccountValue("a", "n", number(value), Notify::No));
         EXPECT_EQ(recordIn(storedDomain(), "a")["n"], number(value))
             << "a change survives the process at once";
     };
@@ -237,8 +237,8 @@ TEST_F(StoreTest, OnlyTheChangedSectionIsWritten) {
         std::function<void()> change;
     };
     const Case cases[] = {
-        {"Accounts", [] { __VeltoIDDBSetAccountValue("a", "x", "1", false); }},
-        {"AuthCertificates", [] { __VeltoIDDBSetCertificateValue("d", "x", "1", false); }},
+        {"Accounts", [] { __VeltoIDDBSetAccountValue("a", "x", "1", Notify::No); }},
+        {"AuthCertificates", [] { __VeltoIDDBSetCertificateValue("d", "x", "1", Notify::No); }},
         {"MetaInfo", [] { __VeltoIDDBSetMetaInfoValue(nullptr, "x", "1"); }},
     };
     for (const Case& each : cases) {
@@ -254,13 +254,14 @@ TEST_F(StoreTest, OnlyTheChangedSectionIsWritten) {
 TEST_F(StoreTest, ALaterProcessReadsWhatAKilledOneHadInMemory) {
     ASSERT_TRUE(platform::ChildProcess([] {
                     return __VeltoIDDBCreateVeltoIDAccount("a@b", "hash", "d") &&
-                           __VeltoIDDBSetAccountValue("a@b", "ValidatedEmail", Array{"a@b", "ä@b"}, true) &&
+                           __VeltoIDDBSetAccountValue("a@b", "ValidatedEmail", Array{"a@b", "ä@b"},
+                                                      Notify::Yes) &&
                            __VeltoIDDBSetCertificateInfo("d", Dictionary{{"CertStatus", "CERT_ISSUED"}}) &&
                            __VeltoIDDBSetMetaInfoValue("a@b", "Count", number(7));
                 }).succeeded());
     const Dictionary record = account("a@b");
     EXPECT_EQ(record["ValidatedEmail"], (Array{"a@b", "ä@b"}));
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword(record), "hash");
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({"a@b", record}), "hash");
     EXPECT_TRUE(__VeltoIDDBHasValidCertificate("a@b"));
     EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue("a@b", {}, "Count"), number(7));
     EXPECT_EQ(openCount(), 0) << "reading back changes nothing";
@@ -299,13 +300,13 @@ TEST_F(StoreTest, WithoutPreferencesEverythingStaysInMemory) {
 
 TEST_F(StoreTest, SwitchingPreferencesOffWritesEverythingFirst) {
     ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("a", nullptr, nullptr));
-    ASSERT_TRUE(__VeltoIDDBCopyDirtyVeltoIDs(true, false)) << "marks go in memory only";
+    ASSERT_TRUE(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearOfAccounts)) << "marks go in memory only";
     const auto storedMark = [] { return recordIn(storedDomain(), "a").contains("Dirty"); };
     EXPECT_TRUE(storedMark());
     __VeltoIDDBSetUsePreferences(false);
     EXPECT_FALSE(storedMark());
     EXPECT_EQ(takeSignals(), 1) << "only the creation is a change";
-    ASSERT_TRUE(__VeltoIDDBSetAccountValue("a", "x", "memory", true));
+    ASSERT_TRUE(__VeltoIDDBSetAccountValue("a", "x", "memory", Notify::Yes));
     EXPECT_EQ(takeSignals(), 1);
     EXPECT_FALSE(recordIn(storedDomain(), "a").contains("x"));
     doNotCompareWithDisk();
@@ -340,7 +341,7 @@ TEST_F(StoreTest, AStoreThatCannotBeReadIsNeverOverwritten) {
 
     EXPECT_EQ(accountNames(), Array{"kept"}) << "readable again, without a restart";
     EXPECT_TRUE(__VeltoIDDBCopyMetaInfoValue(nullptr, {}, "lost").isAbsent());
-    EXPECT_TRUE(__VeltoIDDBSetAccountValue("kept", "x", "y", true));
+    EXPECT_TRUE(__VeltoIDDBSetAccountValue("kept", "x", "y", Notify::Yes));
 }
 
 TEST_F(StoreTest, WhatCannotBeStoredIsNotKeptInMemoryEither) {
@@ -350,13 +351,13 @@ TEST_F(StoreTest, WhatCannotBeStoredIsNotKeptInMemoryEither) {
     Value tooDeep = Array();
     for (int depth = 0; depth < 1000; ++depth) tooDeep = Array{tooDeep};
     EXPECT_EQ(effectsOf([&] {
-                  EXPECT_FALSE(__VeltoIDDBSetAccountValue("a", "x", tooDeep, true));
-                  EXPECT_FALSE(__VeltoIDDBSetCertificateValue("d", "x", tooDeep, true));
+                  EXPECT_FALSE(__VeltoIDDBSetAccountValue("a", "x", tooDeep, Notify::Yes));
+                  EXPECT_FALSE(__VeltoIDDBSetCertificateValue("d", "x", tooDeep, Notify::Yes));
                   EXPECT_FALSE(__VeltoIDDBSetMetaInfoValue("a", "x", tooDeep));
               }),
               "");
     EXPECT_EQ(account("a"), before);
-    EXPECT_TRUE(__VeltoIDDBSetAccountValue("a", "x", "y", true)) << "and harms nothing later";
+    EXPECT_TRUE(__VeltoIDDBSetAccountValue("a", "x", "y", Notify::Yes)) << "and harms nothing later";
 }
 
 TEST_F(StoreTest, ConcurrentFirstCallersShareOneLoad) {
@@ -366,7 +367,7 @@ TEST_F(StoreTest, ConcurrentFirstCallersShareOneLoad) {
             const std::string name = "account" + std::to_string(i);
             EXPECT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, nullptr, nullptr));
             for (int round = 0; round < 20; ++round) {
-                EXPECT_TRUE(__VeltoIDDBSetAccountValue(name, "round", number(round), true));
+                EXPECT_TRUE(__VeltoIDDBSetAccountValue(name, "round", number(round), Notify::Yes));
                 EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter(name, {}, "rounds", 1), round + 1);
                 EXPECT_TRUE(__VeltoIDDBSynchronize());
             }

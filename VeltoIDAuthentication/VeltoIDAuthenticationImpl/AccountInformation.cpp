@@ -8,15 +8,17 @@
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/MessageKeys.h"
 #include "Protocol/Names.h"
+#include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DateText.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
+#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -25,7 +27,9 @@ namespace {
 /// Share of a validation record's suggested duration after which it is looked at again.
 constexpr double kRecordCheckShare = 0.75;
 
-double now() { return platform::Clock::shared().now(); }
+// Keys of the signed record.
+constexpr std::string_view kValidAsOfKey = "ValidAsOf";
+constexpr std::string_view kSuggestedDurationKey = "SuggestValidDuration";
 
 std::optional<double> finiteNumber(const Dictionary& dictionary, std::string_view key) {
     const auto number = dictionary.number(key);
@@ -37,96 +41,92 @@ class InformationRequest {
   public:
     InformationRequest(const String& requestedName, const Dictionary& options) : options_(options) {
         known_ = copyRecord(requestedName);
-        name_ = known_ ? record_.string(kVeltoIDAccountNameKey) : requestedName;
-        if (!name_) name_ = requestedName;
-        encDsId_ = record_.string(kVeltoIDAccountDSIDKey);
+        name_ = known_ ? record_.accountName() : requestedName;
+        encDsId_ = record_.encDsId();
     }
 
     bool run() {
         const bool fresh = isFresh();
-        if (option("SkipValidation")) return fresh && isComplete();
-        if (option("DeferValidation")) {
-            if (!isComplete()) return false;
+        if (isOn(option::kSkipValidation)) return fresh && record_.isComplete();
+        if (isOn(option::kDeferValidation)) {
+            if (!record_.isComplete()) return false;
             markForValidation();
             return true;
         }
-        const bool mustAsk = option("ForceValidationRecordFetch") ||
-                             option("ValidateCertificateSerialNumber") || option("ForceValidation");
-        if (mustAsk || !fresh || !isComplete()) return askServer(fresh);
+        const bool mustAsk = isOn(option::kForceValidationRecordFetch) ||
+                             isOn(option::kValidateCertificateSerialNumber) || isOn(option::kForceValidation);
+        if (mustAsk || !fresh || !record_.isComplete()) return askServer(fresh);
         return true;
     }
 
     Dictionary answer() const {
-        Dictionary entry;
-        if (encDsId_) __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
+        CertificateEntry entry;
+        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
+        const Dictionary& values = record_.values();
         Dictionary info;
-        info.set("VeltoID", name_);
-        info.set("encDsId", encDsId_);
+        info.set(message::kAccount, name_);
+        info.set(message::kEncDsId, encDsId_);
         for (const std::string_view key : {kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey})
-            info.set(key, record_.string(key));
-        if (const Array* all = record_.array(kVeltoIDAccountEmailAddressesKey)) info.set("AllEmails", *all);
+            info.set(key, values.string(key));
+        if (const Array* all = values.array(kVeltoIDAccountEmailAddressesKey))
+            info.set(message::kAllEmails, *all);
         for (const std::string_view key :
              {kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey})
-            if (const Array* items = record_.array(key)) info.set(key, *items);
-        if (const auto date = record_.date(kVeltoIDAccountLastValidationDateKey))
+            if (const Array* items = values.array(key)) info.set(key, *items);
+        if (const auto date = record_.lastValidation())
             info.set(kVeltoIDAccountLastValidationDateKey, Value::date(*date));
-        info.set("CertificatePEM", entry["CertificatePEM"]);
-        info.set("CertificateExpiration", entry[kVeltoIDCertificateExpirationDateKey]);
-        info.set("SerialNumber", entry[kVeltoIDCertificateSerialNumberKey]);
-        info.set("CertificateDate", entry["Date"]);
+        info.set(message::kCertificatePEM, entry.values()[kVeltoIDCertificatePEMKey]);
+        info.set(message::kCertificateExpiration, entry.values()[kVeltoIDCertificateExpirationDateKey]);
+        info.set(kVeltoIDCertificateSerialNumberKey, entry.values()[kVeltoIDCertificateSerialNumberKey]);
+        info.set(message::kCertificateDate, entry.values()[kVeltoIDCertificateDateKey]);
         return info;
     }
 
     const String& name() const { return name_; }
+    const String& sentPasswordHash() const { return password_; }
     const std::optional<Error>& error() const { return held_; }
 
   private:
-    bool option(std::string_view key) const { return getBool(&options_, key, false); }
+    bool isOn(std::string_view key) const { return getBool(&options_, key, false); }
 
     bool copyRecord(const String& requestedName) {
         if (requestedName) return __VeltoIDDBCopyVeltoIDAccount(requestedName, &record_, &held_);
-        auto first = __VeltoIDDBCopyFirstVeltoIDAccount(true, false);
+        auto first = __VeltoIDDBCopyFirstVeltoIDAccount({.password = true});
         if (first) record_ = std::move(*first);
         return first.has_value();
     }
 
     bool isFresh() const {
-        const Value stored = __VeltoIDDBCopyMetaInfoValue(
-            name_, options_, kVeltoIDMetaAccountPresumedValidIntervalKey, Value::Kind::Number);
-        const double presumed = stored.asDouble().value_or(kVeltoIDPresumedValidInterval);
+        const double presumed = metaInterval(name_, options_, kVeltoIDMetaAccountPresumedValidIntervalKey,
+                                             kVeltoIDPresumedValidInterval);
         double valid = presumed;
-        if (const auto own = record_.number(kVeltoIDAccountValidForIntervalKey))
-            valid = std::min(std::max(*own, kVeltoIDLeastValidInterval), presumed);
-        const auto validated = record_.date(kVeltoIDAccountLastValidationDateKey);
-        return validated && *validated <= now() && now() <= *validated + valid;
-    }
-
-    bool isComplete() const {
-        return record_.contains(kVeltoIDAccountNameKey) && record_.contains(kVeltoIDAccountDSIDKey) &&
-               (record_.contains(kVeltoIDAccountValidatedEmailKey) ||
-                record_.contains(kVeltoIDAccountValidatedPhonesKey));
+        if (const auto own = record_.validForInterval())
+            valid = std::min(std::max(*own, kMinValidInterval), presumed);
+        const auto validated = record_.lastValidation();
+        return validated && *validated <= platform::now() && platform::now() <= *validated + valid;
     }
 
     /// The next account check validates the account.
     void markForValidation() const {
-        __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountForceValidationKey, Value::boolean(true), true);
-        if (!record_.contains(kVeltoIDAccountNextValidationDateKey))
-            __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountNextValidationDateKey, Value::date(now()), true);
+        __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountForceValidationKey, Value::boolean(true),
+                                   Notify::Yes);
+        if (!record_.values().contains(kVeltoIDAccountNextValidationDateKey))
+            __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountNextValidationDateKey,
+                                       Value::date(platform::now()), Notify::Yes);
     }
 
     bool askServer(bool fresh) {
         std::optional<Error> sessionError;
         encDsId_ = nullptr;
-        Session session = __VeltoIDSessionDoCreateSession(name_, __VeltoIDDBCopyHashedPassword(record_),
-                                                          options_, &encDsId_, nullptr, &sessionError);
+        password_ = __VeltoIDDBCopyHashedPassword(record_);
+        const Session session =
+            __VeltoIDSessionDoCreateSession(name_, password_, options_, &encDsId_, nullptr, &sessionError);
         if (!session) {
             if (sessionError) held_ = sessionError;
             if (known_ && !fresh) markForValidation();
             return known_;
         }
-        const bool answered = fetch(*session);
-        __VeltoIDSessionRelease(std::move(session));
-        return answered;
+        return fetch(*session);
     }
 
     bool fetch(VeltoIDAuthenticationSessionInfo& session) {
@@ -143,20 +143,22 @@ class InformationRequest {
 
     /// What the agent has already; an empty identifier makes the server send its record.
     Dictionary fetchParameters() const {
-        Dictionary entry;
-        if (encDsId_) __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
-        String identifier = record_.string(kVeltoIDAccountValidationRecordIdentifierKey);
-        const bool hasRecordData = record_.data(kVeltoIDAccountValidationRecordDataKey).size() > 0;
-        if (option("ForceValidationRecordFetch") || !identifier || !hasRecordData) identifier = "";
-        return {{kVeltoIDCertificateSerialNumberKey, entry.string(kVeltoIDCertificateSerialNumberKey)},
+        CertificateEntry entry;
+        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
+        String identifier = record_.validationRecordIdentifier();
+        if (isOn(option::kForceValidationRecordFetch) || !identifier ||
+            record_.validationRecordData().size() == 0)
+            identifier = "";
+        return {{kVeltoIDCertificateSerialNumberKey, entry.serialNumber()},
                 {kVeltoIDAccountValidationRecordIdentifierKey, identifier}};
     }
 
     const Dictionary& options_;
-    Dictionary record_;
+    AccountRecord record_;
     bool known_ = false;
     String name_;
     String encDsId_;
+    String password_;
     std::optional<Error> held_;
 };
 
@@ -167,7 +169,7 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
     const String encDsId = answer.string(kVeltoIDAccountDSIDKey);
     if (isValid.asBoolean().value_or(false)) {
         __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                       Value::date(now()), true);
+                                       Value::date(platform::now()), Notify::Yes);
         return;
     }
     VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice,
@@ -176,8 +178,9 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
                          << "as invalid because the server said CertificateIsValid = false. ("
                          << describeValue(isValid));
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
-                                   true);
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey, Value::date(now()), true);
+                                   Notify::Yes);
+    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey,
+                                   Value::date(platform::now()), Notify::Yes);
 }
 
 bool bothPresentAndDifferent(const Value& before, const Value& after) {
@@ -190,8 +193,8 @@ std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values)
     const Data content = verifyValidationRecord(signedRecord);
     const auto payload = content ? parseValidationRecordPayload(content) : std::nullopt;
     if (!payload) return std::nullopt;
-    const auto validAsOf = dateFromValue((*payload)["ValidAsOf"]);
-    const auto duration = finiteNumber(*payload, "SuggestValidDuration");
+    const auto validAsOf = dateFromValue((*payload)[kValidAsOfKey]);
+    const auto duration = finiteNumber(*payload, kSuggestedDurationKey);
     values.set(kVeltoIDAccountValidationRecordValidAsOfKey, validAsOf ? Value::date(*validAsOf) : Value());
     values.set(kVeltoIDAccountValidationRecordSuggestedValidIntervalKey,
                duration ? Value::real(*duration) : Value());
@@ -202,7 +205,7 @@ std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values)
 /// Record data is kept only with an identifier and a date at which it is looked at again, from the server or
 /// from the record itself; otherwise the stored one goes. True when the account has another record than
 /// before.
-bool applyValidationRecord(const Dictionary& before, const Dictionary& answer, Dictionary& values) {
+bool applyValidationRecord(const AccountRecord& before, const Dictionary& answer, Dictionary& values) {
     const String identifier = answer.string(kVeltoIDAccountValidationRecordIdentifierKey);
     const Data data = answer.data(kVeltoIDAccountValidationRecordDataKey);
     auto nextCheck = answer.date(kVeltoIDAccountValidationRecordNextCheckDateKey);
@@ -219,15 +222,15 @@ bool applyValidationRecord(const Dictionary& before, const Dictionary& answer, D
             values.set(kVeltoIDAccountValidationRecordNextCheckDateKey, Value::date(*nextCheck));
         }
     }
-    return bothPresentAndDifferent(before.string(kVeltoIDAccountValidationRecordIdentifierKey), identifier);
+    return bothPresentAndDifferent(before.validationRecordIdentifier(), identifier);
 }
 
-bool visibleDetailsChanged(const Dictionary& before, const Dictionary& values) {
+bool visibleDetailsChanged(const AccountRecord& before, const Dictionary& values) {
     constexpr std::string_view kVisibleKeys[] = {
         kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey, kVeltoIDAccountEmailAddressesKey,
         kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey};
     return std::any_of(std::begin(kVisibleKeys), std::end(kVisibleKeys), [&](std::string_view key) {
-        return bothPresentAndDifferent(before[key], values[key]);
+        return bothPresentAndDifferent(before.values()[key], values[key]);
     });
 }
 
@@ -237,22 +240,22 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
                           ErrorOut error) {
     InformationRequest request(accountName, options);
     if (request.run()) {
-        if (result != nullptr) *result = request.answer();
+        fill(result, request.answer());
         return true;
     }
-    handleServerError(request.name(), request.error());
+    handleServerError(request.name(), request.sentPasswordHash(), request.error());
     fillError(error, request.error() ? *request.error() : VELTOID_ERROR(identity_error::kUnknown));
     return false;
 }
 
 void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer) {
-    Dictionary before;
+    AccountRecord before;
     const bool existed = __VeltoIDDBCopyVeltoIDAccount(accountName, &before);
     Dictionary values = answer;
-    values.set(kVeltoIDAccountLastValidationDateKey, Value::date(now()));
+    values.set(kVeltoIDAccountLastValidationDateKey, Value::date(platform::now()));
     // Records keep the list of all addresses under their own name for it.
-    values.set(kVeltoIDAccountEmailAddressesKey, answer["AllEmails"]);
-    values.remove("AllEmails");
+    values.set(kVeltoIDAccountEmailAddressesKey, answer[message::kAllEmails]);
+    values.remove(message::kAllEmails);
     applyCertificateValidity(accountName, answer);
 
     bool notify = false;
@@ -262,7 +265,7 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
 
     values.set(kVeltoIDAccountForceValidationKey, Value::null());
     values.set(kVeltoIDAccountNextValidationDateKey, Value::null());
-    __VeltoIDDBSetAccountValues(accountName, values, true);
+    __VeltoIDDBSetAccountValues(accountName, values, Notify::Yes);
     if (notify) platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
 }
 
@@ -274,7 +277,7 @@ bool __VeltoIDCopyVeltoIDs(const Dictionary& /*options*/, Array* names, ErrorOut
         fillError(error, databaseError);
         return false;
     }
-    if (names != nullptr) *names = std::move(all);
+    fill(names, std::move(all));
     return true;
 }
 

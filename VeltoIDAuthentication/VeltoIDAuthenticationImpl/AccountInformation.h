@@ -11,7 +11,7 @@ namespace veltoid {
 /// How long account information counts as fresh (seconds), unless the meta information says otherwise.
 inline constexpr double kVeltoIDPresumedValidInterval = 28'800;
 /// The least that an account's own validity interval may be (seconds).
-inline constexpr double kVeltoIDLeastValidInterval = 60;
+inline constexpr double kMinValidInterval = 60;
 
 /// Answers the account's information (names, addresses, phones, certificate) from its record, asking the
 /// server first when an option says so or the information is not both fresh and complete. Name null: the

@@ -145,8 +145,8 @@ TEST_F(Information, AnswersWhatRecordAndCertificateEntryHold) {
     ASSERT_TRUE(get({}));
     EXPECT_EQ(info_, expected);
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"Expires", date(5)}, {"SerialNumber", "7"}});
-    __VeltoIDDBSetCertificateValue("d1", "CertificatePEM", "pem", false);
-    __VeltoIDDBSetCertificateValue("d1", "Date", date(1), false);
+    __VeltoIDDBSetCertificateValue("d1", "CertificatePEM", "pem", Notify::No);
+    __VeltoIDDBSetCertificateValue("d1", "Date", date(1), Notify::No);
     Dictionary withCertificate = expected;
     withCertificate.set("CertificatePEM", "pem");
     withCertificate.set("CertificateExpiration", date(5));

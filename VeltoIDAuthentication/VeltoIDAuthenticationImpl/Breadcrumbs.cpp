@@ -11,10 +11,9 @@ template <typename Call>
 bool withSession(const String& accountName, const String& hashedPassword, const Dictionary& options,
                  ErrorOut error, const Call& call) {
     std::optional<Error> held;
-    Session session =
+    const Session session =
         __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, nullptr, nullptr, &held);
     const bool succeeded = session && call(*session, &held);
-    __VeltoIDSessionRelease(std::move(session));
     if (!succeeded) fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
     return succeeded;
 }

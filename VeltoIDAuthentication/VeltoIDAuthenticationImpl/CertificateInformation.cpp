@@ -1,5 +1,6 @@
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 
+#include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
@@ -19,11 +20,11 @@ struct InformationEntry {
 constexpr InformationEntry kEntries[] = {
     {kVeltoIDAccountDSIDKey, Value::Kind::String},
     {kVeltoIDCertificateStatusKey, Value::Kind::String},
-    {"CertType", Value::Kind::String},
+    {kVeltoIDCertificateTypeKey, Value::Kind::String},
     {kVeltoIDCertificateSerialNumberKey, Value::Kind::String},
     {kVeltoIDCertificateExpirationDateKey, Value::Kind::Date},
-    {"CreationDate", Value::Kind::Date},
-    {"ModificationDate", Value::Kind::Date},
+    {kVeltoIDCertificateCreationDateKey, Value::Kind::Date},
+    {kVeltoIDCertificateModificationDateKey, Value::Kind::Date},
 };
 
 constexpr InformationEntry kReferences[] = {
@@ -55,7 +56,7 @@ String requestedEncDsId(const String& accountName, const String& encDsId) {
 bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
                                   Dictionary* information, ErrorOut error) {
     const String requested = requestedEncDsId(accountName, encDsId);
-    Dictionary entry;
+    CertificateEntry entry;
     if (!requested) {
         fillError(error, Error{String(kOSStatusErrorDomain), -1, {}});
         return false;
@@ -65,17 +66,16 @@ bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDs
         return false;
     }
     Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
-    takeEntries(entry, kEntries, found);
-    if (getBool(&options, option::kCertificateDetails, false)) takeEntries(entry, kDetails, found);
+    takeEntries(entry.values(), kEntries, found);
+    if (getBool(&options, option::kCertificateDetails, false)) takeEntries(entry.values(), kDetails, found);
     std::optional<platform::Certificate> certificate;
     if (usesSystemKeychain()) {
-        takeEntries(entry, kReferences, found);
-    } else if (copyCertificateFromKeychainGivenPersistentRef(
-                   entry.data(kVeltoIDCertificateCertificatePersistentReferenceKey), &certificate) &&
+        takeEntries(entry.values(), kReferences, found);
+    } else if (copyCertificateFromKeychainGivenPersistentRef(entry.reference(), &certificate) &&
                certificate) {
-        found.set("CertificateData", Data(certificate->der));
+        found.set(message::kCertificateData, Data(certificate->der));
     }
-    if (information != nullptr) *information = std::move(found);
+    fill(information, std::move(found));
     return true;
 }
 

@@ -6,11 +6,12 @@
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/PollBackOff.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
-#include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
+#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -20,15 +21,13 @@ constexpr const char* kRequestFunction = "__VeltoIDDoCreateCertificateRequestFor
 
 // Seconds.
 constexpr double kDefaultDelayAfterFailedSignIn = 10;
-constexpr double kReconnectInterval = 300;
-
-double now() { return platform::Clock::shared().now(); }
 
 Error statusCodeError() { return {String(kOSStatusErrorDomain), -1, {}}; }
 
-/// Passes the failure on to whoever has to react to it, and hands it out.
-bool fail(const String& accountName, const std::optional<Error>& held, ErrorOut error) {
-    handleServerError(accountName, held);
+/// Has the failure judged and hands it out.
+bool fail(const String& accountName, const String& sentPasswordHash, const std::optional<Error>& held,
+          ErrorOut error) {
+    handleServerError(accountName, sentPasswordHash, held);
     fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
     return false;
 }
@@ -44,45 +43,43 @@ class SigningRequest {
         : ownership_(ownership), accountName_(accountName), options_(options) {}
 
     bool run() {
-        Dictionary record;
+        AccountRecord record;
         if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_) ||
-            !admitCertificateRequest(accountName_, record, &held_))
+            !admitCertificateRequest(record, &held_))
             return false;
-        const String password = __VeltoIDDBCopyHashedPassword(record);
+        password_ = __VeltoIDDBCopyHashedPassword(record);
         VELTOID_LOG_FROM(kRequestFunction, kNotice,
                          "VeltoIDAuth: Creating CSR for " << accountName_.view() << ".");
         begin(record);
-        Session session =
-            __VeltoIDSessionDoCreateSession(accountName_, password, options_, &encDsId_, nullptr, &held_);
+        const Session session =
+            __VeltoIDSessionDoCreateSession(accountName_, password_, options_, &encDsId_, nullptr, &held_);
         if (!session) return false;
         const bool succeeded = encDsId_ && adoptEncDsId(record) && makeKeys() && send(*session);
         if (!succeeded) discardKeys();
-        __VeltoIDSessionRelease(std::move(session));
         return succeeded;
     }
 
     const String& encDsId() const { return encDsId_; }
+    const String& sentPasswordHash() const { return password_; }
     const std::optional<Error>& error() const { return held_; }
 
   private:
     /// The request takes the place of one that was pending.
-    void begin(const Dictionary& record) {
-        setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::date(now())},
+    void begin(const AccountRecord& record) {
+        setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now())},
                      {kVeltoIDAccountCertificateTokenKey, Value::null()},
                      {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
                      {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()}},
-                    false);
-        const auto interval = record.number(kVeltoIDAccountCSRGenerationIntervalKey);
-        if (!interval)
+                    Notify::No);
+        if (!record.requestGenerationInterval())
             setInRecord(
                 {{kVeltoIDAccountCSRGenerationIntervalKey, Value::real(kVeltoIDCSRGenerationInterval)}},
-                true);
+                Notify::Yes);
         discardPendingKey(ownership_, accountName_);
     }
 
-    bool adoptEncDsId(const Dictionary& record) {
-        if (record.string(kVeltoIDAccountDSIDKey) == encDsId_ ||
-            __VeltoIDDBCreateVeltoIDAccount(accountName_, nullptr, encDsId_))
+    bool adoptEncDsId(const AccountRecord& record) {
+        if (record.encDsId() == encDsId_ || __VeltoIDDBCreateVeltoIDAccount(accountName_, nullptr, encDsId_))
             return true;
         held_ = statusCodeError();
         return false;
@@ -101,14 +98,14 @@ class SigningRequest {
     }
 
     bool send(VeltoIDAuthenticationSessionInfo& session) {
-        const double sent = now();
+        const double sent = platform::now();
         noteCertificateRequest(accountName_);
         String token;
         CertificateAnswer answer;
         if (!__VeltoIDSessionDoSendCSR(session, encDsId_, request_, options_, &token, &answer, &held_))
             return false;
-        setInRecord({{kVeltoIDAccountCSRCreationDateKey, Value::date(sent)}}, false);
-        if (token.view().size() > kVeltoIDMaxCertificateTokenBytes) {
+        setInRecord({{kVeltoIDAccountCSRCreationDateKey, Value::date(sent)}}, Notify::No);
+        if (token.view().size() > kMaxCertificateTokenBytes) {
             VELTOID_LOG_FROM(
                 kRequestFunction, kError,
                 "The server's certificate token is refused: it has " << token.view().size() << " bytes.");
@@ -128,7 +125,7 @@ class SigningRequest {
                              "FAILED adding public or private key to keychain, so ");
             return false;
         }
-        return setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference}}, false);
+        return setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference}}, Notify::No);
     }
 
     bool keepToken(const String& token, const Value& delay) {
@@ -136,17 +133,17 @@ class SigningRequest {
                          "VeltoIDAuth: CSR sent to Velto ID server for account "
                              << accountName_.view() << ", certificateToken=, certToken="
                              << describeValue(token) << ", delay=" << describeValue(delay) << ".");
-        if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}, true))
+        if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}, Notify::Yes))
             setInRecord({{kVeltoIDAccountCertificateTokenExpirationKey,
-                          Value::date(now() + kVeltoIDCertificateTokenLifetime)}},
-                        true);
+                          Value::date(platform::now() + kVeltoIDCertificateTokenLifetime)}},
+                        Notify::Yes);
         const auto seconds = tokenDelay(delay);
         setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
                       seconds ? Value::real(*seconds) : Value::null()}},
-                    true);
-        const double nextFetch = now() + seconds.value_or(0);
+                    Notify::Yes);
+        const double nextFetch = platform::now() + seconds.value_or(0);
         const bool stored = setInRecord(
-            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, false);
+            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, Notify::No);
         requestRelaunch(nextFetch);
         return stored;
     }
@@ -159,13 +156,14 @@ class SigningRequest {
                 removeKeyFromKeychainGivenPersistentRef(reference);
     }
 
-    bool setInRecord(const Dictionary& values, bool dirty) {
-        return __VeltoIDDBSetAccountValues(accountName_, values, dirty);
+    bool setInRecord(const Dictionary& values, Notify notify) {
+        return __VeltoIDDBSetAccountValues(accountName_, values, notify);
     }
 
     const OwnershipLock& ownership_;
     const String& accountName_;
     const Dictionary& options_;
+    String password_;
     String encDsId_;
     String request_;
     Key publicKey_;
@@ -173,21 +171,14 @@ class SigningRequest {
     std::optional<Error> held_;
 };
 
-/// When the next fetch is allowed, if that is later than now and can be believed.
-std::optional<double> laterFetchDate(const Dictionary& record) {
-    const auto date = record.date(kVeltoIDAccountCertificateNextCertificateFetchDateKey);
-    if (!date || *date <= now() || *date > now() + kVeltoIDLongestFetchDelay) return std::nullopt;
-    return date;
-}
-
-void putOffFetchAfterFailedSignIn(const String& accountName, const Dictionary& record) {
+void putOffFetchAfterFailedSignIn(const AccountRecord& record) {
     const double delta = storedFetchDelta(record).value_or(kDefaultDelayAfterFailedSignIn);
     __VeltoIDDBSetAccountValues(
-        accountName,
-        {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(now() + delta)},
+        record.accountName(),
+        {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(platform::now() + delta)},
          {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
           Value::real(delayAfterFailedSignIn(delta))}},
-        false);
+        Notify::No);
 }
 
 /// Asks with the token and applies the answer.
@@ -212,11 +203,6 @@ bool fetch(const OwnershipLock& ownership, VeltoIDAuthenticationSessionInfo& ses
     return true;
 }
 
-bool wasTriedRecently(const Dictionary& record) {
-    const auto attempt = record.date(kVeltoIDMetaLastConnectAttemptKey);
-    return attempt && *attempt <= now() && now() <= *attempt + kReconnectInterval;
-}
-
 }  // namespace
 
 bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
@@ -225,50 +211,51 @@ bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, co
     SigningRequest request(ownership, accountName, options);
     const bool succeeded = request.run();
     if (encDsId != nullptr && request.encDsId()) *encDsId = request.encDsId();
-    return succeeded || fail(accountName, request.error(), error);
+    return succeeded || fail(accountName, request.sentPasswordHash(), request.error(), error);
 }
 
-bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, bool force, const Dictionary& options,
-                                           ErrorOut error) {
+bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,
+                                           const Dictionary& options, ErrorOut error) {
     const OwnershipLock ownership;
     std::optional<Error> held;
-    Dictionary record;
-    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, &held)) return fail(accountName, held, error);
-    const String token = record.string(kVeltoIDAccountCertificateTokenKey);
+    AccountRecord record;
+    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, &held))
+        return fail(accountName, nullptr, held, error);
+    const String token = record.certificateToken();
     if (!token) return true;
-    if (const auto date = laterFetchDate(record); date && !force) {
-        const Dictionary information = {
-            {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(*date)}};
+    if (time == FetchTime::WhenDue && !AccountSchedule(record, {}, options).isDue(DueReason::PendingFetch)) {
+        const Dictionary information = {{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
+                                         Value::date(record.nextCertificateFetch().value_or(0))}};
         fillError(error,
                   makeError(identity_error::kNotYet, {}, information, __func__, __FILE_NAME__, __LINE__));
         return false;
     }
+    const String password = __VeltoIDDBCopyHashedPassword(record);
     String encDsId;
-    Session session = __VeltoIDSessionDoCreateSession(accountName, __VeltoIDDBCopyHashedPassword(record),
-                                                      options, &encDsId, nullptr, &held);
+    const Session session =
+        __VeltoIDSessionDoCreateSession(accountName, password, options, &encDsId, nullptr, &held);
     if (!session) {
-        putOffFetchAfterFailedSignIn(accountName, record);
+        putOffFetchAfterFailedSignIn(record);
         return true;
     }
-    const bool succeeded = fetch(ownership, *session, encDsId, token, options, &held);
-    __VeltoIDSessionRelease(std::move(session));
-    return succeeded || fail(accountName, held, error);
+    return fetch(ownership, *session, encDsId, token, options, &held) ||
+           fail(accountName, password, held, error);
 }
 
 void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dictionary& options,
                                            ErrorOut error) {
     std::optional<Error> held;
-    Dictionary record;
+    AccountRecord record;
     __VeltoIDDBCopyVeltoIDAccount(accountName, &record, &held);
-    if (wasTriedRecently(record)) {
+    if (!AccountSchedule(record, {}, options).isDue(DueReason::SignIn)) {
         held = VELTOID_ERROR(identity_error::kNotYet);
     } else if (const String password = __VeltoIDDBCopyHashedPassword(record)) {
-        __VeltoIDDBSetAccountValue(accountName, kVeltoIDMetaLastConnectAttemptKey, Value::date(now()), false);
+        __VeltoIDDBSetAccountValue(accountName, kVeltoIDMetaLastConnectAttemptKey,
+                                   Value::date(platform::now()), Notify::No);
         String encDsId;
-        Session session =
+        const Session session =
             __VeltoIDSessionDoCreateSession(accountName, password, options, &encDsId, nullptr, &held);
-        if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId, true);
-        __VeltoIDSessionRelease(std::move(session));
+        if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId, Notify::Yes);
     }
     fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
 }

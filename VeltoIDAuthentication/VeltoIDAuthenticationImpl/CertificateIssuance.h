@@ -26,11 +26,9 @@ inline constexpr double kVeltoIDCertificateTokenLifetime = 1'209'600;
 inline constexpr double kVeltoIDCSRGenerationInterval = 3'600;
 /// After a refusal, or a token that expired, until the next request.
 inline constexpr double kVeltoIDCSRRetryDelay = 3'600;
-/// Longer waits than this that a record asks for are not believed.
-inline constexpr double kVeltoIDLongestFetchDelay = 604'800;
 
 /// Longer tokens are refused: they would be stored and logged.
-inline constexpr size_t kVeltoIDMaxCertificateTokenBytes = size_t{16} << 10U;
+inline constexpr size_t kMaxCertificateTokenBytes = size_t{16} << 10U;
 
 /// Generates a key pair, sends a certificate signing request and applies the answer: the certificate, a
 /// token, or a refusal. Keys made for an attempt that fails are deleted. The error (also passed to
@@ -47,11 +45,13 @@ bool updateAccountWithCertificateResult(const OwnershipLock& ownership, const St
                                         const String& encDsId, const CertificateAnswer& answer,
                                         ErrorOut error = nullptr);
 
+enum class FetchTime { WhenDue, AtOnce };
+
 /// Asks the server for the certificate that the account's token stands for, and applies the answer. True also
 /// when there is no token, or no session could be opened (the next fetch is put off). Error 99: it is not
-/// time yet (with "NextCertificateFetchDate", unless `force` is set), or the request is still pending.
-bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, bool force, const Dictionary& options,
-                                           ErrorOut error = nullptr);
+/// time yet (with "NextCertificateFetchDate"), or the request is still pending.
+bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,
+                                           const Dictionary& options, ErrorOut error = nullptr);
 
 /// Signs in to learn and store the account's encDsId. The error is always filled: the session's, 99 within
 /// 300 s of the record's "LastConnectAttempt", or -100.

@@ -4,9 +4,10 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "TestSupport/CertificateFixture.h"
-#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/Cleanup.h"
+#include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 
@@ -116,7 +117,7 @@ TEST_F(IssuanceTest, ATokenIsAskedWithUntilTheCertificateIsThere) {
     EXPECT_FALSE(record().contains(kGenerated) || record().contains(kInterval));
 
     server_.answer("fetchCert", Dictionary{{"dsCert", Dictionary{{"CertStatus", "SIGNIN_PENDING"}}}});
-    EXPECT_FALSE(fetch(true)) << "forced before its time";
+    EXPECT_FALSE(fetch(FetchTime::AtOnce)) << "forced before its time";
     EXPECT_EQ(in(kFetchDate), 450);
     EXPECT_EQ(record()[kDelta], number(675));
     clock_.advanceBy(450);
@@ -381,7 +382,7 @@ TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
     EXPECT_EQ(in(kFetchDate), 15);
     EXPECT_EQ(record().number(kDelta), 22.5);
     setValue(kDelta, number(200'000));
-    EXPECT_TRUE(fetch(true));
+    EXPECT_TRUE(fetch(FetchTime::AtOnce));
     EXPECT_EQ(in(kFetchDate), 200'000);
     EXPECT_TRUE(record().number(kDelta) >= kDay && record().number(kDelta) <= 2 * kDay);
 }
@@ -427,9 +428,9 @@ TEST_F(IssuanceTest, AnAddAsksForTheCertificateWhenItIsToldTo) {
         {"forced, later", {{"ForceCertificateCreation", on}}, true, false},
     };
     const auto add = [this](const Dictionary& options) {
-        String encDsId;
-        EXPECT_TRUE(__VeltoIDDoAddVeltoID(kName, kPassword, options, &encDsId, nullptr, &error_));
-        return encDsId;
+        AddedAccount added;
+        EXPECT_TRUE(__VeltoIDDoAddVeltoID(kName, kPassword, options, &added, &error_));
+        return added.encDsId;
     };
     issueAtOnce();
     for (const Case& each : cases) {
@@ -498,7 +499,8 @@ TEST_F(IssuanceTest, CleaningUpTakesWhatIsOfNoUse) {
                                    {kKeyReference, certificateEntry()[kKeyReference]}};
     const auto cleanUp = [](const Dictionary& values, const String& encDsId) {
         __VeltoIDDBSetCertificateInfo(encDsId, Dictionary());
-        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue(encDsId, key, value, false);
+        for (const auto& [key, value] : values)
+            __VeltoIDDBSetCertificateValue(encDsId, key, value, Notify::No);
         EXPECT_TRUE(__VeltoIDCleanupAccountsAndCertificates({}));
         return !__VeltoIDDBCopyCertificateInfo(encDsId, nullptr);
     };
@@ -536,13 +538,13 @@ TEST_F(IssuanceTest, AnAccountThatAsksOverAndOverIsHeldUp) {
     EXPECT_EQ(server_.takeMethods(), "");
     EXPECT_EQ(keys(), 1U) << "what there is stays";
     EXPECT_EQ(record()["CertificateRequestsHeldUntil"], date(7'200));
-    EXPECT_EQ(nextRequestDate(record()), now() + 7'200);
+    EXPECT_EQ(nextRequestDate({kName, record()}), now() + 7'200);
     clock_.advanceBy(7'000);
     EXPECT_FALSE(request());
     EXPECT_EQ(log_.count(" certificates within an hour and wants another one"), 1);
     clock_.advanceBy(200);
     EXPECT_TRUE(request());
-    EXPECT_EQ(requestsHeldUntil(record()), std::nullopt);
+    EXPECT_EQ(requestsHeldUntil({kName, record()}), std::nullopt);
     setValue("CertificateRequestsHeldUntil", date(1e9));
     EXPECT_TRUE(request()) << "no clock that was right has noted that";
 }

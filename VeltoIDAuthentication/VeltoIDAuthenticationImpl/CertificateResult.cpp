@@ -25,8 +25,6 @@ constexpr const char* kIntermediateLabel = "Velto ID authorization intermediate 
 /// Share of a certificate's remaining lifetime after which it is renewed.
 constexpr double kRenewalShare = 0.75;
 
-double now() { return platform::Clock::shared().now(); }
-
 /// One answer and the account that it is for.
 class CertificateResult {
   public:
@@ -55,12 +53,12 @@ class CertificateResult {
                          "VeltoIDAuth: Adding certificate for "
                              << accountName_.view() << ", " << encDsId_.view() << " to keychain, serial#="
                              << result_.string(kVeltoIDCertificateSerialNumberKey).view());
-        Dictionary before;
+        CertificateEntry before;
         __VeltoIDDBCopyCertificateInfo(encDsId_, &before);
         const bool stored = storeEntry() && storeCertificate() && storeIntermediate() && movePrivateKey();
         if (stored) {
             planRenewal();
-            Dictionary after;
+            CertificateEntry after;
             __VeltoIDDBCopyCertificateInfo(encDsId_, &after);
             discardReplacedItems(ownership_, before, after);
         } else {
@@ -74,17 +72,17 @@ class CertificateResult {
     bool storeEntry() {
         if (!__VeltoIDDBSetCertificateInfo(encDsId_, result_)) return false;
         for (const auto& [key, value] : result_) setInEntry(key, value);
-        setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now() - 1));
+        setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now() - 1));
         return true;
     }
 
     bool setInEntry(const String& key, const Value& value) {
-        return __VeltoIDDBSetCertificateValue(encDsId_, key, value, true);
+        return __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::Yes);
     }
 
     /// Text that is no certificate is passed over: the entry tells that there is none.
     bool storeCertificate() {
-        const auto certificate = certificateFromPEM(result_.string("Certificate"));
+        const auto certificate = certificateFromPEM(result_.string(kVeltoIDCertificateCertificateKey));
         if (!certificate) return true;
         Data reference;
         if (!addCertificateToKeychain(*certificate, certificateLabelForAccount(accountName_), &reference))
@@ -95,7 +93,8 @@ class CertificateResult {
     }
 
     bool storeIntermediate() {
-        const auto certificate = certificateFromPEM(result_.string("IntermediateCertificate"));
+        const auto certificate =
+            certificateFromPEM(result_.string(kVeltoIDCertificateIntermediateCertificateKey));
         Data reference;
         if (certificate && (copyPersistentRefForCertificate(*certificate, &reference) ||
                             addCertificateToKeychain(*certificate, kIntermediateLabel, &reference)))
@@ -104,17 +103,18 @@ class CertificateResult {
     }
 
     bool movePrivateKey() {
-        const Data reference = record_.data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
+        const Data reference = record_.pendingKeyReference();
         if (!reference) return true;
         return setInEntry(kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference) &&
-               setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::null()}}, false);
+               setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::null()}},
+                           Notify::No);
     }
 
     void planRenewal() {
         const auto expires = result_.date(kVeltoIDCertificateExpirationDateKey);
-        if (expires && *expires > now())
+        if (expires && *expires > platform::now())
             setInEntry(kVeltoIDCertificateNextRenewalAttemptDateKey,
-                       Value::date(now() + kRenewalShare * (*expires - now())));
+                       Value::date(platform::now() + kRenewalShare * (*expires - platform::now())));
     }
 
     /// Last, so that an agent that is killed before asks for the certificate once more.
@@ -126,16 +126,14 @@ class CertificateResult {
                      {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()},
                      {kVeltoIDAccountCSRCreationDateKey, Value::null()}},
-                    true);
+                    Notify::Yes);
     }
 
-    /// Nobody could prove to own such a certificate.
+    /// Without its key the certificate would be of no use.
     bool isForAnotherKey() const {
-        const auto certificate = certificateFromPEM(result_.string("Certificate"));
+        const auto certificate = certificateFromPEM(result_.string(kVeltoIDCertificateCertificateKey));
         Key pending;
-        if (!certificate ||
-            !copyKeyFromKeychainGivenPersistentRef(
-                record_.data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey), &pending) ||
+        if (!certificate || !copyKeyFromKeychainGivenPersistentRef(record_.pendingKeyReference(), &pending) ||
             pending.publicPart == Data(certificate->publicKey))
             return false;
         VELTOID_LOG_FROM(kFunction, kError,
@@ -148,16 +146,16 @@ class CertificateResult {
 
     bool applyPending() {
         const double delay = pendingDelay(delay_, record_);
-        const double nextFetch = now() + (delay > 0 ? delay : 1);
+        const double nextFetch = platform::now() + (delay > 0 ? delay : 1);
         const bool stored = setInRecord(
-            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, true);
+            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, Notify::Yes);
         if (stored)
             setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
                           Value::real(delayAfterPending(delay))}},
-                        false);
+                        Notify::No);
         setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::null()},
                      {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()}},
-                    false);
+                    Notify::No);
         requestRelaunch(nextFetch);
         return stored;
     }
@@ -185,8 +183,8 @@ class CertificateResult {
                          "UNKNOWN Certificate issuance request for "
                              << accountName_.view() << " dsID=" << encDsId_.view() << " certToken=" << token()
                              << ", status=" << statusText() << ".");
-        const auto expiration = record_.date(kVeltoIDAccountCertificateTokenExpirationKey);
-        if (expiration && *expiration < now()) {
+        const auto expiration = record_.certificateTokenExpiration();
+        if (expiration && *expiration < platform::now()) {
             dropRequest();
         } else {
             putOffFetch();
@@ -196,34 +194,35 @@ class CertificateResult {
 
     /// Back to no request at all; the next one is made in an hour at the earliest.
     void dropRequest() {
-        setInRecord({{kVeltoIDAccountCertificateTokenKey, Value::null()},
-                     {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
-                     {kVeltoIDAccountCSRGenerationDateKey, Value::date(now() + kVeltoIDCSRRetryDelay)},
-                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
-                     {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
-                     {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}},
-                    true);
+        setInRecord(
+            {{kVeltoIDAccountCertificateTokenKey, Value::null()},
+             {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
+             {kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now() + kVeltoIDCSRRetryDelay)},
+             {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
+             {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
+             {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}},
+            Notify::Yes);
         discardPendingKey(ownership_, accountName_);
     }
 
     void putOffFetch() {
-        const double delta = storedFetchDelta(record_).value_or(kLongestPollingDelay);
+        const double delta = storedFetchDelta(record_).value_or(kMaxPollingDelay);
         setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
-                      Value::date(now() + (delta > 0 ? delta : kLongestPollingDelay))},
+                      Value::date(platform::now() + (delta > 0 ? delta : kMaxPollingDelay))},
                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
                       Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}},
-                    true);
+                    Notify::Yes);
     }
 
-    std::string_view token() const { return record_.string(kVeltoIDAccountCertificateTokenKey).view(); }
+    std::string token() const { return record_.certificateToken().text(); }
 
     std::string statusText() const {
         const Value& status = result_[kVeltoIDCertificateStatusKey];
         return status.isString() ? status.asString().text() : describeValue(status);
     }
 
-    bool setInRecord(const Dictionary& values, bool dirty) {
-        return __VeltoIDDBSetAccountValues(accountName_, values, dirty);
+    bool setInRecord(const Dictionary& values, Notify notify) {
+        return __VeltoIDDBSetAccountValues(accountName_, values, notify);
     }
 
     const OwnershipLock& ownership_;
@@ -231,7 +230,7 @@ class CertificateResult {
     const String& encDsId_;
     const Dictionary result_;
     const Value& delay_;
-    Dictionary record_;
+    AccountRecord record_;
 };
 
 }  // namespace

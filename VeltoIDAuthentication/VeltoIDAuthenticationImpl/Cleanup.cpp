@@ -18,23 +18,22 @@ std::set<std::string> encDsIdsOfAccounts() {
     Array names;
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names) {
-        Dictionary record;
+        AccountRecord record;
         if (!__VeltoIDDBCopyVeltoIDAccount(name.asString(), &record)) continue;
-        if (const String encDsId = record.string(kVeltoIDAccountDSIDKey)) encDsIds.insert(encDsId.text());
-        const auto embargo = record.date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
-        if (embargo && *embargo < platform::Clock::shared().now())
+        if (const String encDsId = record.encDsId()) encDsIds.insert(encDsId.text());
+        const auto embargo = record.earliestConnection();
+        if (embargo && *embargo < platform::now())
             __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountEarliestAllowedConnectionDateKey,
-                                       Value::null(), false);
+                                       Value::null(), Notify::No);
     }
     return encDsIds;
 }
 
 bool isOfUse(const String& encDsId) {
-    Dictionary entry;
-    return __VeltoIDDBCopyCertificateInfo(encDsId, &entry) &&
-           entry.string(kVeltoIDCertificateStatusKey) != kVeltoIDCertificateStatusInvalid &&
-           entry.contains(kVeltoIDCertificateCertificatePersistentReferenceKey) &&
-           entry.contains(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
+    CertificateEntry entry;
+    return __VeltoIDDBCopyCertificateInfo(encDsId, &entry) && !entry.isInvalid() &&
+           entry.values().contains(kVeltoIDCertificateCertificatePersistentReferenceKey) &&
+           entry.values().contains(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
 }
 
 }  // namespace

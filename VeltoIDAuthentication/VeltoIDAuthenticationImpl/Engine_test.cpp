@@ -1,11 +1,13 @@
 // The account engine: adding and forgetting, people and breadcrumbs, passwords, dates.
 #include "TestSupport/EngineFixture.h"
-#include "VeltoIDAuthenticationImpl/AddForget.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
+#include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
 #include "VeltoIDAuthenticationImpl/FindPerson.h"
+#include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
-#include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
+#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -16,14 +18,12 @@ namespace {
 class Adding : public EngineTest {
   protected:
     bool add(const Dictionary& options = {}, const String& password = kPassword) {
-        encDsId_ = nullptr;
-        accountRecord_.reset();
+        added_ = {};
         error_.reset();
-        return __VeltoIDDoAddVeltoID(kName, password, options, &encDsId_, &accountRecord_, &error_);
+        return __VeltoIDDoAddVeltoID(kName, password, options, &added_, &error_);
     }
 
-    String encDsId_;
-    std::optional<Dictionary> accountRecord_;
+    AddedAccount added_;
     std::optional<Error> error_;
 };
 
@@ -52,9 +52,9 @@ TEST_F(Adding, StoresTheAccountWhateverTheServerSays) {
         EXPECT_TRUE(add(each.options)) << each.what;
         EXPECT_EQ(error_, std::nullopt) << each.what;
         EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        EXPECT_EQ(encDsId_, each.signsIn ? String("d1") : String()) << each.what;
-        EXPECT_EQ(record().string("encDsId"), encDsId_) << each.what;
-        EXPECT_EQ(accountRecord_, each.succeeds ? std::optional(record()) : std::nullopt) << each.what;
+        EXPECT_EQ(added_.encDsId, each.signsIn ? String("d1") : String()) << each.what;
+        EXPECT_EQ(record().string("encDsId"), added_.encDsId) << each.what;
+        EXPECT_EQ(added_.record, each.succeeds ? std::optional(record()) : std::nullopt) << each.what;
         EXPECT_EQ(hasPassword(), each.server != Server::RefusesPassword) << each.what;
         const std::string line = std::string("VeltoIDAuth: Adding account ") + kName +
                                  (each.succeeds ? " succeeded." : " failed, ERROR:");
@@ -83,9 +83,9 @@ TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
     };
     setValue("CertificateToken", "t");
     EXPECT_EQ(readd(), "");
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword(record()), "new hash");
-    EXPECT_EQ(encDsId_, "d1");
-    EXPECT_EQ(accountRecord_, record());
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, record()}), "new hash");
+    EXPECT_EQ(added_.encDsId, "d1");
+    EXPECT_EQ(added_.record, record());
     EXPECT_EQ(takePosted(), "added/removed ");
     EXPECT_EQ(
         log_.count("VeltoIDAuth: Already existing account " + std::string(kName) + " re-added; succeeded."),
@@ -217,6 +217,7 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
 // --- What an account needs next
 
 TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
+    // What is left to do for an account whose certificate was just validated.
     constexpr double kFortnight = 1'209'600;
     struct Case {
         const char* what;
@@ -230,32 +231,53 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
     constexpr const char* kRequested = "CSRGenerationDate";
     constexpr const char* kRenewal = "NextRenewalAttempt";
     constexpr const char* kFetch = "NextCertificateFetchDate";
+    constexpr const char* kToken = "CertificateToken";
+    constexpr const char* kValidated = "LastSuccessfulValidation";
+    constexpr const char* kAttempt = "LastValidationAttempt";
+    constexpr const char* kAsOf = "VeltoIDAccountValidationRecordValidAsOfKey";
+    constexpr const char* kDuration = "VeltoIDAccountValidationRecordSuggestedValidIntervalKey";
     const auto in = [this](double seconds) { return date(seconds); };
     const Dictionary entry;
     const Case cases[] = {
-        {"nothing foreseen", {}, entry, {}},
+        {"nothing else", {}, entry, kFortnight},
         {"dirty", {{"Dirty", kOn}}, entry, 0},
         {"no encDsId", {{"encDsId", none}}, {}, 0},
-        {"tried", {{"encDsId", none}, {"LastConnectAttempt", in(-100)}, {kFetch, in(999)}}, {}, 200},
+        {"tried", {{"encDsId", none}, {"LastConnectAttempt", in(-100)}, {kRequested, in(0)}}, {}, 200},
         {"forced validation", {{"ForceValidation", kOn}, {"NextValidationDate", in(50)}}, entry, 0},
         {"next validation", {{"NextValidationDate", in(50)}, {"ValidationDate", in(0)}}, entry, 50},
         {"last validation", {{"ValidationDate", in(-100)}}, entry, kFortnight - 100},
         {"embargo", {{kEmbargo, in(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}}, entry, 1000},
         {"embargo, expiry", {{kEmbargo, in(99)}}, Dictionary{{"Expires", in(9)}, {kRenewal, in(5)}}, 9},
         {"embargo, no certificate", {{kEmbargo, in(1000)}}, {}, 1000},
-        {"embargo is over", {{kEmbargo, in(-1)}, {"ClientTooOld", kOn}}, entry, {}},
+        {"embargo is over", {{kEmbargo, in(-1)}, {"ClientTooOld", kOn}}, entry, kFortnight},
         {"too old", {{"ClientTooOld", kOn}, {"ForceValidation", kOn}}, {}, 3'153'600'000},
         {"an expiry", {}, Dictionary{{"Expires", in(500)}}, 500},
         {"a renewal", {}, Dictionary{{"Expires", in(500)}, {kRenewal, in(400)}}, 400},
-        {"a validated certificate", {}, Dictionary{{"LastSuccessfulValidation", in(-50)}}, kFortnight - 50},
+        {"a validated certificate", {}, Dictionary{{kValidated, in(-50)}}, kFortnight - 50},
+        {"a certificate never validated", {}, Dictionary{{kValidated, none}}, 0},
+        {"tried 6 h ago", {}, Dictionary{{kValidated, in(-2e6)}, {kAttempt, in(-21'600)}}, 21'600},
+        {"an invalid one", {}, Dictionary{{"CertStatus", "CERTIFICATE_INVALID"}}, 0},
+        {"a renewal put off, near the end",
+         {},
+         Dictionary{{"Expires", in(130'000)}, {kRenewal, in(9e4)}},
+         9e4},
         {"no certificate", {}, {}, 0},
-        {"a fetch", {{kFetch, in(30)}, {kRequested, in(-10)}}, {}, 30},
-        {"a request", {{kRequested, in(-10)}}, {}, 3590},
+        {"a fetch", {{kToken, "t"}, {kFetch, in(30)}, {kRequested, in(-10)}}, {}, 30},
+        {"a fetch without date", {{kToken, "t"}}, {}, 0},
+        {"a fetch that is too far ahead to be believed", {{kToken, "t"}, {kFetch, in(700'000)}}, {}, 0},
+        {"a fetch comes first", {{kToken, "t"}, {kFetch, in(30)}}, Dictionary{{"Expires", in(-1)}}, 30},
+        {"a request", {{kRequested, in(-10)}}, {}, 86'390},
         {"an interval", {{kRequested, in(-10)}, {"CSRGenerationInterval", number(60)}}, {}, 50},
-        {"a request from the future", {{kRequested, in(10)}}, {}, 0},
-        {"an old server's record", {{kNextCheck, in(40)}}, entry, {}},
+        {"a request after a refusal", {{kRequested, in(3600)}}, {}, 90'000},
+        {"requests held up", {{"CertificateRequestsHeldUntil", in(70)}}, {}, 70},
+        {"an old server's record", {{kNextCheck, in(40)}}, entry, kFortnight},
         {"a record", {{kNextCheck, in(40)}}, entry, 40, true},
-        {"a record, no date", {{kIdentifier, "v"}}, entry, {}, true},
+        {"a record without data", {{kIdentifier, "v"}}, entry, 0, true},
+        {"a record of 100 s",
+         {{kData, kRecordData}, {kAsOf, in(0)}, {kDuration, number(100)}},
+         entry,
+         75,
+         true},
         {"no record", {}, entry, 0, true},
     };
     for (const Case& each : cases) {
@@ -271,8 +293,9 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
         __VeltoIDDBRemoveCertificateInfo("d1");
         if (each.entry) {
             __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
+            __VeltoIDDBSetCertificateValue("d1", kValidated, date(), Notify::No);
             for (const auto& [key, value] : *each.entry)
-                __VeltoIDDBSetCertificateValue("d1", key, value, false);
+                __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
         }
         std::optional<double> next = -1;
         EXPECT_TRUE(copyNextActionDateForAccount(kName, &next)) << each.what;
@@ -280,7 +303,7 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
     }
     __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(100));
     setValue("ValidationDate", date(-30));
-    setValue(kIdentifier, "v");
+    setValue(kNextCheck, date(1000));
     std::optional<double> next;
     EXPECT_TRUE(copyNextActionDateForAccount(kName, &next));
     EXPECT_EQ(next, now() + 70);

@@ -2,8 +2,8 @@
 
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
-#include "VeltoIDAuthenticationImpl/ServerErrorHandling.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
+#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -11,12 +11,12 @@ namespace {
 
 /// The first account that could sign in; null without one.
 String firstAccount() {
-    const auto record = __VeltoIDDBCopyFirstVeltoIDAccount(true, true);
-    return record ? record->string(kVeltoIDAccountNameKey) : String();
+    const auto record = __VeltoIDDBCopyFirstVeltoIDAccount({.password = true, .encDsId = true});
+    return record ? record->accountName() : String();
 }
 
 String storedPassword(const String& accountName) {
-    Dictionary record;
+    AccountRecord record;
     return __VeltoIDDBCopyVeltoIDAccount(accountName, &record) ? __VeltoIDDBCopyHashedPassword(record)
                                                                : String();
 }
@@ -33,11 +33,10 @@ bool __VeltoIDDoFindPerson(const String& accountName, const String& hashedPasswo
     }
     const String password = accountName && hashedPassword ? hashedPassword : storedPassword(name);
     std::optional<Error> held;
-    Session session = __VeltoIDSessionDoCreateSession(name, password, options, nullptr, nullptr, &held);
+    const Session session = __VeltoIDSessionDoCreateSession(name, password, options, nullptr, nullptr, &held);
     const bool found = session && __VeltoIDSessionDoFindPerson(*session, criteria, options, results, &held);
-    __VeltoIDSessionRelease(std::move(session));
     if (found) return true;
-    handleServerError(name, held);
+    handleServerError(name, password, held);
     fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
     return false;
 }

@@ -14,11 +14,7 @@
 namespace veltoid {
 namespace {
 
-constexpr std::string_view kCertificateKey = kVeltoIDCertificateCertificatePersistentReferenceKey;
-constexpr std::string_view kPrivateKeyKey = kVeltoIDCertificatePrivateKeyPersistentReferenceKey;
-constexpr std::string_view kIntermediateKey = kVeltoIDCertificateIntermediateCertificateReferenceKey;
-
-/// A semaphore, so that time stands still neither for the one who waits nor for the one who is waited for.
+/// A semaphore, since simulated time goes on while a task waits for one, but not while it waits for a mutex.
 struct Ownership {
     const platform::Semaphore semaphore{1};
 };
@@ -27,20 +23,14 @@ const platform::Semaphore& ownershipSemaphore() {
     return platform::Lifetime::current().state<Ownership>().semaphore;
 }
 
-/// The reference under the key, if the other dictionary has another one or none.
-Data replacedReference(const Dictionary& before, const Dictionary& after, std::string_view key) {
-    const Data reference = before.data(key);
-    return reference == after.data(key) ? Data() : reference;
-}
-
 bool isReferredTo(const Data& reference) {
     Array encDsIds;
     __VeltoIDDBCopyCertificateKeys(&encDsIds);
     return std::any_of(encDsIds.begin(), encDsIds.end(), [&](const Value& encDsId) {
-        Dictionary entry;
+        CertificateEntry entry;
         return __VeltoIDDBCopyCertificateInfo(encDsId.asString(), &entry) &&
-               (entry.data(kCertificateKey) == reference || entry.data(kPrivateKeyKey) == reference ||
-                entry.data(kIntermediateKey) == reference);
+               (entry.reference() == reference || entry.privateKeyReference() == reference ||
+                entry.intermediateReference() == reference);
     });
 }
 
@@ -59,31 +49,37 @@ OwnershipLock::OwnershipLock() {
 OwnershipLock::~OwnershipLock() { ownershipSemaphore().signal(); }
 
 void discardPendingKey(const OwnershipLock& /*ownership*/, const String& accountName) {
-    const Data reference = __VeltoIDDBCopyAccountValue(accountName, kPrivateKeyKey).asData();
+    const Data reference =
+        __VeltoIDDBCopyAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey)
+            .asData();
     if (!reference) return;
     removeKeyFromKeychainGivenPersistentRef(reference);
-    __VeltoIDDBSetAccountValue(accountName, kPrivateKeyKey, Value::null(), false);
+    __VeltoIDDBSetAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey,
+                               Value::null(), Notify::No);
 }
 
-void discardReplacedItems(const OwnershipLock& /*ownership*/, const Dictionary& before,
-                          const Dictionary& after) {
-    if (const Data reference = replacedReference(before, after, kCertificateKey))
-        removeCertificateFromKeychainGivenPersistentRef(reference);
-    if (const Data reference = replacedReference(before, after, kPrivateKeyKey))
-        removeKeyFromKeychainGivenPersistentRef(reference);
-    const Data intermediate = replacedReference(before, after, kIntermediateKey);
-    if (intermediate && !isReferredTo(intermediate))
+void discardReplacedItems(const OwnershipLock& /*ownership*/, const CertificateEntry& before,
+                          const CertificateEntry& after) {
+    // A removal without reference does nothing.
+    if (before.reference() != after.reference())
+        removeCertificateFromKeychainGivenPersistentRef(before.reference());
+    if (before.privateKeyReference() != after.privateKeyReference())
+        removeKeyFromKeychainGivenPersistentRef(before.privateKeyReference());
+    const Data intermediate = before.intermediateReference();
+    if (intermediate && intermediate != after.intermediateReference() && !isReferredTo(intermediate))
         removeCertificateFromKeychainGivenPersistentRef(intermediate);
 }
 
 void discardCertificate(const OwnershipLock& ownership, const String& encDsId, const DroppedItems& dropped) {
-    if (!encDsId) return;
-    Dictionary entry;
-    __VeltoIDDBCopyCertificateInfo(encDsId, &entry);
+    CertificateEntry entry;
+    if (!__VeltoIDDBCopyCertificateInfo(encDsId, &entry)) return;
     __VeltoIDDBRemoveCertificateInfo(encDsId);
-    if (!dropped.certificate) entry.remove(kCertificateKey);
-    if (!dropped.privateKey) entry.remove(kPrivateKeyKey);
-    discardReplacedItems(ownership, entry, {});
+    Dictionary kept;
+    if (!dropped.certificate)
+        kept.set(kVeltoIDCertificateCertificatePersistentReferenceKey, entry.reference());
+    if (!dropped.privateKey)
+        kept.set(kVeltoIDCertificatePrivateKeyPersistentReferenceKey, entry.privateKeyReference());
+    discardReplacedItems(ownership, entry, {encDsId, kept});
 }
 
 void discardStrayItems(const OwnershipLock& /*ownership*/, const String& accountName,

@@ -1,17 +1,18 @@
 // Who owns the key and certificate items of the keychain.
 //
 // An item lives as long as a record or certificate entry refers to it: the reference in the record while a
-// request is pending ("CertificatePrivateKeyReference"), the references in the entry afterwards. Whoever
-// drops a reference drops the item here. Between making an item and storing its reference nobody else may
-// look, so all of this happens under one lock.
+// request is pending ("CertificatePrivateKeyReference"), the references in the entry afterwards. Code that
+// drops a reference drops the item here. Between the making of an item and the storing of its reference the
+// item would look abandoned, so all of this happens under one lock.
 #pragma once
 
 #include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/CertificateEntry.h"
 
 namespace veltoid {
 
-/// Held by whatever makes, stores or drops key and certificate items, server calls in between included. Taken
-/// before any queue; not recursive.
+/// Held by operations that make, store or drop key and certificate items, server calls in between included.
+/// Taken before any queue; not recursive.
 class OwnershipLock {
   public:
     OwnershipLock();
@@ -31,7 +32,8 @@ void discardPendingKey(const OwnershipLock& ownership, const String& accountName
 
 /// Deletes the items that `before` refers to and `after` does not. An intermediate certificate goes only when
 /// no stored entry refers to it.
-void discardReplacedItems(const OwnershipLock& ownership, const Dictionary& before, const Dictionary& after);
+void discardReplacedItems(const OwnershipLock& ownership, const CertificateEntry& before,
+                          const CertificateEntry& after);
 
 /// Removes the encDsId's certificate entry, if there is one, with its items.
 void discardCertificate(const OwnershipLock& ownership, const String& encDsId,

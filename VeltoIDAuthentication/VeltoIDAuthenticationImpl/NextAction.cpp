@@ -1,22 +1,22 @@
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
-#include <algorithm>
-#include <cmath>
-
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/crypto/TrustEvaluation.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
+#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -24,37 +24,8 @@ namespace {
 
 constexpr const char* kFunction = "checkAccountAndDetermineNextAction";
 
-// Seconds.
-constexpr double kDefaultValidationInterval = 1'209'600;
+/// Until a validation that was due is tried again (seconds).
 constexpr double kValidationPostponement = 3'600;
-constexpr double kValidationAttemptSpacing = 43'200;
-constexpr double kPreExpirationIntervalWhenMissing = 30;
-constexpr double kRecordDateTolerance = 86'400;
-constexpr double kDefaultSuggestedDuration = 2'592'000;
-
-/// Share of a validation record's suggested duration for which it is good.
-constexpr double kRecordValidShare = 0.75;
-/// Share of a certificate's own lifetime in which it is renewed at the latest.
-constexpr double kLastShareOfLifetime = 0.25;
-
-double now() { return platform::Clock::shared().now(); }
-
-double metaInterval(const String& accountName, std::string_view key, double defaultValue) {
-    return __VeltoIDDBCopyMetaInfoValue(accountName, {}, key, Value::Kind::Number)
-        .asDouble()
-        .value_or(defaultValue);
-}
-
-/// The dates from `start` for `length` seconds include now.
-bool isWithin(std::optional<double> start, double length) {
-    return start && *start <= now() && now() <= *start + length;
-}
-
-bool speaksAgainstThePassword(const std::optional<Error>& error) {
-    return error && error->domain == kIdentityErrorDomain &&
-           (error->code == identity_error::kInvalidAccountOrPassword ||
-            error->code == identity_error::kAccountLogonDisabled);
-}
 
 /// One examination of one account.
 class AccountCheck {
@@ -62,20 +33,16 @@ class AccountCheck {
     AccountCheck(const String& accountName, const Dictionary& options)
         : accountName_(accountName),
           options_(options),
-          networkAllowed_(getBool(&options, "CheckNetwork", false)) {}
-    ~AccountCheck() { __VeltoIDSessionRelease(std::move(session_)); }
-    AccountCheck(const AccountCheck&) = delete;
-    AccountCheck& operator=(const AccountCheck&) = delete;
+          networkAllowed_(getBool(&options, option::kCheckNetwork, false)) {}
 
     AccountState run() {
         if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record_)) return AccountState::NoCertificate;
-        const auto embargo = record_.date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
-        if (embargo && *embargo > now()) networkAllowed_ = false;
+        if (schedule().isEmbargoed()) networkAllowed_ = false;
         if (const auto state = examinePassword()) return *state;
-        encDsId_ = record_.string(kVeltoIDAccountDSIDKey);
+        encDsId_ = record_.encDsId();
         if (!encDsId_) return AccountState::NoEncodedDSID;
         takeDueValidation();
-        if (record_.string(kVeltoIDAccountCertificateTokenKey)) return AccountState::CertificatePending;
+        if (record_.certificateToken()) return AccountState::CertificatePending;
         if (const auto state = validateAccount()) return *state;
         if (!__VeltoIDDBCopyCertificateInfo(encDsId_, &entry_)) return AccountState::NoCertificate;
         return examineCertificate();
@@ -85,7 +52,7 @@ class AccountCheck {
     // --- Password and account
 
     std::optional<AccountState> examinePassword() const {
-        const Data reference = record_.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+        const Data reference = record_.passwordReference();
         if (!reference) {
             VELTOID_LOG_FROM(kFunction, kNotice,
                              "checkAccount: Velto ID " << accountName_.view()
@@ -102,42 +69,33 @@ class AccountCheck {
     }
 
     void takeDueValidation() {
-        const auto next = record_.date(kVeltoIDAccountNextValidationDateKey);
-        if (record_.boolean(kVeltoIDAccountForceValidationKey).value_or(false)) {
-            setInRecord(kVeltoIDAccountForceValidationKey, Value::null(), false);
-            validationIsDue_ = true;
-        } else if (next && *next <= now()) {
-            postponeValidation(true);
-            validationIsDue_ = true;
+        validationIsDue_ = schedule().isDue(DueReason::Validation);
+        if (!validationIsDue_) return;
+        if (record_.isValidationForced()) {
+            setInRecord(kVeltoIDAccountForceValidationKey, Value::null(), Notify::No);
+        } else if (record_.nextValidation()) {
+            postponeValidation(Notify::Yes);
         }
     }
 
-    void postponeValidation(bool dirty) const {
-        setInRecord(kVeltoIDAccountNextValidationDateKey, Value::date(now() + kValidationPostponement),
-                    dirty);
+    void postponeValidation(Notify notify) const {
+        setInRecord(kVeltoIDAccountNextValidationDateKey,
+                    Value::date(platform::now() + kValidationPostponement), notify);
     }
 
     /// Asks the server about the account if its information is old or its validation due. A state only when
     /// the check ends here; a server that cannot be reached does not end it.
     std::optional<AccountState> validateAccount() {
-        const auto validated = record_.date(kVeltoIDAccountLastValidationDateKey);
-        if (!networkAllowed_ ||
-            (!validationIsDue_ && isWithin(validated, accountValidationInterval(accountName_))))
-            return std::nullopt;
-        const auto next = record_.date(kVeltoIDAccountNextValidationDateKey);
-        if (validated && !validationIsDue_ && !(next && *next > now())) {
-            // What is too old is asked for again, and in an hour once more if the server cannot be reached.
-            postponeValidation(false);
-            validationIsDue_ = true;
-        }
-        if (!record_.string(kVeltoIDAccountNameKey) || !password())
-            return AccountState::PasswordInaccessibleInKeychain;
+        if (!networkAllowed_ || (!validationIsDue_ && schedule().isInformationFresh())) return std::nullopt;
+        // What is too old is asked for again, and in an hour once more if the server cannot be reached.
+        if (validationIsDue_ && !record_.isValidationForced() && !record_.nextValidation())
+            postponeValidation(Notify::No);
+        if (!password()) return AccountState::PasswordInaccessibleInKeychain;
         std::optional<Error> error;
         if (!openSession(&error))
-            return speaksAgainstThePassword(error) ? std::optional(AccountState::PasswordInvalid)
-                                                   : std::nullopt;
+            return refusesPassword(error) ? std::optional(AccountState::PasswordInvalid) : std::nullopt;
         if (validationIsDue_) {
-            const Dictionary forced = {{kVeltoIDAccountForceValidationKey, Value::boolean(true)}};
+            const Dictionary forced = {{option::kForceValidation, Value::boolean(true)}};
             __VeltoIDDoGetMyInfo(accountName_, forced, nullptr);
             __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
         }
@@ -153,7 +111,7 @@ class AccountCheck {
             askAboutCertificate();
             // The server's word counts at once.
             __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
-            if (isInvalid()) return AccountState::CertificateRevoked;
+            if (entry_.isInvalid()) return AccountState::CertificateRevoked;
         }
         if (static_cast<int>(state) < 0) return state;
         std::optional<platform::Certificate> certificate;
@@ -161,36 +119,29 @@ class AccountCheck {
         if (state == AccountState::Unknown)
             state = networkAllowed_ ? evaluate(*certificate) : AccountState::CertificateAssumedOK;
         if (state != AccountState::CertificateOK && state != AccountState::CertificateAssumedOK) return state;
-        return isRenewalDue(*certificate) ? AccountState::CertificateShouldBeRenewed
-                                          : withValidationRecord(state);
+        return schedule().isDue(DueReason::Renewal) || schedule().isDue(DueReason::PreExpiry)
+                   ? AccountState::CertificateShouldBeRenewed
+                   : withValidationRecord(state);
     }
 
     /// By the entry alone.
     AccountState classify() {
-        const auto expires = entry_.date(kVeltoIDCertificateExpirationDateKey);
-        if (isInvalid()) return AccountState::CertificateRevoked;
-        if (expires && *expires < now()) return AccountState::CertificateExpired;
-        const auto validated = entry_.date(kVeltoIDCertificateLastSuccessfulValidationDateKey);
-        if (entry_.boolean(kVeltoIDDirtyKey).value_or(false) ||
-            getBool(&options_, kVeltoIDAccountForceValidationKey, false) || !validated || *validated > now())
+        if (entry_.isInvalid()) return AccountState::CertificateRevoked;
+        const AccountSchedule now = schedule();
+        if (now.isDue(DueReason::Expiry)) return AccountState::CertificateExpired;
+        if (entry_.isDirty() || getBool(&options_, option::kForceValidation, false) ||
+            now.isDue(DueReason::CertificateValidation))
             return AccountState::Unknown;
-        if (now() < *validated + certificateValidationInterval(accountName_))
-            return AccountState::CertificateAssumedOK;
-        const auto attempt = entry_.date(kVeltoIDCertificateLastValidationAttemptDateKey);
-        triedRecently_ = attempt && now() <= *attempt + kValidationAttemptSpacing;
-        return triedRecently_ ? AccountState::CertificateAssumedOK : AccountState::Unknown;
-    }
-
-    bool isInvalid() const {
-        return entry_.string(kVeltoIDCertificateStatusKey) == kVeltoIDCertificateStatusInvalid;
+        triedRecently_ = now.isCertificateValidationPutOff();
+        return AccountState::CertificateAssumedOK;
     }
 
     void askAboutCertificate() {
-        const String serialNumber = entry_.string(kVeltoIDCertificateSerialNumberKey);
+        const String serialNumber = entry_.serialNumber();
         if (!networkAllowed_ || !serialNumber || (!session_ && !openSession(nullptr))) return;
-        const Dictionary parameters = {{kVeltoIDCertificateSerialNumberKey, serialNumber},
-                                       {kVeltoIDAccountValidationRecordIdentifierKey,
-                                        record_.string(kVeltoIDAccountValidationRecordIdentifierKey)}};
+        const Dictionary parameters = {
+            {kVeltoIDCertificateSerialNumberKey, serialNumber},
+            {kVeltoIDAccountValidationRecordIdentifierKey, record_.validationRecordIdentifier()}};
         Dictionary answer;
         if (!_VeltoIDSessionDoGetMyInfo(*session_, encDsId_, parameters, options_, &answer, nullptr)) return;
         updateAccountWithGetMyInfoResult(accountName_, answer);
@@ -204,7 +155,7 @@ class AccountCheck {
     }
 
     bool readCertificate(std::optional<platform::Certificate>* certificate) const {
-        const Data reference = entry_.data(kVeltoIDCertificateCertificatePersistentReferenceKey);
+        const Data reference = entry_.reference();
         if (!reference) {
             VELTOID_LOG_FROM(kFunction, kNotice,
                              "Failed trying to get certificate from keychain for veltoID "
@@ -223,7 +174,7 @@ class AccountCheck {
     bool readPrivateKey() const {
         constexpr const char* kText =
             "Failed trying to get private key from keychain from persistent reference for veltoID ";
-        const Data reference = entry_.data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
+        const Data reference = entry_.privateKeyReference();
         if (!reference) {
             VELTOID_LOG_FROM(kFunction, kNotice, kText << accountName_.view() << " privateKeyRef=NULL");
             return false;
@@ -237,16 +188,15 @@ class AccountCheck {
 
     AccountState evaluate(const platform::Certificate& certificate) {
         std::optional<platform::Certificate> intermediate;
-        copyCertificateFromKeychainGivenPersistentRef(
-            entry_.data(kVeltoIDCertificateIntermediateCertificateReferenceKey), &intermediate);
+        copyCertificateFromKeychainGivenPersistentRef(entry_.intermediateReference(), &intermediate);
         std::vector<platform::Certificate> chain;
         if (intermediate) chain.push_back(*intermediate);
         const auto result = platform::evaluateTrust(certificate, chain);
         if (!result) return AccountState::Unknown;
         const AccountState state = stateOf(*result);
-        setInEntry(kVeltoIDCertificateLastValidationAttemptDateKey, Value::date(now()));
+        setInEntry(kVeltoIDCertificateLastValidationAttemptDateKey, Value::date(platform::now()));
         if (state == AccountState::CertificateOK || state == AccountState::CertificateAssumedOK)
-            setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now()));
+            setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now()));
         return state;
     }
 
@@ -262,8 +212,8 @@ class AccountCheck {
                 VELTOID_LOG_FROM(
                     kFunction, kNotice,
                     "Removing certificate, serial#="
-                        << entry_.string(kVeltoIDCertificateSerialNumberKey).view() << " for veltoID "
-                        << accountName_.view() << " dsID=" << encDsId_.view()
+                        << entry_.serialNumber().view() << " for veltoID " << accountName_.view()
+                        << " dsID=" << encDsId_.view()
                         << " because it is not present in the certificates the server has for us.");
                 return AccountState::CertificateRevoked;
             case FatalFailure:
@@ -276,61 +226,28 @@ class AccountCheck {
         return AccountState::Unknown;
     }
 
-    bool isRenewalDue(const platform::Certificate& certificate) const {
-        const auto next = entry_.date(kVeltoIDCertificateNextRenewalAttemptDateKey);
-        if (!next) return false;
-        const auto expires = entry_.date(kVeltoIDCertificateExpirationDateKey);
-        return *next < now() || (expires && now() + preExpiration(certificate) >= *expires);
-    }
-
-    /// How long before the expiry a renewal is due, whatever its planned date: the interval that is asked
-    /// for, but of a certificate's own lifetime only the last quarter, or a short-lived one would be renewed
-    /// without end. A negative interval counts by its size.
-    double preExpiration(const platform::Certificate& certificate) const {
-        const Value stored =
-            __VeltoIDDBCopyMetaInfoValue(accountName_, options_, kVeltoIDMetaPreExpirationIntervalKey);
-        const double interval =
-            stored.isAbsent() ? kPreExpirationIntervalWhenMissing : stored.asDouble().value_or(0);
-        if (!std::isfinite(interval)) return 0;
-        if (interval < 0) return -interval;
-        return std::min(interval,
-                        kLastShareOfLifetime * std::max(certificate.notAfter - certificate.notBefore, 0.0));
-    }
-
-    // --- Validation record
-
     AccountState withValidationRecord(AccountState state) const {
-        return __VeltoIDSessionGetServerVersion() >= kVeltoIDFirstVersionWithValidationRecords &&
-                       isRecordDue()
-                   ? AccountState::ValidationRecordNeedsToBeUpdated
-                   : state;
-    }
-
-    bool isRecordDue() const {
-        if (const auto next = record_.date(kVeltoIDAccountValidationRecordNextCheckDateKey))
-            return *next <= now();
-        const auto validAsOf = record_.date(kVeltoIDAccountValidationRecordValidAsOfKey);
-        const double duration = getDouble(&record_, kVeltoIDAccountValidationRecordSuggestedValidIntervalKey,
-                                          kDefaultSuggestedDuration);
-        return record_.data(kVeltoIDAccountValidationRecordDataKey).size() == 0 || !validAsOf ||
-               now() < *validAsOf - kRecordDateTolerance || now() > *validAsOf + kRecordValidShare * duration;
+        return schedule().isDue(DueReason::ValidationRecord) ? AccountState::ValidationRecordNeedsToBeUpdated
+                                                             : state;
     }
 
     // ---
 
+    AccountSchedule schedule() const { return {record_, entry_, options_}; }
+
     String password() const { return __VeltoIDDBCopyHashedPassword(record_); }
 
     bool openSession(ErrorOut error) {
-        session_ = __VeltoIDSessionDoCreateSession(record_.string(kVeltoIDAccountNameKey), password(),
-                                                   options_, nullptr, nullptr, error);
+        session_ =
+            __VeltoIDSessionDoCreateSession(accountName_, password(), options_, nullptr, nullptr, error);
         return session_ != nullptr;
     }
 
-    void setInRecord(std::string_view key, const Value& value, bool dirty) const {
-        __VeltoIDDBSetAccountValue(accountName_, key, value, dirty);
+    void setInRecord(std::string_view key, const Value& value, Notify notify) const {
+        __VeltoIDDBSetAccountValue(accountName_, key, value, notify);
     }
     void setInEntry(std::string_view key, const Value& value) const {
-        __VeltoIDDBSetCertificateValue(encDsId_, key, value, false);
+        __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::No);
     }
 
     const String& accountName_;
@@ -338,21 +255,13 @@ class AccountCheck {
     bool networkAllowed_;
     bool validationIsDue_ = false;
     bool triedRecently_ = false;
-    Dictionary record_;
-    Dictionary entry_;
+    AccountRecord record_;
+    CertificateEntry entry_;
     String encDsId_;
     Session session_;
 };
 
 }  // namespace
-
-double accountValidationInterval(const String& accountName) {
-    return metaInterval(accountName, "AccountValidationInterval", kDefaultValidationInterval);
-}
-
-double certificateValidationInterval(const String& accountName) {
-    return metaInterval(accountName, "CertificateValidationInterval", kDefaultValidationInterval);
-}
 
 AccountState checkAccountAndDetermineNextAction(const String& accountName, const Dictionary& options,
                                                 ErrorOut error) {

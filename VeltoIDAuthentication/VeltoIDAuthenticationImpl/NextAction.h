@@ -1,4 +1,4 @@
-// What an account needs next, and when.
+// What an account needs next.
 #pragma once
 
 #include <optional>
@@ -8,13 +8,6 @@
 #include "Values/Value.h"
 
 namespace veltoid {
-
-/// Servers of this version and later give out validation records.
-inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
-
-/// How long the account's information, and its certificate, count as validated (seconds).
-double accountValidationInterval(const String& accountName);
-double certificateValidationInterval(const String& accountName);
 
 /// Examines the account in this order: password, encDsId, pending request, information, certificate (status,
 /// dates, the server's word on it, its items in the keychain, its trust), renewal, validation record. Without
@@ -27,9 +20,5 @@ double certificateValidationInterval(const String& accountName);
 /// asked.
 AccountState checkAccountAndDetermineNextAction(const String& accountName, const Dictionary& options,
                                                 ErrorOut error = nullptr);
-
-/// When the account next needs attention (seconds since 1970; none: no action is foreseen). False for an
-/// account without password reference. Caller's queue.
-bool copyNextActionDateForAccount(const String& accountName, std::optional<double>* date);
 
 }  // namespace veltoid

@@ -31,7 +31,7 @@ class NextActionTest : public CertificateTest {
     }
     /// Sets values of the entry; Null removes.
     static void set(const Dictionary& values) {
-        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue("d1", key, value, false);
+        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
     }
     static AccountState check(const Dictionary& options = {{"CheckNetwork", flag(true)}}) {
         return checkAccountAndDetermineNextAction(kName, options);

@@ -1,7 +1,7 @@
 #include "VeltoIDAuthenticationImpl/PasswordVerification.h"
 
+#include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
-#include "VeltoIDXMLServerCommunications/SessionCache.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -13,12 +13,12 @@ bool __VeltoIDDoVerifyPassword(const String& accountName, const String& hashedPa
         return false;
     }
     const Dictionary signInOptions =
-        copyDictionarySettingValue(options, "DoNotUseCachedSession", Value::boolean(true));
+        copyDictionarySettingValue(options, option::kDoNotUseCachedSession, Value::boolean(true));
     std::optional<Error> sessionError;
-    Session session = __VeltoIDSessionDoCreateSession(accountName, hashedPassword, signInOptions, nullptr,
-                                                      nullptr, &sessionError);
+    const Session session = __VeltoIDSessionDoCreateSession(accountName, hashedPassword, signInOptions,
+                                                            nullptr, nullptr, &sessionError);
     if (session) {
-        destroySession(std::move(session));
+        session->spoil();
         return true;
     }
     fillError(error, sessionError ? *sessionError : VELTOID_ERROR(identity_error::kInvalidAccountOrPassword));

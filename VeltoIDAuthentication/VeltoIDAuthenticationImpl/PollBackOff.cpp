@@ -27,29 +27,29 @@ double randomPollingDelay() {
     platform::fillRandom(bytes);
     uint32_t number = 0;
     std::memcpy(&number, bytes, sizeof number);
-    return kLongestPollingDelay + kLongestPollingDelay * (number & kHighest) / kHighest;
+    return kMaxPollingDelay + kMaxPollingDelay * (number & kHighest) / kHighest;
 }
 
 double delayAfterPending(double delay) {
-    return delay < kLongestPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
+    return delay < kMaxPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
 }
 
 double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
 
-std::optional<double> storedFetchDelta(const Dictionary& record) {
-    return finite(record.number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey));
+std::optional<double> storedFetchDelta(const AccountRecord& record) {
+    return finite(record.nextCertificateFetchDelta());
 }
 
-double pendingDelay(const Value& delay, const Dictionary& record) {
+double pendingDelay(const Value& delay, const AccountRecord& record) {
     const auto given = finite(delay.asDouble());
     const double seconds = given ? *given : storedFetchDelta(record).value_or(kDefaultPendingDelay);
-    return std::min(seconds, kVeltoIDLongestFetchDelay);
+    return std::min(seconds, kMaxFetchDelay);
 }
 
 std::optional<double> tokenDelay(const Value& delay) {
     const auto seconds = delay.asDouble();
     if (!seconds) return std::nullopt;
-    return *seconds >= 0 && *seconds <= kLongestPollingDelay ? *seconds : kDelayForUnbelievableOnes;
+    return *seconds >= 0 && *seconds <= kMaxPollingDelay ? *seconds : kDelayForUnbelievableOnes;
 }
 
 }  // namespace veltoid

@@ -4,11 +4,15 @@
 #include <optional>
 
 #include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/AccountRecord.h"
 
 namespace veltoid {
 
 /// Up to here waits grow by half each time; from here on they are spread at random over the second day.
-inline constexpr double kLongestPollingDelay = 86'400;
+inline constexpr double kMaxPollingDelay = 86'400;
+
+/// Longer waits than this, whether the server or a record asks for them, are not believed.
+inline constexpr double kMaxFetchDelay = 604'800;
 
 /// A random delay between one and two days, so that devices that fail together do not come back together.
 double randomPollingDelay();
@@ -20,11 +24,11 @@ double delayAfterPending(double delay);
 double delayAfterFailedSignIn(double delay);
 
 /// The record's "NextCertificateFetchDelta", if that is a finite number.
-std::optional<double> storedFetchDelta(const Dictionary& record);
+std::optional<double> storedFetchDelta(const AccountRecord& record);
 
 /// How long the server wants to be left alone: what it says now (`delay`, absent or a Number), else what the
 /// record has noted, else a minute. What cannot be believed (infinite, longer than a week) is cut off.
-double pendingDelay(const Value& delay, const Dictionary& record);
+double pendingDelay(const Value& delay, const AccountRecord& record);
 
 /// The delay that a fresh token came with: none if the server gave none; 15 seconds for one that is negative,
 /// longer than a day or no number.

@@ -15,55 +15,55 @@ namespace {
 
 // Seconds.
 constexpr double kGenerationInterval = 86'400;
-constexpr double kLongestGenerationInterval = 1'209'600;
+constexpr double kMaxGenerationInterval = 1'209'600;
 
-double now() { return platform::Clock::shared().now(); }
-
-double generationInterval(const Dictionary& record) {
-    const auto stored = record.number(kVeltoIDAccountCSRGenerationIntervalKey);
-    return stored && !std::isnan(*stored) ? std::clamp(*stored, 0.0, kLongestGenerationInterval)
+double generationInterval(const AccountRecord& record) {
+    const auto stored = record.requestGenerationInterval();
+    return stored && !std::isnan(*stored) ? std::clamp(*stored, 0.0, kMaxGenerationInterval)
                                           : kGenerationInterval;
 }
 
 /// The dates of the requests that still count.
-Array recentRequests(const Dictionary& record) {
+Array recentRequests(const AccountRecord& record) {
     Array recent;
-    const Array* stored = record.array(kVeltoIDAccountCertificateRequestDatesKey);
+    const Array* stored = record.requestDates();
     if (stored == nullptr) return recent;
     for (const Value& date : *stored) {
         const auto seconds = date.asDate();
-        if (seconds && *seconds <= now() && now() < *seconds + kVeltoIDRequestWindow) recent.append(date);
+        if (seconds && *seconds <= platform::now() && platform::now() < *seconds + kRequestWindow)
+            recent.append(date);
     }
     return recent;
 }
 
 }  // namespace
 
-std::optional<double> requestsHeldUntil(const Dictionary& record) {
-    const auto date = record.date(kVeltoIDAccountCertificateRequestsHeldUntilKey);
+std::optional<double> requestsHeldUntil(const AccountRecord& record) {
+    const auto date = record.requestsHeldUntil();
     // One that lies further ahead than it can was noted by a clock that was wrong.
-    if (!date || *date <= now() || *date > now() + kLongestGenerationInterval) return std::nullopt;
+    if (!date || *date <= platform::now() || *date > platform::now() + kMaxGenerationInterval)
+        return std::nullopt;
     return date;
 }
 
-std::optional<double> nextRequestDate(const Dictionary& record) {
+std::optional<double> nextRequestDate(const AccountRecord& record) {
     std::optional<double> next = requestsHeldUntil(record);
-    const auto generated = record.date(kVeltoIDAccountCSRGenerationDateKey);
+    const auto generated = record.requestGeneration();
     if (!generated) return next;
     return std::max(*generated + generationInterval(record), next.value_or(*generated));
 }
 
-bool admitCertificateRequest(const String& accountName, const Dictionary& record, ErrorOut error) {
+bool admitCertificateRequest(const AccountRecord& record, ErrorOut error) {
     auto heldUntil = requestsHeldUntil(record);
     if (!heldUntil) {
-        if (recentRequests(record).size() < kVeltoIDMostRequestsInWindow) return true;
-        heldUntil = now() + generationInterval(record);
-        __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountCertificateRequestsHeldUntilKey,
-                                   Value::date(*heldUntil), false);
+        if (recentRequests(record).size() < kMaxRequestsInWindow) return true;
+        heldUntil = platform::now() + generationInterval(record);
+        __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCertificateRequestsHeldUntilKey,
+                                   Value::date(*heldUntil), Notify::No);
         VELTOID_LOG(
             kError,
-            "Velto ID " << describeAccountForLog(accountName) << " has asked for "
-                        << kVeltoIDMostRequestsInWindow
+            "Velto ID " << describeAccountForLog(record.accountName()) << " has asked for "
+                        << kMaxRequestsInWindow
                         << " certificates within an hour and wants another one; its requests are held "
                            "up until "
                         << describeValue(Value::date(*heldUntil)) << ".");
@@ -77,14 +77,14 @@ bool admitCertificateRequest(const String& accountName, const Dictionary& record
 }
 
 void noteCertificateRequest(const String& accountName) {
-    Dictionary record;
+    AccountRecord record;
     if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) return;
     Array requests = recentRequests(record);
-    requests.append(Value::date(now()));
+    requests.append(Value::date(platform::now()));
     __VeltoIDDBSetAccountValues(accountName,
                                 {{kVeltoIDAccountCertificateRequestDatesKey, requests},
                                  {kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::null()}},
-                                false);
+                                Notify::No);
 }
 
 }  // namespace veltoid

@@ -16,6 +16,7 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDXMLServerCommunications/WireKeys.h"
 #include "XMLRPC/XMLRPCShim.h"
 
 namespace veltoid {
@@ -48,9 +49,9 @@ void applyValidityDuration(VeltoIDAuthenticationSessionInfo& session, const Valu
 }
 
 void applyRelaunch(const Dictionary& reply) {
-    const int32_t interval = getInt32(&reply, "NextLaunchTimeInterval", 0);
+    const int32_t interval = getInt32(&reply, wire::kNextLaunchInterval, 0);
     if (interval < 1) return;
-    const double date = platform::Clock::shared().now() + interval;
+    const double date = platform::now() + interval;
     VELTOID_LOG_FROM("xmlInvoke", kNotice,
                      "Received 'NextLaunchTimeInterval' == " << interval
                                                              << " from server, so setting NextLaunchDate to "
@@ -59,7 +60,7 @@ void applyRelaunch(const Dictionary& reply) {
 }
 
 void applyFlushAndExit(const Dictionary& reply) {
-    if (!getBool(&reply, "FlushAndExit", false)) return;
+    if (!getBool(&reply, wire::kFlushAndExit, false)) return;
     VELTOID_LOG_FROM(
         "xmlInvoke", kNotice,
         "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
@@ -68,16 +69,16 @@ void applyFlushAndExit(const Dictionary& reply) {
 }
 
 void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& reply) {
-    applyValidityDuration(session, reply["dsSessionValidityDuration"]);
-    if (reply.contains("NewURL"))
+    applyValidityDuration(session, reply[wire::kSessionValidity]);
+    if (reply.contains(wire::kNewURL))
         VELTOID_LOG_FROM("xmlInvoke", kNotice,
                          "Ignoring a new server URL in a reply: credentials are not redirected by a reply.");
-    if (const Dictionary* metaInformation = reply.dictionary("MetaInformation"))
+    if (const Dictionary* metaInformation = reply.dictionary(wire::kMetaInformation))
         for (const auto& [key, value] : *metaInformation)
             __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
-    if (const Dictionary* accountInformation = reply.dictionary("AccountInformation"))
+    if (const Dictionary* accountInformation = reply.dictionary(wire::kAccountInformation))
         for (const auto& [key, value] : *accountInformation)
-            __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), false);
+            __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), Notify::No);
     applyRelaunch(reply);
     applyFlushAndExit(reply);
 }
@@ -91,20 +92,21 @@ void requestRelaunch(double date) { hooks().scheduleRelaunch(date); }
 Dictionary createCallParameters(const String& accountName, const String& sessionID,
                                 const Dictionary& options) {
     Dictionary parameters;
-    parameters.set("dsSession", sessionID);
-    parameters.set("VeltoIDAuthProtocolVersion", Value::int64(kVeltoIDAuthProtocolVersion));
-    parameters.set("TamrixVersion", frameworkVersionText());
-    parameters.set("ClientTime", Value::date(platform::Clock::shared().now()));
+    parameters.set(wire::kSession, sessionID);
+    parameters.set(wire::kProtocolVersion, Value::int64(kVeltoIDAuthProtocolVersion));
+    parameters.set(wire::kFrameworkVersion, frameworkVersionText());
+    parameters.set(wire::kClientTime, Value::date(platform::now()));
     const platform::SystemVersion& system = platform::systemVersion();
-    if (system.productName) parameters.set("ProductName", *system.productName);
-    if (system.buildVersion) parameters.set("SystemVersion", *system.buildVersion);
+    if (system.productName) parameters.set(wire::kProductName, *system.productName);
+    if (system.buildVersion) parameters.set(wire::kSystemVersion, *system.buildVersion);
     if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerMetaInformationItemsKey)) {
         if (auto information = __VeltoIDDBCopyMetaInformation(accountName, options))
-            parameters.set("MetaInformation", *information);
+            parameters.set(wire::kMetaInformation, *information);
     }
     if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerAccountInformationItemsKey)) {
-        Dictionary record;
-        if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) parameters.set("AccountInformation", record);
+        AccountRecord record;
+        if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record))
+            parameters.set(wire::kAccountInformation, record.values());
     }
     return parameters;
 }

@@ -2,6 +2,8 @@
 
 #include <span>
 
+#include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/Base64.h"
 #include "Values/DateText.h"
@@ -11,6 +13,7 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
+#include "VeltoIDXMLServerCommunications/WireKeys.h"
 
 namespace veltoid {
 namespace {
@@ -24,13 +27,6 @@ struct Method {
     /// Empty when successes are not counted.
     std::string_view counter;
 };
-
-/// Spoiled for reuse: whatever the server thinks of the session now, nobody else gets it.
-void spoil(VeltoIDAuthenticationSessionInfo& session) {
-    session.fSessionID = nullptr;
-    session.fCreated = 0;
-    session.fValidityDuration = 0;
-}
 
 struct Call {
     bool succeeded = false;
@@ -57,10 +53,11 @@ void count(VeltoIDAuthenticationSessionInfo& session, const Method& method, cons
         __VeltoIDDBIncrementMetaInfoCounter(session.fAccountName, options, method.counter, 1);
 }
 
-/// A failed call: hands out the translated error, and nobody else gets the session.
+/// A failed call: hands out the translated error; the session is not used for anything else.
 void fail(VeltoIDAuthenticationSessionInfo& session, const Call& call, ErrorOut error) {
-    fillError(error, copyAndHandleXMLErrorResponse(session.fAccountName, call.reply, call.error));
-    spoil(session);
+    fillError(error, copyAndHandleXMLErrorResponse(session.fAccountName, session.fPasswordHash, call.reply,
+                                                   call.error));
+    session.spoil();
 }
 
 /// The reply, or none and the translated error.
@@ -82,18 +79,13 @@ bool callOnQueue(VeltoIDAuthenticationSessionInfo& session, const Method& method
         [&] { return call(session, method, own, options, error).has_value(); });
 }
 
-template <typename Output>
-void fill(Output* output, Output value) {
-    if (output != nullptr) *output = std::move(value);
-}
-
 void takeValidationRecord(const Dictionary& reply, Dictionary& result) {
-    const Data record = base64Decode(reply.string("VIDVRecord"));
+    const Data record = base64Decode(reply.string(wire::kValidationRecord));
     // Text that is no base64 decodes to nothing.
     if (record.size() == 0) return;
     result.set(kVeltoIDAccountValidationRecordDataKey, record);
-    result.set(kVeltoIDAccountValidationRecordIdentifierKey, reply.string("VIDVRecordIdentifier"));
-    if (const auto nextCheck = dateFromValue(reply.string("VIDVRecordNextCheckDate")))
+    result.set(kVeltoIDAccountValidationRecordIdentifierKey, reply.string(wire::kValidationRecordIdentifier));
+    if (const auto nextCheck = dateFromValue(reply.string(wire::kValidationRecordNextCheck)))
         result.set(kVeltoIDAccountValidationRecordNextCheckDateKey, Value::date(*nextCheck));
 }
 
@@ -104,24 +96,24 @@ struct ReplyEntry {
 };
 
 constexpr ReplyEntry kGetMyInfoEntries[] = {
-    {"encDsId", Value::Kind::String, kVeltoIDAccountDSIDKey},
-    {"lastNm", Value::Kind::String, kVeltoIDAccountLastNameKey},
-    {"firstNm", Value::Kind::String, kVeltoIDAccountFirstNameKey},
-    {"ValidatedEmail", Value::Kind::Array, kVeltoIDAccountValidatedEmailKey},
-    {"ValidatedPhones", Value::Kind::Array, kVeltoIDAccountValidatedPhonesKey},
-    {"PrimaryEmail", Value::Kind::String, kVeltoIDAccountPrimaryEmailKey},
-    {"VeltoID", Value::Kind::String, kVeltoIDAccountNameKey},
-    {"CertificateIsValid", Value::Kind::Boolean, kVeltoIDAccountCertificateIsValidKey},
-    {"AllEmails", Value::Kind::Array, "AllEmails"},
-    {"ValidForInterval", Value::Kind::Number, kVeltoIDAccountValidForIntervalKey},
+    {wire::kEncDsId, Value::Kind::String, kVeltoIDAccountDSIDKey},
+    {wire::kLastName, Value::Kind::String, kVeltoIDAccountLastNameKey},
+    {wire::kFirstName, Value::Kind::String, kVeltoIDAccountFirstNameKey},
+    {wire::kValidatedEmail, Value::Kind::Array, kVeltoIDAccountValidatedEmailKey},
+    {wire::kValidatedPhones, Value::Kind::Array, kVeltoIDAccountValidatedPhonesKey},
+    {wire::kPrimaryEmail, Value::Kind::String, kVeltoIDAccountPrimaryEmailKey},
+    {wire::kAccountName, Value::Kind::String, kVeltoIDAccountNameKey},
+    {wire::kCertificateIsValid, Value::Kind::Boolean, kVeltoIDAccountCertificateIsValidKey},
+    {wire::kAllEmails, Value::Kind::Array, message::kAllEmails},
+    {wire::kValidForInterval, Value::Kind::Number, kVeltoIDAccountValidForIntervalKey},
 };
 
 constexpr ReplyEntry kCertificateEntries[] = {
-    {"Certificate", Value::Kind::String, "Certificate"},
-    {"CertType", Value::Kind::String, "CertType"},
-    {"SerialNumber", Value::Kind::String, kVeltoIDCertificateSerialNumberKey},
-    {"CertStatus", Value::Kind::String, kVeltoIDCertificateStatusKey},
-    {"IntermediateCert", Value::Kind::String, "IntermediateCertificate"},
+    {wire::kCertificate, Value::Kind::String, kVeltoIDCertificateCertificateKey},
+    {wire::kCertificateType, Value::Kind::String, kVeltoIDCertificateTypeKey},
+    {wire::kSerialNumber, Value::Kind::String, kVeltoIDCertificateSerialNumberKey},
+    {wire::kCertificateStatus, Value::Kind::String, kVeltoIDCertificateStatusKey},
+    {wire::kIntermediateCertificate, Value::Kind::String, kVeltoIDCertificateIntermediateCertificateKey},
 };
 
 void takeEntries(const Dictionary& reply, std::span<const ReplyEntry> entries, Dictionary& result) {
@@ -141,29 +133,22 @@ std::optional<Dictionary> copyCertificateResultFromDsCert(const Dictionary* dsCe
     if (dsCert == nullptr) return std::nullopt;
     Dictionary result;
     takeEntries(*dsCert, kCertificateEntries, result);
-    if (const auto expires = dateFromValue((*dsCert)["Expires"]))
+    if (const auto expires = dateFromValue((*dsCert)[wire::kCertificateExpiration]))
         result.set(kVeltoIDCertificateExpirationDateKey, Value::date(*expires));
     return result.empty() ? std::nullopt : std::optional(result);
 }
 
 Value delayOf(const Dictionary& reply) {
-    const Value& delay = reply["Delay"];
+    const Value& delay = reply[wire::kDelay];
     return delay.isNumber() ? delay : Value();
 }
 
 /// Some servers answer with a list of certificates, the wanted one first.
 const Dictionary* dsCertOf(const Dictionary& reply) {
-    const Value& dsCert = reply["dsCert"];
+    const Value& dsCert = reply[wire::kCertificateEntry];
     const Array* list = dsCert.asArray();
     if (list != nullptr) return list->empty() ? nullptr : (*list)[0].asDictionary();
     return dsCert.asDictionary();
-}
-
-/// The lifetime to ask for; a Number that is none as a double counts as 0.
-double requestedLifetime(const String& accountName, const Dictionary& options) {
-    const Value lifetime = __VeltoIDDBCopyMetaInfoValue(
-        accountName, options, "VeltoIDMetaDefaultCertificateRequestedLifetime", Value::Kind::Number);
-    return lifetime.isNumber() ? lifetime.asDouble().value_or(0) : kVeltoIDRequestedCertificateLifetime;
 }
 
 bool isPending(const Call& call) {
@@ -179,14 +164,14 @@ CertificateAnswer pendingAnswer(const Call& call, const String& token) {
 
 /// The parameters that say whose breadcrumb it is.
 Dictionary breadcrumbParameters(const String& accountName, const String& key) {
-    return {{"machineUUID", __VeltoIDDBCopyAccountValue(accountName, kVeltoIDAccountUUIDKey)},
-            {"breadcrumbKey", key}};
+    return {{wire::kMachineUUID, __VeltoIDDBCopyAccountValue(accountName, kVeltoIDAccountUUIDKey)},
+            {wire::kBreadcrumbKey, key}};
 }
 
 String serialNumberOf(const String& encDsId) {
-    Dictionary entry;
-    if (!__VeltoIDDBCopyCertificateInfo(encDsId, &entry)) return nullptr;
-    return entry.string(kVeltoIDCertificateSerialNumberKey);
+    CertificateEntry entry;
+    __VeltoIDDBCopyCertificateInfo(encDsId, &entry);
+    return entry.serialNumber();
 }
 
 }  // namespace
@@ -197,15 +182,15 @@ bool _VeltoIDSessionDoGetMyInfo(VeltoIDAuthenticationSessionInfo& session, const
     return session.fDispatchQueue.sync([&] {
         const String certificateSerial = serialNumberOf(encDsId);
         const Dictionary own = {
-            {"encDsId", encDsId ? encDsId : session.fEncDsId},
-            {"CertificateSerialNumber",
+            {wire::kEncDsId, encDsId ? encDsId : session.fEncDsId},
+            {wire::kKnownSerialNumber,
              certificateSerial ? certificateSerial : parameters.string(kVeltoIDCertificateSerialNumberKey)},
-            {"ClientVIDVRecordIdentifier", parameters.string(kVeltoIDAccountValidationRecordIdentifierKey)},
+            {wire::kKnownRecordIdentifier, parameters.string(kVeltoIDAccountValidationRecordIdentifierKey)},
         };
         const auto reply = call(session, {"getMyInfo", kVeltoIDXMLGetMyInfoCountKey}, own, options, error);
         if (!reply) return false;
-        if (!session.fEncDsId) session.fEncDsId = reply->string("encDsId");
-        if (result != nullptr) *result = getMyInfoResult(*reply);
+        if (!session.fEncDsId) session.fEncDsId = reply->string(wire::kEncDsId);
+        fill(result, getMyInfoResult(*reply));
         return true;
     });
 }
@@ -214,9 +199,9 @@ bool __VeltoIDSessionDoFindPerson(VeltoIDAuthenticationSessionInfo& session, con
                                   const Dictionary& options, std::optional<Array>* matches, ErrorOut error) {
     return session.fDispatchQueue.sync([&] {
         const auto reply = call(session, {"findPerson", kVeltoIDXMLFindPersonCountKey},
-                                {{"searchCriteria", criteria}}, options, error);
+                                {{wire::kSearchCriteria, criteria}}, options, error);
         if (!reply) return false;
-        const Array* found = reply->array("matches");
+        const Array* found = reply->array(wire::kMatches);
         if (found != nullptr) __VeltoIDDBAddFindPersonResultsToCache(*found);
         fill(matches, found != nullptr ? std::optional(*found) : std::nullopt);
         return true;
@@ -228,17 +213,19 @@ bool __VeltoIDSessionDoSendCSR(VeltoIDAuthenticationSessionInfo& session, const 
                                CertificateAnswer* answer, ErrorOut error) {
     return session.fDispatchQueue.sync([&] {
         const Dictionary own = {
-            {"__CERT_FETCH_DELAY_MIN", options.string("__CERT_FETCH_DELAY_MIN")},
-            {"__CERT_FETCH_DELAY_MAX", options.string("__CERT_FETCH_DELAY_MAX")},
-            {"CSR", request},
-            {"encDsId", encDsId},
-            {"RequestedCertificateLifetimeInSeconds",
-             Value::real(requestedLifetime(session.fAccountName, options))},
+            {wire::kFetchDelayMinimum, options.string(option::kFetchDelayMinimum)},
+            {wire::kFetchDelayMaximum, options.string(option::kFetchDelayMaximum)},
+            {wire::kRequest, request},
+            {wire::kEncDsId, encDsId},
+            {wire::kRequestedLifetime,
+             Value::real(metaInterval(session.fAccountName, options, kVeltoIDMetaCertificateLifetimeKey,
+                                      kVeltoIDRequestedCertificateLifetime))},
         };
         const auto reply = call(session, {"createCert", kVeltoIDXMLSendCSRCountKey}, own, options, error);
         if (!reply) return false;
-        fill(token, reply->string("CertificateToken"));
-        fill(answer, {copyCertificateResultFromDsCert(reply->dictionary("dsCert")), delayOf(*reply)});
+        fill(token, reply->string(wire::kCertificateToken));
+        fill(answer,
+             {copyCertificateResultFromDsCert(reply->dictionary(wire::kCertificateEntry)), delayOf(*reply)});
         return true;
     });
 }
@@ -249,7 +236,7 @@ bool __VeltoIDSessionDoFetchCSRResult(VeltoIDAuthenticationSessionInfo& session,
     constexpr Method kMethod{"fetchCert", kVeltoIDXMLFetchCertCountKey};
     return session.fDispatchQueue.sync([&] {
         const Call made =
-            invoke(session, kMethod, {{"CertificateToken", token}, {"encDsId", encDsId}}, options);
+            invoke(session, kMethod, {{wire::kCertificateToken, token}, {wire::kEncDsId, encDsId}}, options);
         if (made.isAnswered()) {
             fill(answer, {copyCertificateResultFromDsCert(dsCertOf(*made.reply)), delayOf(*made.reply)});
         } else if (isPending(made)) {
@@ -266,7 +253,7 @@ bool __VeltoIDSessionDoFetchCSRResult(VeltoIDAuthenticationSessionInfo& session,
 bool __VeltoIDSessionDoCompleteCertificate(VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
                                            const String& token, const Dictionary& options, ErrorOut error) {
     return callOnQueue(session, {"downloadCertComplete", kVeltoIDXMLCompleteCertCountKey},
-                       {{"CertificateToken", token}, {"encDsId", encDsId}}, options, error);
+                       {{wire::kCertificateToken, token}, {wire::kEncDsId, encDsId}}, options, error);
 }
 
 bool __VeltoIDSessionDoFetchCertificateBySerialNumber(VeltoIDAuthenticationSessionInfo& session,
@@ -274,9 +261,9 @@ bool __VeltoIDSessionDoFetchCertificateBySerialNumber(VeltoIDAuthenticationSessi
                                                       String* certificate, ErrorOut error) {
     return session.fDispatchQueue.sync([&] {
         const auto reply = call(session, {"fetchCert", kVeltoIDXMLFetchCertCountKey},
-                                {{"certSerialNumber", serialNumber}}, options, error);
+                                {{wire::kFetchedSerialNumber, serialNumber}}, options, error);
         if (!reply) return false;
-        fill(certificate, reply->string("Certificate"));
+        fill(certificate, reply->string(wire::kCertificate));
         return true;
     });
 }
@@ -284,7 +271,7 @@ bool __VeltoIDSessionDoFetchCertificateBySerialNumber(VeltoIDAuthenticationSessi
 bool __VeltoIDSessionDoRevokeCertificate(VeltoIDAuthenticationSessionInfo& session,
                                          const String& serialNumber, const Dictionary& options,
                                          ErrorOut error) {
-    return callOnQueue(session, {"revokeCert", {}}, {{"SerialNumber", serialNumber}}, options, error);
+    return callOnQueue(session, {"revokeCert", {}}, {{wire::kSerialNumber, serialNumber}}, options, error);
 }
 
 Data __VeltoIDSessionDoCopyBreadcrumb(VeltoIDAuthenticationSessionInfo& session, const String& key,
@@ -296,7 +283,7 @@ Data __VeltoIDSessionDoCopyBreadcrumb(VeltoIDAuthenticationSessionInfo& session,
             fail(session, made, error);
             return {};
         }
-        const Data data = made.reply ? base64Decode(made.reply->string("ek")) : Data();
+        const Data data = made.reply ? base64Decode(made.reply->string(wire::kBreadcrumb)) : Data();
         // Text that is no base64 decodes to nothing.
         return data.size() > 0 ? data : Data();
     });
@@ -305,7 +292,7 @@ Data __VeltoIDSessionDoCopyBreadcrumb(VeltoIDAuthenticationSessionInfo& session,
 bool __VeltoIDSessionDoSetBreadcrumb(VeltoIDAuthenticationSessionInfo& session, const String& key,
                                      const Data& data, const Dictionary& options, ErrorOut error) {
     Dictionary own = breadcrumbParameters(session.fAccountName, key);
-    own.set("ek", base64Encode(data));
+    own.set(wire::kBreadcrumb, base64Encode(data));
     return callOnQueue(session, {"saveBreadcrumbEk", {}}, own, options, error);
 }
 

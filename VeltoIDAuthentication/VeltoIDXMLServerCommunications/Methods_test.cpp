@@ -4,7 +4,6 @@
 
 #include "TestSupport/FakeIdentityServer.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
-#include "VeltoIDXMLServerCommunications/SessionCache.h"
 
 namespace veltoid {
 namespace {
@@ -17,9 +16,9 @@ class GetMyInfo : public ServerTest {
     }
 
     Session session(const String& encDsId = "d1") const {
-        return std::make_unique<VeltoIDAuthenticationSessionInfo>(
-            VeltoIDAuthenticationSessionInfo{kName, kPassword, "https://server.example", "s1", now(), 100,
-                                             encDsId, copySessionQueueForAccount(kName)});
+        return Session(new VeltoIDAuthenticationSessionInfo{kName, kPassword, "https://server.example", "s1",
+                                                            now(), 100, encDsId,
+                                                            copySessionQueueForAccount(kName)});
     }
 
     /// What the operation makes of a reply.
@@ -161,7 +160,7 @@ TEST_F(GetMyInfo, AFailedCallSpoilsTheSession) {
         EXPECT_EQ(error->code, each.code) << each.what;
         EXPECT_EQ(hasPassword(), each.keepsPassword) << each.what;
         EXPECT_EQ(failing->fSessionID, String()) << each.what;
-        __VeltoIDSessionRelease(std::move(failing));
+        failing.reset();
         EXPECT_EQ(takeCachedSession(kName, kPassword, "https://server.example"), nullptr) << each.what;
     }
     EXPECT_EQ(count("VeltoIDXMLGetMyInfoCount"), 0);
@@ -169,7 +168,7 @@ TEST_F(GetMyInfo, AFailedCallSpoilsTheSession) {
     Session working = session();
     EXPECT_TRUE(_VeltoIDSessionDoGetMyInfo(*working, "d1", {}, {}, nullptr, nullptr));
     EXPECT_EQ(working->fValidityDuration, 50) << "commands of any reply are applied";
-    __VeltoIDSessionRelease(std::move(working));
+    working.reset();
     EXPECT_NE(takeCachedSession(kName, kPassword, "https://server.example"), nullptr);
 }
 

@@ -1,6 +1,6 @@
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 
-#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
 
 namespace veltoid {
 namespace {
@@ -11,7 +11,8 @@ constexpr int64_t kFaultAccountDisabled = -20209;
 
 }  // namespace
 
-Error copyAndHandleXMLErrorResponse(const String& accountName, const std::optional<Dictionary>& response,
+Error copyAndHandleXMLErrorResponse(const String& accountName, const String& passwordHash,
+                                    const std::optional<Dictionary>& response,
                                     const std::optional<Error>& error) {
     int64_t code = identity_error::kUnknown;
     ErrorTexts texts;
@@ -32,8 +33,9 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const std::option
             }
         }
     }
-    if (code != identity_error::kUnknown) __VeltoIDDBRemovePassword(accountName);
-    return makeError(code, texts, userInfo, __func__, __FILE_NAME__, __LINE__);
+    Error translated = makeError(code, texts, userInfo, __func__, __FILE_NAME__, __LINE__);
+    judgeRefusal(accountName, passwordHash, translated);
+    return translated;
 }
 
 }  // namespace veltoid

@@ -11,10 +11,12 @@ namespace veltoid {
 /// Where people manage their account.
 inline constexpr std::string_view kVeltoIDAccountManagementSite = "https://account.velto.example";
 
-/// The agent's error for a failed call: wrong account or password (-101) and disabled account (-102) also
-/// remove the stored password of the account; anything else is -100. Fault, fault code and response go into
-/// the user information. Any queue but the database's.
-Error copyAndHandleXMLErrorResponse(const String& accountName, const std::optional<Dictionary>& response,
+/// The agent's error for a call that failed with this password hash: wrong account or password (-101),
+/// disabled account (-102), anything else (-100). What that means for the stored password is judged at once
+/// (PasswordRefusal.h). Fault, fault code and response go into the user information. Any queue but the
+/// database's.
+Error copyAndHandleXMLErrorResponse(const String& accountName, const String& passwordHash,
+                                    const std::optional<Dictionary>& response,
                                     const std::optional<Error>& error);
 
 }  // namespace veltoid

@@ -7,7 +7,6 @@
 
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
-#include "VeltoIDXMLServerCommunications/SessionCache.h"
 
 namespace veltoid {
 namespace {
@@ -19,7 +18,7 @@ struct Sessions {
 
     const platform::WorkQueue globalQueue{"sVeltoIDAuthenticationSessionGlobalQueue"};
     /// On the global queue only.
-    std::vector<Session> cached;
+    std::vector<IdleSession> cached;
 };
 
 Sessions& state() { return platform::Lifetime::current().state<Sessions>(); }
@@ -27,7 +26,27 @@ Sessions& state() { return platform::Lifetime::current().state<Sessions>(); }
 platform::WorkQueue globalQueue() { return state().globalQueue; }
 
 /// On the global queue only.
-std::vector<Session>& cachedSessions() { return state().cached; }
+std::vector<IdleSession>& cachedSessions() { return state().cached; }
+
+/// Has the session destroyed on its own queue.
+void destroy(IdleSession session) {
+    const platform::WorkQueue queue = session->fDispatchQueue;
+    queue.async([released = std::shared_ptr<VeltoIDAuthenticationSessionInfo>(std::move(session))] {});
+}
+
+/// Keeps the session; those whose time has passed go.
+void cache(IdleSession session) {
+    globalQueue().sync([&] {
+        auto& sessions = cachedSessions();
+        const double now = platform::now();
+        const auto expired =
+            std::stable_partition(sessions.begin(), sessions.end(),
+                                  [&](const IdleSession& cached) { return cached->isReusableAt(now); });
+        std::for_each(expired, sessions.end(), [](IdleSession& cached) { destroy(std::move(cached)); });
+        sessions.erase(expired, sessions.end());
+        sessions.push_back(std::move(session));
+    });
+}
 
 }  // namespace
 
@@ -40,50 +59,33 @@ platform::WorkQueue copySessionQueueForAccount(const String& accountName) {
     return table.queues.emplace_back(accountName, platform::WorkQueue("queue.session.")).second;
 }
 
-void __VeltoIDSessionRelease(Session session) {
-    if (!session) return;
-    const platform::WorkQueue queue = session->fDispatchQueue;
-    queue.sync([&] {
-        if (session->isReusableAt(platform::Clock::shared().now())) {
-            cacheSession(std::move(session));
-        } else {
-            destroySession(std::move(session));
-        }
-    });
-}
-
-Session takeCachedSession(const String& accountName, const String& passwordHash, const String& serverURL) {
+IdleSession takeCachedSession(const String& accountName, const String& passwordHash,
+                              const String& serverURL) {
     if (!accountName || !passwordHash || !serverURL) return nullptr;
-    return globalQueue().sync([&]() -> Session {
+    return globalQueue().sync([&]() -> IdleSession {
         auto& sessions = cachedSessions();
-        const double now = platform::Clock::shared().now();
-        const auto match = std::find_if(sessions.begin(), sessions.end(), [&](const Session& session) {
+        const double now = platform::now();
+        const auto match = std::find_if(sessions.begin(), sessions.end(), [&](const IdleSession& session) {
             return session->fAccountName == accountName && session->fPasswordHash == passwordHash &&
                    session->fServerURL == serverURL && session->isReusableAt(now);
         });
         if (match == sessions.end()) return nullptr;
-        Session taken = std::move(*match);
+        IdleSession taken = std::move(*match);
         sessions.erase(match);
         return taken;
     });
 }
 
-void cacheSession(Session session) {
-    globalQueue().sync([&] {
-        auto& sessions = cachedSessions();
-        const double now = platform::Clock::shared().now();
-        const auto expired =
-            std::stable_partition(sessions.begin(), sessions.end(),
-                                  [&](const Session& cached) { return cached->isReusableAt(now); });
-        std::for_each(expired, sessions.end(), [](Session& cached) { destroySession(std::move(cached)); });
-        sessions.erase(expired, sessions.end());
-        sessions.push_back(std::move(session));
-    });
-}
-
-void destroySession(Session session) {
+void __VeltoIDSessionRelease(VeltoIDAuthenticationSessionInfo* session) {
     const platform::WorkQueue queue = session->fDispatchQueue;
-    queue.async([released = std::shared_ptr<VeltoIDAuthenticationSessionInfo>(std::move(session))] {});
+    queue.sync([&] {
+        IdleSession idle(session);
+        if (idle->isReusableAt(platform::now())) {
+            cache(std::move(idle));
+        } else {
+            destroy(std::move(idle));
+        }
+    });
 }
 
 }  // namespace veltoid

@@ -1,9 +1,9 @@
 // Sessions with the identity server: the record that a sign-in yields, and the queue of each account.
 //
 // All server traffic of an account runs on the account's own serial queue, so that two calls for one account
-// never overlap while different accounts proceed side by side. A session is built by the sign-in, lives with
-// the engine while methods run, and is given back with __VeltoIDSessionRelease: it is cached while the server
-// lets it be reused, else destroyed.
+// never overlap while different accounts proceed side by side. A session is built by the sign-in and lives
+// with the engine while methods run. When its owner lets go of it, it is cached while the server lets it be
+// reused, else destroyed.
 #pragma once
 
 #include <memory>
@@ -28,18 +28,37 @@ struct VeltoIDAuthenticationSessionInfo {
     String fEncDsId;
     platform::WorkQueue fDispatchQueue;
 
+    /// The session is not to be used again: it is destroyed when its owner lets go of it.
+    void spoil() {
+        fSessionID = nullptr;
+        fCreated = 0;
+        fValidityDuration = 0;
+    }
+
     bool isReusableAt(double now) const {
         return fEncDsId && fCreated != 0 && fCreated <= now && now < fCreated + fValidityDuration;
     }
 };
 
-/// The engine's handle on a session.
-using Session = std::unique_ptr<VeltoIDAuthenticationSessionInfo>;
+/// Caches the session, oldest first, or has it destroyed on its queue. Called by Session's destructor alone:
+/// on any queue but the session's own.
+void __VeltoIDSessionRelease(VeltoIDAuthenticationSessionInfo* session);
+
+struct SessionReleaser {
+    void operator()(VeltoIDAuthenticationSessionInfo* session) const { __VeltoIDSessionRelease(session); }
+};
+
+/// The engine's handle on a session. It must not end on the session's own queue.
+using Session = std::unique_ptr<VeltoIDAuthenticationSessionInfo, SessionReleaser>;
+
+/// A session without a user: cached, or not signed in yet. It just ends.
+using IdleSession = std::unique_ptr<VeltoIDAuthenticationSessionInfo>;
 
 /// The account's queue, created on first use and kept. Any thread.
 platform::WorkQueue copySessionQueueForAccount(const String& accountName);
 
-/// Caches the session or has it destroyed on its queue. Any queue but the session's own; null is ignored.
-void __VeltoIDSessionRelease(Session session);
+/// Takes the first cached session of exactly this account, password and server that is still valid; null when
+/// there is none. Any thread.
+IdleSession takeCachedSession(const String& accountName, const String& passwordHash, const String& serverURL);
 
 }  // namespace veltoid

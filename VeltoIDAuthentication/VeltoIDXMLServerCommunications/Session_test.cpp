@@ -4,7 +4,6 @@
 #include "TestSupport/FakeIdentityServer.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
-#include "VeltoIDXMLServerCommunications/SessionCache.h"
 
 namespace veltoid {
 namespace {
@@ -15,12 +14,12 @@ class SessionTest : public ServerTest {
   protected:
     Session session(double age = 0, double validity = 100, const String& encDsId = "d1",
                     const String& id = "s") const {
-        return std::make_unique<VeltoIDAuthenticationSessionInfo>(VeltoIDAuthenticationSessionInfo{
-            kName, kPassword, kURL, id, now() - age, validity, encDsId, copySessionQueueForAccount(kName)});
+        return Session(new VeltoIDAuthenticationSessionInfo{kName, kPassword, kURL, id, now() - age, validity,
+                                                            encDsId, copySessionQueueForAccount(kName)});
     }
 
     static std::string takeID() {
-        const Session taken = takeCachedSession(kName, kPassword, kURL);
+        const IdleSession taken = takeCachedSession(kName, kPassword, kURL);
         return taken ? taken->fSessionID.text() : "none";
     }
 };
@@ -50,16 +49,14 @@ TEST_F(SessionTest, IsKeptWhileTheServerLetsItBeReused) {
         {"spoiled", now(), 1e12, "d", false},
     };
     for (const Case& each : cases) {
-        __VeltoIDSessionRelease(
-            session(each.age, each.validity, each.encDsId ? String(each.encDsId) : String()));
+        (void)session(each.age, each.validity, each.encDsId ? String(each.encDsId) : String());
         EXPECT_EQ(takeID(), each.isKept ? "s" : "none") << each.what;
         EXPECT_EQ(takeID(), "none") << each.what;
     }
-    __VeltoIDSessionRelease(nullptr);
 }
 
 TEST_F(SessionTest, IsFoundByAccountPasswordAndServer) {
-    __VeltoIDSessionRelease(session());
+    (void)session();
     EXPECT_EQ(takeCachedSession("other", kPassword, kURL), nullptr);
     EXPECT_EQ(takeCachedSession(kName, "other", kURL), nullptr);
     EXPECT_EQ(takeCachedSession(kName, kPassword, "other"), nullptr);
@@ -70,16 +67,16 @@ TEST_F(SessionTest, IsFoundByAccountPasswordAndServer) {
 }
 
 TEST_F(SessionTest, TheOldestThatIsStillValidComesFirst) {
-    __VeltoIDSessionRelease(session(0, 10, "d", "short"));
-    __VeltoIDSessionRelease(session(0, 100, "d", "first"));
-    __VeltoIDSessionRelease(session(0, 100, "d", "second"));
+    (void)session(0, 10, "d", "short");
+    (void)session(0, 100, "d", "first");
+    (void)session(0, 100, "d", "second");
     clock_.advanceBy(20);
-    Session first = takeCachedSession(kName, kPassword, kURL);
+    IdleSession first = takeCachedSession(kName, kPassword, kURL);
     ASSERT_NE(first, nullptr);
     EXPECT_EQ(first->fSessionID, "first");
     EXPECT_EQ(takeID(), "second");
     clock_.advanceBy(70);
-    __VeltoIDSessionRelease(std::move(first));
+    (void)Session(first.release());
     clock_.advanceBy(20);
     EXPECT_EQ(takeID(), "none") << "use does not prolong it";
 }
@@ -250,7 +247,7 @@ TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
     };
     for (const Case& each : cases) {
         createAccount();
-        const Error error = copyAndHandleXMLErrorResponse(kName, each.response, each.error);
+        const Error error = copyAndHandleXMLErrorResponse(kName, kPassword, each.response, each.error);
         EXPECT_EQ(error.domain, kIdentityErrorDomain) << each.what;
         EXPECT_EQ(error.code, each.code) << each.what;
         EXPECT_EQ(error.userInfo[kErrorFailureReasonKey], each.reason ? Value(each.reason) : Value())
@@ -262,9 +259,10 @@ TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
         EXPECT_EQ(hasPassword(), !each.removesPassword) << each.what;
     }
     EXPECT_EQ(
-        copyAndHandleXMLErrorResponse(kName, {}, faultOf(-20209)).userInfo[kErrorDescriptionKey],
+        copyAndHandleXMLErrorResponse(kName, kPassword, {}, faultOf(-20209)).userInfo[kErrorDescriptionKey],
         Value("Go to https://account.velto.example for information on how to re-enable this Velto ID."));
-    EXPECT_EQ(copyAndHandleXMLErrorResponse(kName, {}, faultOf(-1)).userInfo["XMLFaultCode"], number(-1));
+    EXPECT_EQ(copyAndHandleXMLErrorResponse(kName, kPassword, {}, faultOf(-1)).userInfo["XMLFaultCode"],
+              number(-1));
 }
 
 }  // namespace

@@ -7,6 +7,7 @@
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
+#include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DateText.h"
 #include "Values/DictionaryAccess.h"
@@ -15,7 +16,7 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
-#include "VeltoIDXMLServerCommunications/SessionCache.h"
+#include "VeltoIDXMLServerCommunications/WireKeys.h"
 
 namespace veltoid {
 namespace {
@@ -43,20 +44,19 @@ class SignIn {
     void run() {
         hasRecord_ = __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
         const String url = serverURL();
-        if (!getBool(&options_, "DoNotUseCachedSession", false))
+        if (!getBool(&options_, option::kDoNotUseCachedSession, false))
             session_ = takeCachedSession(accountName_, passwordHash_, url);
         if (session_) {
             encDsId_ = session_->fEncDsId;
             count(kVeltoIDXMLSessionReusedCountKey);
         } else {
             if (mayConnect()) signInAnew(url);
-            if (!session_ && !held_)
-                held_ = Error{String(kIdentityErrorDomain), identity_error::kSignInFailed, {}};
+            if (!session_ && !held_) held_ = identityError(identity_error::kSignInFailed);
         }
         keepBooks();
     }
 
-    Session takeSession() { return std::move(session_); }
+    Session takeSession() { return Session(session_.release()); }
     const String& encDsId() const { return encDsId_; }
     const std::optional<Dictionary>& result() const { return result_; }
     const std::optional<Error>& error() const { return held_; }
@@ -68,10 +68,10 @@ class SignIn {
 
     /// From the options, the account's record, the meta information or its default; null for none.
     String serverURL() const {
-        const Value& given = options_["ServerURL"];
+        const Value& given = options_[option::kServerURL];
         String url = given.asString();
         if (const auto asURL = given.asURL()) url = asURL->first;
-        if (!url && hasRecord_) url = record_.string(kVeltoIDAccountServerURLKey);
+        if (!url && hasRecord_) url = record_.serverURL();
         if (!url)
             url = __VeltoIDDBCopyMetaInfoValue(nullptr, options_, kVeltoIDDBServerURLKey, Value::Kind::String)
                       .asString();
@@ -81,7 +81,7 @@ class SignIn {
     /// False, with the error held, while the server must not be contacted for this account.
     bool mayConnect() {
         if (!hasRecord_) return true;
-        if (record_.boolean(kVeltoIDAccountClientTooOldKey).value_or(false)) {
+        if (record_.isClientTooOld()) {
             VELTOID_LOG_FROM(
                 kOperation, kNotice,
                 "Not connecting to VeltoID authentication server because clientTooOld = true is set "
@@ -90,7 +90,7 @@ class SignIn {
             held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
             return false;
         }
-        const auto earliest = record_.date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
+        const auto earliest = record_.earliestConnection();
         if (earliest && *earliest > now_) {
             VELTOID_LOG_FROM(kOperation, kNotice,
                              "Not connecting to VeltoID authentication server because there is an "
@@ -109,7 +109,7 @@ class SignIn {
         if (url) {
             authenticate(url, parameters);
         } else {
-            held_ = copyAndHandleXMLErrorResponse(accountName_, std::nullopt,
+            held_ = copyAndHandleXMLErrorResponse(accountName_, passwordHash_, std::nullopt,
                                                   signInError(identity_error::kUnknown, __LINE__));
         }
         if (session_) return;
@@ -120,26 +120,26 @@ class SignIn {
 
     Dictionary authenticateParameters() {
         Dictionary parameters = createCallParameters(accountName_, nullptr, options_);
-        parameters.set("veltoConnect", accountName_);
-        parameters.set("pwdHash", passwordHash_);
-        parameters.set("UserUUID", __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaUserUUIDKey,
-                                                                Value::Kind::String));
-        parameters.set("ClientDateTime", Value::date(now_));
+        parameters.set(wire::kAccount, accountName_);
+        parameters.set(wire::kPasswordHash, passwordHash_);
+        parameters.set(wire::kUserUUID, __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaUserUUIDKey,
+                                                                     Value::Kind::String));
+        parameters.set(wire::kClientDateTime, Value::date(now_));
         if (hasRecord_) addAccountParameters(parameters);
         return parameters;
     }
 
     void addAccountParameters(Dictionary& parameters) {
-        oldEncDsId_ = record_.string(kVeltoIDAccountDSIDKey);
-        oldRecordIdentifier_ = record_.string(kVeltoIDAccountValidationRecordIdentifierKey);
-        parameters.set("ClientVIDVRecordIdentifier", oldRecordIdentifier_);
-        Dictionary entry;
-        if (oldEncDsId_ && __VeltoIDDBCopyCertificateInfo(oldEncDsId_, &entry))
-            parameters.set("CertificateSerialNumber", entry.string(kVeltoIDCertificateSerialNumberKey));
-        const String uuid = record_.string(kVeltoIDAccountUUIDKey);
-        parameters.set("AccountUUID", uuid);
-        parameters.set("machineUUID", uuid);
-        parameters.set("AccountStableUUID", record_.string(kVeltoIDAccountStableUUIDKey));
+        oldEncDsId_ = record_.encDsId();
+        oldRecordIdentifier_ = record_.validationRecordIdentifier();
+        parameters.set(wire::kKnownRecordIdentifier, oldRecordIdentifier_);
+        CertificateEntry entry;
+        __VeltoIDDBCopyCertificateInfo(oldEncDsId_, &entry);
+        parameters.set(wire::kKnownSerialNumber, entry.serialNumber());
+        const String uuid = record_.uuid();
+        parameters.set(wire::kAccountUUID, uuid);
+        parameters.set(wire::kMachineUUID, uuid);
+        parameters.set(wire::kAccountStableUUID, record_.stableUUID());
     }
 
     void authenticate(const String& url, const Dictionary& parameters) {
@@ -150,7 +150,7 @@ class SignIn {
         std::optional<Error> callError;
         const String method = std::string(kVeltoIDMethodPrefix) + "authenticate";
         if (!xmlInvoke(*session, method, parameters, &reply, &callError)) {
-            held_ = copyAndHandleXMLErrorResponse(accountName_, reply, callError);
+            held_ = copyAndHandleXMLErrorResponse(accountName_, passwordHash_, reply, callError);
             return;
         }
         count(kVeltoIDXMLAuthenticateCountKey);
@@ -159,33 +159,33 @@ class SignIn {
     }
 
     void applyReply(const Dictionary& reply, VeltoIDAuthenticationSessionInfo& session) {
-        serverVersion() = getInt32(&reply, "Version", 0);
+        serverVersion() = getInt32(&reply, wire::kVersion, 0);
         applyEmbargo(reply);
-        if (reply.boolean("ClientTooOld").value_or(false)) {
+        if (reply.boolean(wire::kClientTooOld).value_or(false)) {
             __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true),
-                                       true);
+                                       Notify::Yes);
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
         }
-        encDsId_ = reply.string("encDsId");
+        encDsId_ = reply.string(wire::kEncDsId);
         if (oldEncDsId_ && encDsId_ && oldEncDsId_ != encDsId_) disableCertificatesOfChangedAccount();
-        session.fSessionID = reply.string("dsSession");
+        session.fSessionID = reply.string(wire::kSession);
         if (encDsId_) {
             session.fEncDsId = encDsId_;
             applyCertificateState(reply);
         } else if (!held_) {
             held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
         }
-        applyRecordIdentifier(reply.string("VeltoIDRecordIdentifier"));
+        applyRecordIdentifier(reply.string(wire::kRecordIdentifier));
         result_ = reply;
     }
 
     void applyEmbargo(const Dictionary& reply) {
-        std::optional<double> date = dateFromValue(reply["DoNotConnectBeforeX"]);
-        const int32_t seconds = getInt32(&reply, "DoNotConnectForX", 0);
+        std::optional<double> date = dateFromValue(reply[wire::kDoNotConnectBefore]);
+        const int32_t seconds = getInt32(&reply, wire::kDoNotConnectFor, 0);
         if (!date && seconds >= 1) date = now_ + seconds;
         if (!date || *date <= now_) return;
         __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountEarliestAllowedConnectionDateKey,
-                                   Value::date(*date), true);
+                                   Value::date(*date), Notify::Yes);
         held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
     }
 
@@ -196,22 +196,23 @@ class SignIn {
                              << " so disabling the certs and VeltoIDValidationRecord on this account.");
         for (const String& encDsId : {oldEncDsId_, encDsId_})
             __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey,
-                                           kVeltoIDCertificateStatusInvalid, true);
+                                           kVeltoIDCertificateStatusInvalid, Notify::Yes);
         __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountValidationRecordIdentifierKey, Value::null(),
-                                   true);
+                                   Notify::Yes);
         __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_),
-                                       true);
+                                       Notify::Yes);
     }
 
     void applyCertificateState(const Dictionary& reply) {
-        if (reply.boolean("CertificateIsValid").value_or(false)) {
+        if (reply.boolean(wire::kCertificateIsValid).value_or(false)) {
             __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                           Value::date(now_), true);
-        } else if (reply.contains("CertificateIsValid") || reply.contains("CertificateNoLongerValid")) {
+                                           Value::date(now_), Notify::Yes);
+        } else if (reply.contains(wire::kCertificateIsValid) ||
+                   reply.contains(wire::kCertificateNoLongerValid)) {
             __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey,
-                                           kVeltoIDCertificateStatusInvalid, true);
+                                           kVeltoIDCertificateStatusInvalid, Notify::Yes);
             __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_),
-                                           true);
+                                           Notify::Yes);
         }
     }
 
@@ -221,11 +222,11 @@ class SignIn {
         __VeltoIDDBSetAccountValues(accountName_,
                                     {{kVeltoIDAccountValidationRecordIdentifierKey, Value::null()},
                                      {kVeltoIDAccountValidationRecordNextCheckDateKey, Value::null()}},
-                                    true);
+                                    Notify::Yes);
     }
 
     void keepBooks() {
-        if (!session_ || getBool(&options_, "DoNotSaveSessionInfo", false)) {
+        if (!session_ || getBool(&options_, option::kDoNotSaveSessionInfo, false)) {
             count(kVeltoIDMetaUnsuccessfulConnectionCountKey);
             return;
         }
@@ -238,12 +239,12 @@ class SignIn {
     const String& accountName_;
     const String& passwordHash_;
     const Dictionary& options_;
-    const double now_ = platform::Clock::shared().now();
+    const double now_ = platform::now();
     bool hasRecord_ = false;
-    Dictionary record_;
+    AccountRecord record_;
     String oldEncDsId_;
     String oldRecordIdentifier_;
-    Session session_;
+    IdleSession session_;
     String encDsId_;
     std::optional<Dictionary> result_;
     std::optional<Error> held_;

@@ -4,7 +4,6 @@
 
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/SystemLog.h"
-#include "XMLRPC/XMLRPCConnectionManager.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 
 namespace veltoid {
@@ -18,8 +17,8 @@ Error transportError(const platform::HTTPError& error) {
 
 Error noClientError() { return transportError({0, "the HTTPS client library cannot be loaded"}); }
 
-/// What one synchronous call and the HTTP session's delivery thread share: whoever comes first, the outcome
-/// or the end of the wait, closes it for the other.
+/// What one synchronous call and the HTTP session's delivery thread share. The first of two events decides:
+/// the outcome of the exchange, or the end of the wait; the later one has no effect.
 class SynchronousExchange : public platform::HTTPSessionEvents {
   public:
     // On the delivery thread, one after the other.
@@ -94,13 +93,13 @@ std::optional<XMLRPCResponse> XMLRPCConnection::sendSynchronousXMLRPCRequest(con
 
 std::shared_ptr<XMLRPCConnection> XMLRPCConnection::initWithXMLRPCRequest(
     std::shared_ptr<XMLRPCRequest> request, std::shared_ptr<XMLRPCConnectionDelegate> delegate,
-    XMLRPCConnectionManager& manager) {
-    auto connection =
-        std::make_shared<XMLRPCConnection>(Private(), std::move(request), std::move(delegate), manager);
+    EndHandler whenEnded) {
+    auto connection = std::make_shared<XMLRPCConnection>(Private(), std::move(request), std::move(delegate),
+                                                         std::move(whenEnded));
     const std::shared_ptr<platform::HTTPSessionEvents> events(connection, connection.get());
-    connection->mySession = platform::HTTPSession::create(events, platform::WorkQueue::main());
-    const std::string name = connection->myIdentifier.text();
-    if (!connection->mySession) {
+    connection->session_ = platform::HTTPSession::create(events, platform::WorkQueue::main());
+    const std::string name = connection->identifier_.text();
+    if (!connection->session_) {
         logLine(platform::LogPriority::Error, "The session, " + name + ", could not be established!",
                 __LINE__, __func__);
         return nullptr;
@@ -111,56 +110,53 @@ std::shared_ptr<XMLRPCConnection> XMLRPCConnection::initWithXMLRPCRequest(
 }
 
 XMLRPCConnection::XMLRPCConnection(Private, std::shared_ptr<XMLRPCRequest> request,
-                                   std::shared_ptr<XMLRPCConnectionDelegate> delegate,
-                                   XMLRPCConnectionManager& manager)
-    : myManager(manager),
-      myRequest(std::move(request)),
-      myIdentifier(stringByGeneratingUUID()),
-      myDelegate(std::move(delegate)) {}
+                                   std::shared_ptr<XMLRPCConnectionDelegate> delegate, EndHandler whenEnded)
+    : whenEnded_(std::move(whenEnded)),
+      request_(std::move(request)),
+      identifier_(stringByGeneratingUUID()),
+      delegate_(std::move(delegate)) {}
 
-void XMLRPCConnection::start() { mySession->start(myRequest->request()); }
+void XMLRPCConnection::start() { session_->start(request_->request()); }
 
-void XMLRPCConnection::cancel() { mySession->invalidateAndCancel(); }
-
-void XMLRPCConnection::close() { myManager.closeConnectionForIdentifier(myIdentifier); }
+void XMLRPCConnection::cancel() { session_->invalidateAndCancel(); }
 
 platform::ChallengeAnswer XMLRPCConnection::challenge(const platform::ProtectionSpace& space) {
     constexpr auto kDefault = platform::ChallengeAnswer::PerformDefaultHandling;
-    if (!myDelegate->canAuthenticateAgainstProtectionSpace(*myRequest, space).value_or(true)) return kDefault;
-    return myDelegate->didReceiveAuthenticationChallenge(*myRequest, space).value_or(kDefault);
+    if (!delegate_->canAuthenticateAgainstProtectionSpace(*request_, space).value_or(true)) return kDefault;
+    return delegate_->didReceiveAuthenticationChallenge(*request_, space).value_or(kDefault);
 }
 
 void XMLRPCConnection::responseHeader(int statusCode) {
-    myData.clear();
+    data_.clear();
     if (statusCode >= kFirstHTTPErrorStatus) {
-        myDelegate->didFailWithError(*myRequest, {kHTTPErrorDomain, statusCode, {}});
+        delegate_->didFailWithError(*request_, {kHTTPErrorDomain, statusCode, {}});
     } else if (statusCode == kNotModifiedStatus) {
-        close();
+        whenEnded_(identifier_);
     }
 }
 
 void XMLRPCConnection::bodyBytes(platform::Bytes bytes) {
-    myData.insert(myData.end(), bytes.begin(), bytes.end());
+    data_.insert(data_.end(), bytes.begin(), bytes.end());
 }
 
 void XMLRPCConnection::uploadProgress(uint64_t sent, uint64_t expected) {
     if (expected > 0)
-        myDelegate->didSendBodyData(*myRequest, static_cast<float>(sent) / static_cast<float>(expected));
+        delegate_->didSendBodyData(*request_, static_cast<float>(sent) / static_cast<float>(expected));
 }
 
 void XMLRPCConnection::completed(const std::optional<platform::HTTPError>& error) {
     if (error) return sessionBecameInvalid(transportError(*error));
-    if (!myData.empty()) myDelegate->didReceiveResponse(*myRequest, XMLRPCResponse(std::move(myData)));
-    close();
+    if (!data_.empty()) delegate_->didReceiveResponse(*request_, XMLRPCResponse(std::move(data_)));
+    whenEnded_(identifier_);
 }
 
 void XMLRPCConnection::sessionBecameInvalid(const Error& error) {
     logLine(platform::LogPriority::Error,
-            "The connection, " + myIdentifier.text() +
+            "The connection, " + identifier_.text() +
                 ", failed with the following error: " + error.userInfo.string(kErrorDescriptionKey).text(),
             __LINE__, __func__);
-    myDelegate->didFailWithError(*myRequest, error);
-    close();
+    delegate_->didFailWithError(*request_, error);
+    whenEnded_(identifier_);
 }
 
 }  // namespace veltoid

@@ -2,6 +2,7 @@
 // delegate.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 
@@ -11,8 +12,6 @@
 #include "XMLRPC/XMLRPCResponse.h"
 
 namespace veltoid {
-
-class XMLRPCConnectionManager;
 
 /// How long a synchronous call waits for the server.
 inline constexpr double kSynchronousTimeoutSeconds = 5.0;
@@ -53,8 +52,8 @@ class XMLRPCConnectionDelegate {
     }
 };
 
-/// The event-driven form. Its HTTP session reports to it on the main queue; it lives until the manager closes
-/// it: on failure, on status 304, on completion or when asked to.
+/// The event-driven form. Its HTTP session reports to it on the main queue. It reports its end (failure,
+/// status 304, completion) to its owner, which then lets go of it.
 class XMLRPCConnection : private platform::HTTPSessionEvents,
                          public std::enable_shared_from_this<XMLRPCConnection> {
     struct Private {};
@@ -66,16 +65,19 @@ class XMLRPCConnection : private platform::HTTPSessionEvents,
     static std::optional<XMLRPCResponse> sendSynchronousXMLRPCRequest(const XMLRPCRequest& request,
                                                                       ErrorOut error);
 
+    /// Called with the connection's identifier when it has ended, on the main queue.
+    using EndHandler = std::function<void(const String& identifier)>;
+
     /// A connection that has not started yet; null when there is no HTTP session to be had.
     static std::shared_ptr<XMLRPCConnection> initWithXMLRPCRequest(
         std::shared_ptr<XMLRPCRequest> request, std::shared_ptr<XMLRPCConnectionDelegate> delegate,
-        XMLRPCConnectionManager& manager);
+        EndHandler whenEnded);
 
     XMLRPCConnection(Private, std::shared_ptr<XMLRPCRequest> request,
-                     std::shared_ptr<XMLRPCConnectionDelegate> delegate, XMLRPCConnectionManager& manager);
+                     std::shared_ptr<XMLRPCConnectionDelegate> delegate, EndHandler whenEnded);
 
-    const String& identifier() const { return myIdentifier; }
-    const std::shared_ptr<XMLRPCConnectionDelegate>& delegate() const { return myDelegate; }
+    const String& identifier() const { return identifier_; }
+    const std::shared_ptr<XMLRPCConnectionDelegate>& delegate() const { return delegate_; }
 
     /// Sends the request. Once.
     void start();
@@ -91,14 +93,13 @@ class XMLRPCConnection : private platform::HTTPSessionEvents,
     void completed(const std::optional<platform::HTTPError>& error) override;
 
     void sessionBecameInvalid(const Error& error);
-    void close();
 
-    XMLRPCConnectionManager& myManager;
-    const std::shared_ptr<XMLRPCRequest> myRequest;
-    const String myIdentifier;
-    platform::SecretBytes myData;
-    std::shared_ptr<platform::HTTPSession> mySession;
-    const std::shared_ptr<XMLRPCConnectionDelegate> myDelegate;
+    const EndHandler whenEnded_;
+    const std::shared_ptr<XMLRPCRequest> request_;
+    const String identifier_;
+    platform::SecretBytes data_;
+    std::shared_ptr<platform::HTTPSession> session_;
+    const std::shared_ptr<XMLRPCConnectionDelegate> delegate_;
 };
 
 }  // namespace veltoid

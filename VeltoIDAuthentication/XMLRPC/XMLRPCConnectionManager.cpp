@@ -12,14 +12,15 @@ XMLRPCConnectionManager& XMLRPCConnectionManager::sharedManager() {
 
 String XMLRPCConnectionManager::spawnConnectionWithXMLRPCRequest(
     std::shared_ptr<XMLRPCRequest> request, std::shared_ptr<XMLRPCConnectionDelegate> delegate) {
-    const auto connection =
-        XMLRPCConnection::initWithXMLRPCRequest(std::move(request), std::move(delegate), *this);
+    const auto connection = XMLRPCConnection::initWithXMLRPCRequest(
+        std::move(request), std::move(delegate),
+        [this](const String& identifier) { closeConnectionForIdentifier(identifier); });
     if (!connection) return nullptr;
     {
         const std::lock_guard lock(mutex_);
-        myConnections.emplace(connection->identifier().text(), connection);
+        connections_.emplace(connection->identifier().text(), connection);
     }
-    // Held before it starts: it closes itself when it is done, which may be at once.
+    // Held before it starts: it may end at once.
     connection->start();
     return connection->identifier();
 }
@@ -27,40 +28,40 @@ String XMLRPCConnectionManager::spawnConnectionWithXMLRPCRequest(
 std::vector<String> XMLRPCConnectionManager::activeConnectionIdentifiers() const {
     const std::lock_guard lock(mutex_);
     std::vector<String> identifiers;
-    identifiers.reserve(myConnections.size());
-    for (const auto& [identifier, connection] : myConnections) identifiers.emplace_back(identifier);
+    identifiers.reserve(connections_.size());
+    for (const auto& [identifier, connection] : connections_) identifiers.emplace_back(identifier);
     return identifiers;
 }
 
 size_t XMLRPCConnectionManager::numberOfActiveConnections() const {
     const std::lock_guard lock(mutex_);
-    return myConnections.size();
+    return connections_.size();
 }
 
 std::shared_ptr<XMLRPCConnection> XMLRPCConnectionManager::connectionForIdentifier(
     const String& identifier) const {
     const std::lock_guard lock(mutex_);
-    const auto position = myConnections.find(identifier.view());
-    return position == myConnections.end() ? nullptr : position->second;
+    const auto position = connections_.find(identifier.view());
+    return position == connections_.end() ? nullptr : position->second;
 }
 
 void XMLRPCConnectionManager::closeConnectionForIdentifier(const String& identifier) {
     std::shared_ptr<XMLRPCConnection> connection;
     {
         const std::lock_guard lock(mutex_);
-        const auto position = myConnections.find(identifier.view());
-        if (position == myConnections.end()) return;
+        const auto position = connections_.find(identifier.view());
+        if (position == connections_.end()) return;
         connection = std::move(position->second);
-        myConnections.erase(position);
+        connections_.erase(position);
     }
     connection->cancel();
 }
 
 void XMLRPCConnectionManager::closeConnections() {
-    decltype(myConnections) connections;
+    decltype(connections_) connections;
     {
         const std::lock_guard lock(mutex_);
-        connections.swap(myConnections);
+        connections.swap(connections_);
     }
     for (const auto& [identifier, connection] : connections) connection->cancel();
 }

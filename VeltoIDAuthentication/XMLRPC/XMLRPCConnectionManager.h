@@ -39,7 +39,7 @@ class XMLRPCConnectionManager {
   private:
     mutable std::mutex mutex_;
     /// By identifier; guarded by the mutex, which is never held while a connection is called.
-    std::map<std::string, std::shared_ptr<XMLRPCConnection>, std::less<>> myConnections;
+    std::map<std::string, std::shared_ptr<XMLRPCConnection>, std::less<>> connections_;
 };
 
 }  // namespace veltoid

@@ -1,0 +1,157 @@
+#include "VeltoIDAuthenticationImpl/AccountActions.h"
+
+#include <algorithm>
+#include <cmath>
+
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Logging/LogText.h"
+#include "Platform/keychain/LockState.h"
+#include "Platform/runtime/Clock.h"
+#include "Protocol/OptionKeys.h"
+#include "Protocol/RecordKeys.h"
+#include "Values/DictionaryAccess.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDAuthenticationImpl/PollBackOff.h"
+#include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
+
+namespace veltoid {
+namespace {
+
+// Seconds.
+constexpr double kRenewalInterval = 86'400;
+constexpr double kRecordRetryInterval = 180;
+constexpr double kRecordCheckSoon = 15;
+constexpr double kRecordIntervalAfterServersDate = 14'400;
+
+constexpr double kRecordRetryGrowth = 1.5;
+
+constexpr std::string_view kNextCheckInterval = kVeltoIDAccountValidationRecordNextCheckIntervalKey;
+constexpr std::string_view kNextCheckDate = kVeltoIDAccountValidationRecordNextCheckDateKey;
+
+/// The keychain may have been unlocked, or locked, since the account was examined.
+void dropLostPassword(const AccountRecord& record) {
+    if (!platform::LockState::shared().hasBeenUnlockedSinceBoot() ||
+        copyPasswordFromKeychainGivenPersistentRef(record.passwordReference(), nullptr))
+        return;
+    __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountHashedPasswordKeychainReferenceKey,
+                               Value::null(), Notify::Yes);
+}
+
+/// The account is of no use until it is given its password again. One that the server refused is gone
+/// already; a hash of the record's own, without an item in the keychain, is not used.
+void disable(const AccountRecord& record) {
+    __VeltoIDDBSetAccountValues(
+        record.accountName(),
+        {{kVeltoIDAccountHashedPasswordKey, Value::null()}, {kVeltoIDAccountDSIDKey, Value::null()}},
+        Notify::Yes);
+}
+
+/// The certificate has just been evaluated and is good.
+void noteValidation(const String& encDsId) {
+    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateLastSuccessfulValidationDateKey,
+                                   Value::date(platform::now()), Notify::No);
+    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDDirtyKey, Value::boolean(false), Notify::No);
+}
+
+/// What is tried next after an attempt that failed.
+Dictionary laterAttempt(const AccountRecord& record) {
+    const auto stored = record.validationRecordNextCheckInterval();
+    const double interval = stored && *stored > 0 && std::isfinite(*stored)
+                                ? *stored
+                                : metaInterval(nullptr, {}, kVeltoIDMetaValidationRecordRetryIntervalKey,
+                                               kRecordRetryInterval, UnreadableInterval::Zero);
+    const double grown =
+        std::min(std::max(interval * kRecordRetryGrowth, kRecordRetryInterval), randomPollingDelay());
+    return {{kNextCheckDate, Value::date(platform::now() + interval)},
+            {kNextCheckInterval, Value::real(grown)}};
+}
+
+}  // namespace
+
+void checkAccount(const AccountRecord& record) {
+    const Dictionary options = {{option::kCheckNetwork, Value::boolean(true)}};
+    const String& accountName = record.accountName();
+    const String encDsId = record.encDsId();
+    switch (checkAccountAndDetermineNextAction(accountName, options)) {
+        case AccountState::NoEncodedDSID:
+            return __VeltoIDDoFetchEncodedDSIDForVeltoID(accountName, options);
+        case AccountState::PasswordInaccessibleInKeychain:
+            return dropLostPassword(record);
+        case AccountState::PasswordInvalid:
+            return disable(record);
+        case AccountState::CertificateRevoked:
+        case AccountState::CertificateExpired:
+            renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Remove);
+            return;
+        case AccountState::NoCertificate:
+        case AccountState::CertificateShouldBeRenewed:
+        case AccountState::CertificateMustBeRenewed:
+            renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Keep);
+            return;
+        case AccountState::CertificateOK:
+            return noteValidation(encDsId);
+        case AccountState::ValidationRecordNeedsToBeUpdated:
+            return fetchValidationRecordForAccount(record, options);
+        case AccountState::CertificatePending:
+            __VeltoIDDoFetchCertificateForVeltoID(accountName, FetchTime::WhenDue, options);
+            return;
+        case AccountState::Unknown:
+        case AccountState::CertificateAssumedOK:
+            return;
+    }
+}
+
+bool renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
+                                OldCertificate old) {
+    if (old == OldCertificate::Remove) {
+        VELTOID_LOG(kNotice, "Removing certificate for Velto ID "
+                                 << describeAccountForLog(accountName) << " dsID=" << describeValue(encDsId)
+                                 << " because it has expired or been revoked.");
+        discardCertificate(OwnershipLock(), encDsId);
+    } else {
+        const double interval = metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey,
+                                             kRenewalInterval, UnreadableInterval::Zero);
+        __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateNextRenewalAttemptDateKey,
+                                       Value::date(platform::now() + interval), Notify::No);
+    }
+    AccountRecord record;
+    __VeltoIDDBCopyVeltoIDAccount(accountName, &record);
+    if (const auto next = nextRequestDate(record); next && platform::now() < *next) return false;
+    return __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, nullptr);
+}
+
+void fetchValidationRecordForAccount(const AccountRecord& record, const Dictionary& options) {
+    const String& accountName = record.accountName();
+    VELTOID_LOG(kNotice, "Fetching VeltoIDValidationRecord for veltoid " << describeValue(accountName));
+    Dictionary fetchOptions = options;
+    fetchOptions.set(option::kForceValidationRecordFetch, Value::boolean(true));
+    if (const Value& interval = record.values()[kNextCheckInterval]; interval.isNumber())
+        fetchOptions.set(kNextCheckInterval, interval);
+    const double before = platform::now();
+    __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
+    AccountRecord after;
+    __VeltoIDDBCopyVeltoIDAccount(accountName, &after);
+    // Information of a known account is given out whether the server answers or not: the date tells.
+    const bool isAnswered = after.lastValidation().value_or(before - 1) >= before;
+    const auto nextCheck = after.validationRecordNextCheck();
+    if (isAnswered && nextCheck && *nextCheck > platform::now() && after.validationRecordIdentifier()) {
+        __VeltoIDDBSetAccountValues(accountName, {{kNextCheckInterval, Value::null()}}, Notify::Yes);
+    } else if (isAnswered && nextCheck &&
+               record.validationRecordNextCheckInterval() != kRecordIntervalAfterServersDate) {
+        __VeltoIDDBSetAccountValues(accountName,
+                                    {{kNextCheckDate, Value::date(platform::now() + kRecordCheckSoon)},
+                                     {kNextCheckInterval, Value::real(kRecordIntervalAfterServersDate)}},
+                                    Notify::Yes);
+    } else {
+        __VeltoIDDBSetAccountValues(accountName, laterAttempt(record), Notify::Yes);
+    }
+}
+
+}  // namespace veltoid

@@ -1,0 +1,27 @@
+// What the account check does for an account, by its state. All on the account-check queue; server calls
+// block it.
+#pragma once
+
+#include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/AccountRecord.h"
+
+namespace veltoid {
+
+/// Examines the account, network allowed, and does what its state asks for: learn the encDsId, drop a
+/// password that cannot be used, ask for a certificate or fetch it, fetch the validation record. `record` is
+/// the account's, as it was before.
+void checkAccount(const AccountRecord& record);
+
+/// What becomes of the certificate that the account has: one that has expired or was revoked is removed.
+enum class OldCertificate { Keep, Remove };
+
+/// Asks for a new certificate. The old one is removed first, or else the next attempt is planned first.
+/// False, without asking, until the account's "CSRGenerationInterval" has passed since its
+/// "CSRGenerationDate", and while its requests are held up.
+bool renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
+                                OldCertificate old);
+
+/// Fetches the validation record; after a failure plans the next attempt, later each time.
+void fetchValidationRecordForAccount(const AccountRecord& record, const Dictionary& options);
+
+}  // namespace veltoid

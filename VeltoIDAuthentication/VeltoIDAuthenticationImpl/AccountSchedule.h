@@ -1,0 +1,96 @@
+// What is due for an account, and when: one table of reasons, each with the date at which it becomes due. The
+// account's examination asks it what is due now, and the date of the next action is the earliest of the same
+// dates.
+#pragma once
+
+#include <optional>
+
+#include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/AccountRecord.h"
+#include "VeltoIDAuthenticationDB/CertificateEntry.h"
+
+namespace veltoid {
+
+/// Servers of this version and later give out validation records.
+inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
+
+enum class DueReason {
+    /// The record was changed.
+    Change,
+    /// The encDsId is to be learnt.
+    SignIn,
+    /// The account's information is to be validated: forced, planned, or old.
+    Validation,
+    /// The pending certificate may be asked for.
+    PendingFetch,
+    /// A certificate may be requested (RequestRateLimit.h).
+    Request,
+    /// The certificate has expired or is invalid.
+    Expiry,
+    /// The planned renewal.
+    Renewal,
+    /// The last part of the certificate's life: a renewal is due, whatever was planned.
+    PreExpiry,
+    /// The certificate is to be evaluated.
+    CertificateValidation,
+    ValidationRecord,
+};
+
+/// The table for one account at the moment of construction. Keeps references: short-lived. Any queue but the
+/// database's and the keychain's.
+class AccountSchedule {
+  public:
+    /// `entry` is that of the record's encDsId, or does not exist; the options may hold
+    /// "PreExpirationInterval".
+    AccountSchedule(const AccountRecord& record, const CertificateEntry& entry, const Dictionary& options);
+
+    /// Whether it is time for that, leaving aside what has to be done before.
+    bool isDue(DueReason reason) const;
+
+    /// The earliest date (seconds since 1970) of all reasons that the examination gets to; none: no action is
+    /// foreseen.
+    std::optional<double> nextAction() const;
+
+    /// Whether the server wants to be left alone by this account.
+    bool isEmbargoed() const { return record_.earliestConnection() > now_; }
+    /// Whether the account's information was validated not long ago.
+    bool isInformationFresh() const;
+    /// Whether the certificate's evaluation is due, but was tried not long ago.
+    bool isCertificateValidationPutOff() const;
+
+  private:
+    struct Due {
+        double date = 0;
+        /// Not at the date itself, but from then on.
+        bool isOnlyAfter = false;
+    };
+    using Date = std::optional<Due>;
+
+    static Date at(std::optional<double> date);
+    static Date after(std::optional<double> date, double offset = 0);
+    Date rightNow() const { return Due{now_, false}; }
+
+    Date due(DueReason reason) const;
+    Date signIn() const;
+    Date validation() const;
+    Date pendingFetch() const;
+    Date expiry() const;
+    Date preExpiry() const;
+    Date certificateValidation() const;
+    Date validationRecord() const;
+    double informationInterval() const;
+    double evaluationInterval() const;
+    double certificateLifetime() const;
+    std::optional<double> endOfEmbargo() const;
+
+    const AccountRecord& record_;
+    const CertificateEntry& entry_;
+    const Dictionary& options_;
+    const double now_;
+};
+
+/// When the account next needs attention (seconds since 1970; none: no action is foreseen). False for an
+/// account without password reference. Caller's queue.
+bool copyNextActionDateForAccount(const String& accountName, std::optional<double>* date);
+
+}  // namespace veltoid

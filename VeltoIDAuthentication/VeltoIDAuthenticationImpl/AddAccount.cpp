@@ -1,0 +1,179 @@
+#include "VeltoIDAuthenticationImpl/AddAccount.h"
+
+#include <algorithm>
+
+#include "Logging/Describe.h"
+#include "Logging/Log.h"
+#include "Platform/bus/Notifications.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "Protocol/Names.h"
+#include "Protocol/OptionKeys.h"
+#include "Values/DictionaryAccess.h"
+#include "Values/LowerCase.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
+#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
+#include "VeltoIDAuthenticationImpl/ForgetAccount.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDXMLServerCommunications/SignIn.h"
+
+namespace veltoid {
+namespace {
+
+// How long an add that waits for its certificate lets pass between two looks at the account (seconds). The
+// account check, which does the work, makes a pass every five seconds at the most.
+constexpr double kMinWait = 0.25;
+constexpr double kMaxWait = 3;
+
+std::string describeError(const std::optional<Error>& error) {
+    return error ? describeValue(*error) : std::string();
+}
+
+bool isAlreadyOnItsWay(const AccountRecord& record, const Dictionary& options) {
+    return !getBool(&options, option::kForceCertificateCreation, false) &&
+           (record.certificateToken() || hasValidCertificateEntry(record.encDsId()));
+}
+
+/// Signs in and fetches the account's information; null, with the error, when the sign-in failed.
+Session signIn(const String& accountName, const String& hashedPassword, const Dictionary& options,
+               String* encDsId, ErrorOut error) {
+    Session session =
+        __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, encDsId, nullptr, error);
+    if (!session) return nullptr;
+    if (*encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, *encDsId, Notify::Yes);
+    if (!getBool(&options, option::kDoNotFetchInformation, false)) {
+        const Dictionary fetchOptions =
+            copyDictionarySettingValue(options, option::kForceValidationRecordFetch, Value::boolean(true));
+        __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
+    }
+    return session;
+}
+
+/// Whether the add itself asks for a certificate instead of leaving that to the account check.
+bool createsRequest(const String& encDsId, const Dictionary& options) {
+    if (!encDsId || getBool(&options, option::kDoNotCreateRequest, false) ||
+        getBool(&options, option::kCreateRequestAsynchronously, true))
+        return false;
+    return getBool(&options, option::kForceCertificateCreation, false) || !hasValidCertificateEntry(encDsId);
+}
+
+/// The record as it is stored now; false when it cannot be read.
+bool copyOutcome(const String& accountName, AddedAccount& added, ErrorOut error) {
+    AccountRecord record;
+    added = {};
+    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return false;
+    added = {record.encDsId(), record.values()};
+    return true;
+}
+
+AddedAccount readd(const String& accountName) {
+    std::optional<Error> copyError;
+    AddedAccount added;
+    copyOutcome(accountName, added, &copyError);
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
+                     "VeltoIDAuth: Already existing account " << accountName.view() << " re-added; "
+                                                              << (added.encDsId ? "succeeded." : "failed, ")
+                                                              << describeError(copyError));
+    return added;
+}
+
+AddedAccount addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options) {
+    std::optional<Error> held;
+    String encDsId;
+    Session session;
+    bool proceeds = getBool(&options, option::kDoNotCheckPassword, false);
+    if (!proceeds) {
+        session = signIn(accountName, hashedPassword, options, &encDsId, &held);
+        proceeds = session != nullptr;
+    }
+    if (proceeds && createsRequest(encDsId, options)) {
+        encDsId = nullptr;
+        proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held);
+    }
+    AddedAccount added{encDsId, {}};
+    const bool succeeded = proceeds && copyOutcome(accountName, added, &held);
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
+                     "VeltoIDAuth: Adding account " << accountName.view() << " "
+                                                    << (succeeded ? "succeeded." : "failed, ")
+                                                    << describeError(held));
+    return added;
+}
+
+/// The agent keeps one account.
+void forgetOtherAccounts(const String& added) {
+    Array names;
+    __VeltoIDDBCopyVeltoIDs(&names);
+    const String addedInLowerCase = lowerCased(added);
+    for (const Value& name : names)
+        if (name.isString() && lowerCased(name.asString()) != addedInLowerCase)
+            __VeltoIDForgetVeltoID(name.asString(), {{option::kRemovePrivateKey, Value::boolean(true)}});
+}
+
+/// Lets some time pass before the account is looked at again: until its next action, but not for long.
+void waitForNextAction(const String& accountName) {
+    const double now = platform::now();
+    std::optional<double> next;
+    if (!copyNextActionDateForAccount(accountName, &next) || !next || *next <= now) next = now + kMinWait;
+    const platform::Semaphore neverSignalled;
+    (void)neverSignalled.wait(std::clamp(*next - now, kMinWait, kMaxWait));
+}
+
+bool waitForCertificate(const String& accountName, const Dictionary& options,
+                        const std::function<void()>& wakeAccountCheck) {
+    const double duration = getDouble(&options, option::kCertificateWait, 0);
+    if (!(duration > 0)) return true;
+    const Dictionary checkOptions =
+        copyDictionarySettingValue(options, option::kCheckNetwork, Value::boolean(true));
+    const auto& lifetime = platform::Lifetime::current();
+    for (const double deadline = platform::now() + duration;
+         platform::now() <= deadline && !lifetime.isEnding();) {
+        wakeAccountCheck();
+        switch (checkAccountAndDetermineNextAction(accountName, checkOptions)) {
+            case AccountState::NoEncodedDSID:
+            case AccountState::PasswordInaccessibleInKeychain:
+            case AccountState::PasswordInvalid:
+                return false;
+            case AccountState::CertificateOK:
+            case AccountState::CertificateAssumedOK:
+                return true;
+            default:
+                waitForNextAction(accountName);
+        }
+    }
+    return true;
+}
+
+}  // namespace
+
+bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPassword, const Dictionary& options,
+                           AddedAccount* added, ErrorOut error) {
+    if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr)) {
+        fillError(error, VELTOID_ERROR(identity_error::kUnknown));
+        return false;
+    }
+    AccountRecord record;
+    __VeltoIDDBCopyVeltoIDAccount(accountName, &record);
+    AddedAccount outcome = isAlreadyOnItsWay(record, options) ? readd(accountName)
+                                                              : addAnew(accountName, hashedPassword, options);
+    platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
+    fill(added, std::move(outcome));
+    return true;
+}
+
+bool addOnlyAccount(const String& accountName, const String& hashedPassword, const Dictionary& options,
+                    const std::function<void()>& wakeAccountCheck, AddedAccount* added, ErrorOut error) {
+    const bool isAdded = __VeltoIDDoAddVeltoID(accountName, hashedPassword, options, added, error);
+    __VeltoIDDBIncrementMetaInfoCounter(nullptr, options, kVeltoIDAddVeltoIDCountKey, 1);
+    if (!isAdded) return false;
+    __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountLastValidationDateKey, Value::null(), Notify::Yes);
+    wakeAccountCheck();
+    forgetOtherAccounts(accountName);
+    return waitForCertificate(accountName, options, wakeAccountCheck);
+}
+
+}  // namespace veltoid
