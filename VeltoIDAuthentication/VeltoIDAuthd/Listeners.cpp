@@ -5,6 +5,7 @@
 #include "IPCHelpers/Transaction.h"
 #include "Platform/bus/MessageService.h"
 #include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
 #include "VeltoIDAuthd/AuthenticationService.h"
 #include "VeltoIDAuthd/ClientRequest.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
@@ -20,8 +21,8 @@ using platform::PeerConnection;
 using RequestHandler = void (*)(platform::IncomingMessage& message);
 
 /// A ping waits for nothing.
-bool isAnsweredAtOnce(platform::IncomingMessage& message) {
-    return message.peekInteger("command") == command::kPing;
+bool isAnsweredAtOnce(platform::IncomingMessage& incoming) {
+    return incoming.peekInteger(message::kCommand) == command::kPing;
 }
 
 void serve(PeerConnection& peer, RequestHandler handle) {

@@ -1,5 +1,5 @@
-// An account record as its readers see it: the stored dictionary under the names of its entries. The view shares the
-// stored value and copies nothing; entries of the wrong type count as absent.
+// An account record as its readers see it: the stored dictionary under the names of its entries. The view
+// shares the stored value and copies nothing; entries of the wrong type count as absent.
 #pragma once
 
 #include <optional>
@@ -16,7 +16,8 @@ class AccountRecord {
     AccountRecord(String accountName, Dictionary values)
         : accountName_(std::move(accountName)), values_(std::move(values)) {}
 
-    /// The database's key, by which every operation knows the account; null for a record that was never found.
+    /// The database's key, by which every operation knows the account; null for a record that was never
+    /// found.
     const String& accountName() const { return accountName_; }
     const Dictionary& values() const { return values_; }
 
@@ -38,20 +39,28 @@ class AccountRecord {
     bool hasPassword() const { return passwordReference() || ownPasswordHash(); }
 
     // Connecting to the server.
-    std::optional<double> lastConnectAttempt() const { return values_.date(kVeltoIDMetaLastConnectAttemptKey); }
+    std::optional<double> lastConnectAttempt() const {
+        return values_.date(kVeltoIDMetaLastConnectAttemptKey);
+    }
     std::optional<double> earliestConnection() const {
         return values_.date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
     }
     bool isClientTooOld() const { return values_.boolean(kVeltoIDAccountClientTooOldKey).value_or(false); }
 
     // Validation of the account's information.
-    std::optional<double> lastValidation() const { return values_.date(kVeltoIDAccountLastValidationDateKey); }
-    std::optional<double> nextValidation() const { return values_.date(kVeltoIDAccountNextValidationDateKey); }
+    std::optional<double> lastValidation() const {
+        return values_.date(kVeltoIDAccountLastValidationDateKey);
+    }
+    std::optional<double> nextValidation() const {
+        return values_.date(kVeltoIDAccountNextValidationDateKey);
+    }
     bool isValidationForced() const {
         return values_.boolean(kVeltoIDAccountForceValidationKey).value_or(false);
     }
     /// Seconds.
-    std::optional<double> validForInterval() const { return values_.number(kVeltoIDAccountValidForIntervalKey); }
+    std::optional<double> validForInterval() const {
+        return values_.number(kVeltoIDAccountValidForIntervalKey);
+    }
 
     // The signed validation record.
     String validationRecordIdentifier() const {
@@ -70,7 +79,9 @@ class AccountRecord {
     }
 
     // A certificate request: dates of those that were sent, and what is known of the pending one.
-    std::optional<double> requestGeneration() const { return values_.date(kVeltoIDAccountCSRGenerationDateKey); }
+    std::optional<double> requestGeneration() const {
+        return values_.date(kVeltoIDAccountCSRGenerationDateKey);
+    }
     /// Seconds.
     std::optional<double> requestGenerationInterval() const {
         return values_.number(kVeltoIDAccountCSRGenerationIntervalKey);

@@ -1,5 +1,5 @@
-// A certificate entry as its readers see it: the stored dictionary under the names of its entries. The view shares the
-// stored value and copies nothing; entries of the wrong type count as absent.
+// A certificate entry as its readers see it: the stored dictionary under the names of its entries. The view
+// shares the stored value and copies nothing; entries of the wrong type count as absent.
 #pragma once
 
 #include <optional>

@@ -31,8 +31,8 @@ constexpr double kRecordValidShare = 0.75;
 constexpr double kLastShareOfLifetime = 0.25;
 
 using enum DueReason;
-// The certificate is wanted already: so an account whose sign-in keeps failing stays due and is put off for longer
-// and longer, rather than tried every five minutes.
+// The certificate is wanted already: so an account whose sign-in keeps failing stays due and is put off for
+// longer and longer, rather than tried every five minutes.
 constexpr DueReason kUnknownToServer[] = {Change, SignIn, Request};
 constexpr DueReason kPending[] = {Change, Validation, PendingFetch};
 constexpr DueReason kWithoutCertificate[] = {Change, Validation, Request};
@@ -70,7 +70,8 @@ bool AccountSchedule::isDue(DueReason reason) const {
 std::optional<double> AccountSchedule::nextAction() const {
     std::optional<double> earliest = endOfEmbargo();
     // While the server wants to be left alone, only the certificate's expiry can lead to an action.
-    for (const DueReason reason : earliest ? std::span<const DueReason>(kEmbargoed) : reasonsOf(record_, entry_)) {
+    for (const DueReason reason :
+         earliest ? std::span<const DueReason>(kEmbargoed) : reasonsOf(record_, entry_)) {
         const Date date = due(reason);
         if (!date) continue;
         // A renewal that could not be made is tried again as soon as a request is allowed.
@@ -133,14 +134,15 @@ AccountSchedule::Date AccountSchedule::expiry() const {
     return entry_.isInvalid() ? rightNow() : after(entry_.expires());
 }
 
-/// The interval before the expiry that is asked for, but of the certificate's own lifetime only the last quarter,
-/// or a short-lived one would be renewed without end. A negative interval counts by its size.
+/// The interval before the expiry that is asked for, but of the certificate's own lifetime only the last
+/// quarter, or a short-lived one would be renewed without end. A negative interval counts by its size.
 AccountSchedule::Date AccountSchedule::preExpiry() const {
     const auto expires = entry_.expires();
     const auto planned = entry_.nextRenewalAttempt();
     if (!expires || !planned) return std::nullopt;
-    const double interval = metaInterval(record_.accountName(), options_, kVeltoIDMetaPreExpirationIntervalKey,
-                                         kVeltoIDDefaultPreExpirationInterval, UnreadableInterval::Zero);
+    const double interval =
+        metaInterval(record_.accountName(), options_, kVeltoIDMetaPreExpirationIntervalKey,
+                     kVeltoIDDefaultPreExpirationInterval, UnreadableInterval::Zero);
     if (interval <= 0) return at(*expires + interval);
     const double start = *expires - interval;
     // The certificate is read only where its lifetime makes a difference.
@@ -196,7 +198,8 @@ double AccountSchedule::certificateLifetime() const {
 
 std::optional<double> AccountSchedule::endOfEmbargo() const {
     if (isEmbargoed()) return record_.earliestConnection();
-    if (record_.values().contains(kVeltoIDAccountEarliestAllowedConnectionDateKey) || !record_.isClientTooOld())
+    if (record_.values().contains(kVeltoIDAccountEarliestAllowedConnectionDateKey) ||
+        !record_.isClientTooOld())
         return std::nullopt;
     return now_ + kNeverForOldClients;
 }

@@ -1,5 +1,6 @@
 // What is due for an account, and when: one table of reasons, each with the date at which it becomes due. The
-// account's examination asks it what is due now, and the date of the next action is the earliest of the same dates.
+// account's examination asks it what is due now, and the date of the next action is the earliest of the same
+// dates.
 #pragma once
 
 #include <optional>
