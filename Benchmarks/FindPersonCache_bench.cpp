@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "Platform/runtime/Lifetime.h"
+#include "Protocol/Product.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
 
 namespace {
@@ -45,6 +47,7 @@ double microsecondsEach(const std::vector<Dictionary>& questions) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    const platform::Lifetime lifetime(veltoid::kProduct);
     if (argc != 3) return EXIT_FAILURE;
     const size_t entries = std::strtoul(argv[2], nullptr, 10);
     fill(entries);

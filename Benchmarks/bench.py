@@ -217,7 +217,7 @@ def property_list_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
     result = medians(output)
     for form, path in paths.items():
         size, reference = len(lists[form]), statistics.median(references[form])
-        for what, kind, limit in (("read", "events", 20), ("read and build", "values", None)):
+        for what, kind, limit in (("read", "events", 5), ("read and build", "values", None)):
             ours = result[f"{path}:{kind}"]
             yield Row(f"{what} a property list, {form}, {size / 1e6:.1f} MB", f"{size / ours:.0f} MB/s",
                       f"{size / reference:.1f} MB/s plistlib", reference / ours, limit, at_least=True)

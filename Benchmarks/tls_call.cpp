@@ -12,6 +12,8 @@
 #include <string>
 #include <vector>
 
+#include "Platform/runtime/Lifetime.h"
+#include "Protocol/Product.h"
 #include "XMLRPC/XMLRPCShim.h"
 
 namespace {
@@ -63,6 +65,7 @@ double median(std::vector<double>& times) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    const platform::Lifetime lifetime(veltoid::kProduct);
     if (argc != 5) return EXIT_FAILURE;
     const String url(argv[1]);
     const int runs = std::atoi(argv[3]);

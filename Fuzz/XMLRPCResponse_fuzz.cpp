@@ -2,11 +2,13 @@
 #include <cstdlib>
 
 #include "Logging/Describe.h"
+#include "Platform/runtime/Lifetime.h"
 #include "XMLRPC/XMLRPCDefaultEncoder.h"
 #include "XMLRPC/XMLRPCResponse.h"
 
 // NOLINTNEXTLINE(misc-use-internal-linkage): the fuzzer's entry point
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* bytes, size_t size) {
+    static const platform::Lifetime lifetime(platform::Product{});
     const veltoid::XMLRPCResponse response({bytes, bytes + size});
     (void)response.faultCode();
     (void)response.body();

@@ -28,18 +28,14 @@ class CertificateTest : public ServerTest {
         server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}});
         server_.answer("downloadCertComplete", Dictionary{{"done", "yes"}});
         trust(root_);
-        setRelaunchScheduler([this](double date) { relaunches_.push_back(date - now()); });
-    }
-    void TearDown() override {
-        setRelaunchScheduler([](double) {});
-        ServerTest::TearDown();
+        setProcessHooks({.scheduleRelaunch = [this](double date) { relaunches_.push_back(date - now()); }});
     }
 
     /// The device trusts this authority alone.
     void trust(const testing_support::TestAuthority& authority) const {
         setenv("XDG_CONFIG_HOME", directory_.base().c_str(), 1);
-        std::filesystem::create_directories(directory_.base() / "harbwell");
-        std::ofstream(directory_.base() / "harbwell" / "identity-authority.pem")
+        std::filesystem::create_directories(directory_.base() / kVeltoIDFolder);
+        std::ofstream(directory_.base() / kVeltoIDFolder / kVeltoIDIdentityAuthorityFile)
             << testing_support::pemOf(authority.certificate());
     }
 

@@ -13,11 +13,11 @@
 #include "Logging/Describe.h"
 #include "Platform/runtime/Transactions.h"
 #include "Platform/storage/Preferences.h"
+#include "Protocol/RecordKeys.h"
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/SimulatedClock.h"
 #include "TestSupport/TemporaryStateDirectory.h"
 #include "Values/ValueStream.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {
@@ -49,7 +49,12 @@ class DatabaseTest : public testing::Test {
     void TearDown() override {
         flush();
         EXPECT_EQ(platform::transactions::openCount(), 0);
-        if (!isComparedWithDisk_) return;
+        if (isComparedWithDisk_) compareWithDisk();
+        // What still waits ends while all of the test is there.
+        platform::TestLifetime::restart();
+    }
+
+    static void compareWithDisk() {
         const Dictionary stored = storedDomain();
         const auto section = [&](std::string_view key) {
             const Dictionary* entries = stored.dictionary(key);

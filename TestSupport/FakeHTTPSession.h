@@ -11,6 +11,7 @@
 
 #include "Platform/net/HTTPSession.h"
 #include "Platform/runtime/Clock.h"
+#include "TestSupport/TestLifetime.h"
 
 namespace platform {
 
@@ -31,21 +32,9 @@ struct FakeHTTPAnswer {
 };
 
 /// While it exists, every HTTPSession is a fake one. All operations may be called from any thread.
-class FakeHTTPTransport {
+class FakeHTTPTransport : private HTTPSessionFactory {
   public:
     using Responder = std::function<FakeHTTPAnswer(const HTTPRequest&)>;
-
-    FakeHTTPTransport() {
-        HTTPSession::replaceFactory(
-            [state = state_](auto events, auto eventQueue) -> std::shared_ptr<HTTPSession> {
-                ++state->created;
-                if (!state->isAvailable) return nullptr;
-                return std::make_shared<Session>(state, std::move(events), std::move(eventQueue));
-            });
-    }
-    ~FakeHTTPTransport() { HTTPSession::replaceFactory({}); }
-    FakeHTTPTransport(const FakeHTTPTransport&) = delete;
-    FakeHTTPTransport& operator=(const FakeHTTPTransport&) = delete;
 
     /// Answers are given in this order; when none is left the responder is asked.
     void enqueue(FakeHTTPAnswer answer) {
@@ -161,7 +150,15 @@ class FakeHTTPTransport {
         std::shared_ptr<HTTPSessionEvents> events_;
     };
 
+    std::shared_ptr<HTTPSession> create(std::shared_ptr<HTTPSessionEvents> events,
+                                        std::optional<WorkQueue> eventQueue) override {
+        ++state_->created;
+        if (!state_->isAvailable) return nullptr;
+        return std::make_shared<Session>(state_, std::move(events), std::move(eventQueue));
+    }
+
     const std::shared_ptr<State> state_ = std::make_shared<State>();
+    const InTestLifetime<HTTPSessionFactory> inLifetime_{*this};
 };
 
 }  // namespace platform

@@ -6,15 +6,13 @@
 
 #include "Platform/keychain/LockState.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "TestSupport/TestLifetime.h"
 
 namespace platform {
 
 class FakeLockState : public LockState {
   public:
-    explicit FakeLockState(bool unlocked) : unlocked_(unlocked) { replaceShared(this); }
-    ~FakeLockState() override { replaceShared(nullptr); }
-    FakeLockState(const FakeLockState&) = delete;
-    FakeLockState& operator=(const FakeLockState&) = delete;
+    explicit FakeLockState(bool unlocked) : unlocked_(unlocked) {}
 
     bool hasBeenUnlockedSinceBoot() const override {
         const std::lock_guard lock(mutex_);
@@ -43,6 +41,7 @@ class FakeLockState : public LockState {
     mutable std::mutex mutex_;
     bool unlocked_;
     std::function<void()> handler_;
+    const InTestLifetime<LockState> inLifetime_{*this};
 };
 
 }  // namespace platform

@@ -6,16 +6,12 @@
 #include <vector>
 
 #include "Platform/bus/Notifications.h"
+#include "TestSupport/TestLifetime.h"
 
 namespace platform {
 
 class FakeNotifications : public Notifications {
   public:
-    FakeNotifications() { replaceShared(this); }
-    ~FakeNotifications() override { replaceShared(nullptr); }
-    FakeNotifications(const FakeNotifications&) = delete;
-    FakeNotifications& operator=(const FakeNotifications&) = delete;
-
     void post(std::string name) override {
         const std::lock_guard lock(mutex_);
         names_.push_back(std::move(name));
@@ -30,6 +26,7 @@ class FakeNotifications : public Notifications {
   private:
     std::mutex mutex_;
     std::vector<std::string> names_;
+    const InTestLifetime<Notifications> inLifetime_{*this};
 };
 
 }  // namespace platform

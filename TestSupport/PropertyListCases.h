@@ -1,8 +1,6 @@
 // What the tests of both forms of property lists share.
 #pragma once
 
-#include <gtest/gtest.h>
-
 #include <string>
 
 #include "Platform/propertylist/PropertyList.h"
@@ -22,9 +20,7 @@ inline std::string written(const ValueWriter& writer) {
 /// What reading gives: the events as text, or "refused".
 inline std::string readBack(Bytes list, ListReadFunction read) {
     RecordingSink sink;
-    if (read(list, sink)) return sink.text();
-    EXPECT_EQ(sink.text(), "") << "a refused list reached the sink";
-    return "refused";
+    return read(list, sink) ? sink.text() : "refused";
 }
 
 /// Containers within each other around one value.

@@ -8,26 +8,18 @@
 #include <utility>
 
 #include "Platform/runtime/Clock.h"
+#include "TestSupport/TestLifetime.h"
 
 namespace platform {
 
-/// Replaces the process's clock for as long as it exists. All members are guarded by the mutex.
+/// The clock of the test's lifetime for as long as it exists. All members are guarded by the mutex.
 class SimulatedClock : public Clock {
   public:
-    explicit SimulatedClock(double startSeconds = 1'750'000'000) : now_(startSeconds) { replaceShared(this); }
-    ~SimulatedClock() override { replaceShared(nullptr); }
-    SimulatedClock(const SimulatedClock&) = delete;
-    SimulatedClock& operator=(const SimulatedClock&) = delete;
+    explicit SimulatedClock(double startSeconds = 1'750'000'000) : now_(startSeconds) {}
 
     double now() const override {
         const std::lock_guard lock(mutex_);
         return now_;
-    }
-
-    TimerID callAfter(double seconds, bool endsEarlyOnJump, std::function<void()> fire) override {
-        const std::lock_guard lock(mutex_);
-        timers_.emplace(std::pair(elapsed_ + seconds, ++lastID_), Timer{endsEarlyOnJump, std::move(fire)});
-        return lastID_;
     }
 
     bool cancel(TimerID id) override {
@@ -82,7 +74,7 @@ class SimulatedClock : public Clock {
         std::map<std::pair<double, TimerID>, Timer> woken;
         for (auto timer = timers_.begin(); timer != timers_.end();) {
             const auto current = timer++;
-            if (current->second.endsEarlyOnJump) woken.insert(timers_.extract(current));
+            if (current->second.use == Use::WaitForDate) woken.insert(timers_.extract(current));
         }
         lock.unlock();
         for (const auto& [key, timer] : woken) timer.fire();
@@ -91,9 +83,23 @@ class SimulatedClock : public Clock {
 
   private:
     struct Timer {
-        bool endsEarlyOnJump;
+        Use use;
         std::function<void()> fire;
     };
+
+    TimerID addTimer(double seconds, Use use, std::function<void()> fire) override {
+        const std::lock_guard lock(mutex_);
+        timers_.emplace(std::pair(elapsed_ + seconds, ++lastID_), Timer{use, std::move(fire)});
+        return lastID_;
+    }
+
+    void endTimers() override {
+        std::unique_lock lock(mutex_);
+        const auto ended = std::exchange(timers_, {});
+        lock.unlock();
+        for (const auto& [key, timer] : ended)
+            if (timer.use != Use::Task) timer.fire();
+    }
 
     mutable std::mutex mutex_;
     std::condition_variable becameIdle_;
@@ -102,6 +108,7 @@ class SimulatedClock : public Clock {
     long working_ = 0;
     TimerID lastID_ = 0;
     std::map<std::pair<double, TimerID>, Timer> timers_;
+    const InTestLifetime<Clock> inLifetime_{*this};
 };
 
 }  // namespace platform

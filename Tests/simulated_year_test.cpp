@@ -38,9 +38,8 @@ class SimulatedYear : public CertificateTest {
   protected:
     void SetUp() override {
         CertificateTest::SetUp();
-        setRelaunchScheduler([](double date) { scheduleRelaunch(date); });
+        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date); }});
         __VeltoIDDBRemoveVeltoIDAccount(kName);
-        observeAccountCheck([this] { atPass(); });
     }
     void TearDown() override {
         doNotCompareWithDisk();
@@ -56,7 +55,7 @@ class SimulatedYear : public CertificateTest {
             names_.push_back("account" + std::to_string(i) + "@velto.example");
             ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(names_.back(), kPassword, nullptr));
         }
-        startAccountCheck(kVeltoIDFirstAccountCheckDelay);
+        startAccountCheck(kVeltoIDFirstAccountCheckDelay, [this] { atPass(); });
         const double begin = now();
         const double end = begin + configuration.years * 365 * kDay;
         while (now() < end && !HasFailure()) {

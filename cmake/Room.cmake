@@ -5,13 +5,36 @@
 find_package(GTest REQUIRED)
 include(GoogleTest)
 
+# What most sources include, compiled once: builds whose speed matters more than that each source names all it uses.
+if(VELTOID_PRECOMPILE)
+  file(WRITE ${CMAKE_BINARY_DIR}/precompiled.cpp "int main() {}\n")
+  # Libraries and programs are compiled as position-independent in different ways.
+  add_library(precompiled OBJECT ${CMAKE_BINARY_DIR}/precompiled.cpp)
+  add_executable(precompiled_test ${CMAKE_BINARY_DIR}/precompiled.cpp)
+  foreach(kind precompiled precompiled_test)
+    target_precompile_headers(${kind} PRIVATE
+      <algorithm> <atomic> <cstdint> <functional> <map> <memory> <mutex> <optional> <string> <string_view> <utility>
+      <variant> <vector>)
+  endforeach()
+  target_precompile_headers(precompiled_test PRIVATE <gtest/gtest.h> <filesystem> <fstream>)
+  target_compile_options(precompiled_test PRIVATE -Wno-undef -Wno-shadow)
+  target_link_libraries(precompiled_test PRIVATE GTest::gtest)
+endif()
+
+function(veltoid_precompile name kind)
+  if(VELTOID_PRECOMPILE)
+    target_precompile_headers(${name} REUSE_FROM ${kind})
+  endif()
+endfunction()
+
 function(veltoid_test_program name)
   cmake_parse_arguments(ARG "" "" "SOURCES;DEPENDS" ${ARGN})
   add_executable(${name} ${ARG_SOURCES})
   target_include_directories(${name} PRIVATE ${PROJECT_SOURCE_DIR} ${PROJECT_SOURCE_DIR}/VeltoIDAuthentication)
-  target_link_libraries(${name} PRIVATE ${ARG_DEPENDS} GTest::gtest GTest::gtest_main)
+  target_link_libraries(${name} PRIVATE ${ARG_DEPENDS} TestMain)
   # GoogleTest's macros trip these two in perfectly good tests.
   target_compile_options(${name} PRIVATE -Wno-undef -Wno-shadow)
+  veltoid_precompile(${name} precompiled_test)
   gtest_discover_tests(${name} DISCOVERY_MODE PRE_TEST PROPERTIES TIMEOUT 120)
 endfunction()
 
@@ -20,6 +43,7 @@ function(veltoid_room name)
   add_library(${name} STATIC ${ARG_SOURCES})
   target_include_directories(${name} PUBLIC ${PROJECT_SOURCE_DIR} ${PROJECT_SOURCE_DIR}/VeltoIDAuthentication)
   target_link_libraries(${name} PUBLIC ${ARG_DEPENDS})
+  veltoid_precompile(${name} precompiled)
   if(ARG_TESTS AND BUILD_TESTING AND NOT VELTOID_FUZZ)
     veltoid_test_program(${name}_test SOURCES ${ARG_TESTS} DEPENDS ${name} ${ARG_TEST_DEPENDS})
   endif()

@@ -6,6 +6,7 @@ set(CMAKE_POSITION_INDEPENDENT_CODE ON)
 set(CMAKE_CXX_VISIBILITY_PRESET hidden)
 
 set(VELTOID_SANITIZER "" CACHE STRING "value of -fsanitize= for every target; empty for none")
+option(VELTOID_PRECOMPILE "compile the common headers once" OFF)
 option(VELTOID_FUZZ "build the fuzz targets (needs clang)" OFF)
 
 if(NOT CMAKE_BUILD_TYPE)

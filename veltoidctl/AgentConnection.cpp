@@ -4,8 +4,8 @@
 
 #include <memory>
 
-#include "Platform/bus/BusConnection.h"
 #include "Platform/bus/BusMessage.h"
+#include "Protocol/Names.h"
 #include "veltoidctl/JsonBuilder.h"
 
 namespace veltoidctl {
@@ -38,8 +38,8 @@ AgentConnection::~AgentConnection() { sd_bus_flush_close_unref(bus_); }
 
 Json AgentConnection::send(const platform::ValueWriter& writer) {
     sd_bus_message* call = nullptr;
-    int result = sd_bus_message_new_method_call(bus_, &call, service_.c_str(), platform::bus::kObjectPath,
-                                                platform::bus::kMessageInterface, "Send");
+    int result = sd_bus_message_new_method_call(bus_, &call, service_.c_str(), veltoid::kVeltoIDObjectPath,
+                                                veltoid::kVeltoIDMessageInterface, "Send");
     const Message request(call, sd_bus_message_unref);
     if (result >= 0) result = sd_bus_message_sensitive(call);
     if (result >= 0) result = platform::bus::appendDictionary(call, writer);
@@ -62,8 +62,8 @@ Json AgentConnection::send(const platform::ValueWriter& writer) {
 
 void AgentConnection::post(const std::string& notification) {
     const int result =
-        sd_bus_emit_signal(bus_, platform::bus::kObjectPath, platform::bus::kNotificationInterface, "Posted",
-                           "s", notification.c_str());
+        sd_bus_emit_signal(bus_, veltoid::kVeltoIDObjectPath, veltoid::kVeltoIDNotificationInterface,
+                           "Posted", "s", notification.c_str());
     if (result < 0) throw Unreachable(std::string("the bus failed: ") + strerror(-result));
 }
 

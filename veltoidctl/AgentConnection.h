@@ -1,18 +1,15 @@
 // A client's connection to the agent: one dictionary request, one dictionary reply.
 #pragma once
 
-#include <nlohmann/json.hpp>
 #include <stdexcept>
 #include <string>
 
 #include "Platform/encoding/ValueSink.h"
+#include "veltoidctl/Json.h"
 
 struct sd_bus;
 
 namespace veltoidctl {
-
-/// Insertion order is the agent's own.
-using Json = nlohmann::ordered_json;
 
 /// The agent could not be reached or did not answer in time.
 class Unreachable : public std::runtime_error {

@@ -1,24 +1,27 @@
 #include "veltoidctl/AgentRequest.h"
 
 #include "Platform/keychain/Keychain.h"
+#include "Protocol/MessageKeys.h"
 
 namespace veltoidctl {
+
+namespace message = veltoid::message;
 
 Json send(AgentConnection& agent, const Request& request) {
     return agent.send([&](platform::ValueSink& sink) {
         sink.beginDictionary();
-        sink.key("command");
+        sink.key(message::kCommand);
         sink.integer(request.command);
         if (!request.account.empty()) {
-            sink.key("VeltoID");
+            sink.key(message::kAccount);
             sink.string(request.account);
         }
         if (!request.passwordHash.empty()) {
-            sink.key("hashedpassword");
+            sink.key(message::kHashedPassword);
             sink.string(request.passwordHash);
         }
         if (request.entries) request.entries(sink);
-        sink.key("options");
+        sink.key(message::kOptions);
         sink.beginDictionary();
         for (const auto& [option, value] : request.options) {
             sink.key(option);
@@ -33,7 +36,7 @@ Json send(AgentConnection& agent, const Request& request) {
     });
 }
 
-bool succeeded(const Json& reply) { return reply.value("success", false); }
+bool succeeded(const Json& reply) { return reply.value(message::kSuccess, false); }
 
 std::string reasonUnlessLocked(const std::string& reason) {
     return platform::keychain::protection() == platform::keychain::Protection::Locked

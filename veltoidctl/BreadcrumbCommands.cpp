@@ -2,6 +2,8 @@
 #include <iostream>
 
 #include "Platform/encoding/HexText.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Files.h"
@@ -9,22 +11,18 @@
 #include "veltoidctl/Printing.h"
 
 namespace veltoidctl {
-namespace {
 
-constexpr const char* kKey = "identifier";
-constexpr const char* kData = "breadcrumb";
-
-}  // namespace
+namespace message = veltoid::message;
 
 int setBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
     const platform::SecretBytes data = readInput(arguments.input);
-    const Request request{.command = kSetBreadcrumbCommand,
+    const Request request{.command = veltoid::command::kSetBreadcrumb,
                           .account = arguments.account,
                           .passwordHash = readPasswordHash(arguments.password, arguments.account),
                           .entries = [&](platform::ValueSink& sink) {
-                              sink.key(kKey);
+                              sink.key(message::kBreadcrumbKey);
                               sink.string(arguments.key);
-                              sink.key(kData);
+                              sink.key(message::kBreadcrumb);
                               sink.data(data);
                           }};
     return present(send(agent, request), arguments, "breadcrumb set", [&](const Json&) {
@@ -37,15 +35,15 @@ int getBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
     // A terminal gets it in a form that is fit for one.
     const bool isShown = !hasFile && (arguments.json || standardOutputIsTerminal());
     const PrivateOutput output(arguments.output, arguments.force || isShown);
-    const Request request{.command = kGetBreadcrumbCommand,
+    const Request request{.command = veltoid::command::kGetBreadcrumb,
                           .account = arguments.account,
                           .passwordHash = readPasswordHash(arguments.password, arguments.account),
                           .entries = [&](platform::ValueSink& sink) {
-                              sink.key(kKey);
+                              sink.key(message::kBreadcrumbKey);
                               sink.string(arguments.key);
                           }};
     const Json reply = send(agent, request);
-    const veltoid::Data data = dataIn(reply, kData);
+    const veltoid::Data data = dataIn(reply, message::kBreadcrumb);
     if (data && !isShown) output.write(data.bytes());
     return present(
         reply, arguments, "breadcrumb get",

@@ -2,6 +2,10 @@
 #include <iostream>
 #include <stdexcept>
 
+#include "Platform/encoding/CalendarText.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/CertificateExport.h"
 #include "veltoidctl/ClientCertificate.h"
@@ -11,36 +15,41 @@
 #include "veltoidctl/Printing.h"
 
 namespace veltoidctl {
+
+namespace message = veltoid::message;
+
 namespace {
 
-constexpr const char* kValidationRecordType = "VeltoIDValidatedItemsRecordDataCertificateType";
-constexpr const char* kValidationRecordKey = "VeltoIDAccountValidationRecordData";
+constexpr const char* kSubject = "Subject";
+constexpr const char* kIssuer = "Issuer";
+constexpr const char* kValidFrom = "ValidFrom";
 
 constexpr const char* kCertificate = "certificate";
 constexpr const char* kIntermediate = "intermediate certificate";
 
 /// What is shown: the certificate's own words where it can be read, else the agent's.
 Json describe(const ClientCertificate& found) {
-    Json shown = found.reply["result"];
+    Json shown = found.reply[message::kResult];
     if (found.certificate) {
-        shown["Subject"] = found.certificate->subject;
-        shown["Issuer"] = found.certificate->issuer;
-        shown["SerialNumber"] = found.certificate->serialNumber;
-        if (const auto start = dateText(found.certificate->notBefore)) shown["ValidFrom"] = *start;
-        if (const auto end = dateText(found.certificate->notAfter)) shown["Expires"] = *end;
+        shown[kSubject] = found.certificate->subject;
+        shown[kIssuer] = found.certificate->issuer;
+        shown[veltoid::kVeltoIDCertificateSerialNumberKey] = found.certificate->serialNumber;
+        if (const auto start = platform::calendarText(found.certificate->notBefore, platform::kISO8601))
+            shown[kValidFrom] = *start;
+        if (const auto end = platform::calendarText(found.certificate->notAfter, platform::kISO8601))
+            shown[veltoid::kVeltoIDCertificateExpirationDateKey] = *end;
     }
-    if (found.entry.contains("NextRenewalAttempt"))
-        shown["NextRenewalAttempt"] = found.entry["NextRenewalAttempt"];
+    shown.erase(std::string(veltoid::kVeltoIDCertificateIntermediateCertificateReferenceKey));
     return shown;
 }
 
 void printDescription(const ClientCertificate& found) {
-    printEntries(describe(found), {{"Subject", "certificate of"},
-                                   {"CertStatus", "status"},
-                                   {"Expires", "valid until"},
-                                   {"SerialNumber", "serial"},
-                                   {"Issuer", "issuer"},
-                                   {"NextRenewalAttempt", "next renewal"}});
+    printEntries(describe(found), {{kSubject, "certificate of"},
+                                   {veltoid::kVeltoIDCertificateStatusKey, "status"},
+                                   {veltoid::kVeltoIDCertificateExpirationDateKey, "valid until"},
+                                   {veltoid::kVeltoIDCertificateSerialNumberKey, "serial"},
+                                   {kIssuer, "issuer"},
+                                   {veltoid::kVeltoIDCertificateNextRenewalAttemptDateKey, "next renewal"}});
     if (found.isPending()) printLine("new certificate", "pending" + found.nextLook());
     if (!found.certificate)
         std::cerr << "veltoidctl: the certificate itself cannot be read from this user's keychain\n";
@@ -55,13 +64,14 @@ std::string pemFor(const ClientCertificate& found, const Arguments& arguments) {
 int writeValidationRecord(AgentConnection& agent, const Arguments& arguments) {
     const bool isPartOfReply = arguments.json && arguments.output == kStandardStream;
     const PrivateOutput output(arguments.output, arguments.force || isPartOfReply);
-    const Json reply = send(agent, {.command = kCertificateCommand,
+    const Json reply = send(agent, {.command = veltoid::command::kCertificate,
                                     .account = arguments.account,
                                     .entries = [](platform::ValueSink& sink) {
-                                        sink.key("CertificateType");
-                                        sink.string(kValidationRecordType);
+                                        sink.key(message::kCertificateType);
+                                        sink.string(message::kValidationRecordType);
                                     }});
-    const veltoid::Data record = dataIn(reply.value("result", Json::object()), kValidationRecordKey);
+    const veltoid::Data record = dataIn(reply.value(message::kResult, Json::object()),
+                                        veltoid::kVeltoIDAccountValidationRecordDataKey);
     if (succeeded(reply) && !record) throw std::runtime_error("the account has no validation record");
     if (record && !isPartOfReply) output.write(record.bytes());
     return present(
@@ -112,7 +122,8 @@ int exportCertificate(AgentConnection& agent, const Arguments& arguments) {
         return present(found.reply, arguments, "certificate export", {}, found.whyThereIsNone());
     const platform::Certificate& certificate = needed(found.certificate, kCertificate);
     output.write(encode(identityOf(found), arguments));
-    const Json shown = {{"success", true}, {"file", arguments.output}, {"certificate", describe(found)}};
+    const Json shown = {
+        {message::kSuccess, true}, {"file", arguments.output}, {"certificate", describe(found)}};
     return present(shown, arguments, "certificate export", [&](const Json&) {
         if (arguments.output != kStandardStream)
             std::cerr << "key and certificate of " << textOf(certificate.summary) << " are in "

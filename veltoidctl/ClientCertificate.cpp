@@ -2,6 +2,11 @@
 
 #include <stdexcept>
 
+#include "Protocol/AccountState.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/LowerCase.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "veltoidctl/AgentRequest.h"
@@ -9,13 +14,16 @@
 #include "veltoidctl/Printing.h"
 
 namespace veltoidctl {
+
+namespace command = veltoid::command;
+namespace message = veltoid::message;
+
 namespace {
 
 constexpr int kUnknownAccountCode = -1;
 
-Json entryOf(const Json& dictionary, const std::string& section, const std::string& key) {
-    return dictionary.value(section, Json::object()).value(key, Json::object());
-}
+/// An empty object when there is none.
+Json objectIn(const Json& dictionary, std::string_view key) { return dictionary.value(key, Json::object()); }
 
 std::optional<platform::Certificate> certificateFromKeychain(const veltoid::Data& reference) {
     std::optional<platform::Certificate> certificate;
@@ -25,48 +33,60 @@ std::optional<platform::Certificate> certificateFromKeychain(const veltoid::Data
 
 /// An agent without keychain hands out the certificate itself.
 std::optional<platform::Certificate> certificateOf(const Json& information) {
-    if (const veltoid::Data der = dataIn(information, "CertificateData"))
+    if (const veltoid::Data der = dataIn(information, message::kCertificateData))
         return platform::readCertificate(der.bytes());
-    return certificateFromKeychain(dataIn(information, "CertificateReference"));
+    return certificateFromKeychain(
+        dataIn(information, veltoid::kVeltoIDCertificateCertificatePersistentReferenceKey));
 }
 
 }  // namespace
 
 bool ClientCertificate::isIssued() const {
-    return succeeded(reply) && entryOf(reply, "result", "CertStatus") == "CERT_ISSUED";
+    return succeeded(reply) &&
+           objectIn(reply, message::kResult).value(veltoid::kVeltoIDCertificateStatusKey, "") ==
+               veltoid::kVeltoIDCertificateStatusIssued;
 }
 
-bool ClientCertificate::isPending() const { return record.contains("CertificateToken"); }
+bool ClientCertificate::isPending() const {
+    return status.value(message::kAccountState, "") == nameOf(veltoid::AccountState::CertificatePending);
+}
+
+bool ClientCertificate::hasIntermediate() const {
+    return objectIn(reply, message::kResult)
+        .contains(veltoid::kVeltoIDCertificateIntermediateCertificateReferenceKey);
+}
 
 std::string ClientCertificate::whyThereIsNone() const {
     if (isPending()) return "the certificate is still pending" + nextLook();
-    if (reply.contains("error") && reply["error"].value("Code", 0) == kUnknownAccountCode)
+    if (objectIn(reply, message::kError).value(message::kErrorCode, 0) == kUnknownAccountCode)
         return "there is no such account on this device, or it was never signed in";
     return "the account has no certificate";
 }
 
 std::string ClientCertificate::nextLook() const {
-    return record.contains("NextCertificateFetchDate")
-               ? "; the agent asks again at " + textOf(record["NextCertificateFetchDate"])
+    return status.contains(message::kNextFetchAttempt)
+               ? "; the agent asks again at " + textOf(status[message::kNextFetchAttempt])
                : std::string();
 }
 
 ClientCertificate fetchCertificate(AgentConnection& agent, const std::string& account) {
     ClientCertificate found;
-    found.reply = send(agent, {.command = kCertificateCommand, .account = account});
-    const Json information = found.reply.value("result", Json::object());
-    const Json database =
-        send(agent, {.command = kDatabaseCommand, .account = account}).value("result", Json::object());
-    found.record = entryOf(database, "Accounts", veltoid::lowerCased(account).text());
-    found.entry = entryOf(database, "AuthCertificates", information.value("encDsId", ""));
+    found.reply = send(agent, {.command = command::kCertificate,
+                               .account = account,
+                               .options = {{veltoid::option::kCertificateDetails, true}}});
+    const Json information = objectIn(found.reply, message::kResult);
+    const Json agentStatus = objectIn(send(agent, {.command = command::kStatus}), message::kStatus);
+    found.status =
+        objectIn(objectIn(agentStatus, message::kAccountStatuses), veltoid::lowerCased(account).view());
     found.certificate = certificateOf(information);
-    found.intermediate = certificateFromKeychain(dataIn(found.entry, kIntermediateReference));
+    found.intermediate = certificateFromKeychain(
+        dataIn(information, veltoid::kVeltoIDCertificateIntermediateCertificateReferenceKey));
     return found;
 }
 
 veltoid::Key privateKeyOf(const ClientCertificate& certificate) {
-    const veltoid::Data reference =
-        dataIn(certificate.reply.value("result", Json::object()), "CertificatePrivateKeyReference");
+    const veltoid::Data reference = dataIn(objectIn(certificate.reply, message::kResult),
+                                           veltoid::kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
     veltoid::Key key;
     if (!veltoid::copyKeyFromKeychainGivenPersistentRef(reference, &key) || !key.isPrivate)
         throw std::runtime_error(reasonUnlessLocked("the private key is not in this user's keychain"));

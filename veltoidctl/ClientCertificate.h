@@ -11,14 +11,11 @@
 
 namespace veltoidctl {
 
-inline constexpr const char* kIntermediateReference = "IntermediateCertificateReference";
-
 struct ClientCertificate {
     /// The agent's answer to the question for it.
     Json reply = Json::object();
-    /// What the agent's database has: the account's record and the certificate's entry; empty objects else.
-    Json record = Json::object();
-    Json entry = Json::object();
+    /// The account's status; empty when the agent has no such account.
+    Json status = Json::object();
     /// None when there is none, or this user's keychain does not give it out.
     std::optional<platform::Certificate> certificate = {};
     std::optional<platform::Certificate> intermediate = {};
@@ -26,7 +23,7 @@ struct ClientCertificate {
     bool isIssued() const;
     /// A request for one is on its way.
     bool isPending() const;
-    bool hasIntermediate() const { return entry.contains(kIntermediateReference); }
+    bool hasIntermediate() const;
     /// Why the agent has none.
     std::string whyThereIsNone() const;
     /// For the end of a line: when the agent asks next for a pending one; empty when that is not known.

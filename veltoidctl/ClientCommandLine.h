@@ -4,6 +4,7 @@
 #include <string>
 #include <variant>
 
+#include "Protocol/Names.h"
 #include "veltoidctl/Commands.h"
 
 namespace veltoidctl {
@@ -12,7 +13,7 @@ struct Invocation {
     int (*command)(AgentConnection&, const Arguments&) = nullptr;
     Arguments arguments = {};
     /// The agent's name on the bus.
-    std::string service = "com.velto.harbwell.veltoid.authentication";
+    std::string service = veltoid::kVeltoIDAuthenticationServiceName;
     /// Seconds; longer than the agent waits for a server in one request.
     double timeout = 30;
 };

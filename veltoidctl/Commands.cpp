@@ -1,27 +1,37 @@
-#include "veltoidctl/Commands.h"
+#include "Protocol/Commands.h"
 
 #include <iostream>
 
+#include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/ClientCertificate.h"
+#include "veltoidctl/Commands.h"
 #include "veltoidctl/Printing.h"
 
 namespace veltoidctl {
+
+namespace command = veltoid::command;
+namespace message = veltoid::message;
+namespace option = veltoid::option;
+
 namespace {
 
 void printStatusOf(const std::string& account, const Json& status) {
     std::cout << account << "\n";
-    printEntries(status, {{"AccountState", "  state"},
-                          {"AccountRequiresUserAction", "  needs you"},
-                          {"NextActionTime", "  next action"},
-                          {"NextFetchAttempt", "  next fetch"},
-                          {"CertificateRequestsHeldUntil", "  requests held until"},
-                          {"ValidationDate", "  validated"}});
+    printEntries(status, {{message::kAccountState, "  state"},
+                          {message::kRequiresUserAction, "  needs you"},
+                          {message::kNextActionTime, "  next action"},
+                          {message::kNextFetchAttempt, "  next fetch"},
+                          {veltoid::kVeltoIDAccountCertificateRequestsHeldUntilKey, "  requests held until"},
+                          {veltoid::kVeltoIDAccountLastValidationDateKey, "  validated"}});
 }
 
 void printAdded(const Json& reply, const Arguments& arguments) {
-    if (reply.contains("encDsId")) {
-        std::cout << arguments.account << " is added and signed in as " << textOf(reply["encDsId"]) << "\n";
+    if (reply.contains(message::kEncDsId)) {
+        std::cout << arguments.account << " is added and signed in as " << textOf(reply[message::kEncDsId])
+                  << "\n";
     } else if (arguments.withoutSigningIn) {
         std::cout << arguments.account << " is added\n";
     }
@@ -37,7 +47,7 @@ void printOutcome(const ClientCertificate& found, const Arguments& arguments) {
 
 /// What somebody who added the account would miss; empty when nothing is.
 std::string shortcoming(const Json& reply, const Arguments& arguments, const ClientCertificate& found) {
-    if (!reply.contains("encDsId") && !arguments.withoutSigningIn)
+    if (!reply.contains(message::kEncDsId) && !arguments.withoutSigningIn)
         return "is stored on this device, but could not be signed in";
     if (arguments.wantsCertificate() && !found.isIssued() && !found.isPending())
         return "is signed in, but got no certificate";
@@ -46,31 +56,32 @@ std::string shortcoming(const Json& reply, const Arguments& arguments, const Cli
 
 void printMatch(const Json& match) {
     printLine(textOf(match.value("matched", Json("match"))), match.value("value", Json("")));
-    printEntries(match, {{"VeltoID", "  account"},
+    printEntries(match, {{veltoid::kVeltoIDAccountNameKey, "  account"},
                          {"firstNm", "  first name"},
                          {"lastNm", "  last name"},
-                         {"encDsId", "  encDsId"}});
+                         {veltoid::kVeltoIDAccountDSIDKey, "  encDsId"}});
 }
 
 }  // namespace
 
 int ping(AgentConnection& agent, const Arguments& arguments) {
-    return present(send(agent, {.command = kPingCommand}), arguments, "ping",
+    return present(send(agent, {.command = command::kPing}), arguments, "ping",
                    [](const Json&) { std::cout << "the agent answers\n"; });
 }
 
 int add(AgentConnection& agent, const Arguments& arguments) {
-    Request request{.command = kAddCommand,
+    Request request{.command = command::kAdd,
                     .account = arguments.account,
                     .passwordHash = readPasswordHash(arguments.password, arguments.account)};
-    if (arguments.withoutSigningIn) request.options.emplace_back("DoNotCheckPassword", true);
-    if (arguments.withCertificate) request.options.emplace_back("CreateCSRAsynchronously", false);
-    if (arguments.waitSeconds > 0) request.options.emplace_back("certwaitduration", arguments.waitSeconds);
+    if (arguments.withoutSigningIn) request.options.emplace_back(option::kDoNotCheckPassword, true);
+    if (arguments.withCertificate) request.options.emplace_back(option::kCreateRequestAsynchronously, false);
+    if (arguments.waitSeconds > 0)
+        request.options.emplace_back(option::kCertificateWait, arguments.waitSeconds);
     Json reply = send(agent, request);
     ClientCertificate found;
     if (arguments.wantsCertificate() && succeeded(reply)) {
         found = fetchCertificate(agent, arguments.account);
-        reply["certificate"] = found.reply.value("result", Json::object());
+        reply["certificate"] = found.reply.value(message::kResult, Json::object());
         reply["certificateIsPending"] = found.isPending();
     }
     const int status = present(
@@ -89,57 +100,59 @@ int add(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int forget(AgentConnection& agent, const Arguments& arguments) {
-    return present(send(agent, {.command = kForgetCommand, .account = arguments.account}), arguments,
+    return present(send(agent, {.command = command::kForget, .account = arguments.account}), arguments,
                    "forget", [](const Json& reply) {
-                       std::cout << textOf(reply.value("VeltoID", Json(""))) << " is forgotten\n";
+                       std::cout << textOf(reply.value(message::kAccount, Json(""))) << " is forgotten\n";
                    });
 }
 
 int list(AgentConnection& agent, const Arguments& arguments) {
-    return present(send(agent, {.command = kListCommand}), arguments, "list", [](const Json& reply) {
-        const Json names = reply.value("result", Json::array());
+    return present(send(agent, {.command = command::kList}), arguments, "list", [](const Json& reply) {
+        const Json names = reply.value(message::kResult, Json::array());
         for (const Json& name : names) std::cout << textOf(name) << "\n";
         if (names.empty()) std::cerr << "no accounts\n";
     });
 }
 
 int info(AgentConnection& agent, const Arguments& arguments) {
-    Request request{.command = kInfoCommand, .account = arguments.account};
-    if (arguments.refresh) request.options.emplace_back("ForceValidation", true);
+    Request request{.command = command::kInfo, .account = arguments.account};
+    if (arguments.refresh) request.options.emplace_back(option::kForceValidation, true);
     return present(send(agent, request), arguments, "info", [](const Json& reply) {
-        printEntries(reply.value("info", Json::object()), {{"VeltoID", "account"},
-                                                           {"encDsId", "encDsId"},
-                                                           {"FirstName", "first name"},
-                                                           {"LastName", "last name"},
-                                                           {"AllEmails", "e-mails"},
-                                                           {"ValidatedEmail", "validated e-mails"},
-                                                           {"ValidatedPhones", "validated phones"},
-                                                           {"ValidationDate", "validated"},
-                                                           {"SerialNumber", "certificate serial"},
-                                                           {"CertificateExpiration", "certificate expires"}});
+        printEntries(reply.value(message::kInfo, Json::object()),
+                     {{veltoid::kVeltoIDAccountNameKey, "account"},
+                      {veltoid::kVeltoIDAccountDSIDKey, "encDsId"},
+                      {veltoid::kVeltoIDAccountFirstNameKey, "first name"},
+                      {veltoid::kVeltoIDAccountLastNameKey, "last name"},
+                      {message::kAllEmails, "e-mails"},
+                      {veltoid::kVeltoIDAccountValidatedEmailKey, "validated e-mails"},
+                      {veltoid::kVeltoIDAccountValidatedPhonesKey, "validated phones"},
+                      {veltoid::kVeltoIDAccountLastValidationDateKey, "validated"},
+                      {veltoid::kVeltoIDCertificateSerialNumberKey, "certificate serial"},
+                      {message::kCertificateExpiration, "certificate expires"}});
     });
 }
 
 int status(AgentConnection& agent, const Arguments& arguments) {
-    Request request{.command = kStatusCommand};
-    if (arguments.examine) request.options = {{"CheckNetwork", true}, {"ForceValidation", true}};
+    Request request{.command = command::kStatus};
+    if (arguments.examine)
+        request.options = {{option::kCheckNetwork, true}, {option::kForceValidation, true}};
     return present(send(agent, request), arguments, "status", [](const Json& reply) {
-        const Json status = reply.value("status", Json::object());
-        printEntries(status, {{"pid", "agent process"},
-                              {"LaunchTime", "running since"},
-                              {"NextLaunchTime", "next launch"},
-                              {"LastConnectAttempt", "last connect"},
-                              {"LastSuccessfulConnect", "last success"},
-                              {"DeviceUnlockedSinceBoot", "unlocked since boot"},
-                              {"DirtyAccounts", "changed accounts"}});
-        const Json accounts = status.value("AccountStatuses", Json::object());
+        const Json status = reply.value(message::kStatus, Json::object());
+        printEntries(status, {{message::kProcessID, "agent process"},
+                              {message::kLaunchTime, "running since"},
+                              {message::kNextLaunchTime, "next launch"},
+                              {veltoid::kVeltoIDMetaLastConnectAttemptKey, "last connect"},
+                              {veltoid::kVeltoIDMetaLastSuccessfulConnectKey, "last success"},
+                              {message::kUnlockedSinceBoot, "unlocked since boot"},
+                              {message::kDirtyAccounts, "changed accounts"}});
+        const Json accounts = status.value(message::kAccountStatuses, Json::object());
         for (const auto& [account, entry] : accounts.items()) printStatusOf(account, entry);
         if (accounts.empty()) std::cout << "no accounts\n";
     });
 }
 
 int verify(AgentConnection& agent, const Arguments& arguments) {
-    const Request request{.command = kVerifyCommand,
+    const Request request{.command = command::kVerify,
                           .account = arguments.account,
                           .passwordHash = readPasswordHash(arguments.password, arguments.account)};
     return present(send(agent, request), arguments, "verify", [&](const Json&) {
@@ -148,10 +161,10 @@ int verify(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int find(AgentConnection& agent, const Arguments& arguments) {
-    const Request request{.command = arguments.cached ? kFindCachedCommand : kFindCommand,
+    const Request request{.command = arguments.cached ? command::kFindCached : command::kFind,
                           .account = arguments.account,
                           .entries = [&](platform::ValueSink& sink) {
-                              sink.key("criteria");
+                              sink.key(message::kCriteria);
                               sink.beginDictionary();
                               sink.key(arguments.criterion);
                               sink.beginArray();
@@ -162,7 +175,7 @@ int find(AgentConnection& agent, const Arguments& arguments) {
     return present(
         send(agent, request), arguments, "find",
         [](const Json& reply) {
-            const Json matches = reply.value("result", Json::array());
+            const Json matches = reply.value(message::kResult, Json::array());
             for (const Json& match : matches) printMatch(match);
             if (matches.empty()) std::cerr << "nobody was found\n";
         },
@@ -170,8 +183,8 @@ int find(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int database(AgentConnection& agent, const Arguments& arguments) {
-    return present(send(agent, {.command = kDatabaseCommand}), arguments, "database",
-                   [](const Json& reply) { printJson(reply.value("result", Json::object())); });
+    return present(send(agent, {.command = command::kDatabase}), arguments, "database",
+                   [](const Json& reply) { printJson(reply.value(message::kResult, Json::object())); });
 }
 
 }  // namespace veltoidctl

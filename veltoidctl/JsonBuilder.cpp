@@ -1,23 +1,11 @@
 #include "veltoidctl/JsonBuilder.h"
 
-#include <cmath>
-#include <ctime>
-
+#include "Platform/encoding/CalendarText.h"
 #include "Values/Base64.h"
 
 namespace veltoidctl {
 
-std::optional<std::string> dateText(double seconds) {
-    std::tm calendar{};
-    const auto whole = static_cast<time_t>(std::floor(seconds));
-    char text[64];
-    if (!std::isfinite(seconds) || std::abs(seconds) > 6e16 || gmtime_r(&whole, &calendar) == nullptr ||
-        std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%SZ", &calendar) == 0)
-        return std::nullopt;
-    return text;
-}
-
-veltoid::Data dataIn(const Json& dictionary, const char* key) {
+veltoid::Data dataIn(const Json& dictionary, std::string_view key) {
     const auto found = dictionary.find(key);
     if (found == dictionary.end() || !found->is_string()) return {};
     return veltoid::xmlrpcBase64Decode(found->get_ref<const std::string&>());
@@ -26,7 +14,7 @@ veltoid::Data dataIn(const Json& dictionary, const char* key) {
 void JsonBuilder::data(platform::Bytes bytes) { add(veltoid::xmlrpcBase64Encode(bytes, false).text()); }
 
 void JsonBuilder::date(double seconds) {
-    if (const auto text = dateText(seconds)) {
+    if (const auto text = platform::calendarText(seconds, platform::kISO8601)) {
         add(*text);
     } else {
         add(seconds);

@@ -1,21 +1,17 @@
 // Values of a reply as JSON.
 #pragma once
 
-#include <optional>
 #include <string>
 #include <vector>
 
 #include "Platform/encoding/ValueSink.h"
 #include "Values/Value.h"
-#include "veltoidctl/AgentConnection.h"
+#include "veltoidctl/Json.h"
 
 namespace veltoidctl {
 
-/// ISO 8601 text at UTC; none for seconds beyond what a calendar has.
-std::optional<std::string> dateText(double seconds);
-
 /// The bytes behind a key of a reply; null without them.
-veltoid::Data dataIn(const Json& dictionary, const char* key);
+veltoid::Data dataIn(const Json& dictionary, std::string_view key);
 
 /// Dates become ISO 8601 text at UTC, data and UUIDs base64 text; file descriptors null.
 class JsonBuilder : public platform::ValueSink {

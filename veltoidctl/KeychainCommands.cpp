@@ -3,7 +3,9 @@
 #include <iostream>
 
 #include "Platform/keychain/Keychain.h"
-#include "Platform/keychain/LockState.h"
+#include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
+#include "Protocol/Names.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/Commands.h"
 #include "veltoidctl/Printing.h"
@@ -34,22 +36,22 @@ std::string reasonFor(platform::KeychainStatus status) {
 
 int presentOutcome(platform::KeychainStatus status, const Arguments& arguments, const std::string& what,
                    const char* done) {
-    const Json reply{{"success", status == platform::kKeychainSuccess}};
+    const Json reply{{veltoid::message::kSuccess, status == platform::kKeychainSuccess}};
     return present(
         reply, arguments, what, [done](const Json&) { std::cout << done << "\n"; }, reasonFor(status));
 }
 
 /// A running agent may wait for this, and one that is not running has work now.
 void tellAgent(AgentConnection& agent) {
-    agent.post(platform::kUnlockedNotification);
-    send(agent, {.command = kPingCommand});
+    agent.post(veltoid::kVeltoIDUnlockedNotification);
+    send(agent, {.command = veltoid::command::kPing});
 }
 
 }  // namespace
 
 int keychainStatus(AgentConnection& /*agent*/, const Arguments& arguments) {
     const auto protection = platform::keychain::protection();
-    Json reply{{"success", protection.has_value()}};
+    Json reply{{veltoid::message::kSuccess, protection.has_value()}};
     if (protection) reply["protection"] = nameOf(*protection);
     return present(
         reply, arguments, "keychain status",
@@ -83,7 +85,7 @@ int unlockKeychain(AgentConnection& agent, const Arguments& arguments) {
 
 int lockKeychain(AgentConnection& /*agent*/, const Arguments& arguments) {
     if (platform::keychain::protection() == Protection::NoPassphrase) {
-        const Json refusal{{"success", false}};
+        const Json refusal{{veltoid::message::kSuccess, false}};
         return present(refusal, arguments, "keychain lock", {}, "the keychain has no passphrase");
     }
     return presentOutcome(platform::keychain::lock(), arguments, "keychain lock", "the keychain is locked");

@@ -3,9 +3,13 @@
 #include <iomanip>
 #include <iostream>
 
+#include "Protocol/MessageKeys.h"
 #include "veltoidctl/AgentRequest.h"
 
 namespace veltoidctl {
+
+namespace message = veltoid::message;
+
 namespace {
 
 constexpr int kLabelWidth = 22;
@@ -23,12 +27,12 @@ std::string withoutControls(std::string text) {
 
 /// The most telling text of an error, its own or that of the one underneath.
 std::string reasonOf(const Json& error, const std::string& otherwise) {
-    const Json information = error.value("UserInfo", Json::object());
+    const Json information = error.value(message::kErrorUserInfo, Json::object());
     for (const char* key : {"HWLocalizedFailureReason", "HWLocalizedDescription"})
         if (information.contains(key)) return textOf(information[key]);
     if (information.contains("HWUnderlyingError"))
         return reasonOf(information["HWUnderlyingError"], otherwise);
-    switch (error.value("Code", 0)) {
+    switch (error.value(message::kErrorCode, 0)) {
         case -103:
             return "the server has asked not to be contacted for a while";
         case -107:
@@ -55,7 +59,7 @@ void printLine(const std::string& label, const Json& value) {
 }
 
 void printEntries(const Json& dictionary,
-                  std::initializer_list<std::pair<const char*, const char*>> entries) {
+                  std::initializer_list<std::pair<std::string_view, const char*>> entries) {
     for (const auto& [key, label] : entries)
         if (dictionary.contains(key)) printLine(label, dictionary[key]);
 }
@@ -66,13 +70,13 @@ void printJson(const Json& value) {
 
 void printRefusal(const Json& reply, const std::string& what, const std::string& otherwise) {
     std::cerr << "veltoidctl: " << what << ": ";
-    if (!reply.contains("error")) {
+    if (!reply.contains(message::kError)) {
         std::cerr << otherwise << "\n";
         return;
     }
-    const Json& error = reply["error"];
-    std::cerr << reasonOf(error, otherwise) << " (" << error.value("Domain", "?") << " "
-              << error.value("Code", 0) << ")\n";
+    const Json& error = reply[message::kError];
+    std::cerr << reasonOf(error, otherwise) << " (" << error.value(message::kErrorDomain, "?") << " "
+              << error.value(message::kErrorCode, 0) << ")\n";
 }
 
 int present(const Json& reply, const Arguments& arguments, const std::string& what,

@@ -4,10 +4,11 @@
 #include <functional>
 #include <initializer_list>
 #include <string>
+#include <string_view>
 #include <utility>
 
-#include "veltoidctl/AgentConnection.h"
-#include "veltoidctl/Commands.h"
+#include "veltoidctl/Arguments.h"
+#include "veltoidctl/Json.h"
 
 namespace veltoidctl {
 
@@ -17,7 +18,8 @@ std::string textOf(const Json& value);
 void printLine(const std::string& label, const Json& value);
 
 /// Prints the entries that the dictionary has, in the given order, under readable labels.
-void printEntries(const Json& dictionary, std::initializer_list<std::pair<const char*, const char*>> entries);
+void printEntries(const Json& dictionary,
+                  std::initializer_list<std::pair<std::string_view, const char*>> entries);
 
 void printJson(const Json& value);
 

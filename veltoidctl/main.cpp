@@ -6,6 +6,8 @@
 #include <stdexcept>
 
 #include "Platform/crypto/OpenSSLLibrary.h"
+#include "Platform/runtime/Lifetime.h"
+#include "Protocol/Product.h"
 #include "veltoidctl/ClientCommandLine.h"
 
 namespace veltoidctl {
@@ -33,6 +35,7 @@ int run(int argc, char** argv) {
 int main(int argc, char** argv) {
     // Account names are lower-cased by the locale's rules, as the agent does it.
     std::setlocale(LC_CTYPE, "");
+    const platform::Lifetime lifetime(veltoid::kProduct);
     try {
         veltoidctl::keepSecrets();
         return veltoidctl::run(argc, argv);

@@ -7,10 +7,12 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <list>
 #include <utility>
 #include <vector>
 
-#include "Platform/bus/EventLoop.h"
+#include "Platform/runtime/EventLoop.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 
 namespace platform::bus {
@@ -26,18 +28,24 @@ struct State {
     bool ended = false;
     std::function<bool()> serve;
     std::vector<std::function<void()>> disconnectHandlers;
+    /// The bus has their addresses.
+    std::list<std::function<void()>> postedHandlers;
     sd_event_source* arrival = nullptr;
     sd_event_source* timeout = nullptr;
     sd_event_source* more = nullptr;
 
-    static State& shared() {
-        static auto* state = new State;
-        return *state;
+    void lifetimeEnds() {
+        ended = tried = true;
+        for (sd_event_source** source : {&arrival, &timeout, &more})
+            *source = sd_event_source_disable_unref(*source);
+        bus = sd_bus_close_unref(bus);
     }
 };
 
+State& shared() { return Lifetime::current().state<State>(); }
+
 void connectionEnded() {
-    State& state = State::shared();
+    State& state = shared();
     if (std::exchange(state.ended, true)) return;
     VELTOID_PLATFORM_LOG(Error, "The message bus has ended the connection.");
     for (const auto& handler : state.disconnectHandlers) handler();
@@ -54,6 +62,7 @@ int posted(sd_bus_message* /*message*/, void* context, sd_bus_error* /*error*/) 
 }
 
 void enable(sd_event_source* source, int whether) {
+    if (source == nullptr) return;
     if (const int result = sd_event_source_set_enabled(source, whether); result < 0)
         logFailure("watching", result);
 }
@@ -134,7 +143,7 @@ void logFailure(const char* operation, int result) {
 }
 
 sd_bus* connection() {
-    State& state = State::shared();
+    State& state = shared();
     if (state.tried) return state.bus;
     state.tried = true;
 
@@ -148,42 +157,43 @@ sd_bus* connection() {
     return state.bus;
 }
 
-void afterReading(std::function<bool()> serve) { State::shared().serve = std::move(serve); }
+void afterReading(std::function<bool()> serve) { shared().serve = std::move(serve); }
 
 size_t unreadBytes() {
-    sd_bus* bus = State::shared().bus;
+    sd_bus* bus = shared().bus;
     int bytes = 0;
     if (bus == nullptr || ioctl(sd_bus_get_fd(bus), SIOCOUTQ, &bytes) < 0) return 0;
     return static_cast<size_t>(bytes);
 }
 
-void serveSoon() { enable(State::shared().more, SD_EVENT_ON); }
+void serveSoon() { enable(shared().more, SD_EVENT_ON); }
 
 void emitPosted(const std::string& name) {
-    sd_bus* bus = State::shared().bus;
+    sd_bus* bus = shared().bus;
     if (bus == nullptr) return;
-    const int result =
-        sd_bus_emit_signal(bus, kObjectPath, kNotificationInterface, "Posted", "s", name.c_str());
+    const Product& product = Lifetime::current().product();
+    const int result = sd_bus_emit_signal(bus, product.objectPath, product.notificationInterface, "Posted",
+                                          "s", name.c_str());
     if (result < 0) logFailure("posting a notification", result);
 }
 
 void onPosted(const std::string& name, std::function<void()> handler) {
     sd_bus* bus = connection();
     if (bus == nullptr) return;
-    const std::string rule = "type='signal',path='" + std::string(kObjectPath) + "',interface='" +
-                             kNotificationInterface + "',member='Posted',arg0='" + name + "'";
-    // Lives as long as the process, like the match.
-    auto* kept = new std::function<void()>(std::move(handler));
+    const Product& product = Lifetime::current().product();
+    const std::string rule = "type='signal',path='" + std::string(product.objectPath) + "',interface='" +
+                             product.notificationInterface + "',member='Posted',arg0='" + name + "'";
+    void* kept = &shared().postedHandlers.emplace_back(std::move(handler));
     const int result = sd_bus_add_match_async(bus, nullptr, rule.c_str(), posted, posted, kept);
     if (result < 0) logFailure("listening", result);
 }
 
 void flush() {
-    if (sd_bus* bus = State::shared().bus) sd_bus_flush(bus);
+    if (sd_bus* bus = shared().bus) sd_bus_flush(bus);
 }
 
 void onDisconnect(std::function<void()> handler) {
-    State::shared().disconnectHandlers.push_back(std::move(handler));
+    shared().disconnectHandlers.push_back(std::move(handler));
 }
 
 }  // namespace platform::bus

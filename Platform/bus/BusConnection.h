@@ -1,5 +1,4 @@
-// The agent's one bus connection (sd-bus on the event loop). For Platform and, the names, for the programs
-// beside the agent; main thread.
+// The agent's one bus connection (sd-bus on the event loop). Main thread.
 #pragma once
 
 #include <functional>
@@ -9,12 +8,8 @@ struct sd_bus;
 
 namespace platform::bus {
 
-inline constexpr const char* kObjectPath = "/com/velto/harbwell/veltoid";
-inline constexpr const char* kMessageInterface = "com.velto.harbwell.veltoid.MessageService";
-inline constexpr const char* kNotificationInterface = "com.velto.harbwell.veltoid.Notifications";
-
 /// The connection, opened and attached to the event loop on first use; null when there is no bus (logged
-/// once).
+/// once), and when the lifetime ends: nothing more goes out then.
 sd_bus* connection();
 
 /// Calls `serve` after each portion that was read from the bus. While it answers true it is called again
@@ -30,8 +25,8 @@ size_t unreadBytes();
 /// Emits Posted(name); nothing happens without a connection that was opened before.
 void emitPosted(const std::string& name);
 
-/// Calls `handler` for the rest of the process when somebody posts that name, and once when the bus has begun
-/// to tell of it: what was posted before that is for the handler to find out.
+/// From now on calls `handler` when that name is posted, and once when the bus has begun to tell of it: what
+/// was posted before that is for the handler to find out.
 void onPosted(const std::string& name, std::function<void()> handler);
 
 /// Hands everything that was sent to the bus.

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "Platform/bus/MessageService.h"
+#include "Platform/bus/PeerConnection.h"
 #include "Platform/encoding/UTF8.h"
 
 namespace platform::bus {

@@ -3,9 +3,9 @@
 #include <systemd/sd-bus.h>
 
 #include <utility>
-#include <vector>
 
 #include "Platform/bus/BusConnection.h"
+#include "Platform/runtime/Lifetime.h"
 
 namespace platform {
 namespace {
@@ -31,11 +31,14 @@ constexpr double kRestSeconds = 0.0003;
 /// The peers that have events waiting, each in one of the two. Main thread only.
 struct BusPeer::Turns {
     std::deque<std::shared_ptr<BusPeer>> peers;
-    std::vector<std::shared_ptr<BusPeer>> resting;
+    std::deque<std::shared_ptr<BusPeer>> resting;
 
-    static Turns& shared() {
-        static auto* turns = new Turns;
-        return *turns;
+    /// What waits for its turn is not handled any more.
+    void lifetimeEnds() {
+        for (auto& each : {&peers, &resting})
+            for (const auto& peer : *each) peer->waiting_.clear();
+        peers.clear();
+        resting.clear();
     }
 
     void rest(std::shared_ptr<BusPeer> peer) {
@@ -49,19 +52,21 @@ struct BusPeer::Turns {
     }
 };
 
+BusPeer::Turns& BusPeer::turns() { return Lifetime::current().state<Turns>(); }
+
 bool BusPeer::serveWaiting() {
-    Turns& turns = Turns::shared();
-    for (int left = kServedAtOnce; left > 0 && !turns.peers.empty(); --left) {
-        std::shared_ptr<BusPeer> peer = std::move(turns.peers.front());
-        turns.peers.pop_front();
+    Turns& current = turns();
+    for (int left = kServedAtOnce; left > 0 && !current.peers.empty(); --left) {
+        std::shared_ptr<BusPeer> peer = std::move(current.peers.front());
+        current.peers.pop_front();
         if (peer->sendsAhead() && bus::unreadBytes() > kMostUnread) {
-            turns.rest(std::move(peer));
+            current.rest(std::move(peer));
             continue;
         }
         peer->handleOldest();
-        if (!peer->waiting_.empty()) turns.peers.push_back(std::move(peer));
+        if (!peer->waiting_.empty()) current.peers.push_back(std::move(peer));
     }
-    return !turns.peers.empty();
+    return !current.peers.empty();
 }
 
 BusPeer::~BusPeer() { sd_bus_track_unref(track_); }
@@ -76,14 +81,14 @@ void BusPeer::setAnsweredAtOnce(std::function<bool(IncomingMessage&)> test) {
 
 void BusPeer::resume() {
     if (std::exchange(resumed_, true) || waiting_.empty()) return;
-    Turns::shared().peers.push_back(shared_from_this());
+    turns().peers.push_back(shared_from_this());
     bus::serveSoon();
 }
 
 void BusPeer::deliver(PeerEvent event) {
     waiting_.push_back(std::move(event));
     if (!resumed_) return;
-    if (waiting_.size() == 1) Turns::shared().peers.push_back(shared_from_this());
+    if (waiting_.size() == 1) turns().peers.push_back(shared_from_this());
     if (waiting_.size() > kMostWaiting) handleOldest();
 }
 

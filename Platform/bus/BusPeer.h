@@ -10,7 +10,7 @@
 #include <memory>
 #include <string>
 
-#include "Platform/bus/MessageService.h"
+#include "Platform/bus/PeerConnection.h"
 #include "Platform/runtime/WorkQueue.h"
 
 struct sd_bus;
@@ -45,6 +45,7 @@ class BusPeer : public PeerConnection, public std::enable_shared_from_this<BusPe
 
   private:
     struct Turns;
+    static Turns& turns();
 
     void handleOldest();
     bool sendsAhead() const;

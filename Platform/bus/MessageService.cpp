@@ -13,6 +13,7 @@
 #include "Platform/bus/BusMessage.h"
 #include "Platform/bus/BusPeer.h"
 #include "Platform/bus/ServiceManager.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Platform/runtime/Transactions.h"
 
@@ -33,7 +34,7 @@ using MessageHandle = std::shared_ptr<sd_bus_message>;
 
 /// Main thread.
 void sendReply(sd_bus_message* request, const ValueWriter& writer) {
-    if (sd_bus_message_get_expect_reply(request) <= 0) return;
+    if (sd_bus_message_get_expect_reply(request) <= 0 || Lifetime::current().isEnding()) return;
     sd_bus_message* reply = nullptr;
     int result = sd_bus_message_new_method_return(request, &reply);
     // Replies may carry what the requests of this interface carry: wiped when freed, like those.
@@ -56,29 +57,25 @@ struct Release {
     long namesHeld = 0;
     std::function<void()> done;
 
-    static Release& shared() {
-        static auto* release = new Release;
-        return *release;
-    }
-
     /// Main thread.
     void look() {
         if (began && namesHeld == 0 && openRequests == 0 && done) std::exchange(done, nullptr)();
     }
 };
 
+Release& release() { return Lifetime::current().state<Release>(); }
+
 /// Holds a transaction from its arrival on: its handler opens one of its own only when its turn has come.
 class BusRequest : public IncomingMessage {
   public:
     explicit BusRequest(sd_bus_message* message) : message_(sd_bus_message_ref(message), releaseMessage) {
         transactions::began();
-        ++Release::shared().openRequests;
+        ++release().openRequests;
     }
 
     ~BusRequest() override {
-        Release& release = Release::shared();
-        if (--release.openRequests == 0 && release.began)
-            WorkQueue::main().async([&release] { release.look(); });
+        if (--release().openRequests == 0 && release().began)
+            WorkQueue::main().async([] { release().look(); });
         transactions::ended();
     }
 
@@ -109,17 +106,16 @@ class BusRequest : public IncomingMessage {
 
 class BusListener;
 
-/// The named services of this process. Main thread only.
+/// The named services. Main thread only.
 struct Services {
     std::vector<std::shared_ptr<BusListener>> listeners;
     bool objectAdded = false;
     long namesAskedFor = 0;
 
-    static Services& shared() {
-        static auto* services = new Services;
-        return *services;
-    }
+    void lifetimeEnds();
 };
+
+Services& services() { return Lifetime::current().state<Services>(); }
 
 int handleSend(sd_bus_message* message, void* context, sd_bus_error* error);
 
@@ -136,7 +132,7 @@ const sd_bus_vtable kNotificationInterfaceTable[] = {
     SD_BUS_VTABLE_END,
 };
 
-/// Lives as long as the process: the bus holds its address.
+/// Lives as long as the connection: the bus holds its address.
 class BusListener : public Listener {
   public:
     BusListener(std::string name, std::function<void(const ListenerEvent&)> handler)
@@ -154,7 +150,7 @@ class BusListener : public Listener {
         if (result >= 0)
             result = sd_bus_request_name_async(bus, nullptr, name_.c_str(), 0, nameRequested, this);
         if (result >= 0) {
-            ++Services::shared().namesAskedFor;
+            ++services().namesAskedFor;
             return;
         }
         bus::logFailure("registering a service", result);
@@ -167,6 +163,9 @@ class BusListener : public Listener {
         return bus != nullptr && !name_.empty() &&
                sd_bus_release_name_async(bus, nullptr, name_.c_str(), nameReleased, nullptr) >= 0;
     }
+
+    /// The peers and what they were waiting for.
+    void dropPeers() { peers_.clear(); }
 
     /// The peer of that bus name, new when this is its first message; null when it may not speak to the
     /// agent.
@@ -184,12 +183,13 @@ class BusListener : public Listener {
     };
 
     static int addObject(sd_bus* bus) {
-        if (std::exchange(Services::shared().objectAdded, true)) return 0;
+        if (std::exchange(services().objectAdded, true)) return 0;
         bus::afterReading(BusPeer::serveWaiting);
-        const int result = sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kMessageInterface,
-                                                    kMessageInterfaceTable, nullptr);
+        const Product& product = Lifetime::current().product();
+        const int result = sd_bus_add_object_vtable(
+            bus, nullptr, product.objectPath, product.messageInterface, kMessageInterfaceTable, nullptr);
         if (result < 0) return result;
-        return sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kNotificationInterface,
+        return sd_bus_add_object_vtable(bus, nullptr, product.objectPath, product.notificationInterface,
                                         kNotificationInterfaceTable, nullptr);
     }
 
@@ -199,7 +199,7 @@ class BusListener : public Listener {
         uint32_t outcome = 0;
         const bool answered = sd_bus_message_is_method_error(reply, nullptr) <= 0 &&
                               sd_bus_message_read(reply, "u", &outcome) > 0;
-        if (--Services::shared().namesAskedFor == 0) ServiceManager::shared().announceReady();
+        if (--services().namesAskedFor == 0) ServiceManager::shared().announceReady();
         if (answered && outcome == kPrimaryOwner) return 0;
         VELTOID_PLATFORM_LOG(Error, "The service name " + listener->name_ + " cannot be had on this bus.");
         listener->notify(ConnectionError::Invalid);
@@ -207,10 +207,9 @@ class BusListener : public Listener {
     }
 
     static int nameReleased(sd_bus_message* /*reply*/, void* /*context*/, sd_bus_error* /*error*/) noexcept {
-        Release& release = Release::shared();
-        --release.namesHeld;
+        --release().namesHeld;
         // What came before this reply has been dispatched.
-        release.look();
+        release().look();
         return 0;
     }
 
@@ -260,9 +259,13 @@ class BusListener : public Listener {
     std::map<std::string, std::shared_ptr<BusPeer>, std::less<>> peers_;
 };
 
+void Services::lifetimeEnds() {
+    for (const auto& listener : listeners) listener->dropPeers();
+}
+
 /// Messages to the connection's unique name go to the one without a name, else to the first service.
 BusListener* listenerFor(sd_bus_message* message) {
-    const auto& listeners = Services::shared().listeners;
+    const auto& listeners = services().listeners;
     const auto called = [&](std::string_view name) {
         const auto found = std::find_if(listeners.begin(), listeners.end(),
                                         [&](const auto& listener) { return listener->name() == name; });
@@ -293,7 +296,7 @@ int handleSend(sd_bus_message* message, void* /*context*/, sd_bus_error* error) 
 std::shared_ptr<Listener> Listener::create(std::string serviceName,
                                            std::function<void(const ListenerEvent&)> handler) {
     auto listener = std::make_shared<BusListener>(std::move(serviceName), std::move(handler));
-    Services::shared().listeners.push_back(listener);
+    services().listeners.push_back(listener);
     return listener;
 }
 
@@ -304,17 +307,16 @@ void onConnectionLost(std::function<void()> handler) {
 }
 
 void announceTermination() {
-    const auto listeners = Services::shared().listeners;
+    const auto listeners = services().listeners;
     for (const auto& listener : listeners) listener->notify(ConnectionError::TerminationImminent);
 }
 
 void releaseNames(std::function<void()> done) {
-    Release& release = Release::shared();
-    release.done = std::move(done);
-    release.began = true;
-    for (const auto& listener : Services::shared().listeners)
-        if (listener->releaseName()) ++release.namesHeld;
-    WorkQueue::main().async([&release] { release.look(); });
+    release().done = std::move(done);
+    release().began = true;
+    for (const auto& listener : services().listeners)
+        if (listener->releaseName()) ++release().namesHeld;
+    WorkQueue::main().async([] { release().look(); });
 }
 
 }  // namespace message_service

@@ -1,8 +1,7 @@
 #include "Platform/bus/Notifications.h"
 
-#include <atomic>
-
 #include "Platform/bus/BusConnection.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 
 namespace platform {
@@ -15,18 +14,8 @@ class BusNotifications : public Notifications {
     }
 };
 
-std::atomic<Notifications*> replacement{nullptr};
-
 }  // namespace
 
-Notifications& Notifications::shared() {
-    if (Notifications* notifications = replacement.load(std::memory_order_acquire)) return *notifications;
-    static auto* real = new BusNotifications;
-    return *real;
-}
-
-void Notifications::replaceShared(Notifications* notifications) {
-    replacement.store(notifications, std::memory_order_release);
-}
+Notifications& Notifications::shared() { return Lifetime::current().part<Notifications, BusNotifications>(); }
 
 }  // namespace platform

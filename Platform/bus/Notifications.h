@@ -1,5 +1,5 @@
 // System-wide notifications: a name, no payload, for whoever listens (D-Bus signal Posted(s name) of
-// interface com.velto.harbwell.veltoid.Notifications on the agent's object).
+// the product's notification interface on its object).
 #pragma once
 
 #include <string>
@@ -11,8 +11,6 @@ class Notifications {
   public:
     virtual ~Notifications() = default;
     static Notifications& shared();
-    /// Tests only: posts go to `notifications` (kept alive by the caller) until it is replaced by null.
-    static void replaceShared(Notifications* notifications);
 
     virtual void post(std::string name) = 0;
 };

@@ -11,19 +11,19 @@
 #include <systemd/sd-daemon.h>
 
 #include <algorithm>
-#include <array>
 #include <atomic>
 #include <cmath>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 #include <memory>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "Platform/bus/BusConnection.h"
+#include "Platform/encoding/CalendarText.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Platform/runtime/Transactions.h"
 
@@ -37,8 +37,6 @@ constexpr const char* kUnitPathPrefix = "/org/freedesktop/systemd1/unit";
 constexpr const char* kUnitExists = "org.freedesktop.systemd1.UnitExists";
 constexpr const char* kNoSuchUnit = "org.freedesktop.systemd1.NoSuchUnit";
 constexpr const char* kJobDone = "done";
-constexpr const char* kServiceUnit = "veltoidauthd.service";
-constexpr const char* kTimerUnit = "veltoidauthd-relaunch.timer";
 
 /// A date that has passed by the time the manager reads it never comes: what is nearer than this (seconds)
 /// is handed over as a delay.
@@ -51,19 +49,16 @@ constexpr uint64_t kTimerAccuracy = 100'000;
 /// Somebody else may create the timer at the same time; only so often is it stopped to make room.
 constexpr int kMostStops = 3;
 
+const Product& product() { return Lifetime::current().product(); }
+
 using Message = std::unique_ptr<sd_bus_message, decltype(&sd_bus_message_unref)>;
 using MessageHandler = int (*)(sd_bus_message* message, void* context, sd_bus_error* error);
 
+/// Of the form of systemd.time(7).
 std::string calendarDate(double date) {
-    const double whole = std::floor(date);
-    const auto seconds = static_cast<time_t>(whole);
-    const auto microseconds = static_cast<uint64_t>((date - whole) * kMicrosecondsPerSecond);
-    tm utc{};
-    gmtime_r(&seconds, &utc);
-    std::array<char, 32> text{};
-    const size_t length = std::strftime(text.data(), text.size(), "%Y-%m-%d %H:%M:%S.", &utc);
+    const auto microseconds = static_cast<uint64_t>((date - std::floor(date)) * kMicrosecondsPerSecond);
     const std::string fraction = std::to_string(kMicrosecondsPerSecond + microseconds).substr(1);
-    return std::string(text.data(), length) + fraction + " UTC";
+    return calendarText(date, "%Y-%m-%d %H:%M:%S.").value_or("") + fraction + " UTC";
 }
 
 /// The manager is only spoken to: asking the bus to start one would start nothing that manages this process.
@@ -77,13 +72,13 @@ Message callTo(sd_bus* bus, const char* method) {
 
 int appendTimer(sd_bus_message* call, double date) {
     const double left = date - Clock::shared().now();
-    int result = sd_bus_message_append(call, "ss", kTimerUnit, "replace");
+    int result = sd_bus_message_append(call, "ss", product().timerUnit, "replace");
     if (result >= 0) result = sd_bus_message_open_container(call, 'a', "(sv)");
     if (result >= 0)
-        result = sd_bus_message_append(call, "(sv)(sv)(sv)(sv)",                                       //
-                                       "Description", "s", "Starts the Velto ID account agent again",  //
-                                       "AccuracyUSec", "t", kTimerAccuracy,                            //
-                                       "RemainAfterElapse", "b", 0,                                    //
+        result = sd_bus_message_append(call, "(sv)(sv)(sv)(sv)",                        //
+                                       "Description", "s", product().timerDescription,  //
+                                       "AccuracyUSec", "t", kTimerAccuracy,             //
+                                       "RemainAfterElapse", "b", 0,                     //
                                        "CollectMode", "s", "inactive-or-failed");
     if (result >= 0 && left < kNearestDate)
         result = sd_bus_message_append(
@@ -99,14 +94,15 @@ int appendTimer(sd_bus_message* call, double date) {
 bool isServiceUnit(sd_bus_message* reply) {
     const char* unit = nullptr;
     char* expected = nullptr;
-    const bool same =
-        sd_bus_message_is_method_error(reply, nullptr) <= 0 && sd_bus_message_read(reply, "o", &unit) >= 0 &&
-        sd_bus_path_encode(kUnitPathPrefix, kServiceUnit, &expected) >= 0 && std::strcmp(unit, expected) == 0;
+    const bool same = sd_bus_message_is_method_error(reply, nullptr) <= 0 &&
+                      sd_bus_message_read(reply, "o", &unit) >= 0 &&
+                      sd_bus_path_encode(kUnitPathPrefix, product().serviceUnit, &expected) >= 0 &&
+                      std::strcmp(unit, expected) == 0;
     std::free(expected);
     return same;
 }
 
-/// Every callback comes with this object, which lives as long as the process.
+/// Every callback comes with this object, which lives as long as the connection.
 class Systemd : public ServiceManager {
   public:
     Systemd() {
@@ -114,10 +110,13 @@ class Systemd : public ServiceManager {
             if (!job_.path.empty()) fail("the message bus is gone");
         });
     }
+    ~Systemd() override { sd_bus_slot_unref(jobRemoved_); }
+    Systemd(const Systemd&) = delete;
+    Systemd& operator=(const Systemd&) = delete;
 
     uint32_t setStartInterval(uint32_t seconds) override {
         const uint32_t previous = std::exchange(interval_, seconds);
-        if (!mayBeUnit()) return previous;
+        if (!mayBeUnit() || Lifetime::current().isEnding()) return previous;
         date_ = Clock::shared().now() + seconds;
         changed_ = true;
         handedOver_ = false;
@@ -200,7 +199,8 @@ class Systemd : public ServiceManager {
 
     int stopTimer() {
         const Message call = callTo(bus::connection(), "StopUnit");
-        return sendWith(call, sd_bus_message_append(call.get(), "ss", kTimerUnit, "replace"), onStopping);
+        return sendWith(call, sd_bus_message_append(call.get(), "ss", product().timerUnit, "replace"),
+                        onStopping);
     }
 
     /// systemd reports the end of a job to whoever has asked for it.
@@ -306,18 +306,8 @@ class Systemd : public ServiceManager {
     std::vector<std::function<void(bool)>> answers_;
 };
 
-std::atomic<ServiceManager*> replacement{nullptr};
-
 }  // namespace
 
-ServiceManager& ServiceManager::shared() {
-    if (ServiceManager* manager = replacement.load(std::memory_order_acquire)) return *manager;
-    static auto* systemd = new Systemd;
-    return *systemd;
-}
-
-void ServiceManager::replaceShared(ServiceManager* manager) {
-    replacement.store(manager, std::memory_order_release);
-}
+ServiceManager& ServiceManager::shared() { return Lifetime::current().part<ServiceManager, Systemd>(); }
 
 }  // namespace platform

@@ -11,8 +11,6 @@ class ServiceManager {
   public:
     virtual ~ServiceManager() = default;
     static ServiceManager& shared();
-    /// Tests only: the caller keeps `manager` alive until it is replaced by null.
-    static void replaceShared(ServiceManager* manager);
 
     /// Asks for the agent to be started again after `seconds`; the previous interval (0: none) is returned
     /// and no longer holds. Returns at once: a transaction is open until the manager has agreed.

@@ -8,6 +8,7 @@
 #include <memory>
 
 #include "Platform/crypto/OpenSSLLibrary.h"
+#include "Platform/encoding/CalendarText.h"
 
 namespace platform {
 
@@ -81,7 +82,8 @@ std::string serialText(const X509* certificate) {
 std::optional<double> secondsOf(const ASN1_TIME* time) {
     std::tm fields{};
     if (time == nullptr || ASN1_TIME_to_tm(time, &fields) != 1) return std::nullopt;
-    return static_cast<double>(timegm(&fields));
+    return platform::secondsOf(CalendarDate{fields.tm_year + 1900, fields.tm_mon + 1, fields.tm_mday,
+                                            fields.tm_hour, fields.tm_min, fields.tm_sec});
 }
 
 std::vector<uint8_t> publicKeyOf(const X509* certificate) {

@@ -11,6 +11,7 @@
 #include <string>
 
 #include "Platform/crypto/OpenSSLLibrary.h"
+#include "Platform/encoding/HexText.h"
 #include "Platform/runtime/SystemLog.h"
 
 namespace platform {
@@ -123,14 +124,8 @@ UUIDBytes randomUUID() {
 }
 
 std::string canonicalUUIDText(const UUIDBytes& uuid) {
-    constexpr char kDigits[] = "0123456789ABCDEF";
-    std::string text;
-    text.reserve(36);
-    for (size_t i = 0; i < uuid.size(); ++i) {
-        if (i == 4 || i == 6 || i == 8 || i == 10) text += '-';
-        text += kDigits[uuid[i] >> 4U];
-        text += kDigits[uuid[i] & 0x0FU];
-    }
+    std::string text = hexText(uuid, kUpperCaseDigits);
+    for (const size_t hyphen : {8, 13, 18, 23}) text.insert(hyphen, 1, '-');
     return text;
 }
 

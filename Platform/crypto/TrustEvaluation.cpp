@@ -15,6 +15,7 @@
 
 #include "Platform/crypto/OpenSSLLibrary.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 
 namespace platform {
@@ -85,20 +86,20 @@ class OwningStack {
 };
 
 std::filesystem::path authorityFile() {
-    constexpr const char* kName = "harbwell/identity-authority.pem";
+    const Product& product = Lifetime::current().product();
+    const std::filesystem::path name = std::filesystem::path(product.folder) / product.authorityFile;
     // NOLINTBEGIN(concurrency-mt-unsafe): nobody changes the environment
     const char* configuration = std::getenv("XDG_CONFIG_HOME");
     const char* home = std::getenv("HOME");
     // NOLINTEND(concurrency-mt-unsafe)
     std::filesystem::path own;
     if (configuration != nullptr && *configuration == '/') {
-        own = std::filesystem::path(configuration) / kName;
+        own = std::filesystem::path(configuration) / name;
     } else if (home != nullptr && *home == '/') {
-        own = std::filesystem::path(home) / ".config" / kName;
+        own = std::filesystem::path(home) / ".config" / name;
     }
     std::error_code ignored;
-    return !own.empty() && std::filesystem::exists(own, ignored) ? own
-                                                                 : std::filesystem::path("/etc") / kName;
+    return !own.empty() && std::filesystem::exists(own, ignored) ? own : std::filesystem::path("/etc") / name;
 }
 
 void logUnusable(const std::filesystem::path& file, const std::string& reason) {

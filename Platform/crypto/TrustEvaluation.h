@@ -1,7 +1,7 @@
 // Whether a certificate comes from the identity service's authority.
 //
-// The authorities are the certificates in identity-authority.pem, in $XDG_CONFIG_HOME/harbwell (default
-// ~/.config/harbwell), else in /etc/harbwell. An entry may be an intermediate authority, it may be marked as
+// The authorities are the certificates in one file, in the product's folder in $XDG_CONFIG_HOME (default
+// ~/.config), else in that in /etc. An entry may be an intermediate authority, it may be marked as
 // rejected (a "TRUSTED CERTIFICATE" of OpenSSL), and revocation lists ("X509 CRL") may stand beside them. The
 // file is read for each evaluation, so that a change counts at once.
 #pragma once

@@ -1,46 +1,71 @@
 #include "Platform/encoding/UTF8.h"
 
-#include <optional>
-
-#include "Platform/runtime/SecureMemory.h"
+#include <cstdint>
+#include <cstring>
 
 namespace platform {
 namespace {
 
-/// What may follow the first byte of a character: how many bytes, and the range of the first of them.
-struct Continuation {
-    size_t count;
-    unsigned char lowest = 0x80;
-    unsigned char highest = 0xBF;
-};
-
-std::optional<Continuation> continuationOf(unsigned char first) {
-    if (first < 0x80) return Continuation{0};
-    if (first < 0xC2 || first > 0xF4) return std::nullopt;
-    if (first < 0xE0) return Continuation{1};
-    // The narrower ranges leave out overlong forms, surrogates and what lies beyond U+10FFFF.
-    if (first == 0xE0) return Continuation{2, 0xA0};
-    if (first == 0xED) return Continuation{2, 0x80, 0x9F};
-    if (first < 0xF0) return Continuation{2};
-    if (first == 0xF0) return Continuation{3, 0x90};
-    if (first == 0xF4) return Continuation{3, 0x80, 0x8F};
-    return Continuation{3};
+/// How many bytes from the start are ASCII, in whole groups of eight and one by one after them.
+size_t leadingASCII(std::string_view text) {
+    constexpr uint64_t kHighBits = 0x8080808080808080;
+    size_t length = 0;
+    for (uint64_t eight = 0; length + sizeof eight <= text.size(); length += sizeof eight) {
+        std::memcpy(&eight, text.data() + length, sizeof eight);
+        if ((eight & kHighBits) != 0) break;
+    }
+    while (length < text.size() && static_cast<uint8_t>(text[length]) < 0x80) ++length;
+    return length;
 }
 
 }  // namespace
 
+bool isASCII(std::string_view text) { return leadingASCII(text) == text.size(); }
+
 bool isUTF8(std::string_view text) {
-    const Bytes bytes = bytesOf(text);
-    for (size_t i = 0; i < bytes.size();) {
-        const auto continuation = continuationOf(bytes[i++]);
-        if (!continuation || bytes.size() - i < continuation->count) return false;
-        for (size_t k = 0; k < continuation->count; ++k, ++i) {
-            const unsigned char lowest = k == 0 ? continuation->lowest : 0x80;
-            const unsigned char highest = k == 0 ? continuation->highest : 0xBF;
-            if (bytes[i] < lowest || bytes[i] > highest) return false;
-        }
+    for (;;) {
+        text.remove_prefix(leadingASCII(text));
+        if (text.empty()) return true;
+        if (!takeCodePoint(text)) return false;
     }
-    return true;
+}
+
+std::optional<char32_t> takeCodePoint(std::string_view& text) {
+    const auto lead = static_cast<uint8_t>(text.front());
+    const size_t length = lead < 0x80   ? 1
+                          : lead < 0xC2 ? 0
+                          : lead < 0xE0 ? 2
+                          : lead < 0xF0 ? 3
+                          : lead < 0xF5 ? 4
+                                        : 0;
+    if (length == 0 || text.size() < length) return std::nullopt;
+    char32_t point = length == 1 ? lead : lead & (0x7FU >> length);
+    for (size_t i = 1; i < length; ++i) {
+        const auto next = static_cast<uint8_t>(text[i]);
+        if ((next & 0xC0U) != 0x80) return std::nullopt;
+        point = point << 6U | (next & 0x3FU);
+    }
+    const bool overlong = (length == 3 && point < 0x800) || (length == 4 && point < 0x10000);
+    const bool surrogate = point >= 0xD800 && point <= 0xDFFF;
+    if (overlong || surrogate || point > 0x10FFFF) return std::nullopt;
+    text.remove_prefix(length);
+    return point;
+}
+
+void appendUTF8(SecretText& text, char32_t point) {
+    const auto tail = [&](unsigned shift) { text += static_cast<char>(0x80U | (point >> shift & 0x3FU)); };
+    if (point < 0x80) {
+        text += static_cast<char>(point);
+    } else if (point < 0x800) {
+        text += static_cast<char>(0xC0U | point >> 6U);
+        tail(0);
+    } else if (point < 0x10000) {
+        text += static_cast<char>(0xE0U | point >> 12U);
+        tail(6), tail(0);
+    } else {
+        text += static_cast<char>(0xF0U | point >> 18U);
+        tail(12), tail(6), tail(0);
+    }
 }
 
 }  // namespace platform

@@ -11,6 +11,7 @@
 #include "Platform/keychain/KernelKeyring.h"
 #include "Platform/keychain/KeychainClassKeys.h"
 #include "Platform/keychain/KeychainSealing.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Platform/storage/SQLiteFile.h"
 
@@ -39,12 +40,16 @@ constexpr const char* kSchema =
     "CREATE UNIQUE INDEX objects ON items (class, coalesce(key_class, x''), application_value) WHERE class "
     "<> 0;";
 
-/// The store; never destroyed, so that exit from any thread is safe.
-SQLiteFile& file() {
-    static const std::string schema = std::string(kSchema) + kClassKeysSchema;
-    static auto& shared = *new SQLiteFile({"keychain.db", 0x48574B43 /* "HWKC" */, 1, schema.c_str()});
-    return shared;
-}
+struct KeychainFile : SQLiteFile {
+    KeychainFile() : SQLiteFile({"keychain.db", 0x48574B43 /* "HWKC" */, 1, schema().c_str()}) {}
+
+    static const std::string& schema() {
+        static const std::string text = std::string(kSchema) + kClassKeysSchema;
+        return text;
+    }
+};
+
+SQLiteFile& file() { return Lifetime::current().state<KeychainFile>(); }
 
 struct Row {
     int64_t sequence = 0;

@@ -9,6 +9,7 @@
 #include "Platform/encoding/HexText.h"
 #include "Platform/keychain/KernelKeyring.h"
 #include "Platform/keychain/KeychainDeviceKey.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 
 namespace platform::keychain {
@@ -94,7 +95,8 @@ bool isWellFormed(Bytes wrapped) {
 
 /// No two passphrases that were set share a salt, and it stays the same for every process.
 std::string keyringName(Bytes wrapped) {
-    return "veltoid keychain " + hexText(wrapped.subspan(kSaltAt, kSaltBytes));
+    return std::string(Lifetime::current().product().keyringPrefix) +
+           hexText(wrapped.subspan(kSaltAt, kSaltBytes));
 }
 
 std::optional<SecretBytes> derive(Bytes passphrase, Bytes header) {

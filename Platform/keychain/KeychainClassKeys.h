@@ -7,7 +7,7 @@
 
 #include <string>
 
-#include "Platform/keychain/Keychain.h"
+#include "Platform/keychain/KeychainItem.h"
 #include "Platform/storage/SQLiteFile.h"
 
 namespace platform::keychain {

@@ -8,9 +8,9 @@
 #include <cerrno>
 #include <cstring>
 #include <string_view>
-#include <vector>
 
 #include "Platform/crypto/Crypto.h"
+#include "Platform/encoding/BigEndian.h"
 #include "Platform/runtime/StateDirectory.h"
 #include "Platform/runtime/SystemLog.h"
 
@@ -24,11 +24,6 @@ constexpr uint32_t kKeyFileVersion = 1;
 constexpr size_t kVersionBytes = 4;
 constexpr size_t kCheckBytes = 4;
 constexpr size_t kKeyFileBytes = kKeyFileMagic.size() + kVersionBytes + kCheckBytes + kSealingKeyBytes;
-
-void appendVersion(std::vector<uint8_t>& output) {
-    for (size_t i = kVersionBytes; i-- > 0;)
-        output.push_back(static_cast<uint8_t>(kKeyFileVersion >> (8 * i)));
-}
 
 /// The file's descriptor, closed at the end.
 class File {
@@ -82,9 +77,8 @@ SecretBytes checkOf(Bytes key) {
 }
 
 SecretBytes encodeKeyFile(Bytes key) {
-    std::vector<uint8_t> header(kKeyFileMagic.begin(), kKeyFileMagic.end());
-    appendVersion(header);
-    SecretBytes bytes(header.begin(), header.end());
+    SecretBytes bytes(kKeyFileMagic.begin(), kKeyFileMagic.end());
+    appendBigEndian(bytes, kKeyFileVersion, kVersionBytes);
     const SecretBytes check = checkOf(key);
     bytes.insert(bytes.end(), check.begin(), check.end());
     bytes.insert(bytes.end(), key.begin(), key.end());
@@ -95,9 +89,7 @@ std::optional<SecretBytes> decodeKeyFile(const std::string& path, Bytes bytes) {
     if (bytes.size() < kKeyFileBytes || !textOf(bytes).starts_with(kKeyFileMagic)) {
         return refuse(path, "is not a device key");
     }
-    uint32_t version = 0;
-    for (const uint8_t byte : bytes.subspan(kKeyFileMagic.size(), kVersionBytes))
-        version = version << 8U | byte;
+    const uint64_t version = bigEndian(bytes.subspan(kKeyFileMagic.size(), kVersionBytes));
     if (version != kKeyFileVersion) return refuse(path, "has the unknown version " + std::to_string(version));
     const Bytes key = bytes.last(kSealingKeyBytes);
     if (bytes.size() != kKeyFileBytes ||

@@ -3,6 +3,7 @@
 #include <string_view>
 
 #include "Platform/crypto/Crypto.h"
+#include "Platform/encoding/BigEndian.h"
 #include "Platform/encoding/HexText.h"
 #include "Platform/keychain/KeychainClassKeys.h"
 #include "Platform/runtime/SystemLog.h"
@@ -11,15 +12,11 @@ namespace platform::keychain {
 
 namespace {
 
-void appendNumber(std::vector<uint8_t>& output, uint64_t number, size_t width) {
-    for (size_t i = width; i-- > 0;) output.push_back(static_cast<uint8_t>(number >> (8 * i)));
-}
-
 /// Presence, length, bytes: no two lists of fields have the same encoding.
 void appendField(std::vector<uint8_t>& output, std::optional<std::string_view> field) {
     output.push_back(field ? 1 : 0);
     if (!field) return;
-    appendNumber(output, field->size(), 8);
+    appendBigEndian(output, field->size(), 8);
     output.insert(output.end(), field->begin(), field->end());
 }
 
@@ -32,8 +29,8 @@ ClassKey classKeyOf(Accessibility accessibility) {
 std::vector<uint8_t> encodeIdentity(const ItemIdentity& identity) {
     const KeychainAttributes& attributes = identity.attributes;
     std::vector<uint8_t> output;
-    appendNumber(output, static_cast<uint64_t>(attributes.itemClass), 1);
-    appendNumber(output, static_cast<uint64_t>(identity.accessibility), 1);
+    appendBigEndian(output, static_cast<uint64_t>(attributes.itemClass), 1);
+    appendBigEndian(output, static_cast<uint64_t>(identity.accessibility), 1);
     appendField(output, textOf(identity.id));
     for (const auto* field :
          {&attributes.account, &attributes.service, &attributes.label, &attributes.description,

@@ -6,7 +6,7 @@
 #include <optional>
 #include <string>
 
-#include "Platform/keychain/Keychain.h"
+#include "Platform/keychain/KeychainItem.h"
 #include "Platform/storage/SQLiteFile.h"
 
 namespace platform::keychain {

@@ -1,24 +1,19 @@
 // Whether this device has been unlocked since it was started, and news of that: the passphrase of the
-// keychain is what unlocks it, and who gave it posts the notification. Without a passphrase the device counts
-// as unlocked.
+// keychain is what unlocks it, and the program that takes it posts the notification. Without a passphrase the
+// device counts as unlocked.
 #pragma once
 
 #include <functional>
+#include <utility>
 
 namespace platform {
-
-/// Posted on the agent's object after the keychain was unlocked, by whoever did it.
-inline constexpr const char* kUnlockedNotification = "com.velto.harbwell.veltoid.keychain.unlocked";
 
 /// All operations may be called from any thread.
 class LockState {
   public:
     virtual ~LockState() = default;
+    /// The lifetime's one: as the keychain says, without news, unless another part was given.
     static LockState& shared();
-    /// From now on the device counts as unlocked: for a process without a keychain.
-    static void assumeUnlocked();
-    /// Tests only: the caller keeps `state` alive until it is replaced by null.
-    static void replaceShared(LockState* state);
 
     /// True once the keychain's "after first unlock" key can be had.
     virtual bool hasBeenUnlockedSinceBoot() const = 0;
@@ -26,6 +21,34 @@ class LockState {
     /// From now on calls `handler` on the main queue whenever the device was unlocked; replaces an earlier
     /// handler. Null ends that.
     virtual void onChange(std::function<void()> handler) = 0;
+};
+
+/// As the keychain says.
+class KeychainLockState : public LockState {
+  public:
+    /// Has `handler` called on the main queue when the keychain may have been unlocked, and once when it has
+    /// begun to listen: what was posted before that is for the handler to find out.
+    using Subscribe = std::function<void(std::function<void()> handler)>;
+
+    explicit KeychainLockState(Subscribe subscribe = {}) : subscribe_(std::move(subscribe)) {}
+
+    bool hasBeenUnlockedSinceBoot() const override;
+    void onChange(std::function<void()> handler) override;
+
+  private:
+    void look() const;
+
+    const Subscribe subscribe_;
+    /// Main thread only.
+    std::function<void()> handler_;
+    bool isListening_ = false;
+};
+
+/// For a process without a keychain.
+class AlwaysUnlocked : public LockState {
+  public:
+    bool hasBeenUnlockedSinceBoot() const override { return true; }
+    void onChange(std::function<void()>) override {}
 };
 
 }  // namespace platform

@@ -1,7 +1,6 @@
 #include "Platform/net/CurlExchange.h"
 
 #include <curl/curl.h>
-#include <dlfcn.h>
 
 #include <algorithm>
 #include <cstdlib>
@@ -9,6 +8,7 @@
 #include <string>
 
 #include "Platform/crypto/OpenSSLLibrary.h"
+#include "Platform/runtime/LazyLibrary.h"
 #include "Platform/runtime/SystemLog.h"
 
 namespace platform {
@@ -16,115 +16,36 @@ namespace {
 
 // --- The library
 
-/// The functions of libcurl that are in use, found in the library at run time.
-struct CurlLibrary {
-    decltype(&::curl_global_init) globalInit = nullptr;
-    decltype(&::curl_easy_init) easyInit = nullptr;
-    decltype(&::curl_easy_cleanup) easyCleanup = nullptr;
-    decltype(&::curl_easy_setopt) easySetopt = nullptr;
-    decltype(&::curl_easy_getinfo) easyGetinfo = nullptr;
-    decltype(&::curl_easy_strerror) easyStrerror = nullptr;
-    decltype(&::curl_slist_append) slistAppend = nullptr;
-    decltype(&::curl_slist_free_all) slistFreeAll = nullptr;
-    decltype(&::curl_multi_init) multiInit = nullptr;
-    decltype(&::curl_multi_cleanup) multiCleanup = nullptr;
-    decltype(&::curl_multi_add_handle) multiAddHandle = nullptr;
-    decltype(&::curl_multi_remove_handle) multiRemoveHandle = nullptr;
-    decltype(&::curl_multi_perform) multiPerform = nullptr;
-    decltype(&::curl_multi_poll) multiPoll = nullptr;
-    decltype(&::curl_multi_wakeup) multiWakeup = nullptr;
-    decltype(&::curl_multi_info_read) multiInfoRead = nullptr;
+// As macros with arguments they would stand in the way of the functions' own names.
+#undef curl_easy_setopt
+#undef curl_easy_getinfo
 
-    decltype(&::curl_url) url = nullptr;
-    decltype(&::curl_url_cleanup) urlCleanup = nullptr;
-    decltype(&::curl_url_set) urlSet = nullptr;
-    decltype(&::curl_url_get) urlGet = nullptr;
-    decltype(&::curl_free) free = nullptr;
+// The functions that are in use.
+#define VELTOID_CURL_FUNCTIONS(each)                                                                        \
+    each(curl_easy_cleanup) each(curl_easy_getinfo) each(curl_easy_init) each(curl_easy_setopt)             \
+        each(curl_easy_strerror) each(curl_free) each(curl_multi_add_handle) each(curl_multi_cleanup)       \
+            each(curl_multi_info_read) each(curl_multi_init) each(curl_multi_perform) each(curl_multi_poll) \
+                each(curl_multi_remove_handle) each(curl_multi_wakeup) each(curl_slist_append)              \
+                    each(curl_slist_free_all) each(curl_url) each(curl_url_cleanup) each(curl_url_get)      \
+                        each(curl_url_set)
 
-    /// Loaded and initialised on the first call and kept for the life of the process; null when the library
-    /// or one of the functions is missing. Any thread.
-    static const CurlLibrary* shared();
-};
+#define VELTOID_CURL_NAME(function) #function,
+#define VELTOID_CURL_FUNCTION(function) VELTOID_LAZY_FUNCTION(library, function);
 
-constexpr const char* kLibraryName = "libcurl.so.4";
+constinit const LazyLibrary library("libcurl.so.4");
+VELTOID_LAZY_FUNCTION(library, curl_global_init);
+VELTOID_CURL_FUNCTIONS(VELTOID_CURL_FUNCTION)
 
-/// Looks functions up until one is missing.
-class SymbolReader {
-  public:
-    explicit SymbolReader(void* library) : library_(library) {}
-
-    template <typename Function>
-    void find(Function& function, const char* name) {
-        function = reinterpret_cast<Function>(require(name));
-    }
-
-    void* require(const char* name) {
-        void* address = dlsym(library_, name);
-        if (address == nullptr && missing_ == nullptr) missing_ = name;
-        return address;
-    }
-
-    const char* missing() const { return missing_; }
-
-  private:
-    void* library_;
-    const char* missing_ = nullptr;
-};
-
-const char* findAll(void* library, CurlLibrary& curl) {
-    SymbolReader symbols(library);
-    symbols.find(curl.globalInit, "curl_global_init");
-    symbols.find(curl.easyInit, "curl_easy_init");
-    symbols.find(curl.easyCleanup, "curl_easy_cleanup");
-    symbols.find(curl.easySetopt, "curl_easy_setopt");
-    symbols.find(curl.easyGetinfo, "curl_easy_getinfo");
-    symbols.find(curl.easyStrerror, "curl_easy_strerror");
-    symbols.find(curl.slistAppend, "curl_slist_append");
-    symbols.find(curl.slistFreeAll, "curl_slist_free_all");
-    symbols.find(curl.multiInit, "curl_multi_init");
-    symbols.find(curl.multiCleanup, "curl_multi_cleanup");
-    symbols.find(curl.multiAddHandle, "curl_multi_add_handle");
-    symbols.find(curl.multiRemoveHandle, "curl_multi_remove_handle");
-    symbols.find(curl.multiPerform, "curl_multi_perform");
-    symbols.find(curl.multiPoll, "curl_multi_poll");
-    symbols.find(curl.multiWakeup, "curl_multi_wakeup");
-    symbols.find(curl.multiInfoRead, "curl_multi_info_read");
-    symbols.find(curl.url, "curl_url");
-    symbols.find(curl.urlCleanup, "curl_url_cleanup");
-    symbols.find(curl.urlSet, "curl_url_set");
-    symbols.find(curl.urlGet, "curl_url_get");
-    symbols.find(curl.free, "curl_free");
+bool load() {
     // There are builds on other TLS libraries.
-    symbols.require("OPENSSL_init_crypto");
-    return symbols.missing();
-}
-
-const CurlLibrary* load() {
-    // Never closed: its threads and TLS state live as long as the process.
-    void* library = dlopen(kLibraryName, RTLD_NOW | RTLD_LOCAL);
-    if (library == nullptr) {
-        const char* reason = dlerror();  // NOLINT(concurrency-mt-unsafe): thread-local in glibc
-        VELTOID_PLATFORM_LOG(Error,
-                             std::string("cannot load the HTTPS client library: ") + (reason ? reason : "?"));
-        return nullptr;
-    }
-    static CurlLibrary curl;
-    if (const char* missing = findAll(library, curl)) {
-        VELTOID_PLATFORM_LOG(Error, std::string(kLibraryName) + " lacks " + missing);
-        return nullptr;
-    }
+    if (!library.provides(
+            {VELTOID_CURL_FUNCTIONS(VELTOID_CURL_NAME) "curl_global_init", "OPENSSL_init_crypto"}))
+        return false;
     // Before the library makes use of it.
     openssl::prepare();
-    if (curl.globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
-        VELTOID_PLATFORM_LOG(Error, "cannot initialise the HTTPS client library");
-        return nullptr;
-    }
-    return &curl;
-}
-
-const CurlLibrary* CurlLibrary::shared() {
-    static const CurlLibrary* const curl = load();
-    return curl;
+    if (curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK) return true;
+    VELTOID_PLATFORM_LOG(Error, "cannot initialise the HTTPS client library");
+    return false;
 }
 
 // --- The exchange
@@ -162,7 +83,7 @@ bool isFieldValue(std::string_view value) {
 class CurlExchange::Transfer {
   public:
     /// Request and events must outlive the exchange.
-    Transfer(const CurlLibrary& curl, const HTTPRequest& request, HTTPSessionEvents& events);
+    Transfer(const HTTPRequest& request, HTTPSessionEvents& events);
     Transfer(const Transfer&) = delete;
     Transfer& operator=(const Transfer&) = delete;
 
@@ -175,16 +96,13 @@ class CurlExchange::Transfer {
 
   private:
     struct EasyDeleter {
-        const CurlLibrary* curl;
-        void operator()(CURL* handle) const { curl->easyCleanup(handle); }
+        void operator()(CURL* handle) const { curl_easy_cleanup(handle); }
     };
     struct MultiDeleter {
-        const CurlLibrary* curl;
-        void operator()(CURLM* handle) const { curl->multiCleanup(handle); }
+        void operator()(CURLM* handle) const { curl_multi_cleanup(handle); }
     };
     struct ListDeleter {
-        const CurlLibrary* curl;
-        void operator()(curl_slist* list) const { curl->slistFreeAll(list); }
+        void operator()(curl_slist* list) const { curl_slist_free_all(list); }
     };
 
     template <typename Value>
@@ -210,7 +128,6 @@ class CurlExchange::Transfer {
     static int onProgress(void* exchange, curl_off_t, curl_off_t, curl_off_t expected,
                           curl_off_t sent) noexcept;
 
-    const CurlLibrary& curl_;
     HTTPSessionEvents& events_;
     const std::string& url_;
     std::unique_ptr<curl_slist, ListDeleter> headerFields_;
@@ -224,14 +141,8 @@ class CurlExchange::Transfer {
     curl_off_t reportedSent_ = 0;
 };
 
-CurlExchange::Transfer::Transfer(const CurlLibrary& curl, const HTTPRequest& request,
-                                 HTTPSessionEvents& events)
-    : curl_(curl),
-      events_(events),
-      url_(request.url),
-      headerFields_(nullptr, {&curl}),
-      easy_(curl.easyInit(), {&curl}),
-      multi_(curl.multiInit(), {&curl}) {
+CurlExchange::Transfer::Transfer(const HTTPRequest& request, HTTPSessionEvents& events)
+    : events_(events), url_(request.url), easy_(curl_easy_init()), multi_(curl_multi_init()) {
     if (!easy_ || !multi_) {
         failure_ = CURLE_FAILED_INIT;
         return;
@@ -244,7 +155,7 @@ CurlExchange::Transfer::Transfer(const CurlLibrary& curl, const HTTPRequest& req
 
 template <typename Value>
 void CurlExchange::Transfer::set(CURLoption option, Value value) {
-    const CURLcode code = curl_.easySetopt(easy_.get(), option, value);
+    const CURLcode code = curl_easy_setopt(easy_.get(), option, value);
     if (failure_ == CURLE_OK) failure_ = code;
 }
 
@@ -306,7 +217,7 @@ void CurlExchange::Transfer::setRequest(const HTTPRequest& request) {
         if (strcasecmp(name.c_str(), "Content-Length") != 0) addHeaderField(name, value);
     }
     // Without this, larger bodies wait a second for a server's leave to come.
-    headerFields_.reset(curl_.slistAppend(headerFields_.release(), "Expect:"));
+    headerFields_.reset(curl_slist_append(headerFields_.release(), "Expect:"));
     set(CURLOPT_HTTPHEADER, headerFields_.get());
 }
 
@@ -317,31 +228,31 @@ void CurlExchange::Transfer::addHeaderField(std::string_view name, std::string_v
     }
     // To the library a name with a colon and nothing behind it means that the field is to be left out.
     const std::string line = std::string(name) + (value.empty() ? ";" : ": " + std::string(value));
-    headerFields_.reset(curl_.slistAppend(headerFields_.release(), line.c_str()));
+    headerFields_.reset(curl_slist_append(headerFields_.release(), line.c_str()));
 }
 
 std::optional<HTTPError> CurlExchange::Transfer::run(const std::atomic<bool>& cancelled) {
     if (failure_ != CURLE_OK) return errorOf(failure_);
-    if (curl_.multiAddHandle(multi_.get(), easy_.get()) != CURLM_OK) return errorOf(CURLE_FAILED_INIT);
+    if (curl_multi_add_handle(multi_.get(), easy_.get()) != CURLM_OK) return errorOf(CURLE_FAILED_INIT);
     const bool ended = drive(cancelled);
     std::optional<HTTPError> error = ended ? outcome() : errorOf(CURLE_ABORTED_BY_CALLBACK);
-    curl_.multiRemoveHandle(multi_.get(), easy_.get());
+    curl_multi_remove_handle(multi_.get(), easy_.get());
     return error;
 }
 
 bool CurlExchange::Transfer::drive(const std::atomic<bool>& cancelled) {
     while (!cancelled) {
         int running = 0;
-        if (curl_.multiPerform(multi_.get(), &running) != CURLM_OK) return false;
+        if (curl_multi_perform(multi_.get(), &running) != CURLM_OK) return false;
         if (running == 0) return true;
-        if (curl_.multiPoll(multi_.get(), nullptr, 0, kPollMilliseconds, nullptr) != CURLM_OK) return false;
+        if (curl_multi_poll(multi_.get(), nullptr, 0, kPollMilliseconds, nullptr) != CURLM_OK) return false;
     }
     return false;
 }
 
 std::optional<HTTPError> CurlExchange::Transfer::outcome() {
     int left = 0;
-    const CURLMsg* message = curl_.multiInfoRead(multi_.get(), &left);
+    const CURLMsg* message = curl_multi_info_read(multi_.get(), &left);
     const CURLcode code =
         message != nullptr && message->msg == CURLMSG_DONE ? message->data.result : CURLE_FAILED_INIT;
     if (code == CURLE_OK) return std::nullopt;
@@ -350,26 +261,26 @@ std::optional<HTTPError> CurlExchange::Transfer::outcome() {
 }
 
 void CurlExchange::Transfer::wakeUp() {
-    if (multi_) curl_.multiWakeup(multi_.get());
+    if (multi_) curl_multi_wakeup(multi_.get());
 }
 
-HTTPError CurlExchange::Transfer::errorOf(CURLcode code) const { return {code, curl_.easyStrerror(code)}; }
+HTTPError CurlExchange::Transfer::errorOf(CURLcode code) const { return {code, curl_easy_strerror(code)}; }
 
 ProtectionSpace CurlExchange::Transfer::protectionSpace() const {
     ProtectionSpace space{{}, 0, "ServerTrust"};
-    CURLU* url = curl_.url();
+    CURLU* url = curl_url();
     char* part = nullptr;
-    if (curl_.urlSet(url, CURLUPART_URL, url_.c_str(), 0) == CURLUE_OK) {
-        if (curl_.urlGet(url, CURLUPART_HOST, &part, 0) == CURLUE_OK) {
+    if (curl_url_set(url, CURLUPART_URL, url_.c_str(), 0) == CURLUE_OK) {
+        if (curl_url_get(url, CURLUPART_HOST, &part, 0) == CURLUE_OK) {
             space.host = part;
-            curl_.free(part);
+            curl_free(part);
         }
-        if (curl_.urlGet(url, CURLUPART_PORT, &part, CURLU_DEFAULT_PORT) == CURLUE_OK) {
+        if (curl_url_get(url, CURLUPART_PORT, &part, CURLU_DEFAULT_PORT) == CURLUE_OK) {
             space.port = std::atoi(part);
-            curl_.free(part);
+            curl_free(part);
         }
     }
-    curl_.urlCleanup(url);
+    curl_url_cleanup(url);
     return space;
 }
 
@@ -402,7 +313,7 @@ size_t CurlExchange::Transfer::onHeader(char* line, size_t size, size_t count, v
     const std::string_view text(line, size * count);
     if (self.hasHeader_ || text.find_first_not_of("\r\n") != std::string_view::npos) return text.size();
     long status = 0;
-    self.curl_.easyGetinfo(self.easy_.get(), CURLINFO_RESPONSE_CODE, &status);
+    curl_easy_getinfo(self.easy_.get(), CURLINFO_RESPONSE_CODE, &status);
     if (status < kFirstFinalStatus) return text.size();
     self.hasHeader_ = true;
     const bool taken =
@@ -435,10 +346,13 @@ int CurlExchange::Transfer::onProgress(void* exchange, curl_off_t, curl_off_t, c
 
 // --- What the rest of the HTTPS client sees
 
-bool CurlExchange::isLibraryAvailable() { return CurlLibrary::shared() != nullptr; }
+bool CurlExchange::isLibraryAvailable() {
+    static const bool isAvailable = load();
+    return isAvailable;
+}
 
 CurlExchange::CurlExchange(const HTTPRequest& request, HTTPSessionEvents& events)
-    : transfer_(std::make_unique<Transfer>(*CurlLibrary::shared(), request, events)) {}
+    : transfer_(std::make_unique<Transfer>(request, events)) {}
 
 CurlExchange::~CurlExchange() = default;
 

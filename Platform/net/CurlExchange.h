@@ -6,7 +6,7 @@
 #include <memory>
 #include <optional>
 
-#include "Platform/net/HTTPSession.h"
+#include "Platform/net/HTTPExchange.h"
 
 namespace platform {
 

@@ -1,12 +1,10 @@
 #include "Platform/net/HTTPSession.h"
 
-#include <strings.h>
-
-#include <algorithm>
 #include <atomic>
 #include <mutex>
 
 #include "Platform/net/CurlExchange.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/Transactions.h"
 
 namespace platform {
@@ -125,52 +123,23 @@ class CurlSession : public HTTPSession,
     CurlExchange* exchange_ = nullptr;
 };
 
-struct ReplacedFactory {
-    std::mutex mutex;
-    HTTPSession::Factory factory;
+class CurlSessionFactory : public HTTPSessionFactory {
+  public:
+    std::shared_ptr<HTTPSession> create(std::shared_ptr<HTTPSessionEvents> events,
+                                        std::optional<WorkQueue> eventQueue) override {
+        if (!isHTTPSClientAvailable()) return nullptr;
+        return std::make_shared<CurlSession>(std::move(events), std::move(eventQueue));
+    }
 };
-
-ReplacedFactory& replacedFactory() {
-    static auto* replaced = new ReplacedFactory;
-    return *replaced;
-}
-
-bool isSameFieldName(std::string_view a, std::string_view b) {
-    return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
-}
 
 }  // namespace
 
-void HTTPRequest::setHeaderField(std::string_view name, std::string_view value) {
-    for (auto& [fieldName, fieldValue] : headerFields) {
-        if (!isSameFieldName(fieldName, name)) continue;
-        fieldValue = value;
-        return;
-    }
-    headerFields.emplace_back(name, value);
-}
-
-const std::string* HTTPRequest::headerField(std::string_view name) const {
-    const auto field = std::find_if(headerFields.begin(), headerFields.end(),
-                                    [=](const auto& each) { return isSameFieldName(each.first, name); });
-    return field == headerFields.end() ? nullptr : &field->second;
-}
-
 std::shared_ptr<HTTPSession> HTTPSession::create(std::shared_ptr<HTTPSessionEvents> events,
                                                  std::optional<WorkQueue> eventQueue) {
-    Factory factory;
-    {
-        const std::lock_guard lock(replacedFactory().mutex);
-        factory = replacedFactory().factory;
-    }
-    if (factory) return factory(std::move(events), std::move(eventQueue));
-    if (!CurlExchange::isLibraryAvailable()) return nullptr;
-    return std::make_shared<CurlSession>(std::move(events), std::move(eventQueue));
+    return Lifetime::current().part<HTTPSessionFactory, CurlSessionFactory>().create(std::move(events),
+                                                                                     std::move(eventQueue));
 }
 
-void HTTPSession::replaceFactory(Factory factory) {
-    const std::lock_guard lock(replacedFactory().mutex);
-    replacedFactory().factory = std::move(factory);
-}
+bool isHTTPSClientAvailable() { return CurlExchange::isLibraryAvailable(); }
 
 }  // namespace platform

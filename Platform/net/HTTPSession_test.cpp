@@ -15,7 +15,6 @@
 #include <mutex>
 #include <thread>
 
-#include "Platform/net/OptionalLibrary.h"
 #include "Platform/runtime/Clock.h"
 
 namespace platform {

@@ -1,5 +1,5 @@
-// Property lists in their two public forms: binary, the stored form of preference values, and XML, the form
-// for people and other programs.
+// Property lists in their two public forms: binary, the stored form of preference values, and XML, which is
+// only read.
 //
 // Binary is the "bplist00" layout: header, object table, offset table, 32-byte trailer; big-endian
 // throughout. Equal strings share one object. Reading gives back what was written, with these exceptions: an
@@ -8,9 +8,7 @@
 // object (marker 0x0E), which few other readers know; everything else is common to all of them.
 //
 // XML is a "plist" element around one of dict (of key and value in turn), array, string, integer, real, true,
-// false, date and data. Reading gives back what was written, except for unsigned integers as above, floats,
-// which come back as doubles of the same value, NaNs, which are all alike, and dates, which are whole seconds
-// there: the writer drops fractions, towards the past.
+// false, date and data.
 //
 // In both forms a dictionary's keys are delivered as they come, equal ones included: the last one wins where
 // values are built.
@@ -20,9 +18,8 @@
 
 namespace platform {
 
-/// Limits of writing and reading: lists beyond them are refused before anything reaches the sink. Objects and
-/// payload (bytes of text and data) are counted each time that they are delivered, so that shared ones cannot
-/// multiply.
+/// Limits of writing and reading. Objects and payload (bytes of text and data) are counted each time that
+/// they are delivered, so that shared ones cannot multiply.
 inline constexpr int kMaxPropertyListDepth = 64;
 inline constexpr size_t kMaxPropertyListObjects = 4U << 20U;
 inline constexpr size_t kMaxPropertyListPayload = size_t{64} << 20U;
@@ -32,17 +29,15 @@ inline constexpr size_t kMaxPropertyListPayload = size_t{64} << 20U;
 /// thread.
 SecretBytes writeBinaryPropertyList(const ValueWriter& writer);
 
-/// The same as an XML document in UTF-8, without a document type. Empty, too, for what has no XML form: null,
-/// UUIDs, dates outside the years 1 to 9999, text with characters that XML does not have (most control
-/// characters, U+FFFE, U+FFFF). Any thread.
-SecretBytes writeXMLPropertyList(const ValueWriter& writer);
+// Reading delivers events while it checks: after a false answer what has reached the sink means nothing, and
+// some of its containers may still be open.
 
-/// Reads a binary property list into the sink. False, with nothing written, when it is damaged: out-of-range
+/// Reads a binary property list into the sink. False when it is damaged: out-of-range
 /// offsets, cycles, a depth, object count or payload over the limits, text that is not valid, dictionary keys
 /// that are not strings, objects that have no event (sets, references). Any thread.
 bool readBinaryPropertyList(Bytes bytes, ValueSink& sink);
 
-/// Reads an XML property list into the sink. False, with nothing written, when the document is not
+/// Reads an XML property list into the sink. False when the document is not
 /// well-formed, has other elements, or elements or text where none belong, has a dictionary in which keys and
 /// values do not take turns, a number, date or base64 text that is none, goes over a limit, or declares
 /// anything in a document type of its own (one that only names another document is passed over and never

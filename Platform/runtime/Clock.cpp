@@ -6,14 +6,16 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cerrno>
 #include <cmath>
 #include <ctime>
 #include <map>
 #include <mutex>
 #include <thread>
+#include <utility>
 #include <vector>
+
+#include "Platform/runtime/Lifetime.h"
 
 namespace platform {
 namespace {
@@ -39,18 +41,23 @@ timespec timespecOf(double seconds) {
 /// clock. All members are guarded by the mutex.
 class RealClock : public Clock {
   public:
+    RealClock() = default;
+    ~RealClock() override {
+        for (const int descriptor : {timerDescriptor_, jumpDescriptor_, wakeDescriptor_})
+            if (descriptor >= 0) close(descriptor);
+    }
+    RealClock(const RealClock&) = delete;
+    RealClock& operator=(const RealClock&) = delete;
+
     double now() const override { return secondsOf(CLOCK_REALTIME); }
 
-    TimerID callAfter(double seconds, bool endsEarlyOnJump, std::function<void()> fire) override {
-        const std::lock_guard lock(mutex_);
-        startThreadOnce();
-        const double deadline = secondsOf(CLOCK_BOOTTIME) + std::clamp(seconds, 0.0, kFarthestDeadline);
-        const TimerID id = ++lastID_;
-        const auto position =
-            timers_.emplace(std::pair(deadline, id), Timer{endsEarlyOnJump, std::move(fire)}).first;
-        deadlines_[id] = deadline;
-        if (position == timers_.begin()) wake();
-        return id;
+    void lifetimeEnds() override {
+        std::unique_lock lock(mutex_);
+        isStopping_ = true;
+        if (wakeDescriptor_ >= 0) wake();
+        lock.unlock();
+        if (thread_.joinable()) thread_.join();
+        endTimers();
     }
 
     bool cancel(TimerID id) override {
@@ -64,16 +71,36 @@ class RealClock : public Clock {
 
   private:
     struct Timer {
-        bool endsEarlyOnJump;
+        Use use;
         std::function<void()> fire;
     };
 
+    TimerID addTimer(double seconds, Use use, std::function<void()> fire) override {
+        const std::lock_guard lock(mutex_);
+        startThreadOnce();
+        const double deadline = secondsOf(CLOCK_BOOTTIME) + std::clamp(seconds, 0.0, kFarthestDeadline);
+        const TimerID id = ++lastID_;
+        const auto position = timers_.emplace(std::pair(deadline, id), Timer{use, std::move(fire)}).first;
+        deadlines_[id] = deadline;
+        if (position == timers_.begin()) wake();
+        return id;
+    }
+
+    void endTimers() override {
+        std::unique_lock lock(mutex_);
+        const auto ended = std::exchange(timers_, {});
+        deadlines_.clear();
+        lock.unlock();
+        for (const auto& [key, timer] : ended)
+            if (timer.use != Use::Task) timer.fire();
+    }
+
     void startThreadOnce() {
-        if (timerDescriptor_ >= 0) return;
+        if (timerDescriptor_ >= 0 || isStopping_) return;
         timerDescriptor_ = timerfd_create(CLOCK_BOOTTIME, TFD_CLOEXEC | TFD_NONBLOCK);
         jumpDescriptor_ = timerfd_create(CLOCK_REALTIME, TFD_CLOEXEC | TFD_NONBLOCK);
         wakeDescriptor_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-        std::thread([this] { serve(); }).detach();
+        thread_ = std::thread([this] { serve(); });
     }
 
     void wake() const {
@@ -88,11 +115,13 @@ class RealClock : public Clock {
         timerfd_settime(jumpDescriptor_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &far, nullptr);
     }
 
-    void armForNextDeadline() {
+    /// False when the thread is to end.
+    bool armForNextDeadline() {
         const std::lock_guard lock(mutex_);
         itimerspec next{};
         if (!timers_.empty()) next.it_value = timespecOf(std::max(timers_.begin()->first.first, 1e-6));
         timerfd_settime(timerDescriptor_, TFD_TIMER_ABSTIME, &next, nullptr);
+        return !isStopping_;
     }
 
     bool takeJump() const {
@@ -105,7 +134,7 @@ class RealClock : public Clock {
         const double reached = secondsOf(CLOCK_BOOTTIME);
         std::vector<std::function<void()>> due;
         for (auto timer = timers_.begin(); timer != timers_.end();) {
-            if (timer->first.first <= reached || (jumped && timer->second.endsEarlyOnJump)) {
+            if (timer->first.first <= reached || (jumped && timer->second.use == Use::WaitForDate)) {
                 due.push_back(std::move(timer->second.fire));
                 deadlines_.erase(timer->first.second);
                 timer = timers_.erase(timer);
@@ -116,10 +145,9 @@ class RealClock : public Clock {
         return due;
     }
 
-    [[noreturn]] void serve() {
+    void serve() {
         watchForJump();
-        for (;;) {
-            armForNextDeadline();
+        while (armForNextDeadline()) {
             pollfd descriptors[] = {
                 {timerDescriptor_, POLLIN, 0}, {jumpDescriptor_, POLLIN, 0}, {wakeDescriptor_, POLLIN, 0}};
             poll(descriptors, std::size(descriptors), -1);
@@ -139,18 +167,20 @@ class RealClock : public Clock {
     int timerDescriptor_ = -1;
     int jumpDescriptor_ = -1;
     int wakeDescriptor_ = -1;
+    bool isStopping_ = false;
+    /// Started once, and joined by the thread that ends the lifetime.
+    std::thread thread_;
 };
-
-std::atomic<Clock*> replacement{nullptr};
 
 }  // namespace
 
-Clock& Clock::shared() {
-    if (Clock* clock = replacement.load(std::memory_order_acquire)) return *clock;
-    static auto* real = new RealClock;
-    return *real;
-}
+Clock& Clock::shared() { return Lifetime::current().part<Clock, RealClock>(); }
 
-void Clock::replaceShared(Clock* clock) { replacement.store(clock, std::memory_order_release); }
+Clock::TimerID Clock::callAfter(double seconds, Use use, std::function<void()> fire) {
+    const TimerID timer = addTimer(seconds, use, std::move(fire));
+    // One that the end did not find any more.
+    if (Lifetime::current().isEnding()) endTimers();
+    return timer;
+}
 
 }  // namespace platform

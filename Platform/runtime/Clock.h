@@ -1,5 +1,5 @@
-// Time. Nobody else reads the system clock, waits with a deadline or sleeps, so that a test can put a
-// simulated clock in its place and run years in seconds.
+// Time. Nothing else reads the system clock, waits with a deadline or sleeps, so that a test can give a
+// simulated clock to the lifetime and run years in seconds.
 #pragma once
 
 #include <cstdint>
@@ -18,19 +18,19 @@ class Clock {
 
     virtual ~Clock() = default;
 
-    /// The process's clock: the real one unless a test replaced it.
+    /// The lifetime's clock.
     static Clock& shared();
 
-    /// Tests only, before any queue or timer is in use; the caller keeps the clock alive. Null: the real one.
-    static void replaceShared(Clock* clock);
+    /// What a timer is for: work that is dropped when the lifetime ends, or a wait that is over then; one for
+    /// a date is over as well when the real-time clock is set, so that the date is looked at again.
+    enum class Use { Task, Wait, WaitForDate };
 
     /// Absolute time: seconds since 1970-01-01 00:00:00 UTC.
     virtual double now() const = 0;
 
-    /// Calls `fire` once after `seconds` (time in suspend counts), on the clock's own thread: it must be
-    /// short (queue a task, raise a signal). With `endsEarlyOnJump` it is called at once when the real-time
-    /// clock is set, so that whoever waits for a date looks again.
-    virtual TimerID callAfter(double seconds, bool endsEarlyOnJump, std::function<void()> fire) = 0;
+    /// Calls `fire` once after `seconds` (time in suspend counts), on the clock's own thread or, when the
+    /// lifetime ends, on another: it must be short (queue a task, raise a signal).
+    TimerID callAfter(double seconds, Use use, std::function<void()> fire);
 
     /// False when the timer has fired, is firing or is unknown.
     virtual bool cancel(TimerID timer) = 0;
@@ -39,6 +39,13 @@ class Clock {
     /// that waits does not count meanwhile, nor does what is queued behind it.
     virtual void workBegan() {}
     virtual void workEnded() {}
+
+    /// Fires the timers of waits and drops the others.
+    virtual void lifetimeEnds() { endTimers(); }
+
+  protected:
+    virtual TimerID addTimer(double seconds, Use use, std::function<void()> fire) = 0;
+    virtual void endTimers() = 0;
 };
 
 /// The absolute time of the process's clock.

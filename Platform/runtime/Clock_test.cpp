@@ -26,7 +26,7 @@ class ClockTest : public testing::Test {
     /// A timer that records its name and time when it fires.
     Clock::TimerID start(double seconds, char name) {
         const double due = steadyTime() + seconds;
-        return clock_.callAfter(seconds, false, [this, due, name] {
+        return clock_.callAfter(seconds, Clock::Use::Task, [this, due, name] {
             const std::lock_guard lock(mutex_);
             fired_ += name;
             earliest_ = std::min(earliest_, steadyTime() - due);
@@ -93,7 +93,8 @@ TEST_F(ClockTest, EveryTimerEitherFiresOrIsCancelled) {
             std::vector<Clock::TimerID> timers;
             for (size_t i = 0; i < kTimers; ++i) {
                 const size_t index = thread * kTimers + i;
-                timers.push_back(clock_.callAfter(static_cast<double>(i % 10) * 0.001, i % 2 == 0,
+                timers.push_back(clock_.callAfter(static_cast<double>(i % 10) * 0.001,
+                                                  i % 2 == 0 ? Clock::Use::WaitForDate : Clock::Use::Task,
                                                   [&end, index] { end(index); }));
                 if (i % 3 == 0 && clock_.cancel(timers[i / 2])) end(thread * kTimers + i / 2);
             }

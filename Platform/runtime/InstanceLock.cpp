@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <string>
 
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/StateDirectory.h"
 
 namespace platform::instance_lock {
@@ -26,13 +27,25 @@ void lock(int descriptor, int how) {
     }
 }
 
+/// Shared: agents of several services may leave at the same time.
+class HeldLock {
+  public:
+    HeldLock() {
+        if (descriptor_ >= 0) lock(descriptor_, LOCK_SH);
+    }
+    ~HeldLock() {
+        if (descriptor_ >= 0) close(descriptor_);
+    }
+    HeldLock(const HeldLock&) = delete;
+    HeldLock& operator=(const HeldLock&) = delete;
+
+  private:
+    const int descriptor_ = openLock(O_CREAT);
+};
+
 }  // namespace
 
-void holdUpNext() {
-    // Shared: agents of several services may leave at the same time. Kept open until the process ends.
-    static const int descriptor = openLock(O_CREAT);
-    if (descriptor >= 0) lock(descriptor, LOCK_SH);
-}
+void holdUpNext() { Lifetime::current().state<HeldLock>(); }
 
 void waitForPrevious() {
     const int descriptor = openLock(0);

@@ -5,7 +5,7 @@
 
 namespace platform::instance_lock {
 
-/// Makes every agent of this user that starts from now on wait for the end of this process.
+/// Makes every agent of this user that starts from now on wait for the end of this lifetime.
 void holdUpNext();
 
 /// Returns when no agent that is leaving is left; at once where there is no place for state.

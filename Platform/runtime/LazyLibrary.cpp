@@ -2,6 +2,7 @@
 
 #include <dlfcn.h>
 
+#include <algorithm>
 #include <cstdlib>
 #include <string>
 
@@ -10,9 +11,13 @@
 namespace platform {
 namespace {
 
-[[noreturn]] void abortOnMissing(const char* what) {
+std::string missing(const char* what) {
     const char* reason = dlerror();  // NOLINT(concurrency-mt-unsafe): thread-local in glibc
-    VELTOID_PLATFORM_LOG(Critical, std::string("cannot load ") + what + ": " + (reason ? reason : "?"));
+    return std::string("cannot load ") + what + ": " + (reason != nullptr ? reason : "?");
+}
+
+[[noreturn]] void abortOnMissing(const char* what) {
+    VELTOID_PLATFORM_LOG(Critical, missing(what));
     std::abort();
 }
 
@@ -26,6 +31,18 @@ void* LazyLibrary::addressOf(const char* function) const {
     void* address = dlsym(library, function);
     if (address == nullptr) abortOnMissing(function);
     return address;
+}
+
+bool LazyLibrary::provides(std::initializer_list<const char*> functions) const {
+    void* library = dlopen(soname_, RTLD_NOW | RTLD_LOCAL);
+    const auto* lacking = library == nullptr
+                              ? functions.begin()
+                              : std::find_if(functions.begin(), functions.end(), [library](const char* name) {
+                                    return dlsym(library, name) == nullptr;
+                                });
+    if (library != nullptr && lacking == functions.end()) return true;
+    VELTOID_PLATFORM_LOG(Error, missing(library == nullptr ? soname_ : *lacking));
+    return false;
 }
 
 }  // namespace platform

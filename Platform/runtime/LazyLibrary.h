@@ -11,6 +11,7 @@
 #pragma once
 
 #include <atomic>
+#include <initializer_list>
 
 namespace platform {
 
@@ -24,6 +25,10 @@ class LazyLibrary {
     /// The address of a function; ends the process with a log line when the library or the function is
     /// missing, like the dynamic linker with a library that is linked. Any thread.
     void* addressOf(const char* function) const;
+
+    /// Whether the library and all of these functions are there: for a program that can do without it. Loads
+    /// the library; what is missing is logged. Any thread.
+    bool provides(std::initializer_list<const char*> functions) const;
 
   private:
     const char* soname_;

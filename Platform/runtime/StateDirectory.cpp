@@ -13,6 +13,8 @@
 #include <cstdlib>
 #include <vector>
 
+#include "Platform/runtime/Lifetime.h"
+
 namespace platform {
 
 namespace {
@@ -85,7 +87,7 @@ std::string stateDirectory() {
         errno = ENOENT;
         return {};
     }
-    const std::string ours = base + "/harbwell";
+    const std::string ours = base + '/' + Lifetime::current().product().folder;
     std::string directory = ours + '/' + machineName();
     return createDirectories(directory) && makePrivate(ours) && makePrivate(directory) ? directory
                                                                                        : std::string();

@@ -1,5 +1,5 @@
-// The directory in which this user's state on this machine is kept: $XDG_STATE_HOME/harbwell/<machine-id>, by
-// default below ~/.local/state.
+// The directory in which this user's state on this machine is kept: $XDG_STATE_HOME/FOLDER/<machine-id>, by
+// default below ~/.local/state; the product names the folder.
 #pragma once
 
 #include <string>

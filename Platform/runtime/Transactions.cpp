@@ -6,12 +6,13 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 
 namespace platform::transactions {
 namespace {
 
-/// Guarded by its mutex; never destroyed.
+/// Guarded by its mutex.
 struct State {
     std::mutex mutex;
     long open = 0;
@@ -21,19 +22,16 @@ struct State {
     double idleSeconds = 0;
     double idleSince = 0;
     bool timerArmed = false;
-
-    static State& shared() {
-        static auto* state = new State;
-        return *state;
-    }
 };
+
+State& shared() { return Lifetime::current().state<State>(); }
 
 /// The timer is not moved when the process becomes busy and idle again, which it does with every request: it
 /// fires when it may be time and is armed anew for what is left. Called with the lock held.
 void armTimer(State& state, double seconds);
 
 void timerFired() {
-    State& state = State::shared();
+    State& state = shared();
     std::unique_lock lock(state.mutex);
     state.timerArmed = false;
     if (state.open > 0 || !state.whenIdle) return;
@@ -52,7 +50,7 @@ void timerFired() {
 
 void armTimer(State& state, double seconds) {
     state.timerArmed = true;
-    Clock::shared().callAfter(seconds, false, timerFired);
+    Clock::shared().callAfter(seconds, Clock::Use::Task, timerFired);
 }
 
 void becameIdle(State& state) {
@@ -68,13 +66,13 @@ void queueOnMain(std::vector<std::function<void()>> functions) {
 }  // namespace
 
 void began() {
-    State& state = State::shared();
+    State& state = shared();
     const std::lock_guard lock(state.mutex);
     ++state.open;
 }
 
 void ended() {
-    State& state = State::shared();
+    State& state = shared();
     std::unique_lock lock(state.mutex);
     if (--state.open > 0) return;
     becameIdle(state);
@@ -85,13 +83,13 @@ void ended() {
 }
 
 long openCount() {
-    State& state = State::shared();
+    State& state = shared();
     const std::lock_guard lock(state.mutex);
     return state.open;
 }
 
 void whenNoneIsOpen(std::function<void()> function) {
-    State& state = State::shared();
+    State& state = shared();
     std::unique_lock lock(state.mutex);
     if (state.open > 0) {
         state.waiting.push_back(std::move(function));
@@ -102,7 +100,7 @@ void whenNoneIsOpen(std::function<void()> function) {
 }
 
 void whenNoneWasOpenFor(double seconds, std::function<void()> function) {
-    State& state = State::shared();
+    State& state = shared();
     const std::lock_guard lock(state.mutex);
     state.idleSeconds = seconds;
     state.whenIdle = std::move(function);

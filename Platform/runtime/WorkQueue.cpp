@@ -5,11 +5,13 @@
 #include <cstdio>
 #include <cstdlib>
 #include <deque>
+#include <list>
 #include <mutex>
 #include <thread>
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 
 namespace platform {
 namespace {
@@ -88,11 +90,17 @@ void drain(const StatePointer& state);
 /// for long.
 class ThreadPool {
   public:
-    /// Never destroyed: threads may outlive main.
-    static ThreadPool& shared() {
-        static auto* pool = new ThreadPool;
-        return *pool;
+    ThreadPool() = default;
+    ~ThreadPool() {
+        std::unique_lock lock(mutex_);
+        isStopping_ = true;
+        becameReady_.notify_all();
+        lock.unlock();
+        for (std::thread& thread : threads_) thread.join();
+        if (retired_.joinable()) retired_.join();
     }
+    ThreadPool(const ThreadPool&) = delete;
+    ThreadPool& operator=(const ThreadPool&) = delete;
 
     void run(StatePointer queue) {
         const std::lock_guard lock(mutex_);
@@ -100,14 +108,32 @@ class ThreadPool {
         if (idle_ >= ready_.size()) {
             becameReady_.notify_one();
         } else {
-            std::thread([this] { work(); }).detach();
+            const auto thread = threads_.emplace(threads_.end());
+            *thread = std::thread([this, thread] { work(thread); });
         }
     }
 
-  private:
-    void work() {
+    /// Ends the next waitUntilQuiet.
+    void interrupt() {
+        const std::lock_guard lock(mutex_);
+        isInterrupted_ = true;
+        becameQuiet_.notify_all();
+    }
+
+    /// Waits until no queue is ready or runs, or for an interruption; true in the first case.
+    bool waitUntilQuiet() {
         std::unique_lock lock(mutex_);
-        for (;;) {
+        const auto isQuiet = [this] { return ready_.empty() && idle_ == threads_.size(); };
+        becameQuiet_.wait(lock, [&] { return isInterrupted_ || isQuiet(); });
+        return !std::exchange(isInterrupted_, false);
+    }
+
+  private:
+    using Threads = std::list<std::thread>;
+
+    void work(Threads::iterator self) {
+        std::unique_lock lock(mutex_);
+        do {
             while (!ready_.empty()) {
                 const StatePointer queue = std::move(ready_.front());
                 ready_.pop_front();
@@ -115,24 +141,57 @@ class ThreadPool {
                 drain(queue);
                 lock.lock();
             }
-            ++idle_;
-            const bool woken =
-                becameReady_.wait_for(lock, kIdleThreadLifetime, [this] { return !ready_.empty(); });
+            if (++idle_ == threads_.size()) becameQuiet_.notify_all();
+            becameReady_.wait_for(lock, kIdleThreadLifetime,
+                                  [this] { return isStopping_ || !ready_.empty(); });
             --idle_;
-            if (!woken) return;
-        }
+        } while (!ready_.empty());
+        if (!isStopping_) retire(self, lock);
+    }
+
+    /// Each thread that leaves early is joined by the next one that does, the last one at the end.
+    void retire(Threads::iterator self, std::unique_lock<std::mutex>& lock) {
+        std::thread previous = std::exchange(retired_, std::move(*self));
+        threads_.erase(self);
+        lock.unlock();
+        if (previous.joinable()) previous.join();
     }
 
     std::mutex mutex_;
     std::condition_variable becameReady_;
+    std::condition_variable becameQuiet_;
     std::deque<StatePointer> ready_;
+    Threads threads_;
+    std::thread retired_;
     size_t idle_ = 0;
+    bool isInterrupted_ = false;
+    bool isStopping_ = false;
 };
+
+/// Runs a lifetime's queues.
+class QueueRunner {
+  public:
+    QueueRunner() = default;
+    ~QueueRunner() { std::erase(tCurrentQueues, main_.get()); }
+    QueueRunner(const QueueRunner&) = delete;
+    QueueRunner& operator=(const QueueRunner&) = delete;
+
+    ThreadPool& pool() { return pool_; }
+    const StatePointer& mainQueue() const { return main_; }
+
+    void runDry();
+
+  private:
+    const StatePointer main_ = std::make_shared<WorkQueue::State>("main");
+    ThreadPool pool_;
+};
+
+QueueRunner& runner() { return Lifetime::current().state<QueueRunner>(); }
 
 /// Has a ready queue run; it counts as work until it has nothing to run or waits.
 void runOnPool(const StatePointer& state) {
     Clock::shared().workBegan();
-    ThreadPool::shared().run(state);
+    runner().pool().run(state);
 }
 
 /// Gives the queue to whoever comes next. Called by the thread that has it.
@@ -183,9 +242,14 @@ void drain(const StatePointer& state) {
     Clock::shared().workEnded();
 }
 
-const StatePointer& mainState() {
-    static const auto* state = new StatePointer(std::make_shared<WorkQueue::State>("main"));
-    return *state;
+void QueueRunner::runDry() {
+    {
+        const std::lock_guard lock(main_->mutex);
+        if (main_->wakeLoop) main_->wakeLoop = [this] { pool_.interrupt(); };
+    }
+    do {
+        if (main_->wakeLoop) main_queue::runPending();
+    } while (!pool_.waitUntilQuiet());
 }
 
 [[noreturn]] void abortOnSyncOntoItself(const WorkQueue::State& target) {
@@ -199,7 +263,7 @@ const StatePointer& mainState() {
 
 WorkQueue::WorkQueue(std::string label) : state_(std::make_shared<State>(std::move(label))) {}
 
-WorkQueue WorkQueue::main() { return WorkQueue(mainState()); }
+WorkQueue WorkQueue::main() { return WorkQueue(runner().mainQueue()); }
 
 void WorkQueue::async(Task task) const {
     std::unique_lock lock(state_->mutex);
@@ -219,7 +283,8 @@ void WorkQueue::asyncAfter(double seconds, Task task) const {
         async(std::move(task));
         return;
     }
-    Clock::shared().callAfter(seconds, false, [queue = *this, task = std::move(task)] { queue.async(task); });
+    Clock::shared().callAfter(seconds, Clock::Use::Task,
+                              [queue = *this, task = std::move(task)] { queue.async(task); });
 }
 
 void WorkQueue::runSync(const std::function<void()>& function) const {
@@ -272,7 +337,7 @@ const std::string* WorkQueue::currentLabel() {
 namespace main_queue {
 
 void adopt(std::function<void()> wake) {
-    const StatePointer& state = mainState();
+    const StatePointer& state = runner().mainQueue();
     tCurrentQueues.push_back(state.get());
     const std::lock_guard lock(state->mutex);
     state->wakeLoop = std::move(wake);
@@ -280,7 +345,7 @@ void adopt(std::function<void()> wake) {
 }
 
 void runPending() {
-    const StatePointer& state = mainState();
+    const StatePointer& state = runner().mainQueue();
     std::unique_lock lock(state->mutex);
     for (size_t left = state->items.size(); left > 0; --left) {
         WorkQueue::Task task = std::move(state->items.front().task);
@@ -335,7 +400,7 @@ bool Semaphore::wait(double seconds) const {
     }
     std::optional<Clock::TimerID> timer;
     if (seconds < kForever) {
-        timer = Clock::shared().callAfter(seconds, true, [state = state_, waiter] {
+        timer = Clock::shared().callAfter(seconds, Clock::Use::WaitForDate, [state = state_, waiter] {
             std::unique_lock lock(state->mutex);
             const auto position = std::find(state->waiters.begin(), state->waiters.end(), waiter);
             if (position == state->waiters.end()) return;

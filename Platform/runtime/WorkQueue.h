@@ -4,6 +4,8 @@
 // A queue runs its tasks one at a time in the order in which they came. It costs no thread while it is empty.
 // `sync` on an idle queue runs on the caller's thread: waking another thread costs more than most operations
 // take.
+//
+// The end of a lifetime runs what is queued, until no queue has anything left (Lifetime.h).
 #pragma once
 
 #include <functional>
@@ -30,7 +32,7 @@ class WorkQueue {
 
     void async(Task task) const;
 
-    /// Queues the task after `seconds`; at once when not positive.
+    /// Queues the task after `seconds`; at once when not positive. Dropped if the lifetime ends before.
     void asyncAfter(double seconds, Task task) const;
 
     /// Runs `function` on this queue, after everything queued before it, and returns its result. Waiting for
@@ -82,7 +84,8 @@ class Semaphore {
     void wait() const { (void)wait(kForever); }
 
     /// Takes one signal, waiting for it at most `seconds`; false when there was none. A jump of the real-time
-    /// clock ends the wait early (false), so that the caller looks at the date again.
+    /// clock ends the wait early (false), so that the caller looks at the date again, and so does the end of
+    /// the lifetime.
     bool wait(double seconds) const;
 
   private:
@@ -94,7 +97,7 @@ class Semaphore {
 namespace main_queue {
 
 /// From now on the main queue's tasks wait until runPending; `wake` is called, from any thread, when there is
-/// one. Called on the thread that will run them, which is on the main queue from now on.
+/// one. Called on the thread that will run them and end the lifetime, which is on the main queue until then.
 void adopt(std::function<void()> wake);
 
 /// Runs what is queued when it is called. On the adopting thread only.

@@ -4,6 +4,7 @@
 
 #include "Platform/propertylist/PropertyList.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Platform/storage/SQLiteFile.h"
 
@@ -25,11 +26,11 @@ constexpr SQLiteFile::Format kFormat = {
     ") WITHOUT ROWID",
 };
 
-/// Never destroyed, so that exit from any thread is safe.
-SQLiteFile& file() {
-    static auto& shared = *new SQLiteFile(kFormat);
-    return shared;
-}
+struct PreferencesFile : SQLiteFile {
+    PreferencesFile() : SQLiteFile(kFormat) {}
+};
+
+SQLiteFile& file() { return Lifetime::current().state<PreferencesFile>(); }
 
 /// Runs one operation of the interface, out of which nothing is thrown.
 template <typename Operation>

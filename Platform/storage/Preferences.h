@@ -1,5 +1,5 @@
 // Preference domains: named sets of keys with one value each, for this user on this machine, kept in one
-// SQLite file ($XDG_STATE_HOME/harbwell/<machine-id>/preferences.db; default ~/.local/state). Opened on first
+// SQLite file (preferences.db of the state directory). Opened on first
 // use.
 //
 // A file that cannot be read as a database is moved aside (never deleted) and logged; one written by a newer
@@ -32,7 +32,7 @@ class Preferences {
         Failed,
     };
 
-    /// Writes the value under `key` into the sink when it is found, otherwise nothing.
+    /// Writes the value under `key` into the sink. What has reached the sink counts only when it was found.
     ReadResult read(std::string_view key, ValueSink& sink) const;
 
     /// Empty, too, when the store cannot be read now.

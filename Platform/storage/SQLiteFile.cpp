@@ -9,10 +9,10 @@
 #include <array>
 #include <cerrno>
 #include <cstring>
-#include <ctime>
 #include <exception>
 #include <memory>
 
+#include "Platform/encoding/CalendarText.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/LazyLibrary.h"
 #include "Platform/runtime/StateDirectory.h"
@@ -92,12 +92,8 @@ bool exists(const std::string& path) {
 
 /// `path`.corrupt-YYYYMMDD-HHMMSS, with a counter when that is taken.
 std::string nameAside(const std::string& path) {
-    const auto now = static_cast<std::time_t>(Clock::shared().now());
-    std::tm date{};
-    gmtime_r(&now, &date);
-    char stamp[32];
-    (void)std::strftime(stamp, sizeof stamp, "%Y%m%d-%H%M%S", &date);
-    const std::string base = path + ".corrupt-" + stamp;
+    const std::string base =
+        path + ".corrupt-" + calendarText(Clock::shared().now(), "%Y%m%d-%H%M%S").value_or("-");
     std::string name = base;
     const auto taken = [&] {
         for (const char* suffix : kFileSuffixes) {

@@ -14,10 +14,10 @@ from dataclasses import dataclass, field
 
 from world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB,  # noqa: E402
                    INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD, PASSWORD_SERVICE, PING, SERVICE, SET_BREADCRUMB,
-                   SET_VALUE, SET_VALUE_QUIETLY, STATUS, VERIFY, Client, hashed, plain, variant)
+                   SET_VALUE, SET_VALUE_QUIETLY, STATUS, UPDATE_LINKED_IDENTITY, VERIFY, Client, hashed, plain, variant)
 from jeepney import HeaderFields, MessageType, new_method_call  # noqa: E402
 
-UNKNOWN_COMMAND, LINKED_IDENTITY = 0x121, 400
+UNKNOWN_COMMAND = 0x121
 PASSWORDS = {ACCOUNT: PASSWORD, OTHER_ACCOUNT: OTHER_PASSWORD, "kim@example.com": "a third one"}
 WAITING_ACCOUNT = "waiting@example.com"
 PASSWORD_CLIENTS = 6
@@ -290,7 +290,7 @@ class PasswordMixer(Mixer):
     """The same at the password-check service."""
 
     def linked_identity(self):
-        self.ask("linked identity", is_error, LINKED_IDENTITY, identityReferenceData=b"reference")
+        self.ask("linked identity", is_error, UPDATE_LINKED_IDENTITY, identityReferenceData=b"reference")
 
     def foreign(self):
         self.ask("unknown", is_refusal, self.rng.choice((ADD, LIST, SET_VALUE)))

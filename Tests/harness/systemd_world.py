@@ -20,11 +20,11 @@ import time
 from jeepney import DBusAddress, DBusErrorResponse, MatchRule, Properties, message_bus, new_method_call
 from jeepney.io.blocking import Proxy, open_dbus_connection
 
+from protocol import TIMER, UNIT  # noqa: E402, F401
 from world import Client, complaint_of_a_sanitizer  # noqa: E402
 
 USER = pwd.getpwnam("nobody")
 RUNTIME = pathlib.Path(f"/run/user/{USER.pw_uid}")
-UNIT, TIMER = "veltoidauthd.service", "veltoidauthd-relaunch.timer"
 SKIPPED = 77
 LONGEST_BOOT = 60
 

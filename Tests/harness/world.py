@@ -25,18 +25,13 @@ ROOT = pathlib.Path(__file__).resolve().parents[2]
 sys.path.insert(0, str(ROOT / "IdentityServer"))
 from control_client import IdentityServer  # noqa: E402
 
-SERVICE = "com.velto.harbwell.veltoid.authentication"
-PASSWORD_SERVICE = "com.velto.harbwell.veltoid.checkpassword"
-OBJECT = "/com/velto/harbwell/veltoid"
-INTERFACE = "com.velto.harbwell.veltoid.MessageService"
+from protocol import *  # noqa: E402, F403
+from protocol import INTERFACE, OBJECT, PASSWORD_SERVICE, SERVICE, STATUS  # noqa: E402
+
 ACCOUNT = "jane.roe@example.com"
 PASSWORD = "correct horse"
 OTHER_ACCOUNT = "john.doe@example.com"
 OTHER_PASSWORD = "battery staple"
-
-PING, SET_VALUE, SET_VALUE_QUIETLY = 0x1, 0xFE, 0xFF
-ADD, INFO, LIST, FORGET, VERIFY, DATABASE, STATUS, TERMINATE = 0x120, 0x130, 0x150, 0x160, 0x180, 0x500, 0x510, 0x9999
-FIND, FIND_CACHED, CERTIFICATE, SET_BREADCRUMB, GET_BREADCRUMB, CHECK = 0x140, 0x141, 0x170, 0x200, 0x201, 0x501
 
 BUS_CONFIGURATION = """<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN"
  "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">

@@ -5,6 +5,7 @@
 #include <cstdio>
 #include <ctime>
 
+#include "Platform/encoding/CalendarText.h"
 #include "Platform/encoding/HexText.h"
 
 namespace veltoid {
@@ -74,14 +75,7 @@ MessageValue dictionaryToMessage(const Dictionary& dictionary) {
 }
 
 std::string describeDate(double seconds) {
-    std::tm calendar{};
-    const auto whole = static_cast<time_t>(std::clamp(seconds, 0.0, 6e16));
-    if (!(seconds > 0) || gmtime_r(&whole, &calendar) == nullptr) return {};
-    char text[64];
-    const int length = std::snprintf(text, sizeof text, "%.4d/%.2d/%.2d %.2d:%.2d:%.2d ",
-                                     calendar.tm_year + 1900, calendar.tm_mon + 1, calendar.tm_mday,
-                                     calendar.tm_hour, calendar.tm_min, calendar.tm_sec);
-    return {text, static_cast<size_t>(length)};
+    return seconds > 0 ? platform::calendarText(seconds, "%Y/%m/%d %H:%M:%S ").value_or("") : std::string();
 }
 
 std::string describeDictionary(const MessageDictionary& dictionary) {

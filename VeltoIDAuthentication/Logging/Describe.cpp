@@ -8,6 +8,7 @@
 #include <sstream>
 #include <vector>
 
+#include "Platform/encoding/HexText.h"
 #include "Platform/runtime/Clock.h"
 #include "Values/Error.h"
 #include "Values/SecurityObject.h"
@@ -54,13 +55,6 @@ constexpr const char* kTrustResultNames[] = {
 constexpr double kRelativeWordingLimit = 300;
 
 void append(std::string& text, const Value& value);
-
-void appendHexadecimal(std::string& text, std::span<const uint8_t> bytes, const char* digits) {
-    for (const uint8_t byte : bytes) {
-        text += digits[byte >> 4U];
-        text += digits[byte & 15U];
-    }
-}
 
 void appendQuoted(std::string& text, std::string_view bytes) {
     text += '"';
@@ -110,7 +104,7 @@ void appendData(std::string& text, std::span<const uint8_t> bytes) {
     if (printable) {
         appendQuoted(text, {reinterpret_cast<const char*>(bytes.data()), bytes.size()});
     } else {
-        appendHexadecimal(text, bytes, "0123456789abcdef");
+        text += platform::hexText(bytes);
     }
 }
 
@@ -165,7 +159,7 @@ void appendRawNumber(std::string& text, uint64_t number) {
     if (firstUsed == bytes.end()) {
         text += '0';
     } else {
-        appendHexadecimal(text, {firstUsed, bytes.end()}, "0123456789ABCDEF");
+        text += platform::hexText({firstUsed, bytes.end()}, platform::kUpperCaseDigits);
     }
 }
 

@@ -24,6 +24,8 @@ inline constexpr std::string_view kRemoveCertificate = "RemoveCertificateFromKey
 inline constexpr std::string_view kRemovePrivateKey = "RemovePrivateKeyFromKeychain";
 inline constexpr std::string_view kDoNotUseCachedSession = "DoNotUseCachedSession";
 inline constexpr std::string_view kDoNotSaveSessionInfo = "DoNotSaveSessionInfo";
+/// Certificate information also tells of the intermediate certificate and of the next renewal.
+inline constexpr std::string_view kCertificateDetails = "CertificateDetails";
 inline constexpr std::string_view kTerminateServer = "VeltoIDAuthenticationStatusTerminateServer";
 
 /// Seconds: how long an add waits for the certificate.

@@ -1,8 +1,9 @@
 #include "Values/DateText.h"
 
-#include <chrono>
 #include <cstdio>
 #include <string>
+
+#include "Platform/encoding/CalendarText.h"
 
 namespace veltoid {
 namespace {
@@ -29,21 +30,6 @@ bool readFields(const char* text, Fields& f) {
     return false;
 }
 
-/// Seconds since 1970 of the fields as a time at UTC; none when they are no date or time.
-std::optional<double> wallClockOf(const Fields& f) {
-    // A leap second is read as the second after it.
-    if (f.year < 1 || f.year > 9'999 || f.month < 1 || f.month > 12 || f.day < 1 || f.day > 31 ||
-        f.hour < 0 || f.hour > 23 || f.minute < 0 || f.minute > 59 || f.second < 0 || f.second > 60)
-        return std::nullopt;
-    const std::chrono::year_month_day date{std::chrono::year(static_cast<int>(f.year)),
-                                           std::chrono::month(static_cast<unsigned>(f.month)),
-                                           std::chrono::day(static_cast<unsigned>(f.day))};
-    if (!date.ok()) return std::nullopt;
-    const std::chrono::sys_seconds midnight = std::chrono::sys_days(date);
-    return static_cast<double>(midnight.time_since_epoch().count() + f.hour * 3'600 + f.minute * 60 +
-                               f.second);
-}
-
 }  // namespace
 
 std::optional<double> dateFromValue(const Value& value) {
@@ -54,7 +40,7 @@ std::optional<double> dateFromValue(const Value& value) {
     Fields f;
     if (!readFields(std::string(*text).c_str(), f) || f.offset < -kMaxOffset || f.offset > kMaxOffset)
         return std::nullopt;
-    const std::optional<double> wallClock = wallClockOf(f);
+    const auto wallClock = platform::secondsOf({f.year, f.month, f.day, f.hour, f.minute, f.second});
     if (!wallClock) return std::nullopt;
     const long hours = f.offset / 100;
     const long minutes = f.offset - 100 * hours;

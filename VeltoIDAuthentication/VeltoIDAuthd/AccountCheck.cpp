@@ -8,13 +8,14 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Platform/keychain/LockState.h"
-#include "Platform/net/OptionalLibrary.h"
+#include "Platform/net/HTTPSession.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
@@ -34,18 +35,21 @@ double relaunchInterval() {
                         UnreadableInterval::Zero);
 }
 
-/// Signals that come while the loop is busy are kept.
-const platform::Semaphore& checkSemaphore() {
-    static const auto* semaphore = new platform::Semaphore;
-    return *semaphore;
-}
+struct CheckState {
+    /// Signals that come while the loop is busy are kept.
+    const platform::Semaphore semaphore;
+    const platform::WorkQueue queue{"accountCheckDispatch"};
+    std::atomic<bool> isStarted{false};
+    std::function<void()> onPass;
 
-std::atomic<bool> isStarted{false};
+    void lifetimeEnds() { semaphore.signal(); }
+};
 
-std::function<void()>& passObserver() {
-    static auto* observer = new std::function<void()>;
-    return *observer;
-}
+CheckState& state() { return platform::Lifetime::current().state<CheckState>(); }
+
+const platform::Semaphore& checkSemaphore() { return state().semaphore; }
+
+bool isEnding() { return platform::Lifetime::current().isEnding(); }
 
 /// Accounts that a pass left as due as it found them.
 class Deferrals {
@@ -91,8 +95,8 @@ struct Plan {
 /// The loop's state belongs to its queue.
 class AccountCheckLoop {
   public:
-    [[noreturn]] void run() {
-        while (true) {
+    void run() {
+        while (!isEnding()) {
             waitForUnlock();
             pass();
         }
@@ -106,7 +110,7 @@ class AccountCheckLoop {
             wakeAccountCheck();
             lockState.onChange(nullptr);
         });
-        while (!lockState.hasBeenUnlockedSinceBoot()) {
+        while (!lockState.hasBeenUnlockedSinceBoot() && !isEnding()) {
             scheduleRelaunch(platform::now() + kDay);
             (void)wait(kDay);
         }
@@ -124,7 +128,7 @@ class AccountCheckLoop {
     /// Waits until a pass is allowed again; what signals meanwhile is looked at by that pass.
     void keepDistance() {
         const platform::Semaphore neverSignalled;
-        while (lastPass_) {
+        while (lastPass_ && !isEnding()) {
             const double missing = *lastPass_ + kMinTimeBetweenPasses - platform::now();
             // A clock that was set back is no reason to wait for longer.
             if (missing <= 0 || missing > kMinTimeBetweenPasses) break;
@@ -155,7 +159,7 @@ class AccountCheckLoop {
         const Plan next = plan();
         if (!sleepUntilTimeFor(next)) return;
         keepDistance();
-        if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return giveBack(next);
+        if (isEnding() || !platform::LockState::shared().hasBeenUnlockedSinceBoot()) return giveBack(next);
         if (next.accounts.empty()) {
             __VeltoIDCleanupAccountsAndCertificates({});
         } else {
@@ -163,7 +167,7 @@ class AccountCheckLoop {
         }
     }
 
-    /// The plan is for later: the keychain was locked while the loop slept.
+    /// The plan is for later: the keychain was locked while the loop slept, or the agent ends.
     static void giveBack(const Plan& plan) {
         if (!plan.isForChanged) return;
         for (const Value& name : plan.accounts)
@@ -184,7 +188,7 @@ class AccountCheckLoop {
     }
 
     void check(const Array& accounts) {
-        if (passObserver()) passObserver()();
+        if (state().onPass) state().onPass();
         for (const Value& name : accounts) {
             const String accountName = name.asString();
             AccountRecord record;
@@ -203,20 +207,16 @@ class AccountCheckLoop {
 
 }  // namespace
 
-void startAccountCheck(double firstDelaySeconds) {
-    static std::once_flag once;
-    std::call_once(once, [firstDelaySeconds] {
-        __VeltoIDDBSetChangeSemaphore(checkSemaphore());
-        isStarted = true;
-        static const auto* queue = new platform::WorkQueue("accountCheckDispatch");
-        queue->asyncAfter(firstDelaySeconds, [] { AccountCheckLoop().run(); });
-    });
+void startAccountCheck(double firstDelaySeconds, std::function<void()> onPass) {
+    CheckState& check = state();
+    if (check.isStarted.exchange(true)) return;
+    check.onPass = std::move(onPass);
+    __VeltoIDDBSetChangeSemaphore(check.semaphore);
+    check.queue.asyncAfter(firstDelaySeconds, [] { AccountCheckLoop().run(); });
 }
 
-void observeAccountCheck(std::function<void()> observer) { passObserver() = std::move(observer); }
-
 void wakeAccountCheck() {
-    if (isStarted) checkSemaphore().signal();
+    if (state().isStarted) checkSemaphore().signal();
 }
 
 }  // namespace veltoid

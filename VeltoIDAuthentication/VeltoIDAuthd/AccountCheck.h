@@ -18,16 +18,13 @@ namespace veltoid {
 inline constexpr double kMinTimeBetweenPasses = 5;
 inline constexpr double kVeltoIDFirstAccountCheckDelay = 10;
 
-/// Starts the loop, once per process; the first pass comes after `firstDelaySeconds` (at once when not
-/// positive). The loop waits for the device's first unlock before that. Any queue.
-void startAccountCheck(double firstDelaySeconds);
+/// Starts the loop, once; the first pass comes after `firstDelaySeconds` (at once when not positive). The
+/// loop waits for the device's first unlock before that. `onPass` is called on the loop's queue whenever a
+/// pass begins to look at accounts. Any queue.
+void startAccountCheck(double firstDelaySeconds, std::function<void()> onPass = {});
 
 /// Makes the next pass come early, as a notifying change of the database does. Does nothing before the start.
 /// Any queue.
 void wakeAccountCheck();
-
-/// Tests only, before the start: calls `observer` on the loop's queue whenever a pass begins to look at
-/// accounts.
-void observeAccountCheck(std::function<void()> observer);
 
 }  // namespace veltoid

@@ -21,11 +21,10 @@ class AccountCheckTest : public CertificateTest {
   protected:
     void SetUp() override {
         CertificateTest::SetUp();
-        setRelaunchScheduler([](double date) { scheduleRelaunch(date); });
+        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date); }});
     }
     void TearDown() override {
-        // The loop lives on, but without the account it sleeps. What it has taken of marks is on disk later.
-        __VeltoIDDBRemoveVeltoIDAccount(kName);
+        // What the loop has taken of marks is on disk later.
         doNotCompareWithDisk();
         CertificateTest::TearDown();
     }
@@ -62,8 +61,13 @@ TEST_F(AccountCheckTest, WithoutAccountsItSleepsUntilThereIsOne) {
     EXPECT_TRUE(certificateEntry().contains("CertificateReference"));
 }
 
-TEST_F(AccountCheckTest, TheDeviceHasToBeUnlockedFirst) {
-    platform::FakeLockState lock(false);
+class LockedDeviceTest : public AccountCheckTest {
+  protected:
+    platform::FakeLockState lock_{false};
+};
+
+TEST_F(LockedDeviceTest, TheDeviceHasToBeUnlockedFirst) {
+    platform::FakeLockState& lock = lock_;
     issueAtOnce();
     setValue("Dirty", flag(true));
     start();

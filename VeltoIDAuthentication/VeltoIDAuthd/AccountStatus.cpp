@@ -6,10 +6,10 @@
 #include "Platform/keychain/LockState.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/MessageKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
@@ -17,9 +17,6 @@
 
 namespace veltoid {
 namespace {
-
-/// When the process was started (seconds since 1970).
-const double kLaunchTime = platform::now();
 
 /// What the override says; none without one.
 std::optional<bool> userActionOverride() {
@@ -90,7 +87,7 @@ Dictionary copyAccountStatusesDictionary(const Dictionary& options) {
     for (const std::string_view key :
          {kVeltoIDMetaLastSuccessfulConnectKey, kVeltoIDMetaLastConnectAttemptKey})
         status.set(key, __VeltoIDDBCopyMetaInfoValue(nullptr, options, key));
-    status.set(message::kLaunchTime, Value::date(kLaunchTime));
+    status.set(message::kLaunchTime, Value::date(launchDate()));
     if (const auto next = nextLaunchDate()) status.set(message::kNextLaunchTime, Value::date(*next));
     status.set(message::kProcessID, Value::int64(getpid()));
     for (const auto& [key, value] : copyDeviceStatusDictionary()) status.set(key, value);

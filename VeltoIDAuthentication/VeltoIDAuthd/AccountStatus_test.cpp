@@ -140,8 +140,12 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
     }
 }
 
-TEST_F(AccountStatusTest, SaysNothingOfAPasswordThatMayYetBecomeReadable) {
-    const platform::FakeLockState lock(false);
+class LockedDeviceStatusTest : public AccountStatusTest {
+  protected:
+    const platform::FakeLockState lock_{false};
+};
+
+TEST_F(LockedDeviceStatusTest, SaysNothingOfAPasswordThatMayYetBecomeReadable) {
     add(false);
     removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef"));
     EXPECT_EQ(statusOf({})["AccountState"], Value("PasswordInaccessibleInKeychain"));

@@ -8,6 +8,7 @@
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/AccountStatus.h"

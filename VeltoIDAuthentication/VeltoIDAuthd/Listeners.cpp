@@ -8,7 +8,6 @@
 #include "Protocol/MessageKeys.h"
 #include "VeltoIDAuthd/AuthenticationService.h"
 #include "VeltoIDAuthd/ClientRequest.h"
-#include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
@@ -18,14 +17,14 @@ namespace {
 using platform::ConnectionError;
 using platform::PeerConnection;
 
-using RequestHandler = void (*)(platform::IncomingMessage& message);
+using RequestHandler = std::function<void(platform::IncomingMessage& message)>;
 
 /// A ping waits for nothing.
 bool isAnsweredAtOnce(platform::IncomingMessage& incoming) {
     return incoming.peekInteger(message::kCommand) == command::kPing;
 }
 
-void serve(PeerConnection& peer, RequestHandler handle) {
+void serve(PeerConnection& peer, const RequestHandler& handle) {
     peer.setTargetQueue(platform::WorkQueue("client " + std::to_string(peer.processID())));
     // The queue ends with the last event that uses it, so the end of the connection needs no action of its
     // own.
@@ -58,12 +57,15 @@ void registerAuthenticationListener(const std::string& serviceName) {
     listener->resume();
 }
 
-void registerPasswordCheckListener() {
+void registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity) {
     const Transaction keepAlive("registerPasswordCheckListener");
+    const RequestHandler handle = [linkedIdentity](platform::IncomingMessage& message) {
+        handlePasswordCheckIPCMessage(message, linkedIdentity);
+    };
     const auto listener = platform::Listener::create(
-        kVeltoIDPasswordCheckServiceName, [](const platform::ListenerEvent& event) {
+        kVeltoIDPasswordCheckServiceName, [handle](const platform::ListenerEvent& event) {
             if (const auto* peer = std::get_if<std::shared_ptr<PeerConnection>>(&event))
-                serve(**peer, handlePasswordCheckIPCMessage);
+                serve(**peer, handle);
         });
     listener->resume();
 }

@@ -5,11 +5,12 @@
 #include <string>
 
 #include "Protocol/Names.h"
+#include "VeltoIDAuthd/PasswordCheckService.h"
 
 namespace veltoid {
 
 /// Main queue, once each. The authentication service may be there a second time without a name.
 void registerAuthenticationListener(const std::string& serviceName);
-void registerPasswordCheckListener();
+void registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity);
 
 }  // namespace veltoid

@@ -10,29 +10,25 @@
 namespace veltoid {
 namespace {
 
-bool linkedIdentityUnsupported(const Data& /*identityReference*/, ErrorOut error) {
+bool linkedIdentityUnsupported(ErrorOut error) {
     fillError(error, VELTOID_ERROR(identity_error::kUnsupportedFeature));
     return false;
 }
 
-LinkedIdentityHandler& linkedIdentityHandler() {
-    static auto* handler = new LinkedIdentityHandler(linkedIdentityUnsupported);
-    return *handler;
-}
-
-bool updateLinkedIdentity(const Request& request, ErrorOut error) {
+bool updateLinkedIdentity(const Request& request, const LinkedIdentityHandler& update, ErrorOut error) {
     const Data reference = request.value(message::kIdentityReference).asData();
-    return reference && linkedIdentityHandler()(reference, error);
+    if (!reference) return false;
+    return update ? update(reference, error) : linkedIdentityUnsupported(error);
 }
 
-bool run(const Request& request, ErrorOut error) {
+bool run(const Request& request, const LinkedIdentityHandler& linkedIdentity, ErrorOut error) {
     switch (request.command()) {
         case command::kPing:
             return true;
         case command::kVerify:
             return verifyRequestedPassword(request, error);
         case command::kUpdateLinkedIdentity:
-            return updateLinkedIdentity(request, error);
+            return updateLinkedIdentity(request, linkedIdentity, error);
         default:
             return false;
     }
@@ -40,11 +36,12 @@ bool run(const Request& request, ErrorOut error) {
 
 }  // namespace
 
-void handlePasswordCheckIPCMessage(platform::IncomingMessage& message) {
+void handlePasswordCheckIPCMessage(platform::IncomingMessage& message,
+                                   const LinkedIdentityHandler& linkedIdentity) {
     const Transaction guard("handlePasswordCheckIPCMessage");
     Request request(message);
     std::optional<Error> error;
-    const bool success = run(request, &error);
+    const bool success = run(request, linkedIdentity, &error);
     request.finish(success, error);
 }
 
@@ -55,7 +52,5 @@ bool verifyRequestedPassword(const Request& request, ErrorOut error) {
         copyDictionarySettingValue(request.options(), option::kDoNotSaveSessionInfo, Value::boolean(true));
     return __VeltoIDDoVerifyPassword(request.account(), password, options, error);
 }
-
-void setLinkedIdentityHandler(LinkedIdentityHandler handler) { linkedIdentityHandler() = std::move(handler); }
 
 }  // namespace veltoid

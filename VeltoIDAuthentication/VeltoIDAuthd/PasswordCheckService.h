@@ -9,16 +9,15 @@
 
 namespace veltoid {
 
-/// Handles one request of a client, synchronously, on the client's queue.
-void handlePasswordCheckIPCMessage(platform::IncomingMessage& message);
-
 /// The verification that both services offer: false without an error when account or password is missing.
 bool verifyRequestedPassword(const Request& request, ErrorOut error);
 
 /// Updates the provisioning of the linked identity that the reference names.
 using LinkedIdentityHandler = std::function<bool(const Data& identityReference, ErrorOut error)>;
 
-/// Without a handler the platform has no such service, and requests fail with -114. Called once, at start.
-void setLinkedIdentityHandler(LinkedIdentityHandler handler);
+/// Handles one request of a client, synchronously, on the client's queue. An empty handler means that the
+/// platform has no such service: its requests fail with -114.
+void handlePasswordCheckIPCMessage(platform::IncomingMessage& message,
+                                   const LinkedIdentityHandler& linkedIdentity = {});
 
 }  // namespace veltoid

@@ -8,6 +8,7 @@
 #include "IPCHelpers/Transaction.h"
 #include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Values/Error.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
@@ -20,28 +21,27 @@ namespace {
 constexpr double kNoParticularTime = 1e10;
 constexpr double kMaxInterval = std::numeric_limits<uint32_t>::max();
 
-/// Changed on the main queue only; the lock is for the status, which reads it from a client's queue.
-struct NextLaunch {
+/// The next date is changed on the main queue only; the lock is for the status, which reads it from a
+/// client's queue.
+struct Launches {
+    const double begun = platform::Clock::shared().now();
     std::mutex mutex;
-    std::optional<double> date;
-
-    static NextLaunch& shared() {
-        static auto* next = new NextLaunch;
-        return *next;
-    }
+    std::optional<double> next;
 };
+
+Launches& launches() { return platform::Lifetime::current().state<Launches>(); }
 
 /// Main queue.
 void handOver(double requested, RelaunchDate rule) {
     const double now = platform::now();
     const double target = requested > 0 ? requested : now + kNoParticularTime;
-    NextLaunch& next = NextLaunch::shared();
-    const std::lock_guard lock(next.mutex);
-    if (rule == RelaunchDate::OnlyIfEarlier && next.date && target > *next.date) return;
+    auto& [begun, mutex, next] = launches();
+    const std::lock_guard lock(mutex);
+    if (rule == RelaunchDate::OnlyIfEarlier && next && target > *next) return;
     const double delta = target - now;
-    next.date.reset();
+    next.reset();
     if (delta < 0) return;
-    next.date = now + delta;
+    next = now + delta;
     platform::ServiceManager::shared().setStartInterval(
         delta >= kMaxInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
 }
@@ -49,6 +49,7 @@ void handOver(double requested, RelaunchDate rule) {
 }  // namespace
 
 void scheduleRelaunch(std::optional<double> date, RelaunchDate rule) {
+    (void)launches();
     const auto keepAlive = std::make_shared<Transaction>("scheduleRelaunch");
     platform::WorkQueue::main().async([keepAlive, requested = date.value_or(0), rule] {
         handOver(requested, rule);
@@ -79,9 +80,10 @@ void computeRelaunchFromAccounts() {
 }
 
 std::optional<double> nextLaunchDate() {
-    NextLaunch& next = NextLaunch::shared();
-    const std::lock_guard lock(next.mutex);
-    return next.date;
+    const std::lock_guard lock(launches().mutex);
+    return launches().next;
 }
+
+double launchDate() { return launches().begun; }
 
 }  // namespace veltoid

@@ -22,6 +22,9 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate);
 /// Asks for a relaunch at the earliest next action, if there is one, and makes the database durable.
 void computeRelaunchFromAccounts();
 
+/// When the agent was started (seconds since 1970), as far as it has ever asked for a relaunch.
+double launchDate();
+
 /// The date of the relaunch that was last asked for; none when there is none. Any queue.
 std::optional<double> nextLaunchDate();
 

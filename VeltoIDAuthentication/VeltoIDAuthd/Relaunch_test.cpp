@@ -9,11 +9,6 @@ namespace {
 
 class FakeServiceManager : public platform::ServiceManager {
   public:
-    FakeServiceManager() { replaceShared(this); }
-    ~FakeServiceManager() override { replaceShared(nullptr); }
-    FakeServiceManager(const FakeServiceManager&) = delete;
-    FakeServiceManager& operator=(const FakeServiceManager&) = delete;
-
     uint32_t setStartInterval(uint32_t seconds) override {
         handed_ = seconds;
         return 0;
@@ -22,6 +17,7 @@ class FakeServiceManager : public platform::ServiceManager {
 
   private:
     std::optional<uint32_t> handed_;
+    const platform::InTestLifetime<platform::ServiceManager> inLifetime_{*this};
 };
 
 class RelaunchTest : public DatabaseTest {

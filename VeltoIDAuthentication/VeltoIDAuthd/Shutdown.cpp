@@ -8,10 +8,12 @@
 #include <utility>
 
 #include "Logging/Log.h"
-#include "Platform/bus/EventLoop.h"
+#include "Platform/bus/BusConnection.h"
 #include "Platform/bus/MessageService.h"
 #include "Platform/bus/ServiceManager.h"
+#include "Platform/runtime/EventLoop.h"
 #include "Platform/runtime/InstanceLock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/Transactions.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
@@ -28,6 +30,14 @@ constexpr double kDefaultIdleExit = 30;
 /// How long open transactions may hold up the end after SIGTERM, and after a command (seconds).
 constexpr double kLongestTermination = 10;
 constexpr double kLongestCommandedEnd = 1;
+
+/// A service manager that is busy longer does not keep an ending process (seconds).
+constexpr double kLongestHandOver = 2;
+
+/// Main thread only.
+struct Leaving {
+    bool hasBegun = false;
+};
 
 /// 0 for never.
 double idleExitSeconds() {
@@ -52,7 +62,7 @@ void makeDurable() {
 
 void endProcess() {
     makeDurable();
-    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
+    endAfterPendingWork();
 }
 
 /// Everything that was sent to the agent is answered. What it stored is made durable now, since it would keep
@@ -68,8 +78,7 @@ void endWhenWorkIsDone() {
 }
 
 void leave() {
-    static bool leaving = false;
-    if (std::exchange(leaving, true)) return;
+    if (std::exchange(platform::Lifetime::current().state<Leaving>().hasBegun, true)) return;
     // Before the names are free: a start that is asked for while the service manager believes that the agent
     // runs would come to nothing.
     platform::ServiceManager::shared().announceStopping();
@@ -103,6 +112,19 @@ void prepareShutdown() {
     // Without its bus it can be reached by nobody and hold up the end of a log-in session.
     platform::message_service::onConnectionLost(terminate);
     if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
+}
+
+void endAfterPendingWork() {
+    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
+    const auto end = [] {
+        platform::ServiceManager::shared().announceStopping();
+        platform::bus::flush();
+        platform::event_loop::stop(EXIT_SUCCESS);
+    };
+    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
+    mainQueue.asyncAfter(kLongestHandOver, end);
+    while (!mainQueue.isCurrent() && !platform::Lifetime::current().isEnding())
+        (void)platform::Semaphore().wait(kLongestTermination);
 }
 
 void shutDownByCommand() {

@@ -11,4 +11,8 @@ void prepareShutdown();
 /// Has the agent leave now. Others' requests may hold that up for a second. Any queue.
 void shutDownByCommand();
 
+/// Ends the agent (event_loop::run returns) once the main queue has done what it was asked for so far,
+/// replies and relaunch included. On other queues than the main one this returns when the lifetime ends.
+void endAfterPendingWork();
+
 }  // namespace veltoid

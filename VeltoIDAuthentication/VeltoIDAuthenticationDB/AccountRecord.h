@@ -5,8 +5,8 @@
 #include <optional>
 #include <utility>
 
+#include "Protocol/RecordKeys.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 

@@ -2,9 +2,9 @@
 
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 

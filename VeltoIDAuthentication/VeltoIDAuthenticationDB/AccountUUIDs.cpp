@@ -1,8 +1,8 @@
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 
+#include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
 #include "Values/LowerCase.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid::database {
 

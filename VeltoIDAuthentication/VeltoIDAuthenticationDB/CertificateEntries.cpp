@@ -1,7 +1,7 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
 #include "Platform/runtime/Clock.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {

@@ -12,6 +12,7 @@
 #include "IPCHelpers/Transaction.h"
 #include "Platform/propertylist/PropertyList.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Platform/storage/Preferences.h"
 #include "Values/ValueStream.h"
@@ -26,12 +27,6 @@ constexpr std::string_view kMatched = "matched";
 constexpr std::string_view kMatchedValue = "value";
 constexpr std::string_view kValidDate = "ValidDate";
 constexpr std::string_view kValidInterval = "ValidInterval";
-
-/// Writes run here one after the other, apart from the lock.
-const platform::WorkQueue& writeQueue() {
-    static const auto* queue = new platform::WorkQueue("VeltoIDFindPersonCacheQueue");
-    return *queue;
-}
 
 Preferences domain() { return Preferences(std::string(kVeltoIDFindPersonCacheDomain)); }
 
@@ -106,8 +101,14 @@ class FindPersonCache {
     void add(const Array& results);
     Array find(const Dictionary& criteria);
 
-    /// On the write queue.
-    bool write();
+    bool writeNow() {
+        return writeQueue_.sync([this] { return write(); });
+    }
+
+    /// What waits to be written is written now.
+    void lifetimeEnds() {
+        writeQueue_.async([this] { write(); });
+    }
 
   private:
     using Entries = std::list<Entry>;
@@ -120,6 +121,11 @@ class FindPersonCache {
     void dropEnded();
     void planWrite();
 
+    /// On the write queue.
+    bool write();
+
+    /// Writes run here one after the other, apart from the lock.
+    const platform::WorkQueue writeQueue_{"VeltoIDFindPersonCacheQueue"};
     std::mutex mutex_;
     /// In the order in which they were stored.
     Entries entries_;
@@ -131,10 +137,7 @@ class FindPersonCache {
     bool isSeeded_ = false;
 };
 
-FindPersonCache& cache() {
-    static auto* shared = new FindPersonCache;
-    return *shared;
-}
+FindPersonCache& cache() { return platform::Lifetime::current().state<FindPersonCache>(); }
 
 void FindPersonCache::add(const Array& results) {
     const std::lock_guard lock(mutex_);
@@ -227,7 +230,7 @@ void FindPersonCache::dropEnded() {
 void FindPersonCache::planWrite() {
     if (pendingWrite_) return;
     pendingWrite_ = std::make_unique<Transaction>("VeltoIDFindPersonCache");
-    writeQueue().asyncAfter(kVeltoIDDBFlushDelay, [this] { write(); });
+    writeQueue_.asyncAfter(database::flushDelay(), [this] { write(); });
 }
 
 /// The entries are shared, so that the lock is held for no longer than it takes to count them.
@@ -272,8 +275,6 @@ std::optional<Array> __VeltoIDDBCopyCachedFindPersonResults(const Dictionary& cr
     return found;
 }
 
-bool __VeltoIDDBWriteFindPersonCache() {
-    return writeQueue().sync([] { return cache().write(); });
-}
+bool __VeltoIDDBWriteFindPersonCache() { return cache().writeNow(); }
 
 }  // namespace veltoid

@@ -15,7 +15,10 @@ constexpr std::string_view kKey = "findPersonCache";
 
 class FindPersonCacheTest : public DatabaseTest {
   protected:
-    FindPersonCacheTest() { __VeltoIDDBSetFindPersonCacheUsePreferences(true); }
+    void SetUp() override {
+        DatabaseTest::SetUp();
+        __VeltoIDDBSetFindPersonCacheUsePreferences(true);
+    }
 
     static platform::Preferences cacheDomain() { return domain(kVeltoIDFindPersonCacheDomain); }
 

@@ -3,7 +3,7 @@
 #include <cmath>
 #include <limits>
 
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {

@@ -3,9 +3,9 @@
 #include <algorithm>
 #include <vector>
 
+#include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid::database {
 namespace {

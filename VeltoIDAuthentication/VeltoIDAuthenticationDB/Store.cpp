@@ -5,18 +5,31 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/ValueStream.h"
 #include "VeltoIDAuthenticationDB/Migration.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace database {
+
+struct StoreState {
+    Store store;
+    const platform::WorkQueue queue{"VeltoIDDBQueue"};
+    std::atomic<bool> isLoaded{false};
+
+    /// What waits to be flushed is flushed now.
+    void lifetimeEnds() {
+        queue.async([this] {
+            if (store.pendingFlush_) store.synchronize();
+        });
+    }
+};
+
 namespace {
 
-Store& store() {
-    static auto* shared = new Store;
-    return *shared;
-}
+StoreState& state() { return platform::Lifetime::current().state<StoreState>(); }
+Store& store() { return state().store; }
 
 using ReadResult = platform::Preferences::ReadResult;
 
@@ -84,20 +97,19 @@ std::string_view keyOf(Dictionary Store::*section) {
 
 }  // namespace
 
-platform::WorkQueue queue() {
-    static const auto* shared = new platform::WorkQueue("VeltoIDDBQueue");
-    return *shared;
-}
+platform::WorkQueue queue() { return state().queue; }
+
+double flushDelay() { return platform::Lifetime::current().isEnding() ? 0 : kVeltoIDDBFlushDelay; }
 
 Store& loadedStore() {
-    static std::atomic<bool> loaded{false};
-    if (!loaded.load(std::memory_order_acquire)) {
-        queue().sync([] {
-            if (!loaded.load(std::memory_order_relaxed))
-                loaded.store(store().load(), std::memory_order_release);
+    StoreState& current = state();
+    if (!current.isLoaded.load(std::memory_order_acquire)) {
+        current.queue.sync([&] {
+            if (!current.isLoaded.load(std::memory_order_relaxed))
+                current.isLoaded.store(current.store.load(), std::memory_order_release);
         });
     }
-    return store();
+    return current.store;
 }
 
 const Dictionary* Store::find(const Dictionary& section, const String& key) {
@@ -177,7 +189,7 @@ bool Store::writeSections(std::initializer_list<Dictionary Store::*> sections) {
 void Store::planFlush() {
     if (pendingFlush_) return;
     pendingFlush_ = std::make_unique<Transaction>("VeltoIDDBFlush");
-    queue().asyncAfter(kVeltoIDDBFlushDelay, [this] { synchronize(); });
+    queue().asyncAfter(flushDelay(), [this] { synchronize(); });
 }
 
 /// A flush that fails is logged by the preference store; the data survives the process all the same.

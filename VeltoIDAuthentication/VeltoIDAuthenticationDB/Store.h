@@ -76,6 +76,7 @@ class Store {
     friend bool veltoid::__VeltoIDDBSynchronize();
     friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
     friend Store& loadedStore();
+    friend struct StoreState;
 
     platform::Preferences preferences() const;
     bool load();
@@ -92,6 +93,9 @@ class Store {
 };
 
 platform::WorkQueue queue();
+
+/// How long what has changed waits for more to be written with it; not at all when the lifetime ends.
+double flushDelay();
 
 /// The store, loaded. The first caller loads it before its body is queued; others wait for that. While the
 /// preference store cannot be read, the sections are empty and nothing is written, and each call tries to

@@ -6,6 +6,7 @@
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/Names.h"
 #include "Protocol/OptionKeys.h"
@@ -128,7 +129,9 @@ bool waitForCertificate(const String& accountName, const Dictionary& options,
     if (!(duration > 0)) return true;
     const Dictionary checkOptions =
         copyDictionarySettingValue(options, option::kCheckNetwork, Value::boolean(true));
-    for (const double deadline = platform::now() + duration; platform::now() <= deadline;) {
+    const auto& lifetime = platform::Lifetime::current();
+    for (const double deadline = platform::now() + duration;
+         platform::now() <= deadline && !lifetime.isEnding();) {
         wakeAccountCheck();
         switch (checkAccountAndDetermineNextAction(accountName, checkOptions)) {
             case AccountState::NoEncodedDSID:

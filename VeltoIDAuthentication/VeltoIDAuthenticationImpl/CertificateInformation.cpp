@@ -1,9 +1,11 @@
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 
 #include "Protocol/MessageKeys.h"
+#include "Protocol/OptionKeys.h"
+#include "Protocol/RecordKeys.h"
+#include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 
@@ -30,6 +32,11 @@ constexpr InformationEntry kReferences[] = {
     {kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::Kind::Data},
 };
 
+constexpr InformationEntry kDetails[] = {
+    {kVeltoIDCertificateIntermediateCertificateReferenceKey, Value::Kind::Data},
+    {kVeltoIDCertificateNextRenewalAttemptDateKey, Value::Kind::Date},
+};
+
 void takeEntries(const Dictionary& entry, std::span<const InformationEntry> entries,
                  Dictionary& information) {
     for (const InformationEntry& wanted : entries)
@@ -46,8 +53,8 @@ String requestedEncDsId(const String& accountName, const String& encDsId) {
 
 }  // namespace
 
-bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId,
-                                  const Dictionary& /*options*/, Dictionary* information, ErrorOut error) {
+bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
+                                  Dictionary* information, ErrorOut error) {
     const String requested = requestedEncDsId(accountName, encDsId);
     CertificateEntry entry;
     if (!requested) {
@@ -60,6 +67,7 @@ bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDs
     }
     Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
     takeEntries(entry.values(), kEntries, found);
+    if (getBool(&options, option::kCertificateDetails, false)) takeEntries(entry.values(), kDetails, found);
     std::optional<platform::Certificate> certificate;
     if (usesSystemKeychain()) {
         takeEntries(entry.values(), kReferences, found);

@@ -5,9 +5,9 @@
 
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace {

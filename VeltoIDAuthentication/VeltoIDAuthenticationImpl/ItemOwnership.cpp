@@ -3,10 +3,11 @@
 #include <algorithm>
 
 #include "Certificates/CertificateRequest.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 
@@ -14,9 +15,12 @@ namespace veltoid {
 namespace {
 
 /// A semaphore, since simulated time goes on while a task waits for one, but not while it waits for a mutex.
+struct Ownership {
+    const platform::Semaphore semaphore{1};
+};
+
 const platform::Semaphore& ownershipSemaphore() {
-    static const auto* semaphore = new platform::Semaphore(1);
-    return *semaphore;
+    return platform::Lifetime::current().state<Ownership>().semaphore;
 }
 
 bool isReferredTo(const Data& reference) {

@@ -7,8 +7,8 @@
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
 #include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 
 namespace veltoid {
 namespace {

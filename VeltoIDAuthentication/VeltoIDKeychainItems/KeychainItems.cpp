@@ -8,17 +8,19 @@ namespace veltoid {
 
 namespace {
 
-std::atomic<bool> useKeychain{true};
+struct ItemState {
+    std::atomic<bool> useKeychain{true};
+    const platform::WorkQueue queue{"KeychainDispatchQueue"};
+};
+
+ItemState& state() { return platform::Lifetime::current().state<ItemState>(); }
 
 }  // namespace
 
-void setUseSystemKeychain(bool use) { useKeychain = use; }
-bool usesSystemKeychain() { return useKeychain; }
+void setUseSystemKeychain(bool use) { state().useKeychain = use; }
+bool usesSystemKeychain() { return state().useKeychain; }
 
-platform::WorkQueue keychainQueue() {
-    static const auto* queue = new platform::WorkQueue("KeychainDispatchQueue");
-    return *queue;
-}
+platform::WorkQueue keychainQueue() { return state().queue; }
 
 namespace keychain_items {
 

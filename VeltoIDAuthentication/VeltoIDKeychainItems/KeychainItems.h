@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "Platform/keychain/Keychain.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Values/Digest.h"
 #include "Values/Value.h"
@@ -19,7 +20,7 @@ namespace veltoid {
 inline constexpr const char* kKeychainAccessGroup =
     "com.velto.harbwell.veltoidauthentication.keychainaccessgroup";
 
-/// Whether items go to the keychain (the default) or into memory. Called once, at start. Any thread.
+/// Whether items go to the keychain (the default) or into memory. Any thread.
 void setUseSystemKeychain(bool use);
 bool usesSystemKeychain();
 
@@ -71,6 +72,12 @@ class MemoryTable {
   private:
     std::vector<std::pair<Data, Item>> items_;
 };
+
+/// The table of this lifetime.
+template <typename Item>
+MemoryTable<Item>& memoryItems() {
+    return platform::Lifetime::current().state<MemoryTable<Item>>();
+}
 
 }  // namespace keychain_items
 }  // namespace veltoid

@@ -14,10 +14,7 @@ using platform::KeychainAttributes;
 using platform::KeychainItemClass;
 using platform::KeychainStatus;
 
-keychain_items::MemoryTable<Key>& memoryItems() {
-    static auto* items = new keychain_items::MemoryTable<Key>;
-    return *items;
-}
+keychain_items::MemoryTable<Key>& memoryItems() { return keychain_items::memoryItems<Key>(); }
 
 /// What identifies the key among those of its class.
 KeychainAttributes identityOf(const Key& key) {

@@ -16,10 +16,7 @@ using platform::KeychainQuery;
 using platform::KeychainStatus;
 using platform::PersistentReference;
 
-keychain_items::MemoryTable<String>& memoryItems() {
-    static auto* items = new keychain_items::MemoryTable<String>;
-    return *items;
-}
+keychain_items::MemoryTable<String>& memoryItems() { return keychain_items::memoryItems<String>(); }
 
 KeychainQuery queryForReference(const Data& reference) {
     return keychain_items::queryForReference(platform::KeychainItemClass::GenericPassword, reference);

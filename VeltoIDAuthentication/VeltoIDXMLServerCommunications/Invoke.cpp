@@ -8,13 +8,13 @@
 
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
-#include "Platform/bus/EventLoop.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemVersion.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDXMLServerCommunications/WireKeys.h"
 #include "XMLRPC/XMLRPCShim.h"
@@ -22,20 +22,12 @@
 namespace veltoid {
 namespace {
 
-using RelaunchScheduler = std::function<void(double)>;
+ProcessHooks& hooks() { return platform::Lifetime::current().state<ProcessHooks>(); }
 
-RelaunchScheduler& relaunchScheduler() {
-    static auto* scheduler = new RelaunchScheduler([](double) {});
-    return *scheduler;
-}
-
-const String& frameworkVersionText() {
-    static const auto* text = [] {
-        char buffer[32];
-        std::snprintf(buffer, sizeof buffer, "%g", kVeltoIDDBAccessorVersion);
-        return new String(buffer);
-    }();
-    return *text;
+String frameworkVersionText() {
+    char buffer[32];
+    std::snprintf(buffer, sizeof buffer, "%g", kVeltoIDDBAccessorVersion);
+    return buffer;
 }
 
 bool metaSwitchIsOn(const String& accountName, const Dictionary& options, std::string_view key) {
@@ -73,7 +65,7 @@ void applyFlushAndExit(const Dictionary& reply) {
         "xmlInvoke", kNotice,
         "Received 'FlushAndExit' from server, so flushing database to disk and immediately exiting.");
     __VeltoIDDBSynchronize();
-    platform::event_loop::exitAfterPendingWork(EXIT_SUCCESS);
+    hooks().endProcess();
 }
 
 void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& reply) {
@@ -93,9 +85,9 @@ void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& 
 
 }  // namespace
 
-void setRelaunchScheduler(RelaunchScheduler scheduler) { relaunchScheduler() = std::move(scheduler); }
+void setProcessHooks(ProcessHooks given) { hooks() = std::move(given); }
 
-void requestRelaunch(double date) { relaunchScheduler()(date); }
+void requestRelaunch(double date) { hooks().scheduleRelaunch(date); }
 
 Dictionary createCallParameters(const String& accountName, const String& sessionID,
                                 const Dictionary& options) {

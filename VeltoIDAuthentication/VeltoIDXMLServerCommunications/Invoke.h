@@ -17,9 +17,16 @@ inline constexpr std::string_view kVeltoIDMethodPrefix = "com.velto.dir.idm.web.
 /// Protocol version that this agent speaks.
 inline constexpr int64_t kVeltoIDAuthProtocolVersion = 101;
 
-/// Hands down what the process does when a reply asks for a relaunch at a date (seconds since 1970). Set
-/// once, at start.
-void setRelaunchScheduler(std::function<void(double date)> scheduler);
+/// What the process does when a reply asks for it. Any queue.
+struct ProcessHooks {
+    /// Is running at the date (seconds since 1970).
+    std::function<void(double date)> scheduleRelaunch = [](double) {};
+    /// Ends, and does not return before that.
+    std::function<void()> endProcess = [] {};
+};
+
+/// Handed down by the process at start.
+void setProcessHooks(ProcessHooks hooks);
 
 /// Asks the process to be running at the date (seconds since 1970). Any queue.
 void requestRelaunch(double date);

@@ -6,31 +6,27 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 
 namespace veltoid {
 namespace {
 
-/// Guarded by its mutex; never destroyed.
-struct QueueTable {
+struct Sessions {
     std::mutex mutex;
+    /// Guarded by the mutex.
     std::vector<std::pair<String, platform::WorkQueue>> queues;
 
-    static QueueTable& shared() {
-        static auto* table = new QueueTable;
-        return *table;
-    }
+    const platform::WorkQueue globalQueue{"sVeltoIDAuthenticationSessionGlobalQueue"};
+    /// On the global queue only.
+    std::vector<IdleSession> cached;
 };
 
-platform::WorkQueue globalQueue() {
-    static const auto* queue = new platform::WorkQueue("sVeltoIDAuthenticationSessionGlobalQueue");
-    return *queue;
-}
+Sessions& state() { return platform::Lifetime::current().state<Sessions>(); }
+
+platform::WorkQueue globalQueue() { return state().globalQueue; }
 
 /// On the global queue only.
-std::vector<IdleSession>& cachedSessions() {
-    static auto* sessions = new std::vector<IdleSession>;
-    return *sessions;
-}
+std::vector<IdleSession>& cachedSessions() { return state().cached; }
 
 /// Has the session destroyed on its own queue.
 void destroy(IdleSession session) {
@@ -55,7 +51,7 @@ void cache(IdleSession session) {
 }  // namespace
 
 platform::WorkQueue copySessionQueueForAccount(const String& accountName) {
-    QueueTable& table = QueueTable::shared();
+    Sessions& table = state();
     const std::lock_guard lock(table.mutex);
     const auto known = std::find_if(table.queues.begin(), table.queues.end(),
                                     [&](const auto& entry) { return entry.first == accountName; });

@@ -121,11 +121,8 @@ class CommandsTest : public SessionTest {
   protected:
     void SetUp() override {
         SessionTest::SetUp();
-        setRelaunchScheduler([this](double date) { relaunches_.push_back(date - now()); });
-    }
-    void TearDown() override {
-        setRelaunchScheduler([](double) {});
-        SessionTest::TearDown();
+        setProcessHooks({.scheduleRelaunch = [this](double date) { relaunches_.push_back(date - now()); },
+                         .endProcess = [] { _exit(EXIT_SUCCESS); }});
     }
 
     /// The session after a call that got this reply.

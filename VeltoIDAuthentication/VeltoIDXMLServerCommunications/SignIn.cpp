@@ -6,13 +6,14 @@
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Protocol/OptionKeys.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/DateText.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationDB/RecordKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/WireKeys.h"
@@ -24,7 +25,11 @@ constexpr const char* kOperation = "__VeltoIDSessionDoCreateSession";
 constexpr std::string_view kClientOutOfDate =
     "The client on this machine is out of date and can not talk with the Velto ID server.";
 
-std::atomic<int32_t> serverVersion{0};
+struct Server {
+    std::atomic<int32_t> version{0};
+};
+
+std::atomic<int32_t>& serverVersion() { return platform::Lifetime::current().state<Server>().version; }
 
 Error signInError(int64_t code, int line, const ErrorTexts& texts = {}) {
     return makeError(code, texts, {}, kOperation, __FILE_NAME__, line);
@@ -154,7 +159,7 @@ class SignIn {
     }
 
     void applyReply(const Dictionary& reply, VeltoIDAuthenticationSessionInfo& session) {
-        serverVersion = getInt32(&reply, wire::kVersion, 0);
+        serverVersion() = getInt32(&reply, wire::kVersion, 0);
         applyEmbargo(reply);
         if (reply.boolean(wire::kClientTooOld).value_or(false)) {
             __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true),
@@ -267,6 +272,6 @@ Session __VeltoIDSessionDoCreateSession(const String& accountName, const String&
     });
 }
 
-int32_t __VeltoIDSessionGetServerVersion() { return serverVersion; }
+int32_t __VeltoIDSessionGetServerVersion() { return serverVersion(); }
 
 }  // namespace veltoid

@@ -82,7 +82,8 @@ std::optional<XMLRPCResponse> XMLRPCConnection::sendSynchronousXMLRPCRequest(con
     // A timer of its own rather than a wait with a limit: that one also ends when the date is set, and
     // setting the date is no reason to give up a call.
     platform::Clock& clock = platform::Clock::shared();
-    const auto timer = clock.callAfter(kSynchronousTimeoutSeconds, false, [exchange] { exchange->giveUp(); });
+    const auto timer = clock.callAfter(kSynchronousTimeoutSeconds, platform::Clock::Use::Wait,
+                                       [exchange] { exchange->giveUp(); });
     session->start(request.request());
     exchange->wait();
     clock.cancel(timer);

@@ -2,11 +2,12 @@
 
 #include <utility>
 
+#include "Platform/runtime/Lifetime.h"
+
 namespace veltoid {
 
 XMLRPCConnectionManager& XMLRPCConnectionManager::sharedManager() {
-    static auto* manager = new XMLRPCConnectionManager;
-    return *manager;
+    return platform::Lifetime::current().state<XMLRPCConnectionManager>();
 }
 
 String XMLRPCConnectionManager::spawnConnectionWithXMLRPCRequest(

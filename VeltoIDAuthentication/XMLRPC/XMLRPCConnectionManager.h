@@ -13,9 +13,10 @@ namespace veltoid {
 /// All operations may be called from any thread.
 class XMLRPCConnectionManager {
   public:
-    /// The only one, made on first use and never destroyed.
+    /// The one of this lifetime.
     static XMLRPCConnectionManager& sharedManager();
 
+    XMLRPCConnectionManager() = default;
     XMLRPCConnectionManager(const XMLRPCConnectionManager&) = delete;
     XMLRPCConnectionManager& operator=(const XMLRPCConnectionManager&) = delete;
 
@@ -33,10 +34,9 @@ class XMLRPCConnectionManager {
     void closeConnectionForIdentifier(const String& identifier);
     void closeConnections();
 
-  private:
-    XMLRPCConnectionManager() = default;
-    ~XMLRPCConnectionManager() = default;
+    void lifetimeEnds() { closeConnections(); }
 
+  private:
     mutable std::mutex mutex_;
     /// By identifier; guarded by the mutex, which is never held while a connection is called.
     std::map<std::string, std::shared_ptr<XMLRPCConnection>, std::less<>> connections_;

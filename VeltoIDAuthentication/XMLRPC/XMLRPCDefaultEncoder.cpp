@@ -2,9 +2,9 @@
 
 #include <algorithm>
 #include <charconv>
-#include <chrono>
-#include <cmath>
+#include <cstdlib>
 
+#include "Platform/encoding/CalendarText.h"
 #include "Values/Base64.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 
@@ -15,16 +15,6 @@ using platform::SecretText;
 
 /// Where a text starts: more than what a string keeps inside itself, where it would not be wiped.
 constexpr size_t kInitialCapacity = 256;
-
-// The dates that std::chrono's calendar knows.
-constexpr double kEarliestDate =
-    static_cast<double>(std::chrono::sys_seconds(std::chrono::sys_days(std::chrono::year::min() / 1 / 1))
-                            .time_since_epoch()
-                            .count());
-constexpr double kLatestDate =
-    static_cast<double>(std::chrono::sys_seconds(std::chrono::sys_days(std::chrono::year::max() / 12 / 31))
-                            .time_since_epoch()
-                            .count());
 
 /// Appends elements to one text, so that no value costs a text of its own.
 class ElementWriter {
@@ -51,7 +41,7 @@ class ElementWriter {
         out_.append(std::begin(digits), end);
     }
     /// At least `width` digits, filled up with zeros.
-    void padded(int number, ptrdiff_t width);
+    void padded(int64_t number, ptrdiff_t width);
 
     SecretText& out_;
 };
@@ -136,8 +126,8 @@ void ElementWriter::string(std::string_view text) {
     out_ += "</string></value>";
 }
 
-void ElementWriter::padded(int number, ptrdiff_t width) {
-    char digits[16];
+void ElementWriter::padded(int64_t number, ptrdiff_t width) {
+    char digits[24];
     const char* const end = std::to_chars(std::begin(digits), std::end(digits), std::abs(number)).ptr;
     if (number < 0) {
         out_ += '-';
@@ -149,22 +139,17 @@ void ElementWriter::padded(int number, ptrdiff_t width) {
 }
 
 void ElementWriter::date(double seconds) {
-    using namespace std::chrono;
-    const double known = std::isnan(seconds) ? 0 : std::clamp(seconds, kEarliestDate, kLatestDate);
-    const sys_seconds time{std::chrono::seconds(static_cast<int64_t>(std::floor(known)))};
-    const sys_days day = floor<days>(time);
-    const year_month_day date(day);
-    const hh_mm_ss clock(time - day);
+    const platform::CalendarDate date = platform::calendarDate(seconds);
     out_ += "<value><dateTime.iso8601>";
-    padded(static_cast<int>(date.year()), 4);
-    padded(static_cast<int>(static_cast<unsigned>(date.month())), 2);
-    padded(static_cast<int>(static_cast<unsigned>(date.day())), 2);
+    padded(date.year, 4);
+    padded(date.month, 2);
+    padded(date.day, 2);
     out_ += 'T';
-    padded(static_cast<int>(clock.hours().count()), 2);
+    padded(date.hour, 2);
     out_ += ':';
-    padded(static_cast<int>(clock.minutes().count()), 2);
+    padded(date.minute, 2);
     out_ += ':';
-    padded(static_cast<int>(clock.seconds().count()), 2);
+    padded(date.second, 2);
     out_ += "Z</dateTime.iso8601></value>";
 }
 

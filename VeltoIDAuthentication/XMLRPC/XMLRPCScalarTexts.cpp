@@ -2,9 +2,9 @@
 
 #include <algorithm>
 #include <charconv>
-#include <chrono>
 #include <limits>
 
+#include "Platform/encoding/CalendarText.h"
 #include "XMLRPC/XMLRPCHelpers.h"
 
 namespace veltoid::xmlrpc {
@@ -97,36 +97,16 @@ class FieldReader {
     bool ok_ = true;
 };
 
-std::chrono::sys_days readDay(FieldReader& fields, bool hyphens) {
-    const std::chrono::year year(fields.number(4));
-    if (hyphens) fields.literal('-');
-    const std::chrono::month month(static_cast<unsigned>(fields.number(2)));
-    if (hyphens) fields.literal('-');
-    const std::chrono::day day(static_cast<unsigned>(fields.number(2)));
-    const std::chrono::year_month_day date(year, month, day);
-    fields.require(date.ok() && year >= std::chrono::year(1));
-    return date.ok() ? std::chrono::sys_days(date) : std::chrono::sys_days();
-}
-
-std::chrono::seconds readTime(FieldReader& fields) {
-    const int hour = fields.number(2);
-    fields.literal(':');
-    const int minute = fields.number(2);
-    fields.literal(':');
-    const int second = fields.number(2);
-    fields.require(hour < 24 && minute < 60 && second < 60);
-    return std::chrono::hours(hour) + std::chrono::minutes(minute) + std::chrono::seconds(second);
-}
-
-std::chrono::seconds readZone(FieldReader& fields) {
-    if (fields.take('Z')) return {};
+/// Seconds east of UTC.
+double readZone(FieldReader& fields) {
+    if (fields.take('Z')) return 0;
     const bool isWest = fields.take('-');
     if (!isWest) fields.literal('+');
     const int hours = fields.number(2);
     (void)fields.take(':');
     const int minutes = fields.number(2);
     fields.require(hours < 24 && minutes < 60);
-    const std::chrono::seconds offset = std::chrono::hours(hours) + std::chrono::minutes(minutes);
+    const int offset = 3'600 * hours + 60 * minutes;
     return isWest ? -offset : offset;
 }
 
@@ -171,12 +151,22 @@ Value parseDate(std::string_view text) {
 
 std::optional<double> parseDateString(std::string_view text, DateFormat withFormat) {
     FieldReader fields(text);
-    const std::chrono::sys_days day = readDay(fields, withFormat.hyphens);
+    platform::CalendarDate date;
+    date.year = fields.number(4);
+    if (withFormat.hyphens) fields.literal('-');
+    date.month = fields.number(2);
+    if (withFormat.hyphens) fields.literal('-');
+    date.day = fields.number(2);
     fields.literal('T');
-    const std::chrono::seconds time = readTime(fields);
-    const std::chrono::seconds offset = withFormat.zone ? readZone(fields) : std::chrono::seconds();
-    if (!fields.readAll()) return std::nullopt;
-    return static_cast<double>((std::chrono::sys_seconds(day) + time - offset).time_since_epoch().count());
+    date.hour = fields.number(2);
+    fields.literal(':');
+    date.minute = fields.number(2);
+    fields.literal(':');
+    date.second = fields.number(2);
+    fields.require(date.second < 60);
+    const double offset = withFormat.zone ? readZone(fields) : 0;
+    const auto seconds = platform::secondsOf(date);
+    return fields.readAll() && seconds ? std::optional(*seconds - offset) : std::nullopt;
 }
 
 Data parseData(std::string_view text) { return dataFromBase64String(text); }

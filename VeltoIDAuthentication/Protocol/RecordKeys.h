@@ -1,4 +1,5 @@
-// Keys of the account database: top level, account records, certificate entries, meta information.
+// Keys of the account database: top level, account records, certificate entries, meta information. Replies
+// carry them as they are.
 #pragma once
 
 #include <array>

@@ -1,4 +1,4 @@
-#include "Platform/bus/EventLoop.h"
+#include "Platform/runtime/EventLoop.h"
 
 #include <sys/eventfd.h>
 #include <systemd/sd-event.h>
@@ -10,29 +10,37 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <list>
+#include <utility>
 
-#include "Platform/bus/BusConnection.h"
-#include "Platform/bus/ServiceManager.h"
+#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 
 namespace platform::event_loop {
 namespace {
 
-/// A service manager that is busy longer does not keep an ending process (seconds).
-constexpr double kLongestHandOver = 2;
+/// Main thread only, except that any thread writes to the descriptor.
+struct Loop {
+    sd_event* loop = nullptr;
+    int wakeDescriptor = -1;
+    /// The loop has their addresses.
+    std::list<std::function<void()>> signalHandlers;
 
-sd_event* loop = nullptr;
-int wakeDescriptor = -1;
+    Loop() = default;
+    ~Loop() {
+        sd_event_unref(loop);
+        if (wakeDescriptor >= 0) close(wakeDescriptor);
+    }
+    Loop(const Loop&) = delete;
+    Loop& operator=(const Loop&) = delete;
+};
+
+Loop& state() { return Lifetime::current().state<Loop>(); }
 
 [[noreturn]] void fail(const char* what, int error) {
     // NOLINTNEXTLINE(cert-err33-c): the process ends in any case
     std::fprintf(stderr, "event loop: %s: %s\n", what, std::strerror(error));
     std::abort();
-}
-
-void wakeLoop() {
-    const uint64_t one = 1;
-    if (write(wakeDescriptor, &one, sizeof one) < 0 && errno != EAGAIN) fail("waking", errno);
 }
 
 // What a task throws has no caller to go to: the process ends there rather than inside the C library.
@@ -55,53 +63,45 @@ void prepare() {
     sigemptyset(&served);
     sigaddset(&served, SIGINT);
     sigaddset(&served, SIGTERM);
-    sigprocmask(SIG_BLOCK, &served, nullptr);
+    pthread_sigmask(SIG_BLOCK, &served, nullptr);
     std::signal(SIGPIPE, SIG_IGN);
 
-    if (const int result = sd_event_default(&loop); result < 0) fail("creating", -result);
-    wakeDescriptor = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-    if (wakeDescriptor < 0) fail("creating wake descriptor", errno);
+    Loop& made = state();
+    if (const int result = sd_event_new(&made.loop); result < 0) fail("creating", -result);
+    made.wakeDescriptor = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (made.wakeDescriptor < 0) fail("creating wake descriptor", errno);
     sd_event_source* wake = nullptr;
-    int result = sd_event_add_io(loop, &wake, wakeDescriptor, EPOLLIN, woken, nullptr);
+    int result = sd_event_add_io(made.loop, &wake, made.wakeDescriptor, EPOLLIN, woken, nullptr);
     // Before new messages: their replies would have to stand behind those that wait here.
     if (result >= 0) result = sd_event_source_set_priority(wake, SD_EVENT_PRIORITY_IMPORTANT);
+    if (result >= 0) result = sd_event_source_set_floating(wake, 1);
+    sd_event_source_unref(wake);
     if (result < 0) fail("watching wake descriptor", -result);
-    main_queue::adopt(wakeLoop);
+    main_queue::adopt([descriptor = made.wakeDescriptor] {
+        const uint64_t one = 1;
+        if (write(descriptor, &one, sizeof one) < 0 && errno != EAGAIN) fail("waking", errno);
+    });
 }
 
 void onSignal(int signal, std::function<void()> handler) {
-    // Lives as long as the process, like the signal's source.
-    auto* kept = new std::function<void()>(std::move(handler));
+    Loop& current = state();
+    void* context = &current.signalHandlers.emplace_back(std::move(handler));
     sd_event_source* source = nullptr;
-    int result = sd_event_add_signal(loop, &source, signal, signalled, kept);
+    int result = sd_event_add_signal(current.loop, &source, signal, signalled, context);
     if (result >= 0) result = sd_event_source_set_priority(source, SD_EVENT_PRIORITY_IMPORTANT);
+    if (result >= 0) result = sd_event_source_set_floating(source, 1);
+    sd_event_source_unref(source);
     if (result < 0) fail("watching signal", -result);
 }
 
-void run() {
-    const int result = sd_event_loop(loop);
+int run() {
+    const int result = sd_event_loop(state().loop);
     if (result < 0) fail("running", -result);
-    exitProcess(result);
+    return result;
 }
 
-sd_event* handle() { return loop; }
+void stop(int status) { (void)sd_event_exit(state().loop, status); }
 
-void exitAfterPendingWork(int status) {
-    const WorkQueue mainQueue = WorkQueue::main();
-    const auto leave = [status] {
-        ServiceManager::shared().announceStopping();
-        bus::flush();
-        exitProcess(status);
-    };
-    mainQueue.async([leave] { ServiceManager::shared().whenHandedOver(leave); });
-    mainQueue.asyncAfter(kLongestHandOver, leave);
-    if (!mainQueue.isCurrent()) Semaphore().wait();
-}
-
-void exitProcess(int status) {
-    // NOLINTNEXTLINE(cert-err33-c): nobody is left to tell
-    std::fflush(stdout);
-    _exit(status);
-}
+sd_event* handle() { return state().loop; }
 
 }  // namespace platform::event_loop

@@ -1,0 +1,95 @@
+#include "VeltoIDAuthd/Agent.h"
+
+#include <csignal>
+#include <functional>
+
+#include "Platform/bus/BusConnection.h"
+#include "Platform/runtime/Clock.h"
+#include "Platform/runtime/EventLoop.h"
+#include "Platform/runtime/InstanceLock.h"
+#include "Platform/runtime/WorkQueue.h"
+#include "Protocol/RecordKeys.h"
+#include "VeltoIDAuthd/AccountCheck.h"
+#include "VeltoIDAuthd/Listeners.h"
+#include "VeltoIDAuthd/Relaunch.h"
+#include "VeltoIDAuthd/Shutdown.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/FindPersonCache.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
+
+namespace veltoid {
+namespace {
+
+/// A relaunch is asked for at start, so that an agent that dies early comes back (seconds).
+constexpr double kRelaunchAfterStart = 30;
+constexpr double kLeaksPause = 1;
+
+std::unique_ptr<platform::LockState> lockStateFor(const Agent::Configuration& configuration) {
+    if (!configuration.line.usePreferences) return std::make_unique<platform::AlwaysUnlocked>();
+    return std::make_unique<platform::KeychainLockState>(
+        [name = configuration.product.unlockedNotification](std::function<void()> handler) {
+            platform::bus::onPosted(name, std::move(handler));
+        });
+}
+
+void flushOnInterrupt() {
+    platform::event_loop::onSignal(SIGINT, [queue = platform::WorkQueue("flush on interrupt")] {
+        queue.async([] { __VeltoIDDBSynchronize(); });
+    });
+}
+
+void prepareDatabase(const CommandLine& line) {
+    if (line.preferencesDomainName) __VeltoIDDBSetPreferencesDomainName(*line.preferencesDomainName);
+    __VeltoIDDBSetUsePreferences(line.usePreferences);
+    __VeltoIDDBSetFindPersonCacheUsePreferences(line.usePreferences);
+    setUseSystemKeychain(line.usePreferences);
+    for (const auto& [key, value] : line.metaInfoValues)
+        __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+}
+
+void startServices(const Agent::Configuration& configuration) {
+    const CommandLine& line = configuration.line;
+    if (line.runsAuthentication()) {
+        scheduleRelaunch(platform::now() + kRelaunchAfterStart);
+        startAccountCheck(configuration.firstCheckDelay);
+        registerAuthenticationListener(
+            line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
+    }
+    if (line.checkPassword) registerPasswordCheckListener(configuration.linkedIdentity);
+}
+
+/// Every account is validated, at once unless the account check is about to start anyway, and clients that
+/// know the connection may ask for more: enough work for a leak checker.
+void workForLeakChecker() {
+    Array names;
+    __VeltoIDDBCopyVeltoIDs(&names);
+    for (const Value& name : names)
+        __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true),
+                                   Notify::Yes);
+    startAccountCheck(0);
+    registerAuthenticationListener({});
+    (void)platform::Semaphore().wait(kLeaksPause);
+}
+
+}  // namespace
+
+Agent::Agent(const Configuration& configuration)
+    : lockState_(lockStateFor(configuration)),
+      lifetime_(configuration.product, platform::Lifetime::Parts(configuration.parts).with(*lockState_)) {
+    platform::event_loop::prepare();
+    const CommandLine& line = configuration.line;
+    if (line.usePreferences) platform::instance_lock::waitForPrevious();
+    prepareDatabase(line);
+    setProcessHooks({[](double date) { scheduleRelaunch(date); }, endAfterPendingWork});
+    flushOnInterrupt();
+    prepareShutdown();
+    startServices(configuration);
+    if (line.leaks) workForLeakChecker();
+}
+
+int Agent::run() { return platform::event_loop::run(); }
+
+}  // namespace veltoid
