@@ -36,7 +36,7 @@ double relaunchInterval() {
 }
 
 struct CheckState {
-    /// Signals that come while the loop does not wait are kept.
+    /// Signals that come while the loop is busy are kept.
     const platform::Semaphore semaphore;
     const platform::WorkQueue queue{"accountCheckDispatch"};
     std::atomic<bool> isStarted{false};

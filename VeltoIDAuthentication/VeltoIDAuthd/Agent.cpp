@@ -61,8 +61,8 @@ void startServices(const Agent::Configuration& configuration) {
     if (line.checkPassword) registerPasswordCheckListener(configuration.linkedIdentity);
 }
 
-/// Every account is validated, at once unless the account check is about to start anyway, and whoever knows
-/// the connection may ask for more: enough work for a leak checker.
+/// Every account is validated, at once unless the account check is about to start anyway, and clients that
+/// know the connection may ask for more: enough work for a leak checker.
 void workForLeakChecker() {
     Array names;
     __VeltoIDDBCopyVeltoIDs(&names);

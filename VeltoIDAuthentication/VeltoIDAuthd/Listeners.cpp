@@ -5,6 +5,7 @@
 #include "IPCHelpers/Transaction.h"
 #include "Platform/bus/MessageService.h"
 #include "Protocol/Commands.h"
+#include "Protocol/MessageKeys.h"
 #include "VeltoIDAuthd/AuthenticationService.h"
 #include "VeltoIDAuthd/ClientRequest.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -19,8 +20,8 @@ using platform::PeerConnection;
 using RequestHandler = std::function<void(platform::IncomingMessage& message)>;
 
 /// A ping waits for nothing.
-bool isAnsweredAtOnce(platform::IncomingMessage& message) {
-    return message.peekInteger("command") == command::kPing;
+bool isAnsweredAtOnce(platform::IncomingMessage& incoming) {
+    return incoming.peekInteger(message::kCommand) == command::kPing;
 }
 
 void serve(PeerConnection& peer, const RequestHandler& handle) {

@@ -7,7 +7,6 @@
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Protocol/RecordKeys.h"
-#include "Values/Digest.h"
 #include "Values/ValueStream.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/Migration.h"
