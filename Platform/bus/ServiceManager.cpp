@@ -11,7 +11,6 @@
 #include <systemd/sd-daemon.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cmath>
 #include <cstdlib>
 #include <cstring>
