@@ -97,12 +97,13 @@ TEST_F(LifetimeTest, TheEndRunsWhatIsQueuedDropsWhatIsDelayedAndCutsWaits) {
     bool delayed = false;
     bool signalled = true;
     bool waitedInVain = true;
+    // They outlive the lifetime, as what its tasks use has to.
+    const WorkQueue queue("queue");
+    const WorkQueue other("other");
+    const Semaphore started;
+    const Semaphore nothing;
     {
         const Lifetime lifetime({});
-        const WorkQueue queue("queue");
-        const WorkQueue other("other");
-        const Semaphore started;
-        const Semaphore nothing;
         queue.async([&] {
             started.signal();
             signalled = nothing.wait(1e6);

@@ -5,6 +5,8 @@
 #include <cstring>
 
 #include "Platform/crypto/Crypto.h"
+#include "Protocol/RecordKeys.h"
+#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
 namespace veltoid {
 namespace {
