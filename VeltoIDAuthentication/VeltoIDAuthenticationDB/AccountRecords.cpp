@@ -3,8 +3,6 @@
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
-#include "Values/Digest.h"
-#include "Values/LowerCase.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/Store.h"

@@ -8,7 +8,6 @@
 #include "Platform/runtime/Lifetime.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/ValueStream.h"
-#include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/Migration.h"
 
 namespace veltoid {

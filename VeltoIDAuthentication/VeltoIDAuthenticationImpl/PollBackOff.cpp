@@ -5,8 +5,6 @@
 #include <cstring>
 
 #include "Platform/crypto/Crypto.h"
-#include "Protocol/RecordKeys.h"
-#include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
 namespace veltoid {
 namespace {
