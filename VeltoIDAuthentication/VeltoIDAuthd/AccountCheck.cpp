@@ -19,7 +19,7 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
-#include "VeltoIDAuthenticationImpl/Cleanup.h"
+#include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 
 namespace veltoid {
 namespace {

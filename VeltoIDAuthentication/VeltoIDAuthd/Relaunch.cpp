@@ -24,7 +24,7 @@ constexpr double kMaxInterval = std::numeric_limits<uint32_t>::max();
 /// The next date is changed on the main queue only; the lock is for the status, which reads it from a
 /// client's queue.
 struct Launches {
-    const double begun = platform::Clock::shared().now();
+    const double begun = platform::now();
     std::mutex mutex;
     std::optional<double> next;
 };

@@ -10,7 +10,6 @@
 #include "Platform/runtime/Clock.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
-#include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"

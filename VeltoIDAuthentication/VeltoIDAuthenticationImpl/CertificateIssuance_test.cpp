@@ -6,8 +6,8 @@
 #include "TestSupport/CertificateFixture.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
-#include "VeltoIDAuthenticationImpl/Cleanup.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
+#include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 

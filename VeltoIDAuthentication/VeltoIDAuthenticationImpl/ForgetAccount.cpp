@@ -6,7 +6,7 @@
 #include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
-#include "VeltoIDAuthenticationImpl/Cleanup.h"
+#include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 
 namespace veltoid {
 namespace {

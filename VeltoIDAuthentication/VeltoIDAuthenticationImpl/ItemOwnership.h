@@ -6,6 +6,7 @@
 // item would look abandoned, so all of this happens under one lock.
 #pragma once
 
+#include "Values/Error.h"
 #include "Values/Value.h"
 #include "VeltoIDAuthenticationDB/CertificateEntry.h"
 
@@ -43,5 +44,13 @@ void discardCertificate(const OwnershipLock& ownership, const String& encDsId,
 /// agent was killed. For an account that is being forgotten.
 void discardStrayItems(const OwnershipLock& ownership, const String& accountName,
                        const DroppedItems& dropped);
+
+/// Removes, with their keychain items, the certificate entries that no account owns, that are invalid, or
+/// that lack certificate or key; lifts connection embargoes that are over. The options are not looked at.
+/// True. Caller's queue.
+bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& options, ErrorOut error = nullptr);
+
+/// The same for callers that hold the ownership lock.
+void cleanUpAccountsAndCertificates(const OwnershipLock& ownership);
 
 }  // namespace veltoid
