@@ -214,6 +214,30 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
     EXPECT_EQ(server_.takeMethods(), "authenticate authenticate");
 }
 
+TEST_F(EngineTest, OnlyARefusalTakesThePassword) {
+    struct Case {
+        Error error;
+        bool isTaken;
+        const char* line;
+    };
+    const Case cases[] = {
+        {identityError(-101), true, "is incorrect or the account has been disabled"},
+        {identityError(-102), true, "is incorrect or the account has been disabled"},
+        {identityError(-105), true, "no longer supports this client"},
+        {identityError(-100), false, "removing"},
+        {Error{kXMLErrorDomain, -101, {}}, false, "removing"},
+    };
+    for (const Case& each : cases) {
+        createAccount("d1");
+        const auto lines = log_.count(each.line);
+        handleServerError(kName, kPassword, each.error);
+        EXPECT_EQ(hasPassword(), !each.isTaken) << each.error.code;
+        EXPECT_EQ(log_.count(each.line) - lines, each.isTaken ? 1 : 0) << each.error.code;
+    }
+    handleServerError(kName, kPassword, std::nullopt);
+    EXPECT_TRUE(hasPassword());
+}
+
 // --- What an account needs next
 
 TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
