@@ -3,6 +3,7 @@
 
 #include <functional>
 
+#include "Protocol/Commands.h"
 #include "TestSupport/FakeIdentityServer.h"
 #include "TestSupport/FakeNotifications.h"
 #include "VeltoIDAuthd/AccountStatus.h"
@@ -73,7 +74,7 @@ class ServiceTest : public ServerTest {
     }
 
     static Dictionary firstStatus() {
-        const Dictionary status = *send(0x510).dictionary("status");
+        const Dictionary status = *send(command::kStatus).dictionary("status");
         const Dictionary* accounts = status.dictionary("AccountStatuses");
         return accounts->empty() ? Dictionary() : *accounts->begin()->value.asDictionary();
     }
@@ -130,12 +131,12 @@ TEST_F(ServiceTest, SetsDatabaseValues) {
         {"a key of the wrong kind", "MetaInfo", {}, number(1), false, true, inMeta, 0},
     };
     for (const Case& each : cases) {
-        for (const int64_t command : {0xFE, 0xFF}) {
+        for (const int64_t command : {command::kSetValue, command::kSetValueQuietly}) {
             (void)takeSignals();
             Dictionary request = {{"domain", each.domain}, {"item", each.item}, {"key", each.key}};
             const Dictionary removal = request;
             request.set("value", "v");
-            const bool succeeds = command == 0xFE ? each.succeeds : each.succeedsIfPossible;
+            const bool succeeds = command == command::kSetValue ? each.succeeds : each.succeedsIfPossible;
             EXPECT_EQ(send(command, request), succeeds ? kSuccess : kFailure) << each.what << command;
             EXPECT_EQ(each.stored(), each.succeeds ? Value("v") : Value()) << each.what << command;
             EXPECT_EQ(takeSignals(), each.signals) << each.what << command;
@@ -145,7 +146,8 @@ TEST_F(ServiceTest, SetsDatabaseValues) {
     }
     (void)takeSignals();
     const Dictionary quietly = {{"Dirty", kOff}};
-    send(0xFE, {{"domain", "Accounts"}, {"item", kName}, {"key", "k"}, {"value", "v"}, {"options", quietly}});
+    send(command::kSetValue,
+         {{"domain", "Accounts"}, {"item", kName}, {"key", "k"}, {"value", "v"}, {"options", quietly}});
     EXPECT_EQ(record()["k"], Value("v"));
     EXPECT_EQ(takeSignals(), 0);
 }
@@ -157,24 +159,26 @@ TEST_F(ServiceTest, AnswersFromWhatIsStored) {
     const Value data = Data(std::vector<uint8_t>{1, 2});
     const Dictionary criteria = {{"email", Array{"a"}}};
     const Dictionary person = {{"matched", "email"}, {"value", "a"}};
-    EXPECT_EQ(send(0x141, {{"criteria", criteria}}), kFailure);
+    EXPECT_EQ(send(command::kFindCached, {{"criteria", criteria}}), kFailure);
     __VeltoIDDBAddFindPersonResultsToCache(Array{person});
-    const Dictionary found = send(0x141, {{"criteria", criteria}});
+    const Dictionary found = send(command::kFindCached, {{"criteria", criteria}});
     EXPECT_EQ((*found.array("result"))[0].asDictionary()->string("value"), "a");
-    EXPECT_EQ(send(0x141, {{"criteria", "email"}}), kFailure);
+    EXPECT_EQ(send(command::kFindCached, {{"criteria", "email"}}), kFailure);
 
     const Dictionary recordRequest = {{"VeltoID", kName}, {"CertificateType", kRecordType}};
     const Dictionary certificateRequest = {{"VeltoID", kName}};
-    EXPECT_EQ(send(0x170, recordRequest), kFailure);
-    EXPECT_EQ(errorCode(send(0x170, certificateRequest)), -1);
+    EXPECT_EQ(send(command::kCertificate, recordRequest), kFailure);
+    EXPECT_EQ(errorCode(send(command::kCertificate, certificateRequest)), -1);
     createAccount("d1");
-    EXPECT_EQ(send(0x170, recordRequest), (Dictionary{{"success", kOn}, {"result", Dictionary()}}));
+    EXPECT_EQ(send(command::kCertificate, recordRequest),
+              (Dictionary{{"success", kOn}, {"result", Dictionary()}}));
     setValues({{kRecord, data}, {kAsOf, date()}});
-    EXPECT_EQ(send(0x170, recordRequest)["result"], Value(Dictionary{{kRecord, data}, {kAsOf, date()}}));
-    EXPECT_EQ(errorCode(send(0x170, certificateRequest)), -100) << "no certificate";
+    EXPECT_EQ(send(command::kCertificate, recordRequest)["result"],
+              Value(Dictionary{{kRecord, data}, {kAsOf, date()}}));
+    EXPECT_EQ(errorCode(send(command::kCertificate, certificateRequest)), -100) << "no certificate";
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
     for (const Dictionary& request : {certificateRequest, Dictionary{{"encDsId", "d1"}}}) {
-        const Dictionary reply = send(0x170, request);
+        const Dictionary reply = send(command::kCertificate, request);
         ASSERT_TRUE(reply["result"].isDictionary());
         EXPECT_EQ(reply.dictionary("result")->string("SerialNumber"), "7");
     }
@@ -187,7 +191,7 @@ TEST_F(ServiceTest, WhatNeedsTheServerFailsWithoutOne) {
                                 {"identifier", "k"},
                                 {"criteria", Dictionary()},
                                 {"breadcrumb", Data(std::vector<uint8_t>{1})}};
-    for (const int64_t command : {0x140, 0x200, 0x201})
+    for (const int64_t command : {command::kFind, command::kSetBreadcrumb, command::kGetBreadcrumb})
         EXPECT_EQ(errorCode(send(command, request)), -100) << command;
     EXPECT_EQ(server_.takeMethods(),
               "authenticate findPerson authenticate saveBreadcrumbEk authenticate fetchBreadcrumbEk");
