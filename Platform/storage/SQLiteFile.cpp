@@ -23,32 +23,13 @@ namespace platform {
 namespace {
 
 constinit const LazyLibrary library("libsqlite3.so.0");
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_blob64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_int64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_null);
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_text64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_busy_timeout);
-VELTOID_LAZY_FUNCTION(library, sqlite3_clear_bindings);
-VELTOID_LAZY_FUNCTION(library, sqlite3_close);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_blob);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_bytes);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_int64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_text);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_type);
-VELTOID_LAZY_FUNCTION(library, sqlite3_db_config);
-VELTOID_LAZY_FUNCTION(library, sqlite3_errstr);
-VELTOID_LAZY_FUNCTION(library, sqlite3_exec);
-VELTOID_LAZY_FUNCTION(library, sqlite3_file_control);
-VELTOID_LAZY_FUNCTION(library, sqlite3_finalize);
-VELTOID_LAZY_FUNCTION(library, sqlite3_get_autocommit);
-VELTOID_LAZY_FUNCTION(library, sqlite3_open);
-VELTOID_LAZY_FUNCTION(library, sqlite3_open_v2);
-VELTOID_LAZY_FUNCTION(library, sqlite3_prepare_v2);
-VELTOID_LAZY_FUNCTION(library, sqlite3_prepare_v3);
-VELTOID_LAZY_FUNCTION(library, sqlite3_reset);
-VELTOID_LAZY_FUNCTION(library, sqlite3_step);
-VELTOID_LAZY_FUNCTION(library, sqlite3_system_errno);
-VELTOID_LAZY_FUNCTION(library, sqlite3_wal_checkpoint_v2);
+VELTOID_LAZY_FUNCTIONS(library, sqlite3_bind_blob64, sqlite3_bind_int64, sqlite3_bind_null,
+                       sqlite3_bind_text64, sqlite3_busy_timeout, sqlite3_clear_bindings, sqlite3_close,
+                       sqlite3_column_blob, sqlite3_column_bytes, sqlite3_column_int64, sqlite3_column_text,
+                       sqlite3_column_type, sqlite3_db_config, sqlite3_errstr, sqlite3_exec,
+                       sqlite3_file_control, sqlite3_finalize, sqlite3_get_autocommit, sqlite3_open,
+                       sqlite3_open_v2, sqlite3_prepare_v2, sqlite3_prepare_v3, sqlite3_reset, sqlite3_step,
+                       sqlite3_system_errno, sqlite3_wal_checkpoint_v2);
 
 constexpr int kBusyTimeoutMilliseconds = 5000;
 /// Damage is believed when it is seen twice; then the fresh file, and once more for a file that another
