@@ -52,7 +52,7 @@ class Reader {
 
     bool readArrayLike(const char* contents, int depth) {
         const std::string element(contents);
-        if (element == "y") return readData();
+        if (element == "y") return readBytes([this](Bytes bytes) { sink_.data(bytes); });
         if (depth >= kMaxMessageDepth) return replaceByNull("a" + element);
         if (element.front() != SD_BUS_TYPE_DICT_ENTRY_BEGIN) return readArray(element, depth + 1);
         const char keyType = element[1];
@@ -61,26 +61,18 @@ class Reader {
         return readDictionary(element.substr(1, element.size() - 2), keyType, depth + 1);
     }
 
-    std::optional<Bytes> readBytes() {
+    template <typename Take>
+    bool readBytes(Take take) {
         const void* bytes = nullptr;
         size_t size = 0;
-        if (sd_bus_message_read_array(message_, 'y', &bytes, &size) < 0) return std::nullopt;
-        return Bytes(static_cast<const uint8_t*>(bytes), size);
-    }
-
-    bool readData() {
-        const auto bytes = readBytes();
-        if (bytes) sink_.data(*bytes);
-        return bytes.has_value();
+        if (sd_bus_message_read_array(message_, 'y', &bytes, &size) < 0) return false;
+        take(Bytes(static_cast<const uint8_t*>(bytes), size));
+        return true;
     }
 
     bool readUUID() {
-        const auto bytes = readBytes();
-        if (bytes && bytes->size() == 16)
-            sink_.uuid(bytes->first<16>());
-        else if (bytes)
-            sink_.null();
-        return bytes.has_value();
+        return readBytes(
+            [this](Bytes bytes) { bytes.size() == 16 ? sink_.uuid(bytes.first<16>()) : sink_.null(); });
     }
 
     bool readArray(const std::string& element, int depth) {

@@ -116,11 +116,11 @@ std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query
     };
     if (!query.itemList) {
         collect(transaction.prepare(VELTOID_SELECT_ITEMS "class = ? ORDER BY sequence")
-                    .bindInteger(static_cast<int>(query.attributes.itemClass)));
+                    .bind(static_cast<int>(query.attributes.itemClass)));
         return rows;
     }
     for (const PersistentReference& reference : *query.itemList) {
-        collect(transaction.prepare(VELTOID_SELECT_ITEMS "id = ?").bindBlob(reference));
+        collect(transaction.prepare(VELTOID_SELECT_ITEMS "id = ?").bind(reference));
     }
     std::ranges::sort(rows, {}, &Row::sequence);
     const auto same = [](const Row& one, const Row& other) { return one.sequence == other.sequence; };
@@ -130,7 +130,7 @@ std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query
 
 KeychainStatus unsealRow(SQLiteTransaction& transaction, const Row& row, SecretBytes& value) {
     auto statement = transaction.prepare("SELECT sealed FROM items WHERE sequence = ?");
-    if (!statement.bindInteger(row.sequence).step()) return kKeychainNotAvailable;
+    if (!statement.bind(row.sequence).step()) return kKeychainNotAvailable;
     return unsealItem(transaction, row.identity, statement.blob(0), value);
 }
 
@@ -138,9 +138,9 @@ KeychainStatus insert(SQLiteTransaction& transaction, const ItemIdentity& identi
     auto statement = transaction.prepare(
         "INSERT INTO items (id, class, account, service, label, description, access_group, key_class,"
         " application_value, accessibility, sealed) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)");
-    statement.bindBlob(identity.id).bindInteger(static_cast<int>(identity.attributes.itemClass));
-    for (const auto text : kKeychainTexts) statement.bindOptionalText(identity.attributes.*text);
-    statement.bindInteger(static_cast<int>(identity.accessibility)).bindBlob(sealed).run();
+    statement.bind(identity.id, static_cast<int>(identity.attributes.itemClass));
+    for (const auto text : kKeychainTexts) statement.bind(identity.attributes.*text);
+    statement.bind(static_cast<int>(identity.accessibility), sealed).run();
     return kKeychainSuccess;
 }
 
@@ -159,11 +159,8 @@ KeychainStatus change(SQLiteTransaction& transaction, Row row, const Changes& ch
     transaction
         .prepare(
             "UPDATE items SET label = ?, access_group = ?, accessibility = ?, sealed = ? WHERE sequence = ?")
-        .bindOptionalText(row.identity.attributes.label)
-        .bindOptionalText(row.identity.attributes.accessGroup)
-        .bindInteger(static_cast<int>(row.identity.accessibility))
-        .bindBlob(sealed)
-        .bindInteger(row.sequence)
+        .bind(row.identity.attributes.label, row.identity.attributes.accessGroup,
+              static_cast<int>(row.identity.accessibility), sealed, row.sequence)
         .run();
     return kKeychainSuccess;
 }
@@ -194,8 +191,7 @@ KeychainStatus sealAll(SQLiteTransaction& transaction, const OpenedItems& items)
         const KeychainStatus status = sealItem(transaction, row.identity, value, sealed);
         if (status != kKeychainSuccess) return status;
         transaction.prepare("UPDATE items SET sealed = ? WHERE sequence = ?")
-            .bindBlob(sealed)
-            .bindInteger(row.sequence)
+            .bind(sealed, row.sequence)
             .run();
     }
     return kKeychainSuccess;
@@ -275,7 +271,7 @@ KeychainStatus remove(const KeychainQuery& query) {
     return changeItems([&](SQLiteTransaction& transaction) {
         const auto rows = find(transaction, query);
         for (const Row& row : rows) {
-            transaction.prepare("DELETE FROM items WHERE sequence = ?").bindInteger(row.sequence).run();
+            transaction.prepare("DELETE FROM items WHERE sequence = ?").bind(row.sequence).run();
         }
         return rows.empty() ? kKeychainItemNotFound : kKeychainSuccess;
     });

@@ -77,10 +77,7 @@ std::string nameAside(const std::string& path) {
         path + ".corrupt-" + calendarText(Clock::shared().now(), "%Y%m%d-%H%M%S").value_or("-");
     std::string name = base;
     const auto taken = [&] {
-        for (const char* suffix : kFileSuffixes) {
-            if (exists(name + suffix)) return true;
-        }
-        return false;
+        return std::ranges::any_of(kFileSuffixes, [&](const char* suffix) { return exists(name + suffix); });
     };
     for (int counter = 2; taken(); ++counter) name = base + '-' + std::to_string(counter);
     return name;
@@ -115,32 +112,24 @@ void SQLiteStatement::check(int code) {
     if (kindOf(code) != Kind::Fine) file_.fail(code);
 }
 
-SQLiteStatement& SQLiteStatement::bindInteger(int64_t value) {
-    if (statement_ != nullptr) check(sqlite3_bind_int64(statement_, ++bound_, value));
-    return *this;
+template <typename Bind, typename... Value>
+void SQLiteStatement::bindWith(const Bind& bind, Value... value) {
+    if (statement_ != nullptr) check(bind(statement_, ++bound_, value...));
 }
 
-SQLiteStatement& SQLiteStatement::bindText(std::string_view value) {
-    // A null pointer would bind NULL instead of an empty text.
+void SQLiteStatement::bindNext(int64_t value) { bindWith(sqlite3_bind_int64, value); }
+void SQLiteStatement::bindNull() { bindWith(sqlite3_bind_null); }
+
+// A null pointer would bind NULL instead of an empty value.
+
+void SQLiteStatement::bindNext(std::string_view value) {
     const char* const text = value.data() == nullptr ? "" : value.data();
-    if (statement_ != nullptr) {
-        check(sqlite3_bind_text64(statement_, ++bound_, text, value.size(), SQLITE_STATIC, SQLITE_UTF8));
-    }
-    return *this;
+    bindWith(sqlite3_bind_text64, text, value.size(), SQLITE_STATIC, uint8_t{SQLITE_UTF8});
 }
 
-SQLiteStatement& SQLiteStatement::bindOptionalText(const std::optional<std::string>& value) {
-    if (value) return bindText(std::string_view(*value));
-    if (statement_ != nullptr) check(sqlite3_bind_null(statement_, ++bound_));
-    return *this;
-}
-
-SQLiteStatement& SQLiteStatement::bindBlob(Bytes value) {
+void SQLiteStatement::bindNext(Bytes value) {
     const void* const bytes = value.empty() ? "" : static_cast<const void*>(value.data());
-    if (statement_ != nullptr) {
-        check(sqlite3_bind_blob64(statement_, ++bound_, bytes, value.size(), SQLITE_STATIC));
-    }
-    return *this;
+    bindWith(sqlite3_bind_blob64, bytes, value.size(), SQLITE_STATIC);
 }
 
 bool SQLiteStatement::step() {
