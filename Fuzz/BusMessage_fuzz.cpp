@@ -141,7 +141,8 @@ class Appender {
 };
 
 veltoid::MessageValue read(sd_bus_message* message) {
-    if (sd_bus_message_seal(message, 1, 0) < 0 || !platform::bus::hasDictionaryBody(message)) return {};
+    if (sd_bus_message_seal(message, 1, 0) < 0 || sd_bus_message_has_signature(message, "a{sv}") <= 0)
+        return {};
     veltoid::MessageValueBuilder builder;
     (void)platform::bus::peekInteger(message, "command");
     platform::bus::readDictionary(message, builder);

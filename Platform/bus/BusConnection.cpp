@@ -81,18 +81,10 @@ void process(State& state) {
     enable(state.more, state.serve && state.serve() ? SD_EVENT_ON : SD_EVENT_OFF);
 }
 
-int arrived(sd_event_source* /*source*/, int /*descriptor*/, uint32_t /*events*/, void* context) noexcept {
-    process(*static_cast<State*>(context));
-    return 0;
-}
-
-int timedOut(sd_event_source* /*source*/, uint64_t /*microseconds*/, void* context) noexcept {
-    process(*static_cast<State*>(context));
-    return 0;
-}
-
-int moreIsWaiting(sd_event_source* /*source*/, void* context) noexcept {
-    process(*static_cast<State*>(context));
+/// What every source calls, whatever it tells beside.
+template <typename... Details>
+int isReady(sd_event_source* /*source*/, Details... /*details*/) noexcept {
+    process(shared());
     return 0;
 }
 
@@ -112,11 +104,10 @@ int prepareWait(sd_event_source* /*source*/, void* context) noexcept {
 /// Instead of sd_bus_attach_event, which goes through the event loop for each message.
 int watch(State& state) {
     sd_event* loop = event_loop::handle();
-    int result = sd_event_add_io(loop, &state.arrival, sd_bus_get_fd(state.bus), 0, arrived, &state);
-    if (result >= 0)
-        result = sd_event_add_time(loop, &state.timeout, CLOCK_MONOTONIC, 0, 0, timedOut, &state);
+    int result = sd_event_add_io(loop, &state.arrival, sd_bus_get_fd(state.bus), 0, isReady, &state);
+    if (result >= 0) result = sd_event_add_time(loop, &state.timeout, CLOCK_MONOTONIC, 0, 0, isReady, &state);
     if (result >= 0) result = sd_event_source_set_enabled(state.timeout, SD_EVENT_OFF);
-    if (result >= 0) result = sd_event_add_defer(loop, &state.more, moreIsWaiting, &state);
+    if (result >= 0) result = sd_event_add_defer(loop, &state.more, isReady, &state);
     // It is always pending while it is on, and would go before everything else.
     if (result >= 0) result = sd_event_source_set_priority(state.more, SD_EVENT_PRIORITY_IDLE);
     if (result >= 0) result = sd_event_source_set_prepare(state.arrival, prepareWait);

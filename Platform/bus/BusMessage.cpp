@@ -4,6 +4,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -30,7 +31,7 @@ class Reader {
         if (sd_bus_message_peek_type(message_, &type, &contents) <= 0) return false;
         switch (type) {
             case SD_BUS_TYPE_VARIANT:
-                return readVariant(contents, depth);
+                return inside(type, contents, [&] { return readValue(depth); });
             case SD_BUS_TYPE_ARRAY:
                 return readArrayLike(contents, depth);
             case SD_BUS_TYPE_STRUCT:
@@ -41,18 +42,17 @@ class Reader {
     }
 
   private:
-    bool readVariant(const char* contents, int depth) {
-        // A copy: the message may reuse the text while the container is entered.
-        const std::string signature(contents);
-        if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_VARIANT, signature.c_str()) <= 0)
-            return false;
-        if (!readValue(depth)) return false;
-        return sd_bus_message_exit_container(message_) >= 0;
+    /// Reads in the container at the current position. The type of what it contains is a copy: the message
+    /// may reuse its own text while the container is entered.
+    template <typename Read>
+    bool inside(char type, const std::string& contents, Read readContents) {
+        return sd_bus_message_enter_container(message_, type, contents.c_str()) > 0 && readContents() &&
+               sd_bus_message_exit_container(message_) >= 0;
     }
 
     bool readArrayLike(const char* contents, int depth) {
         const std::string element(contents);
-        if (element == "y") return readData();
+        if (element == "y") return readBytes([this](Bytes bytes) { sink_.data(bytes); });
         if (depth >= kMaxMessageDepth) return replaceByNull("a" + element);
         if (element.front() != SD_BUS_TYPE_DICT_ENTRY_BEGIN) return readArray(element, depth + 1);
         const char keyType = element[1];
@@ -61,59 +61,49 @@ class Reader {
         return readDictionary(element.substr(1, element.size() - 2), keyType, depth + 1);
     }
 
-    bool readData() {
+    template <typename Take>
+    bool readBytes(Take take) {
         const void* bytes = nullptr;
         size_t size = 0;
         if (sd_bus_message_read_array(message_, 'y', &bytes, &size) < 0) return false;
-        sink_.data({static_cast<const uint8_t*>(bytes), size});
+        take(Bytes(static_cast<const uint8_t*>(bytes), size));
         return true;
     }
 
+    bool readUUID() {
+        return readBytes(
+            [this](Bytes bytes) { bytes.size() == 16 ? sink_.uuid(bytes.first<16>()) : sink_.null(); });
+    }
+
     bool readArray(const std::string& element, int depth) {
-        if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_ARRAY, element.c_str()) < 0) return false;
-        sink_.beginArray();
-        while (sd_bus_message_at_end(message_, false) == 0)
-            if (!readValue(depth)) return false;
-        sink_.endArray();
-        return sd_bus_message_exit_container(message_) >= 0;
+        return inside(SD_BUS_TYPE_ARRAY, element, [&] {
+            sink_.beginArray();
+            while (sd_bus_message_at_end(message_, false) == 0)
+                if (!readValue(depth)) return false;
+            sink_.endArray();
+            return true;
+        });
     }
 
     bool readDictionary(const std::string& entry, char keyType, int depth) {
-        if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_ARRAY, ("{" + entry + "}").c_str()) < 0)
-            return false;
-        sink_.beginDictionary();
-        while (sd_bus_message_at_end(message_, false) == 0) {
-            const char* key = nullptr;
-            if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_DICT_ENTRY, entry.c_str()) <= 0 ||
-                sd_bus_message_read_basic(message_, keyType, static_cast<void*>(&key)) <= 0)
-                return false;
-            sink_.key(key);
-            if (!readValue(depth) || sd_bus_message_exit_container(message_) < 0) return false;
-        }
-        sink_.endDictionary();
-        return sd_bus_message_exit_container(message_) >= 0;
+        const auto readEntry = [&] {
+            return read<const char*>(keyType, &ValueSink::key) && readValue(depth);
+        };
+        return inside(SD_BUS_TYPE_ARRAY, "{" + entry + "}", [&] {
+            sink_.beginDictionary();
+            while (sd_bus_message_at_end(message_, false) == 0)
+                if (!inside(SD_BUS_TYPE_DICT_ENTRY, entry, readEntry)) return false;
+            sink_.endDictionary();
+            return true;
+        });
     }
 
     /// (d) is a date, (ay) of 16 bytes a UUID; nothing else has a meaning.
-    bool readStruct(const char* contents) {
-        const std::string members(contents);
+    bool readStruct(const std::string& members) {
         if (members != "d" && members != "ay") return replaceByNull("(" + members + ")");
-        if (sd_bus_message_enter_container(message_, SD_BUS_TYPE_STRUCT, members.c_str()) <= 0) return false;
-        if (members == "d") {
-            double seconds = 0;
-            if (sd_bus_message_read_basic(message_, SD_BUS_TYPE_DOUBLE, &seconds) <= 0) return false;
-            sink_.date(seconds);
-        } else {
-            const void* bytes = nullptr;
-            size_t size = 0;
-            if (sd_bus_message_read_array(message_, 'y', &bytes, &size) < 0) return false;
-            if (size == 16) {
-                sink_.uuid(std::span<const uint8_t, 16>(static_cast<const uint8_t*>(bytes), 16));
-            } else {
-                sink_.null();
-            }
-        }
-        return sd_bus_message_exit_container(message_) >= 0;
+        return inside(SD_BUS_TYPE_STRUCT, members, [&] {
+            return members == "d" ? read<double>(SD_BUS_TYPE_DOUBLE, &ValueSink::date) : readUUID();
+        });
     }
 
     bool replaceByNull(const std::string& signature) {
@@ -122,65 +112,48 @@ class Reader {
         return true;
     }
 
-    template <typename T>
-    bool readInteger(char type) {
-        T value{};
-        if (sd_bus_message_read_basic(message_, type, &value) <= 0) return false;
-        sink_.integer(static_cast<int64_t>(value));
+    template <typename Wire, typename Value>
+    bool read(char type, void (ValueSink::*take)(Value)) {
+        Wire value{};
+        if (sd_bus_message_read_basic(message_, type, static_cast<void*>(&value)) <= 0) return false;
+        (sink_.*take)(static_cast<Value>(value));
         return true;
     }
 
-    bool readText(char type) {
+    bool readSignature() {
         const char* text = nullptr;
-        if (sd_bus_message_read_basic(message_, type, static_cast<void*>(&text)) <= 0) return false;
-        if (type == SD_BUS_TYPE_SIGNATURE && *text == '\0') {
-            sink_.null();
-        } else {
-            sink_.string(text);
-        }
+        if (sd_bus_message_read_basic(message_, SD_BUS_TYPE_SIGNATURE, static_cast<void*>(&text)) <= 0)
+            return false;
+        *text == '\0' ? sink_.null() : sink_.string(text);
         return true;
     }
 
     bool readBasic(char type) {
         switch (type) {
             case SD_BUS_TYPE_BYTE:
-                return readInteger<uint8_t>(type);
+                return read<uint8_t>(type, &ValueSink::integer);
             case SD_BUS_TYPE_INT16:
-                return readInteger<int16_t>(type);
+                return read<int16_t>(type, &ValueSink::integer);
             case SD_BUS_TYPE_UINT16:
-                return readInteger<uint16_t>(type);
+                return read<uint16_t>(type, &ValueSink::integer);
             case SD_BUS_TYPE_INT32:
-                return readInteger<int32_t>(type);
+                return read<int32_t>(type, &ValueSink::integer);
             case SD_BUS_TYPE_UINT32:
-                return readInteger<uint32_t>(type);
+                return read<uint32_t>(type, &ValueSink::integer);
             case SD_BUS_TYPE_INT64:
-                return readInteger<int64_t>(type);
-            case SD_BUS_TYPE_UINT64: {
-                uint64_t value = 0;
-                if (sd_bus_message_read_basic(message_, type, &value) <= 0) return false;
-                sink_.unsignedInteger(value);
-                return true;
-            }
-            case SD_BUS_TYPE_BOOLEAN: {
-                int value = 0;
-                if (sd_bus_message_read_basic(message_, type, &value) <= 0) return false;
-                sink_.boolean(value != 0);
-                return true;
-            }
-            case SD_BUS_TYPE_DOUBLE: {
-                double value = 0;
-                if (sd_bus_message_read_basic(message_, type, &value) <= 0) return false;
-                sink_.real(value);
-                return true;
-            }
-            case SD_BUS_TYPE_UNIX_FD: {
-                int descriptor = -1;
-                if (sd_bus_message_read_basic(message_, type, &descriptor) <= 0) return false;
-                sink_.fileDescriptor(descriptor);
-                return true;
-            }
+                return read<int64_t>(type, &ValueSink::integer);
+            case SD_BUS_TYPE_UINT64:
+                return read<uint64_t>(type, &ValueSink::unsignedInteger);
+            case SD_BUS_TYPE_BOOLEAN:
+                return read<int>(type, &ValueSink::boolean);
+            case SD_BUS_TYPE_DOUBLE:
+                return read<double>(type, &ValueSink::real);
+            case SD_BUS_TYPE_UNIX_FD:
+                return read<int>(type, &ValueSink::fileDescriptor);
+            case SD_BUS_TYPE_SIGNATURE:
+                return readSignature();
             default:
-                return readText(type);
+                return read<const char*>(type, &ValueSink::string);
         }
     }
 
@@ -222,25 +195,17 @@ class MessageSink : public ValueSink {
     }
 
     void data(Bytes bytes) override {
-        openVariant("ay");
-        check(sd_bus_message_append_array(message_, 'y', bytes.data(), bytes.size()));
-        closeVariant();
+        variant("ay", [&] { appendBytes(bytes); });
     }
-
     void date(double seconds) override {
-        openVariant("(d)");
-        check(sd_bus_message_open_container(message_, SD_BUS_TYPE_STRUCT, "d"));
-        check(sd_bus_message_append_basic(message_, SD_BUS_TYPE_DOUBLE, &seconds));
-        check(sd_bus_message_close_container(message_));
-        closeVariant();
+        variant("(d)", [&] { check(sd_bus_message_append(message_, "(d)", seconds)); });
     }
-
     void uuid(std::span<const uint8_t, 16> bytes) override {
-        openVariant("(ay)");
-        check(sd_bus_message_open_container(message_, SD_BUS_TYPE_STRUCT, "ay"));
-        check(sd_bus_message_append_array(message_, 'y', bytes.data(), bytes.size()));
-        check(sd_bus_message_close_container(message_));
-        closeVariant();
+        variant("(ay)", [&] {
+            check(sd_bus_message_open_container(message_, SD_BUS_TYPE_STRUCT, "ay"));
+            appendBytes(bytes);
+            check(sd_bus_message_close_container(message_));
+        });
     }
 
     void beginArray() override { begin("av", "v", 2); }
@@ -261,39 +226,43 @@ class MessageSink : public ValueSink {
     }
 
     void openVariant(const char* signature) {
-        if (tooDeep_ > 0) return;
         if (!entryOpen_.empty())
             check(sd_bus_message_open_container(message_, SD_BUS_TYPE_VARIANT, signature));
     }
 
+    /// Closes the dictionary entry, too, whose value the variant was.
     void closeVariant() {
-        if (tooDeep_ > 0) return;
-        if (!entryOpen_.empty()) check(sd_bus_message_close_container(message_));
-        closeEntry();
-    }
-
-    void closeEntry() {
-        if (entryOpen_.empty() || !entryOpen_.back()) return;
+        if (entryOpen_.empty()) return;
+        check(sd_bus_message_close_container(message_));
+        if (!entryOpen_.back()) return;
         entryOpen_.back() = false;
         check(sd_bus_message_close_container(message_));
     }
 
-    void basic(const char* signature, char type, const void* value) {
+    template <typename Append>
+    void variant(const char* signature, Append append) {
         if (tooDeep_ > 0) return;
         openVariant(signature);
-        check(sd_bus_message_append_basic(message_, type, value));
+        append();
         closeVariant();
     }
 
+    void basic(const char* signature, char type, const void* value) {
+        variant(signature, [&] { check(sd_bus_message_append_basic(message_, type, value)); });
+    }
+
+    void appendBytes(Bytes bytes) {
+        check(sd_bus_message_append_array(message_, 'y', bytes.data(), bytes.size()));
+    }
+
     void begin(const char* signature, const char* contents, int wireDepth) {
-        const bool outermost = entryOpen_.empty();
         if (tooDeep_ > 0 || wireDepth_ + wireDepth > kMaxWireDepth ||
             static_cast<int>(entryOpen_.size()) >= kMaxMessageDepth) {
             if (tooDeep_ == 0) null();
             ++tooDeep_;
             return;
         }
-        if (!outermost) openVariant(signature);
+        openVariant(signature);
         check(sd_bus_message_open_container(message_, SD_BUS_TYPE_ARRAY, contents));
         wireDepth_ += wireDepth;
         entryOpen_.push_back(false);
@@ -307,7 +276,7 @@ class MessageSink : public ValueSink {
         entryOpen_.pop_back();
         wireDepth_ -= wireDepth;
         check(sd_bus_message_close_container(message_));
-        if (!entryOpen_.empty()) closeVariant();
+        closeVariant();
     }
 
     sd_bus_message* message_;
@@ -320,8 +289,6 @@ class MessageSink : public ValueSink {
 };
 
 }  // namespace
-
-bool hasDictionaryBody(sd_bus_message* message) { return sd_bus_message_has_signature(message, "a{sv}") > 0; }
 
 void readDictionary(sd_bus_message* message, ValueSink& sink) {
     sd_bus_message_rewind(message, true);

@@ -11,9 +11,6 @@ struct sd_bus_message;
 
 namespace platform::bus {
 
-/// Whether the body is one dictionary with string keys and variant values.
-bool hasDictionaryBody(sd_bus_message* message);
-
 /// Writes the dictionary of the body into the sink, from the start of the body.
 void readDictionary(sd_bus_message* message, ValueSink& sink);
 

@@ -136,7 +136,7 @@ class Systemd : public ServiceManager {
             return;
         }
         answers_.push_back(answer);
-        if (answers_.size() == 1 && askForOwnUnit(onAnswer) < 0) giveAnswers(false);
+        if (answers_.size() == 1 && askForOwnUnit(calling<&Systemd::onAnswer>) < 0) giveAnswers(false);
     }
 
     void announceReady() override { sd_notify(0, "READY=1"); }
@@ -154,7 +154,7 @@ class Systemd : public ServiceManager {
         underWay_ = true;
         stops_ = 0;
         transactions::began();
-        const int result = isUnit_ ? createTimer() : askForOwnUnit(onOwnUnit);
+        const int result = isUnit_ ? createTimer() : askForOwnUnit(calling<&Systemd::onOwnUnit>);
         if (result < 0) fail(std::strerror(-result));
     }
 
@@ -193,20 +193,22 @@ class Systemd : public ServiceManager {
         changed_ = false;
         const int result = watchJobs();
         const Message call = callTo(bus::connection(), "StartTransientUnit");
-        return result < 0 ? result : sendWith(call, appendTimer(call.get(), date_), onCreating);
+        return result < 0 ? result
+                          : sendWith(call, appendTimer(call.get(), date_), calling<&Systemd::onCreating>);
     }
 
     int stopTimer() {
         const Message call = callTo(bus::connection(), "StopUnit");
         return sendWith(call, sd_bus_message_append(call.get(), "ss", product().timerUnit, "replace"),
-                        onStopping);
+                        calling<&Systemd::onStopping>);
     }
 
     /// systemd reports the end of a job to whoever has asked for it.
     int watchJobs() {
         if (jobRemoved_ != nullptr) return 0;
         return sd_bus_match_signal_async(bus::connection(), &jobRemoved_, nullptr, kManagerPath,
-                                         kManagerInterface, "JobRemoved", onJobRemoved, nullptr, this);
+                                         kManagerInterface, "JobRemoved", calling<&Systemd::onJobRemoved>,
+                                         nullptr, this);
     }
 
     void proceed(int result) {
@@ -215,32 +217,32 @@ class Systemd : public ServiceManager {
 
     // --- What the manager says
 
-    static int onOwnUnit(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
-        auto& self = *static_cast<Systemd*>(context);
-        self.isUnit_ = isServiceUnit(reply);
-        if (self.isUnit_)
-            self.proceed(self.createTimer());
-        else
-            self.end();
+    template <void (Systemd::*handle)(sd_bus_message*)>
+    static int calling(sd_bus_message* message, void* context, sd_bus_error* /*error*/) noexcept {
+        (static_cast<Systemd*>(context)->*handle)(message);
         return 0;
     }
 
-    static int onCreating(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
-        auto& self = *static_cast<Systemd*>(context);
-        if (sd_bus_message_is_method_error(reply, kUnitExists) > 0 && self.stops_++ < kMostStops)
-            self.proceed(self.stopTimer());
+    void onOwnUnit(sd_bus_message* reply) {
+        isUnit_ = isServiceUnit(reply);
+        if (isUnit_)
+            proceed(createTimer());
         else
-            self.waitForJob(reply, &Systemd::created);
-        return 0;
+            end();
     }
 
-    static int onStopping(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
-        auto& self = *static_cast<Systemd*>(context);
+    void onCreating(sd_bus_message* reply) {
+        if (sd_bus_message_is_method_error(reply, kUnitExists) > 0 && stops_++ < kMostStops)
+            proceed(stopTimer());
+        else
+            waitForJob(reply, &Systemd::created);
+    }
+
+    void onStopping(sd_bus_message* reply) {
         if (sd_bus_message_is_method_error(reply, kNoSuchUnit) > 0)
-            self.proceed(self.createTimer());  // it has just elapsed
+            proceed(createTimer());  // it has just elapsed
         else
-            self.waitForJob(reply, &Systemd::stopped);
-        return 0;
+            waitForJob(reply, &Systemd::stopped);
     }
 
     void waitForJob(sd_bus_message* reply, void (Systemd::*then)(const std::string& outcome)) {
@@ -250,16 +252,13 @@ class Systemd : public ServiceManager {
         job_ = {job, then};
     }
 
-    static int onJobRemoved(sd_bus_message* signal, void* context, sd_bus_error* /*error*/) noexcept {
-        auto& self = *static_cast<Systemd*>(context);
+    void onJobRemoved(sd_bus_message* signal) {
         uint32_t id = 0;
         const char* job = nullptr;
         const char* unit = nullptr;
         const char* outcome = nullptr;
-        if (sd_bus_message_read(signal, "uoss", &id, &job, &unit, &outcome) < 0 || job != self.job_.path)
-            return 0;
-        (self.*std::exchange(self.job_, {}).then)(outcome);
-        return 0;
+        if (sd_bus_message_read(signal, "uoss", &id, &job, &unit, &outcome) < 0 || job != job_.path) return;
+        (this->*std::exchange(job_, {}).then)(outcome);
     }
 
     void created(const std::string& outcome) {
@@ -274,10 +273,7 @@ class Systemd : public ServiceManager {
 
     void stopped(const std::string& /*outcome*/) { proceed(createTimer()); }
 
-    static int onAnswer(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
-        static_cast<Systemd*>(context)->giveAnswers(isServiceUnit(reply));
-        return 0;
-    }
+    void onAnswer(sd_bus_message* reply) { giveAnswers(isServiceUnit(reply)); }
 
     void giveAnswers(bool can) {
         for (const auto& answer : std::exchange(answers_, {})) answer(can && handedOver_);

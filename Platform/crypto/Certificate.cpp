@@ -15,44 +15,19 @@ namespace platform {
 namespace {
 
 using openssl::library;
-VELTOID_LAZY_FUNCTION(library, ASN1_INTEGER_to_BN);
-VELTOID_LAZY_FUNCTION(library, ASN1_STRING_to_UTF8);
-VELTOID_LAZY_FUNCTION(library, ASN1_TIME_to_tm);
-VELTOID_LAZY_FUNCTION(library, BIO_ctrl);
-VELTOID_LAZY_FUNCTION(library, BIO_free);
-VELTOID_LAZY_FUNCTION(library, BIO_new);
-VELTOID_LAZY_FUNCTION(library, BIO_s_mem);
-VELTOID_LAZY_FUNCTION(library, BN_bn2hex);
-VELTOID_LAZY_FUNCTION(library, BN_free);
-VELTOID_LAZY_FUNCTION(library, CRYPTO_free);
-VELTOID_LAZY_FUNCTION(library, d2i_X509);
-VELTOID_LAZY_FUNCTION(library, i2d_X509_PUBKEY);
-VELTOID_LAZY_FUNCTION(library, X509_free);
-VELTOID_LAZY_FUNCTION(library, X509_get0_notAfter);
-VELTOID_LAZY_FUNCTION(library, X509_get0_notBefore);
-VELTOID_LAZY_FUNCTION(library, X509_get0_serialNumber);
-VELTOID_LAZY_FUNCTION(library, X509_get_issuer_name);
-VELTOID_LAZY_FUNCTION(library, X509_get_subject_name);
-VELTOID_LAZY_FUNCTION(library, X509_get_X509_PUBKEY);
-VELTOID_LAZY_FUNCTION(library, X509_NAME_ENTRY_get_data);
-VELTOID_LAZY_FUNCTION(library, X509_NAME_get_entry);
-VELTOID_LAZY_FUNCTION(library, X509_NAME_get_index_by_NID);
-VELTOID_LAZY_FUNCTION(library, X509_NAME_print_ex);
+VELTOID_LAZY_FUNCTIONS(library, ASN1_INTEGER_to_BN, ASN1_STRING_to_UTF8, ASN1_TIME_to_tm, BIO_ctrl, BIO_free,
+                       BIO_new, BIO_s_mem, BN_bn2hex, BN_free, CRYPTO_free, d2i_X509, i2d_X509_PUBKEY,
+                       X509_free, X509_get0_notAfter, X509_get0_notBefore, X509_get0_serialNumber,
+                       X509_get_issuer_name, X509_get_subject_name, X509_get_X509_PUBKEY,
+                       X509_NAME_ENTRY_get_data, X509_NAME_get_entry, X509_NAME_get_index_by_NID,
+                       X509_NAME_print_ex);
 
-void freeMemory(void* memory) { CRYPTO_free(memory, __FILE__, __LINE__); }
-
-struct Deleter {
-    void operator()(X509* certificate) const { X509_free(certificate); }
-    void operator()(BIO* stream) const { BIO_free(stream); }
-    void operator()(BIGNUM* number) const { BN_free(number); }
-};
 struct MemoryDeleter {
-    void operator()(void* memory) const { freeMemory(memory); }
+    void operator()(void* memory) const { CRYPTO_free(memory, __FILE__, __LINE__); }
 };
-using LibraryText = std::unique_ptr<char, MemoryDeleter>;
 
 std::string nameText(const X509_NAME* name) {
-    const std::unique_ptr<BIO, Deleter> stream(BIO_new(BIO_s_mem()));
+    const LazyOwner<BIO, BIO_free> stream(BIO_new(BIO_s_mem()));
     // Texts are UTF-8 here: nothing needs to be escaped for being beyond ASCII.
     constexpr unsigned long kFlags = XN_FLAG_RFC2253 & ~static_cast<unsigned long>(ASN1_STRFLGS_ESC_MSB);
     if (stream == nullptr || name == nullptr || X509_NAME_print_ex(stream.get(), name, 0, kFlags) < 0)
@@ -73,9 +48,8 @@ std::string attributeText(const X509_NAME* name, int identifier) {
 }
 
 std::string serialText(const X509* certificate) {
-    const std::unique_ptr<BIGNUM, Deleter> number(
-        ASN1_INTEGER_to_BN(X509_get0_serialNumber(certificate), nullptr));
-    const LibraryText text(number != nullptr ? BN_bn2hex(number.get()) : nullptr);
+    const LazyOwner<BIGNUM, BN_free> number(ASN1_INTEGER_to_BN(X509_get0_serialNumber(certificate), nullptr));
+    const std::unique_ptr<char, MemoryDeleter> text(number != nullptr ? BN_bn2hex(number.get()) : nullptr);
     return text != nullptr ? text.get() : "";
 }
 
@@ -86,14 +60,6 @@ std::optional<double> secondsOf(const ASN1_TIME* time) {
                                             fields.tm_hour, fields.tm_min, fields.tm_sec});
 }
 
-std::vector<uint8_t> publicKeyOf(const X509* certificate) {
-    unsigned char* der = nullptr;
-    const int size = i2d_X509_PUBKEY(X509_get_X509_PUBKEY(certificate), &der);
-    if (size <= 0) return {};
-    const std::unique_ptr<unsigned char, MemoryDeleter> owner(der);
-    return {der, der + size};
-}
-
 std::optional<Certificate> describe(const X509* certificate, Bytes der) {
     const auto notBefore = secondsOf(X509_get0_notBefore(certificate));
     const auto notAfter = secondsOf(X509_get0_notAfter(certificate));
@@ -101,24 +67,23 @@ std::optional<Certificate> describe(const X509* certificate, Bytes der) {
     const X509_NAME* subject = X509_get_subject_name(certificate);
     std::string summary = attributeText(subject, NID_commonName);
     if (summary.empty()) summary = attributeText(subject, NID_organizationName);
-    return Certificate{{der.begin(), der.end()},
-                       std::move(summary),
-                       nameText(subject),
-                       nameText(X509_get_issuer_name(certificate)),
-                       serialText(certificate),
-                       *notBefore,
-                       *notAfter,
-                       publicKeyOf(certificate)};
+    return Certificate{
+        {der.begin(), der.end()},
+        std::move(summary),
+        nameText(subject),
+        nameText(X509_get_issuer_name(certificate)),
+        serialText(certificate),
+        *notBefore,
+        *notAfter,
+        openssl::encoded<std::vector<uint8_t>>(i2d_X509_PUBKEY, X509_get_X509_PUBKEY(certificate))};
 }
 
 }  // namespace
 
 std::optional<Certificate> readCertificate(Bytes der) {
-    if (der.empty() || der.size() > kMaxCertificateBytes) return std::nullopt;
-    const unsigned char* end = der.data();
-    const std::unique_ptr<X509, Deleter> parsed(d2i_X509(nullptr, &end, static_cast<long>(der.size())));
+    const auto parsed = openssl::decoded<LazyOwner<X509, X509_free>>(d2i_X509, der, kMaxCertificateBytes);
     std::optional<Certificate> certificate;
-    if (parsed != nullptr && end == der.data() + der.size()) certificate = describe(parsed.get(), der);
+    if (parsed != nullptr) certificate = describe(parsed.get(), der);
     openssl::clearErrors();
     return certificate;
 }

@@ -7,7 +7,6 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
-#include <memory>
 #include <string>
 
 #include "Platform/crypto/OpenSSLLibrary.h"
@@ -19,29 +18,17 @@ namespace platform {
 namespace {
 
 using openssl::library;
-VELTOID_LAZY_FUNCTION(library, EVP_aes_256_gcm);
-VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_ctrl);
-VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_free);
-VELTOID_LAZY_FUNCTION(library, EVP_CIPHER_CTX_new);
-VELTOID_LAZY_FUNCTION(library, EVP_DecryptFinal_ex);
-VELTOID_LAZY_FUNCTION(library, EVP_DecryptInit_ex2);
-VELTOID_LAZY_FUNCTION(library, EVP_DecryptUpdate);
-VELTOID_LAZY_FUNCTION(library, EVP_Digest);
-VELTOID_LAZY_FUNCTION(library, EVP_EncryptFinal_ex);
-VELTOID_LAZY_FUNCTION(library, EVP_EncryptInit_ex2);
-VELTOID_LAZY_FUNCTION(library, EVP_EncryptUpdate);
-VELTOID_LAZY_FUNCTION(library, EVP_PBE_scrypt);
-VELTOID_LAZY_FUNCTION(library, EVP_sha256);
+VELTOID_LAZY_FUNCTIONS(library, EVP_aes_256_gcm, EVP_CIPHER_CTX_ctrl, EVP_CIPHER_CTX_free, EVP_CIPHER_CTX_new,
+                       EVP_DecryptFinal_ex, EVP_DecryptInit_ex2, EVP_DecryptUpdate, EVP_Digest,
+                       EVP_EncryptFinal_ex, EVP_EncryptInit_ex2, EVP_EncryptUpdate, EVP_PBE_scrypt,
+                       EVP_sha256);
 
 constexpr size_t kNonceBytes = 12;
 constexpr size_t kTagBytes = 16;
 /// The library counts in int: longer input goes in pieces.
 constexpr size_t kPieceBytes = size_t{1} << 30U;
 
-struct CipherContextDeleter {
-    void operator()(EVP_CIPHER_CTX* context) const { EVP_CIPHER_CTX_free(context); }
-};
-using CipherContext = std::unique_ptr<EVP_CIPHER_CTX, CipherContextDeleter>;
+using CipherContext = LazyOwner<EVP_CIPHER_CTX, EVP_CIPHER_CTX_free>;
 
 using CipherUpdate = int (*)(EVP_CIPHER_CTX*, unsigned char*, int*, const unsigned char*, int);
 

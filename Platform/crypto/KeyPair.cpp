@@ -4,8 +4,6 @@
 #include <openssl/x509.h>
 #include <openssl/x509v3.h>
 
-#include <memory>
-
 #include "Platform/crypto/OpenSSLLibrary.h"
 #include "Platform/runtime/SystemLog.h"
 
@@ -14,74 +12,34 @@ namespace platform {
 namespace {
 
 using openssl::library;
-VELTOID_LAZY_FUNCTION(library, ASN1_BIT_STRING_free);
-VELTOID_LAZY_FUNCTION(library, ASN1_BIT_STRING_new);
-VELTOID_LAZY_FUNCTION(library, ASN1_BIT_STRING_set_bit);
-VELTOID_LAZY_FUNCTION(library, d2i_PKCS8_PRIV_KEY_INFO);
-VELTOID_LAZY_FUNCTION(library, d2i_PUBKEY);
-VELTOID_LAZY_FUNCTION(library, EVP_PKCS82PKEY);
-VELTOID_LAZY_FUNCTION(library, EVP_PKEY2PKCS8);
-VELTOID_LAZY_FUNCTION(library, EVP_PKEY_free);
-VELTOID_LAZY_FUNCTION(library, EVP_PKEY_Q_keygen);
-VELTOID_LAZY_FUNCTION(library, EVP_sha256);
-VELTOID_LAZY_FUNCTION(library, i2d_PKCS8_PRIV_KEY_INFO);
-VELTOID_LAZY_FUNCTION(library, i2d_PUBKEY);
-VELTOID_LAZY_FUNCTION(library, i2d_X509_REQ);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_free);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_new_null);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_push);
-VELTOID_LAZY_FUNCTION(library, PKCS8_PRIV_KEY_INFO_free);
-VELTOID_LAZY_FUNCTION(library, X509_EXTENSION_free);
-VELTOID_LAZY_FUNCTION(library, X509_NAME_add_entry_by_NID);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_add_extensions);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_free);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_get_subject_name);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_new);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_set_pubkey);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_set_version);
-VELTOID_LAZY_FUNCTION(library, X509_REQ_sign);
-VELTOID_LAZY_FUNCTION(library, X509V3_EXT_i2d);
+VELTOID_LAZY_FUNCTIONS(library, ASN1_BIT_STRING_free, ASN1_BIT_STRING_new, ASN1_BIT_STRING_set_bit,
+                       d2i_PKCS8_PRIV_KEY_INFO, d2i_PUBKEY, EVP_PKCS82PKEY, EVP_PKEY2PKCS8, EVP_PKEY_free,
+                       EVP_PKEY_Q_keygen, EVP_sha256, i2d_PKCS8_PRIV_KEY_INFO, i2d_PUBKEY, i2d_X509_REQ,
+                       OPENSSL_sk_free, OPENSSL_sk_new_null, OPENSSL_sk_push, PKCS8_PRIV_KEY_INFO_free,
+                       X509_EXTENSION_free, X509_NAME_add_entry_by_NID, X509_REQ_add_extensions,
+                       X509_REQ_free, X509_REQ_get_subject_name, X509_REQ_new, X509_REQ_set_pubkey,
+                       X509_REQ_set_version, X509_REQ_sign, X509V3_EXT_i2d);
 
-template <const auto& Free>
-struct Freeing {
-    template <typename Object>
-    void operator()(Object* object) const {
-        Free(object);
-    }
-};
-using Key = std::unique_ptr<EVP_PKEY, Freeing<EVP_PKEY_free>>;
-using PrivateKeyInfo = std::unique_ptr<PKCS8_PRIV_KEY_INFO, Freeing<PKCS8_PRIV_KEY_INFO_free>>;
-using CertificationRequest = std::unique_ptr<X509_REQ, Freeing<X509_REQ_free>>;
-using BitString = std::unique_ptr<ASN1_BIT_STRING, Freeing<ASN1_BIT_STRING_free>>;
-using Extension = std::unique_ptr<X509_EXTENSION, Freeing<X509_EXTENSION_free>>;
-using Extensions = std::unique_ptr<OPENSSL_STACK, Freeing<OPENSSL_sk_free>>;
+using Key = LazyOwner<EVP_PKEY, EVP_PKEY_free>;
+using PrivateKeyInfo = LazyOwner<PKCS8_PRIV_KEY_INFO, PKCS8_PRIV_KEY_INFO_free>;
+using CertificationRequest = LazyOwner<X509_REQ, X509_REQ_free>;
+using BitString = LazyOwner<ASN1_BIT_STRING, ASN1_BIT_STRING_free>;
+using Extension = LazyOwner<X509_EXTENSION, X509_EXTENSION_free>;
+using Extensions = LazyOwner<OPENSSL_STACK, OPENSSL_sk_free>;
 
 // Positions of the key usages (RFC 5280, 4.2.1.3).
 constexpr int kDigitalSignature = 0;
 constexpr int kKeyEncipherment = 2;
 
-/// What the library's encoder writes for the object; empty when it refuses.
-template <typename Container, typename Encode, typename Object>
-Container encoded(const Encode& encode, const Object* object) {
-    const int size = encode(object, nullptr);
-    if (size <= 0) return {};
-    Container der(static_cast<size_t>(size));
-    unsigned char* end = der.data();
-    if (encode(object, &end) != size) return {};
-    return der;
-}
-
 Key readPrivateKey(Bytes pkcs8) {
-    if (pkcs8.empty() || pkcs8.size() > kMaxKeyBytes) return nullptr;
-    const unsigned char* end = pkcs8.data();
-    const PrivateKeyInfo info(d2i_PKCS8_PRIV_KEY_INFO(nullptr, &end, static_cast<long>(pkcs8.size())));
-    Key key(info != nullptr && end == pkcs8.data() + pkcs8.size() ? EVP_PKCS82PKEY(info.get()) : nullptr);
+    const auto info = openssl::decoded<PrivateKeyInfo>(d2i_PKCS8_PRIV_KEY_INFO, pkcs8, kMaxKeyBytes);
+    Key key(info != nullptr ? EVP_PKCS82PKEY(info.get()) : nullptr);
     if (key == nullptr) openssl::clearErrors();
     return key;
 }
 
 std::vector<uint8_t> encodePublicKey(const EVP_PKEY* key) {
-    return encoded<std::vector<uint8_t>>(i2d_PUBKEY, key);
+    return openssl::encoded<std::vector<uint8_t>>(i2d_PUBKEY, key);
 }
 
 int identifierOf(SubjectAttribute::Type type) {
@@ -132,7 +90,7 @@ std::optional<KeyPair> generateRSAKeyPair(size_t bits) {
     const PrivateKeyInfo info(key != nullptr ? EVP_PKEY2PKCS8(key.get()) : nullptr);
     KeyPair pair;
     if (info != nullptr) {
-        pair.privateKey = encoded<SecretBytes>(i2d_PKCS8_PRIV_KEY_INFO, info.get());
+        pair.privateKey = openssl::encoded<SecretBytes>(i2d_PKCS8_PRIV_KEY_INFO, info.get());
         pair.publicKey = encodePublicKey(key.get());
     }
     if (!pair.privateKey.empty() && !pair.publicKey.empty()) return pair;
@@ -149,11 +107,9 @@ std::optional<std::vector<uint8_t>> publicKeyOf(Bytes privateKey) {
 }
 
 bool isPublicKey(Bytes bytes) {
-    if (bytes.empty() || bytes.size() > kMaxKeyBytes) return false;
-    const unsigned char* end = bytes.data();
-    const Key key(d2i_PUBKEY(nullptr, &end, static_cast<long>(bytes.size())));
+    const auto key = openssl::decoded<Key>(d2i_PUBKEY, bytes, kMaxKeyBytes);
     if (key == nullptr) openssl::clearErrors();
-    return key != nullptr && end == bytes.data() + bytes.size();
+    return key != nullptr;
 }
 
 std::optional<std::vector<uint8_t>> createCertificationRequest(Bytes privateKey,
@@ -163,7 +119,7 @@ std::optional<std::vector<uint8_t>> createCertificationRequest(Bytes privateKey,
     if (request != nullptr && X509_REQ_set_version(request.get(), X509_REQ_VERSION_1) == 1 &&
         addSubject(request.get(), subject) && X509_REQ_set_pubkey(request.get(), key.get()) == 1 &&
         addKeyUsage(request.get()) && X509_REQ_sign(request.get(), key.get(), EVP_sha256()) > 0) {
-        auto der = encoded<std::vector<uint8_t>>(i2d_X509_REQ, request.get());
+        auto der = openssl::encoded<std::vector<uint8_t>>(i2d_X509_REQ, request.get());
         if (!der.empty()) return der;
     }
     logRefusal("no certification request could be created");

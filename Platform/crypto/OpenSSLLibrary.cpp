@@ -18,8 +18,7 @@ constexpr const char* kSoname = "libcrypto.so.3";
 
 // What prepares the library cannot wait for it to be prepared.
 constinit const LazyLibrary unprepared(kSoname);
-VELTOID_LAZY_FUNCTION(unprepared, CRYPTO_set_mem_functions);
-VELTOID_LAZY_FUNCTION(unprepared, OPENSSL_init_crypto);
+VELTOID_LAZY_FUNCTIONS(unprepared, CRYPTO_set_mem_functions, OPENSSL_init_crypto);
 
 }  // namespace
 
@@ -27,9 +26,7 @@ constinit const LazyLibrary library(kSoname, [] { (void)prepare(); });
 
 namespace {
 
-VELTOID_LAZY_FUNCTION(library, ERR_clear_error);
-VELTOID_LAZY_FUNCTION(library, ERR_error_string_n);
-VELTOID_LAZY_FUNCTION(library, ERR_get_error);
+VELTOID_LAZY_FUNCTIONS(library, ERR_clear_error, ERR_error_string_n, ERR_get_error);
 
 void* allocate(size_t size, const char* /*file*/, int /*line*/) { return std::malloc(size); }
 

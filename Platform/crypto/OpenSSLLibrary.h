@@ -7,6 +7,7 @@
 #include <string>
 
 #include "Platform/runtime/LazyLibrary.h"
+#include "Platform/runtime/SecureMemory.h"
 
 namespace platform::openssl {
 
@@ -19,6 +20,28 @@ bool prepare();
 
 /// The library's own words for what just failed on the calling thread, whose error queue is empty afterwards.
 std::string takeReason();
+
+/// What the library's decoder reads; null when the bytes are more than `limit` or not exactly one such
+/// object.
+template <typename Owner, typename Decode>
+Owner decoded(const Decode& decode, Bytes der, size_t limit) {
+    if (der.empty() || der.size() > limit) return nullptr;
+    const unsigned char* end = der.data();
+    Owner object(decode(nullptr, &end, static_cast<long>(der.size())));
+    if (end != der.data() + der.size()) object.reset();
+    return object;
+}
+
+/// What the library's encoder writes for the object; empty when it refuses.
+template <typename Container, typename Encode, typename Object>
+Container encoded(const Encode& encode, const Object* object) {
+    const int size = encode(object, nullptr);
+    if (size <= 0) return {};
+    Container der(static_cast<size_t>(size));
+    unsigned char* end = der.data();
+    if (encode(object, &end) != size) return {};
+    return der;
+}
 
 /// Empties the calling thread's error queue, where a failure needs no words.
 void clearErrors();

@@ -23,67 +23,25 @@ namespace platform {
 namespace {
 
 using openssl::library;
-VELTOID_LAZY_FUNCTION(library, BIO_free);
-VELTOID_LAZY_FUNCTION(library, BIO_new_mem_buf);
-VELTOID_LAZY_FUNCTION(library, d2i_X509);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_free);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_new_null);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_num);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_pop);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_push);
-VELTOID_LAZY_FUNCTION(library, OPENSSL_sk_value);
-VELTOID_LAZY_FUNCTION(library, PEM_X509_INFO_read_bio);
-VELTOID_LAZY_FUNCTION(library, X509_free);
-VELTOID_LAZY_FUNCTION(library, X509_INFO_free);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_add_cert);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_add_crl);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_CTX_free);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_CTX_get0_param);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_CTX_get_error);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_CTX_init);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_CTX_new);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_CTX_set_default);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_free);
-VELTOID_LAZY_FUNCTION(library, X509_STORE_new);
-VELTOID_LAZY_FUNCTION(library, X509_verify_cert);
-VELTOID_LAZY_FUNCTION(library, X509_VERIFY_PARAM_set_flags);
-VELTOID_LAZY_FUNCTION(library, X509_VERIFY_PARAM_set_time);
+VELTOID_LAZY_FUNCTIONS(library, BIO_free, BIO_new_mem_buf, d2i_X509, OPENSSL_sk_new_null, OPENSSL_sk_num,
+                       OPENSSL_sk_pop_free, OPENSSL_sk_push, OPENSSL_sk_value, PEM_X509_INFO_read_bio,
+                       X509_free, X509_INFO_free, X509_STORE_add_cert, X509_STORE_add_crl,
+                       X509_STORE_CTX_free, X509_STORE_CTX_get0_param, X509_STORE_CTX_get_error,
+                       X509_STORE_CTX_init, X509_STORE_CTX_new, X509_STORE_CTX_set_default, X509_STORE_free,
+                       X509_STORE_new, X509_verify_cert, X509_VERIFY_PARAM_set_flags,
+                       X509_VERIFY_PARAM_set_time);
 
-struct Deleter {
-    void operator()(BIO* stream) const { BIO_free(stream); }
-    void operator()(X509* certificate) const { X509_free(certificate); }
-    void operator()(X509_INFO* entry) const { X509_INFO_free(entry); }
-    void operator()(X509_STORE* store) const { X509_STORE_free(store); }
-    void operator()(X509_STORE_CTX* context) const { X509_STORE_CTX_free(context); }
+using Parsed = LazyOwner<X509, X509_free>;
+
+/// Owns a list of the library and what is in it.
+template <typename Object, const auto& Free>
+struct StackDeleter {
+    void operator()(OPENSSL_STACK* stack) const {
+        OPENSSL_sk_pop_free(stack, [](void* object) { Free(static_cast<Object*>(object)); });
+    }
 };
-template <typename Object>
-using Owned = std::unique_ptr<Object, Deleter>;
-
-/// A list of the library that owns what is in it.
-template <typename Object>
-class OwningStack {
-  public:
-    explicit OwningStack(OPENSSL_STACK* stack) : stack_(stack) {}
-    ~OwningStack() {
-        while (Owned<Object>(static_cast<Object*>(OPENSSL_sk_pop(stack_)))) {
-        }
-        OPENSSL_sk_free(stack_);
-    }
-    OwningStack(const OwningStack&) = delete;
-    OwningStack& operator=(const OwningStack&) = delete;
-
-    OPENSSL_STACK* get() const { return stack_; }
-    int size() const { return stack_ != nullptr ? OPENSSL_sk_num(stack_) : 0; }
-    const Object* operator[](int index) const {
-        return static_cast<Object*>(OPENSSL_sk_value(stack_, index));
-    }
-    void push(Owned<Object> object) {
-        if (OPENSSL_sk_push(stack_, object.get()) > 0) (void)object.release();
-    }
-
-  private:
-    OPENSSL_STACK* stack_;
-};
+template <typename Object, const auto& Free>
+using OwningStack = std::unique_ptr<OPENSSL_STACK, StackDeleter<Object, Free>>;
 
 std::filesystem::path authorityFile() {
     const Product& product = Lifetime::current().product();
@@ -122,7 +80,7 @@ std::optional<std::string> readAuthorityFile(const std::filesystem::path& file) 
 
 /// The authorities and, beside them, the revocation lists.
 struct Authorities {
-    Owned<X509_STORE> store;
+    LazyOwner<X509_STORE, X509_STORE_free> store;
     bool hasRevocationLists = false;
 };
 
@@ -130,15 +88,16 @@ std::optional<Authorities> readAuthorities() {
     const std::filesystem::path file = authorityFile();
     const auto text = readAuthorityFile(file);
     if (!text) return std::nullopt;
-    const Owned<BIO> stream(BIO_new_mem_buf(text->data(), static_cast<int>(text->size())));
-    const OwningStack<X509_INFO> entries(
+    const LazyOwner<BIO, BIO_free> stream(BIO_new_mem_buf(text->data(), static_cast<int>(text->size())));
+    const OwningStack<X509_INFO, X509_INFO_free> entries(
         reinterpret_cast<OPENSSL_STACK*>(PEM_X509_INFO_read_bio(stream.get(), nullptr, nullptr, nullptr)));
-    Authorities authorities{Owned<X509_STORE>(X509_STORE_new()), false};
+    Authorities authorities;
+    authorities.store.reset(X509_STORE_new());
     int certificates = 0;
-    for (int i = 0; i < entries.size(); ++i) {
-        if (entries[i]->x509 != nullptr)
-            certificates += X509_STORE_add_cert(authorities.store.get(), entries[i]->x509);
-        if (entries[i]->crl != nullptr && X509_STORE_add_crl(authorities.store.get(), entries[i]->crl) == 1)
+    for (int i = 0; i < OPENSSL_sk_num(entries.get()); ++i) {
+        const auto* entry = static_cast<const X509_INFO*>(OPENSSL_sk_value(entries.get(), i));
+        if (entry->x509 != nullptr) certificates += X509_STORE_add_cert(authorities.store.get(), entry->x509);
+        if (entry->crl != nullptr && X509_STORE_add_crl(authorities.store.get(), entry->crl) == 1)
             authorities.hasRevocationLists = true;
     }
     if (certificates > 0) return authorities;
@@ -146,18 +105,20 @@ std::optional<Authorities> readAuthorities() {
     return std::nullopt;
 }
 
-Owned<X509> parsed(const Certificate& certificate) {
-    const unsigned char* der = certificate.der.data();
-    return Owned<X509>(d2i_X509(nullptr, &der, static_cast<long>(certificate.der.size())));
+Parsed parsed(const Certificate& certificate) {
+    return openssl::decoded<Parsed>(d2i_X509, certificate.der, kMaxCertificateBytes);
 }
 
 /// One run of the library's verification with these flags; its verdict.
 int verify(const Authorities& authorities, const Certificate& certificate,
            std::span<const Certificate> intermediates, unsigned long flags) {
-    const Owned<X509> leaf = parsed(certificate);
-    OwningStack<X509> untrusted(OPENSSL_sk_new_null());
-    for (const Certificate& intermediate : intermediates) untrusted.push(parsed(intermediate));
-    const Owned<X509_STORE_CTX> context(X509_STORE_CTX_new());
+    const Parsed leaf = parsed(certificate);
+    const OwningStack<X509, X509_free> untrusted(OPENSSL_sk_new_null());
+    for (const Certificate& intermediate : intermediates) {
+        Parsed between = parsed(intermediate);
+        if (OPENSSL_sk_push(untrusted.get(), between.get()) > 0) (void)between.release();
+    }
+    const LazyOwner<X509_STORE_CTX, X509_STORE_CTX_free> context(X509_STORE_CTX_new());
     if (leaf == nullptr || context == nullptr ||
         X509_STORE_CTX_init(context.get(), authorities.store.get(), leaf.get(),
                             reinterpret_cast<STACK_OF(X509)*>(untrusted.get())) != 1 ||

@@ -40,6 +40,11 @@ constexpr const char* kSchema =
     "CREATE UNIQUE INDEX objects ON items (class, coalesce(key_class, x''), application_value) WHERE class "
     "<> 0;";
 
+// What rowOf reads. A macro, since statements are kept under the address of their literal.
+#define VELTOID_SELECT_ITEMS                                                                     \
+    "SELECT sequence, id, class, account, service, label, description, access_group, key_class," \
+    " application_value, accessibility FROM items WHERE "
+
 struct KeychainFile : SQLiteFile {
     KeychainFile() : SQLiteFile({"keychain.db", 0x48574B43 /* "HWKC" */, 1, schema().c_str()}) {}
 
@@ -84,13 +89,8 @@ KeychainStatus changeItems(const Work& work) {
 }
 
 bool matches(const KeychainAttributes& query, const KeychainAttributes& item) {
-    const auto agrees = [](const std::optional<std::string>& wanted, const std::optional<std::string>& has) {
-        return !wanted || wanted == has;
-    };
-    return query.itemClass == item.itemClass && agrees(query.account, item.account) &&
-           agrees(query.service, item.service) && agrees(query.label, item.label) &&
-           agrees(query.description, item.description) && agrees(query.accessGroup, item.accessGroup) &&
-           agrees(query.keyClass, item.keyClass) && agrees(query.applicationValue, item.applicationValue);
+    const auto agrees = [&](auto text) { return !(query.*text) || query.*text == item.*text; };
+    return query.itemClass == item.itemClass && std::ranges::all_of(kKeychainTexts, agrees);
 }
 
 Row rowOf(SQLiteStatement& statement) {
@@ -98,43 +98,29 @@ Row rowOf(SQLiteStatement& statement) {
     Row row;
     row.sequence = statement.integer(0);
     row.identity.id.assign(id.begin(), id.end());
-    KeychainAttributes& attributes = row.identity.attributes;
-    attributes.itemClass = static_cast<KeychainItemClass>(statement.integer(2));
-    attributes.account = statement.optionalText(3);
-    attributes.service = statement.optionalText(4);
-    attributes.label = statement.optionalText(5);
-    attributes.description = statement.optionalText(6);
-    attributes.accessGroup = statement.optionalText(7);
-    attributes.keyClass = statement.optionalText(8);
-    attributes.applicationValue = statement.optionalText(9);
-    row.identity.accessibility = static_cast<Accessibility>(statement.integer(10));
+    row.identity.attributes.itemClass = static_cast<KeychainItemClass>(statement.integer(2));
+    int column = 3;
+    for (const auto text : kKeychainTexts) row.identity.attributes.*text = statement.optionalText(column++);
+    row.identity.accessibility = static_cast<Accessibility>(statement.integer(column));
     return row;
-}
-
-void collect(SQLiteStatement& statement, const KeychainAttributes& query, std::vector<Row>& rows) {
-    while (statement.step()) {
-        Row row = rowOf(statement);
-        if (matches(query, row.identity.attributes)) rows.push_back(std::move(row));
-    }
 }
 
 /// The matching items, oldest first.
 std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query) {
     std::vector<Row> rows;
+    const auto collect = [&](SQLiteStatement& statement) {
+        while (statement.step()) {
+            Row row = rowOf(statement);
+            if (matches(query.attributes, row.identity.attributes)) rows.push_back(std::move(row));
+        }
+    };
     if (!query.itemList) {
-        auto statement = transaction.prepare(
-            "SELECT sequence, id, class, account, service, label, description, access_group, key_class,"
-            " application_value, accessibility FROM items WHERE class = ? ORDER BY sequence");
-        statement.bindInteger(static_cast<int>(query.attributes.itemClass));
-        collect(statement, query.attributes, rows);
+        collect(transaction.prepare(VELTOID_SELECT_ITEMS "class = ? ORDER BY sequence")
+                    .bind(static_cast<int>(query.attributes.itemClass)));
         return rows;
     }
     for (const PersistentReference& reference : *query.itemList) {
-        auto statement = transaction.prepare(
-            "SELECT sequence, id, class, account, service, label, description, access_group, key_class,"
-            " application_value, accessibility FROM items WHERE id = ?");
-        statement.bindBlob(reference);
-        collect(statement, query.attributes, rows);
+        collect(transaction.prepare(VELTOID_SELECT_ITEMS "id = ?").bind(reference));
     }
     std::ranges::sort(rows, {}, &Row::sequence);
     const auto same = [](const Row& one, const Row& other) { return one.sequence == other.sequence; };
@@ -144,28 +130,17 @@ std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query
 
 KeychainStatus unsealRow(SQLiteTransaction& transaction, const Row& row, SecretBytes& value) {
     auto statement = transaction.prepare("SELECT sealed FROM items WHERE sequence = ?");
-    if (!statement.bindInteger(row.sequence).step()) return kKeychainNotAvailable;
+    if (!statement.bind(row.sequence).step()) return kKeychainNotAvailable;
     return unsealItem(transaction, row.identity, statement.blob(0), value);
 }
 
 KeychainStatus insert(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed) {
-    const KeychainAttributes& attributes = identity.attributes;
-    transaction
-        .prepare(
-            "INSERT INTO items (id, class, account, service, label, description, access_group, key_class,"
-            " application_value, accessibility, sealed) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)")
-        .bindBlob(identity.id)
-        .bindInteger(static_cast<int>(attributes.itemClass))
-        .bindOptionalText(attributes.account)
-        .bindOptionalText(attributes.service)
-        .bindOptionalText(attributes.label)
-        .bindOptionalText(attributes.description)
-        .bindOptionalText(attributes.accessGroup)
-        .bindOptionalText(attributes.keyClass)
-        .bindOptionalText(attributes.applicationValue)
-        .bindInteger(static_cast<int>(identity.accessibility))
-        .bindBlob(sealed)
-        .run();
+    auto statement = transaction.prepare(
+        "INSERT INTO items (id, class, account, service, label, description, access_group, key_class,"
+        " application_value, accessibility, sealed) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)");
+    statement.bind(identity.id, static_cast<int>(identity.attributes.itemClass));
+    for (const auto text : kKeychainTexts) statement.bind(identity.attributes.*text);
+    statement.bind(static_cast<int>(identity.accessibility), sealed).run();
     return kKeychainSuccess;
 }
 
@@ -184,11 +159,8 @@ KeychainStatus change(SQLiteTransaction& transaction, Row row, const Changes& ch
     transaction
         .prepare(
             "UPDATE items SET label = ?, access_group = ?, accessibility = ?, sealed = ? WHERE sequence = ?")
-        .bindOptionalText(row.identity.attributes.label)
-        .bindOptionalText(row.identity.attributes.accessGroup)
-        .bindInteger(static_cast<int>(row.identity.accessibility))
-        .bindBlob(sealed)
-        .bindInteger(row.sequence)
+        .bind(row.identity.attributes.label, row.identity.attributes.accessGroup,
+              static_cast<int>(row.identity.accessibility), sealed, row.sequence)
         .run();
     return kKeychainSuccess;
 }
@@ -219,8 +191,7 @@ KeychainStatus sealAll(SQLiteTransaction& transaction, const OpenedItems& items)
         const KeychainStatus status = sealItem(transaction, row.identity, value, sealed);
         if (status != kKeychainSuccess) return status;
         transaction.prepare("UPDATE items SET sealed = ? WHERE sequence = ?")
-            .bindBlob(sealed)
-            .bindInteger(row.sequence)
+            .bind(sealed, row.sequence)
             .run();
     }
     return kKeychainSuccess;
@@ -300,7 +271,7 @@ KeychainStatus remove(const KeychainQuery& query) {
     return changeItems([&](SQLiteTransaction& transaction) {
         const auto rows = find(transaction, query);
         for (const Row& row : rows) {
-            transaction.prepare("DELETE FROM items WHERE sequence = ?").bindInteger(row.sequence).run();
+            transaction.prepare("DELETE FROM items WHERE sequence = ?").bind(row.sequence).run();
         }
         return rows.empty() ? kKeychainItemNotFound : kKeychainSuccess;
     });

@@ -33,16 +33,14 @@ struct Row {
 /// None when there is none; a failure shows in the transaction.
 std::optional<Row> rowOf(SQLiteTransaction& transaction, ClassKey which) {
     auto statement = transaction.prepare("SELECT wrapping, wrapped FROM class_keys WHERE class = ?");
-    if (!statement.bindInteger(static_cast<int>(which)).step()) return std::nullopt;
+    if (!statement.bind(static_cast<int>(which)).step()) return std::nullopt;
     const Bytes wrapped = statement.blob(1);
     return Row{static_cast<Wrapping>(statement.integer(0)), {wrapped.begin(), wrapped.end()}};
 }
 
 KeychainStatus store(SQLiteTransaction& transaction, ClassKey which, Wrapping wrapping, Bytes wrapped) {
     transaction.prepare("INSERT OR REPLACE INTO class_keys (class, wrapping, wrapped) VALUES (?, ?, ?)")
-        .bindInteger(static_cast<int>(which))
-        .bindInteger(static_cast<int64_t>(wrapping))
-        .bindBlob(wrapped)
+        .bind(static_cast<int>(which), static_cast<int64_t>(wrapping), wrapped)
         .run();
     return transaction.failed() ? kKeychainNotAvailable : kKeychainSuccess;
 }

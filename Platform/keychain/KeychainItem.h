@@ -1,6 +1,7 @@
 // What is known of an item of the keychain, and the outcomes of operations on it.
 #pragma once
 
+#include <array>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -46,6 +47,12 @@ struct KeychainAttributes {
     /// class.
     std::optional<std::string> applicationValue;
 };
+
+/// All of an item's texts, in the order in which they are stored and sealed.
+inline constexpr std::array kKeychainTexts = {
+    &KeychainAttributes::account,         &KeychainAttributes::service,     &KeychainAttributes::label,
+    &KeychainAttributes::description,     &KeychainAttributes::accessGroup, &KeychainAttributes::keyClass,
+    &KeychainAttributes::applicationValue};
 
 namespace keychain {
 

@@ -27,16 +27,11 @@ ClassKey classKeyOf(Accessibility accessibility) {
 }  // namespace
 
 std::vector<uint8_t> encodeIdentity(const ItemIdentity& identity) {
-    const KeychainAttributes& attributes = identity.attributes;
     std::vector<uint8_t> output;
-    appendBigEndian(output, static_cast<uint64_t>(attributes.itemClass), 1);
+    appendBigEndian(output, static_cast<uint64_t>(identity.attributes.itemClass), 1);
     appendBigEndian(output, static_cast<uint64_t>(identity.accessibility), 1);
     appendField(output, textOf(identity.id));
-    for (const auto* field :
-         {&attributes.account, &attributes.service, &attributes.label, &attributes.description,
-          &attributes.accessGroup, &attributes.keyClass, &attributes.applicationValue}) {
-        appendField(output, *field);
-    }
+    for (const auto text : kKeychainTexts) appendField(output, identity.attributes.*text);
     return output;
 }
 

@@ -18,21 +18,15 @@ class CurlExchange {
     static bool isLibraryAvailable();
 
     /// Only when the library is available. Request and events must outlive the exchange.
-    CurlExchange(const HTTPRequest& request, HTTPSessionEvents& events);
-    ~CurlExchange();
-    CurlExchange(const CurlExchange&) = delete;
-    CurlExchange& operator=(const CurlExchange&) = delete;
+    static std::unique_ptr<CurlExchange> create(const HTTPRequest& request, HTTPSessionEvents& events);
+    virtual ~CurlExchange() = default;
 
     /// Runs until the exchange has ended or `cancelled` is set, telling the events everything but the
     /// completion. None when the response arrived whole, whatever its status.
-    std::optional<HTTPError> run(const std::atomic<bool>& cancelled);
+    virtual std::optional<HTTPError> run(const std::atomic<bool>& cancelled) = 0;
 
     /// Makes `run` look at `cancelled`. Any thread.
-    void wakeUp();
-
-  private:
-    class Transfer;
-    std::unique_ptr<Transfer> transfer_;
+    virtual void wakeUp() = 0;
 };
 
 }  // namespace platform

@@ -42,9 +42,9 @@ class CurlSession : public HTTPSession,
 
   private:
     void run(const HTTPRequest& request) {
-        CurlExchange exchange(request, *this);
-        setExchange(&exchange);
-        const std::optional<HTTPError> error = exchange.run(cancelled_);
+        const auto exchange = CurlExchange::create(request, *this);
+        setExchange(exchange.get());
+        const std::optional<HTTPError> error = exchange->run(cancelled_);
         setExchange(nullptr);
         completed(error);
         if (eventQueue_)

@@ -72,7 +72,36 @@ class Writer : public ValueSink {
         if (shape_.key(utf8.size())) frames_.back().keys.push_back(addText(utf8));
     }
 
-    SecretBytes finish() const;
+    SecretBytes finish() const {
+        if (!shape_.isComplete()) return {};
+        SecretBytes output(kHeader.begin(), kHeader.end());
+        std::vector<uint64_t> offsets;
+        offsets.reserve(objects_.size());
+        const size_t referenceWidth = widthOf(objects_.size());
+        for (const Object& object : objects_) {
+            offsets.push_back(output.size());
+            if (object.container == kLeaf) {
+                const Bytes leaf = Bytes(leaves_).subspan(object.begin, object.count);
+                output.insert(output.end(), leaf.begin(), leaf.end());
+                continue;
+            }
+            appendMarker(output, object.container, object.count);
+            const size_t references = object.container == kDictionary ? 2 * object.count : object.count;
+            for (size_t i = 0; i < references; ++i) {
+                appendBigEndian(output, references_[object.begin + i], referenceWidth);
+            }
+        }
+        const size_t table = output.size();
+        const size_t offsetWidth = widthOf(table);
+        for (const uint64_t offset : offsets) appendBigEndian(output, offset, offsetWidth);
+        appendBigEndian(output, 0, 6);
+        output.push_back(static_cast<uint8_t>(offsetWidth));
+        output.push_back(static_cast<uint8_t>(referenceWidth));
+        appendBigEndian(output, objects_.size(), 8);
+        appendBigEndian(output, top_, 8);
+        appendBigEndian(output, table, 8);
+        return output;
+    }
 
   private:
     /// `begin` and `count` are a range of leaves_ or, for containers, of references_.
@@ -119,8 +148,48 @@ class Writer : public ValueSink {
         addValue(addLeaf(begin), 0);
     }
 
-    uint32_t addText(std::string_view utf8);
-    void appendUTF16(std::string_view utf8);
+    uint32_t addText(std::string_view utf8) {
+        const size_t begin = leaves_.size();
+        if (isASCII(utf8)) {
+            appendMarker(leaves_, kASCII, utf8.size());
+            leaves_.insert(leaves_.end(), utf8.begin(), utf8.end());
+        } else {
+            appendUTF16(utf8);
+        }
+        const Bytes encoded = Bytes(leaves_).subspan(begin);
+        const size_t hash = std::hash<std::string_view>()(textOf(encoded));
+        if (const auto known = texts_.find(hash); known != texts_.end()) {
+            const Object& object = objects_[known->second];
+            // Two texts of one hash are rare: the second is simply not shared.
+            if (textOf(Bytes(leaves_).subspan(object.begin, object.count)) == textOf(encoded)) {
+                leaves_.resize(begin);
+                return known->second;
+            }
+        }
+        const uint32_t object = addLeaf(begin);
+        texts_.emplace(hash, object);
+        return object;
+    }
+
+    void appendUTF16(std::string_view utf8) {
+        SecretBytes units;
+        units.reserve(2 * utf8.size());
+        while (!utf8.empty()) {
+            const auto point = takeCodePoint(utf8);
+            if (!point) {
+                shape_.fail();
+                return;
+            }
+            if (*point < 0x10000) {
+                appendBigEndian(units, *point, 2);
+            } else {
+                appendBigEndian(units, 0xD800U + ((*point - 0x10000U) >> 10U), 2);
+                appendBigEndian(units, 0xDC00U + (*point & 0x3FFU), 2);
+            }
+        }
+        appendMarker(leaves_, kUTF16, units.size() / 2);
+        leaves_.insert(leaves_.end(), units.begin(), units.end());
+    }
 
     void addValue(uint32_t object, size_t payload) {
         if (shape_.value(payload)) place(object);
@@ -158,80 +227,6 @@ class Writer : public ValueSink {
     uint32_t top_ = 0;
     Shape shape_;
 };
-
-void Writer::appendUTF16(std::string_view utf8) {
-    SecretBytes units;
-    units.reserve(2 * utf8.size());
-    while (!utf8.empty()) {
-        const auto point = takeCodePoint(utf8);
-        if (!point) {
-            shape_.fail();
-            return;
-        }
-        if (*point < 0x10000) {
-            appendBigEndian(units, *point, 2);
-        } else {
-            appendBigEndian(units, 0xD800U + ((*point - 0x10000U) >> 10U), 2);
-            appendBigEndian(units, 0xDC00U + (*point & 0x3FFU), 2);
-        }
-    }
-    appendMarker(leaves_, kUTF16, units.size() / 2);
-    leaves_.insert(leaves_.end(), units.begin(), units.end());
-}
-
-uint32_t Writer::addText(std::string_view utf8) {
-    const size_t begin = leaves_.size();
-    if (isASCII(utf8)) {
-        appendMarker(leaves_, kASCII, utf8.size());
-        leaves_.insert(leaves_.end(), utf8.begin(), utf8.end());
-    } else {
-        appendUTF16(utf8);
-    }
-    const Bytes encoded = Bytes(leaves_).subspan(begin);
-    const size_t hash = std::hash<std::string_view>()(textOf(encoded));
-    if (const auto known = texts_.find(hash); known != texts_.end()) {
-        const Object& object = objects_[known->second];
-        // Two texts of one hash are rare: the second is simply not shared.
-        if (textOf(Bytes(leaves_).subspan(object.begin, object.count)) == textOf(encoded)) {
-            leaves_.resize(begin);
-            return known->second;
-        }
-    }
-    const uint32_t object = addLeaf(begin);
-    texts_.emplace(hash, object);
-    return object;
-}
-
-SecretBytes Writer::finish() const {
-    if (!shape_.isComplete()) return {};
-    SecretBytes output(kHeader.begin(), kHeader.end());
-    std::vector<uint64_t> offsets;
-    offsets.reserve(objects_.size());
-    const size_t referenceWidth = widthOf(objects_.size());
-    for (const Object& object : objects_) {
-        offsets.push_back(output.size());
-        if (object.container == kLeaf) {
-            const Bytes leaf = Bytes(leaves_).subspan(object.begin, object.count);
-            output.insert(output.end(), leaf.begin(), leaf.end());
-            continue;
-        }
-        appendMarker(output, object.container, object.count);
-        const size_t references = object.container == kDictionary ? 2 * object.count : object.count;
-        for (size_t i = 0; i < references; ++i) {
-            appendBigEndian(output, references_[object.begin + i], referenceWidth);
-        }
-    }
-    const size_t table = output.size();
-    const size_t offsetWidth = widthOf(table);
-    for (const uint64_t offset : offsets) appendBigEndian(output, offset, offsetWidth);
-    appendBigEndian(output, 0, 6);
-    output.push_back(static_cast<uint8_t>(offsetWidth));
-    output.push_back(static_cast<uint8_t>(referenceWidth));
-    appendBigEndian(output, objects_.size(), 8);
-    appendBigEndian(output, top_, 8);
-    appendBigEndian(output, table, 8);
-    return output;
-}
 
 }  // namespace
 

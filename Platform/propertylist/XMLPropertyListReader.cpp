@@ -136,9 +136,59 @@ class ListReader : public XMLEvents {
         if (!condition) document_.abort();
     }
 
-    bool begin(Element element);
-    bool end(Element element);
-    bool endLeaf(Element element);
+    bool begin(Element element) {
+        if (leaf_ != Element::None || element == Element::None) return false;
+        // The list is the outermost element and no other one.
+        if (isInside_ == (element == Element::PropertyList)) return false;
+        isInside_ = true;
+        switch (element) {
+            case Element::PropertyList:
+                return true;
+            case Element::Array:
+                return shape_.begin(Container::Array) && (sink_.beginArray(), true);
+            case Element::Dictionary:
+                return shape_.begin(Container::Dictionary) && (sink_.beginDictionary(), true);
+            default:
+                leaf_ = element;
+                text_.clear();
+                return true;
+        }
+    }
+
+    bool end(Element element) {
+        switch (element) {
+            case Element::PropertyList:
+                return true;
+            case Element::Array:
+                return shape_.end(Container::Array) && (sink_.endArray(), true);
+            case Element::Dictionary:
+                return shape_.end(Container::Dictionary) && (sink_.endDictionary(), true);
+            default:
+                leaf_ = Element::None;
+                return endLeaf(element);
+        }
+    }
+
+    bool endLeaf(Element element) {
+        switch (element) {
+            case Element::Key:
+                return shape_.key(text_.size()) && (sink_.key(text_), true);
+            case Element::String:
+                return shape_.value(text_.size()) && (sink_.string(text_), true);
+            case Element::True:
+            case Element::False:
+                return shape_.value(0) && (sink_.boolean(element == Element::True), true);
+            case Element::Integer:
+                return shape_.value(0) && readInteger(text_, sink_);
+            case Element::Real:
+                return shape_.value(0) && readReal(text_, sink_);
+            case Element::Date:
+                return shape_.value(0) && readDate(text_, sink_);
+            default:
+                return decodeStrictBase64(text_, data_) && shape_.value(data_.size()) &&
+                       (sink_.data(data_), true);
+        }
+    }
 
     XMLReader document_;
     ValueSink& sink_;
@@ -149,60 +199,6 @@ class ListReader : public XMLEvents {
     Shape shape_;
     bool isInside_ = false;
 };
-
-bool ListReader::begin(Element element) {
-    if (leaf_ != Element::None || element == Element::None) return false;
-    // The list is the outermost element and no other one.
-    if (isInside_ == (element == Element::PropertyList)) return false;
-    isInside_ = true;
-    switch (element) {
-        case Element::PropertyList:
-            return true;
-        case Element::Array:
-            return shape_.begin(Container::Array) && (sink_.beginArray(), true);
-        case Element::Dictionary:
-            return shape_.begin(Container::Dictionary) && (sink_.beginDictionary(), true);
-        default:
-            leaf_ = element;
-            text_.clear();
-            return true;
-    }
-}
-
-bool ListReader::end(Element element) {
-    switch (element) {
-        case Element::PropertyList:
-            return true;
-        case Element::Array:
-            return shape_.end(Container::Array) && (sink_.endArray(), true);
-        case Element::Dictionary:
-            return shape_.end(Container::Dictionary) && (sink_.endDictionary(), true);
-        default:
-            leaf_ = Element::None;
-            return endLeaf(element);
-    }
-}
-
-bool ListReader::endLeaf(Element element) {
-    switch (element) {
-        case Element::Key:
-            return shape_.key(text_.size()) && (sink_.key(text_), true);
-        case Element::String:
-            return shape_.value(text_.size()) && (sink_.string(text_), true);
-        case Element::True:
-        case Element::False:
-            return shape_.value(0) && (sink_.boolean(element == Element::True), true);
-        case Element::Integer:
-            return shape_.value(0) && readInteger(text_, sink_);
-        case Element::Real:
-            return shape_.value(0) && readReal(text_, sink_);
-        case Element::Date:
-            return shape_.value(0) && readDate(text_, sink_);
-        default:
-            return decodeStrictBase64(text_, data_) && shape_.value(data_.size()) &&
-                   (sink_.data(data_), true);
-    }
-}
 
 }  // namespace
 

@@ -56,6 +56,15 @@ int signalled(sd_event_source* /*source*/, const signalfd_siginfo* /*info*/, voi
     return 0;
 }
 
+/// Hands a new source over to the loop. It goes before new messages: their replies would have to stand behind
+/// what waits here.
+void keep(sd_event_source* source, int result, const char* what) {
+    if (result >= 0) result = sd_event_source_set_priority(source, SD_EVENT_PRIORITY_IMPORTANT);
+    if (result >= 0) result = sd_event_source_set_floating(source, 1);
+    sd_event_source_unref(source);
+    if (result < 0) fail(what, -result);
+}
+
 }  // namespace
 
 void prepare() {
@@ -71,12 +80,8 @@ void prepare() {
     made.wakeDescriptor = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     if (made.wakeDescriptor < 0) fail("creating wake descriptor", errno);
     sd_event_source* wake = nullptr;
-    int result = sd_event_add_io(made.loop, &wake, made.wakeDescriptor, EPOLLIN, woken, nullptr);
-    // Before new messages: their replies would have to stand behind those that wait here.
-    if (result >= 0) result = sd_event_source_set_priority(wake, SD_EVENT_PRIORITY_IMPORTANT);
-    if (result >= 0) result = sd_event_source_set_floating(wake, 1);
-    sd_event_source_unref(wake);
-    if (result < 0) fail("watching wake descriptor", -result);
+    const int result = sd_event_add_io(made.loop, &wake, made.wakeDescriptor, EPOLLIN, woken, nullptr);
+    keep(wake, result, "watching wake descriptor");
     main_queue::adopt([descriptor = made.wakeDescriptor] {
         const uint64_t one = 1;
         if (write(descriptor, &one, sizeof one) < 0 && errno != EAGAIN) fail("waking", errno);
@@ -87,11 +92,8 @@ void onSignal(int signal, std::function<void()> handler) {
     Loop& current = state();
     void* context = &current.signalHandlers.emplace_back(std::move(handler));
     sd_event_source* source = nullptr;
-    int result = sd_event_add_signal(current.loop, &source, signal, signalled, context);
-    if (result >= 0) result = sd_event_source_set_priority(source, SD_EVENT_PRIORITY_IMPORTANT);
-    if (result >= 0) result = sd_event_source_set_floating(source, 1);
-    sd_event_source_unref(source);
-    if (result < 0) fail("watching signal", -result);
+    const int result = sd_event_add_signal(current.loop, &source, signal, signalled, context);
+    keep(source, result, "watching signal");
 }
 
 int run() {

@@ -4,7 +4,7 @@
 // answer.
 //
 //     LazyLibrary library("libexample.so.1");
-//     VELTOID_LAZY_FUNCTION(library, example_open);
+//     VELTOID_LAZY_FUNCTIONS(library, example_open, example_close);
 //
 // Below these lines, in the same namespace, example_open(...) is written as if the library had been linked.
 // It is not: a function that is missing from such a list is an error of the linker.
@@ -12,6 +12,7 @@
 
 #include <atomic>
 #include <initializer_list>
+#include <memory>
 
 namespace platform {
 
@@ -41,6 +42,8 @@ class LazyFunction {
   public:
     constexpr LazyFunction(const LazyLibrary& library, const char* name) : library_(library), name_(name) {}
 
+    constexpr const char* name() const { return name_; }
+
     operator Function*() const {  // NOLINT(google-explicit-constructor): this is what makes it callable
         void* address = address_.load(std::memory_order_acquire);
         if (address == nullptr) {
@@ -57,8 +60,32 @@ class LazyFunction {
     mutable std::atomic<void*> address_{nullptr};
 };
 
+/// Owns an object of the library, which one of its functions frees.
+template <const auto& Free>
+struct LazyDeleter {
+    template <typename Object>
+    void operator()(Object* object) const {
+        Free(object);
+    }
+};
+template <typename Object, const auto& Free>
+using LazyOwner = std::unique_ptr<Object, LazyDeleter<Free>>;
+
 }  // namespace platform
 
-// The name is the library's own, so that it hides the declaration of its header.
-#define VELTOID_LAZY_FUNCTION(library, function) \
-    constinit const ::platform::LazyFunction<decltype(::function)> function(library, #function)
+// Each name is the library's own, so that it hides the declaration of its header. A macro may name itself
+// only by way of another one that the preprocessor is made to look at again, here often enough for 85
+// functions.
+#define VELTOID_LAZY_FUNCTIONS(library, ...) VELTOID_LAZY_SCAN(VELTOID_LAZY_FUNCTION(library, __VA_ARGS__))
+#define VELTOID_LAZY_FUNCTION(library, function, ...)                                           \
+    constinit const ::platform::LazyFunction<decltype(::function)> function(library, #function) \
+        __VA_OPT__(; VELTOID_LAZY_AGAIN VELTOID_LAZY_PARENTHESES(library, __VA_ARGS__))
+#define VELTOID_LAZY_AGAIN() VELTOID_LAZY_FUNCTION
+#define VELTOID_LAZY_PARENTHESES ()
+#define VELTOID_LAZY_SCAN(...) \
+    VELTOID_LAZY_SCAN_21(VELTOID_LAZY_SCAN_21(VELTOID_LAZY_SCAN_21(VELTOID_LAZY_SCAN_21(__VA_ARGS__))))
+#define VELTOID_LAZY_SCAN_21(...) \
+    VELTOID_LAZY_SCAN_5(VELTOID_LAZY_SCAN_5(VELTOID_LAZY_SCAN_5(VELTOID_LAZY_SCAN_5(__VA_ARGS__))))
+#define VELTOID_LAZY_SCAN_5(...) \
+    VELTOID_LAZY_SCAN_1(VELTOID_LAZY_SCAN_1(VELTOID_LAZY_SCAN_1(VELTOID_LAZY_SCAN_1(__VA_ARGS__))))
+#define VELTOID_LAZY_SCAN_1(...) __VA_ARGS__

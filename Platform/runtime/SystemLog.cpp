@@ -6,6 +6,7 @@
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cstdlib>
@@ -28,15 +29,9 @@ bool standardErrorLeadsToJournal() {
 
 /// A line stays one line, whatever a peer put into a name.
 std::string singleLine(std::string_view text) {
-    std::string line;
-    line.reserve(text.size());
-    for (const char c : text) {
-        if (static_cast<unsigned char>(c) < ' ' || c == '\x7f') {
-            line += '?';
-        } else {
-            line += c;
-        }
-    }
+    std::string line(text);
+    std::ranges::replace_if(
+        line, [](unsigned char c) { return c < ' ' || c == '\x7f'; }, '?');
     return line;
 }
 

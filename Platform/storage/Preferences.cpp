@@ -32,6 +32,13 @@ struct PreferencesFile : SQLiteFile {
 
 SQLiteFile& file() { return Lifetime::current().state<PreferencesFile>(); }
 
+using Work = std::function<void(SQLiteTransaction&)>;
+
+bool write(const Work& work) {
+    return file().write([&](SQLiteTransaction& transaction) { return work(transaction), true; }) ==
+           Outcome::Done;
+}
+
 /// Runs one operation of the interface, out of which nothing is thrown.
 template <typename Operation>
 bool guarded(const std::string& domain, const char* name, Operation operation) {
@@ -53,7 +60,7 @@ Preferences::ReadResult Preferences::read(std::string_view key, ValueSink& sink)
         const Outcome outcome = file().read([&](SQLiteTransaction& transaction) {
             auto statement =
                 transaction.prepare("SELECT value FROM preferences WHERE domain = ? AND key = ?");
-            statement.bindText(domain_).bindText(key);
+            statement.bind(domain_, key);
             if (!statement.step()) return false;
             const Bytes stored = statement.blob(0);
             value.assign(stored.begin(), stored.end());
@@ -81,7 +88,7 @@ std::vector<std::string> Preferences::keys() const {
         return file().read([&](SQLiteTransaction& transaction) {
             keys.clear();
             auto statement = transaction.prepare("SELECT key FROM preferences WHERE domain = ? ORDER BY key");
-            statement.bindText(domain_);
+            statement.bind(domain_);
             while (statement.step()) keys.emplace_back(statement.text(0));
             return true;
         }) == Outcome::Done;
@@ -100,30 +107,25 @@ bool Preferences::set(const std::vector<std::pair<std::string, ValueWriter>>& va
                                             "\" has no stored form; nothing is set");
             return false;
         }
-        return file().write([&](SQLiteTransaction& transaction) {
+        return write([&](SQLiteTransaction& transaction) {
             for (const auto& [key, value] : rows) {
                 transaction.prepare("REPLACE INTO preferences (domain, key, value) VALUES (?, ?, ?)")
-                    .bindText(domain_)
-                    .bindText(key)
-                    .bindBlob(value)
+                    .bind(domain_, key, value)
                     .run();
             }
-            return true;
-        }) == Outcome::Done;
+        });
     });
 }
 
 bool Preferences::remove(const std::vector<std::string>& keys) const {
     return guarded(domain_, "remove", [&] {
-        return file().write([&](SQLiteTransaction& transaction) {
+        return write([&](SQLiteTransaction& transaction) {
             for (const auto& key : keys) {
                 transaction.prepare("DELETE FROM preferences WHERE domain = ? AND key = ?")
-                    .bindText(domain_)
-                    .bindText(key)
+                    .bind(domain_, key)
                     .run();
             }
-            return true;
-        }) == Outcome::Done;
+        });
     });
 }
 
@@ -131,20 +133,17 @@ bool Preferences::setAside(std::string_view key) const {
     return guarded(domain_, "setAside", [&] {
         const auto date = static_cast<int64_t>(Clock::shared().now());
         const std::string asideKey = std::string(key) + "-" + std::to_string(date);
-        const Outcome outcome = file().write([&](SQLiteTransaction& transaction) {
+        const std::string asideDomain = domain_ + ".damaged";
+        const bool done = write([&](SQLiteTransaction& transaction) {
             transaction
                 .prepare("UPDATE OR REPLACE preferences SET domain = ?, key = ? WHERE domain = ? AND key = ?")
-                .bindText(domain_ + ".damaged")
-                .bindText(asideKey)
-                .bindText(domain_)
-                .bindText(key)
+                .bind(asideDomain, asideKey, domain_, key)
                 .run();
-            return true;
         });
-        if (outcome == Outcome::Done)
+        if (done)
             VELTOID_PLATFORM_LOG(Error, "preferences of " + domain_ + ": the damaged value is kept as \"" +
-                                            asideKey + "\" of " + domain_ + ".damaged");
-        return outcome == Outcome::Done;
+                                            asideKey + "\" of " + asideDomain);
+        return done;
     });
 }
 

@@ -23,32 +23,13 @@ namespace platform {
 namespace {
 
 constinit const LazyLibrary library("libsqlite3.so.0");
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_blob64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_int64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_null);
-VELTOID_LAZY_FUNCTION(library, sqlite3_bind_text64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_busy_timeout);
-VELTOID_LAZY_FUNCTION(library, sqlite3_clear_bindings);
-VELTOID_LAZY_FUNCTION(library, sqlite3_close);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_blob);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_bytes);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_int64);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_text);
-VELTOID_LAZY_FUNCTION(library, sqlite3_column_type);
-VELTOID_LAZY_FUNCTION(library, sqlite3_db_config);
-VELTOID_LAZY_FUNCTION(library, sqlite3_errstr);
-VELTOID_LAZY_FUNCTION(library, sqlite3_exec);
-VELTOID_LAZY_FUNCTION(library, sqlite3_file_control);
-VELTOID_LAZY_FUNCTION(library, sqlite3_finalize);
-VELTOID_LAZY_FUNCTION(library, sqlite3_get_autocommit);
-VELTOID_LAZY_FUNCTION(library, sqlite3_open);
-VELTOID_LAZY_FUNCTION(library, sqlite3_open_v2);
-VELTOID_LAZY_FUNCTION(library, sqlite3_prepare_v2);
-VELTOID_LAZY_FUNCTION(library, sqlite3_prepare_v3);
-VELTOID_LAZY_FUNCTION(library, sqlite3_reset);
-VELTOID_LAZY_FUNCTION(library, sqlite3_step);
-VELTOID_LAZY_FUNCTION(library, sqlite3_system_errno);
-VELTOID_LAZY_FUNCTION(library, sqlite3_wal_checkpoint_v2);
+VELTOID_LAZY_FUNCTIONS(library, sqlite3_bind_blob64, sqlite3_bind_int64, sqlite3_bind_null,
+                       sqlite3_bind_text64, sqlite3_busy_timeout, sqlite3_clear_bindings, sqlite3_close,
+                       sqlite3_column_blob, sqlite3_column_bytes, sqlite3_column_int64, sqlite3_column_text,
+                       sqlite3_column_type, sqlite3_db_config, sqlite3_errstr, sqlite3_exec,
+                       sqlite3_file_control, sqlite3_finalize, sqlite3_get_autocommit, sqlite3_open,
+                       sqlite3_open_v2, sqlite3_prepare_v2, sqlite3_prepare_v3, sqlite3_reset, sqlite3_step,
+                       sqlite3_system_errno, sqlite3_wal_checkpoint_v2);
 
 constexpr int kBusyTimeoutMilliseconds = 5000;
 /// Damage is believed when it is seen twice; then the fresh file, and once more for a file that another
@@ -96,10 +77,7 @@ std::string nameAside(const std::string& path) {
         path + ".corrupt-" + calendarText(Clock::shared().now(), "%Y%m%d-%H%M%S").value_or("-");
     std::string name = base;
     const auto taken = [&] {
-        for (const char* suffix : kFileSuffixes) {
-            if (exists(name + suffix)) return true;
-        }
-        return false;
+        return std::ranges::any_of(kFileSuffixes, [&](const char* suffix) { return exists(name + suffix); });
     };
     for (int counter = 2; taken(); ++counter) name = base + '-' + std::to_string(counter);
     return name;
@@ -134,32 +112,24 @@ void SQLiteStatement::check(int code) {
     if (kindOf(code) != Kind::Fine) file_.fail(code);
 }
 
-SQLiteStatement& SQLiteStatement::bindInteger(int64_t value) {
-    if (statement_ != nullptr) check(sqlite3_bind_int64(statement_, ++bound_, value));
-    return *this;
+template <typename Bind, typename... Value>
+void SQLiteStatement::bindWith(const Bind& bind, Value... value) {
+    if (statement_ != nullptr) check(bind(statement_, ++bound_, value...));
 }
 
-SQLiteStatement& SQLiteStatement::bindText(std::string_view value) {
-    // A null pointer would bind NULL instead of an empty text.
+void SQLiteStatement::bindNext(int64_t value) { bindWith(sqlite3_bind_int64, value); }
+void SQLiteStatement::bindNull() { bindWith(sqlite3_bind_null); }
+
+// A null pointer would bind NULL instead of an empty value.
+
+void SQLiteStatement::bindNext(std::string_view value) {
     const char* const text = value.data() == nullptr ? "" : value.data();
-    if (statement_ != nullptr) {
-        check(sqlite3_bind_text64(statement_, ++bound_, text, value.size(), SQLITE_STATIC, SQLITE_UTF8));
-    }
-    return *this;
+    bindWith(sqlite3_bind_text64, text, value.size(), SQLITE_STATIC, uint8_t{SQLITE_UTF8});
 }
 
-SQLiteStatement& SQLiteStatement::bindOptionalText(const std::optional<std::string>& value) {
-    if (value) return bindText(std::string_view(*value));
-    if (statement_ != nullptr) check(sqlite3_bind_null(statement_, ++bound_));
-    return *this;
-}
-
-SQLiteStatement& SQLiteStatement::bindBlob(Bytes value) {
+void SQLiteStatement::bindNext(Bytes value) {
     const void* const bytes = value.empty() ? "" : static_cast<const void*>(value.data());
-    if (statement_ != nullptr) {
-        check(sqlite3_bind_blob64(statement_, ++bound_, bytes, value.size(), SQLITE_STATIC));
-    }
-    return *this;
+    bindWith(sqlite3_bind_blob64, bytes, value.size(), SQLITE_STATIC);
 }
 
 bool SQLiteStatement::step() {

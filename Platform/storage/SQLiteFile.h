@@ -8,6 +8,7 @@
 #pragma once
 
 #include <array>
+#include <concepts>
 #include <cstdint>
 #include <functional>
 #include <mutex>
@@ -25,7 +26,7 @@ namespace platform {
 
 class SQLiteFile;
 
-/// One use of a statement: parameters are bound in order, then it is stepped. After an error it gives no more
+/// One use of a statement: its parameters are bound, then it is stepped. After an error it gives no more
 /// rows, and the transaction fails as a whole, so that nothing has to be checked in between. Bound memory
 /// must outlive the use.
 class SQLiteStatement {
@@ -35,10 +36,12 @@ class SQLiteStatement {
     SQLiteStatement(const SQLiteStatement&) = delete;
     SQLiteStatement& operator=(const SQLiteStatement&) = delete;
 
-    SQLiteStatement& bindInteger(int64_t value);
-    SQLiteStatement& bindText(std::string_view value);
-    SQLiteStatement& bindOptionalText(const std::optional<std::string>& value);
-    SQLiteStatement& bindBlob(Bytes value);
+    /// Binds the next parameters, in order: integers, texts (an absent one is NULL) and bytes.
+    template <typename... Values>
+    SQLiteStatement& bind(const Values&... values) {
+        (bindNext(values), ...);
+        return *this;
+    }
 
     /// True: there is a row.
     bool step();
@@ -54,6 +57,16 @@ class SQLiteStatement {
     Bytes blob(int column);
 
   private:
+    void bindNext(int64_t value);
+    void bindNext(std::string_view value);
+    void bindNext(Bytes value);
+    /// A template, so that no other text becomes an optional one.
+    void bindNext(const std::same_as<std::optional<std::string>> auto& value) {
+        value ? bindNext(std::string_view(*value)) : bindNull();
+    }
+    void bindNull();
+    template <typename Bind, typename... Value>
+    void bindWith(const Bind& bind, Value... value);
     void check(int code);
 
     SQLiteFile& file_;

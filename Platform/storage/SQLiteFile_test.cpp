@@ -27,10 +27,7 @@ constexpr SQLiteFile::Format kFormat = {"test.db", 0x54455354, 1,
 
 Outcome put(SQLiteFile& file, const std::string& name, const std::string& value) {
     return file.write([&](SQLiteTransaction& transaction) {
-        transaction.prepare("REPLACE INTO rows (name, value) VALUES (?, ?)")
-            .bindText(name)
-            .bindBlob(bytesOf(value))
-            .run();
+        transaction.prepare("REPLACE INTO rows (name, value) VALUES (?, ?)").bind(name, bytesOf(value)).run();
         return true;
     });
 }
@@ -40,7 +37,7 @@ std::optional<std::string> get(SQLiteFile& file, const std::string& name) {
     std::string value;
     const Outcome outcome = file.read([&](SQLiteTransaction& transaction) {
         auto statement = transaction.prepare("SELECT value FROM rows WHERE name = ?");
-        if (!statement.bindText(name).step()) return false;
+        if (!statement.bind(name).step()) return false;
         value = textOf(statement.blob(0));
         return true;
     });
@@ -116,7 +113,7 @@ TEST_F(SQLiteFileTest, KeepsOnlyWhatATransactionCompleted) {
     const auto insertTwo = [&](const char* second, bool accept) {
         return file.write([&](SQLiteTransaction& transaction) {
             for (const std::string_view name : {std::string_view("b"), std::string_view(second)}) {
-                transaction.prepare("INSERT INTO rows VALUES (?, ?)").bindText(name).bindBlob({}).run();
+                transaction.prepare("INSERT INTO rows VALUES (?, ?)").bind(name, Bytes()).run();
             }
             return accept;
         });

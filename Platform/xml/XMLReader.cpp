@@ -35,10 +35,7 @@ void* reallocateWiped(void* memory, size_t size) {
 
 constexpr XML_Memory_Handling_Suite kWipedMemory = {std::malloc, reallocateWiped, freeWiped};
 
-struct ParserDeleter {
-    void operator()(XML_Parser parser) const { XML_ParserFree(parser); }
-};
-using ParserHandle = std::unique_ptr<XML_ParserStruct, ParserDeleter>;
+using ParserHandle = std::unique_ptr<XML_ParserStruct, decltype(&XML_ParserFree)>;
 
 /// One read in progress: what the parser's callbacks see.
 struct Reading {
@@ -126,7 +123,7 @@ bool feed(XML_Parser parser, Bytes document) {
 
 bool XMLReader::read(XMLEvents& events) {
     error_.reset();
-    const ParserHandle parser(XML_ParserCreate_MM(nullptr, &kWipedMemory, nullptr));
+    const ParserHandle parser(XML_ParserCreate_MM(nullptr, &kWipedMemory, nullptr), XML_ParserFree);
     if (!parser) {
         error_ = XMLError{"no memory for an XML parser", 0, 0};
         return false;
