@@ -112,7 +112,7 @@ UUIDBytes randomUUID() {
 
 std::string canonicalUUIDText(const UUIDBytes& uuid) {
     std::string text = hexText(uuid, kUpperCaseDigits);
-    for (const size_t hyphen : {8, 13, 18, 23}) text.insert(hyphen, 1, '-');
+    for (const unsigned hyphen : {8U, 13U, 18U, 23U}) text.insert(hyphen, 1, '-');
     return text;
 }
 
