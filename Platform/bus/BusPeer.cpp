@@ -10,20 +10,20 @@
 namespace platform {
 namespace {
 
-/// Events that are handled between two readings from the bus: fewer than are read, since whose turn it is
-/// cannot be known before.
+/// Events that are handled between two readings from the bus. These are fewer than are read at once: only
+/// what has been read tells which peers have something to say.
 constexpr int kServedAtOnce = 32;
 
-/// So many events of a peer wait for their turn. More are handled out of turn, so that memory is not theirs
-/// alone; those that are for the peer's own queue wait there.
-constexpr size_t kMostWaiting = 16'384;
+/// So many events of a peer wait for their turn. Further ones are handled at once, so that one peer cannot
+/// fill the memory; they wait in the peer's own queue.
+constexpr size_t kMaxWaiting = 16'384;
 
-/// A peer with more events waiting is sending ahead. It rests while the bus has not read so much of what the
-/// agent has sent: what goes to the others would stand in line behind its replies. The kernel counts 768
-/// bytes for a small reply; with twice as many, others wait half as long again, with half as many a peer that
-/// is alone is slowed down by half.
+/// A peer that has more events than this waiting sends ahead of its replies. It rests while more than
+/// kMaxUnread bytes of what the agent has sent are still unread by the bus, since replies to other peers
+/// would have to stand in line behind its own. The kernel counts 768 bytes for a small reply. With twice the
+/// limit other peers wait half as long again; with half of it a peer that is alone is slowed down by half.
 constexpr size_t kSendingAhead = 8;
-constexpr size_t kMostUnread = 12 << 10;
+constexpr size_t kMaxUnread = 12 << 10;
 constexpr double kRestSeconds = 0.0003;
 
 }  // namespace
@@ -59,7 +59,7 @@ bool BusPeer::serveWaiting() {
     for (int left = kServedAtOnce; left > 0 && !current.peers.empty(); --left) {
         std::shared_ptr<BusPeer> peer = std::move(current.peers.front());
         current.peers.pop_front();
-        if (peer->sendsAhead() && bus::unreadBytes() > kMostUnread) {
+        if (peer->sendsAhead() && bus::unreadBytes() > kMaxUnread) {
             current.rest(std::move(peer));
             continue;
         }
@@ -89,7 +89,7 @@ void BusPeer::deliver(PeerEvent event) {
     waiting_.push_back(std::move(event));
     if (!resumed_) return;
     if (waiting_.size() == 1) turns().peers.push_back(shared_from_this());
-    if (waiting_.size() > kMostWaiting) handleOldest();
+    if (waiting_.size() > kMaxWaiting) handleOldest();
 }
 
 void BusPeer::watch(sd_bus* bus, const std::string& name, sd_bus_track_handler_t gone,

@@ -1,4 +1,4 @@
-// System-wide notifications: a name, no payload, for whoever listens (D-Bus signal Posted(s name) of
+// System-wide notifications: a name without payload for all that listen (D-Bus signal Posted(s name) of
 // the product's notification interface on its object).
 #pragma once
 

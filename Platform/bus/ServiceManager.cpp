@@ -40,13 +40,13 @@ constexpr const char* kJobDone = "done";
 /// A date that has passed by the time the manager reads it never comes: what is nearer than this (seconds)
 /// is handed over as a delay.
 constexpr double kNearestDate = 5;
-constexpr double kShortestDelay = 1;
+constexpr double kMinDelay = 1;
 
 constexpr uint64_t kMicrosecondsPerSecond = 1'000'000;
 constexpr uint64_t kTimerAccuracy = 100'000;
 
-/// Somebody else may create the timer at the same time; only so often is it stopped to make room.
-constexpr int kMostStops = 3;
+/// Another process may create the timer at the same time. It is stopped only so many times to make room.
+constexpr int kMaxStops = 3;
 
 const Product& product() { return Lifetime::current().product(); }
 
@@ -80,9 +80,9 @@ int appendTimer(sd_bus_message* call, double date) {
                                        "RemainAfterElapse", "b", 0,                     //
                                        "CollectMode", "s", "inactive-or-failed");
     if (result >= 0 && left < kNearestDate)
-        result = sd_bus_message_append(
-            call, "(sv)", "TimersMonotonic", "a(st)", 1, "OnActiveSec",
-            static_cast<uint64_t>(std::max(left, kShortestDelay) * kMicrosecondsPerSecond));
+        result =
+            sd_bus_message_append(call, "(sv)", "TimersMonotonic", "a(st)", 1, "OnActiveSec",
+                                  static_cast<uint64_t>(std::max(left, kMinDelay) * kMicrosecondsPerSecond));
     else if (result >= 0)
         result = sd_bus_message_append(call, "(sv)", "TimersCalendar", "a(ss)", 1, "OnCalendar",
                                        calendarDate(date).c_str());
@@ -203,7 +203,7 @@ class Systemd : public ServiceManager {
                         calling<&Systemd::onStopping>);
     }
 
-    /// systemd reports the end of a job to whoever has asked for it.
+    /// systemd reports the end of a job to the connection that has asked for it.
     int watchJobs() {
         if (jobRemoved_ != nullptr) return 0;
         return sd_bus_match_signal_async(bus::connection(), &jobRemoved_, nullptr, kManagerPath,
@@ -232,7 +232,7 @@ class Systemd : public ServiceManager {
     }
 
     void onCreating(sd_bus_message* reply) {
-        if (sd_bus_message_is_method_error(reply, kUnitExists) > 0 && stops_++ < kMostStops)
+        if (sd_bus_message_is_method_error(reply, kUnitExists) > 0 && stops_++ < kMaxStops)
             proceed(stopTimer());
         else
             waitForJob(reply, &Systemd::created);

@@ -26,7 +26,8 @@ class ServiceManager {
     /// Tells the manager that the agent can be spoken to.
     virtual void announceReady() {}
 
-    /// Tells the manager that the agent is about to leave: whoever needs it from now on gets the next one.
+    /// Tells the manager that the agent is about to leave: a client that needs it from now on gets the next
+    /// one.
     virtual void announceStopping() {}
 };
 

@@ -138,7 +138,7 @@ std::optional<SecretBytes> deriveKey(Bytes passphrase, Bytes salt, const ScryptC
     if (cost.logN == 0 || cost.logN >= 32) return std::nullopt;
     SecretBytes key(kSealingKeyBytes);
     if (EVP_PBE_scrypt(textOf(passphrase).data(), passphrase.size(), salt.data(), salt.size(),
-                       uint64_t{1} << cost.logN, cost.blockSize, cost.parallelism, kMostScryptBytes,
+                       uint64_t{1} << cost.logN, cost.blockSize, cost.parallelism, kMaxScryptBytes,
                        key.data(), key.size()) == 1)
         return key;
     openssl::clearErrors();

@@ -40,7 +40,7 @@ struct ScryptCost {
 };
 
 /// Deriving takes at most so much memory; a cost beyond it is refused.
-inline constexpr size_t kMostScryptBytes = size_t{256} << 20U;
+inline constexpr size_t kMaxScryptBytes = size_t{256} << 20U;
 
 /// A key of kSealingKeyBytes that only who knows the passphrase can derive. None when the cost is refused or
 /// there is no memory for it.

@@ -46,7 +46,7 @@ using OwningStack = std::unique_ptr<OPENSSL_STACK, StackDeleter<Object, Free>>;
 std::filesystem::path authorityFile() {
     const Product& product = Lifetime::current().product();
     const std::filesystem::path name = std::filesystem::path(product.folder) / product.authorityFile;
-    // NOLINTBEGIN(concurrency-mt-unsafe): nobody changes the environment
+    // NOLINTBEGIN(concurrency-mt-unsafe): the environment does not change
     const char* configuration = std::getenv("XDG_CONFIG_HOME");
     const char* home = std::getenv("HOME");
     // NOLINTEND(concurrency-mt-unsafe)

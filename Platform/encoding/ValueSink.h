@@ -1,5 +1,5 @@
 // The form in which values cross the platform boundary: a stream of events, so that neither side knows the
-// other's tree. Whoever stores or sends a value writes it into a sink; whoever reads one hands a sink in.
+// other's tree. A value that is stored or sent is written into a sink; to read one, a sink is handed in.
 #pragma once
 
 #include <cstdint>

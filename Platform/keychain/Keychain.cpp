@@ -197,7 +197,7 @@ KeychainStatus sealAll(SQLiteTransaction& transaction, const OpenedItems& items)
     return kKeychainSuccess;
 }
 
-/// Whoever has an earlier copy of the file, and what opened that, is to learn nothing from this one.
+/// An earlier copy of the file, together with what opened it, must not open anything of this one.
 KeychainStatus replaceClassKey(const Work& replace) {
     std::string keptBefore;
     const KeychainStatus status = changeItems([&](SQLiteTransaction& transaction) {

@@ -102,7 +102,7 @@ std::optional<SecretBytes> derive(Bytes passphrase, Bytes header) {
                      {header[kCostAt], header[kCostAt + 1], header[kCostAt + 2]});
 }
 
-/// The header is sealed together with the key, so that nobody makes guessing cheaper.
+/// The header is sealed together with the key, so that the cost of guessing cannot be lowered.
 std::vector<uint8_t> passphraseContext(ClassKey which, Bytes header) {
     std::vector<uint8_t> context = wrappingContext(which);
     context.insert(context.end(), header.begin(), header.end());
@@ -170,7 +170,7 @@ KeychainStatus replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphr
     wrapped.resize(kHeaderBytes);
     fillRandom(std::span(wrapped).subspan(kSaltAt));
     const auto derived = derive(passphrase, wrapped);
-    // Without a keyring nobody could ever unlock it.
+    // Without a keyring it could never be unlocked.
     if (!derived || !kernel_keyring::store(keyringName(wrapped), *derived)) return kKeychainNotAvailable;
     const SecretBytes sealed = seal(*derived, passphraseContext(kWhich, wrapped), key);
     wrapped.insert(wrapped.end(), sealed.begin(), sealed.end());

@@ -45,10 +45,10 @@ bool load() {
 // --- The exchange
 
 /// No exchange goes on longer, even if its owner has forgotten it.
-constexpr long kLongestExchangeSeconds = 60;
+constexpr long kMaxExchangeSeconds = 60;
 
 /// A wake-up, a socket or one of the library's own timers ends a wait before.
-constexpr int kPollMilliseconds = kLongestExchangeSeconds * 1000;
+constexpr int kPollMilliseconds = kMaxExchangeSeconds * 1000;
 
 constexpr const char* kCertificateDirectory = "/etc/ssl/certs";
 constexpr const char* kCertificateFileVariable = "SSL_CERT_FILE";
@@ -120,7 +120,7 @@ class Transfer : public CurlExchange {
         set(CURLOPT_TCP_NODELAY, 1L);
         set(CURLOPT_NOSIGNAL, 1L);
         set(CURLOPT_NETRC, static_cast<long>(CURL_NETRC_IGNORED));
-        set(CURLOPT_TIMEOUT, kLongestExchangeSeconds);
+        set(CURLOPT_TIMEOUT, kMaxExchangeSeconds);
         set(CURLOPT_MAXFILESIZE_LARGE, static_cast<curl_off_t>(kMaxHTTPResponseBytes));
         // Proxies stay at the library's default: https_proxy and no_proxy of the environment are followed,
         // the TLS session going through the proxy's tunnel to the server itself. The tunnel's own header is

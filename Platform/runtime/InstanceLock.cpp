@@ -14,8 +14,8 @@
 namespace platform::instance_lock {
 namespace {
 
-/// Locked while somebody is leaving; the kernel unlocks it when the process is gone. Never removed: who comes
-/// and who goes have to meet at the same file.
+/// Locked while an agent is leaving; the kernel unlocks it when the process is gone. Never removed: the agent
+/// that starts and the one that leaves have to meet at the same file.
 int openLock(int flags) {
     const std::string directory = stateDirectory();
     if (directory.empty()) return -1;

@@ -74,7 +74,7 @@ class RealSystemLog : public SystemLog {
 
     void echo(const std::string& line) const {
         const std::string whole = programName_ + "[" + std::to_string(getpid()) + "]: " + line + "\n";
-        // One write, so that lines of several threads do not mix. Nobody is left to tell when it fails.
+        // One write, so that lines of several threads do not mix. A failure cannot be reported anywhere.
         [[maybe_unused]] const ssize_t written = ::write(STDERR_FILENO, whole.data(), whole.size());
     }
 

@@ -17,7 +17,7 @@ struct State {
     std::mutex mutex;
     long open = 0;
     std::vector<std::function<void()>> waiting;
-    /// Null: nobody waits for the process to be idle.
+    /// Null while no function waits for the process to be idle.
     std::function<void()> whenIdle;
     double idleSeconds = 0;
     double idleSince = 0;

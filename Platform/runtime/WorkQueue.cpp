@@ -24,8 +24,8 @@ thread_local std::vector<const WorkQueue::State*> tCurrentQueues;
 /// Whether the current thread runs a queued task, and so counts as work for the clock.
 thread_local bool tRunsCountedTask = false;
 
-/// One blocked thread. While it is blocked it does not count as work; whoever ends the block counts it again
-/// before it can run, so that a simulated clock never sees a moment in which nobody works.
+/// One blocked thread. While it is blocked it does not count as work; the thread that ends the block counts
+/// it again before it can run, so that a simulated clock never sees a moment without work.
 class BlockedThread {
   public:
     void release() {
@@ -194,7 +194,8 @@ void runOnPool(const StatePointer& state) {
     runner().pool().run(state);
 }
 
-/// Gives the queue to whoever comes next. Called by the thread that has it.
+/// Hands the queue over to the next thread that waits for it, or to the pool. Called by the thread that has
+/// it.
 void passOn(const StatePointer& state, std::unique_lock<std::mutex>& lock) {
     if (state->items.empty()) {
         state->active = false;
@@ -238,7 +239,7 @@ void drain(const StatePointer& state) {
         lock.lock();
     }
     passOn(state, lock);
-    // Only now: whoever waited for the queue counts again.
+    // Only now, when the thread that waited for the queue counts again.
     Clock::shared().workEnded();
 }
 

@@ -45,7 +45,7 @@ class Preferences {
     bool remove(const std::vector<std::string>& keys) const;
 
     /// Takes the key out of the domain and keeps its bytes under the domain's name with ".damaged" and the
-    /// key with the date appended, for whoever wants to look at them.
+    /// key with the date appended, so that they can be looked at.
     bool setAside(std::string_view key) const;
 
     /// Makes everything set so far durable on disk.

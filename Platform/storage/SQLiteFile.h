@@ -1,6 +1,6 @@
 // One SQLite file of the state directory, as the stores of Platform use it. Internal to Platform.
 //
-// Whoever asks for a transaction gets the file opened, checked and, when new, laid out. What happens to a bad
+// A transaction finds the file opened, checked and, when it is new, laid out. What happens to a bad
 // file is decided here, once for all stores: a damaged one is moved aside with its companions (never deleted)
 // and a fresh one begun; one that a newer version wrote is refused and left alone; anything that may pass
 // (permission, full disk, an I/O error, another process holding it) fails the operation, keeps the file, and

@@ -53,8 +53,8 @@ struct Reading {
     }
 };
 
-/// Calls `deliver(events)` unless the reading was stopped. The library's frames lie between here and whoever
-/// started the reading, so nothing may be thrown through them.
+/// Calls `deliver(events)` unless the reading was stopped. The library's frames lie between here and the
+/// caller of the reading, so nothing may be thrown through them.
 template <typename Deliver>
 void guarded(void* context, Deliver deliver) noexcept {
     auto& reading = *static_cast<Reading*>(context);

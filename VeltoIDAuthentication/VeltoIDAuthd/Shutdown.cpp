@@ -28,11 +28,11 @@ constexpr const char* kIdleExitVariable = "HARBWELL_IDLE_EXIT";
 constexpr double kDefaultIdleExit = 30;
 
 /// How long open transactions may hold up the end after SIGTERM, and after a command (seconds).
-constexpr double kLongestTermination = 10;
-constexpr double kLongestCommandedEnd = 1;
+constexpr double kMaxTermination = 10;
+constexpr double kMaxCommandedEnd = 1;
 
 /// A service manager that is busy longer does not keep an ending process (seconds).
-constexpr double kLongestHandOver = 2;
+constexpr double kMaxHandOver = 2;
 
 /// Main thread only.
 struct Leaving {
@@ -92,7 +92,7 @@ void shutDownWithin(double seconds) {
     platform::WorkQueue::main().asyncAfter(seconds, endProcess);
 }
 
-void terminate() { shutDownWithin(kLongestTermination); }
+void terminate() { shutDownWithin(kMaxTermination); }
 
 void shutDownWhenIdle(double seconds) {
     platform::transactions::whenNoneWasOpenFor(seconds, [seconds] {
@@ -122,13 +122,13 @@ void endAfterPendingWork() {
         platform::event_loop::stop(EXIT_SUCCESS);
     };
     mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
-    mainQueue.asyncAfter(kLongestHandOver, end);
+    mainQueue.asyncAfter(kMaxHandOver, end);
     while (!mainQueue.isCurrent() && !platform::Lifetime::current().isEnding())
-        (void)platform::Semaphore().wait(kLongestTermination);
+        (void)platform::Semaphore().wait(kMaxTermination);
 }
 
 void shutDownByCommand() {
-    platform::WorkQueue::main().async([] { shutDownWithin(kLongestCommandedEnd); });
+    platform::WorkQueue::main().async([] { shutDownWithin(kMaxCommandedEnd); });
 }
 
 }  // namespace veltoid

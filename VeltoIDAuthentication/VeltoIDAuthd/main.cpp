@@ -16,7 +16,7 @@ namespace veltoid {
 namespace {
 
 /// What still blocks when the agent has been told to end is not waited for (seconds).
-constexpr unsigned kLongestEnd = 1;
+constexpr unsigned kMaxEnd = 1;
 
 /// Memory of this process holds password hashes: it is never written to a core file, nor open to debuggers.
 void keepMemoryPrivate() {
@@ -38,7 +38,7 @@ int showUsage(int argc, char* const* argv, const CommandLineError& error) {
 
 void limitEnd() {
     std::signal(SIGALRM, [](int) { _exit(EXIT_SUCCESS); });
-    alarm(kLongestEnd);
+    alarm(kMaxEnd);
 }
 
 }  // namespace
