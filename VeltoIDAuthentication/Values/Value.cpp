@@ -109,8 +109,8 @@ Value::Value(const Value& other) noexcept : kind_(other.kind_), numberKind_(othe
     std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_), sizeof payload_);
     if (kind_ < Kind::String) return;
     detail::Counted* node = nullptr;
-    static_assert(sizeof(payload_) == sizeof node);
-    std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof node);
+    static_assert(sizeof payload_ == sizeof(void*));
+    std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof payload_);
     if (node != nullptr) node->references.fetch_add(1, std::memory_order_relaxed);
 }
 
