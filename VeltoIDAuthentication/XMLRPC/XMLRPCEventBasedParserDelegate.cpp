@@ -65,17 +65,10 @@ bool XMLRPCEventBasedParserDelegate::push(XMLRPCElementType type) {
 }
 
 bool XMLRPCEventBasedParserDelegate::startElement(XMLRPCTag tag) {
-    switch (tag) {
-        case XMLRPCTag::Value:
-            return push(XMLRPCElementType::String);
-        case XMLRPCTag::Member:
-            return push(XMLRPCElementType::Member);
-        case XMLRPCTag::Name:
-            return push(XMLRPCElementType::Name);
-        default:
-            setElementType(tag);
-            return true;
-    }
+    if (tag == XMLRPCTag::Value) return push(XMLRPCElementType::String);
+    if (isNode(tag)) return push(static_cast<XMLRPCElementType>(tag));
+    setElementType(tag);
+    return true;
 }
 
 void XMLRPCEventBasedParserDelegate::setElementType(XMLRPCTag tag) {
