@@ -7,6 +7,12 @@ namespace veltoidctl {
 
 namespace message = veltoid::message;
 
+Request requestWithPassword(int64_t command, const Arguments& arguments) {
+    return {.command = command,
+            .account = arguments.account,
+            .passwordHash = readPasswordHash(arguments.password, arguments.account)};
+}
+
 Json send(AgentConnection& agent, const Request& request) {
     return agent.send([&](platform::ValueSink& sink) {
         sink.beginDictionary();

@@ -11,6 +11,7 @@
 
 #include "Platform/runtime/SecureMemory.h"
 #include "veltoidctl/AgentConnection.h"
+#include "veltoidctl/Arguments.h"
 
 namespace veltoidctl {
 
@@ -24,6 +25,9 @@ struct Request {
     /// Writes the keys and values that only this command has.
     std::function<void(platform::ValueSink&)> entries = {};
 };
+
+/// A request about the account that was named, with its password. Throws like readPasswordHash.
+Request requestWithPassword(int64_t command, const Arguments& arguments);
 
 /// The agent's reply. Throws Unreachable.
 Json send(AgentConnection& agent, const Request& request);

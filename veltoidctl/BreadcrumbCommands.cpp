@@ -16,15 +16,13 @@ namespace message = veltoid::message;
 
 int setBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
     const platform::SecretBytes data = readInput(arguments.input);
-    const Request request{.command = veltoid::command::kSetBreadcrumb,
-                          .account = arguments.account,
-                          .passwordHash = readPasswordHash(arguments.password, arguments.account),
-                          .entries = [&](platform::ValueSink& sink) {
-                              sink.key(message::kBreadcrumbKey);
-                              sink.string(arguments.key);
-                              sink.key(message::kBreadcrumb);
-                              sink.data(data);
-                          }};
+    Request request = requestWithPassword(veltoid::command::kSetBreadcrumb, arguments);
+    request.entries = [&](platform::ValueSink& sink) {
+        sink.key(message::kBreadcrumbKey);
+        sink.string(arguments.key);
+        sink.key(message::kBreadcrumb);
+        sink.data(data);
+    };
     return present(send(agent, request), arguments, "breadcrumb set", [&](const Json&) {
         std::cout << "the server keeps " << data.size() << " bytes under " << arguments.key << "\n";
     });
@@ -35,13 +33,11 @@ int getBreadcrumb(AgentConnection& agent, const Arguments& arguments) {
     // A terminal gets it in a form that is fit for one.
     const bool isShown = !hasFile && (arguments.json || standardOutputIsTerminal());
     const PrivateOutput output(arguments.output, arguments.force || isShown);
-    const Request request{.command = veltoid::command::kGetBreadcrumb,
-                          .account = arguments.account,
-                          .passwordHash = readPasswordHash(arguments.password, arguments.account),
-                          .entries = [&](platform::ValueSink& sink) {
-                              sink.key(message::kBreadcrumbKey);
-                              sink.string(arguments.key);
-                          }};
+    Request request = requestWithPassword(veltoid::command::kGetBreadcrumb, arguments);
+    request.entries = [&](platform::ValueSink& sink) {
+        sink.key(message::kBreadcrumbKey);
+        sink.string(arguments.key);
+    };
     const Json reply = send(agent, request);
     const veltoid::Data data = dataIn(reply, message::kBreadcrumb);
     if (data && !isShown) output.write(data.bytes());

@@ -106,11 +106,8 @@ int certificate(AgentConnection& agent, const Arguments& arguments) {
     return present(
         shown, arguments, "certificate",
         [&](const Json&) {
-            if (pem.empty()) {
-                printDescription(found);
-            } else {
-                std::cout << pem;
-            }
+            if (pem.empty()) printDescription(found);
+            std::cout << pem;
         },
         found.whyThereIsNone());
 }

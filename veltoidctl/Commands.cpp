@@ -45,7 +45,7 @@ void printOutcome(const ClientCertificate& found, const Arguments& arguments) {
     }
 }
 
-/// What somebody who added the account would miss; empty when nothing is.
+/// What is missing from the account that was added; empty when nothing is.
 std::string shortcoming(const Json& reply, const Arguments& arguments, const ClientCertificate& found) {
     if (!reply.contains(message::kEncDsId) && !arguments.withoutSigningIn)
         return "is stored on this device, but could not be signed in";
@@ -70,9 +70,7 @@ int ping(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int add(AgentConnection& agent, const Arguments& arguments) {
-    Request request{.command = command::kAdd,
-                    .account = arguments.account,
-                    .passwordHash = readPasswordHash(arguments.password, arguments.account)};
+    Request request = requestWithPassword(command::kAdd, arguments);
     if (arguments.withoutSigningIn) request.options.emplace_back(option::kDoNotCheckPassword, true);
     if (arguments.withCertificate) request.options.emplace_back(option::kCreateRequestAsynchronously, false);
     if (arguments.waitSeconds > 0)
@@ -152,9 +150,7 @@ int status(AgentConnection& agent, const Arguments& arguments) {
 }
 
 int verify(AgentConnection& agent, const Arguments& arguments) {
-    const Request request{.command = command::kVerify,
-                          .account = arguments.account,
-                          .passwordHash = readPasswordHash(arguments.password, arguments.account)};
+    const Request request = requestWithPassword(command::kVerify, arguments);
     return present(send(agent, request), arguments, "verify", [&](const Json&) {
         std::cout << "the server accepts the password of " << arguments.account << "\n";
     });

@@ -18,15 +18,8 @@ using platform::keychain::Protection;
 constexpr const char* kQuestion = "Passphrase of the keychain: ";
 
 const char* nameOf(Protection protection) {
-    switch (protection) {
-        case Protection::NoPassphrase:
-            return "no passphrase";
-        case Protection::Locked:
-            return "locked";
-        case Protection::Unlocked:
-            break;
-    }
-    return "unlocked";
+    if (protection == Protection::NoPassphrase) return "no passphrase";
+    return protection == Protection::Locked ? "locked" : "unlocked";
 }
 
 std::string reasonFor(platform::KeychainStatus status) {

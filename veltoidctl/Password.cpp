@@ -16,8 +16,8 @@ namespace {
 
 constexpr size_t kMaxPasswordBytes = 4'096;
 
-/// Reads up to the line's end, byte by byte: what follows belongs to somebody else. No buffer but this one
-/// sees it.
+/// Reads up to the line's end, byte by byte: what follows is not part of the password. No other buffer sees
+/// it.
 platform::SecretText readLine(int descriptor) {
     platform::SecretText line;
     line.reserve(kMaxPasswordBytes);
@@ -77,13 +77,7 @@ platform::SecretText hashOf(const platform::SecretText& password) {
 }  // namespace
 
 platform::SecretText readPasswordHash(PasswordSource source, const std::string& account) {
-    switch (source) {
-        case PasswordSource::HashedStandardInput:
-            return readLine(STDIN_FILENO);
-        case PasswordSource::StandardInput:
-        case PasswordSource::Prompt:
-            break;
-    }
+    if (source == PasswordSource::HashedStandardInput) return readLine(STDIN_FILENO);
     return hashOf(readPassword(source, "Password for " + account + ": "));
 }
 

@@ -1,9 +1,7 @@
 #include "IPCHelpers/MessageValue.h"
 
 #include <algorithm>
-#include <cmath>
 #include <cstdio>
-#include <ctime>
 
 #include "Platform/encoding/CalendarText.h"
 #include "Platform/encoding/HexText.h"

@@ -101,11 +101,8 @@ void appendData(std::string& text, std::span<const uint8_t> bytes) {
         return (byte >= 32 && byte <= 126) || byte == '\t' || byte == '\n' || byte == '\r';
     });
     text += '$';
-    if (printable) {
-        appendQuoted(text, {reinterpret_cast<const char*>(bytes.data()), bytes.size()});
-    } else {
-        text += platform::hexText(bytes);
-    }
+    if (!printable) return void(text += platform::hexText(bytes));
+    appendQuoted(text, {reinterpret_cast<const char*>(bytes.data()), bytes.size()});
 }
 
 void appendDate(std::string& text, double date) {
@@ -124,15 +121,9 @@ void appendDate(std::string& text, double date) {
 
     std::tm calendar{};
     // Years beyond what the calendar can hold: nothing sensible to print.
-    if (!std::isfinite(date) || std::abs(date) > 6e16) {
-        text += "?";
-        return;
-    }
+    if (!std::isfinite(date) || std::abs(date) > 6e16) return void(text += "?");
     const auto seconds = static_cast<time_t>(std::floor(date));
-    if (localtime_r(&seconds, &calendar) == nullptr) {
-        text += "?";
-        return;
-    }
+    if (localtime_r(&seconds, &calendar) == nullptr) return void(text += "?");
     std::array<char, 64> buffer{};
     const int length = std::snprintf(buffer.data(), buffer.size(), "%04d/%02d/%02d %02d:%02d:%02d",
                                      calendar.tm_year + 1900, calendar.tm_mon + 1, calendar.tm_mday,
@@ -141,10 +132,7 @@ void appendDate(std::string& text, double date) {
 }
 
 void appendFloating(std::string& text, double number) {
-    if (std::isnan(number)) {
-        text += "NAN";
-        return;
-    }
+    if (std::isnan(number)) return void(text += "NAN");
     std::ostringstream stream;
     stream << std::showpoint << number;
     text += stream.str();
@@ -156,22 +144,17 @@ void appendRawNumber(std::string& text, uint64_t number) {
     std::memcpy(bytes.data(), &number, sizeof number);
     const auto* firstUsed = std::find_if(bytes.begin(), bytes.end(), [](uint8_t byte) { return byte != 0; });
     text += "0x";
-    if (firstUsed == bytes.end()) {
-        text += '0';
-    } else {
-        text += platform::hexText({firstUsed, bytes.end()}, platform::kUpperCaseDigits);
-    }
+    if (firstUsed == bytes.end()) return void(text += '0');
+    text += platform::hexText({firstUsed, bytes.end()}, platform::kUpperCaseDigits);
 }
 
 void appendNumber(std::string& text, const Value& number) {
     switch (*number.numberKind()) {
         case NumberKind::Float32:
         case NumberKind::Float64:
-            appendFloating(text, *number.asDouble());
-            break;
+            return appendFloating(text, *number.asDouble());
         case NumberKind::UInt64:
-            appendRawNumber(text, *number.asUInt64());
-            break;
+            return appendRawNumber(text, *number.asUInt64());
         default:
             text += std::to_string(*number.asInt64());
     }
@@ -204,12 +187,8 @@ struct ObjectWriter {
 
     void operator()(const CertificateDescription& certificate) const {
         text += "CERT:";
-        if (certificate.subjectSummary) {
-            append(text, certificate.subjectSummary);
-            text += "  ";
-        } else {
-            text += ' ';
-        }
+        if (certificate.subjectSummary) append(text, certificate.subjectSummary);
+        text += certificate.subjectSummary ? "  " : " ";
     }
     void operator()(const KeyDescription& key) const {
         text += "KEY:";
@@ -246,44 +225,31 @@ struct ObjectWriter {
 void append(std::string& text, const Value& value) {
     switch (value.kind()) {
         case Value::Kind::Absent:
-            text += "[ NULL ] ";
-            break;
+            return void(text += "[ NULL ] ");
         case Value::Kind::Null:
-            text += "NULL";
-            break;
+            return void(text += "NULL");
         case Value::Kind::Boolean:
-            text += *value.asBoolean() ? "true" : "false";
-            break;
+            return void(text += *value.asBoolean() ? "true" : "false");
         case Value::Kind::Number:
-            appendNumber(text, value);
-            break;
+            return appendNumber(text, value);
         case Value::Kind::Date:
-            appendDate(text, *value.asDate());
-            break;
+            return appendDate(text, *value.asDate());
         case Value::Kind::String:
-            appendQuoted(text, *value.asText());
-            break;
+            return appendQuoted(text, *value.asText());
         case Value::Kind::Data:
-            appendData(text, value.asData().bytes());
-            break;
+            return appendData(text, value.asData().bytes());
         case Value::Kind::Array:
-            appendArray(text, *value.asArray());
-            break;
+            return appendArray(text, *value.asArray());
         case Value::Kind::Dictionary:
-            appendDictionary(text, *value.asDictionary());
-            break;
+            return appendDictionary(text, *value.asDictionary());
         case Value::Kind::URL:
-            appendURL(text, *value.asURL());
-            break;
+            return appendURL(text, *value.asURL());
         case Value::Kind::UUID:
-            appendData(text, *value.asUUID());
-            break;
+            return appendData(text, *value.asUUID());
         case Value::Kind::Error:
-            appendError(text, *value.asError());
-            break;
+            return appendError(text, *value.asError());
         case Value::Kind::Object:
-            std::visit(ObjectWriter{text}, value.asObject()->description);
-            break;
+            return std::visit(ObjectWriter{text}, value.asObject()->description);
     }
 }
 

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <string_view>
+#include <utility>
 
 namespace veltoid {
 
@@ -29,34 +30,23 @@ enum class AccountState : int {
 
 /// The name that clients see.
 constexpr std::string_view nameOf(AccountState state) {
-    switch (state) {
-        case AccountState::NoEncodedDSID:
-            return "NoEncodedDSID";
-        case AccountState::PasswordInaccessibleInKeychain:
-            return "PasswordInaccessibleInKeychain";
-        case AccountState::PasswordInvalid:
-            return "PasswordInvalid";
-        case AccountState::NoCertificate:
-            return "NoCertificate";
-        case AccountState::CertificateRevoked:
-            return "CertificateRevoked";
-        case AccountState::CertificateExpired:
-            return "CertificateExpired";
-        case AccountState::Unknown:
-            return "Unknown";
-        case AccountState::CertificateOK:
-            return "CertificateOK";
-        case AccountState::CertificateAssumedOK:
-            return "CertificateAssumedOK";
-        case AccountState::CertificateShouldBeRenewed:
-            return "CertificateShouldBeRenewed";
-        case AccountState::CertificateMustBeRenewed:
-            return "CertificateMustBeRenewed";
-        case AccountState::ValidationRecordNeedsToBeUpdated:
-            return "VeltoIDValidationRecordNeedsToBeUpdated";
-        case AccountState::CertificatePending:
-            return "CertificatePending";
-    }
+    constexpr std::pair<AccountState, std::string_view> kNames[] = {
+        {AccountState::NoEncodedDSID, "NoEncodedDSID"},
+        {AccountState::PasswordInaccessibleInKeychain, "PasswordInaccessibleInKeychain"},
+        {AccountState::PasswordInvalid, "PasswordInvalid"},
+        {AccountState::NoCertificate, "NoCertificate"},
+        {AccountState::CertificateRevoked, "CertificateRevoked"},
+        {AccountState::CertificateExpired, "CertificateExpired"},
+        {AccountState::Unknown, "Unknown"},
+        {AccountState::CertificateOK, "CertificateOK"},
+        {AccountState::CertificateAssumedOK, "CertificateAssumedOK"},
+        {AccountState::CertificateShouldBeRenewed, "CertificateShouldBeRenewed"},
+        {AccountState::CertificateMustBeRenewed, "CertificateMustBeRenewed"},
+        {AccountState::ValidationRecordNeedsToBeUpdated, "VeltoIDValidationRecordNeedsToBeUpdated"},
+        {AccountState::CertificatePending, "CertificatePending"},
+    };
+    for (const auto& [known, name] : kNames)
+        if (known == state) return name;
     return {};
 }
 

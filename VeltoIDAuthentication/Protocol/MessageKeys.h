@@ -6,66 +6,68 @@
 
 namespace veltoid::message {
 
+using Key = std::string_view;
+
 // Requests.
-inline constexpr std::string_view kCommand = "command";
-inline constexpr std::string_view kAccount = "VeltoID";
-inline constexpr std::string_view kHashedPassword = "hashedpassword";
-inline constexpr std::string_view kOptions = "options";
-inline constexpr std::string_view kCriteria = "criteria";
-inline constexpr std::string_view kEncDsId = "encDsId";
-inline constexpr std::string_view kCertificateType = "CertificateType";
-inline constexpr std::string_view kBreadcrumbKey = "identifier";
-inline constexpr std::string_view kBreadcrumb = "breadcrumb";
-inline constexpr std::string_view kIdentityReference = "identityReferenceData";
+inline constexpr Key kCommand = "command";
+inline constexpr Key kAccount = "VeltoID";
+inline constexpr Key kHashedPassword = "hashedpassword";
+inline constexpr Key kOptions = "options";
+inline constexpr Key kCriteria = "criteria";
+inline constexpr Key kEncDsId = "encDsId";
+inline constexpr Key kCertificateType = "CertificateType";
+inline constexpr Key kBreadcrumbKey = "identifier";
+inline constexpr Key kBreadcrumb = "breadcrumb";
+inline constexpr Key kIdentityReference = "identityReferenceData";
 
 // Setting a value of the database: where (one of the sections below), of what, which, and to what.
-inline constexpr std::string_view kSection = "domain";
-inline constexpr std::string_view kItem = "item";
-inline constexpr std::string_view kKey = "key";
-inline constexpr std::string_view kValue = "value";
-inline constexpr std::string_view kAccountsSection = "Accounts";
-inline constexpr std::string_view kCertificatesSection = "Certificates";
-inline constexpr std::string_view kMetaInfoSection = "MetaInfo";
+inline constexpr Key kSection = "domain";
+inline constexpr Key kItem = "item";
+inline constexpr Key kKey = "key";
+inline constexpr Key kValue = "value";
+inline constexpr Key kAccountsSection = "Accounts";
+inline constexpr Key kCertificatesSection = "Certificates";
+inline constexpr Key kMetaInfoSection = "MetaInfo";
 
 /// The value of kCertificateType that asks for the signed record of validated items.
-inline constexpr std::string_view kValidationRecordType = "VeltoIDValidatedItemsRecordDataCertificateType";
+inline constexpr Key kValidationRecordType = "VeltoIDValidatedItemsRecordDataCertificateType";
 
 // Replies.
-inline constexpr std::string_view kSuccess = "success";
-inline constexpr std::string_view kError = "error";
-inline constexpr std::string_view kResult = "result";
-inline constexpr std::string_view kInfo = "info";
-inline constexpr std::string_view kStatus = "status";
+inline constexpr Key kSuccess = "success";
+inline constexpr Key kError = "error";
+inline constexpr Key kResult = "result";
+inline constexpr Key kInfo = "info";
+inline constexpr Key kStatus = "status";
 /// The account's record: after adding it, and after forgetting it.
-inline constexpr std::string_view kAddedAccount = "accountinfo";
-inline constexpr std::string_view kForgottenAccount = "accountInfo";
-inline constexpr std::string_view kForgottenEncDsId = "encDSID";
+inline constexpr Key kAddedAccount = "accountinfo";
+inline constexpr Key kForgottenAccount = "accountInfo";
+inline constexpr Key kForgottenEncDsId = "encDSID";
 
 // An error in a reply.
-inline constexpr std::string_view kErrorDomain = "Domain";
-inline constexpr std::string_view kErrorCode = "Code";
-inline constexpr std::string_view kErrorUserInfo = "UserInfo";
+inline constexpr Key kErrorDomain = "Domain";
+inline constexpr Key kErrorCode = "Code";
+inline constexpr Key kErrorUserInfo = "UserInfo";
 
 // Account information, beside keys of the record.
-inline constexpr std::string_view kAllEmails = "AllEmails";
-inline constexpr std::string_view kCertificatePEM = "CertificatePEM";
-inline constexpr std::string_view kCertificateExpiration = "CertificateExpiration";
-inline constexpr std::string_view kCertificateDate = "CertificateDate";
+inline constexpr Key kAllEmails = "AllEmails";
+inline constexpr Key kCertificatePEM = "CertificatePEM";
+inline constexpr Key kCertificateExpiration = "CertificateExpiration";
+inline constexpr Key kCertificateDate = "CertificateDate";
 
 // Certificate information, beside keys of the certificate entry.
-inline constexpr std::string_view kCertificateData = "CertificateData";
+inline constexpr Key kCertificateData = "CertificateData";
 
 // Status: of the agent, and of each account.
-inline constexpr std::string_view kAccountStatuses = "AccountStatuses";
-inline constexpr std::string_view kDirtyAccounts = "DirtyAccounts";
-inline constexpr std::string_view kDirtyAccountsAndCertificates = "DirtyAccountsAndCertificates";
-inline constexpr std::string_view kLaunchTime = "LaunchTime";
-inline constexpr std::string_view kNextLaunchTime = "NextLaunchTime";
-inline constexpr std::string_view kProcessID = "pid";
-inline constexpr std::string_view kUnlockedSinceBoot = "DeviceUnlockedSinceBoot";
-inline constexpr std::string_view kAccountState = "AccountState";
-inline constexpr std::string_view kNextActionTime = "NextActionTime";
-inline constexpr std::string_view kNextFetchAttempt = "NextFetchAttempt";
-inline constexpr std::string_view kRequiresUserAction = "AccountRequiresUserAction";
+inline constexpr Key kAccountStatuses = "AccountStatuses";
+inline constexpr Key kDirtyAccounts = "DirtyAccounts";
+inline constexpr Key kDirtyAccountsAndCertificates = "DirtyAccountsAndCertificates";
+inline constexpr Key kLaunchTime = "LaunchTime";
+inline constexpr Key kNextLaunchTime = "NextLaunchTime";
+inline constexpr Key kProcessID = "pid";
+inline constexpr Key kUnlockedSinceBoot = "DeviceUnlockedSinceBoot";
+inline constexpr Key kAccountState = "AccountState";
+inline constexpr Key kNextActionTime = "NextActionTime";
+inline constexpr Key kNextFetchAttempt = "NextFetchAttempt";
+inline constexpr Key kRequiresUserAction = "AccountRequiresUserAction";
 
 }  // namespace veltoid::message

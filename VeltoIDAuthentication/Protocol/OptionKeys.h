@@ -6,36 +6,37 @@
 
 namespace veltoid::option {
 
+using Key = std::string_view;
+
 // Booleans.
-inline constexpr std::string_view kCheckNetwork = "CheckNetwork";
-inline constexpr std::string_view kDirty = "Dirty";
-inline constexpr std::string_view kDoNotCheckPassword = "DoNotCheckPassword";
-inline constexpr std::string_view kDoNotFetchInformation =
-    "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord";
-inline constexpr std::string_view kDoNotCreateRequest = "DoNotCreateCSR";
-inline constexpr std::string_view kCreateRequestAsynchronously = "CreateCSRAsynchronously";
-inline constexpr std::string_view kForceCertificateCreation = "ForceCertificateCreation";
-inline constexpr std::string_view kSkipValidation = "SkipValidation";
-inline constexpr std::string_view kDeferValidation = "DeferValidation";
-inline constexpr std::string_view kForceValidation = "ForceValidation";
-inline constexpr std::string_view kForceValidationRecordFetch = "ForceValidationRecordFetch";
-inline constexpr std::string_view kValidateCertificateSerialNumber = "ValidateCertificateSerialNumber";
-inline constexpr std::string_view kRemoveCertificate = "RemoveCertificateFromKeychain";
-inline constexpr std::string_view kRemovePrivateKey = "RemovePrivateKeyFromKeychain";
-inline constexpr std::string_view kDoNotUseCachedSession = "DoNotUseCachedSession";
-inline constexpr std::string_view kDoNotSaveSessionInfo = "DoNotSaveSessionInfo";
+inline constexpr Key kCheckNetwork = "CheckNetwork";
+inline constexpr Key kDirty = "Dirty";
+inline constexpr Key kDoNotCheckPassword = "DoNotCheckPassword";
+inline constexpr Key kDoNotFetchInformation = "VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord";
+inline constexpr Key kDoNotCreateRequest = "DoNotCreateCSR";
+inline constexpr Key kCreateRequestAsynchronously = "CreateCSRAsynchronously";
+inline constexpr Key kForceCertificateCreation = "ForceCertificateCreation";
+inline constexpr Key kSkipValidation = "SkipValidation";
+inline constexpr Key kDeferValidation = "DeferValidation";
+inline constexpr Key kForceValidation = "ForceValidation";
+inline constexpr Key kForceValidationRecordFetch = "ForceValidationRecordFetch";
+inline constexpr Key kValidateCertificateSerialNumber = "ValidateCertificateSerialNumber";
+inline constexpr Key kRemoveCertificate = "RemoveCertificateFromKeychain";
+inline constexpr Key kRemovePrivateKey = "RemovePrivateKeyFromKeychain";
+inline constexpr Key kDoNotUseCachedSession = "DoNotUseCachedSession";
+inline constexpr Key kDoNotSaveSessionInfo = "DoNotSaveSessionInfo";
 /// Certificate information also tells of the intermediate certificate and of the next renewal.
-inline constexpr std::string_view kCertificateDetails = "CertificateDetails";
-inline constexpr std::string_view kTerminateServer = "VeltoIDAuthenticationStatusTerminateServer";
+inline constexpr Key kCertificateDetails = "CertificateDetails";
+inline constexpr Key kTerminateServer = "VeltoIDAuthenticationStatusTerminateServer";
 
 /// Seconds: how long an add waits for the certificate.
-inline constexpr std::string_view kCertificateWait = "certwaitduration";
+inline constexpr Key kCertificateWait = "certwaitduration";
 
 /// Strings, passed on to the server with a certificate request.
-inline constexpr std::string_view kFetchDelayMinimum = "__CERT_FETCH_DELAY_MIN";
-inline constexpr std::string_view kFetchDelayMaximum = "__CERT_FETCH_DELAY_MAX";
+inline constexpr Key kFetchDelayMinimum = "__CERT_FETCH_DELAY_MIN";
+inline constexpr Key kFetchDelayMaximum = "__CERT_FETCH_DELAY_MAX";
 
 /// A URL or String.
-inline constexpr std::string_view kServerURL = "ServerURL";
+inline constexpr Key kServerURL = "ServerURL";
 
 }  // namespace veltoid::option

@@ -7,155 +7,148 @@
 
 namespace veltoid {
 
-inline constexpr std::string_view kVeltoIDDBDefaultDomain = "com.velto.harbwell.veltoidauthenticationinfo";
+using RecordKey = std::string_view;
+
+inline constexpr RecordKey kVeltoIDDBDefaultDomain = "com.velto.harbwell.veltoidauthenticationinfo";
 
 // Top level of the preference domain.
-inline constexpr std::string_view kVeltoIDDBVersionKey = "Version";
-inline constexpr std::string_view kVeltoIDDBCreationDateKey = "CreationDate";
-inline constexpr std::string_view kVeltoIDDBAccountsKey = "Accounts";
-inline constexpr std::string_view kVeltoIDDBCertificatesKey = "AuthCertificates";
-inline constexpr std::string_view kVeltoIDDBMetaInfoKey = "MetaInfo";
+inline constexpr RecordKey kVeltoIDDBVersionKey = "Version";
+inline constexpr RecordKey kVeltoIDDBCreationDateKey = "CreationDate";
+inline constexpr RecordKey kVeltoIDDBAccountsKey = "Accounts";
+inline constexpr RecordKey kVeltoIDDBCertificatesKey = "AuthCertificates";
+inline constexpr RecordKey kVeltoIDDBMetaInfoKey = "MetaInfo";
 /// What the certificates are called where nothing is stored.
-inline constexpr std::string_view kVeltoIDDBUnstoredCertificatesKey = "Certificates";
-inline constexpr std::string_view kVeltoIDDBAccessorVersionsKey = "AccessorVersions";
+inline constexpr RecordKey kVeltoIDDBUnstoredCertificatesKey = "Certificates";
+inline constexpr RecordKey kVeltoIDDBAccessorVersionsKey = "AccessorVersions";
 
 // Account records.
-inline constexpr std::string_view kVeltoIDAccountNameKey = "VeltoID";
-inline constexpr std::string_view kVeltoIDAccountDSIDKey = "encDsId";
-inline constexpr std::string_view kVeltoIDAccountHashedPasswordKey = "HashedPassword";
-inline constexpr std::string_view kVeltoIDAccountHashedPasswordKeychainReferenceKey = "HashedPasswordRef";
-inline constexpr std::string_view kVeltoIDAccountFirstNameKey = "FirstName";
-inline constexpr std::string_view kVeltoIDAccountLastNameKey = "LastName";
-inline constexpr std::string_view kVeltoIDAccountPrimaryEmailKey = "PrimaryEmail";
+inline constexpr RecordKey kVeltoIDAccountNameKey = "VeltoID";
+inline constexpr RecordKey kVeltoIDAccountDSIDKey = "encDsId";
+inline constexpr RecordKey kVeltoIDAccountHashedPasswordKey = "HashedPassword";
+inline constexpr RecordKey kVeltoIDAccountHashedPasswordKeychainReferenceKey = "HashedPasswordRef";
+inline constexpr RecordKey kVeltoIDAccountFirstNameKey = "FirstName";
+inline constexpr RecordKey kVeltoIDAccountLastNameKey = "LastName";
+inline constexpr RecordKey kVeltoIDAccountPrimaryEmailKey = "PrimaryEmail";
 /// The key is spelled so in every stored database.
-inline constexpr std::string_view kVeltoIDAccountEmailAddressesKey = "EmailAddresess";
-inline constexpr std::string_view kVeltoIDAccountValidatedEmailKey = "ValidatedEmail";
-inline constexpr std::string_view kVeltoIDAccountValidatedPhonesKey = "ValidatedPhones";
-inline constexpr std::string_view kVeltoIDAccountCreationDateKey = "CreationDate";
-inline constexpr std::string_view kVeltoIDAccountModificationDateKey = "ModificationDate";
-inline constexpr std::string_view kVeltoIDAccountLastValidationDateKey = "ValidationDate";
-inline constexpr std::string_view kVeltoIDAccountNextValidationDateKey = "NextValidationDate";
-inline constexpr std::string_view kVeltoIDAccountForceValidationKey = "ForceValidation";
-inline constexpr std::string_view kVeltoIDAccountCertificateTokenKey = "CertificateToken";
-inline constexpr std::string_view kVeltoIDAccountCertificateTokenExpirationKey = "CertificateTokenExpiration";
-inline constexpr std::string_view kVeltoIDAccountCSRGenerationDateKey = "CSRGenerationDate";
+inline constexpr RecordKey kVeltoIDAccountEmailAddressesKey = "EmailAddresess";
+inline constexpr RecordKey kVeltoIDAccountValidatedEmailKey = "ValidatedEmail";
+inline constexpr RecordKey kVeltoIDAccountValidatedPhonesKey = "ValidatedPhones";
+inline constexpr RecordKey kVeltoIDAccountCreationDateKey = "CreationDate";
+inline constexpr RecordKey kVeltoIDAccountModificationDateKey = "ModificationDate";
+inline constexpr RecordKey kVeltoIDAccountLastValidationDateKey = "ValidationDate";
+inline constexpr RecordKey kVeltoIDAccountNextValidationDateKey = "NextValidationDate";
+inline constexpr RecordKey kVeltoIDAccountForceValidationKey = "ForceValidation";
+inline constexpr RecordKey kVeltoIDAccountCertificateTokenKey = "CertificateToken";
+inline constexpr RecordKey kVeltoIDAccountCertificateTokenExpirationKey = "CertificateTokenExpiration";
+inline constexpr RecordKey kVeltoIDAccountCSRGenerationDateKey = "CSRGenerationDate";
 /// Seconds.
-inline constexpr std::string_view kVeltoIDAccountCSRGenerationIntervalKey = "CSRGenerationInterval";
+inline constexpr RecordKey kVeltoIDAccountCSRGenerationIntervalKey = "CSRGenerationInterval";
 /// Dates of the last requests that were sent, and until when further ones are held up.
-inline constexpr std::string_view kVeltoIDAccountCertificateRequestDatesKey = "CertificateRequestDates";
-inline constexpr std::string_view kVeltoIDAccountCertificateRequestsHeldUntilKey =
-    "CertificateRequestsHeldUntil";
-inline constexpr std::string_view kVeltoIDAccountCSRCreationDateKey = "CSRCreationDate";
-inline constexpr std::string_view kVeltoIDAccountCertificateNextCertificateFetchDateKey =
-    "NextCertificateFetchDate";
+inline constexpr RecordKey kVeltoIDAccountCertificateRequestDatesKey = "CertificateRequestDates";
+inline constexpr RecordKey kVeltoIDAccountCertificateRequestsHeldUntilKey = "CertificateRequestsHeldUntil";
+inline constexpr RecordKey kVeltoIDAccountCSRCreationDateKey = "CSRCreationDate";
+inline constexpr RecordKey kVeltoIDAccountCertificateNextCertificateFetchDateKey = "NextCertificateFetchDate";
 /// Seconds.
-inline constexpr std::string_view kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey =
+inline constexpr RecordKey kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey =
     "NextCertificateFetchDelta";
-inline constexpr std::string_view kVeltoIDAccountEarliestAllowedConnectionDateKey =
-    "EarliestAllowedConnectionDate";
-inline constexpr std::string_view kVeltoIDAccountClientTooOldKey = "ClientTooOld";
-inline constexpr std::string_view kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
-inline constexpr std::string_view kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
-inline constexpr std::string_view kVeltoIDAccountValidationRecordIdentifierKey =
+inline constexpr RecordKey kVeltoIDAccountEarliestAllowedConnectionDateKey = "EarliestAllowedConnectionDate";
+inline constexpr RecordKey kVeltoIDAccountClientTooOldKey = "ClientTooOld";
+inline constexpr RecordKey kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
+inline constexpr RecordKey kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
+inline constexpr RecordKey kVeltoIDAccountValidationRecordIdentifierKey =
     "VeltoIDAccountValidationRecordIdentifierKey";
-inline constexpr std::string_view kVeltoIDAccountValidationRecordDataKey =
-    "VeltoIDAccountValidationRecordData";
-inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckDateKey =
+inline constexpr RecordKey kVeltoIDAccountValidationRecordDataKey = "VeltoIDAccountValidationRecordData";
+inline constexpr RecordKey kVeltoIDAccountValidationRecordNextCheckDateKey =
     "VeltoIDAccountValidationRecordNextCheckDateKey";
 /// Seconds.
-inline constexpr std::string_view kVeltoIDAccountValidationRecordNextCheckIntervalKey =
+inline constexpr RecordKey kVeltoIDAccountValidationRecordNextCheckIntervalKey =
     "VeltoIDAccountValidationRecordNextCheckIntervalKey";
-inline constexpr std::string_view kVeltoIDAccountValidationRecordValidAsOfKey =
+inline constexpr RecordKey kVeltoIDAccountValidationRecordValidAsOfKey =
     "VeltoIDAccountValidationRecordValidAsOfKey";
 /// Seconds.
-inline constexpr std::string_view kVeltoIDAccountValidationRecordSuggestedValidIntervalKey =
+inline constexpr RecordKey kVeltoIDAccountValidationRecordSuggestedValidIntervalKey =
     "VeltoIDAccountValidationRecordSuggestedValidIntervalKey";
-inline constexpr std::string_view kVeltoIDAccountUUIDKey = "AccountUUID";
-inline constexpr std::string_view kVeltoIDAccountStableUUIDKey = "AccountStableUUID";
-inline constexpr std::string_view kVeltoIDAccountServerURLKey = "ServerURL";
-inline constexpr std::string_view kVeltoIDDirtyKey = "Dirty";
+inline constexpr RecordKey kVeltoIDAccountUUIDKey = "AccountUUID";
+inline constexpr RecordKey kVeltoIDAccountStableUUIDKey = "AccountStableUUID";
+inline constexpr RecordKey kVeltoIDAccountServerURLKey = "ServerURL";
+inline constexpr RecordKey kVeltoIDDirtyKey = "Dirty";
 
 // What earlier agents kept in account records.
-inline constexpr std::string_view kVeltoIDAccountOldCertificateKey = "Certificate";
-inline constexpr std::string_view kVeltoIDAccountOldCertificatesKey = "Certificates";
-inline constexpr std::string_view kVeltoIDAccountOldPrivateKeyKey = "PrivateKey";
+inline constexpr RecordKey kVeltoIDAccountOldCertificateKey = "Certificate";
+inline constexpr RecordKey kVeltoIDAccountOldCertificatesKey = "Certificates";
+inline constexpr RecordKey kVeltoIDAccountOldPrivateKeyKey = "PrivateKey";
 
 // Certificate entries.
-inline constexpr std::string_view kVeltoIDCertificateCertificatePersistentReferenceKey =
-    "CertificateReference";
-inline constexpr std::string_view kVeltoIDCertificatePrivateKeyPersistentReferenceKey =
+inline constexpr RecordKey kVeltoIDCertificateCertificatePersistentReferenceKey = "CertificateReference";
+inline constexpr RecordKey kVeltoIDCertificatePrivateKeyPersistentReferenceKey =
     "CertificatePrivateKeyReference";
-inline constexpr std::string_view kVeltoIDCertificateIntermediateCertificateReferenceKey =
+inline constexpr RecordKey kVeltoIDCertificateIntermediateCertificateReferenceKey =
     "IntermediateCertificateReference";
-inline constexpr std::string_view kVeltoIDCertificateNextRenewalAttemptDateKey = "NextRenewalAttempt";
-inline constexpr std::string_view kVeltoIDCertificateStatusKey = "CertStatus";
-inline constexpr std::string_view kVeltoIDCertificateExpirationDateKey = "Expires";
-inline constexpr std::string_view kVeltoIDCertificateSerialNumberKey = "SerialNumber";
-inline constexpr std::string_view kVeltoIDCertificateLastSuccessfulValidationDateKey =
-    "LastSuccessfulValidation";
-inline constexpr std::string_view kVeltoIDCertificateLastValidationAttemptDateKey = "LastValidationAttempt";
-inline constexpr std::string_view kVeltoIDCertificateCreationDateKey = "CreationDate";
-inline constexpr std::string_view kVeltoIDCertificateModificationDateKey = "ModificationDate";
-inline constexpr std::string_view kVeltoIDCertificateTypeKey = "CertType";
-inline constexpr std::string_view kVeltoIDCertificateDateKey = "Date";
+inline constexpr RecordKey kVeltoIDCertificateNextRenewalAttemptDateKey = "NextRenewalAttempt";
+inline constexpr RecordKey kVeltoIDCertificateStatusKey = "CertStatus";
+inline constexpr RecordKey kVeltoIDCertificateExpirationDateKey = "Expires";
+inline constexpr RecordKey kVeltoIDCertificateSerialNumberKey = "SerialNumber";
+inline constexpr RecordKey kVeltoIDCertificateLastSuccessfulValidationDateKey = "LastSuccessfulValidation";
+inline constexpr RecordKey kVeltoIDCertificateLastValidationAttemptDateKey = "LastValidationAttempt";
+inline constexpr RecordKey kVeltoIDCertificateCreationDateKey = "CreationDate";
+inline constexpr RecordKey kVeltoIDCertificateModificationDateKey = "ModificationDate";
+inline constexpr RecordKey kVeltoIDCertificateTypeKey = "CertType";
+inline constexpr RecordKey kVeltoIDCertificateDateKey = "Date";
 /// Certificates as PEM text: an answer of the server has the first two, an entry may have the last.
-inline constexpr std::string_view kVeltoIDCertificateCertificateKey = "Certificate";
-inline constexpr std::string_view kVeltoIDCertificateIntermediateCertificateKey = "IntermediateCertificate";
-inline constexpr std::string_view kVeltoIDCertificatePEMKey = "CertificatePEM";
+inline constexpr RecordKey kVeltoIDCertificateCertificateKey = "Certificate";
+inline constexpr RecordKey kVeltoIDCertificateIntermediateCertificateKey = "IntermediateCertificate";
+inline constexpr RecordKey kVeltoIDCertificatePEMKey = "CertificatePEM";
 
 /// Statuses of certificates, and of requests for one.
-inline constexpr std::string_view kVeltoIDCertificateStatusPending = "SIGNIN_PENDING";
-inline constexpr std::string_view kVeltoIDCertificateStatusFailed = "FAILED";
-inline constexpr std::string_view kVeltoIDCertificateStatusIssued = "CERT_ISSUED";
-inline constexpr std::string_view kVeltoIDCertificateStatusInvalid = "CERTIFICATE_INVALID";
+inline constexpr RecordKey kVeltoIDCertificateStatusPending = "SIGNIN_PENDING";
+inline constexpr RecordKey kVeltoIDCertificateStatusFailed = "FAILED";
+inline constexpr RecordKey kVeltoIDCertificateStatusIssued = "CERT_ISSUED";
+inline constexpr RecordKey kVeltoIDCertificateStatusInvalid = "CERTIFICATE_INVALID";
 
 // Meta information.
-inline constexpr std::string_view kVeltoIDMetaUserUUIDKey = "UserUUID";
-inline constexpr std::string_view kVeltoIDDBServerURLKey = "ServerURL";
-inline constexpr std::string_view kVeltoIDMetaPreExpirationIntervalKey = "PreExpirationInterval";
-inline constexpr std::string_view kVeltoIDMetaAccountPresumedValidIntervalKey =
-    "AccountPresumedValidInterval";
+inline constexpr RecordKey kVeltoIDMetaUserUUIDKey = "UserUUID";
+inline constexpr RecordKey kVeltoIDDBServerURLKey = "ServerURL";
+inline constexpr RecordKey kVeltoIDMetaPreExpirationIntervalKey = "PreExpirationInterval";
+inline constexpr RecordKey kVeltoIDMetaAccountPresumedValidIntervalKey = "AccountPresumedValidInterval";
 // Intervals, in seconds.
-inline constexpr std::string_view kVeltoIDMetaAccountValidationIntervalKey = "AccountValidationInterval";
-inline constexpr std::string_view kVeltoIDMetaCertificateValidationIntervalKey =
-    "CertificateValidationInterval";
-inline constexpr std::string_view kVeltoIDMetaCertificateRenewalIntervalKey = "CertificateRenewalInterval";
-inline constexpr std::string_view kVeltoIDMetaCertificateAssumedOKIntervalKey =
+inline constexpr RecordKey kVeltoIDMetaAccountValidationIntervalKey = "AccountValidationInterval";
+inline constexpr RecordKey kVeltoIDMetaCertificateValidationIntervalKey = "CertificateValidationInterval";
+inline constexpr RecordKey kVeltoIDMetaCertificateRenewalIntervalKey = "CertificateRenewalInterval";
+inline constexpr RecordKey kVeltoIDMetaCertificateAssumedOKIntervalKey =
     "CertificateValidationAssumedOKInterval";
-inline constexpr std::string_view kVeltoIDMetaRelaunchIntervalKey = "DefaultRelaunchInterval";
-inline constexpr std::string_view kVeltoIDMetaValidationRecordRetryIntervalKey =
+inline constexpr RecordKey kVeltoIDMetaRelaunchIntervalKey = "DefaultRelaunchInterval";
+inline constexpr RecordKey kVeltoIDMetaValidationRecordRetryIntervalKey =
     "VeltoIDMetaInfoValidationRecordRenewalAttemptInterval";
-inline constexpr std::string_view kVeltoIDMetaCertificateLifetimeKey =
+inline constexpr RecordKey kVeltoIDMetaCertificateLifetimeKey =
     "VeltoIDMetaDefaultCertificateRequestedLifetime";
-inline constexpr std::string_view kVeltoIDMetaSendServerMetaInformationItemsKey =
+inline constexpr RecordKey kVeltoIDMetaSendServerMetaInformationItemsKey =
     "VeltoIDMetaSendServerMetaInformationItems";
-inline constexpr std::string_view kVeltoIDMetaSendServerAccountInformationItemsKey =
+inline constexpr RecordKey kVeltoIDMetaSendServerAccountInformationItemsKey =
     "VeltoIDMetaSendServerAccountInformationItems";
-inline constexpr std::string_view kVeltoIDMetaLastConnectAttemptKey = "LastConnectAttempt";
-inline constexpr std::string_view kVeltoIDMetaLastSuccessfulConnectKey = "LastSuccessfulConnect";
-inline constexpr std::string_view kVeltoIDMetaAccountRequiresUserActionKey = "AccountRequiresUserAction";
+inline constexpr RecordKey kVeltoIDMetaLastConnectAttemptKey = "LastConnectAttempt";
+inline constexpr RecordKey kVeltoIDMetaLastSuccessfulConnectKey = "LastSuccessfulConnect";
+inline constexpr RecordKey kVeltoIDMetaAccountRequiresUserActionKey = "AccountRequiresUserAction";
 
 // Counters of the meta information.
-inline constexpr std::string_view kVeltoIDMetaConnectionAttemptCountKey = "VeltoIDMetaConnectionAttemptCount";
-inline constexpr std::string_view kVeltoIDMetaSuccessfulConnectionCountKey =
-    "VeltoIDMetaSuccessfulConnectionCount";
-inline constexpr std::string_view kVeltoIDMetaUnsuccessfulConnectionCountKey =
+inline constexpr RecordKey kVeltoIDMetaConnectionAttemptCountKey = "VeltoIDMetaConnectionAttemptCount";
+inline constexpr RecordKey kVeltoIDMetaSuccessfulConnectionCountKey = "VeltoIDMetaSuccessfulConnectionCount";
+inline constexpr RecordKey kVeltoIDMetaUnsuccessfulConnectionCountKey =
     "VeltoIDMetaUnsuccessfulConnectionCount";
-inline constexpr std::string_view kVeltoIDXMLAuthenticateCountKey = "VeltoIDXMLAuthenticateCount";
-inline constexpr std::string_view kVeltoIDXMLSessionReusedCountKey = "VeltoIDXMLSessionReusedCount";
-inline constexpr std::string_view kVeltoIDXMLGetMyInfoCountKey = "VeltoIDXMLGetMyInfoCount";
-inline constexpr std::string_view kVeltoIDXMLFindPersonCountKey = "VeltoIDXMLFindPersonCount";
-inline constexpr std::string_view kVeltoIDXMLSendCSRCountKey = "VeltoIDXMLSendCSRCount";
-inline constexpr std::string_view kVeltoIDXMLCompleteCertCountKey = "VeltoIDXMLCompleteCertCount";
-inline constexpr std::string_view kVeltoIDXMLFetchCertCountKey = "VeltoIDXMLFetchCertCount";
-inline constexpr std::string_view kVeltoIDFindCountKey = "VeltoIDFindCount";
-inline constexpr std::string_view kVeltoIDFindCachedCountKey = "VeltoIDFindCachedCount";
-inline constexpr std::string_view kVeltoIDAddVeltoIDCountKey = "VeltoIDAddVeltoIDCount";
-inline constexpr std::string_view kVeltoIDForgetVeltoIDCountKey = "VeltoIDForgetVeltoIDCount";
-inline constexpr std::string_view kVeltoIDGetMyInfoCountKey = "VeltoIDGetMyInfoCount";
+inline constexpr RecordKey kVeltoIDXMLAuthenticateCountKey = "VeltoIDXMLAuthenticateCount";
+inline constexpr RecordKey kVeltoIDXMLSessionReusedCountKey = "VeltoIDXMLSessionReusedCount";
+inline constexpr RecordKey kVeltoIDXMLGetMyInfoCountKey = "VeltoIDXMLGetMyInfoCount";
+inline constexpr RecordKey kVeltoIDXMLFindPersonCountKey = "VeltoIDXMLFindPersonCount";
+inline constexpr RecordKey kVeltoIDXMLSendCSRCountKey = "VeltoIDXMLSendCSRCount";
+inline constexpr RecordKey kVeltoIDXMLCompleteCertCountKey = "VeltoIDXMLCompleteCertCount";
+inline constexpr RecordKey kVeltoIDXMLFetchCertCountKey = "VeltoIDXMLFetchCertCount";
+inline constexpr RecordKey kVeltoIDFindCountKey = "VeltoIDFindCount";
+inline constexpr RecordKey kVeltoIDFindCachedCountKey = "VeltoIDFindCachedCount";
+inline constexpr RecordKey kVeltoIDAddVeltoIDCountKey = "VeltoIDAddVeltoIDCount";
+inline constexpr RecordKey kVeltoIDForgetVeltoIDCountKey = "VeltoIDForgetVeltoIDCount";
+inline constexpr RecordKey kVeltoIDGetMyInfoCountKey = "VeltoIDGetMyInfoCount";
 
 /// What may be reported to the server, when the server asks for it.
-inline constexpr std::array<std::string_view, 12> kVeltoIDReportableMetaInformation = {
+inline constexpr std::array<RecordKey, 12> kVeltoIDReportableMetaInformation = {
     kVeltoIDMetaLastConnectAttemptKey,
     kVeltoIDMetaLastSuccessfulConnectKey,
     kVeltoIDMetaAccountPresumedValidIntervalKey,

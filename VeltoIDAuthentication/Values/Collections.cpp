@@ -40,8 +40,18 @@ struct DictionaryNode : Counted {
         return kNotFound;
     }
 
-    void append(String key, Value value) {
-        entries.push_back({std::move(key), std::move(value)});
+    static std::string_view textOf(std::string_view key) { return key; }
+    static std::string_view textOf(const String& key) { return key.view(); }
+
+    /// A String is shared as the entry's key; a text becomes a new one.
+    template <typename Key>
+    void set(const Key& key, Value value) {
+        const size_t position = find(textOf(key));
+        if (position != kNotFound) {
+            entries[position].value = std::move(value);
+            return;
+        }
+        entries.push_back({String(key), std::move(value)});
         if (entries.size() * 2 > slots.size()) {
             rebuildIndex();
         } else {
@@ -91,8 +101,6 @@ Node& makeWritable(Handle<Node>& handle, Copy copy) {
 }  // namespace
 }  // namespace detail
 
-// --- Array
-
 Array::Array(std::initializer_list<Value> elements) {
     reserve(elements.size());
     for (const Value& element : elements) append(element);
@@ -120,8 +128,6 @@ bool operator==(const Array& a, const Array& b) {
     return a.node_.get() == b.node_.get() || std::equal(a.begin(), a.end(), b.begin(), b.end());
 }
 
-// --- Dictionary
-
 Dictionary::Dictionary(std::initializer_list<std::pair<std::string_view, Value>> entries) {
     for (const auto& [key, value] : entries) set(key, value);
 }
@@ -145,25 +151,11 @@ detail::DictionaryNode& Dictionary::writable() {
 }
 
 void Dictionary::set(std::string_view key, Value value) {
-    if (value.isAbsent()) return;
-    detail::DictionaryNode& node = writable();
-    const size_t position = node.find(key);
-    if (position == detail::DictionaryNode::kNotFound) {
-        node.append(String(key), std::move(value));
-    } else {
-        node.entries[position].value = std::move(value);
-    }
+    if (!value.isAbsent()) writable().set(key, std::move(value));
 }
 
 void Dictionary::set(const String& key, Value value) {
-    if (value.isAbsent() || !key) return;
-    detail::DictionaryNode& node = writable();
-    const size_t position = node.find(key.view());
-    if (position == detail::DictionaryNode::kNotFound) {
-        node.append(key, std::move(value));
-    } else {
-        node.entries[position].value = std::move(value);
-    }
+    if (!value.isAbsent() && key) writable().set(key, std::move(value));
 }
 
 bool Dictionary::remove(std::string_view key) {

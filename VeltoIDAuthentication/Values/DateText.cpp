@@ -1,6 +1,5 @@
 #include "Values/DateText.h"
 
-#include <cstdio>
 #include <string>
 
 #include "Platform/encoding/CalendarText.h"

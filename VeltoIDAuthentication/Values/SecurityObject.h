@@ -2,7 +2,6 @@
 // them.
 #pragma once
 
-#include <memory>
 #include <string>
 #include <variant>
 #include <vector>

@@ -51,8 +51,6 @@ bool sameBytes(const Handle<BytesNode>& a, const Handle<BytesNode>& b) {
 }  // namespace
 }  // namespace detail
 
-// --- String and Data
-
 String::String(std::string_view utf8) : node_(detail::copyBytes(platform::bytesOf(utf8))) {}
 
 std::string_view String::view() const {
@@ -70,8 +68,6 @@ std::span<const uint8_t> Data::bytes() const {
 }
 
 bool operator==(const Data& a, const Data& b) { return detail::sameBytes(a.node_, b.node_); }
-
-// --- Value
 
 const Value& absentValue() {
     static const Value absent;
@@ -96,58 +92,6 @@ Value::Value(Dictionary dictionary) : kind_(Kind::Dictionary) {
     new (&payload_.dictionary) veltoid::Dictionary(std::move(dictionary));
 }
 
-Value Value::null() {
-    Value value;
-    value.kind_ = Kind::Null;
-    return value;
-}
-
-Value Value::boolean(bool boolean) {
-    Value value;
-    value.kind_ = Kind::Boolean;
-    value.payload_.boolean = boolean;
-    return value;
-}
-
-Value Value::integer(int64_t integer, NumberKind kind) {
-    Value value;
-    value.kind_ = Kind::Number;
-    value.numberKind_ = kind;
-    value.payload_.integer = integer;
-    return value;
-}
-
-Value Value::uint64(uint64_t integer) {
-    Value value;
-    value.kind_ = Kind::Number;
-    value.numberKind_ = NumberKind::UInt64;
-    value.payload_.unsignedInteger = integer;
-    return value;
-}
-
-Value Value::real(double real) {
-    Value value;
-    value.kind_ = Kind::Number;
-    value.numberKind_ = NumberKind::Float64;
-    value.payload_.real = real;
-    return value;
-}
-
-Value Value::singleReal(float single) {
-    Value value;
-    value.kind_ = Kind::Number;
-    value.numberKind_ = NumberKind::Float32;
-    value.payload_.single = single;
-    return value;
-}
-
-Value Value::date(double seconds) {
-    Value value;
-    value.kind_ = Kind::Date;
-    value.payload_.real = seconds;
-    return value;
-}
-
 Value Value::url(String text, String base) {
     if (!text) return {};
     return boxed(Kind::URL, detail::URLText{std::move(text), std::move(base)});
@@ -159,30 +103,15 @@ Value Value::uuid(std::span<const uint8_t, 16> bytes) {
     return boxed(Kind::UUID, copy);
 }
 
+/// What a value refers to is one pointer to something counted, whatever the kind: its bytes are copied, and
+/// the new reference is counted.
 Value::Value(const Value& other) noexcept : kind_(other.kind_), numberKind_(other.numberKind_) {
-    switch (kind_) {
-        case Kind::String:
-            new (&payload_.string) veltoid::String(other.payload_.string);
-            break;
-        case Kind::Data:
-            new (&payload_.data) veltoid::Data(other.payload_.data);
-            break;
-        case Kind::Array:
-            new (&payload_.array) veltoid::Array(other.payload_.array);
-            break;
-        case Kind::Dictionary:
-            new (&payload_.dictionary) veltoid::Dictionary(other.payload_.dictionary);
-            break;
-        case Kind::URL:
-        case Kind::UUID:
-        case Kind::Error:
-        case Kind::Object:
-            new (&payload_.box) Box(other.payload_.box);
-            break;
-        default:
-            std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_),
-                        sizeof payload_);
-    }
+    std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_), sizeof payload_);
+    if (kind_ < Kind::String) return;
+    detail::Counted* node = nullptr;
+    static_assert(sizeof payload_ == sizeof(void*));
+    std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof payload_);
+    if (node != nullptr) node->references.fetch_add(1, std::memory_order_relaxed);
 }
 
 void Value::releasePayload() noexcept {

@@ -269,17 +269,25 @@ class Value {
     Value(bool) = delete;
     Value(int) = delete;
 
-    static Value null();
-    static Value boolean(bool value);
+    static Value null() { return scalar(Kind::Null, &Payload::integer, int64_t{0}); }
+    static Value boolean(bool value) { return scalar(Kind::Boolean, &Payload::boolean, value); }
     static Value int32(int32_t value) { return integer(value, NumberKind::Int32); }
     static Value int64(int64_t value) { return integer(value, NumberKind::Int64); }
     /// An integer stored as `kind` (one of the integer kinds other than UInt64).
-    static Value integer(int64_t value, NumberKind kind);
-    static Value uint64(uint64_t value);
-    static Value real(double value);
-    static Value singleReal(float value);
+    static Value integer(int64_t value, NumberKind kind) {
+        return scalar(Kind::Number, &Payload::integer, value, kind);
+    }
+    static Value uint64(uint64_t value) {
+        return scalar(Kind::Number, &Payload::unsignedInteger, value, NumberKind::UInt64);
+    }
+    static Value real(double value) {
+        return scalar(Kind::Number, &Payload::real, value, NumberKind::Float64);
+    }
+    static Value singleReal(float value) {
+        return scalar(Kind::Number, &Payload::single, value, NumberKind::Float32);
+    }
     /// Seconds since 1970-01-01 00:00:00 UTC.
-    static Value date(double seconds);
+    static Value date(double seconds) { return scalar(Kind::Date, &Payload::real, seconds); }
     static Value url(String text, String base = nullptr);
     static Value uuid(std::span<const uint8_t, 16> bytes);
     static Value object(SecurityObject object);
@@ -348,6 +356,15 @@ class Value {
         Box box;
     };
 
+    template <typename Content>
+    static Value scalar(Kind kind, Content Payload::*member, Content content,
+                        NumberKind numberKind = NumberKind::Int8) {
+        Value value;
+        value.kind_ = kind;
+        value.numberKind_ = numberKind;
+        value.payload_.*member = content;
+        return value;
+    }
     template <typename Content>
     static Value boxed(Kind kind, Content content) {
         Value value;

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <atomic>
 #include <map>
-#include <mutex>
 #include <string>
 
 #include "IPCHelpers/Transaction.h"

@@ -67,8 +67,7 @@ void workForLeakChecker() {
     Array names;
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names)
-        __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true),
-                                   Notify::Yes);
+        __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true));
     startAccountCheck(0);
     registerAuthenticationListener({});
     (void)platform::Semaphore().wait(kLeaksPause);

@@ -1,7 +1,5 @@
 #include "VeltoIDAuthd/AuthenticationService.h"
 
-#include <algorithm>
-
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Lifetime.h"
@@ -38,16 +36,14 @@ constexpr const char* kHandlerName = "handleAuthenticationIPCMessage";
 /// Long enough for the reply to leave before the process ends (seconds).
 constexpr double kTerminationDelay = 0.1;
 
-struct Outcome {
-    bool success = false;
-    std::optional<Error> error;
-};
-
 void countFor(const String& account, const Request& request, std::string_view counter) {
     __VeltoIDDBIncrementMetaInfoCounter(account, request.options(), counter, 1);
 }
 
-Outcome ping(Request& /*request*/) { return {true, {}}; }
+// Each handler answers one command: it fills the reply, and returns whether it succeeded, with an error if
+// there is one to tell.
+
+bool ping(Request& /*request*/, ErrorOut /*error*/) { return true; }
 
 /// Sets what the request names; none when that is nothing that can be set.
 std::optional<bool> setDatabaseValue(const Request& request) {
@@ -65,27 +61,29 @@ std::optional<bool> setDatabaseValue(const Request& request) {
     return std::nullopt;
 }
 
-Outcome setValueOrFail(Request& request) { return {setDatabaseValue(request).value_or(false), {}}; }
-
-Outcome setValueIfPossible(Request& request) { return {setDatabaseValue(request).value_or(true), {}}; }
-
-Outcome addAccount(Request& request) {
-    Outcome outcome;
-    AddedAccount added;
-    outcome.success = addOnlyAccount(request.account(), request.string(message::kHashedPassword),
-                                     request.options(), wakeAccountCheck, &added, &outcome.error);
-    request.answer(message::kEncDsId, added.encDsId);
-    if (added.record) request.answer(message::kAddedAccount, *added.record);
-    return outcome;
+bool setValueOrFail(Request& request, ErrorOut /*error*/) {
+    return setDatabaseValue(request).value_or(false);
 }
 
-Outcome getMyInfo(Request& request) {
-    Outcome outcome;
+bool setValueIfPossible(Request& request, ErrorOut /*error*/) {
+    return setDatabaseValue(request).value_or(true);
+}
+
+bool addAccount(Request& request, ErrorOut error) {
+    AddedAccount added;
+    const bool succeeded = addOnlyAccount(request.account(), request.string(message::kHashedPassword),
+                                          request.options(), wakeAccountCheck, &added, error);
+    request.answer(message::kEncDsId, added.encDsId);
+    if (added.record) request.answer(message::kAddedAccount, *added.record);
+    return succeeded;
+}
+
+bool getMyInfo(Request& request, ErrorOut error) {
     Dictionary info;
-    outcome.success = __VeltoIDDoGetMyInfo(request.account(), request.options(), &info, &outcome.error);
+    const bool succeeded = __VeltoIDDoGetMyInfo(request.account(), request.options(), &info, error);
     countFor(request.account(), request, kVeltoIDGetMyInfoCountKey);
-    if (outcome.success) request.answer(message::kInfo, info);
-    return outcome;
+    if (succeeded) request.answer(message::kInfo, info);
+    return succeeded;
 }
 
 Dictionary criteriaOf(const Request& request) {
@@ -94,104 +92,90 @@ Dictionary criteriaOf(const Request& request) {
     return dictionary != nullptr ? *dictionary : Dictionary();
 }
 
-Outcome findPerson(Request& request) {
-    Outcome outcome;
+bool findPerson(Request& request, ErrorOut error) {
     std::optional<Array> results;
-    outcome.success = __VeltoIDDoFindPerson(request.account(), request.string(message::kHashedPassword),
-                                            criteriaOf(request), request.options(), &results, &outcome.error);
+    const bool succeeded = __VeltoIDDoFindPerson(request.account(), request.string(message::kHashedPassword),
+                                                 criteriaOf(request), request.options(), &results, error);
     countFor(request.account(), request, kVeltoIDFindCountKey);
-    if (outcome.success && results) request.answer(message::kResult, *results);
-    return outcome;
+    if (succeeded && results) request.answer(message::kResult, *results);
+    return succeeded;
 }
 
-Outcome findCachedPerson(Request& request) {
+bool findCachedPerson(Request& request, ErrorOut /*error*/) {
     const auto results = __VeltoIDDBCopyCachedFindPersonResults(criteriaOf(request));
     countFor(request.account(), request, kVeltoIDFindCachedCountKey);
-    if (!results || results->empty()) return {};
-    request.answer(message::kResult, *results);
-    return {true, {}};
+    if (results) request.answer(message::kResult, *results);
+    return results.has_value();
 }
 
-Outcome listAccounts(Request& request) {
-    Outcome outcome;
+bool listAccounts(Request& request, ErrorOut error) {
     Array names;
-    outcome.success = __VeltoIDCopyVeltoIDs(request.options(), &names, &outcome.error);
-    if (outcome.success) request.answer(message::kResult, names);
-    return outcome;
+    if (!__VeltoIDCopyVeltoIDs(request.options(), &names, error)) return false;
+    request.answer(message::kResult, names);
+    return true;
 }
 
-Outcome forgetAccount(Request& request) {
-    Outcome outcome;
+bool forgetAccount(Request& request, ErrorOut error) {
     AccountRecord record;
-    if (__VeltoIDDBCopyVeltoIDAccount(request.account(), &record, &outcome.error))
-        outcome.success = __VeltoIDForgetVeltoID(record.accountName(), request.options(), &outcome.error);
-    if (outcome.success) {
+    const bool succeeded = __VeltoIDDBCopyVeltoIDAccount(request.account(), &record, error) &&
+                           __VeltoIDForgetVeltoID(record.accountName(), request.options(), error);
+    if (succeeded) {
         request.answer(message::kAccount, record.accountName());
         request.answer(message::kForgottenEncDsId, record.encDsId());
         request.answer(message::kForgottenAccount, record.values());
     }
     countFor(nullptr, request, kVeltoIDForgetVeltoIDCountKey);
-    return outcome;
+    return succeeded;
 }
 
 /// The signed record that vouches for the account's validated items.
-Outcome copyValidationRecord(Request& request) {
+bool copyValidationRecord(Request& request) {
     AccountRecord record;
-    if (!__VeltoIDDBCopyVeltoIDAccount(request.account(), &record)) return {};
+    if (!__VeltoIDDBCopyVeltoIDAccount(request.account(), &record)) return false;
     Dictionary result;
     for (const std::string_view key :
          {kVeltoIDAccountValidationRecordDataKey, kVeltoIDAccountValidationRecordValidAsOfKey})
         result.set(key, record.values()[key]);
     request.answer(message::kResult, result);
-    return {true, {}};
+    return true;
 }
 
-Outcome copyCertificateInformation(Request& request) {
+bool copyCertificateInformation(Request& request, ErrorOut error) {
     if (request.string(message::kCertificateType) == message::kValidationRecordType)
         return copyValidationRecord(request);
-    Outcome outcome;
     Dictionary result;
-    outcome.success = __VeltoIDCopyCertificateInfo(request.account(), request.string(message::kEncDsId),
-                                                   request.options(), &result, &outcome.error);
-    if (outcome.success) request.answer(message::kResult, result);
-    return outcome;
+    if (!__VeltoIDCopyCertificateInfo(request.account(), request.string(message::kEncDsId), request.options(),
+                                      &result, error))
+        return false;
+    request.answer(message::kResult, result);
+    return true;
 }
 
-Outcome setBreadcrumb(Request& request) {
-    Outcome outcome;
-    outcome.success = __VeltoIDDoSetBreadcrumb(
-        request.account(), request.string(message::kHashedPassword), request.string(message::kBreadcrumbKey),
-        request.data(message::kBreadcrumb), request.options(), &outcome.error);
-    return outcome;
+bool setBreadcrumb(Request& request, ErrorOut error) {
+    return __VeltoIDDoSetBreadcrumb(request.account(), request.string(message::kHashedPassword),
+                                    request.string(message::kBreadcrumbKey),
+                                    request.data(message::kBreadcrumb), request.options(), error);
 }
 
-Outcome copyBreadcrumb(Request& request) {
-    Outcome outcome;
+bool copyBreadcrumb(Request& request, ErrorOut error) {
     const Data breadcrumb =
         __VeltoIDDoCopyBreadcrumb(request.account(), request.string(message::kHashedPassword),
-                                  request.string(message::kBreadcrumbKey), request.options(), &outcome.error);
-    outcome.success = static_cast<bool>(breadcrumb);
-    if (outcome.success) request.answer(message::kBreadcrumb, breadcrumb);
-    return outcome;
+                                  request.string(message::kBreadcrumbKey), request.options(), error);
+    request.answer(message::kBreadcrumb, breadcrumb);
+    return static_cast<bool>(breadcrumb);
 }
 
-Outcome verifyPassword(Request& request) {
-    Outcome outcome;
-    outcome.success = verifyRequestedPassword(request, &outcome.error);
-    return outcome;
-}
-
-Outcome copyAllContents(Request& request) {
+bool copyAllContents(Request& request, ErrorOut /*error*/) {
     std::optional<Dictionary> contents;
-    const bool success = __VeltoIDDBCopyAllContents(&contents);
+    const bool succeeded = __VeltoIDDBCopyAllContents(&contents);
     if (contents) request.answer(message::kResult, *contents);
-    return {success, {}};
+    return succeeded;
 }
 
-Outcome check(Request& request) {
+bool check(Request& request, ErrorOut /*error*/) {
     const AccountState state = checkAccountAndDetermineNextAction(request.account(), request.options());
     request.answer(message::kStatus, Value::int64(static_cast<int64_t>(state)));
-    return {true, {}};
+    return true;
 }
 
 void terminateAfterReply() {
@@ -204,18 +188,18 @@ void terminateAfterReply() {
     });
 }
 
-Outcome status(Request& request) {
+bool status(Request& request, ErrorOut /*error*/) {
     const bool terminates = getBool(&request.options(), option::kTerminateServer, false);
     if (terminates) computeRelaunchFromAccounts();
     request.answer(message::kStatus, terminates ? copyDeviceStatusDictionary()
                                                 : copyAccountStatusesDictionary(request.options()));
     if (terminates) terminateAfterReply();
-    return {true, {}};
+    return true;
 }
 
 struct Command {
     int64_t number;
-    Outcome (*run)(Request& request);
+    bool (*run)(Request& request, ErrorOut error);
 };
 
 constexpr Command kCommands[] = {
@@ -229,7 +213,7 @@ constexpr Command kCommands[] = {
     {command::kList, listAccounts},
     {command::kForget, forgetAccount},
     {command::kCertificate, copyCertificateInformation},
-    {command::kVerify, verifyPassword},
+    {command::kVerify, verifyRequestedPassword},
     {command::kSetBreadcrumb, setBreadcrumb},
     {command::kGetBreadcrumb, copyBreadcrumb},
     {command::kDatabase, copyAllContents},
@@ -237,10 +221,10 @@ constexpr Command kCommands[] = {
     {command::kStatus, status},
 };
 
-Outcome dispatch(Request& request) {
-    const auto* found = std::find_if(std::begin(kCommands), std::end(kCommands),
-                                     [&](const Command& known) { return known.number == request.command(); });
-    return found != std::end(kCommands) ? found->run(request) : Outcome();
+bool dispatch(Request& request, ErrorOut error) {
+    for (const Command& known : kCommands)
+        if (known.number == request.command()) return known.run(request, error);
+    return false;
 }
 
 }  // namespace
@@ -252,8 +236,9 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
         computeRelaunchFromAccounts();
         return shutDownByCommand();
     }
-    const Outcome outcome = dispatch(request);
-    request.finish(outcome.success, outcome.error);
+    std::optional<Error> error;
+    const bool succeeded = dispatch(request, &error);
+    request.finish(succeeded, error);
 }
 
 }  // namespace veltoid

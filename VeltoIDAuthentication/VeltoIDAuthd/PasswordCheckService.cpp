@@ -21,7 +21,7 @@ bool updateLinkedIdentity(const Request& request, const LinkedIdentityHandler& u
     return update ? update(reference, error) : linkedIdentityUnsupported(error);
 }
 
-bool run(const Request& request, const LinkedIdentityHandler& linkedIdentity, ErrorOut error) {
+bool run(Request& request, const LinkedIdentityHandler& linkedIdentity, ErrorOut error) {
     switch (request.command()) {
         case command::kPing:
             return true;
@@ -41,11 +41,11 @@ void handlePasswordCheckIPCMessage(platform::IncomingMessage& message,
     const Transaction guard("handlePasswordCheckIPCMessage");
     Request request(message);
     std::optional<Error> error;
-    const bool success = run(request, linkedIdentity, &error);
-    request.finish(success, error);
+    const bool succeeded = run(request, linkedIdentity, &error);
+    request.finish(succeeded, error);
 }
 
-bool verifyRequestedPassword(const Request& request, ErrorOut error) {
+bool verifyRequestedPassword(Request& request, ErrorOut error) {
     const String password = request.string(message::kHashedPassword);
     if (!request.account() || !password) return false;
     const Dictionary options =

@@ -10,7 +10,7 @@
 namespace veltoid {
 
 /// The verification that both services offer: false without an error when account or password is missing.
-bool verifyRequestedPassword(const Request& request, ErrorOut error);
+bool verifyRequestedPassword(Request& request, ErrorOut error);
 
 /// Updates the provisioning of the linked identity that the reference names.
 using LinkedIdentityHandler = std::function<bool(const Data& identityReference, ErrorOut error)>;

@@ -62,16 +62,6 @@ void markDirty(Dictionary& record) {
     record.set(kVeltoIDAccountModificationDateKey, Value::date(platform::now()));
 }
 
-/// Applies one entry; true when it changes the record. Setting a key to Null that is not there changes
-/// nothing.
-bool applyEntry(Dictionary& record, const String& key, const Value& value) {
-    const Value& stored = record[key.view()];
-    if (stored == value) return false;
-    if (value.isNull()) return record.remove(key.view());
-    record.set(key, value);
-    return true;
-}
-
 void removeDirtyMarks(Dictionary& section) {
     const Dictionary before = section;
     for (const auto& [key, value] : before) {
@@ -89,9 +79,7 @@ bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     bool loaded = false;
     Array all = database::perform([&](const Store& store) {
         loaded = store.isLoaded();
-        Array keys;
-        for (const auto& [name, record] : store.accounts) keys.append(name);
-        return keys;
+        return database::keysOf(store.accounts);
     });
     if (all.empty()) {
         fillError(error, identityError(loaded ? identity_error::kNoAccounts : identity_error::kUnspecified));
@@ -191,7 +179,7 @@ bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, N
         bool changed = false;
         bool significant = false;
         for (const auto& [key, value] : values) {
-            changed = applyEntry(record, key, value) || changed;
+            changed = database::change(record, key, value) || changed;
             significant = significant || (key.view() != kVeltoIDAccountModificationDateKey &&
                                           key.view() != kVeltoIDDirtyKey);
         }

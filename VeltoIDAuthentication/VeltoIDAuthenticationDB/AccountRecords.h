@@ -48,10 +48,11 @@ bool __VeltoIDDBRemovePassword(const String& name);
 /// Sets every key whose value differs; Null removes. A change stamps "ModificationDate", marks the record
 /// dirty when it notifies (unless the values say otherwise), and is written. False without name, values or
 /// record.
-bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, Notify notify);
+bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, Notify notify = Notify::Yes);
 
 /// The same for one key; an absent value removes it.
-bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value, Notify notify);
+bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value,
+                                Notify notify = Notify::Yes);
 
 /// The stored value, of whatever kind; absent when there is none.
 Value __VeltoIDDBCopyAccountValue(const String& name, const String& key);

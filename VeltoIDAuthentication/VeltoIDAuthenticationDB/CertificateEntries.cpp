@@ -9,21 +9,13 @@ namespace {
 
 using database::Store;
 
-/// Copies the info's value when there is one, else removes the entry's.
-void copyOrRemove(Dictionary& entry, std::string_view key, const Value& value) {
-    if (value.isAbsent()) {
-        entry.remove(key);
-    } else {
-        entry.set(key, value);
-    }
-}
-
 void applyInfo(Dictionary& entry, const Dictionary& info) {
     entry.set(kVeltoIDCertificateCertificatePersistentReferenceKey,
               info.data(kVeltoIDCertificateCertificatePersistentReferenceKey));
     for (const std::string_view key : {kVeltoIDCertificateExpirationDateKey, kVeltoIDCertificateStatusKey})
-        copyOrRemove(entry, key, info[key]);
-    copyOrRemove(entry, kVeltoIDCertificateSerialNumberKey, info.string(kVeltoIDCertificateSerialNumberKey));
+        database::change(entry, key, info[key]);
+    database::change(entry, kVeltoIDCertificateSerialNumberKey,
+                     info.string(kVeltoIDCertificateSerialNumberKey));
 }
 
 }  // namespace
@@ -32,9 +24,7 @@ bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
     bool loaded = false;
     Array all = database::perform([&](const Store& store) {
         loaded = store.isLoaded();
-        Array names;
-        for (const auto& [encDsId, entry] : store.certificates) names.append(encDsId);
-        return names;
+        return database::keysOf(store.certificates);
     });
     if (!loaded) {
         fillError(error, identityError(identity_error::kNoCertificateForAccount));
@@ -71,9 +61,7 @@ bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, co
         const Dictionary* existing = Store::find(store.certificates, encDsId);
         if (existing == nullptr) return false;
         Dictionary entry = *existing;
-        const bool removes = value.isAbsent() || value.isNull();
-        if (removes ? !entry.contains(key.view()) : entry[key.view()] == value) return true;
-        copyOrRemove(entry, key.view(), removes ? Value() : value);
+        if (!database::change(entry, key, value)) return true;
 
         const bool isMark = key.view() == kVeltoIDDirtyKey;
         entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));

@@ -25,7 +25,7 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
 /// Sets one value, an absent or Null one removing it; a change stamps "ModificationDate", marks the entry
 /// dirty when it notifies, and is written. False without encDsId, key or entry.
 bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
-                                    Notify notify);
+                                    Notify notify = Notify::Yes);
 
 /// True and a copy of the entry when there is one.
 bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* entry);

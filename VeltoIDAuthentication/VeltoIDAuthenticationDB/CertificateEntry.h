@@ -10,49 +10,42 @@
 
 namespace veltoid {
 
-class CertificateEntry {
+class CertificateEntry : Dictionary {
   public:
+    using Date = std::optional<double>;
+
     CertificateEntry() = default;
     CertificateEntry(String encDsId, Dictionary values)
-        : encDsId_(std::move(encDsId)), values_(std::move(values)) {}
+        : Dictionary(std::move(values)), encDsId_(std::move(encDsId)) {}
 
     /// Whether the database has the entry.
     bool exists() const { return static_cast<bool>(encDsId_); }
     /// The database's key; null when there is no entry.
     const String& encDsId() const { return encDsId_; }
-    const Dictionary& values() const { return values_; }
+    const Dictionary& values() const { return *this; }
 
     // The items in the keychain.
-    Data reference() const { return values_.data(kVeltoIDCertificateCertificatePersistentReferenceKey); }
-    Data privateKeyReference() const {
-        return values_.data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
-    }
+    Data reference() const { return data(kVeltoIDCertificateCertificatePersistentReferenceKey); }
+    Data privateKeyReference() const { return data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey); }
     Data intermediateReference() const {
-        return values_.data(kVeltoIDCertificateIntermediateCertificateReferenceKey);
+        return data(kVeltoIDCertificateIntermediateCertificateReferenceKey);
     }
 
-    String serialNumber() const { return values_.string(kVeltoIDCertificateSerialNumberKey); }
+    String serialNumber() const { return string(kVeltoIDCertificateSerialNumberKey); }
     bool isIssued() const { return has(kVeltoIDCertificateStatusIssued); }
     bool isInvalid() const { return has(kVeltoIDCertificateStatusInvalid); }
-    std::optional<double> expires() const { return values_.date(kVeltoIDCertificateExpirationDateKey); }
-    std::optional<double> nextRenewalAttempt() const {
-        return values_.date(kVeltoIDCertificateNextRenewalAttemptDateKey);
-    }
-    std::optional<double> lastSuccessfulValidation() const {
-        return values_.date(kVeltoIDCertificateLastSuccessfulValidationDateKey);
-    }
-    std::optional<double> lastValidationAttempt() const {
-        return values_.date(kVeltoIDCertificateLastValidationAttemptDateKey);
-    }
-    bool isDirty() const { return values_.boolean(kVeltoIDDirtyKey).value_or(false); }
+    Date expires() const { return date(kVeltoIDCertificateExpirationDateKey); }
+    Date nextRenewalAttempt() const { return date(kVeltoIDCertificateNextRenewalAttemptDateKey); }
+    Date lastSuccessfulValidation() const { return date(kVeltoIDCertificateLastSuccessfulValidationDateKey); }
+    Date lastValidationAttempt() const { return date(kVeltoIDCertificateLastValidationAttemptDateKey); }
+    bool isDirty() const { return boolean(kVeltoIDDirtyKey).value_or(false); }
 
   private:
     bool has(std::string_view status) const {
-        return values_[kVeltoIDCertificateStatusKey].asText() == status;
+        return (*this)[kVeltoIDCertificateStatusKey].asText() == status;
     }
 
     String encDsId_;
-    Dictionary values_;
 };
 
 }  // namespace veltoid

@@ -98,8 +98,40 @@ class FindPersonCache {
         usesPreferences_ = usesPreferences;
     }
 
-    void add(const Array& results);
-    Array find(const Dictionary& criteria);
+    void add(const Array& results) {
+        const std::lock_guard lock(mutex_);
+        seed();
+        const Value now = Value::date(platform::now());
+        for (const Value& result : results) {
+            if (!result.isDictionary()) continue;
+            Dictionary person = *result.asDictionary();
+            const String matched = person.string(kMatched);
+            const String value = person.string(kMatchedValue);
+            if (!matched || !value) continue;
+            person.set(kValidDate, now);
+            insert({cacheKey(matched.view(), value.view()), std::move(person)});
+            planWrite();
+        }
+    }
+
+    Array find(const Dictionary& criteria) {
+        const std::lock_guard lock(mutex_);
+        seed();
+        const double now = platform::now();
+        Array found;
+        for (const auto& [criterion, wanted] : criteria) {
+            const Array* values = wanted.asArray();
+            if (values == nullptr) continue;
+            for (const Value& value : *values) {
+                const auto text = value.asText();
+                const auto known =
+                    text ? byKey_.find(cacheKey(criterion.view(), *text).view()) : byKey_.end();
+                if (known != byKey_.end() && known->second->isGoodAt(now))
+                    found.append(known->second->person);
+            }
+        }
+        return found;
+    }
 
     bool writeNow() {
         return writeQueue_.sync([this] { return write(); });
@@ -113,16 +145,95 @@ class FindPersonCache {
   private:
     using Entries = std::list<Entry>;
 
-    // The lock is held.
-    void seed();
-    void seedFrom(const Dictionary& stored);
-    void insert(Entry entry);
-    void drop(Entries::iterator entry);
-    void dropEnded();
-    void planWrite();
+    // The lock is held from here to planWrite.
 
-    /// On the write queue.
-    bool write();
+    void seed() {
+        if (isSeeded_ || !usesPreferences_) return;
+        ValueBuilder stored;
+        const auto result = domain().read(kVeltoIDFindPersonCacheKey, stored);
+        if (result == Preferences::ReadResult::Failed) return;
+        // What is damaged is kept aside, so that nothing written later takes its place.
+        if (result == Preferences::ReadResult::Damaged && !domain().setAside(kVeltoIDFindPersonCacheKey))
+            return;
+        isSeeded_ = true;
+        const Dictionary* people = stored.value().asDictionary();
+        if (result == Preferences::ReadResult::Found && people != nullptr) seedFrom(*people);
+    }
+
+    /// What is here already has been added since and is newer than anything stored.
+    void seedFrom(const Dictionary& stored) {
+        Entries added;
+        added.swap(entries_);
+        byKey_.clear();
+        bytes_ = 0;
+        std::vector<Entry> sorted;
+        sorted.reserve(stored.size());
+        for (const auto& [key, person] : stored) {
+            if (!person.isDictionary()) continue;
+            Entry entry(key, *person.asDictionary());
+            if (entry.isEverGood()) sorted.push_back(std::move(entry));
+        }
+        std::stable_sort(sorted.begin(), sorted.end(),
+                         [](const Entry& a, const Entry& b) { return a.validFrom < b.validFrom; });
+        for (Entry& entry : sorted) insert(std::move(entry));
+        for (Entry& entry : added) insert(std::move(entry));
+    }
+
+    void insert(Entry entry) {
+        if (!entry.bytes) return;
+        if (const auto known = byKey_.find(entry.key.view()); known != byKey_.end()) drop(known->second);
+        bytes_ += *entry.bytes;
+        entries_.push_back(std::move(entry));
+        byKey_.emplace(entries_.back().key.view(), std::prev(entries_.end()));
+        while (entries_.size() > kVeltoIDMaxFindPersonEntries || bytes_ > kVeltoIDMaxFindPersonCacheBytes)
+            drop(entries_.begin());
+    }
+
+    void drop(Entries::iterator entry) {
+        bytes_ -= *entry->bytes;
+        byKey_.erase(entry->key.view());
+        entries_.erase(entry);
+    }
+
+    void dropEnded() {
+        const double now = platform::now();
+        for (auto entry = entries_.begin(); entry != entries_.end();) {
+            const auto current = entry++;
+            if (current->hasEndedBy(now)) drop(current);
+        }
+    }
+
+    void planWrite() {
+        if (pendingWrite_) return;
+        pendingWrite_ = std::make_unique<Transaction>("VeltoIDFindPersonCache");
+        writeQueue_.asyncAfter(database::flushDelay(), [this] { write(); });
+    }
+
+    /// On the write queue. The entries are shared, so that the lock is held for no longer than it takes to
+    /// count them.
+    bool write() {
+        const Transaction keepAlive("VeltoIDFindPersonCacheWrite");
+        std::vector<std::pair<String, Dictionary>> kept;
+        {
+            const std::lock_guard lock(mutex_);
+            if (!pendingWrite_) return true;
+            pendingWrite_.reset();
+            seed();
+            dropEnded();
+            if (!usesPreferences_) return true;
+            if (!isSeeded_) return false;
+            kept.reserve(entries_.size());
+            for (const Entry& entry : entries_) kept.emplace_back(entry.key, entry.person);
+        }
+        return domain().set({{std::string(kVeltoIDFindPersonCacheKey), [&kept](platform::ValueSink& sink) {
+                                  sink.beginDictionary();
+                                  for (const auto& [key, person] : kept) {
+                                      sink.key(key.view());
+                                      writeValue(person, sink);
+                                  }
+                                  sink.endDictionary();
+                              }}});
+    }
 
     /// Writes run here one after the other, apart from the lock.
     const platform::WorkQueue writeQueue_{"VeltoIDFindPersonCacheQueue"};
@@ -138,125 +249,6 @@ class FindPersonCache {
 };
 
 FindPersonCache& cache() { return platform::Lifetime::current().state<FindPersonCache>(); }
-
-void FindPersonCache::add(const Array& results) {
-    const std::lock_guard lock(mutex_);
-    seed();
-    const Value now = Value::date(platform::now());
-    for (const Value& result : results) {
-        if (!result.isDictionary()) continue;
-        Dictionary person = *result.asDictionary();
-        const String matched = person.string(kMatched);
-        const String value = person.string(kMatchedValue);
-        if (!matched || !value) continue;
-        person.set(kValidDate, now);
-        insert({cacheKey(matched.view(), value.view()), std::move(person)});
-        planWrite();
-    }
-}
-
-Array FindPersonCache::find(const Dictionary& criteria) {
-    const std::lock_guard lock(mutex_);
-    seed();
-    const double now = platform::now();
-    Array found;
-    for (const auto& [criterion, wanted] : criteria) {
-        const Array* values = wanted.asArray();
-        if (values == nullptr) continue;
-        for (const Value& value : *values) {
-            const auto text = value.asText();
-            const auto known = text ? byKey_.find(cacheKey(criterion.view(), *text).view()) : byKey_.end();
-            if (known != byKey_.end() && known->second->isGoodAt(now)) found.append(known->second->person);
-        }
-    }
-    return found;
-}
-
-void FindPersonCache::seed() {
-    if (isSeeded_ || !usesPreferences_) return;
-    ValueBuilder stored;
-    const auto result = domain().read(kVeltoIDFindPersonCacheKey, stored);
-    if (result == Preferences::ReadResult::Failed) return;
-    // What is damaged is kept aside, so that nothing written later takes its place.
-    if (result == Preferences::ReadResult::Damaged && !domain().setAside(kVeltoIDFindPersonCacheKey)) return;
-    isSeeded_ = true;
-    const Dictionary* people = stored.value().asDictionary();
-    if (result == Preferences::ReadResult::Found && people != nullptr) seedFrom(*people);
-}
-
-/// What is here already has been added since and is newer than anything stored.
-void FindPersonCache::seedFrom(const Dictionary& stored) {
-    Entries added;
-    added.swap(entries_);
-    byKey_.clear();
-    bytes_ = 0;
-    std::vector<Entry> sorted;
-    sorted.reserve(stored.size());
-    for (const auto& [key, person] : stored) {
-        if (!person.isDictionary()) continue;
-        Entry entry(key, *person.asDictionary());
-        if (entry.isEverGood()) sorted.push_back(std::move(entry));
-    }
-    std::stable_sort(sorted.begin(), sorted.end(),
-                     [](const Entry& a, const Entry& b) { return a.validFrom < b.validFrom; });
-    for (Entry& entry : sorted) insert(std::move(entry));
-    for (Entry& entry : added) insert(std::move(entry));
-}
-
-void FindPersonCache::insert(Entry entry) {
-    if (!entry.bytes) return;
-    if (const auto known = byKey_.find(entry.key.view()); known != byKey_.end()) drop(known->second);
-    bytes_ += *entry.bytes;
-    entries_.push_back(std::move(entry));
-    byKey_.emplace(entries_.back().key.view(), std::prev(entries_.end()));
-    while (entries_.size() > kVeltoIDMaxFindPersonEntries || bytes_ > kVeltoIDMaxFindPersonCacheBytes)
-        drop(entries_.begin());
-}
-
-void FindPersonCache::drop(Entries::iterator entry) {
-    bytes_ -= *entry->bytes;
-    byKey_.erase(entry->key.view());
-    entries_.erase(entry);
-}
-
-void FindPersonCache::dropEnded() {
-    const double now = platform::now();
-    for (auto entry = entries_.begin(); entry != entries_.end();) {
-        const auto current = entry++;
-        if (current->hasEndedBy(now)) drop(current);
-    }
-}
-
-void FindPersonCache::planWrite() {
-    if (pendingWrite_) return;
-    pendingWrite_ = std::make_unique<Transaction>("VeltoIDFindPersonCache");
-    writeQueue_.asyncAfter(database::flushDelay(), [this] { write(); });
-}
-
-/// The entries are shared, so that the lock is held for no longer than it takes to count them.
-bool FindPersonCache::write() {
-    const Transaction keepAlive("VeltoIDFindPersonCacheWrite");
-    std::vector<std::pair<String, Dictionary>> kept;
-    {
-        const std::lock_guard lock(mutex_);
-        if (!pendingWrite_) return true;
-        pendingWrite_.reset();
-        seed();
-        dropEnded();
-        if (!usesPreferences_) return true;
-        if (!isSeeded_) return false;
-        kept.reserve(entries_.size());
-        for (const Entry& entry : entries_) kept.emplace_back(entry.key, entry.person);
-    }
-    return domain().set({{std::string(kVeltoIDFindPersonCacheKey), [&kept](platform::ValueSink& sink) {
-                              sink.beginDictionary();
-                              for (const auto& [key, person] : kept) {
-                                  sink.key(key.view());
-                                  writeValue(person, sink);
-                              }
-                              sink.endDictionary();
-                          }}});
-}
 
 }  // namespace
 

@@ -23,14 +23,6 @@ bool fits(const Value& value, std::optional<Value::Kind> requiredKind) {
     return !value.isAbsent() && (!requiredKind || value.kind() == *requiredKind);
 }
 
-/// Sets or removes one value; false when it is as it should be already.
-bool change(Dictionary& dictionary, const String& key, const Value& value) {
-    if (value.isAbsent() || value.isNull()) return dictionary.remove(key.view());
-    if (dictionary[key.view()] == value) return false;
-    dictionary.set(key, value);
-    return true;
-}
-
 }  // namespace
 
 Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& options, const String& key,
@@ -56,10 +48,10 @@ bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const
         if (section) {
             const Dictionary* existing = Store::find(metaInfo, section);
             Dictionary own = existing != nullptr ? *existing : Dictionary();
-            changed = change(own, key, value);
+            changed = database::change(own, key, value);
             metaInfo.set(section, own);
         } else {
-            changed = change(metaInfo, key, value);
+            changed = database::change(metaInfo, key, value);
         }
         return !changed || store.replace(&Store::metaInfo, std::move(metaInfo), Notify::No);
     });

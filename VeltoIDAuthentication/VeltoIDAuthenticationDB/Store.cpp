@@ -112,6 +112,19 @@ Store& loadedStore() {
     return current.store;
 }
 
+bool change(Dictionary& dictionary, const String& key, const Value& value) {
+    if (value.isAbsent() || value.isNull()) return dictionary.remove(key.view());
+    if (dictionary[key.view()] == value) return false;
+    dictionary.set(key, value);
+    return true;
+}
+
+Array keysOf(const Dictionary& section) {
+    Array keys;
+    for (const auto& [key, value] : section) keys.append(key);
+    return keys;
+}
+
 const Dictionary* Store::find(const Dictionary& section, const String& key) {
     return key ? section.dictionary(key.view()) : nullptr;
 }

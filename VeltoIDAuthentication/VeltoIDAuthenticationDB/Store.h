@@ -94,6 +94,11 @@ class Store {
 
 platform::WorkQueue queue();
 
+/// Sets one value, an absent or Null one removing it; false when that changes nothing.
+bool change(Dictionary& dictionary, const String& key, const Value& value);
+
+Array keysOf(const Dictionary& section);
+
 /// How long what has changed waits for more to be written with it; not at all when the lifetime ends.
 double flushDelay();
 

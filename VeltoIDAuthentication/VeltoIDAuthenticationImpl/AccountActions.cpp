@@ -40,16 +40,14 @@ void dropLostPassword(const AccountRecord& record) {
         copyPasswordFromKeychainGivenPersistentRef(record.passwordReference(), nullptr))
         return;
     __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountHashedPasswordKeychainReferenceKey,
-                               Value::null(), Notify::Yes);
+                               Value::null());
 }
 
 /// The account is of no use until it is given its password again. One that the server refused is gone
 /// already; a hash of the record's own, without an item in the keychain, is not used.
 void disable(const AccountRecord& record) {
-    __VeltoIDDBSetAccountValues(
-        record.accountName(),
-        {{kVeltoIDAccountHashedPasswordKey, Value::null()}, {kVeltoIDAccountDSIDKey, Value::null()}},
-        Notify::Yes);
+    __VeltoIDDBSetAccountValues(record.accountName(), {{kVeltoIDAccountHashedPasswordKey, Value::null()},
+                                                       {kVeltoIDAccountDSIDKey, Value::null()}});
 }
 
 /// The certificate has just been evaluated and is good.
@@ -141,15 +139,14 @@ void fetchValidationRecordForAccount(const AccountRecord& record, const Dictiona
     const bool isAnswered = after.lastValidation().value_or(before - 1) >= before;
     const auto nextCheck = after.validationRecordNextCheck();
     if (isAnswered && nextCheck && *nextCheck > platform::now() && after.validationRecordIdentifier()) {
-        __VeltoIDDBSetAccountValues(accountName, {{kNextCheckInterval, Value::null()}}, Notify::Yes);
+        __VeltoIDDBSetAccountValues(accountName, {{kNextCheckInterval, Value::null()}});
     } else if (isAnswered && nextCheck &&
                record.validationRecordNextCheckInterval() != kRecordIntervalAfterServersDate) {
         __VeltoIDDBSetAccountValues(accountName,
                                     {{kNextCheckDate, Value::date(platform::now() + kRecordCheckSoon)},
-                                     {kNextCheckInterval, Value::real(kRecordIntervalAfterServersDate)}},
-                                    Notify::Yes);
+                                     {kNextCheckInterval, Value::real(kRecordIntervalAfterServersDate)}});
     } else {
-        __VeltoIDDBSetAccountValues(accountName, laterAttempt(record), Notify::Yes);
+        __VeltoIDDBSetAccountValues(accountName, laterAttempt(record));
     }
 }
 

@@ -108,11 +108,10 @@ class InformationRequest {
 
     /// The next account check validates the account.
     void markForValidation() const {
-        __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountForceValidationKey, Value::boolean(true),
-                                   Notify::Yes);
+        __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountForceValidationKey, Value::boolean(true));
         if (!record_.values().contains(kVeltoIDAccountNextValidationDateKey))
             __VeltoIDDBSetAccountValue(name_, kVeltoIDAccountNextValidationDateKey,
-                                       Value::date(platform::now()), Notify::Yes);
+                                       Value::date(platform::now()));
     }
 
     bool askServer(bool fresh) {
@@ -169,7 +168,7 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
     const String encDsId = answer.string(kVeltoIDAccountDSIDKey);
     if (isValid.asBoolean().value_or(false)) {
         __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                       Value::date(platform::now()), Notify::Yes);
+                                       Value::date(platform::now()));
         return;
     }
     VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice,
@@ -177,10 +176,9 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
                          << accountName.view() << " dsID=" << describeValue(encDsId)
                          << "as invalid because the server said CertificateIsValid = false. ("
                          << describeValue(isValid));
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid,
-                                   Notify::Yes);
+    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid);
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey,
-                                   Value::date(platform::now()), Notify::Yes);
+                                   Value::date(platform::now()));
 }
 
 bool bothPresentAndDifferent(const Value& before, const Value& after) {
@@ -265,7 +263,7 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
 
     values.set(kVeltoIDAccountForceValidationKey, Value::null());
     values.set(kVeltoIDAccountNextValidationDateKey, Value::null());
-    __VeltoIDDBSetAccountValues(accountName, values, Notify::Yes);
+    __VeltoIDDBSetAccountValues(accountName, values);
     if (notify) platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
 }
 

@@ -1,8 +1,6 @@
 // Who an account is: answered from its record while that is fresh, else asked from the server.
 #pragma once
 
-#include <optional>
-
 #include "Values/Error.h"
 #include "Values/Value.h"
 

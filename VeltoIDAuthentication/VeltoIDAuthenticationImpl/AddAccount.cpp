@@ -45,7 +45,7 @@ Session signIn(const String& accountName, const String& hashedPassword, const Di
     Session session =
         __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, encDsId, nullptr, error);
     if (!session) return nullptr;
-    if (*encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, *encDsId, Notify::Yes);
+    if (*encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, *encDsId);
     if (!getBool(&options, option::kDoNotFetchInformation, false)) {
         const Dictionary fetchOptions =
             copyDictionarySettingValue(options, option::kForceValidationRecordFetch, Value::boolean(true));
@@ -170,7 +170,7 @@ bool addOnlyAccount(const String& accountName, const String& hashedPassword, con
     const bool isAdded = __VeltoIDDoAddVeltoID(accountName, hashedPassword, options, added, error);
     __VeltoIDDBIncrementMetaInfoCounter(nullptr, options, kVeltoIDAddVeltoIDCountKey, 1);
     if (!isAdded) return false;
-    __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountLastValidationDateKey, Value::null(), Notify::Yes);
+    __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountLastValidationDateKey, Value::null());
     wakeAccountCheck();
     forgetOtherAccounts(accountName);
     return waitForCertificate(accountName, options, wakeAccountCheck);

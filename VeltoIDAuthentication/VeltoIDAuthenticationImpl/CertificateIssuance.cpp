@@ -73,8 +73,7 @@ class SigningRequest {
                     Notify::No);
         if (!record.requestGenerationInterval())
             setInRecord(
-                {{kVeltoIDAccountCSRGenerationIntervalKey, Value::real(kVeltoIDCSRGenerationInterval)}},
-                Notify::Yes);
+                {{kVeltoIDAccountCSRGenerationIntervalKey, Value::real(kVeltoIDCSRGenerationInterval)}});
         discardPendingKey(ownership_, accountName_);
     }
 
@@ -133,14 +132,12 @@ class SigningRequest {
                          "VeltoIDAuth: CSR sent to Velto ID server for account "
                              << accountName_.view() << ", certificateToken=, certToken="
                              << describeValue(token) << ", delay=" << describeValue(delay) << ".");
-        if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}, Notify::Yes))
+        if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}))
             setInRecord({{kVeltoIDAccountCertificateTokenExpirationKey,
-                          Value::date(platform::now() + kVeltoIDCertificateTokenLifetime)}},
-                        Notify::Yes);
+                          Value::date(platform::now() + kVeltoIDCertificateTokenLifetime)}});
         const auto seconds = tokenDelay(delay);
         setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-                      seconds ? Value::real(*seconds) : Value::null()}},
-                    Notify::Yes);
+                      seconds ? Value::real(*seconds) : Value::null()}});
         const double nextFetch = platform::now() + seconds.value_or(0);
         const bool stored = setInRecord(
             {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, Notify::No);
@@ -156,7 +153,7 @@ class SigningRequest {
                 removeKeyFromKeychainGivenPersistentRef(reference);
     }
 
-    bool setInRecord(const Dictionary& values, Notify notify) {
+    bool setInRecord(const Dictionary& values, Notify notify = Notify::Yes) {
         return __VeltoIDDBSetAccountValues(accountName_, values, notify);
     }
 
@@ -255,7 +252,7 @@ void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dict
         String encDsId;
         const Session session =
             __VeltoIDSessionDoCreateSession(accountName, password, options, &encDsId, nullptr, &held);
-        if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId, Notify::Yes);
+        if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId);
     }
     fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
 }

@@ -12,8 +12,6 @@
 // call).
 #pragma once
 
-#include <optional>
-
 #include "Values/Error.h"
 #include "Values/Value.h"
 #include "VeltoIDAuthenticationImpl/ItemOwnership.h"

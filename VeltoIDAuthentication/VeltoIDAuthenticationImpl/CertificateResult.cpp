@@ -1,6 +1,4 @@
 // Applying what the server says of a certificate request.
-#include <algorithm>
-#include <cmath>
 
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
@@ -46,8 +44,6 @@ class CertificateResult {
     }
 
   private:
-    // --- Issued
-
     bool applyIssued() {
         VELTOID_LOG_FROM(kFunction, kNotice,
                          "VeltoIDAuth: Adding certificate for "
@@ -77,7 +73,7 @@ class CertificateResult {
     }
 
     bool setInEntry(const String& key, const Value& value) {
-        return __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::Yes);
+        return __VeltoIDDBSetCertificateValue(encDsId_, key, value);
     }
 
     /// Text that is no certificate is passed over: the entry tells that there is none.
@@ -125,8 +121,7 @@ class CertificateResult {
                      {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
                      {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()},
-                     {kVeltoIDAccountCSRCreationDateKey, Value::null()}},
-                    Notify::Yes);
+                     {kVeltoIDAccountCSRCreationDateKey, Value::null()}});
     }
 
     /// Without its key the certificate would be of no use.
@@ -142,13 +137,11 @@ class CertificateResult {
         return true;
     }
 
-    // --- Pending
-
     bool applyPending() {
         const double delay = pendingDelay(delay_, record_);
         const double nextFetch = platform::now() + (delay > 0 ? delay : 1);
-        const bool stored = setInRecord(
-            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, Notify::Yes);
+        const bool stored =
+            setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}});
         if (stored)
             setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
                           Value::real(delayAfterPending(delay))}},
@@ -159,8 +152,6 @@ class CertificateResult {
         requestRelaunch(nextFetch);
         return stored;
     }
-
-    // --- Refused, or anything else
 
     bool giveUp() {
         VELTOID_LOG_FROM(kFunction, kNotice,
@@ -200,8 +191,7 @@ class CertificateResult {
              {kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now() + kVeltoIDCSRRetryDelay)},
              {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
              {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
-             {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}},
-            Notify::Yes);
+             {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}});
         discardPendingKey(ownership_, accountName_);
     }
 
@@ -210,8 +200,7 @@ class CertificateResult {
         setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
                       Value::date(platform::now() + (delta > 0 ? delta : kMaxPollingDelay))},
                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-                      Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}},
-                    Notify::Yes);
+                      Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}});
     }
 
     std::string token() const { return record_.certificateToken().text(); }
@@ -221,7 +210,7 @@ class CertificateResult {
         return status.isString() ? status.asString().text() : describeValue(status);
     }
 
-    bool setInRecord(const Dictionary& values, Notify notify) {
+    bool setInRecord(const Dictionary& values, Notify notify = Notify::Yes) {
         return __VeltoIDDBSetAccountValues(accountName_, values, notify);
     }
 

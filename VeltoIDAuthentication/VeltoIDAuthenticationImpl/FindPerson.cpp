@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationImpl/FindPerson.h"
 
-#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
 #include "VeltoIDXMLServerCommunications/PasswordRefusal.h"

@@ -48,8 +48,6 @@ class AccountCheck {
     }
 
   private:
-    // --- Password and account
-
     std::optional<AccountState> examinePassword() const {
         const Data reference = record_.passwordReference();
         if (!reference) {
@@ -100,8 +98,6 @@ class AccountCheck {
         }
         return std::nullopt;
     }
-
-    // --- Certificate
 
     AccountState examineCertificate() {
         AccountState state = classify();
@@ -229,8 +225,6 @@ class AccountCheck {
         return schedule().isDue(DueReason::ValidationRecord) ? AccountState::ValidationRecordNeedsToBeUpdated
                                                              : state;
     }
-
-    // ---
 
     AccountSchedule schedule() const { return {record_, entry_, options_}; }
 

@@ -1,8 +1,6 @@
 // What an account needs next.
 #pragma once
 
-#include <optional>
-
 #include "Protocol/AccountState.h"
 #include "Values/Error.h"
 #include "Values/Value.h"

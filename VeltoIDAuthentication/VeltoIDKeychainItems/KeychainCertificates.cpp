@@ -14,14 +14,8 @@ using platform::KeychainAttributes;
 using platform::KeychainItemClass;
 using platform::KeychainStatus;
 
-KeychainAttributes allCertificates() {
-    KeychainAttributes attributes;
-    attributes.itemClass = KeychainItemClass::Certificate;
-    return attributes;
-}
-
 KeychainAttributes identityOf(const Certificate& certificate) {
-    KeychainAttributes attributes = allCertificates();
+    KeychainAttributes attributes = keychain_items::itemsOf(KeychainItemClass::Certificate);
     attributes.applicationValue = sha256Text(Data(certificate.der));
     return attributes;
 }
@@ -40,31 +34,34 @@ bool updateItem(const Data& reference, const Certificate& certificate, const Str
     return false;
 }
 
-bool addItem(const Certificate& certificate, const String& label, Data* reference) {
+Data addItem(const Certificate& certificate, const String& label) {
     KeychainAttributes attributes = identityOf(certificate);
     attributes.label = label.text();
     attributes.accessGroup = kKeychainAccessGroup;
     platform::PersistentReference added;
     const KeychainStatus status =
         platform::keychain::add(attributes, Accessibility::Always, certificate.der, &added);
-    if (status == platform::kKeychainSuccess) {
-        *reference = keychain_items::dataOf(added);
-        return true;
-    }
+    if (status == platform::kKeychainSuccess) return keychain_items::dataOf(added);
     VELTOID_LOG_FROM("addCertificateToKeychain", kError,
                      "Certificate " << describeValue(label) << " not added to keychain; err=" << status);
-    return false;
+    return {};
 }
 
-bool addOrUpdate(const Certificate& certificate, const String& label, Data* reference) {
+/// The reference of the certificate's item; null when the keychain refuses.
+Data addOrUpdate(const Certificate& certificate, const String& label) {
     if (const Data found = keychain_items::copyReference(identityOf(certificate))) {
-        if (updateItem(found, certificate, label)) {
-            *reference = found;
-            return true;
-        }
+        if (updateItem(found, certificate, label)) return found;
         platform::keychain::remove({identityOf(certificate), {}});
     }
-    return addItem(certificate, label, reference);
+    return addItem(certificate, label);
+}
+
+/// Those with the label, or all.
+std::optional<Array> copyReferencesOf(const std::optional<std::string>& label) {
+    return keychainQueue().sync([&]() -> std::optional<Array> {
+        if (!usesSystemKeychain()) return std::nullopt;
+        return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Certificate, label));
+    });
 }
 
 }  // namespace
@@ -72,20 +69,13 @@ bool addOrUpdate(const Certificate& certificate, const String& label, Data* refe
 bool addCertificateToKeychain(const Certificate& certificate, const String& label,
                               Data* persistentReference) {
     if (!label) return false;
-    return keychainQueue().sync([&] {
-        Data reference;
-        if (!usesSystemKeychain() || !addOrUpdate(certificate, label, &reference)) return false;
-        if (persistentReference != nullptr) *persistentReference = reference;
-        return true;
-    });
+    return keychain_items::handOut(
+        persistentReference, [&] { return usesSystemKeychain() ? addOrUpdate(certificate, label) : Data(); });
 }
 
 bool copyPersistentRefForCertificate(const Certificate& certificate, Data* persistentReference) {
-    return keychainQueue().sync([&] {
-        const Data reference =
-            usesSystemKeychain() ? keychain_items::copyReference(identityOf(certificate)) : Data();
-        if (reference && persistentReference != nullptr) *persistentReference = reference;
-        return static_cast<bool>(reference);
+    return keychain_items::handOut(persistentReference, [&] {
+        return usesSystemKeychain() ? keychain_items::copyReference(identityOf(certificate)) : Data();
     });
 }
 
@@ -121,20 +111,10 @@ bool removeCertificateFromKeychainGivenPersistentRef(const Data& persistentRefer
     });
 }
 
-std::optional<Array> copyAllCertificatesFromKeychain() {
-    return keychainQueue().sync([]() -> std::optional<Array> {
-        if (!usesSystemKeychain()) return std::nullopt;
-        return keychain_items::copyReferences(allCertificates());
-    });
-}
+std::optional<Array> copyAllCertificatesFromKeychain() { return copyReferencesOf({}); }
 
 std::optional<Array> copyCertificatesFromKeychainGivenLabel(const String& label) {
-    return keychainQueue().sync([&]() -> std::optional<Array> {
-        if (!usesSystemKeychain()) return std::nullopt;
-        KeychainAttributes attributes = allCertificates();
-        attributes.label = label.text();
-        return keychain_items::copyReferences(attributes);
-    });
+    return copyReferencesOf(label.text());
 }
 
 }  // namespace veltoid

@@ -24,12 +24,17 @@ platform::WorkQueue keychainQueue() { return state().queue; }
 
 namespace keychain_items {
 
+platform::KeychainAttributes itemsOf(platform::KeychainItemClass itemClass,
+                                     std::optional<std::string> label) {
+    platform::KeychainAttributes attributes;
+    attributes.itemClass = itemClass;
+    attributes.label = std::move(label);
+    return attributes;
+}
+
 platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass, const Data& reference) {
-    platform::KeychainQuery query;
-    query.attributes.itemClass = itemClass;
     const auto bytes = reference.bytes();
-    query.itemList = {{platform::PersistentReference(bytes.begin(), bytes.end())}};
-    return query;
+    return {itemsOf(itemClass), {{platform::PersistentReference(bytes.begin(), bytes.end())}}};
 }
 
 std::string describeItemQuery(std::string_view itemClass, const Data& reference) {

@@ -50,6 +50,21 @@ Data copyReference(const platform::KeychainAttributes& attributes,
 /// The references of all items that match; none when there are none.
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes);
 
+/// The attributes of all items of the class, or of those with the label.
+platform::KeychainAttributes itemsOf(platform::KeychainItemClass itemClass,
+                                     std::optional<std::string> label = {});
+
+/// Runs `find`, which returns a reference, on the keychain queue, and hands the reference out. False when it
+/// is null.
+template <typename Find>
+bool handOut(Data* reference, Find find) {
+    return keychainQueue().sync([&] {
+        const Data found = find();
+        if (found && reference != nullptr) *reference = found;
+        return static_cast<bool>(found);
+    });
+}
+
 /// Items kept in memory instead, by reference. On the keychain queue only.
 template <typename Item>
 class MemoryTable {

@@ -1,6 +1,5 @@
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 
-#include "Logging/Log.h"
 #include "Platform/crypto/KeyPair.h"
 #include "Values/Digest.h"
 #include "Values/SecurityObject.h"
@@ -18,8 +17,7 @@ keychain_items::MemoryTable<Key>& memoryItems() { return keychain_items::memoryI
 
 /// What identifies the key among those of its class.
 KeychainAttributes identityOf(const Key& key) {
-    KeychainAttributes attributes;
-    attributes.itemClass = KeychainItemClass::Key;
+    KeychainAttributes attributes = keychain_items::itemsOf(KeychainItemClass::Key);
     attributes.keyClass = key.isPrivate ? "private" : "public";
     attributes.applicationValue = sha256Text(key.publicPart);
     return attributes;
@@ -42,7 +40,7 @@ KeychainStatus updateItem(const Data& reference, const Key& key, const std::stri
 }
 
 /// A duplicate that the search did not show makes room once.
-bool addItem(const Key& key, const std::string& label, Data* reference) {
+Data addItem(const Key& key, const std::string& label) {
     KeychainAttributes attributes = identityOf(key);
     attributes.label = label;
     attributes.accessGroup = kKeychainAccessGroup;
@@ -54,24 +52,22 @@ bool addItem(const Key& key, const std::string& label, Data* reference) {
     if (status == platform::kKeychainDuplicateItem &&
         platform::keychain::remove({identityOf(key), {}}) == platform::kKeychainSuccess)
         status = add();
-    if (status != platform::kKeychainSuccess) return false;
-    *reference = keychain_items::dataOf(added);
-    return true;
+    return status == platform::kKeychainSuccess ? keychain_items::dataOf(added) : Data();
 }
 
-bool addOrUpdate(const Key& key, const std::string& label, Data* reference) {
+/// The reference of the key's item; null when the keychain refuses.
+Data addOrUpdate(const Key& key, const std::string& label) {
     KeychainStatus status = platform::kKeychainSuccess;
     const Data found = keychain_items::copyReference(identityOf(key), &status);
     if (found) {
         status = updateItem(found, key, label);
-        if (status == platform::kKeychainSuccess) *reference = found;
-        if (status == platform::kKeychainSuccess || keychain_items::mayPass(status))
-            return status == platform::kKeychainSuccess;
+        if (status == platform::kKeychainSuccess) return found;
+        if (keychain_items::mayPass(status)) return {};
         // Damaged: the key at hand replaces it.
         platform::keychain::remove({identityOf(key), {}});
     }
-    if (!found && status != platform::kKeychainItemNotFound) return false;
-    return addItem(key, label, reference);
+    if (!found && status != platform::kKeychainItemNotFound) return {};
+    return addItem(key, label);
 }
 
 }  // namespace
@@ -96,30 +92,18 @@ Value Key::description() const {
 bool addKeyToKeychain(const String& owner, const String& kind, const Key& key, Data* persistentReference) {
     const bool kindIsPrivate = !kind || kind == kPrivateKeyKind;
     if (!key || key.isPrivate != kindIsPrivate) return false;
-    return keychainQueue().sync([&] {
-        Data reference;
-        if (!usesSystemKeychain()) {
-            reference = memoryItems().add(key);
-        } else if (!addOrUpdate(key, labelOf(owner, kind), &reference)) {
-            return false;
-        }
-        if (persistentReference != nullptr) *persistentReference = reference;
-        return true;
+    return keychain_items::handOut(persistentReference, [&] {
+        return usesSystemKeychain() ? addOrUpdate(key, labelOf(owner, kind)) : memoryItems().add(key);
     });
 }
 
 bool copyPersistentRefForKey(const Key& key, Data* persistentReference) {
     if (!key) return false;
-    return keychainQueue().sync([&] {
-        Data reference;
-        if (usesSystemKeychain()) {
-            reference = keychain_items::copyReference(identityOf(key));
-        } else {
-            for (const auto& [known, item] : memoryItems().items())
-                if (!reference && item == key) reference = known;
-        }
-        if (reference && persistentReference != nullptr) *persistentReference = reference;
-        return static_cast<bool>(reference);
+    return keychain_items::handOut(persistentReference, [&] {
+        if (usesSystemKeychain()) return keychain_items::copyReference(identityOf(key));
+        for (const auto& [known, item] : memoryItems().items())
+            if (item == key) return known;
+        return Data();
     });
 }
 
@@ -153,9 +137,8 @@ bool removeKeyFromKeychainGivenPersistentRef(const Data& persistentReference) {
 
 std::optional<Array> copyAllKeysFromKeychain() {
     return keychainQueue().sync([]() -> std::optional<Array> {
-        KeychainAttributes keys;
-        keys.itemClass = KeychainItemClass::Key;
-        if (usesSystemKeychain()) return keychain_items::copyReferences(keys);
+        if (usesSystemKeychain())
+            return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Key));
         Array references;
         for (const auto& [reference, key] : memoryItems().items()) references.append(reference);
         return references.empty() ? std::nullopt : std::optional(references);
@@ -165,10 +148,8 @@ std::optional<Array> copyAllKeysFromKeychain() {
 std::optional<Array> copyKeysFromKeychainGivenOwner(const String& owner, const String& kind) {
     return keychainQueue().sync([&]() -> std::optional<Array> {
         if (!usesSystemKeychain()) return std::nullopt;
-        KeychainAttributes keys;
-        keys.itemClass = KeychainItemClass::Key;
-        keys.label = labelOf(owner, kind);
-        return keychain_items::copyReferences(keys);
+        return keychain_items::copyReferences(
+            keychain_items::itemsOf(KeychainItemClass::Key, labelOf(owner, kind)));
     });
 }
 

@@ -72,26 +72,25 @@ KeychainStatus addItem(const KeychainAttributes& attributes, const String& passw
     return status;
 }
 
-bool addOrUpdate(const String& accountName, const String& passwordHash, const String& label,
-                 Data* reference) {
+/// The reference of the account's item; null when the keychain refuses.
+Data addOrUpdate(const String& accountName, const String& passwordHash, const String& label) {
     std::vector<PersistentReference> found;
     KeychainStatus status = platform::keychain::copyMatchingReferences(queryForAccount(accountName), &found);
+    Data reference;
     if (status == platform::kKeychainSuccess && !found.empty()) {
-        *reference = keychain_items::dataOf(found.front());
-        status = updateItem(*reference, passwordHash);
-        if (status == platform::kKeychainSuccess) return true;
-        *reference = {};
-        if (!keychain_items::mayPass(status)) {
+        reference = keychain_items::dataOf(found.front());
+        status = updateItem(reference, passwordHash);
+        if (status != platform::kKeychainSuccess && !keychain_items::mayPass(status)) {
             platform::keychain::remove(queryForAccount(accountName));
             status = platform::kKeychainItemNotFound;
         }
     }
     if (status == platform::kKeychainItemNotFound)
-        status = addItem(creationAttributes(accountName, label), passwordHash, reference);
-    if (status == platform::kKeychainSuccess) return true;
+        status = addItem(creationAttributes(accountName, label), passwordHash, &reference);
+    if (status == platform::kKeychainSuccess) return reference;
     VELTOID_LOG_FROM("addPasswordToKeychain", kError,
                      "Failed to add password to keychain,err=" << status << " ref=" << describeValue({}));
-    return false;
+    return {};
 }
 
 }  // namespace
@@ -99,15 +98,9 @@ bool addOrUpdate(const String& accountName, const String& passwordHash, const St
 bool addPasswordToKeychain(const String& accountName, const String& passwordHash, const String& label,
                            Data* persistentReference) {
     if (!accountName || !passwordHash) return false;
-    return keychainQueue().sync([&] {
-        Data reference;
-        if (!usesSystemKeychain()) {
-            reference = memoryItems().add(passwordHash);
-        } else if (!addOrUpdate(accountName, passwordHash, label, &reference)) {
-            return false;
-        }
-        if (persistentReference != nullptr) *persistentReference = reference;
-        return true;
+    return keychain_items::handOut(persistentReference, [&] {
+        return usesSystemKeychain() ? addOrUpdate(accountName, passwordHash, label)
+                                    : memoryItems().add(passwordHash);
     });
 }
 

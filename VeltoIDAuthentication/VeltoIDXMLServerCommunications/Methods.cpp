@@ -72,11 +72,21 @@ std::optional<Dictionary> call(VeltoIDAuthenticationSessionInfo& session, const 
     return std::move(made.reply);
 }
 
-/// The same on the session's queue, where nothing of the reply is wanted.
+/// The same on the session's queue; `take` gets the reply.
+template <typename Take>
+bool callOnQueue(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
+                 const Dictionary& options, ErrorOut error, Take take) {
+    return session.fDispatchQueue.sync([&] {
+        const auto reply = call(session, method, own, options, error);
+        if (reply) take(*reply);
+        return reply.has_value();
+    });
+}
+
+/// Where nothing of the reply is wanted.
 bool callOnQueue(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
                  const Dictionary& options, ErrorOut error) {
-    return session.fDispatchQueue.sync(
-        [&] { return call(session, method, own, options, error).has_value(); });
+    return callOnQueue(session, method, own, options, error, [](const Dictionary&) {});
 }
 
 void takeValidationRecord(const Dictionary& reply, Dictionary& result) {
@@ -197,15 +207,12 @@ bool _VeltoIDSessionDoGetMyInfo(VeltoIDAuthenticationSessionInfo& session, const
 
 bool __VeltoIDSessionDoFindPerson(VeltoIDAuthenticationSessionInfo& session, const Dictionary& criteria,
                                   const Dictionary& options, std::optional<Array>* matches, ErrorOut error) {
-    return session.fDispatchQueue.sync([&] {
-        const auto reply = call(session, {"findPerson", kVeltoIDXMLFindPersonCountKey},
-                                {{wire::kSearchCriteria, criteria}}, options, error);
-        if (!reply) return false;
-        const Array* found = reply->array(wire::kMatches);
-        if (found != nullptr) __VeltoIDDBAddFindPersonResultsToCache(*found);
-        fill(matches, found != nullptr ? std::optional(*found) : std::nullopt);
-        return true;
-    });
+    return callOnQueue(session, {"findPerson", kVeltoIDXMLFindPersonCountKey},
+                       {{wire::kSearchCriteria, criteria}}, options, error, [&](const Dictionary& reply) {
+                           const Array* found = reply.array(wire::kMatches);
+                           if (found != nullptr) __VeltoIDDBAddFindPersonResultsToCache(*found);
+                           fill(matches, found != nullptr ? std::optional(*found) : std::nullopt);
+                       });
 }
 
 bool __VeltoIDSessionDoSendCSR(VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
@@ -259,13 +266,9 @@ bool __VeltoIDSessionDoCompleteCertificate(VeltoIDAuthenticationSessionInfo& ses
 bool __VeltoIDSessionDoFetchCertificateBySerialNumber(VeltoIDAuthenticationSessionInfo& session,
                                                       const String& serialNumber, const Dictionary& options,
                                                       String* certificate, ErrorOut error) {
-    return session.fDispatchQueue.sync([&] {
-        const auto reply = call(session, {"fetchCert", kVeltoIDXMLFetchCertCountKey},
-                                {{wire::kFetchedSerialNumber, serialNumber}}, options, error);
-        if (!reply) return false;
-        fill(certificate, reply->string(wire::kCertificate));
-        return true;
-    });
+    return callOnQueue(session, {"fetchCert", kVeltoIDXMLFetchCertCountKey},
+                       {{wire::kFetchedSerialNumber, serialNumber}}, options, error,
+                       [&](const Dictionary& reply) { fill(certificate, reply.string(wire::kCertificate)); });
 }
 
 bool __VeltoIDSessionDoRevokeCertificate(VeltoIDAuthenticationSessionInfo& session,

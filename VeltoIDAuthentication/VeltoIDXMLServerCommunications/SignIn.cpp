@@ -162,8 +162,7 @@ class SignIn {
         serverVersion() = getInt32(&reply, wire::kVersion, 0);
         applyEmbargo(reply);
         if (reply.boolean(wire::kClientTooOld).value_or(false)) {
-            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true),
-                                       Notify::Yes);
+            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true));
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
         }
         encDsId_ = reply.string(wire::kEncDsId);
@@ -185,7 +184,7 @@ class SignIn {
         if (!date && seconds >= 1) date = now_ + seconds;
         if (!date || *date <= now_) return;
         __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountEarliestAllowedConnectionDateKey,
-                                   Value::date(*date), Notify::Yes);
+                                   Value::date(*date));
         held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
     }
 
@@ -196,23 +195,20 @@ class SignIn {
                              << " so disabling the certs and VeltoIDValidationRecord on this account.");
         for (const String& encDsId : {oldEncDsId_, encDsId_})
             __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey,
-                                           kVeltoIDCertificateStatusInvalid, Notify::Yes);
-        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountValidationRecordIdentifierKey, Value::null(),
-                                   Notify::Yes);
-        __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_),
-                                       Notify::Yes);
+                                           kVeltoIDCertificateStatusInvalid);
+        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountValidationRecordIdentifierKey, Value::null());
+        __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_));
     }
 
     void applyCertificateState(const Dictionary& reply) {
         if (reply.boolean(wire::kCertificateIsValid).value_or(false)) {
             __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                           Value::date(now_), Notify::Yes);
+                                           Value::date(now_));
         } else if (reply.contains(wire::kCertificateIsValid) ||
                    reply.contains(wire::kCertificateNoLongerValid)) {
             __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey,
-                                           kVeltoIDCertificateStatusInvalid, Notify::Yes);
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_),
-                                           Notify::Yes);
+                                           kVeltoIDCertificateStatusInvalid);
+            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_));
         }
     }
 
@@ -221,8 +217,7 @@ class SignIn {
         if (!identifier || identifier == oldRecordIdentifier_) return;
         __VeltoIDDBSetAccountValues(accountName_,
                                     {{kVeltoIDAccountValidationRecordIdentifierKey, Value::null()},
-                                     {kVeltoIDAccountValidationRecordNextCheckDateKey, Value::null()}},
-                                    Notify::Yes);
+                                     {kVeltoIDAccountValidationRecordNextCheckDateKey, Value::null()}});
     }
 
     void keepBooks() {

@@ -5,76 +5,78 @@
 
 namespace veltoid::wire {
 
+using Key = std::string_view;
+
 // Of every call.
-inline constexpr std::string_view kSession = "dsSession";
-inline constexpr std::string_view kProtocolVersion = "VeltoIDAuthProtocolVersion";
-inline constexpr std::string_view kFrameworkVersion = "TamrixVersion";
-inline constexpr std::string_view kClientTime = "ClientTime";
-inline constexpr std::string_view kProductName = "ProductName";
-inline constexpr std::string_view kSystemVersion = "SystemVersion";
+inline constexpr Key kSession = "dsSession";
+inline constexpr Key kProtocolVersion = "VeltoIDAuthProtocolVersion";
+inline constexpr Key kFrameworkVersion = "TamrixVersion";
+inline constexpr Key kClientTime = "ClientTime";
+inline constexpr Key kProductName = "ProductName";
+inline constexpr Key kSystemVersion = "SystemVersion";
 
 // Of calls and replies.
-inline constexpr std::string_view kMetaInformation = "MetaInformation";
-inline constexpr std::string_view kAccountInformation = "AccountInformation";
-inline constexpr std::string_view kEncDsId = "encDsId";
-inline constexpr std::string_view kCertificateToken = "CertificateToken";
-inline constexpr std::string_view kSerialNumber = "SerialNumber";
-inline constexpr std::string_view kBreadcrumb = "ek";
+inline constexpr Key kMetaInformation = "MetaInformation";
+inline constexpr Key kAccountInformation = "AccountInformation";
+inline constexpr Key kEncDsId = "encDsId";
+inline constexpr Key kCertificateToken = "CertificateToken";
+inline constexpr Key kSerialNumber = "SerialNumber";
+inline constexpr Key kBreadcrumb = "ek";
 
 // Commands that any reply may carry.
-inline constexpr std::string_view kSessionValidity = "dsSessionValidityDuration";
-inline constexpr std::string_view kNewURL = "NewURL";
-inline constexpr std::string_view kNextLaunchInterval = "NextLaunchTimeInterval";
-inline constexpr std::string_view kFlushAndExit = "FlushAndExit";
+inline constexpr Key kSessionValidity = "dsSessionValidityDuration";
+inline constexpr Key kNewURL = "NewURL";
+inline constexpr Key kNextLaunchInterval = "NextLaunchTimeInterval";
+inline constexpr Key kFlushAndExit = "FlushAndExit";
 
 // Calls.
-inline constexpr std::string_view kAccount = "veltoConnect";
-inline constexpr std::string_view kPasswordHash = "pwdHash";
-inline constexpr std::string_view kUserUUID = "UserUUID";
-inline constexpr std::string_view kClientDateTime = "ClientDateTime";
-inline constexpr std::string_view kKnownRecordIdentifier = "ClientVIDVRecordIdentifier";
-inline constexpr std::string_view kKnownSerialNumber = "CertificateSerialNumber";
-inline constexpr std::string_view kAccountUUID = "AccountUUID";
-inline constexpr std::string_view kAccountStableUUID = "AccountStableUUID";
-inline constexpr std::string_view kMachineUUID = "machineUUID";
-inline constexpr std::string_view kBreadcrumbKey = "breadcrumbKey";
-inline constexpr std::string_view kSearchCriteria = "searchCriteria";
-inline constexpr std::string_view kFetchedSerialNumber = "certSerialNumber";
-inline constexpr std::string_view kRequest = "CSR";
-inline constexpr std::string_view kRequestedLifetime = "RequestedCertificateLifetimeInSeconds";
-inline constexpr std::string_view kFetchDelayMinimum = "__CERT_FETCH_DELAY_MIN";
-inline constexpr std::string_view kFetchDelayMaximum = "__CERT_FETCH_DELAY_MAX";
+inline constexpr Key kAccount = "veltoConnect";
+inline constexpr Key kPasswordHash = "pwdHash";
+inline constexpr Key kUserUUID = "UserUUID";
+inline constexpr Key kClientDateTime = "ClientDateTime";
+inline constexpr Key kKnownRecordIdentifier = "ClientVIDVRecordIdentifier";
+inline constexpr Key kKnownSerialNumber = "CertificateSerialNumber";
+inline constexpr Key kAccountUUID = "AccountUUID";
+inline constexpr Key kAccountStableUUID = "AccountStableUUID";
+inline constexpr Key kMachineUUID = "machineUUID";
+inline constexpr Key kBreadcrumbKey = "breadcrumbKey";
+inline constexpr Key kSearchCriteria = "searchCriteria";
+inline constexpr Key kFetchedSerialNumber = "certSerialNumber";
+inline constexpr Key kRequest = "CSR";
+inline constexpr Key kRequestedLifetime = "RequestedCertificateLifetimeInSeconds";
+inline constexpr Key kFetchDelayMinimum = "__CERT_FETCH_DELAY_MIN";
+inline constexpr Key kFetchDelayMaximum = "__CERT_FETCH_DELAY_MAX";
 
 // Replies to a sign-in.
-inline constexpr std::string_view kVersion = "Version";
-inline constexpr std::string_view kClientTooOld = "ClientTooOld";
-inline constexpr std::string_view kDoNotConnectBefore = "DoNotConnectBeforeX";
-inline constexpr std::string_view kDoNotConnectFor = "DoNotConnectForX";
-inline constexpr std::string_view kRecordIdentifier = "VeltoIDRecordIdentifier";
-inline constexpr std::string_view kCertificateIsValid = "CertificateIsValid";
-inline constexpr std::string_view kCertificateNoLongerValid = "CertificateNoLongerValid";
+inline constexpr Key kVersion = "Version";
+inline constexpr Key kClientTooOld = "ClientTooOld";
+inline constexpr Key kDoNotConnectBefore = "DoNotConnectBeforeX";
+inline constexpr Key kDoNotConnectFor = "DoNotConnectForX";
+inline constexpr Key kRecordIdentifier = "VeltoIDRecordIdentifier";
+inline constexpr Key kCertificateIsValid = "CertificateIsValid";
+inline constexpr Key kCertificateNoLongerValid = "CertificateNoLongerValid";
 
 // Details of an account.
-inline constexpr std::string_view kFirstName = "firstNm";
-inline constexpr std::string_view kLastName = "lastNm";
-inline constexpr std::string_view kPrimaryEmail = "PrimaryEmail";
-inline constexpr std::string_view kAllEmails = "AllEmails";
-inline constexpr std::string_view kValidatedEmail = "ValidatedEmail";
-inline constexpr std::string_view kValidatedPhones = "ValidatedPhones";
-inline constexpr std::string_view kAccountName = "VeltoID";
-inline constexpr std::string_view kValidForInterval = "ValidForInterval";
-inline constexpr std::string_view kValidationRecord = "VIDVRecord";
-inline constexpr std::string_view kValidationRecordIdentifier = "VIDVRecordIdentifier";
-inline constexpr std::string_view kValidationRecordNextCheck = "VIDVRecordNextCheckDate";
+inline constexpr Key kFirstName = "firstNm";
+inline constexpr Key kLastName = "lastNm";
+inline constexpr Key kPrimaryEmail = "PrimaryEmail";
+inline constexpr Key kAllEmails = "AllEmails";
+inline constexpr Key kValidatedEmail = "ValidatedEmail";
+inline constexpr Key kValidatedPhones = "ValidatedPhones";
+inline constexpr Key kAccountName = "VeltoID";
+inline constexpr Key kValidForInterval = "ValidForInterval";
+inline constexpr Key kValidationRecord = "VIDVRecord";
+inline constexpr Key kValidationRecordIdentifier = "VIDVRecordIdentifier";
+inline constexpr Key kValidationRecordNextCheck = "VIDVRecordNextCheckDate";
 
 // Certificates, and people.
-inline constexpr std::string_view kDelay = "Delay";
-inline constexpr std::string_view kCertificateEntry = "dsCert";
-inline constexpr std::string_view kCertificate = "Certificate";
-inline constexpr std::string_view kIntermediateCertificate = "IntermediateCert";
-inline constexpr std::string_view kCertificateType = "CertType";
-inline constexpr std::string_view kCertificateStatus = "CertStatus";
-inline constexpr std::string_view kCertificateExpiration = "Expires";
-inline constexpr std::string_view kMatches = "matches";
+inline constexpr Key kDelay = "Delay";
+inline constexpr Key kCertificateEntry = "dsCert";
+inline constexpr Key kCertificate = "Certificate";
+inline constexpr Key kIntermediateCertificate = "IntermediateCert";
+inline constexpr Key kCertificateType = "CertType";
+inline constexpr Key kCertificateStatus = "CertStatus";
+inline constexpr Key kCertificateExpiration = "Expires";
+inline constexpr Key kMatches = "matches";
 
 }  // namespace veltoid::wire

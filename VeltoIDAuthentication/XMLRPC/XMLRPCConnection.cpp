@@ -28,20 +28,10 @@ class SynchronousExchange : public platform::HTTPSessionEvents {
     void completed(const std::optional<platform::HTTPError>& error) override {
         std::optional<XMLRPCResponse> response;
         if (!error && statusCode_ < kFirstHTTPErrorStatus) response.emplace(std::move(body_));
-        const std::lock_guard lock(mutex_);
-        if (isOver_) return;
-        isOver_ = true;
-        response_ = std::move(response);
-        if (error) error_ = transportError(*error);
-        over_.signal();
+        end(std::move(response), error ? std::optional(transportError(*error)) : std::nullopt);
     }
 
-    void giveUp() {
-        const std::lock_guard lock(mutex_);
-        if (isOver_) return;
-        isOver_ = true;
-        over_.signal();
-    }
+    void giveUp() { end({}, {}); }
 
     /// Ends with `completed` or `giveUp`.
     void wait() const { (void)over_.wait(platform::kForever); }
@@ -53,6 +43,15 @@ class SynchronousExchange : public platform::HTTPSessionEvents {
     }
 
   private:
+    void end(std::optional<XMLRPCResponse> response, std::optional<Error> error) {
+        const std::lock_guard lock(mutex_);
+        if (isOver_) return;
+        isOver_ = true;
+        response_ = std::move(response);
+        error_ = std::move(error);
+        over_.signal();
+    }
+
     int statusCode_ = 0;
     platform::SecretBytes body_;
 

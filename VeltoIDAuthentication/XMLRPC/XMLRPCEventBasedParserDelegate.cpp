@@ -65,53 +65,21 @@ bool XMLRPCEventBasedParserDelegate::push(XMLRPCElementType type) {
 }
 
 bool XMLRPCEventBasedParserDelegate::startElement(XMLRPCTag tag) {
-    switch (tag) {
-        case XMLRPCTag::Value:
-            return push(XMLRPCElementType::String);
-        case XMLRPCTag::Member:
-            return push(XMLRPCElementType::Member);
-        case XMLRPCTag::Name:
-            return push(XMLRPCElementType::Name);
-        default:
-            setElementType(tag);
-            return true;
-    }
+    if (tag == XMLRPCTag::Value) return push(XMLRPCElementType::String);
+    if (isNode(tag)) return push(static_cast<XMLRPCElementType>(tag));
+    setElementType(tag);
+    return true;
 }
 
 void XMLRPCEventBasedParserDelegate::setElementType(XMLRPCTag tag) {
+    static_assert(static_cast<int>(XMLRPCTag::Data) == static_cast<int>(XMLRPCElementType::Data));
+    if (tag > XMLRPCTag::Data) return;
     Node& node = nodes_[depth_ - 1];
-    switch (tag) {
-        case XMLRPCTag::Array:
-            node.myElementType = XMLRPCElementType::Array;
-            node.array = Array();
-            node.text.clear();
-            break;
-        case XMLRPCTag::Struct:
-            node.myElementType = XMLRPCElementType::Dictionary;
-            node.dictionary = Dictionary();
-            node.text.clear();
-            break;
-        case XMLRPCTag::Integer:
-            node.myElementType = XMLRPCElementType::Integer;
-            break;
-        case XMLRPCTag::Double:
-            node.myElementType = XMLRPCElementType::Double;
-            break;
-        case XMLRPCTag::Boolean:
-            node.myElementType = XMLRPCElementType::Boolean;
-            break;
-        case XMLRPCTag::String:
-            node.myElementType = XMLRPCElementType::String;
-            break;
-        case XMLRPCTag::Date:
-            node.myElementType = XMLRPCElementType::Date;
-            break;
-        case XMLRPCTag::Data:
-            node.myElementType = XMLRPCElementType::Data;
-            break;
-        default:
-            break;
-    }
+    node.myElementType = static_cast<XMLRPCElementType>(tag);
+    if (holdsText(node.myElementType)) return;
+    node.text.clear();
+    node.array = Array();
+    node.dictionary = Dictionary();
 }
 
 void XMLRPCEventBasedParserDelegate::characters(std::string_view text) {

@@ -32,21 +32,21 @@ enum class XMLRPCElementType : uint8_t {
     Data = 9
 };
 
-/// What an element's name means.
+/// What an element's name means. Names of types, up to Data, have the numbers of their element types.
 enum class XMLRPCTag : uint8_t {
-    Other,
-    Fault,
-    Value,
-    Member,
-    Name,
     Array,
     Struct,
+    Member,
+    Name,
     Integer,
     Double,
     Boolean,
     String,
     Date,
-    Data
+    Data,
+    Value,
+    Fault,
+    Other
 };
 
 XMLRPCTag tagNamed(std::string_view name);

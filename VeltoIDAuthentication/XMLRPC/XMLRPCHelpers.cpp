@@ -2,7 +2,6 @@
 
 #include <algorithm>
 #include <array>
-#include <optional>
 
 #include "Values/Base64.h"
 #include "Values/Digest.h"

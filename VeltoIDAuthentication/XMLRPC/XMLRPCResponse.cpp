@@ -2,7 +2,6 @@
 
 #include "Platform/encoding/UTF8.h"
 #include "XMLRPC/XMLRPCEventBasedParser.h"
-#include "XMLRPC/XMLRPCHelpers.h"
 
 namespace veltoid {
 

@@ -1,7 +1,6 @@
 #include "XMLRPC/XMLRPCShim.h"
 
 #include <algorithm>
-#include <cmath>
 #include <limits>
 
 #include "Logging/Describe.h"
