@@ -29,7 +29,7 @@ class AgentConnection {
     /// as base64 text. The request's memory is wiped. Throws Unreachable.
     Json send(const platform::ValueWriter& writer);
 
-    /// Tells whoever listens, a running agent above all. Throws Unreachable.
+    /// Posts the notification to all listeners; a running agent is one of them. Throws Unreachable.
     void post(const std::string& notification);
 
   private:

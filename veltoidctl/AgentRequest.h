@@ -18,7 +18,7 @@ namespace veltoidctl {
 struct Request {
     /// One of Protocol/Commands.h.
     int64_t command = 0;
-    /// Empty: the request carries none. So with the password hash.
+    /// Left out of the request when empty, like the password hash.
     std::string account = {};
     platform::SecretText passwordHash = {};
     std::vector<std::pair<std::string_view, std::variant<bool, double>>> options = {};
@@ -34,7 +34,7 @@ Json send(AgentConnection& agent, const Request& request);
 
 bool succeeded(const Json& reply);
 
-/// Why something could not be had: that the keychain is locked, if it is, else `reason`.
+/// The reason for a failure: that the keychain is locked, if it is, else `reason`.
 std::string reasonUnlessLocked(const std::string& reason);
 
 }  // namespace veltoidctl

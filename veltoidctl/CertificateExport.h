@@ -11,7 +11,7 @@ namespace veltoidctl {
 
 std::string pemOf(const platform::Certificate& certificate);
 
-/// What is exported: a key, its certificate, and, if known, the certificate of whoever signed that.
+/// A private key, its certificate, and the issuer's certificate if that is known.
 struct Identity {
     veltoid::Key privateKey;
     platform::Certificate certificate;

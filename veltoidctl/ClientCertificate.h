@@ -12,11 +12,11 @@
 namespace veltoidctl {
 
 struct ClientCertificate {
-    /// The agent's answer to the question for it.
+    /// The agent's reply to the certificate request.
     Json reply = Json::object();
     /// The account's status; empty when the agent has no such account.
     Json status = Json::object();
-    /// None when there is none, or this user's keychain does not give it out.
+    /// None when the account has no certificate or this user's keychain does not return it.
     std::optional<platform::Certificate> certificate = {};
     std::optional<platform::Certificate> intermediate = {};
 
@@ -24,7 +24,7 @@ struct ClientCertificate {
     /// A request for one is on its way.
     bool isPending() const;
     bool hasIntermediate() const;
-    /// Why the agent has none.
+    /// Why the agent has no certificate.
     std::string whyThereIsNone() const;
     /// For the end of a line: when the agent asks next for a pending one; empty when that is not known.
     std::string nextLook() const;

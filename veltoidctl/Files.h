@@ -14,7 +14,7 @@ inline constexpr const char* kStandardStream = "-";
 /// empty.
 platform::SecretBytes readInput(const std::string& path);
 
-/// Standard output, a terminal or not, or a file that nobody else can read (0600) from its first moment.
+/// Standard output, or a file that is created with mode 0600, so that no other user can ever read it.
 class PrivateOutput {
   public:
     /// An existing file is refused, and so is a terminal, unless `force` is set; anything in the file's place

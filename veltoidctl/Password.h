@@ -12,7 +12,7 @@ enum class PasswordSource {
     Prompt,
     /// The first line of standard input.
     StandardInput,
-    /// The first line of standard input, which is a hash already.
+    /// The first line of standard input, which already is the hash.
     HashedStandardInput,
 };
 

@@ -14,7 +14,7 @@ namespace {
 
 constexpr int kLabelWidth = 22;
 
-/// A terminal obeys control characters: the ASCII ones, and those of two bytes (U+0080 to U+009F).
+/// The control characters that a terminal obeys: those of ASCII, and U+0080 to U+009F (two bytes in UTF-8).
 std::string withoutControls(std::string text) {
     for (size_t i = 0; i < text.size(); ++i) {
         const auto byte = static_cast<unsigned char>(text[i]);

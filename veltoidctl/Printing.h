@@ -12,7 +12,7 @@
 
 namespace veltoidctl {
 
-/// One line for people. Control characters, which somebody else may have put there, become "?".
+/// The text on one line. Control characters, which may come from the server, become "?".
 std::string textOf(const Json& value);
 
 void printLine(const std::string& label, const Json& value);

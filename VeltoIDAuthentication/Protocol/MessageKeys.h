@@ -20,7 +20,8 @@ inline constexpr Key kBreadcrumbKey = "identifier";
 inline constexpr Key kBreadcrumb = "breadcrumb";
 inline constexpr Key kIdentityReference = "identityReferenceData";
 
-// Setting a value of the database: where (one of the sections below), of what, which, and to what.
+// Setting a value of the database: one of the sections below, the account or certificate in it, the value's
+// key, and the new value.
 inline constexpr Key kSection = "domain";
 inline constexpr Key kItem = "item";
 inline constexpr Key kKey = "key";

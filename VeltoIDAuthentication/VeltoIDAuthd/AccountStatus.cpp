@@ -18,7 +18,7 @@
 namespace veltoid {
 namespace {
 
-/// What the override says; none without one.
+/// Whether the override says that the user must act; none without an override.
 std::optional<bool> userActionOverride() {
     const String text = __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaAccountRequiresUserActionKey,
                                                      Value::Kind::String)

@@ -45,7 +45,7 @@ void countFor(const String& account, const Request& request, std::string_view co
 
 bool ping(Request& /*request*/, ErrorOut /*error*/) { return true; }
 
-/// Sets what the request names; none when that is nothing that can be set.
+/// Sets the database value that the request names; none when section, item or key is missing or unknown.
 std::optional<bool> setDatabaseValue(const Request& request) {
     const String section = request.string(message::kSection);
     const String item = request.string(message::kItem);

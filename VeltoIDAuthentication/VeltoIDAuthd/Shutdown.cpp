@@ -31,7 +31,7 @@ constexpr double kDefaultIdleExit = 30;
 constexpr double kMaxTermination = 10;
 constexpr double kMaxCommandedEnd = 1;
 
-/// A service manager that is busy longer does not keep an ending process (seconds).
+/// How long the end waits for a busy service manager to take the relaunch time (seconds).
 constexpr double kMaxHandOver = 2;
 
 /// Main thread only.
@@ -54,7 +54,7 @@ double idleExitSeconds() {
     return kDefaultIdleExit;
 }
 
-/// Now, instead of when it was planned for.
+/// Makes the delayed writes now.
 void makeDurable() {
     __VeltoIDDBSynchronize();
     __VeltoIDDBWriteFindPersonCache();
@@ -65,8 +65,8 @@ void endProcess() {
     endAfterPendingWork();
 }
 
-/// Everything that was sent to the agent is answered. What it stored is made durable now, since it would keep
-/// the agent for a while otherwise; other work is finished.
+/// Answers the requests that have arrived and finishes the work under way. Stored values are synced at once:
+/// their delayed write would keep the agent running for a while.
 void endWhenWorkIsDone() {
     makeDurable();
     platform::transactions::whenNoneIsOpen([] {
@@ -109,7 +109,7 @@ void shutDownWhenIdle(double seconds) {
 
 void prepareShutdown() {
     platform::event_loop::onSignal(SIGTERM, terminate);
-    // Without its bus it can be reached by nobody and hold up the end of a log-in session.
+    // Without its bus no client can reach the agent, and it would only hold up the end of a log-in session.
     platform::message_service::onConnectionLost(terminate);
     if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
 }

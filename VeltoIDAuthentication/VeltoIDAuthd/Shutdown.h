@@ -1,6 +1,6 @@
-// How the agent leaves: when it was idle for a while and can be started again, on SIGTERM, and when its bus
-// is gone. Nothing that was sent to it is lost: it gives up its names first, so that the bus starts the next
-// agent for whoever comes then, and answers what came before.
+// Shutdown: the agent ends when it has been idle for a while and can be started again, on SIGTERM, and when
+// its bus is gone. No request is lost: it releases its bus names first, so that later requests start the next
+// agent, and then answers those that it has already received.
 #pragma once
 
 namespace veltoid {
@@ -8,7 +8,7 @@ namespace veltoid {
 /// Serves SIGTERM, the end of the bus, and idleness. Main queue, once, before the services are registered.
 void prepareShutdown();
 
-/// Has the agent leave now. Others' requests may hold that up for a second. Any queue.
+/// Begins the shutdown now. Requests that are still being served may delay it for a second. Any queue.
 void shutDownByCommand();
 
 /// Ends the agent (event_loop::run returns) once the main queue has done what it was asked for so far,

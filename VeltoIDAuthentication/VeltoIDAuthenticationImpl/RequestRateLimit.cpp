@@ -23,7 +23,7 @@ double generationInterval(const AccountRecord& record) {
                                           : kGenerationInterval;
 }
 
-/// The dates of the requests that still count.
+/// The dates of the requests within the window.
 Array recentRequests(const AccountRecord& record) {
     Array recent;
     const Array* stored = record.requestDates();
@@ -40,7 +40,7 @@ Array recentRequests(const AccountRecord& record) {
 
 std::optional<double> requestsHeldUntil(const AccountRecord& record) {
     const auto date = record.requestsHeldUntil();
-    // One that lies further ahead than it can was noted by a clock that was wrong.
+    // No refusal lasts longer than the longest interval: a later date was stored while the clock was wrong.
     if (!date || *date <= platform::now() || *date > platform::now() + kMaxGenerationInterval)
         return std::nullopt;
     return date;

@@ -1,8 +1,8 @@
 // How often an account may ask for a certificate.
 //
-// Requests are spaced by the account's "CSRGenerationInterval". Beside that a guard looks at how many were
-// really sent: an account that asks for more than a few certificates within an hour is in a loop. Its
-// requests are then held up, which the log and the status tell.
+// Requests are spaced by the account's "CSRGenerationInterval". A guard also counts the requests that were
+// sent: an account that sends more than kMaxRequestsInWindow within kRequestWindow is in a loop. It is then
+// refused until a generation interval has passed; the log and the account's status show that.
 #pragma once
 
 #include <optional>
@@ -13,21 +13,21 @@
 
 namespace veltoid {
 
-/// So many certificates may be asked for within kRequestWindow seconds.
+/// The number of requests that an account may send within kRequestWindow (seconds).
 inline constexpr size_t kMaxRequestsInWindow = 3;
 inline constexpr double kRequestWindow = 3'600;
 
-/// When the next request may be made, by the record (seconds since 1970); none: at any time.
+/// The earliest date of the next request (seconds since 1970); none when it may be sent at any time.
 std::optional<double> nextRequestDate(const AccountRecord& record);
 
-/// Until when the guard holds up requests; none: it does not.
+/// The date until which the guard refuses requests (seconds since 1970); none when it does not.
 std::optional<double> requestsHeldUntil(const AccountRecord& record);
 
-/// Asks the guard; false, with error 99, while requests are held up. The one that would be too many starts
-/// that: it is logged, and the account waits for its generation interval.
+/// Asks the guard; false, with identity_error::kNotYet, while it refuses requests. The first request over the
+/// limit starts that: it is logged, and the date until which requests are refused is stored.
 bool admitCertificateRequest(const AccountRecord& record, ErrorOut error);
 
-/// Notes that a request is being sent.
+/// Counts a request that is being sent.
 void noteCertificateRequest(const String& accountName);
 
 }  // namespace veltoid

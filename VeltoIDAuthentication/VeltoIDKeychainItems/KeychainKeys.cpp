@@ -31,7 +31,7 @@ Accessibility accessibilityOf(const Key& key) {
     return key.isPrivate ? Accessibility::AfterFirstUnlock : Accessibility::Always;
 }
 
-/// Same key, so only what surrounds it can differ.
+/// The item holds the same key; its label, accessibility and access group may be outdated.
 KeychainStatus updateItem(const Data& reference, const Key& key, const std::string& label) {
     const auto bytes = key.encoded.bytes();
     return platform::keychain::update(keychain_items::queryForReference(KeychainItemClass::Key, reference),
@@ -39,7 +39,8 @@ KeychainStatus updateItem(const Data& reference, const Key& key, const std::stri
                                        accessibilityOf(key), label, kKeychainAccessGroup});
 }
 
-/// A duplicate that the search did not show makes room once.
+/// Adds the item. If the keychain reports a duplicate that the search did not find, that one is removed and
+/// the addition tried once more.
 Data addItem(const Key& key, const std::string& label) {
     KeychainAttributes attributes = identityOf(key);
     attributes.label = label;
@@ -63,7 +64,7 @@ Data addOrUpdate(const Key& key, const std::string& label) {
         status = updateItem(found, key, label);
         if (status == platform::kKeychainSuccess) return found;
         if (keychain_items::mayPass(status)) return {};
-        // Damaged: the key at hand replaces it.
+        // The item is damaged; it is added again below.
         platform::keychain::remove({identityOf(key), {}});
     }
     if (!found && status != platform::kKeychainItemNotFound) return {};

@@ -9,20 +9,20 @@
 
 namespace veltoid {
 
-/// A private or public key; without encoding it is none at all. Keys of one class are equal when their public
-/// parts are.
+/// A private or public key; false when the encoding is null. Keys of one class are equal when their public
+/// parts are equal.
 struct Key {
     bool isPrivate = false;
     /// PKCS#8 or SubjectPublicKeyInfo (DER).
     Data encoded;
-    /// SubjectPublicKeyInfo of either.
+    /// The SubjectPublicKeyInfo, also of a private key.
     Data publicPart;
 
     static Key privateKey(platform::Bytes pkcs8);
     static Key publicKey(platform::Bytes publicKeyInfo);
 
     explicit operator bool() const { return static_cast<bool>(encoded); }
-    /// For log lines: nothing of a private part.
+    /// For log lines; contains nothing of the private part.
     Value description() const;
 
     friend bool operator==(const Key& a, const Key& b) {
