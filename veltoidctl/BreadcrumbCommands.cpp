@@ -5,7 +5,7 @@
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
 #include "veltoidctl/AgentRequest.h"
-#include "veltoidctl/Commands.h"
+#include "veltoidctl/ClientCommands.h"
 #include "veltoidctl/Files.h"
 #include "veltoidctl/JsonBuilder.h"
 #include "veltoidctl/Printing.h"

@@ -9,7 +9,7 @@
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/CertificateExport.h"
 #include "veltoidctl/ClientCertificate.h"
-#include "veltoidctl/Commands.h"
+#include "veltoidctl/ClientCommands.h"
 #include "veltoidctl/Files.h"
 #include "veltoidctl/JsonBuilder.h"
 #include "veltoidctl/Printing.h"

@@ -5,7 +5,7 @@
 #include <variant>
 
 #include "Protocol/Names.h"
-#include "veltoidctl/Commands.h"
+#include "veltoidctl/ClientCommands.h"
 
 namespace veltoidctl {
 

@@ -7,7 +7,7 @@
 #include "Protocol/MessageKeys.h"
 #include "Protocol/Names.h"
 #include "veltoidctl/AgentRequest.h"
-#include "veltoidctl/Commands.h"
+#include "veltoidctl/ClientCommands.h"
 #include "veltoidctl/Printing.h"
 
 namespace veltoidctl {

@@ -4,7 +4,7 @@
 #include <string_view>
 #include <utility>
 
-#include "Platform/encoding/Base64.h"
+#include "Platform/encoding/Base64Codec.h"
 #include "Platform/encoding/CalendarText.h"
 #include "Platform/propertylist/PropertyList.h"
 #include "Platform/propertylist/PropertyListShape.h"

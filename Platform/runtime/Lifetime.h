@@ -20,7 +20,7 @@
 #include <mutex>
 #include <vector>
 
-#include "Platform/runtime/Product.h"
+#include "Platform/runtime/ProductNames.h"
 
 namespace platform {
 

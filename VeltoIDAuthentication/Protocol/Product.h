@@ -1,7 +1,7 @@
 // This product's names, as the platform takes them.
 #pragma once
 
-#include "Platform/runtime/Product.h"
+#include "Platform/runtime/ProductNames.h"
 #include "Protocol/Names.h"
 
 namespace veltoid {

@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "Platform/encoding/Base64.h"
+#include "Platform/encoding/Base64Codec.h"
 
 namespace veltoid {
 namespace {

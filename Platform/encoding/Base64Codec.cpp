@@ -1,4 +1,4 @@
-#include "Platform/encoding/Base64.h"
+#include "Platform/encoding/Base64Codec.h"
 
 #include <algorithm>
 #include <array>

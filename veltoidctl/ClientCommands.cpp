@@ -1,13 +1,13 @@
-#include "Protocol/Commands.h"
+#include "veltoidctl/ClientCommands.h"
 
 #include <iostream>
 
+#include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "veltoidctl/AgentRequest.h"
 #include "veltoidctl/ClientCertificate.h"
-#include "veltoidctl/Commands.h"
 #include "veltoidctl/Printing.h"
 
 namespace veltoidctl {
