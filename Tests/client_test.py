@@ -189,8 +189,9 @@ class CommandLine(unittest.TestCase):
         self.run_table([(["keychain", "remove-passphrase"], "", 0, "no passphrase"), readable])
 
     def test_an_agent_that_waits_for_the_passphrase_is_told(self):
-        self.add_account()
+        # Locked at once after it was added, the account has no certificate yet.
         self.set_passphrase("open")
+        self.add_account()
         self.run_table([(["keychain", "lock"], "", 0, "")])
         self.world.end_agent_of_the_bus()
         with self.world.client() as client:
