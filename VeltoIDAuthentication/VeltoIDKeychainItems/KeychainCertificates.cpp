@@ -49,7 +49,7 @@ Data addItem(const Certificate& certificate, const String& label) {
 
 /// The reference of the certificate's item; null when the keychain refuses.
 Data addOrUpdate(const Certificate& certificate, const String& label) {
-    if (const Data found = keychain_items::copyReference(identityOf(certificate))) {
+    if (Data found = keychain_items::copyReference(identityOf(certificate))) {
         if (updateItem(found, certificate, label)) return found;
         platform::keychain::remove({identityOf(certificate), {}});
     }

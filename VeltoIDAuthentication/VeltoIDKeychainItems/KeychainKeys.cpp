@@ -59,7 +59,7 @@ Data addItem(const Key& key, const std::string& label) {
 /// The reference of the key's item; null when the keychain refuses.
 Data addOrUpdate(const Key& key, const std::string& label) {
     KeychainStatus status = platform::kKeychainSuccess;
-    const Data found = keychain_items::copyReference(identityOf(key), &status);
+    Data found = keychain_items::copyReference(identityOf(key), &status);
     if (found) {
         status = updateItem(found, key, label);
         if (status == platform::kKeychainSuccess) return found;
