@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <exception>
 #include <functional>
-#include <span>
 #include <string>
 #include <utility>
 
@@ -61,14 +60,19 @@ struct Row {
     ItemIdentity identity;
 };
 
-using Work = std::function<KeychainStatus(SQLiteTransaction&)>;
+using Work = std::function<void(SQLiteTransaction&)>;
 
-/// Runs the work as a transaction that counts only when it succeeds.
+/// Runs the work as a transaction that counts only when there is no Failure.
 KeychainStatus perform(Outcome (SQLiteFile::*kind)(const SQLiteFile::Work&), const Work& work) {
     try {
-        KeychainStatus status = kKeychainNotAvailable;
+        KeychainStatus status = kKeychainSuccess;
         const Outcome outcome = (file().*kind)([&](SQLiteTransaction& transaction) {
-            status = work(transaction);
+            status = kKeychainSuccess;
+            try {
+                work(transaction);
+            } catch (const Failure& failure) {
+                status = failure.status;
+            }
             return status == kKeychainSuccess;
         });
         if (outcome == Outcome::Duplicate) return kKeychainDuplicateItem;
@@ -128,84 +132,78 @@ std::vector<Row> find(SQLiteTransaction& transaction, const KeychainQuery& query
     return rows;
 }
 
-KeychainStatus unsealRow(SQLiteTransaction& transaction, const Row& row, SecretBytes& value) {
-    auto statement = transaction.prepare("SELECT sealed FROM items WHERE sequence = ?");
-    if (!statement.bind(row.sequence).step()) return kKeychainNotAvailable;
-    return unsealItem(transaction, row.identity, statement.blob(0), value);
+std::vector<Row> findSome(SQLiteTransaction& transaction, const KeychainQuery& query) {
+    std::vector<Row> rows = find(transaction, query);
+    if (rows.empty()) throw Failure{kKeychainItemNotFound};
+    return rows;
 }
 
-KeychainStatus insert(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed) {
+SecretBytes unsealRow(SQLiteTransaction& transaction, const Row& row) {
+    auto statement = transaction.prepare("SELECT sealed FROM items WHERE sequence = ?");
+    if (!statement.bind(row.sequence).step()) throw Failure{kKeychainNotAvailable};
+    return unsealItem(transaction, row.identity, statement.blob(0));
+}
+
+void insert(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes value) {
+    const SecretBytes sealed = sealItem(transaction, identity, value);
     auto statement = transaction.prepare(
         "INSERT INTO items (id, class, account, service, label, description, access_group, key_class,"
         " application_value, accessibility, sealed) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?, ?, ?)");
     statement.bind(identity.id, static_cast<int>(identity.attributes.itemClass));
     for (const auto text : kKeychainTexts) statement.bind(identity.attributes.*text);
     statement.bind(static_cast<int>(identity.accessibility), sealed).run();
-    return kKeychainSuccess;
 }
 
 /// Seals anew, since the attributes are part of the seal.
-KeychainStatus change(SQLiteTransaction& transaction, Row row, const Changes& changes) {
-    SecretBytes value;
-    KeychainStatus status = unsealRow(transaction, row, value);
-    if (status != kKeychainSuccess) return status;
+void change(SQLiteTransaction& transaction, Row row, const Changes& changes) {
+    SecretBytes value = unsealRow(transaction, row);
     if (changes.data) value = *changes.data;
     if (changes.accessibility) row.identity.accessibility = *changes.accessibility;
     if (changes.label) row.identity.attributes.label = changes.label;
     if (changes.accessGroup) row.identity.attributes.accessGroup = changes.accessGroup;
-    SecretBytes sealed;
-    status = sealItem(transaction, row.identity, value, sealed);
-    if (status != kKeychainSuccess) return status;
+    const SecretBytes sealed = sealItem(transaction, row.identity, value);
     transaction
         .prepare(
             "UPDATE items SET label = ?, access_group = ?, accessibility = ?, sealed = ? WHERE sequence = ?")
         .bind(row.identity.attributes.label, row.identity.attributes.accessGroup,
               static_cast<int>(row.identity.accessibility), sealed, row.sequence)
         .run();
-    return kKeychainSuccess;
 }
 
 using OpenedItems = std::vector<std::pair<Row, SecretBytes>>;
 
 /// The items that are not always accessible. One that does not unseal stays as it is.
-KeychainStatus openAll(SQLiteTransaction& transaction, OpenedItems& items) {
+OpenedItems openAll(SQLiteTransaction& transaction) {
+    OpenedItems items;
     for (const auto itemClass :
          {KeychainItemClass::GenericPassword, KeychainItemClass::Key, KeychainItemClass::Certificate}) {
         KeychainQuery query;
         query.attributes.itemClass = itemClass;
-        for (Row& row : find(transaction, query)) {
+        for (const Row& row : find(transaction, query)) {
             if (row.identity.accessibility == Accessibility::Always) continue;
-            SecretBytes value;
-            const KeychainStatus status = unsealRow(transaction, row, value);
-            if (status == kKeychainItemCorrupt) continue;
-            if (status != kKeychainSuccess) return status;
-            items.emplace_back(std::move(row), std::move(value));
+            try {
+                items.emplace_back(row, unsealRow(transaction, row));
+            } catch (const Failure& failure) {
+                if (failure.status != kKeychainItemCorrupt) throw;
+            }
         }
     }
-    return kKeychainSuccess;
-}
-
-KeychainStatus sealAll(SQLiteTransaction& transaction, const OpenedItems& items) {
-    for (const auto& [row, value] : items) {
-        SecretBytes sealed;
-        const KeychainStatus status = sealItem(transaction, row.identity, value, sealed);
-        if (status != kKeychainSuccess) return status;
-        transaction.prepare("UPDATE items SET sealed = ? WHERE sequence = ?")
-            .bind(sealed, row.sequence)
-            .run();
-    }
-    return kKeychainSuccess;
+    return items;
 }
 
 /// An earlier copy of the file, together with what opened it, must not open anything of this one.
 KeychainStatus replaceClassKey(const Work& replace) {
     std::string keptBefore;
     const KeychainStatus status = changeItems([&](SQLiteTransaction& transaction) {
-        OpenedItems items;
         keptBefore = keptKeyName(transaction);
-        KeychainStatus step = openAll(transaction, items);
-        if (step == kKeychainSuccess) step = replace(transaction);
-        return step == kKeychainSuccess ? sealAll(transaction, items) : step;
+        const OpenedItems items = openAll(transaction);
+        replace(transaction);
+        for (const auto& [row, value] : items) {
+            const SecretBytes sealed = sealItem(transaction, row.identity, value);
+            transaction.prepare("UPDATE items SET sealed = ? WHERE sequence = ?")
+                .bind(sealed, row.sequence)
+                .run();
+        }
     });
     if (status == kKeychainSuccess && !keptBefore.empty()) (void)kernel_keyring::remove(keptBefore);
     return status;
@@ -224,8 +222,7 @@ KeychainStatus copyMatchingReferences(const KeychainQuery& query,
     std::vector<PersistentReference> found;
     const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
         found.clear();
-        for (Row& row : find(transaction, query)) found.push_back(std::move(row.identity.id));
-        return found.empty() ? kKeychainItemNotFound : kKeychainSuccess;
+        for (Row& row : findSome(transaction, query)) found.push_back(std::move(row.identity.id));
     });
     if (status == kKeychainSuccess && references != nullptr) *references = std::move(found);
     return status;
@@ -234,8 +231,7 @@ KeychainStatus copyMatchingReferences(const KeychainQuery& query,
 KeychainStatus copyMatchingData(const KeychainQuery& query, SecretBytes* data) {
     SecretBytes value;
     const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
-        const auto rows = find(transaction, query);
-        return rows.empty() ? kKeychainItemNotFound : unsealRow(transaction, rows.front(), value);
+        value = unsealRow(transaction, findSome(transaction, query).front());
     });
     if (status == kKeychainSuccess && data != nullptr) *data = std::move(value);
     return status;
@@ -246,11 +242,8 @@ KeychainStatus add(const KeychainAttributes& attributes, Accessibility accessibi
     if (tooLong(data)) return kKeychainNotAvailable;
     ItemIdentity identity{PersistentReference(kReferenceBytes), attributes, accessibility};
     fillRandom(identity.id);
-    const KeychainStatus status = changeItems([&](SQLiteTransaction& transaction) {
-        SecretBytes sealed;
-        const KeychainStatus sealing = sealItem(transaction, identity, data, sealed);
-        return sealing == kKeychainSuccess ? insert(transaction, identity, sealed) : sealing;
-    });
+    const KeychainStatus status =
+        changeItems([&](SQLiteTransaction& transaction) { insert(transaction, identity, data); });
     if (status == kKeychainSuccess && reference != nullptr) *reference = std::move(identity.id);
     return status;
 }
@@ -258,32 +251,21 @@ KeychainStatus add(const KeychainAttributes& attributes, Accessibility accessibi
 KeychainStatus update(const KeychainQuery& query, const Changes& changes) {
     if (changes.data && tooLong(*changes.data)) return kKeychainNotAvailable;
     return changeItems([&](SQLiteTransaction& transaction) {
-        const auto rows = find(transaction, query);
-        KeychainStatus status = rows.empty() ? kKeychainItemNotFound : kKeychainSuccess;
-        for (const Row& row : rows) {
-            if (status == kKeychainSuccess) status = change(transaction, row, changes);
-        }
-        return status;
+        for (const Row& row : findSome(transaction, query)) change(transaction, row, changes);
     });
 }
 
 KeychainStatus remove(const KeychainQuery& query) {
     return changeItems([&](SQLiteTransaction& transaction) {
-        const auto rows = find(transaction, query);
-        for (const Row& row : rows) {
+        for (const Row& row : findSome(transaction, query))
             transaction.prepare("DELETE FROM items WHERE sequence = ?").bind(row.sequence).run();
-        }
-        return rows.empty() ? kKeychainItemNotFound : kKeychainSuccess;
     });
 }
 
 std::optional<Accessibility> accessibilityOf(const KeychainQuery& query) {
     std::optional<Accessibility> accessibility;
     const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
-        const auto rows = find(transaction, query);
-        if (rows.empty()) return kKeychainItemNotFound;
-        accessibility = rows.front().identity.accessibility;
-        return kKeychainSuccess;
+        accessibility = findSome(transaction, query).front().identity.accessibility;
     });
     return status == kKeychainSuccess ? accessibility : std::nullopt;
 }
@@ -291,28 +273,25 @@ std::optional<Accessibility> accessibilityOf(const KeychainQuery& query) {
 std::optional<Protection> protection() {
     Protection result = Protection::NoPassphrase;
     const KeychainStatus status =
-        readItems([&](SQLiteTransaction& transaction) { return readProtection(transaction, result); });
+        readItems([&](SQLiteTransaction& transaction) { result = readProtection(transaction); });
     return status == kKeychainSuccess ? std::optional(result) : std::nullopt;
 }
 
 KeychainStatus setPassphrase(Bytes passphrase) {
     return replaceClassKey(
-        [&](SQLiteTransaction& transaction) { return replaceByPassphrase(transaction, passphrase); });
+        [&](SQLiteTransaction& transaction) { replaceByPassphrase(transaction, passphrase); });
 }
 
 KeychainStatus removePassphrase() { return replaceClassKey(replaceByDeviceKey); }
 
 KeychainStatus unlock(Bytes passphrase) {
-    return readItems(
-        [&](SQLiteTransaction& transaction) { return unlockByPassphrase(transaction, passphrase); });
+    return readItems([&](SQLiteTransaction& transaction) { unlockByPassphrase(transaction, passphrase); });
 }
 
 KeychainStatus lock() {
     std::string kept;
-    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
-        kept = keptKeyName(transaction);
-        return kKeychainSuccess;
-    });
+    const KeychainStatus status =
+        readItems([&](SQLiteTransaction& transaction) { kept = keptKeyName(transaction); });
     if (status != kKeychainSuccess) return status;
     return kept.empty() || kernel_keyring::remove(kept) ? kKeychainSuccess : kKeychainNotAvailable;
 }

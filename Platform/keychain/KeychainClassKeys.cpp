@@ -30,19 +30,24 @@ struct Row {
     SecretBytes wrapped;
 };
 
-/// None when there is none; a failure shows in the transaction.
+/// What could not be read is not missing.
+void requireSound(const SQLiteTransaction& transaction) {
+    if (transaction.failed()) throw Failure{kKeychainNotAvailable};
+}
+
 std::optional<Row> rowOf(SQLiteTransaction& transaction, ClassKey which) {
     auto statement = transaction.prepare("SELECT wrapping, wrapped FROM class_keys WHERE class = ?");
-    if (!statement.bind(static_cast<int>(which)).step()) return std::nullopt;
+    const bool found = statement.bind(static_cast<int>(which)).step();
+    requireSound(transaction);
+    if (!found) return std::nullopt;
     const Bytes wrapped = statement.blob(1);
     return Row{static_cast<Wrapping>(statement.integer(0)), {wrapped.begin(), wrapped.end()}};
 }
 
-KeychainStatus store(SQLiteTransaction& transaction, ClassKey which, Wrapping wrapping, Bytes wrapped) {
+void store(SQLiteTransaction& transaction, ClassKey which, Wrapping wrapping, Bytes wrapped) {
     transaction.prepare("INSERT OR REPLACE INTO class_keys (class, wrapping, wrapped) VALUES (?, ?, ?)")
         .bind(static_cast<int>(which), static_cast<int64_t>(wrapping), wrapped)
         .run();
-    return transaction.failed() ? kKeychainNotAvailable : kKeychainSuccess;
 }
 
 std::vector<uint8_t> wrappingContext(ClassKey which) {
@@ -52,37 +57,34 @@ std::vector<uint8_t> wrappingContext(ClassKey which) {
     return context;
 }
 
-KeychainStatus unusable(SQLiteTransaction& transaction, ClassKey which, const char* why) {
+[[noreturn]] void refuse(const SQLiteTransaction& transaction, ClassKey which, const char* why) {
     VELTOID_PLATFORM_LOG(Error, "keychain class key " + std::to_string(static_cast<int>(which)) + " of " +
                                     transaction.directory() + " " + why);
-    return kKeychainNotAvailable;
+    throw Failure{kKeychainNotAvailable};
 }
 
 // --- Under the device key
 
+SecretBytes neededDeviceKey(const SQLiteTransaction& transaction, bool mayCreate) {
+    auto key = deviceKey(transaction.directory(), mayCreate);
+    if (!key) throw Failure{kKeychainNotAvailable};
+    return std::move(*key);
+}
+
 /// With class keys in the table a missing device key is lost, not yet to be made: another one would not open
 /// them.
-std::optional<SecretBytes> deviceKeyToWrapWith(SQLiteTransaction& transaction) {
+void storeUnderDeviceKey(SQLiteTransaction& transaction, ClassKey which, Bytes key) {
     const bool first = !transaction.prepare("SELECT 1 FROM class_keys").step();
-    if (transaction.failed()) return std::nullopt;
-    return deviceKey(transaction.directory(), first);
+    requireSound(transaction);
+    const SecretBytes device = neededDeviceKey(transaction, first);
+    store(transaction, which, Wrapping::DeviceKey, seal(device, wrappingContext(which), key));
 }
 
-KeychainStatus storeUnderDeviceKey(SQLiteTransaction& transaction, ClassKey which, Bytes key) {
-    const auto device = deviceKeyToWrapWith(transaction);
-    if (!device) return kKeychainNotAvailable;
-    return store(transaction, which, Wrapping::DeviceKey, seal(*device, wrappingContext(which), key));
-}
-
-KeychainStatus openWithDeviceKey(SQLiteTransaction& transaction, ClassKey which, Bytes wrapped,
-                                 SecretBytes& key) {
-    const auto device = deviceKey(transaction.directory(), false);
-    if (!device) return kKeychainNotAvailable;
-    auto unwrapped = unseal(*device, wrappingContext(which), wrapped);
-    if (!unwrapped || unwrapped->size() != kSealingKeyBytes)
-        return unusable(transaction, which, "does not open with the device key");
-    key = std::move(*unwrapped);
-    return kKeychainSuccess;
+SecretBytes openWithDeviceKey(const SQLiteTransaction& transaction, ClassKey which, Bytes wrapped) {
+    auto key = unseal(neededDeviceKey(transaction, false), wrappingContext(which), wrapped);
+    if (!key || key->size() != kSealingKeyBytes)
+        refuse(transaction, which, "does not open with the device key");
+    return std::move(*key);
 }
 
 // --- Under a passphrase
@@ -115,55 +117,49 @@ std::optional<SecretBytes> openWith(Bytes derivedKey, ClassKey which, Bytes wrap
     return key && key->size() == kSealingKeyBytes ? std::move(key) : std::nullopt;
 }
 
-KeychainStatus openWithKeyring(SQLiteTransaction& transaction, ClassKey which, Bytes wrapped,
-                               SecretBytes& key) {
-    if (!isWellFormed(wrapped)) return unusable(transaction, which, "is damaged");
+SecretBytes openWithKeyring(const SQLiteTransaction& transaction, ClassKey which, Bytes wrapped) {
+    if (!isWellFormed(wrapped)) refuse(transaction, which, "is damaged");
     const auto kept = kernel_keyring::find(keyringName(wrapped));
-    auto opened = kept && kept->size() == kSealingKeyBytes ? openWith(*kept, which, wrapped) : std::nullopt;
-    if (!opened) return kKeychainLocked;
-    key = std::move(*opened);
-    return kKeychainSuccess;
+    auto key = kept && kept->size() == kSealingKeyBytes ? openWith(*kept, which, wrapped) : std::nullopt;
+    if (!key) throw Failure{kKeychainLocked};
+    return std::move(*key);
 }
 
 }  // namespace
 
-KeychainStatus readClassKey(SQLiteTransaction& transaction, ClassKey which, bool& found, SecretBytes& key) {
+std::optional<SecretBytes> readClassKey(SQLiteTransaction& transaction, ClassKey which) {
     const auto row = rowOf(transaction, which);
-    found = row.has_value();
-    if (!found) return transaction.failed() ? kKeychainNotAvailable : kKeychainSuccess;
+    if (!row) return std::nullopt;
     switch (row->wrapping) {
         case Wrapping::DeviceKey:
-            return openWithDeviceKey(transaction, which, row->wrapped, key);
+            return openWithDeviceKey(transaction, which, row->wrapped);
         case Wrapping::Passphrase:
-            return openWithKeyring(transaction, which, row->wrapped, key);
+            return openWithKeyring(transaction, which, row->wrapped);
     }
-    return unusable(transaction, which, "is wrapped in a way that is not known");
+    refuse(transaction, which, "is wrapped in a way that is not known");
 }
 
-KeychainStatus classKey(SQLiteTransaction& transaction, ClassKey which, SecretBytes& key) {
-    bool found = false;
-    const KeychainStatus status = readClassKey(transaction, which, found, key);
-    if (status != kKeychainSuccess || found) return status;
-    key.resize(kSealingKeyBytes);
+SecretBytes classKey(SQLiteTransaction& transaction, ClassKey which) {
+    if (auto known = readClassKey(transaction, which)) return std::move(*known);
+    SecretBytes key(kSealingKeyBytes);
     fillRandom(key);
-    return storeUnderDeviceKey(transaction, which, key);
+    storeUnderDeviceKey(transaction, which, key);
+    return key;
 }
 
-KeychainStatus readProtection(SQLiteTransaction& transaction, Protection& protection) {
-    bool found = false;
-    SecretBytes key;
-    const KeychainStatus status = readClassKey(transaction, ClassKey::AfterFirstUnlock, found, key);
-    protection = status == kKeychainLocked          ? Protection::Locked
-                 : keptKeyName(transaction).empty() ? Protection::NoPassphrase
-                                                    : Protection::Unlocked;
-    return status == kKeychainLocked ? kKeychainSuccess : status;
+Protection readProtection(SQLiteTransaction& transaction) {
+    try {
+        (void)readClassKey(transaction, ClassKey::AfterFirstUnlock);
+    } catch (const Failure& failure) {
+        if (failure.status == kKeychainLocked) return Protection::Locked;
+        throw;
+    }
+    return keptKeyName(transaction).empty() ? Protection::NoPassphrase : Protection::Unlocked;
 }
 
-KeychainStatus replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
+void replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
     constexpr ClassKey kWhich = ClassKey::AfterFirstUnlock;
-    SecretBytes key;
-    if (const KeychainStatus status = classKey(transaction, kWhich, key); status != kKeychainSuccess)
-        return status;
+    SecretBytes key = classKey(transaction, kWhich);
     fillRandom(key);
     const ScryptCost cost;
     SecretBytes wrapped = {kPassphraseVersion, cost.logN, cost.blockSize, cost.parallelism};
@@ -171,18 +167,17 @@ KeychainStatus replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphr
     fillRandom(std::span(wrapped).subspan(kSaltAt));
     const auto derived = derive(passphrase, wrapped);
     // Without a keyring it could never be unlocked.
-    if (!derived || !kernel_keyring::store(keyringName(wrapped), *derived)) return kKeychainNotAvailable;
+    if (!derived || !kernel_keyring::store(keyringName(wrapped), *derived))
+        throw Failure{kKeychainNotAvailable};
     const SecretBytes sealed = seal(*derived, passphraseContext(kWhich, wrapped), key);
     wrapped.insert(wrapped.end(), sealed.begin(), sealed.end());
-    return store(transaction, kWhich, Wrapping::Passphrase, wrapped);
+    store(transaction, kWhich, Wrapping::Passphrase, wrapped);
 }
 
-KeychainStatus replaceByDeviceKey(SQLiteTransaction& transaction) {
-    SecretBytes key;
-    const KeychainStatus status = classKey(transaction, ClassKey::AfterFirstUnlock, key);
-    if (status != kKeychainSuccess) return status;
+void replaceByDeviceKey(SQLiteTransaction& transaction) {
+    SecretBytes key = classKey(transaction, ClassKey::AfterFirstUnlock);
     fillRandom(key);
-    return storeUnderDeviceKey(transaction, ClassKey::AfterFirstUnlock, key);
+    storeUnderDeviceKey(transaction, ClassKey::AfterFirstUnlock, key);
 }
 
 std::string keptKeyName(SQLiteTransaction& transaction) {
@@ -192,17 +187,15 @@ std::string keptKeyName(SQLiteTransaction& transaction) {
                : std::string();
 }
 
-KeychainStatus unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
+void unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphrase) {
     constexpr ClassKey kWhich = ClassKey::AfterFirstUnlock;
     const auto row = rowOf(transaction, kWhich);
-    if (transaction.failed()) return kKeychainNotAvailable;
-    if (!row || row->wrapping != Wrapping::Passphrase) return kKeychainSuccess;
-    if (!isWellFormed(row->wrapped)) return unusable(transaction, kWhich, "is damaged");
+    if (!row || row->wrapping != Wrapping::Passphrase) return;
+    if (!isWellFormed(row->wrapped)) refuse(transaction, kWhich, "is damaged");
     const auto derived = derive(passphrase, row->wrapped);
-    if (!derived) return unusable(transaction, kWhich, "takes more memory than there is to open");
-    if (!openWith(*derived, kWhich, row->wrapped)) return kKeychainWrongPassphrase;
-    return kernel_keyring::store(keyringName(row->wrapped), *derived) ? kKeychainSuccess
-                                                                      : kKeychainNotAvailable;
+    if (!derived) refuse(transaction, kWhich, "takes more memory than there is to open");
+    if (!openWith(*derived, kWhich, row->wrapped)) throw Failure{kKeychainWrongPassphrase};
+    if (!kernel_keyring::store(keyringName(row->wrapped), *derived)) throw Failure{kKeychainNotAvailable};
 }
 
 }  // namespace platform::keychain

@@ -2,9 +2,10 @@
 // keychain.
 //
 // Nothing is cached: a key is in memory only while an operation uses it, and a replaced file or row counts at
-// once. All operations are part of a transaction of the keychain's file.
+// once. All operations are part of a transaction of the keychain's file, which a Failure ends.
 #pragma once
 
+#include <optional>
 #include <string>
 
 #include "Platform/keychain/KeychainItem.h"
@@ -21,25 +22,30 @@ inline constexpr const char* kClassKeysSchema =
     "  wrapped BLOB NOT NULL"
     ");";
 
+/// Thrown by what works inside a transaction; the operation of the keychain answers with the status.
+struct Failure {
+    KeychainStatus status;
+};
+
 /// The values are stored: they do not change.
 enum class ClassKey : int { Always = 1, AfterFirstUnlock = 2 };
 
-/// Reads and unwraps a class key; `found` tells whether there is one.
-KeychainStatus readClassKey(SQLiteTransaction& transaction, ClassKey which, bool& found, SecretBytes& key);
+/// Reads and unwraps a class key; none when there is none yet.
+std::optional<SecretBytes> readClassKey(SQLiteTransaction& transaction, ClassKey which);
 
 /// The same; it is made when there is none.
-KeychainStatus classKey(SQLiteTransaction& transaction, ClassKey which, SecretBytes& key);
+SecretBytes classKey(SQLiteTransaction& transaction, ClassKey which);
 
 // --- The key of the class "after first unlock"; see Keychain.h
 
-KeychainStatus readProtection(SQLiteTransaction& transaction, Protection& protection);
+Protection readProtection(SQLiteTransaction& transaction);
 
 /// A new key takes the place of the one that there is, which has to be at hand: what it has sealed has to be
 /// read before, and sealed again after it.
-KeychainStatus replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
-KeychainStatus replaceByDeviceKey(SQLiteTransaction& transaction);
+void replaceByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
+void replaceByDeviceKey(SQLiteTransaction& transaction);
 
-KeychainStatus unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
+void unlockByPassphrase(SQLiteTransaction& transaction, Bytes passphrase);
 
 /// What the kernel keeps the passphrase's key by while the keychain is unlocked; empty without a passphrase.
 std::string keptKeyName(SQLiteTransaction& transaction);

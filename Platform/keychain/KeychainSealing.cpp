@@ -35,28 +35,17 @@ std::vector<uint8_t> encodeIdentity(const ItemIdentity& identity) {
     return output;
 }
 
-KeychainStatus sealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes value,
-                        SecretBytes& sealed) {
-    SecretBytes key;
-    const KeychainStatus status = classKey(transaction, classKeyOf(identity.accessibility), key);
-    if (status == kKeychainSuccess) sealed = seal(key, encodeIdentity(identity), value);
-    return status;
+SecretBytes sealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes value) {
+    return seal(classKey(transaction, classKeyOf(identity.accessibility)), encodeIdentity(identity), value);
 }
 
-KeychainStatus unsealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed,
-                          SecretBytes& value) {
-    SecretBytes key;
-    bool found = false;
-    const KeychainStatus status = readClassKey(transaction, classKeyOf(identity.accessibility), found, key);
-    if (status != kKeychainSuccess) return status;
-    auto plain = found ? unseal(key, encodeIdentity(identity), sealed) : std::nullopt;
-    if (!plain) {
-        VELTOID_PLATFORM_LOG(Error, "keychain item " + hexText(identity.id) +
-                                        " does not unseal: it is damaged or was changed from outside");
-        return kKeychainItemCorrupt;
-    }
-    value = std::move(*plain);
-    return kKeychainSuccess;
+SecretBytes unsealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed) {
+    const auto key = readClassKey(transaction, classKeyOf(identity.accessibility));
+    auto value = key ? unseal(*key, encodeIdentity(identity), sealed) : std::nullopt;
+    if (value) return std::move(*value);
+    VELTOID_PLATFORM_LOG(Error, "keychain item " + hexText(identity.id) +
+                                    " does not unseal: it is damaged or was changed from outside");
+    throw Failure{kKeychainItemCorrupt};
 }
 
 }  // namespace platform::keychain

@@ -1,10 +1,8 @@
 // How the keychain's values are kept secret: each is sealed under its class key, together with all that the
-// item is known by. Internal to the keychain.
+// item is known by. Internal to the keychain; failures are thrown (KeychainClassKeys.h).
 #pragma once
 
 #include <cstdint>
-#include <optional>
-#include <string>
 
 #include "Platform/keychain/KeychainItem.h"
 #include "Platform/storage/SQLiteFile.h"
@@ -22,11 +20,9 @@ struct ItemIdentity {
 std::vector<uint8_t> encodeIdentity(const ItemIdentity& identity);
 
 /// Seals the value under the class key of the item's accessibility, which is created when there is none yet.
-KeychainStatus sealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes value,
-                        SecretBytes& sealed);
+SecretBytes sealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes value);
 
 /// Corrupt, with a log line that names the item's id, when the value was not sealed for this identity.
-KeychainStatus unsealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed,
-                          SecretBytes& value);
+SecretBytes unsealItem(SQLiteTransaction& transaction, const ItemIdentity& identity, Bytes sealed);
 
 }  // namespace platform::keychain
