@@ -7,17 +7,12 @@
 namespace veltoid {
 namespace detail {
 
-struct ArrayNode : Counted {
+struct ArrayNode final : Node {
     std::vector<Value> elements;
 };
 
-template <>
-void destroy<ArrayNode>(Counted* counted) noexcept {
-    delete static_cast<ArrayNode*>(counted);
-}
-
 /// Entries in insertion order, with an open-addressing index beside them once a scan would cost more.
-struct DictionaryNode : Counted {
+struct DictionaryNode final : Node {
     static constexpr size_t kScanLimit = 8;
     static constexpr uint32_t kFree = 0;
     static constexpr size_t kNotFound = std::numeric_limits<size_t>::max();
@@ -78,22 +73,17 @@ struct DictionaryNode : Counted {
     }
 };
 
-template <>
-void destroy<DictionaryNode>(Counted* counted) noexcept {
-    delete static_cast<DictionaryNode*>(counted);
-}
-
 namespace {
 
 /// Makes `handle` the only holder of its node, copying what `copy` names from a shared one.
-template <typename Node, typename Copy>
-Node& makeWritable(Handle<Node>& handle, Copy copy) {
+template <typename Kind, typename Copy>
+Kind& makeWritable(Handle<Kind>& handle, Copy copy) {
     if (!handle) {
-        handle = Handle<Node>(new Node);
+        handle = Handle<Kind>(new Kind);
     } else if (handle.isShared()) {
-        auto* fresh = new Node;
+        auto* fresh = new Kind;
         copy(*fresh, *handle.get());
-        handle = Handle<Node>(fresh);
+        handle = Handle<Kind>(fresh);
     }
     return *handle.get();
 }

@@ -2,7 +2,6 @@
 // them.
 #pragma once
 
-#include <string>
 #include <variant>
 #include <vector>
 

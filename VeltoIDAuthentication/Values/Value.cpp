@@ -15,24 +15,13 @@ BytesNode* BytesNode::create(size_t size) {
     return node;
 }
 
-template <>
-void destroy<BytesNode>(Counted* counted) noexcept {
-    auto* node = static_cast<BytesNode*>(counted);
-    platform::wipe(node->bytes(), node->size);
-    node->~BytesNode();
-    ::operator delete(node);
-}
+BytesNode::~BytesNode() { platform::wipe(bytes(), size); }
 
 struct URLText {
     String text;
     String base;
     friend bool operator==(const URLText&, const URLText&) = default;
 };
-
-template <>
-void destroy<BoxNode>(Counted* counted) noexcept {
-    delete static_cast<BoxNode*>(counted);
-}
 
 namespace {
 
@@ -101,36 +90,6 @@ Value Value::uuid(std::span<const uint8_t, 16> bytes) {
     std::array<uint8_t, 16> copy{};
     std::copy(bytes.begin(), bytes.end(), copy.begin());
     return boxed(Kind::UUID, copy);
-}
-
-/// What a value refers to is one pointer to something counted, whatever the kind: its bytes are copied, and
-/// the new reference is counted.
-Value::Value(const Value& other) noexcept : kind_(other.kind_), numberKind_(other.numberKind_) {
-    std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_), sizeof payload_);
-    if (kind_ < Kind::String) return;
-    detail::Counted* node = nullptr;
-    static_assert(sizeof payload_ == sizeof(void*));
-    std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof payload_);
-    if (node != nullptr) node->references.fetch_add(1, std::memory_order_relaxed);
-}
-
-void Value::releasePayload() noexcept {
-    switch (kind_) {
-        case Kind::String:
-            payload_.string.~String();
-            break;
-        case Kind::Data:
-            payload_.data.~Data();
-            break;
-        case Kind::Array:
-            payload_.array.~Array();
-            break;
-        case Kind::Dictionary:
-            payload_.dictionary.~Dictionary();
-            break;
-        default:
-            payload_.box.~Box();
-    }
 }
 
 String Value::asString() const { return kind_ == Kind::String ? payload_.string : veltoid::String(); }

@@ -13,14 +13,12 @@
 #include <cstdint>
 #include <cstring>
 #include <initializer_list>
-#include <memory>
 #include <new>
 #include <optional>
 #include <span>
 #include <string>
 #include <string_view>
 #include <utility>
-#include <variant>
 #include <vector>
 
 namespace veltoid {
@@ -31,16 +29,26 @@ struct SecurityObject;
 
 namespace detail {
 
-struct Counted {
+/// What handles share.
+struct Node {
     mutable std::atomic<uint32_t> references{1};
+
+    virtual ~Node() = default;
+    void retain() const noexcept { references.fetch_add(1, std::memory_order_relaxed); }
+    void release() const noexcept {
+        if (references.fetch_sub(1, std::memory_order_acq_rel) == 1) delete this;
+    }
 };
 
 /// Bytes in one allocation behind their header; wiped when freed.
-struct BytesNode : Counted {
+struct BytesNode final : Node {
     size_t size = 0;
+    ~BytesNode() override;
     uint8_t* bytes() { return reinterpret_cast<uint8_t*>(this + 1); }
     const uint8_t* bytes() const { return reinterpret_cast<const uint8_t*>(this + 1); }
     static BytesNode* create(size_t size);
+    /// Without the size, which is not the header's.
+    static void operator delete(void* memory) { ::operator delete(memory); }
 };
 
 struct ArrayNode;
@@ -48,8 +56,7 @@ struct DictionaryNode;
 
 /// Content behind one pointer. Its unit alone knows the type: what is not part of this header defines how it
 /// becomes a value itself.
-struct BoxNode : Counted {
-    virtual ~BoxNode() = default;
+struct BoxNode : Node {
     /// `other` holds content of the same type.
     virtual bool equals(const BoxNode& other) const = 0;
 };
@@ -63,47 +70,31 @@ struct Boxed final : BoxNode {
     const Content content;
 };
 
-/// Frees a node whose last reference has gone.
-template <typename Node>
-void destroy(Counted* node) noexcept;
-template <>
-void destroy<BytesNode>(Counted* node) noexcept;
-template <>
-void destroy<ArrayNode>(Counted* node) noexcept;
-template <>
-void destroy<DictionaryNode>(Counted* node) noexcept;
-template <>
-void destroy<BoxNode>(Counted* node) noexcept;
-
-/// Reference-counted pointer; the node type may be incomplete.
-template <typename Node>
+/// Reference-counted pointer; the kind of node may be incomplete.
+template <typename Kind>
 class Handle {
   public:
     Handle() = default;
-    explicit Handle(Counted* adopted) noexcept : node_(adopted) {}
-    Handle(const Handle& other) noexcept : node_(other.node_) { retain(); }
+    explicit Handle(Node* adopted) noexcept : node_(adopted) {}
+    Handle(const Handle& other) noexcept : node_(other.node_) {
+        if (node_ != nullptr) node_->retain();
+    }
     Handle(Handle&& other) noexcept : node_(std::exchange(other.node_, nullptr)) {}
     Handle& operator=(Handle other) noexcept {
         std::swap(node_, other.node_);
         return *this;
     }
-    ~Handle() { release(); }
+    ~Handle() {
+        if (node_ != nullptr) node_->release();
+    }
 
-    Node* get() const { return static_cast<Node*>(node_); }
-    Node* operator->() const { return get(); }
+    Kind* get() const { return static_cast<Kind*>(node_); }
+    Kind* operator->() const { return get(); }
     explicit operator bool() const { return node_ != nullptr; }
     bool isShared() const { return node_->references.load(std::memory_order_acquire) > 1; }
 
   private:
-    void retain() const noexcept {
-        if (node_ != nullptr) node_->references.fetch_add(1, std::memory_order_relaxed);
-    }
-    void release() noexcept {
-        if (node_ != nullptr && node_->references.fetch_sub(1, std::memory_order_acq_rel) == 1)
-            destroy<Node>(node_);
-    }
-
-    Counted* node_ = nullptr;
+    Node* node_ = nullptr;
 };
 
 }  // namespace detail
@@ -292,7 +283,10 @@ class Value {
     static Value uuid(std::span<const uint8_t, 16> bytes);
     static Value object(SecurityObject object);
 
-    Value(const Value& other) noexcept;
+    Value(const Value& other) noexcept {
+        copyBits(other);
+        if (const detail::Node* shared = node()) shared->retain();
+    }
     Value(Value&& other) noexcept { take(other); }
     Value& operator=(const Value& other) noexcept { return *this = Value(other); }
     Value& operator=(Value&& other) noexcept {
@@ -381,18 +375,28 @@ class Value {
 
     /// Every member is one word or a single counted pointer, so that the bytes can move without a count
     /// changing.
-    void take(Value& other) noexcept {
+    void copyBits(const Value& other) noexcept {
         kind_ = other.kind_;
         numberKind_ = other.numberKind_;
         std::memcpy(static_cast<void*>(&payload_), static_cast<const void*>(&other.payload_),
                     sizeof payload_);
+    }
+    void take(Value& other) noexcept {
+        copyBits(other);
         other.kind_ = Kind::Absent;
     }
     void reset() noexcept {
-        if (kind_ >= Kind::String) releasePayload();
+        if (const detail::Node* shared = node()) shared->release();
         kind_ = Kind::Absent;
     }
-    void releasePayload() noexcept;
+    /// What the value refers to, or null: whatever the kind, it is one pointer.
+    const detail::Node* node() const noexcept {
+        const detail::Node* node = nullptr;
+        static_assert(sizeof payload_ == sizeof node);
+        if (kind_ >= Kind::String)
+            std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof node);
+        return node;
+    }
 
     Kind kind_ = Kind::Absent;
     NumberKind numberKind_ = NumberKind::Int8;

@@ -73,16 +73,9 @@ void ValueBuilder::add(Value value) {
     }
 }
 
-void ValueBuilder::endArray() {
-    Array array = std::move(*open_.back().array);
+void ValueBuilder::endContainer(Value container) {
     open_.pop_back();
-    add(std::move(array));
-}
-
-void ValueBuilder::endDictionary() {
-    Dictionary dictionary = std::move(*open_.back().dictionary);
-    open_.pop_back();
-    add(std::move(dictionary));
+    add(std::move(container));
 }
 
 }  // namespace veltoid

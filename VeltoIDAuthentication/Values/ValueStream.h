@@ -26,10 +26,10 @@ class ValueBuilder : public platform::ValueSink {
     void uuid(std::span<const uint8_t, 16> bytes) override { add(Value::uuid(bytes)); }
     void fileDescriptor(int) override {}
     void beginArray() override { open_.push_back({Array(), {}, {}}); }
-    void endArray() override;
+    void endArray() override { endContainer(std::move(*open_.back().array)); }
     void beginDictionary() override { open_.push_back({{}, Dictionary(), {}}); }
     void key(std::string_view utf8) override { open_.back().key = String(utf8); }
-    void endDictionary() override;
+    void endDictionary() override { endContainer(std::move(*open_.back().dictionary)); }
 
     /// The value, once it is complete; absent before.
     const Value& value() const { return value_; }
@@ -41,6 +41,7 @@ class ValueBuilder : public platform::ValueSink {
         String key;
     };
     void add(Value value);
+    void endContainer(Value container);
 
     std::vector<Level> open_;
     Value value_;
