@@ -1,15 +1,19 @@
 #include "veltoidctl/CertificateExport.h"
 
-#include <openssl/err.h>
 #include <openssl/pkcs12.h>
 #include <openssl/x509.h>
 
 #include <memory>
 #include <stdexcept>
 
+#include "Platform/crypto/KeyPair.h"
+#include "Platform/crypto/OpenSSLLibrary.h"
 #include "Values/Base64.h"
 
 namespace veltoidctl {
+
+namespace openssl = platform::openssl;
+
 namespace {
 
 /// For each of key, certificates and integrity. Readers refuse files that would keep them busy for too long:
@@ -27,27 +31,24 @@ template <typename Object>
 using Owned = std::unique_ptr<Object, Deleter>;
 
 [[noreturn]] void refuse() {
-    char text[256];
-    ERR_error_string_n(ERR_get_error(), text, sizeof text);
-    throw std::runtime_error(std::string("the PKCS#12 file cannot be made: ") + text);
+    throw std::runtime_error("the PKCS#12 file cannot be made: " + openssl::takeReason());
 }
 
 template <typename Object>
-Owned<Object> neededObject(Object* object) {
+Owned<Object> neededObject(Owned<Object> object) {
     if (object == nullptr) refuse();
-    return Owned<Object>(object);
+    return object;
 }
 
 Owned<EVP_PKEY> keyFrom(platform::Bytes pkcs8) {
-    const unsigned char* end = pkcs8.data();
-    const auto information =
-        neededObject(d2i_PKCS8_PRIV_KEY_INFO(nullptr, &end, static_cast<long>(pkcs8.size())));
-    return neededObject(EVP_PKCS82PKEY(information.get()));
+    const auto information = neededObject(
+        openssl::decoded<Owned<PKCS8_PRIV_KEY_INFO>>(d2i_PKCS8_PRIV_KEY_INFO, pkcs8, platform::kMaxKeyBytes));
+    return neededObject(Owned<EVP_PKEY>(EVP_PKCS82PKEY(information.get())));
 }
 
 Owned<X509> certificateFrom(const platform::Certificate& certificate) {
-    const unsigned char* end = certificate.der.data();
-    return neededObject(d2i_X509(nullptr, &end, static_cast<long>(certificate.der.size())));
+    return neededObject(
+        openssl::decoded<Owned<X509>>(d2i_X509, certificate.der, platform::kMaxCertificateBytes));
 }
 
 template <typename Text>
@@ -82,17 +83,14 @@ platform::SecretBytes pkcs12Of(const Identity& identity, const platform::SecretT
     const auto key = keyFrom(identity.privateKey.encoded.bytes());
     const auto certificate = certificateFrom(identity.certificate);
     const auto intermediate = identity.intermediate ? certificateFrom(*identity.intermediate) : Owned<X509>();
-    const auto others = neededObject(sk_X509_new_null());
+    const auto others = neededObject(Owned<STACK_OF(X509)>(sk_X509_new_null()));
     if (intermediate && sk_X509_push(others.get(), intermediate.get()) == 0) refuse();
     // Zero: the library's own choice of ciphers (AES-256, PBKDF2) and key type.
-    const auto container =
-        neededObject(PKCS12_create(password.c_str(), name.c_str(), key.get(), certificate.get(), others.get(),
-                                   0, 0, kPasswordIterations, kPasswordIterations, 0));
-    const int size = i2d_PKCS12(container.get(), nullptr);
-    if (size <= 0) refuse();
-    platform::SecretBytes der(static_cast<size_t>(size));
-    unsigned char* end = der.data();
-    if (i2d_PKCS12(container.get(), &end) != size) refuse();
+    const auto container = neededObject(
+        Owned<PKCS12>(PKCS12_create(password.c_str(), name.c_str(), key.get(), certificate.get(),
+                                    others.get(), 0, 0, kPasswordIterations, kPasswordIterations, 0)));
+    auto der = openssl::encoded<platform::SecretBytes>(i2d_PKCS12, container.get());
+    if (der.empty()) refuse();
     return der;
 }
 
