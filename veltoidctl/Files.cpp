@@ -10,6 +10,8 @@
 #include <cstring>
 #include <stdexcept>
 
+#include "Platform/runtime/FileDescriptor.h"
+
 namespace veltoidctl {
 namespace {
 
@@ -17,48 +19,20 @@ constexpr size_t kMaxInputBytes = size_t{1} << 20U;
 
 [[noreturn]] void fail(const std::string& what) { throw std::runtime_error(what + ": " + strerror(errno)); }
 
-class Descriptor {
-  public:
-    explicit Descriptor(int number) : number_(number) {}
-    ~Descriptor() { close(number_); }
-    Descriptor(const Descriptor&) = delete;
-    Descriptor& operator=(const Descriptor&) = delete;
-
-  private:
-    int number_;
-};
-
 platform::SecretBytes readAll(int descriptor, const std::string& what) {
     // Never moved: what is beyond the end shows that there is too much.
     platform::SecretBytes bytes(kMaxInputBytes + 1);
-    size_t size = 0;
-    while (size < bytes.size()) {
-        const ssize_t count = read(descriptor, bytes.data() + size, bytes.size() - size);
-        if (count < 0 && errno == EINTR) continue;
-        if (count < 0) fail("reading " + what);
-        if (count == 0) break;
-        size += static_cast<size_t>(count);
-    }
-    if (size > kMaxInputBytes) throw std::runtime_error(what + " is too long");
-    if (size == 0) throw std::runtime_error(what + " is empty");
-    bytes.resize(size);
+    const auto size = platform::readFully(descriptor, bytes);
+    if (!size) fail("reading " + what);
+    if (*size > kMaxInputBytes) throw std::runtime_error(what + " is too long");
+    if (*size == 0) throw std::runtime_error(what + " is empty");
+    bytes.resize(*size);
     return bytes;
 }
 
-bool writeAll(int descriptor, platform::Bytes bytes) {
-    while (!bytes.empty()) {
-        const ssize_t count = write(descriptor, bytes.data(), bytes.size());
-        if (count < 0 && errno == EINTR) continue;
-        if (count < 0) return false;
-        bytes = bytes.subspan(static_cast<size_t>(count));
-    }
-    return true;
-}
-
 /// Fills the new file, which disappears when that does not succeed.
-void fill(int number, const std::string& path, platform::Bytes bytes) {
-    const Descriptor descriptor(number);
-    if (writeAll(number, bytes) && fsync(number) == 0) return;
+void fill(const platform::FileDescriptor& file, const std::string& path, platform::Bytes bytes) {
+    if (platform::writeFully(file.number(), bytes) && fsync(file.number()) == 0) return;
     const int reason = errno;
     unlink(path.c_str());
     errno = reason;
@@ -69,10 +43,9 @@ void fill(int number, const std::string& path, platform::Bytes bytes) {
 
 platform::SecretBytes readInput(const std::string& path) {
     if (path == kStandardStream) return readAll(STDIN_FILENO, "standard input");
-    const int number = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (number < 0) fail("opening " + path);
-    const Descriptor descriptor(number);
-    return readAll(number, path);
+    const platform::FileDescriptor file(open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!file.isOpen()) fail("opening " + path);
+    return readAll(file.number(), path);
 }
 
 PrivateOutput::PrivateOutput(std::string path, bool force) : path_(std::move(path)), force_(force) {
@@ -89,7 +62,7 @@ PrivateOutput::PrivateOutput(std::string path, bool force) : path_(std::move(pat
 
 void PrivateOutput::write(platform::Bytes bytes) const {
     if (path_ == kStandardStream) {
-        if (!writeAll(STDOUT_FILENO, bytes)) fail("writing to standard output");
+        if (!platform::writeFully(STDOUT_FILENO, bytes)) fail("writing to standard output");
     } else if (force_) {
         replace(bytes);
     } else {
@@ -99,17 +72,17 @@ void PrivateOutput::write(platform::Bytes bytes) const {
 
 void PrivateOutput::create(platform::Bytes bytes) const {
     // Exclusive: neither an existing file nor a symbolic link is opened.
-    const int number =
-        open(path_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR);
-    if (number < 0) fail("creating " + path_);
-    fill(number, path_, bytes);
+    const platform::FileDescriptor file(
+        open(path_.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
+    if (!file.isOpen()) fail("creating " + path_);
+    fill(file, path_, bytes);
 }
 
 void PrivateOutput::replace(platform::Bytes bytes) const {
     std::string temporary = path_ + ".XXXXXX";
-    const int number = mkostemp(temporary.data(), O_CLOEXEC);
-    if (number < 0) fail("creating " + temporary);
-    fill(number, temporary, bytes);
+    const platform::FileDescriptor file(mkostemp(temporary.data(), O_CLOEXEC));
+    if (!file.isOpen()) fail("creating " + temporary);
+    fill(file, temporary, bytes);
     if (rename(temporary.c_str(), path_.c_str()) == 0) return;
     const int reason = errno;
     unlink(temporary.c_str());

@@ -10,6 +10,7 @@
 
 #include "Platform/crypto/Crypto.h"
 #include "Platform/encoding/HexText.h"
+#include "Platform/runtime/FileDescriptor.h"
 
 namespace veltoidctl {
 namespace {
@@ -21,13 +22,12 @@ constexpr size_t kMaxPasswordBytes = 4'096;
 platform::SecretText readLine(int descriptor) {
     platform::SecretText line;
     line.reserve(kMaxPasswordBytes);
-    for (char c = 0;;) {
-        const ssize_t count = read(descriptor, &c, 1);
-        if (count < 0 && errno == EINTR) continue;
-        if (count < 0) throw std::runtime_error(std::string("reading the password: ") + strerror(errno));
-        if (count == 0 || c == '\n') break;
+    for (uint8_t byte = 0;;) {
+        const auto count = platform::readFully(descriptor, {&byte, 1});
+        if (!count) throw std::runtime_error(std::string("reading the password: ") + strerror(errno));
+        if (*count == 0 || byte == '\n') break;
         if (line.size() == kMaxPasswordBytes) throw std::runtime_error("the password is too long");
-        line += c;
+        line += static_cast<char>(byte);
     }
     if (!line.empty() && line.back() == '\r') line.pop_back();
     if (line.empty()) throw std::runtime_error("there is no password");
@@ -37,28 +37,25 @@ platform::SecretText readLine(int descriptor) {
 /// The terminal without echo for as long as this exists.
 class QuietTerminal {
   public:
-    QuietTerminal() : descriptor_(open("/dev/tty", O_RDWR | O_CLOEXEC)) {
-        if (descriptor_ < 0 || tcgetattr(descriptor_, &before_) != 0)
+    QuietTerminal() {
+        if (!file_.isOpen() || tcgetattr(descriptor(), &before_) != 0)
             throw std::runtime_error("there is no terminal to ask at; use --password-stdin");
         termios quiet = before_;
         quiet.c_lflag &= ~static_cast<tcflag_t>(ECHO);
-        tcsetattr(descriptor_, TCSAFLUSH, &quiet);
+        tcsetattr(descriptor(), TCSAFLUSH, &quiet);
     }
     ~QuietTerminal() {
-        tcsetattr(descriptor_, TCSAFLUSH, &before_);
+        tcsetattr(descriptor(), TCSAFLUSH, &before_);
         say("\n");
-        close(descriptor_);
     }
-    QuietTerminal(const QuietTerminal&) = delete;
-    QuietTerminal& operator=(const QuietTerminal&) = delete;
 
     void say(const std::string& text) const {
-        [[maybe_unused]] const ssize_t written = write(descriptor_, text.data(), text.size());
+        [[maybe_unused]] const ssize_t written = write(descriptor(), text.data(), text.size());
     }
-    int descriptor() const { return descriptor_; }
+    int descriptor() const { return file_.number(); }
 
   private:
-    int descriptor_;
+    const platform::FileDescriptor file_{open("/dev/tty", O_RDWR | O_CLOEXEC)};
     termios before_{};
 };
 

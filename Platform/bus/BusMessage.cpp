@@ -2,8 +2,6 @@
 
 #include <systemd/sd-bus.h>
 
-#include <cerrno>
-#include <cstring>
 #include <optional>
 #include <string>
 #include <vector>

@@ -11,6 +11,7 @@
 
 #include "Platform/crypto/Crypto.h"
 #include "Platform/encoding/BigEndian.h"
+#include "Platform/runtime/FileDescriptor.h"
 #include "Platform/runtime/StateDirectory.h"
 #include "Platform/runtime/SystemLog.h"
 
@@ -24,47 +25,6 @@ constexpr uint32_t kKeyFileVersion = 1;
 constexpr size_t kVersionBytes = 4;
 constexpr size_t kCheckBytes = 4;
 constexpr size_t kKeyFileBytes = kKeyFileMagic.size() + kVersionBytes + kCheckBytes + kSealingKeyBytes;
-
-/// The file's descriptor, closed at the end.
-class File {
-  public:
-    File(const std::string& path, int flags, mode_t mode = 0)
-        : descriptor_(::open(path.c_str(), flags | O_CLOEXEC, mode)) {}
-    ~File() {
-        if (isOpen()) ::close(descriptor_);
-    }
-    File(const File&) = delete;
-    File& operator=(const File&) = delete;
-
-    bool isOpen() const { return descriptor_ >= 0; }
-    int descriptor() const { return descriptor_; }
-
-    /// Reads until the span is full or the file ends; none on an error (errno).
-    std::optional<size_t> read(std::span<uint8_t> bytes) const {
-        size_t done = 0;
-        while (done < bytes.size()) {
-            const ssize_t got = ::read(descriptor_, bytes.data() + done, bytes.size() - done);
-            if (got < 0 && errno == EINTR) continue;
-            if (got < 0) return std::nullopt;
-            if (got == 0) break;
-            done += static_cast<size_t>(got);
-        }
-        return done;
-    }
-
-    bool writeDurably(Bytes bytes) const {
-        while (!bytes.empty()) {
-            const ssize_t put = ::write(descriptor_, bytes.data(), bytes.size());
-            if (put < 0 && errno == EINTR) continue;
-            if (put < 0) return false;
-            bytes = bytes.subspan(static_cast<size_t>(put));
-        }
-        return fsync(descriptor_) == 0;
-    }
-
-  private:
-    int descriptor_;
-};
 
 std::nullopt_t refuse(const std::string& path, const std::string& reason) {
     VELTOID_PLATFORM_LOG(Error, path + ": " + reason + "; the keychain is not available");
@@ -99,14 +59,14 @@ std::optional<SecretBytes> decodeKeyFile(const std::string& path, Bytes bytes) {
     return SecretBytes(key.begin(), key.end());
 }
 
-std::optional<SecretBytes> readKeyFile(const std::string& path, const File& file) {
+std::optional<SecretBytes> readKeyFile(const std::string& path, const FileDescriptor& file) {
     struct stat information {};
-    if (fstat(file.descriptor(), &information) == 0 && (information.st_mode & (S_IRWXG | S_IRWXO)) != 0) {
+    if (fstat(file.number(), &information) == 0 && (information.st_mode & (S_IRWXG | S_IRWXO)) != 0) {
         VELTOID_PLATFORM_LOG(Warning, path + ": was open to other users; its mode is corrected");
-        (void)fchmod(file.descriptor(), S_IRUSR | S_IWUSR);
+        (void)fchmod(file.number(), S_IRUSR | S_IWUSR);
     }
     SecretBytes bytes(kKeyFileBytes + 1);
-    const auto size = file.read(bytes);
+    const auto size = readFully(file.number(), bytes);
     if (!size) return refuse(path, std::string("cannot be read: ") + std::strerror(errno));
     bytes.resize(*size);
     return decodeKeyFile(path, bytes);
@@ -115,14 +75,16 @@ std::optional<SecretBytes> readKeyFile(const std::string& path, const File& file
 /// The file appears under its name only when it is complete, and not at all when another one is there
 /// already: a link, unlike a rename, replaces nothing.
 bool createKeyFile(const std::string& directory, const std::string& path) {
-    const DirectoryLock lock(directory);
+    const FileDescriptor lock = lockDirectory(directory);
     SecretBytes key(kSealingKeyBytes);
     fillRandom(key);
     const std::string temporary = path + ".new";
     // One may be left from a process that was killed while at it.
     (void)unlink(temporary.c_str());
-    const File file(temporary, O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW, S_IRUSR | S_IWUSR);
-    const bool linked = file.isOpen() && file.writeDurably(encodeKeyFile(key)) &&
+    const FileDescriptor file(
+        open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
+    const bool linked = file.isOpen() && writeFully(file.number(), encodeKeyFile(key)) &&
+                        fsync(file.number()) == 0 &&
                         (link(temporary.c_str(), path.c_str()) == 0 || errno == EEXIST);
     const int reason = errno;
     (void)unlink(temporary.c_str());
@@ -135,7 +97,7 @@ bool createKeyFile(const std::string& directory, const std::string& path) {
 std::optional<SecretBytes> deviceKey(const std::string& directory, bool mayCreate) {
     const std::string path = directory + "/keychain.key";
     for (const bool lastTry : {!mayCreate, true}) {
-        const File file(path, O_RDONLY | O_NOFOLLOW);
+        const FileDescriptor file(open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
         if (file.isOpen()) return readKeyFile(path, file);
         if (errno != ENOENT) return refuse(path, std::string("cannot be opened: ") + std::strerror(errno));
         if (lastTry) break;

@@ -57,8 +57,6 @@ class Shape {
 
     bool isComplete() const { return !failed_ && hasTop_ && open_.empty(); }
 
-    size_t depth() const { return open_.size(); }
-
   private:
     struct Level {
         Container container;

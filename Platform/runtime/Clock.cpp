@@ -15,6 +15,7 @@
 #include <utility>
 #include <vector>
 
+#include "Platform/runtime/FileDescriptor.h"
 #include "Platform/runtime/Lifetime.h"
 
 namespace platform {
@@ -41,20 +42,12 @@ timespec timespecOf(double seconds) {
 /// clock. All members are guarded by the mutex.
 class RealClock : public Clock {
   public:
-    RealClock() = default;
-    ~RealClock() override {
-        for (const int descriptor : {timerDescriptor_, jumpDescriptor_, wakeDescriptor_})
-            if (descriptor >= 0) close(descriptor);
-    }
-    RealClock(const RealClock&) = delete;
-    RealClock& operator=(const RealClock&) = delete;
-
     double now() const override { return secondsOf(CLOCK_REALTIME); }
 
     void lifetimeEnds() override {
         std::unique_lock lock(mutex_);
         isStopping_ = true;
-        if (wakeDescriptor_ >= 0) wake();
+        if (waking_.isOpen()) wake();
         lock.unlock();
         if (thread_.joinable()) thread_.join();
         endTimers();
@@ -62,11 +55,7 @@ class RealClock : public Clock {
 
     bool cancel(TimerID id) override {
         const std::lock_guard lock(mutex_);
-        const auto deadline = deadlines_.find(id);
-        if (deadline == deadlines_.end()) return false;
-        timers_.erase({deadline->second, id});
-        deadlines_.erase(deadline);
-        return true;
+        return std::erase_if(timers_, [id](const auto& timer) { return timer.first.second == id; }) > 0;
     }
 
   private:
@@ -81,7 +70,6 @@ class RealClock : public Clock {
         const double deadline = secondsOf(CLOCK_BOOTTIME) + std::clamp(seconds, 0.0, kFarthestDeadline);
         const TimerID id = ++lastID_;
         const auto position = timers_.emplace(std::pair(deadline, id), Timer{use, std::move(fire)}).first;
-        deadlines_[id] = deadline;
         if (position == timers_.begin()) wake();
         return id;
     }
@@ -89,30 +77,29 @@ class RealClock : public Clock {
     void endTimers() override {
         std::unique_lock lock(mutex_);
         const auto ended = std::exchange(timers_, {});
-        deadlines_.clear();
         lock.unlock();
         for (const auto& [key, timer] : ended)
             if (timer.use != Use::Task) timer.fire();
     }
 
     void startThreadOnce() {
-        if (timerDescriptor_ >= 0 || isStopping_) return;
-        timerDescriptor_ = timerfd_create(CLOCK_BOOTTIME, TFD_CLOEXEC | TFD_NONBLOCK);
-        jumpDescriptor_ = timerfd_create(CLOCK_REALTIME, TFD_CLOEXEC | TFD_NONBLOCK);
-        wakeDescriptor_ = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+        if (waking_.isOpen() || isStopping_) return;
+        expiry_ = FileDescriptor(timerfd_create(CLOCK_BOOTTIME, TFD_CLOEXEC | TFD_NONBLOCK));
+        jump_ = FileDescriptor(timerfd_create(CLOCK_REALTIME, TFD_CLOEXEC | TFD_NONBLOCK));
+        waking_ = FileDescriptor(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
         thread_ = std::thread([this] { serve(); });
     }
 
     void wake() const {
         const uint64_t one = 1;
-        if (write(wakeDescriptor_, &one, sizeof one) < 0 && errno != EAGAIN) std::abort();
+        if (write(waking_.number(), &one, sizeof one) < 0 && errno != EAGAIN) std::abort();
     }
 
     /// A timer on the real-time clock that never expires: reading it fails when the clock is set.
     void watchForJump() const {
         itimerspec far{};
         far.it_value = timespecOf(now() + kFarthestDeadline);
-        timerfd_settime(jumpDescriptor_, TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &far, nullptr);
+        timerfd_settime(jump_.number(), TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &far, nullptr);
     }
 
     /// False when the thread is to end.
@@ -120,13 +107,13 @@ class RealClock : public Clock {
         const std::lock_guard lock(mutex_);
         itimerspec next{};
         if (!timers_.empty()) next.it_value = timespecOf(std::max(timers_.begin()->first.first, 1e-6));
-        timerfd_settime(timerDescriptor_, TFD_TIMER_ABSTIME, &next, nullptr);
+        timerfd_settime(expiry_.number(), TFD_TIMER_ABSTIME, &next, nullptr);
         return !isStopping_;
     }
 
     bool takeJump() const {
         uint64_t expirations = 0;
-        return read(jumpDescriptor_, &expirations, sizeof expirations) < 0 && errno == ECANCELED;
+        return read(jump_.number(), &expirations, sizeof expirations) < 0 && errno == ECANCELED;
     }
 
     std::vector<std::function<void()>> takeDue(bool jumped) {
@@ -136,7 +123,6 @@ class RealClock : public Clock {
         for (auto timer = timers_.begin(); timer != timers_.end();) {
             if (timer->first.first <= reached || (jumped && timer->second.use == Use::WaitForDate)) {
                 due.push_back(std::move(timer->second.fire));
-                deadlines_.erase(timer->first.second);
                 timer = timers_.erase(timer);
             } else {
                 ++timer;
@@ -149,11 +135,11 @@ class RealClock : public Clock {
         watchForJump();
         while (armForNextDeadline()) {
             pollfd descriptors[] = {
-                {timerDescriptor_, POLLIN, 0}, {jumpDescriptor_, POLLIN, 0}, {wakeDescriptor_, POLLIN, 0}};
+                {expiry_.number(), POLLIN, 0}, {jump_.number(), POLLIN, 0}, {waking_.number(), POLLIN, 0}};
             poll(descriptors, std::size(descriptors), -1);
             uint64_t ignored = 0;
-            if (read(timerDescriptor_, &ignored, sizeof ignored) < 0 && errno != EAGAIN) continue;
-            if (read(wakeDescriptor_, &ignored, sizeof ignored) < 0 && errno != EAGAIN) continue;
+            for (const FileDescriptor* file : {&expiry_, &waking_})
+                (void)!read(file->number(), &ignored, sizeof ignored);
             const bool jumped = takeJump();
             if (jumped) watchForJump();
             for (const auto& fire : takeDue(jumped)) fire();
@@ -162,11 +148,10 @@ class RealClock : public Clock {
 
     std::mutex mutex_;
     std::map<std::pair<double, TimerID>, Timer> timers_;
-    std::map<TimerID, double> deadlines_;
     TimerID lastID_ = 0;
-    int timerDescriptor_ = -1;
-    int jumpDescriptor_ = -1;
-    int wakeDescriptor_ = -1;
+    FileDescriptor expiry_;
+    FileDescriptor jump_;
+    FileDescriptor waking_;
     bool isStopping_ = false;
     /// Started once, and joined by the thread that ends the lifetime.
     std::thread thread_;

@@ -13,6 +13,7 @@
 #include <list>
 #include <utility>
 
+#include "Platform/runtime/FileDescriptor.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 
@@ -22,17 +23,11 @@ namespace {
 /// Main thread only, except that any thread writes to the descriptor.
 struct Loop {
     sd_event* loop = nullptr;
-    int wakeDescriptor = -1;
+    FileDescriptor wakeDescriptor;
     /// The loop has their addresses.
     std::list<std::function<void()>> signalHandlers;
 
-    Loop() = default;
-    ~Loop() {
-        sd_event_unref(loop);
-        if (wakeDescriptor >= 0) close(wakeDescriptor);
-    }
-    Loop(const Loop&) = delete;
-    Loop& operator=(const Loop&) = delete;
+    ~Loop() { sd_event_unref(loop); }
 };
 
 Loop& state() { return Lifetime::current().state<Loop>(); }
@@ -77,12 +72,13 @@ void prepare() {
 
     Loop& made = state();
     if (const int result = sd_event_new(&made.loop); result < 0) fail("creating", -result);
-    made.wakeDescriptor = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
-    if (made.wakeDescriptor < 0) fail("creating wake descriptor", errno);
+    made.wakeDescriptor = FileDescriptor(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    const int descriptor = made.wakeDescriptor.number();
+    if (descriptor < 0) fail("creating wake descriptor", errno);
     sd_event_source* wake = nullptr;
-    const int result = sd_event_add_io(made.loop, &wake, made.wakeDescriptor, EPOLLIN, woken, nullptr);
+    const int result = sd_event_add_io(made.loop, &wake, descriptor, EPOLLIN, woken, nullptr);
     keep(wake, result, "watching wake descriptor");
-    main_queue::adopt([descriptor = made.wakeDescriptor] {
+    main_queue::adopt([descriptor] {
         const uint64_t one = 1;
         if (write(descriptor, &one, sizeof one) < 0 && errno != EAGAIN) fail("waking", errno);
     });

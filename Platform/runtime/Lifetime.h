@@ -63,8 +63,6 @@ class Lifetime {
     /// Aborts when there is one already.
     explicit Lifetime(const Product& product, Parts parts = {});
     ~Lifetime();
-    Lifetime(const Lifetime&) = delete;
-    Lifetime& operator=(const Lifetime&) = delete;
 
     /// Any thread; aborts when there is none.
     static Lifetime& current() {

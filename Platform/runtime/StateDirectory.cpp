@@ -41,14 +41,16 @@ std::string baseDirectory() {
 /// The name under which this machine is known to its user; a home directory may be shared between machines.
 std::string machineName() {
     constexpr size_t kDigits = 32;
-    std::array<char, kDigits> digits{};
-    const int descriptor = open("/etc/machine-id", O_RDONLY | O_CLOEXEC);
-    const ssize_t got = descriptor < 0 ? -1 : ::read(descriptor, digits.data(), digits.size());
-    if (descriptor >= 0) close(descriptor);
+    std::array<uint8_t, kDigits> digits{};
+    const FileDescriptor file(open("/etc/machine-id", O_RDONLY | O_CLOEXEC));
     const bool valid =
-        got == static_cast<ssize_t>(kDigits) &&
+        readFully(file.number(), digits) == kDigits &&
         std::ranges::all_of(digits, [](unsigned char digit) { return std::isxdigit(digit) != 0; });
     return valid ? std::string(digits.begin(), digits.end()) : "no-machine-id";
+}
+
+FileDescriptor openDirectory(const std::string& path) {
+    return FileDescriptor(open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
 }
 
 bool isDirectory(const std::string& path, struct stat& information) {
@@ -94,23 +96,14 @@ std::string stateDirectory() {
 }
 
 bool syncDirectory(const std::string& directory) {
-    const int descriptor = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (descriptor < 0) return false;
-    const bool done = fsync(descriptor) == 0;
-    const int reason = errno;
-    ::close(descriptor);
-    errno = reason;
-    return done;
+    const FileDescriptor opened = openDirectory(directory);
+    return opened.isOpen() && fsync(opened.number()) == 0;
 }
 
-DirectoryLock::DirectoryLock(const std::string& directory)
-    : descriptor_(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)) {
-    while (descriptor_ >= 0 && flock(descriptor_, LOCK_EX) != 0 && errno == EINTR) {
-    }
-}
-
-DirectoryLock::~DirectoryLock() {
-    if (descriptor_ >= 0) ::close(descriptor_);
+FileDescriptor lockDirectory(const std::string& directory) {
+    FileDescriptor opened = openDirectory(directory);
+    lockFile(opened, LOCK_EX);
+    return opened;
 }
 
 }  // namespace platform

@@ -4,6 +4,8 @@
 
 #include <string>
 
+#include "Platform/runtime/FileDescriptor.h"
+
 namespace platform {
 
 /// The directory of this user's state on this machine, created with mode 0700 when missing; empty when it
@@ -13,17 +15,8 @@ std::string stateDirectory();
 /// Makes the directory's entries durable; false with errno set.
 bool syncDirectory(const std::string& directory);
 
-/// Holds a directory for this process: creating and replacing files in it is for one at a time. Where the
-/// file system has no such locks the holder goes on without.
-class DirectoryLock {
-  public:
-    explicit DirectoryLock(const std::string& directory);
-    ~DirectoryLock();
-    DirectoryLock(const DirectoryLock&) = delete;
-    DirectoryLock& operator=(const DirectoryLock&) = delete;
-
-  private:
-    int descriptor_;
-};
+/// Holds a directory for this process until the result's end: creating and replacing files in it is for one
+/// at a time. Where the file system has no such locks the holder goes on without.
+[[nodiscard]] FileDescriptor lockDirectory(const std::string& directory);
 
 }  // namespace platform

@@ -10,7 +10,6 @@
 #include <array>
 #include <atomic>
 #include <cstdlib>
-#include <mutex>
 
 #include "Platform/runtime/WorkQueue.h"
 

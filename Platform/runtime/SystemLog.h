@@ -2,7 +2,6 @@
 // well unless it already leads to the journal. The text of a line is the same everywhere.
 #pragma once
 
-#include <memory>
 #include <string>
 #include <string_view>
 

@@ -90,7 +90,6 @@ void drain(const StatePointer& state);
 /// for long.
 class ThreadPool {
   public:
-    ThreadPool() = default;
     ~ThreadPool() {
         std::unique_lock lock(mutex_);
         isStopping_ = true;
@@ -99,8 +98,6 @@ class ThreadPool {
         for (std::thread& thread : threads_) thread.join();
         if (retired_.joinable()) retired_.join();
     }
-    ThreadPool(const ThreadPool&) = delete;
-    ThreadPool& operator=(const ThreadPool&) = delete;
 
     void run(StatePointer queue) {
         const std::lock_guard lock(mutex_);
@@ -171,10 +168,7 @@ class ThreadPool {
 /// Runs a lifetime's queues.
 class QueueRunner {
   public:
-    QueueRunner() = default;
     ~QueueRunner() { std::erase(tCurrentQueues, main_.get()); }
-    QueueRunner(const QueueRunner&) = delete;
-    QueueRunner& operator=(const QueueRunner&) = delete;
 
     ThreadPool& pool() { return pool_; }
     const StatePointer& mainQueue() const { return main_; }

@@ -7,7 +7,6 @@
 // synchronize.
 #pragma once
 
-#include <memory>
 #include <string>
 #include <string_view>
 #include <utility>

@@ -10,7 +10,6 @@
 #include <cerrno>
 #include <cstring>
 #include <exception>
-#include <memory>
 
 #include "Platform/encoding/CalendarText.h"
 #include "Platform/runtime/Clock.h"
@@ -268,7 +267,7 @@ SQLiteFile::State SQLiteFile::open() {
     }
     // Until the main file and its log are both open: otherwise another process could move them aside in
     // between, and the old file would be read and written with the new one's log.
-    const DirectoryLock lock(directory_);
+    const FileDescriptor lock = lockDirectory(directory_);
     if (!createWhenMissing()) return State::Failed;
     constexpr int kFlags = SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX | SQLITE_OPEN_EXRESCODE;
     const int code = sqlite3_open_v2(path().c_str(), &database_, kFlags, nullptr);
@@ -283,9 +282,9 @@ SQLiteFile::State SQLiteFile::open() {
 
 /// The library would create the file with the mode of the process's umask.
 bool SQLiteFile::createWhenMissing() {
-    const int descriptor = ::open(path().c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, S_IRUSR | S_IWUSR);
-    if (descriptor >= 0) {
-        ::close(descriptor);
+    const FileDescriptor created(
+        ::open(path().c_str(), O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, S_IRUSR | S_IWUSR));
+    if (created.isOpen()) {
         (void)syncDirectory(directory_);
         return true;
     }
@@ -379,7 +378,7 @@ bool SQLiteFile::hasMoved() {
 }
 
 bool SQLiteFile::moveAside() {
-    const DirectoryLock lock(directory_);
+    const FileDescriptor lock = lockDirectory(directory_);
     // Another process may have been faster: then the name already leads to its fresh file.
     if (hasMoved()) return true;
     const std::string aside = nameAside(path());

@@ -113,8 +113,6 @@ class SQLiteFile {
 
     explicit SQLiteFile(const Format& format) : format_(format) {}
     ~SQLiteFile();
-    SQLiteFile(const SQLiteFile&) = delete;
-    SQLiteFile& operator=(const SQLiteFile&) = delete;
 
     Outcome read(const Work& work);
 
