@@ -19,8 +19,7 @@ namespace {
 
 using openssl::library;
 VELTOID_LAZY_FUNCTIONS(library, EVP_aes_256_gcm, EVP_CIPHER_CTX_ctrl, EVP_CIPHER_CTX_free, EVP_CIPHER_CTX_new,
-                       EVP_DecryptFinal_ex, EVP_DecryptInit_ex2, EVP_DecryptUpdate, EVP_Digest,
-                       EVP_EncryptFinal_ex, EVP_EncryptInit_ex2, EVP_EncryptUpdate, EVP_PBE_scrypt,
+                       EVP_CipherFinal_ex, EVP_CipherInit_ex2, EVP_CipherUpdate, EVP_Digest, EVP_PBE_scrypt,
                        EVP_sha256);
 
 constexpr size_t kNonceBytes = 12;
@@ -30,8 +29,6 @@ constexpr size_t kPieceBytes = size_t{1} << 30U;
 
 using CipherContext = LazyOwner<EVP_CIPHER_CTX, EVP_CIPHER_CTX_free>;
 
-using CipherUpdate = int (*)(EVP_CIPHER_CTX*, unsigned char*, int*, const unsigned char*, int);
-
 /// Digests and sealing fail only when memory or the library itself is broken: nothing safe can go on without
 /// them.
 [[noreturn]] void abortOnFailure(const char* what, const std::string& reason) {
@@ -39,11 +36,11 @@ using CipherUpdate = int (*)(EVP_CIPHER_CTX*, unsigned char*, int*, const unsign
     std::abort();
 }
 
-bool feed(EVP_CIPHER_CTX* context, CipherUpdate update, uint8_t* output, Bytes input) {
+bool feed(EVP_CIPHER_CTX* context, uint8_t* output, Bytes input) {
     while (!input.empty()) {
         const auto piece = input.first(std::min(input.size(), kPieceBytes));
         int written = 0;
-        if (update(context, output, &written, piece.data(), static_cast<int>(piece.size())) != 1)
+        if (EVP_CipherUpdate(context, output, &written, piece.data(), static_cast<int>(piece.size())) != 1)
             return false;
         if (output != nullptr) output += written;
         input = input.subspan(piece.size());
@@ -51,34 +48,25 @@ bool feed(EVP_CIPHER_CTX* context, CipherUpdate update, uint8_t* output, Bytes i
     return true;
 }
 
-/// GCM is a stream: the final call only checks or forms the tag, but wants somewhere to point at.
-bool encrypt(Bytes key, Bytes additionalData, Bytes plain, uint8_t* sealed) {
-    const CipherContext context(EVP_CIPHER_CTX_new());
-    uint8_t* const ciphertext = sealed + kNonceBytes;
-    uint8_t nothing[1];
-    int written = 0;
-    return context != nullptr &&
-           EVP_EncryptInit_ex2(context.get(), EVP_aes_256_gcm(), key.data(), sealed, nullptr) == 1 &&
-           feed(context.get(), EVP_EncryptUpdate, nullptr, additionalData) &&
-           feed(context.get(), EVP_EncryptUpdate, ciphertext, plain) &&
-           EVP_EncryptFinal_ex(context.get(), nothing, &written) == 1 &&
-           EVP_CIPHER_CTX_ctrl(context.get(), EVP_CTRL_AEAD_GET_TAG, kTagBytes, ciphertext + plain.size()) ==
-               1;
-}
+enum class Direction : int { Decrypt = 0, Encrypt = 1 };
 
-bool decrypt(Bytes key, Bytes additionalData, Bytes sealed, SecretBytes& plain) {
+/// Writes as many bytes as it reads. GCM is a stream: the final call only forms or checks the tag, but wants
+/// somewhere to point at.
+bool run(Direction direction, Bytes key, Bytes nonce, Bytes additionalData, Bytes input, uint8_t* output,
+         uint8_t* tag) {
     const CipherContext context(EVP_CIPHER_CTX_new());
-    const Bytes ciphertext = sealed.subspan(kNonceBytes, plain.size());
-    uint8_t tag[kTagBytes];
-    std::copy_n(sealed.last(kTagBytes).begin(), kTagBytes, tag);
     uint8_t nothing[1];
     int written = 0;
+    const auto passTagWhen = [&](Direction when, int command) {
+        return direction != when || EVP_CIPHER_CTX_ctrl(context.get(), command, kTagBytes, tag) == 1;
+    };
     return context != nullptr &&
-           EVP_DecryptInit_ex2(context.get(), EVP_aes_256_gcm(), key.data(), sealed.data(), nullptr) == 1 &&
-           feed(context.get(), EVP_DecryptUpdate, nullptr, additionalData) &&
-           feed(context.get(), EVP_DecryptUpdate, plain.data(), ciphertext) &&
-           EVP_CIPHER_CTX_ctrl(context.get(), EVP_CTRL_AEAD_SET_TAG, kTagBytes, tag) == 1 &&
-           EVP_DecryptFinal_ex(context.get(), nothing, &written) == 1;
+           EVP_CipherInit_ex2(context.get(), EVP_aes_256_gcm(), key.data(), nonce.data(),
+                              static_cast<int>(direction), nullptr) == 1 &&
+           passTagWhen(Direction::Decrypt, EVP_CTRL_AEAD_SET_TAG) &&
+           feed(context.get(), nullptr, additionalData) && feed(context.get(), output, input) &&
+           EVP_CipherFinal_ex(context.get(), nothing, &written) == 1 &&
+           passTagWhen(Direction::Encrypt, EVP_CTRL_AEAD_GET_TAG);
 }
 
 }  // namespace
@@ -119,19 +107,24 @@ std::string canonicalUUIDText(const UUIDBytes& uuid) {
 SecretBytes seal(Bytes key, Bytes additionalData, Bytes plain) {
     if (key.size() != kSealingKeyBytes) abortOnFailure("sealing", "the key has the wrong size");
     SecretBytes sealed(kNonceBytes + plain.size() + kTagBytes);
-    fillRandom(std::span(sealed).first(kNonceBytes));
-    if (!encrypt(key, additionalData, plain, sealed.data())) abortOnFailure("sealing", openssl::takeReason());
+    const auto nonce = std::span(sealed).first(kNonceBytes);
+    fillRandom(nonce);
+    uint8_t* const tag = sealed.data() + kNonceBytes + plain.size();
+    if (!run(Direction::Encrypt, key, nonce, additionalData, plain, sealed.data() + kNonceBytes, tag))
+        abortOnFailure("sealing", openssl::takeReason());
     return sealed;
 }
 
 std::optional<SecretBytes> unseal(Bytes key, Bytes additionalData, Bytes sealed) {
     if (key.size() != kSealingKeyBytes || sealed.size() < kNonceBytes + kTagBytes) return std::nullopt;
     SecretBytes plain(sealed.size() - kNonceBytes - kTagBytes);
-    if (!decrypt(key, additionalData, sealed, plain)) {
-        openssl::clearErrors();
-        return std::nullopt;
-    }
-    return plain;
+    uint8_t tag[kTagBytes];
+    std::ranges::copy(sealed.last(kTagBytes), tag);
+    if (run(Direction::Decrypt, key, sealed.first(kNonceBytes), additionalData,
+            sealed.subspan(kNonceBytes, plain.size()), plain.data(), tag))
+        return plain;
+    openssl::clearErrors();
+    return std::nullopt;
 }
 
 std::optional<SecretBytes> deriveKey(Bytes passphrase, Bytes salt, const ScryptCost& cost) {
