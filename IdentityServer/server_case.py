@@ -3,10 +3,10 @@
 from __future__ import annotations
 
 import atexit
+import contextlib
 import hashlib
 import http.client
 import ssl
-import sys
 import tempfile
 import unittest
 import xmlrpc.client
@@ -14,9 +14,7 @@ from pathlib import Path
 from typing import Any
 from urllib.parse import urlsplit
 
-sys.path.insert(0, str(Path(__file__).resolve().parent))
-
-from control_client import IdentityServer  # noqa: E402
+from control_client import IdentityServer
 
 PREFIX = "com.velto.dir.idm.web.collaboration.PersonService."
 JANE = "jane.roe@example.com"
@@ -37,17 +35,16 @@ def setUpModule() -> None:
     trust = ssl.create_default_context(cafile=server.authority)
 
 
-def exchange(body: bytes | None, url: str = "", verb: str = "POST", **headers: str) -> tuple[int, bytes]:
+def exchange(body: bytes | None, url: str = "", verb: str = "POST", context: ssl.SSLContext | None = None,
+             **headers: str) -> tuple[int, bytes]:
     """One HTTPS request; status and body of the answer."""
     address = urlsplit(url or server.url)
-    connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=trust)
-    try:
+    connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=context or trust)
+    with contextlib.closing(connection):
         fields = {name.replace("_", "-"): value for name, value in headers.items()}
         connection.request(verb, address.path, body, {"Content-Type": "text/xml"} | fields)
         response = connection.getresponse()
         return response.status, response.read()
-    finally:
-        connection.close()
 
 
 def call(method: str, parameters: Any, url: str = "") -> dict[str, Any]:
