@@ -13,44 +13,31 @@ import shutil
 import ssl
 import stat
 import subprocess
-import pathlib
-import sys
 import time
 import unittest
 import urllib.request
+from unittest import mock
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
-from systemd_world import wait_until  # noqa: E402
-from world import ACCOUNT, PASSWORD, STATUS, World, hashed  # noqa: E402
+from harness.world import ACCOUNT, PASSWORD, STATUS, World, hashed, openssl, wait_until
 
 
-def client_program() -> str:
-    return os.environ["VELTOID_CLIENT"]
+PROGRAM = os.environ["VELTOID_CLIENT"]
 
 
 def keyring_is_permitted() -> bool:
     """Asks the kernel itself: add_key(2) to the user keyring, which is number -4."""
     number = {"x86_64": 248, "aarch64": 217}.get(platform.machine())
-    secret = b"x"
-    return number is not None and ctypes.CDLL(None).syscall(number, b"user", b"veltoid test", secret, len(secret), -4) >= 0
+    return number is not None and ctypes.CDLL(None).syscall(number, b"user", b"veltoid test", b"x", 1, -4) >= 0
 
 
 class CommandLine(unittest.TestCase):
     @classmethod
     def setUpClass(cls):
-        cls.world = World()
+        cls.world = cls.enterClassContext(World())
 
-    @classmethod
-    def tearDownClass(cls):
-        cls.world.__exit__()
-
-    def environment(self):
-        return {**os.environ, **self.world.environment, "DBUS_SESSION_BUS_ADDRESS": self.world.bus.address}
-
-    def run_client(self, *arguments, stdin="", address=None, **more):
-        environment = {**self.environment(), **({"DBUS_SESSION_BUS_ADDRESS": address} if address else {})}
-        return subprocess.run([client_program(), *arguments], input=stdin, text=more.pop("text", True),
-                              capture_output=True, env=environment, check=False, timeout=60, **more)
+    def run_client(self, *arguments, stdin="", text=True, **more):
+        return subprocess.run([PROGRAM, *arguments], input=stdin, text=text, capture_output=True,
+                              env=self.world.environment, check=False, timeout=60, **more)
 
     def run_table(self, cases):
         """Runs (arguments, standard input, status, text that is printed)."""
@@ -64,7 +51,7 @@ class CommandLine(unittest.TestCase):
         """Runs the client at a terminal of its own, answering (prompt, answer); returns status and what was shown."""
         pid, terminal = pty.fork()
         if pid == 0:
-            os.execve(client_program(), ["veltoidctl", *arguments], self.environment())
+            os.execve(PROGRAM, ["veltoidctl", *arguments], self.world.environment)
         shown = b""
         for prompt, answer in dialogue:
             seen = len(shown)
@@ -90,11 +77,8 @@ class CommandLine(unittest.TestCase):
         self.addCleanup(shutil.rmtree, folder)
         return folder
 
-    def openssl(self, *arguments, stdin=""):
-        return subprocess.run(["openssl", *arguments], input=stdin, text=True, capture_output=True, check=True).stdout
-
     def test_an_account_s_life_ends_with_the_right_statuses(self):
-        steps = [
+        self.run_table([
             (["ping"], "", 0, "the agent answers"),
             (["list"], "", 0, "no accounts"),
             (["info", ACCOUNT], "", 1, "no such account on this device (HWIdentityErrorDomain -108)"),
@@ -108,18 +92,16 @@ class CommandLine(unittest.TestCase):
             (["database"], "", 0, "AccessorVersions"),
             (["verify", ACCOUNT, "--password-stdin"], "wrong", 1, "The Velto ID account or password are incorrect."),
             (["status"], "", 0, "PasswordInvalid"),
-            (["forget", ACCOUNT], "", 0, "is forgotten"),
-        ]
-        self.run_table(steps)
+            (["forget", ACCOUNT], "", 0, "is forgotten")])
 
     def test_json_is_the_whole_reply_of_every_command(self):
         for command in (["ping"], ["list"], ["status"], ["database"], ["info", "nobody"], ["forget", "nobody"]):
-            with self.subTest(command):
-                self.assertIn("success", json.loads(self.run_client("--json", *command).stdout))
-                self.assertIn("success", json.loads(self.run_client(*command, "--json").stdout))
+            for arguments in (["--json", *command], [*command, "--json"]):
+                with self.subTest(arguments):
+                    self.assertIn("success", json.loads(self.run_client(*arguments).stdout))
 
     def test_wrong_use_is_explained(self):
-        cases = [
+        self.run_table([
             ([], "", 2, "A subcommand is required"),
             (["dance"], "", 2, "subcommand"),
             (["add"], "", 2, "NAME is required"),
@@ -139,10 +121,9 @@ class CommandLine(unittest.TestCase):
             (["find", "email"], "", 2, "VALUE is required"),
             (["breadcrumb", "get", "x"], "", 2, "KEY is required"),
             (["breadcrumb", "set", "x", "k", "--password-stdin"], PASSWORD, 2, "cannot both be standard input"),
-            (["breadcrumb", "set", "x", "k", "--password-stdin", "--input", "/dev/null"], PASSWORD, 1, "is empty"),
-        ]
-        self.run_table(cases)
-        self.assertEqual(self.run_client("ping", address="unix:path=/nowhere/bus").returncode, 3)
+            (["breadcrumb", "set", "x", "k", "--password-stdin", "--input", "/dev/null"], PASSWORD, 1, "is empty")])
+        with mock.patch.dict(self.world.environment, DBUS_SESSION_BUS_ADDRESS="unix:path=/nowhere/bus"):
+            self.run_table([(["ping"], "", 3, "")])
 
     def test_the_password_is_asked_for_without_echo(self):
         status, shown = self.at_terminal("verify", ACCOUNT, dialogue=[(b"Password for", PASSWORD)])
@@ -227,17 +208,17 @@ class CommandLine(unittest.TestCase):
                                            "next renewal"])
 
         pem, chain = (self.run_client("certificate", ACCOUNT, form).stdout for form in ("--pem", "--chain"))
-        self.assertIn(serial, self.openssl("x509", "-noout", "-serial", stdin=pem))
+        self.assertIn(serial, openssl("x509", "-noout", "-serial", stdin=pem))
         file = self.new_folder() / "chain.pem"
         file.write_text(chain)
-        self.openssl("verify", "-CAfile", self.world.server.authority, "-untrusted", file, stdin=pem)
+        openssl("verify", "-CAfile", self.world.server.authority, "-untrusted", file, stdin=pem)
         self.assertEqual(json.loads(self.run_client("certificate", ACCOUNT, "--chain", "--json").stdout)
                          ["certificate"]["PEM"], chain)
 
         record = self.run_client("certificate", ACCOUNT, "--validation-record", stdin=b"", text=False).stdout
         file.write_bytes(record)
-        self.assertIn(ACCOUNT, self.openssl("cms", "-verify", "-inform", "DER", "-in", file, "-purpose", "any",
-                                            "-CAfile", self.world.server.authority))
+        self.assertIn(ACCOUNT.encode(), openssl("cms", "-verify", "-inform", "DER", "-in", file, "-purpose", "any",
+                                                "-CAfile", self.world.server.authority))
         self.assertEqual(self.at_terminal("certificate", ACCOUNT, "--validation-record")[0], 1)
 
     def test_an_exported_identity_serves_other_programs(self):
@@ -257,7 +238,7 @@ class CommandLine(unittest.TestCase):
         self.run_table([([*export, "--pkcs12", folder / "f", "--password-stdin"], "\n", 1, "there is no password")])
 
         for file, password in ((pkcs12, secret), (unprotected, "")):
-            text = self.openssl("pkcs12", "-in", file, "-passin", "stdin", "-nodes", stdin=password + "\n")
+            text = openssl("pkcs12", "-in", file, "-passin", "stdin", "-nodes", stdin=password + "\n")
             self.assertEqual(text.count("BEGIN"), 3)
             file.write_text(text)
         for file in (pem, pkcs12, unprotected):

@@ -14,8 +14,8 @@ import textwrap
 ROOT = pathlib.Path(__file__).resolve().parent.parent
 BUILD = ROOT / "build" / "release"
 os.environ.setdefault("VELTOID_AGENT", str(BUILD / "VeltoIDAuthentication" / "VeltoIDAuthd" / "veltoidauthd"))
-sys.path.insert(0, str(ROOT / "Tests" / "harness"))
-from world import ACCOUNT, INTERFACE, OBJECT, OTHER_ACCOUNT, PASSWORD, SERVICE, World  # noqa: E402
+sys.path.insert(0, str(ROOT / "Tests"))
+from harness.world import ACCOUNT, INTERFACE, OBJECT, OTHER_ACCOUNT, PASSWORD, SERVICE, World  # noqa: E402
 
 
 def say(text: str):
