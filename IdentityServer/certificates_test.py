@@ -5,7 +5,6 @@ Run like `identity_server_test.py`.
 
 from __future__ import annotations
 
-import hashlib
 import ssl
 import unittest
 import xmlrpc.client
@@ -21,8 +20,8 @@ from cryptography.x509.oid import NameOID
 
 from control_client import IdentityServer
 from openssl_program import openssl
-from server_case import (JANE, SIGN_IN, ServerTest, call, directory, exchange, fault_of, server,
-                         setUpModule)
+from server_case import (JANE, JOHN, JOHN_HASH, SIGN_IN, ServerTest, call, directory, exchange, fault_of, server,
+                         setUpModule, signed_in)
 
 KEY = rsa.generate_private_key(65537, 2048)
 KEY_TEXT = KEY.private_bytes(serialization.Encoding.PEM, serialization.PrivateFormat.PKCS8,
@@ -49,19 +48,11 @@ def verify(certificate: str, intermediate: str = "") -> None:
 class CertificateTest(ServerTest):
     def setUp(self) -> None:
         super().setUp()
-        self.enc_ds_id = call("authenticate", SIGN_IN)["encDsId"]
-        self.owner = self.session | {"encDsId": self.enc_ds_id}
         self.order = self.owner | {"CSR": csr(), "RequestedCertificateLifetimeInSeconds": WEEK}
 
     def issued(self, **settings: Any) -> dict[str, Any]:
         server.settings(issuance="at-once", **settings)
         return call("createCert", self.order)["dsCert"]
-
-    def john(self) -> dict[str, Any]:
-        """The session of another account."""
-        password_hash = hashlib.sha256(b"battery staple").hexdigest()
-        reply = call("authenticate", {"veltoConnect": "john.doe@example.com", "pwdHash": password_hash})
-        return {key: reply[key] for key in ("dsSession", "encDsId")}
 
 
 class RequestTest(CertificateTest):
@@ -89,13 +80,12 @@ class RequestTest(CertificateTest):
 
     def test_a_request_of_another_program_is_understood(self) -> None:
         server.accounts({"name": PLAIN_NAME, "pwdHash": SIGN_IN["pwdHash"]})
-        reply = call("authenticate", SIGN_IN | {"veltoConnect": PLAIN_NAME})
+        owner = signed_in(PLAIN_NAME)
         made = openssl("req", "-new", "-newkey", "rsa:3072", "-nodes", "-keyout", "/dev/null", "-config", "/dev/stdin",
                        stdin="[req]\nprompt=no\ndistinguished_name=n\nstring_mask=default\n"
                              f"[n]\nCN={PLAIN_NAME}\nC=US\nO=Velto, Inc.\n")
-        order = self.order | {"CSR": made, "dsSession": reply["dsSession"], "encDsId": reply["encDsId"]}
-        verify(call("createCert", order)["dsCert"]["Certificate"])
-        self.assertEqual(server.certificates(PLAIN_NAME)[-1]["encDsId"], reply["encDsId"])
+        verify(call("createCert", self.order | owner | {"CSR": made})["dsCert"]["Certificate"])
+        self.assertEqual(server.certificates(PLAIN_NAME)[-1]["encDsId"], owner["encDsId"])
 
     def test_requests_that_are_wrong_are_refused(self) -> None:
         count = len(server.certificates())
@@ -103,7 +93,7 @@ class RequestTest(CertificateTest):
         signed = x509.load_pem_x509_csr(csr().encode()).public_bytes(serialization.Encoding.DER)
         tampered = x509.load_der_x509_csr(signed[:-1] + bytes((signed[-1] ^ 1,)))
         forged = tampered.public_bytes(serialization.Encoding.PEM).decode()
-        other_name = ((NAME, "john.doe@example.com"), *GOOD_SUBJECT[1:])
+        other_name = ((NAME, JOHN), *GOOD_SUBJECT[1:])
         for label, change in (
                 ("no session", {"dsSession": "x"}), ("other account's id", {"encDsId": "000100-05-0"}),
                 ("no request", {"CSR": ""}), ("no PEM", {"CSR": "text"}), ("wrong signature", {"CSR": forged}),
@@ -157,7 +147,7 @@ class IssuanceTest(CertificateTest):
         self.assertEqual(fault_of("fetchCert", claim), PENDING)
         server.settings(issuance="token")
         for method in ("fetchCert", "downloadCertComplete"):
-            self.assertEqual(fault_of(method, claim | self.john()), -1)
+            self.assertEqual(fault_of(method, claim | signed_in(JOHN, JOHN_HASH)), -1)
         first = call("fetchCert", claim)
         self.assertEqual(call("fetchCert", claim), first)
         self.assertEqual(call("downloadCertComplete", claim), {})
@@ -183,7 +173,7 @@ class IssuanceTest(CertificateTest):
         (entry,) = call("fetchCert", claim)["dsCert"]
         self.assertRegex(entry["Expires"], r"^\d{4}-\d\d-\d\dT\d\d:\d\d:\d\dZ$")
         self.assertEqual(server.certificates()[-1], {
-            "serial": entry["SerialNumber"], "account": JANE, "encDsId": self.enc_ds_id, "revoked": False,
+            "serial": entry["SerialNumber"], "account": JANE, "encDsId": self.owner["encDsId"], "revoked": False,
             "notAfter": entry["Expires"]})
         other_key = self.issued(wrongKey=True)["Certificate"]
         verify(other_key)
@@ -208,7 +198,7 @@ class StateTest(CertificateTest):
 
     def test_validity_is_told_to_who_names_a_certificate(self) -> None:
         good, expired = (self.issued(certificateLifetime=life)["SerialNumber"] for life in (None, -5))
-        john = self.john()
+        john = signed_in(JOHN, JOHN_HASH)
         for label, serial, expected in (("good", good, (True, True)), ("expired", expired, (False, False)),
                                         ("unknown", "00", (False, False))):
             with self.subTest(label):

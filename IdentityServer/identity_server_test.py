@@ -22,8 +22,8 @@ from typing import Any
 
 from control_client import ControlError, IdentityServer
 from openssl_program import openssl
-from server_case import (JANE, JANE_HASH, PREFIX, SIGN_IN, TIMEOUT, ServerTest, call, exchange, fault_of,
-                         server, setUpModule)
+from server_case import (JANE, JANE_HASH, JOHN, PREFIX, SIGN_IN, TIMEOUT, ServerTest, call, exchange, fault_of,
+                         server, setUpModule, signed_in)
 
 # What the agent writes where implementations differ: one line, zone letter, wide integer, nil, broken base64.
 AGENT_DOCUMENT = (
@@ -54,14 +54,10 @@ class SignInTest(ServerTest):
                         {"name": "off@example.com", "pwdHash": JANE_HASH, "disabled": True})
         new_hash = hashlib.sha256(password.encode()).hexdigest()
         for label, name, password_hash, expected in (
-                ("right", JANE, JANE_HASH, None),
-                ("name in another case", "Jane.ROE@example.com", JANE_HASH, None),
-                ("added account", "new.user@example.com", new_hash, None),
-                ("wrong password", JANE, "0" * 64, -20101),
-                ("hash in upper case", JANE, JANE_HASH.upper(), -20101),
-                ("hash that is not ASCII", JANE, "ü", -20101),
-                ("hash of another type", JANE, 5, -20101),
-                ("unknown account", "nobody@example.com", JANE_HASH, -20101),
+                ("right", JANE, JANE_HASH, None), ("name in another case", "Jane.ROE@example.com", JANE_HASH, None),
+                ("added account", "new.user@example.com", new_hash, None), ("wrong password", JANE, "0" * 64, -20101),
+                ("hash in upper case", JANE, JANE_HASH.upper(), -20101), ("hash not in ASCII", JANE, "ü", -20101),
+                ("hash of another type", JANE, 5, -20101), ("unknown", "nobody@example.com", JANE_HASH, -20101),
                 ("disabled", "off@example.com", JANE_HASH, -20209),
                 ("disabled, wrong password", "off@example.com", "", -20101)):
             with self.subTest(label):
@@ -76,8 +72,7 @@ class SignInTest(ServerTest):
         self.assertNotEqual(reply["dsSession"], self.session["dsSession"])
         server.settings(Version=102, dsSessionValidityDuration=None)
         server.accounts({"name": JANE, "CertificateIsValid": False, "encDsId": "changed"})
-        as_before = {"name": JANE, "CertificateIsValid": None, "encDsId": reply["encDsId"]}
-        self.addCleanup(server.accounts, as_before)
+        self.addCleanup(server.accounts, {"name": JANE, "CertificateIsValid": None, "encDsId": reply["encDsId"]})
         reply = call("authenticate", SIGN_IN)
         self.assertEqual((reply["Version"], reply["encDsId"]), (102, "changed"))
         self.assertIs(reply["CertificateIsValid"], False)
@@ -85,7 +80,7 @@ class SignInTest(ServerTest):
 
     def test_calls_that_no_method_can_serve_are_faults(self) -> None:
         server.accounts({"name": "leaver@example.com", "pwdHash": JANE_HASH, "disabled": False})
-        leaver = call("authenticate", SIGN_IN | {"veltoConnect": "leaver@example.com"})
+        leaver = signed_in("leaver@example.com")
         server.accounts({"name": "leaver@example.com", "disabled": True})
         self.assertIn(b"unknown method", exchange(agent_document().replace(PREFIX.encode(), b""))[1])
         for label, method, parameters, code in (
@@ -113,16 +108,14 @@ class MyInfoTest(ServerTest):
         self.assertEqual((len(reply["AllEmails"]), len(reply["ValidatedPhones"])), (2, 1))
         statement = self.verified(reply)
         self.assertEqual(statement["SuggestValidDuration"], 2592000)
-        age = datetime.datetime.utcnow() - statement["ValidAsOf"]
-        self.assertLess(abs(age), datetime.timedelta(minutes=10))
+        self.assertLess(abs(datetime.datetime.utcnow() - statement["ValidAsOf"]), datetime.timedelta(minutes=10))
         for key in ("encDsId", "ValidatedEmail", "ValidatedPhones"):
             self.assertEqual(statement[key], reply[key])
 
     def test_record_is_sent_until_the_client_has_it(self) -> None:
         first = call("getMyInfo", self.session)
         known = self.session | {"ClientVIDVRecordIdentifier": first["VIDVRecordIdentifier"]}
-        announced = call("authenticate", SIGN_IN)["VeltoIDRecordIdentifier"]
-        self.assertEqual(announced, first["VIDVRecordIdentifier"])
+        self.assertEqual(call("authenticate", SIGN_IN)["VeltoIDRecordIdentifier"], first["VIDVRecordIdentifier"])
         self.assertNotIn("VIDVRecord", call("getMyInfo", known))
         server.settings(SuggestValidDuration=0)
         aged = call("getMyInfo", known)
@@ -166,8 +159,7 @@ class MyInfoTest(ServerTest):
                         self.content(call("getMyInfo", self.session))
         server.settings(validationRecordFormat="xml", validationRecordTampering="content")
         made_out = plistlib.loads(self.content(call("getMyInfo", self.session), "-no_content_verify"))
-        age = datetime.datetime.utcnow() - made_out["ValidAsOf"]
-        self.assertLess(age, datetime.timedelta(minutes=10))
+        self.assertLess(datetime.datetime.utcnow() - made_out["ValidAsOf"], datetime.timedelta(minutes=10))
 
 
 class PeopleTest(ServerTest):
@@ -179,15 +171,14 @@ class PeopleTest(ServerTest):
                     "PrimaryEmail": "first@example.com"}
         server.accounts(namesake)
         self.addCleanup(server.accounts, namesake | {"AllEmails": None, "PrimaryEmail": None})
-        john = "john.doe@example.com"
         for criteria, expected in (
                 ({}, []), ({"email": ["nobody@example.com", ""]}, []), ({"phone": [JANE]}, []),
                 ({"email": ["first@example.com"]}, [("email", "first@example.com", "twin@example.com", None)]),
                 ({"phone": ["+15555550123"]}, [("phone", "+15555550123", JANE, "Jane")]),
-                ({"VeltoID": ["John.DOE@example.com"]}, [("VeltoID", "John.DOE@example.com", john, "John")]),
-                ({"email": [john, "jane@roe.example"], "VeltoID": [john]},
-                 [("email", john, john, "John"), ("email", "jane@roe.example", JANE, "Jane"),
-                  ("email", "jane@roe.example", "twin@example.com", None), ("VeltoID", john, john, "John")])):
+                ({"VeltoID": ["John.DOE@example.com"]}, [("VeltoID", "John.DOE@example.com", JOHN, "John")]),
+                ({"email": [JOHN, "jane@roe.example"], "VeltoID": [JOHN]},
+                 [("email", JOHN, JOHN, "John"), ("email", "jane@roe.example", JANE, "Jane"),
+                  ("email", "jane@roe.example", "twin@example.com", None), ("VeltoID", JOHN, JOHN, "John")])):
             with self.subTest(criteria):
                 self.assertEqual(found(**criteria), expected)
         for bad in ("text", {"email": JANE}, {"email": [1]}, {"shoeSize": ["9"]}):
@@ -205,7 +196,7 @@ class PeopleTest(ServerTest):
             self.assertEqual(call("saveBreadcrumbEk", place | {"ek": text}), {})
             self.assertEqual(call("fetchBreadcrumbEk", place), {"ek": text})
         server.accounts({"name": "neighbour@example.com", "pwdHash": JANE_HASH})
-        neighbour = call("authenticate", SIGN_IN | {"veltoConnect": "neighbour@example.com"})["dsSession"]
+        neighbour = signed_in("neighbour@example.com")["dsSession"]
         for change in ({"machineUUID": "N"}, {"breadcrumbKey": "L"}, {"dsSession": neighbour}):
             with self.subTest(change):
                 self.assertEqual(call("fetchBreadcrumbEk", place | change), {})

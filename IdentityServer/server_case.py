@@ -19,6 +19,8 @@ from control_client import IdentityServer
 PREFIX = "com.velto.dir.idm.web.collaboration.PersonService."
 JANE = "jane.roe@example.com"
 JANE_HASH = hashlib.sha256(b"correct horse").hexdigest()
+JOHN = "john.doe@example.com"
+JOHN_HASH = hashlib.sha256(b"battery staple").hexdigest()
 SIGN_IN = {"veltoConnect": JANE, "pwdHash": JANE_HASH}
 TIMEOUT = 20
 
@@ -55,6 +57,12 @@ def call(method: str, parameters: Any, url: str = "") -> dict[str, Any]:
     return xmlrpc.client.loads(body, use_builtin_types=True)[0][0]
 
 
+def signed_in(name: str = JANE, password_hash: str = JANE_HASH) -> dict[str, str]:
+    """A new session and the id that goes with it, as the calls of an account carry them."""
+    reply = call("authenticate", {"veltoConnect": name, "pwdHash": password_hash})
+    return {key: reply[key] for key in ("dsSession", "encDsId")}
+
+
 def fault_of(method: str, parameters: Any) -> int | None:
     try:
         call(method, parameters)
@@ -67,5 +75,6 @@ class ServerTest(unittest.TestCase):
     def setUp(self) -> None:
         server.clear_next()
         server.reset_settings()
-        self.session = {"dsSession": call("authenticate", SIGN_IN)["dsSession"]}
+        self.owner = signed_in()
+        self.session = {"dsSession": self.owner["dsSession"]}
         server.clear_received()
