@@ -10,7 +10,7 @@ import plistlib
 import unittest
 
 from harness.world import (ACCOUNT, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB, INFO,
-                           OTHER_ACCOUNT, PASSWORD, PING, SET_BREADCRUMB, VERIFY, World, hashed, openssl, references)
+                           OTHER_ACCOUNT, PASSWORD, PING, SET_BREADCRUMB, World, hashed, openssl, references)
 
 KEYS, CERTIFICATES = 1, 2
 LOOKS = 50  # at something that the agent may be about to change
@@ -20,7 +20,7 @@ DAY = 86_400
 def seconds(moment: datetime.datetime | str) -> float:
     """A date without zone (UTC), or as texts give it, in seconds since 1970."""
     if isinstance(moment, str):
-        moment = datetime.datetime.fromisoformat(moment.removesuffix("Z"))
+        moment = datetime.datetime.fromisoformat(moment)
     return moment.replace(tzinfo=datetime.timezone.utc).timestamp()
 
 
@@ -37,22 +37,17 @@ class AgentCase(unittest.TestCase):
     def case(self, name, account=ACCOUNT, **settings):
         """A fresh agent without accounts, a server with these settings. In the end the account is forgotten, and
         nothing of it may be left in the keychain."""
-        with self.subTest(name):
+        with self.subTest(name), self.world.running_agent() as self.client:
             self.server.clear_received()
             self.server.settings(**settings)
-            self.world.start_agent()
-            self.client = self.world.client()
             try:
                 yield
-                self.client.call(FORGET, VeltoID=account)
-                self.assertEqual(self.world.keychain_items(), {})
-                self.assertTrue(self.client.call(PING)["success"])
             finally:
-                self.client.call(FORGET, VeltoID=account)
-                self.client.close()
-                self.world.stop_agent()
                 self.server.clear_next()
                 self.server.reset_settings()
+                self.client.call(FORGET, VeltoID=account)
+            self.assertEqual(self.world.keychain_items(), {})
+            self.assertTrue(self.client.call(PING)["success"])
 
     def add_with_certificate(self, account=ACCOUNT, timeout=30, **options):
         """The account as the add answers it, None when the add did not come to its end."""
@@ -274,25 +269,15 @@ class People(AgentCase):
         reply = self.client.call(command, criteria={criterion: list(values)})
         return [person["VeltoID"] for person in reply.get("result", [])]
 
-    def test_whom_the_server_found_is_known_afterwards(self):
+    def test_people_and_breadcrumbs_outlive_the_agent(self):
         jane, john = ("email", "jane@roe.example"), ("VeltoID", OTHER_ACCOUNT)
+        mine = {"VeltoID": ACCOUNT, "hashedpassword": hashed(PASSWORD)}
         with self.case("people"):
             self.client.add()
             self.assertEqual(self.find(FIND_CACHED, *jane), [])
             self.assertEqual(self.find(FIND, *jane, "nobody@roe.example"), [ACCOUNT])
             self.server.settings(findPersonValidInterval=-1)
             self.assertEqual(self.find(FIND, *john), [OTHER_ACCOUNT])
-            self.world.stop_agent()
-            self.world.start_agent()
-            self.assertEqual(self.find(FIND_CACHED, *jane), [ACCOUNT])
-            self.assertEqual(self.find(FIND_CACHED, *john), [], "the server said that he is not to be remembered")
-            self.assertEqual(self.find(FIND_CACHED, "phone", jane[1]), [])
-            self.assertEqual(self.server.counts()["findPerson"], 2)
-
-    def test_breadcrumbs_come_back_to_whoever_knows_the_password(self):
-        with self.case("breadcrumbs"):
-            self.client.add()
-            mine = {"VeltoID": ACCOUNT, "hashedpassword": hashed(PASSWORD)}
             for identifier, data in [("a", b"\0"), ("b", bytes(range(256)) * 200), ("a", b"later"), ("ü/ \n", b"x")]:
                 stored = self.client.call(SET_BREADCRUMB, **mine, identifier=identifier, breadcrumb=data)
                 self.assertTrue(stored["success"], stored)
@@ -300,11 +285,15 @@ class People(AgentCase):
                 self.assertEqual(fetched.get("breadcrumb"), data)
             self.world.stop_agent()
             self.world.start_agent()
+            self.assertEqual(self.find(FIND_CACHED, *jane), [ACCOUNT])
+            self.assertEqual(self.find(FIND_CACHED, *john), [], "the server said that he is not to be remembered")
+            self.assertEqual(self.find(FIND_CACHED, "phone", jane[1]), [])
+            self.assertEqual(self.server.counts()["findPerson"], 2)
             self.assertEqual(self.client.call(GET_BREADCRUMB, **mine, identifier="a")["breadcrumb"], b"later")
             self.assertFalse(self.client.call(GET_BREADCRUMB, **mine, identifier="none")["success"])
             refused = self.client.call(GET_BREADCRUMB, **{**mine, "hashedpassword": hashed("wrong")}, identifier="a")
             self.assertEqual((refused["success"], refused["error"]["Code"]), (False, -101))
-            self.assertTrue(self.client.call(VERIFY, **mine)["success"])
+            self.assertTrue(self.client.verify()["success"])
 
 
 if __name__ == "__main__":

@@ -101,27 +101,24 @@ class CommandLine(unittest.TestCase):
                     self.assertIn("success", json.loads(self.run_client(*arguments).stdout))
 
     def test_wrong_use_is_explained(self):
-        self.run_table([
-            ([], "", 2, "A subcommand is required"),
-            (["dance"], "", 2, "subcommand"),
-            (["add"], "", 2, "NAME is required"),
-            (["add", "x", "--password-stdin"], "", 1, "there is no password"),
-            (["add", "x", "--password-stdin", "--hashed-password-stdin"], "", 2, "excludes"),
-            (["--timeout", "0", "ping"], "", 2, "timeout"),
-            (["--service", "no.such.agent", "ping"], "", 3, "not installed on this bus"),
-            (["add", "x", "--no-sign-in", "--certificate"], "", 2, "excludes"),
-            (["certificate"], "", 2, "NAME is required"),
-            (["certificate", "x", "--pem", "--validation-record"], "", 2, "excludes"),
-            (["certificate", "export", "x"], "", 2, "--pem,--pkcs12"),
-            (["certificate", "export", "x", "--pem", "f", "--pkcs12", "f"], "", 2, "--pem,--pkcs12"),
-            (["certificate", "export", "x", "y", "--pem", "f"], "", 2, "excludes"),
-            (["certificate", "export", "x", "--pem", "f", "--no-password"], "", 2, "requires --pkcs12"),
-            (["certificate", "export", "x", "--pkcs12", "f", "--no-password", "--password-stdin"], "", 2, "excludes"),
-            (["certificate", "export", "x", "--pem", "-", "--json"], "", 2, "room for one"),
-            (["find", "email"], "", 2, "VALUE is required"),
-            (["breadcrumb", "get", "x"], "", 2, "KEY is required"),
-            (["breadcrumb", "set", "x", "k", "--password-stdin"], PASSWORD, 2, "cannot both be standard input"),
-            (["breadcrumb", "set", "x", "k", "--password-stdin", "--input", "/dev/null"], PASSWORD, 1, "is empty")])
+        for command, status, said in [
+                ("", 2, "A subcommand is required"), ("dance", 2, "subcommand"), ("--timeout 0 ping", 2, "timeout"),
+                ("--service no.such.agent ping", 3, "not installed on this bus"), ("add", 2, "NAME is required"),
+                ("add x --password-stdin", 1, "there is no password"), ("certificate", 2, "NAME is required"),
+                ("add x --password-stdin --hashed-password-stdin", 2, "excludes"),
+                ("add x --no-sign-in --certificate", 2, "excludes"),
+                ("certificate x --pem --validation-record", 2, "excludes"),
+                ("certificate export x", 2, "--pem,--pkcs12"),
+                ("certificate export x --pem f --pkcs12 f", 2, "--pem,--pkcs12"),
+                ("certificate export x y --pem f", 2, "excludes"),
+                ("certificate export x --pem f --no-password", 2, "requires --pkcs12"),
+                ("certificate export x --pkcs12 f --no-password --password-stdin", 2, "excludes"),
+                ("certificate export x --pem - --json", 2, "room for one"),
+                ("find email", 2, "VALUE is required"), ("breadcrumb get x", 2, "KEY is required")]:
+            self.run_table([(command.split(), "", status, said)])
+        keep = ["breadcrumb", "set", "x", "k", "--password-stdin"]
+        self.run_table([(keep, PASSWORD, 2, "cannot both be standard input"),
+                        ([*keep, "--input", "/dev/null"], PASSWORD, 1, "is empty")])
         with mock.patch.dict(self.world.environment, DBUS_SESSION_BUS_ADDRESS="unix:path=/nowhere/bus"):
             self.run_table([(["ping"], "", 3, "")])
 
@@ -249,7 +246,7 @@ class CommandLine(unittest.TestCase):
                 with urllib.request.urlopen(self.world.server.client_certificate_url, context=context) as page:
                     self.assertIn(self.world.server.certificates(ACCOUNT)[-1]["serial"], page.read().decode())
 
-    def test_an_export_spares_what_is_there(self):
+    def test_an_export_spares_what_is_there_and_asks_at_a_terminal(self):
         self.add_account("--certificate")
         folder = self.new_folder()
         file, link, dangling = folder / "file", folder / "link", folder / "dangling"
@@ -275,10 +272,6 @@ class CommandLine(unittest.TestCase):
         self.assertIn("PRIVATE KEY", file.read_text())
         self.assertEqual(stat.S_IMODE(file.stat().st_mode), 0o600)
         self.assertEqual((folder / "other").read_text(), "mine")
-
-    def test_an_export_at_a_terminal(self):
-        self.add_account("--certificate")
-        folder = self.new_folder()
         mistyped, typed = str(folder / "mistyped"), str(folder / "typed")
         for arguments, dialogue, status in [
                 (["--pem", "-"], [], 1),
@@ -290,7 +283,7 @@ class CommandLine(unittest.TestCase):
                 self.assertEqual(ended, status, shown)
                 self.assertEqual(b"PRIVATE KEY" in shown, "--force" in arguments)
                 self.assertNotIn(b"secret", shown)
-        self.assertEqual(os.listdir(folder), ["typed"])
+        self.assertEqual({path.name for path in folder.iterdir()}, {"file", "link", "dangling", "other", "typed"})
 
     def test_people_are_found_and_remembered(self):
         self.run_table([(["find", "email", "jane@roe.example"], "", 1, "HWIdentityErrorDomain")])

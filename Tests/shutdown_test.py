@@ -48,7 +48,7 @@ class Writer:
     def __exit__(self, *_):
         self.stopping = True
         self.pool.shutdown()
-        self.client.close()
+        self.client.connection.close()
         self.running.result()
 
 

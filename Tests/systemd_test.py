@@ -17,16 +17,9 @@ from shutdown_test import Writer
 MICROSECONDS = 1_000_000
 
 
-class SystemdTest(unittest.TestCase):
-    def session(self, **environment: str) -> UserSession:
-        session = UserSession(**environment)
-        self.addCleanup(session.close)
-        return session
-
-
-class ComingAndGoing(SystemdTest):
+class ComingAndGoing(unittest.TestCase):
     def test_a_message_to_either_name_starts_it_and_idleness_ends_it(self):
-        session = self.session(HARBWELL_IDLE_EXIT="1")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="1"))
         for service in (SERVICE, PASSWORD_SERVICE):
             with self.subTest(service):
                 self.assertEqual(session.unit_property("ActiveState"), "inactive")
@@ -38,15 +31,16 @@ class ComingAndGoing(SystemdTest):
         self.assertEqual(session.unit_property("ActiveState", TIMER), "active", "nothing brings it back")
 
     def test_an_unreadable_idle_time_is_the_default(self):
-        session = self.session(HARBWELL_IDLE_EXIT="soon")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="soon"))
         with session.client() as client:
             client.call(SET_VALUE, domain="MetaInfo", key="k", value=1)
-        self.assertIn("HARBWELL_IDLE_EXIT is not a number of seconds; using 30.", session.log_text())
+        log = (session.folder / "log" / "agent.log").read_text(errors="replace")
+        self.assertIn("HARBWELL_IDLE_EXIT is not a number of seconds; using 30.", log)
 
 
-class BroughtBack(SystemdTest):
+class BroughtBack(unittest.TestCase):
     def test_the_timer_starts_it_when_its_time_has_come(self):
-        session = self.session(HARBWELL_IDLE_EXIT="0")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0"))
         with session.client() as client:
             client.add(DoNotCheckPassword=True)
         # As a date, as a date that is almost too near for one, and as a delay.
@@ -65,9 +59,9 @@ class BroughtBack(SystemdTest):
                 self.assertLess(started, date + 2)
 
 
-class NothingIsLost(SystemdTest):
+class NothingIsLost(unittest.TestCase):
     def test_stop_and_restart_in_the_middle_of_requests(self):
-        session = self.session(HARBWELL_IDLE_EXIT="0")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0"))
         with NameOwner(session.address) as owner, Writer(session.client()) as writer:
             owner.wait(True)
             for method in ("StopUnit", "RestartUnit") * 5:
@@ -79,7 +73,7 @@ class NothingIsLost(SystemdTest):
             self.assertEqual(writer.lost(client), {})
 
     def test_a_thousand_messages_across_twenty_idle_exits(self):
-        session = self.session(HARBWELL_IDLE_EXIT="0.2")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0.2"))
         rng = random.Random(20260211)
         answered = 0
         with session.client() as client, NameOwner(session.address) as owner:

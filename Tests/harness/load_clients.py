@@ -193,12 +193,10 @@ class Mixer:
     def unknown(self):
         self.ask("unknown", is_refusal, self.rng.choice((UNKNOWN_COMMAND, 0, 2**40, None)))
 
-    def set_value(self, name="set", command=SET_VALUE):
+    def set_value(self):
+        name, command = self.rng.choices((("set", SET_VALUE), ("set quietly", SET_VALUE_QUIETLY)), (3, 2))[0]
         self.value = (self.value or 0) + 1
         self.ask(name, is_success, command, domain="MetaInfo", key=self.key, value=self.value)
-
-    def set_quietly(self):
-        self.set_value("set quietly", SET_VALUE_QUIETLY)
 
     def set_nothing(self):
         self.ask("set nothing", is_refusal, SET_VALUE, domain="Nowhere", key=self.key, value=1)
@@ -262,7 +260,7 @@ class Mixer:
                  GET_BREADCRUMB, **signed_in, identifier=self.key)
 
     # The server is written in Python: it can be asked for less than the agent.
-    KINDS = ((ping, 20), (unknown, 10), (set_value, 12), (set_nothing, 6), (set_quietly, 8), (contents, 6), (names, 8),
+    KINDS = ((ping, 20), (unknown, 10), (set_value, 20), (set_nothing, 6), (contents, 6), (names, 8),
              (status, 6), (check, 8), (certificate, 4), (record, 4), (info, 4), (find_cached, 8), (add, 2), (forget, 2),
              (verify, 1), (find, 1), (breadcrumb, 1))
 

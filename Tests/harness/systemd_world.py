@@ -162,7 +162,7 @@ def run_inside(program: list[str]) -> int:
         return status
 
 
-class UserSession:
+class UserSession(contextlib.AbstractContextManager):
     """The bus and the service manager of the user, as seen by a program inside. The agent's settings are its own."""
 
     def __init__(self, **agent_environment: str):
@@ -174,7 +174,7 @@ class UserSession:
         wait_until(self.manager_answers, 20, "the service manager is not on the bus")
         self.configure_agent(agent_environment)
 
-    def close(self):
+    def __exit__(self, *_):
         self.call("StopUnit", "ss", (UNIT, "replace"))
         self.wait_for_state("inactive")
         self.connection.close()
@@ -213,9 +213,6 @@ class UserSession:
         with self.connection.filter(rule, bufsize=1000) as changes:
             while self.unit_property("ActiveState") != state:
                 self.connection.recv_until_filtered(changes, timeout=30)
-
-    def log_text(self) -> str:
-        return (self.folder / "log" / "agent.log").read_text(errors="replace")
 
     def client(self) -> Client:
         return Client(self.address)

@@ -144,11 +144,8 @@ class Client(contextlib.AbstractContextManager):
     def verify(self, password: str = PASSWORD, **more):
         return self.call(VERIFY, VeltoID=ACCOUNT, hashedpassword=hashed(password), **more)
 
-    def close(self):
-        self.connection.close()
-
     def __exit__(self, *_):
-        self.close()
+        self.connection.close()
 
 
 class NameOwner(contextlib.AbstractContextManager):
@@ -196,10 +193,8 @@ class Bus:
         assert self.process.stdout.readline(), "the bus did not start"
 
     def stop(self):
-        self.process.terminate()
-        self.process.wait()
-        self.process.stdout.close()
-        self.log.close()
+        with self.process, self.log:
+            self.process.terminate()
 
 
 class World(contextlib.AbstractContextManager):
@@ -294,6 +289,3 @@ def references(contents: dict) -> set:
     """The items of the keychain that a database refers to."""
     holders = [*contents["Accounts"].values(), *contents["AuthCertificates"].values()]
     return {holder[key] for holder in holders for key in REFERENCES if key in holder}
-
-
-__all__ = [name for name in dir() if not name.startswith("_")]
