@@ -133,7 +133,7 @@ def bus_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
     with programs.world(server=False) as world:
         def load(*arguments) -> tuple[float, float]:
             output = programs.run("bus_load", *arguments, SERVICE, MINIMAL,
-                                  environment={"DBUS_SESSION_BUS_ADDRESS": world.bus.address})
+                                  environment={"DBUS_SESSION_BUS_ADDRESS": world.address})
             result = medians(output)
             return result[SERVICE], result[MINIMAL]
 

@@ -12,9 +12,10 @@ import unittest
 
 from harness.world import (ACCOUNT, ADD, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD,
                            PASSWORD_SERVICE, PING, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE,
-                           UPDATE_LINKED_IDENTITY, VERIFY, BusError, NameOwner, World, agent_program, busctl_send,
-                           execute, hashed)
+                           UPDATE_LINKED_IDENTITY, VERIFY, BusError, NameOwner, World, busctl_send, execute,
+                           hashed)
 
+PROGRAM = os.environ["VELTOID_AGENT"]
 ENGINE = "HWIdentityErrorDomain"
 DONE, REFUSED = {"success": True}, {"success": False}
 
@@ -27,7 +28,7 @@ def outcome(reply: dict):
 class WholeJob(unittest.TestCase):
     def test_the_bus_tool_alone_can_do_the_whole_job(self):
         with World() as world:
-            send = functools.partial(busctl_send, world.bus.address)
+            send = functools.partial(busctl_send, world.address)
             self.assertEqual(send(command=PING), DONE)
             added = send(command=ADD, VeltoID="Jane.Roe@Example.com", hashedpassword=hashed(PASSWORD))
             self.assertTrue(added["success"])
@@ -214,7 +215,7 @@ class BadRequests(unittest.TestCase):
             # The agent serves its own user and root; here it runs as root, so another user is a stranger.
             stranger = "setpriv", "--reuid=65534", "--regid=65534", "--clear-groups"
             with world.running_agent(), self.assertRaises(subprocess.CalledProcessError) as refused:
-                busctl_send(world.bus.address, command=PING, prefix=stranger)
+                busctl_send(world.address, command=PING, prefix=stranger)
             self.assertIn("Access denied", refused.exception.stderr)
 
 
@@ -311,8 +312,8 @@ class Process(unittest.TestCase):
 
     def test_without_the_authentication_service_leaks_mode_answers_under_no_name(self):
         with World(server=False) as world:
-            with NameOwner(world.bus.address, PASSWORD_SERVICE) as owner, \
-                    subprocess.Popen([agent_program(), "--leaks", "--checkpassword"], env=world.environment) as agent:
+            with NameOwner(world.address, PASSWORD_SERVICE) as owner, \
+                    subprocess.Popen([PROGRAM, "--leaks", "--checkpassword"], env=world.environment) as agent:
                 self.addCleanup(agent.kill)
                 owner.wait(True)
                 with world.client(PASSWORD_SERVICE) as named:
@@ -324,9 +325,9 @@ class Process(unittest.TestCase):
                 self.assertEqual(agent.wait(timeout=20), 0)
 
     def test_an_unknown_option_prints_the_usage(self):
-        run = subprocess.run([agent_program(), "-x"], capture_output=True, text=True, check=False)
+        run = subprocess.run([PROGRAM, "-x"], capture_output=True, text=True, check=False)
         self.assertEqual((run.returncode, run.stdout),
-                         (255, f"{agent_program()} : [ --checkpassword ] [ --authentication ]\n"))
+                         (255, f"{PROGRAM} : [ --checkpassword ] [ --authentication ]\n"))
         self.assertIn("Got an unexpected argument; ch = 63 index=2", run.stderr)
 
 

@@ -62,7 +62,7 @@ def put_under_load(world: World, agent: int, seconds: float) -> Load:
     calm = begin + TIME_TO_SETTLE
     rush = calm + seconds * CALM_SHARE
     timetable = Timetable(begin, calm, rush, rush + seconds)
-    address = world.bus.address
+    address = world.address
     with concurrent.futures.ProcessPoolExecutor(CLIENTS, multiprocessing.get_context("fork")) as pool:
         clients = [pool.submit(mix, number, address, agent, timetable) for number in range(CLIENTS - 2)]
         clients += [pool.submit(client, address, timetable) for client in (wait_for_certificate, flood)]
@@ -137,7 +137,7 @@ class Turns(unittest.TestCase):
     def test_who_asks_once_does_not_wait_for_who_asks_ahead(self):
         with World(server=False) as world, contextlib.ExitStack() as stack:
             agent = world.start_agent()
-            ahead, other = (stack.enter_context(Conversation(world.bus.address)) for _ in range(2))
+            ahead, other = (stack.enter_context(Conversation(world.address)) for _ in range(2))
             for client in (ahead, other):
                 client.time_ping()
             agent.send_signal(signal.SIGSTOP)
@@ -157,7 +157,7 @@ class OneAccount(unittest.TestCase):
     def test_adding_and_forgetting_at_the_same_time_leaves_no_loose_ends(self):
         with World(server=False) as world, contextlib.ExitStack() as stack:
             world.start_agent()
-            clients = [stack.enter_context(Conversation(world.bus.address)) for _ in range(QUARRELLERS)]
+            clients = [stack.enter_context(Conversation(world.address)) for _ in range(QUARRELLERS)]
             for _ in range(QUARRELS):
                 for number, client in enumerate(clients):
                     for command in (ADD, FORGET, ADD) if number % 2 else (FORGET, ADD, FORGET):

@@ -59,7 +59,7 @@ class PlainBus(unittest.TestCase):
         for environment in ({}, inherited):
             environment["HARBWELL_IDLE_EXIT"] = "0.05"
             with self.subTest(environment), World(server=False, environment=environment) as world, \
-                    NameOwner(world.bus.address) as owner:
+                    NameOwner(world.address) as owner:
                 first = world.agent_pid()
                 owner.wait(True)
                 with self.assertRaises(TimeoutError):
@@ -70,7 +70,7 @@ class PlainBus(unittest.TestCase):
         ends = [lambda client: os.kill(client.call(STATUS)["status"]["pid"], signal.SIGTERM),
                 lambda client: self.assertRaises(BusError, client.call, TERMINATE),
                 lambda client: client.call(STATUS, options={"VeltoIDAuthenticationStatusTerminateServer": True})]
-        with World(server=False) as world, NameOwner(world.bus.address) as owner:
+        with World(server=False) as world, NameOwner(world.address) as owner:
             with Writer(world.client(), "one") as one, Writer(world.client(), "other") as other:
                 for end in ends * 10:
                     one.wait_for(10)
@@ -98,7 +98,7 @@ class PlainBus(unittest.TestCase):
             self.assertEqual((database["MetaInfo"]["k"], [*database["Accounts"]]), (1, [ACCOUNT]))
 
     def test_the_next_agent_waits_for_what_the_one_before_still_stores(self):
-        with World() as world, NameOwner(world.bus.address) as owner, world.client() as client, \
+        with World() as world, NameOwner(world.address) as owner, world.client() as client, \
                 ThreadPoolExecutor() as pool:
             world.server.next("authenticate", delay=1)
             adding = pool.submit(client.add)

@@ -112,10 +112,8 @@ class Conversation(Client):
 
     def time_ping(self) -> float:
         """Microseconds from the request to its reply, with nothing else under way."""
-        serial, data = self.serialised(PING)
-        self.awaited.append((serial, "ping", is_success))
         start = time.perf_counter()
-        self.connection.sock.sendall(data)
+        self.ask("ping", is_success, PING)
         self.take()
         return (time.perf_counter() - start) * 1e6
 

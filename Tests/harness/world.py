@@ -43,9 +43,7 @@ OTHER_PASSWORD = "battery staple"
 REFERENCES = ("HashedPasswordRef", "CertificateReference", "CertificatePrivateKeyReference",
               "IntermediateCertificateReference")
 
-BUS_CONFIGURATION = """<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN"
- "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">
-<busconfig>
+BUS_CONFIGURATION = """<busconfig>
   <type>session</type>
   <listen>{listen}</listen>
   <auth>EXTERNAL</auth>
@@ -64,10 +62,6 @@ BUS_CONFIGURATION = """<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-Bus Bus
 
 def hashed(password: str) -> str:
     return hashlib.sha256(password.encode()).hexdigest()
-
-
-def agent_program() -> str:
-    return os.environ["VELTOID_AGENT"]
 
 
 def variant(value):
@@ -176,38 +170,17 @@ def complaint_of_a_sanitizer(log: str) -> str | None:
     return mark and log[max(mark.start() - 100, 0):][:4000]
 
 
-class Bus:
-    """A private message bus that can start the agent."""
-
-    def __init__(self, folder: pathlib.Path, address: str, environment: dict[str, str], agent: list[str]):
-        self.address = address
-        services = folder / "services"
-        services.mkdir()
-        for name in (SERVICE, PASSWORD_SERVICE):
-            (services / f"{name}.service").write_text(f"[D-BUS Service]\nName={name}\nExec={' '.join(agent)}\n")
-        (folder / "bus.conf").write_text(BUS_CONFIGURATION.format(listen=address, services=services))
-        self.log = open(folder / "agent.log", "ab")
-        self.process = subprocess.Popen(
-            ["dbus-daemon", f"--config-file={folder}/bus.conf", "--nofork", "--print-address"],
-            env=environment, stdout=subprocess.PIPE, stderr=self.log)
-        assert self.process.stdout.readline(), "the bus did not start"
-
-    def stop(self):
-        with self.process, self.log:
-            self.process.terminate()
-
-
 class World(contextlib.AbstractContextManager):
     """Bus, identity server and agent."""
 
     def __init__(self, *agent_arguments: str, server: bool = True, environment: dict[str, str] | None = None):
         self.folder = pathlib.Path(tempfile.mkdtemp(prefix="veltoid-"))
         self.server = IdentityServer(self.folder / "server").start() if server else None
-        address = f"unix:path={self.folder}/bus"
+        self.address = f"unix:path={self.folder}/bus"
         self.environment = {**os.environ, "XDG_STATE_HOME": str(self.folder / "state"),
                             "XDG_RUNTIME_DIR": str(self.folder), "XDG_CONFIG_HOME": str(self.folder / "config"),
-                            "DBUS_SESSION_BUS_ADDRESS": address, **(environment or {})}
-        self.command = [agent_program(), "--authentication", "--checkpassword", *agent_arguments]
+                            "DBUS_SESSION_BUS_ADDRESS": self.address, **(environment or {})}
+        self.command = [os.environ["VELTOID_AGENT"], "--authentication", "--checkpassword", *agent_arguments]
         if self.server:
             self.environment["SSL_CERT_FILE"] = self.server.authority
             # It is also the authority that client certificates are evaluated against.
@@ -215,13 +188,27 @@ class World(contextlib.AbstractContextManager):
             configuration.mkdir(parents=True)
             shutil.copy(self.server.authority, configuration / "identity-authority.pem")
             self.command.append(f"ServerURL={self.server.url}")
-        self.bus = Bus(self.folder, address, self.environment, self.command)
+        self.log = open(self.folder / "agent.log", "ab")
+        self.start_bus()
         self.agent: subprocess.Popen | None = None
+
+    def start_bus(self):
+        """A bus that can start the agent."""
+        services = self.folder / "services"
+        services.mkdir()
+        for name in (SERVICE, PASSWORD_SERVICE):
+            (services / f"{name}.service").write_text(f"[D-BUS Service]\nName={name}\nExec={' '.join(self.command)}\n")
+        (self.folder / "bus.conf").write_text(BUS_CONFIGURATION.format(listen=self.address, services=services))
+        self.bus = subprocess.Popen(
+            ["dbus-daemon", f"--config-file={self.folder}/bus.conf", "--nofork", "--print-address"],
+            env=self.environment, stdout=subprocess.PIPE, stderr=self.log)
+        assert self.bus.stdout.readline(), "the bus did not start"
 
     def __exit__(self, *_):
         self.stop_agent()
         self.end_agent_of_the_bus()
-        self.bus.stop()
+        with self.bus, self.log:
+            self.bus.terminate()
         if self.server:
             self.server.stop()
         complaint = complaint_of_a_sanitizer(self.log_text())
@@ -229,13 +216,13 @@ class World(contextlib.AbstractContextManager):
         assert not complaint, complaint
 
     def client(self, service: str = SERVICE, starts_agent: bool = True) -> Client:
-        return Client(self.bus.address, service, starts_agent)
+        return Client(self.address, service, starts_agent)
 
     def start_agent(self) -> subprocess.Popen:
         """By hand; returns when it answers. The bus may need a moment to see that the one before is gone."""
-        with NameOwner(self.bus.address) as owner:
+        with NameOwner(self.address) as owner:
             owner.wait(False)
-            self.agent = subprocess.Popen(self.command, stdout=subprocess.DEVNULL, stderr=self.bus.log,
+            self.agent = subprocess.Popen(self.command, stdout=subprocess.DEVNULL, stderr=self.log,
                                           env=self.environment)
             owner.wait(True)
         return self.agent
@@ -264,7 +251,7 @@ class World(contextlib.AbstractContextManager):
 
     def end_agent_of_the_bus(self):
         """Ends the agent that the bus has started, if any, and returns when it is gone: it writes files on its way."""
-        with contextlib.closing(open_dbus_connection(bus=self.bus.address)) as connection:
+        with open_dbus_connection(bus=self.address) as connection:
             try:
                 process = os.pidfd_open(connection.bus_proxy.GetConnectionUnixProcessID(SERVICE)[0])
             except (BusError, ProcessLookupError):
