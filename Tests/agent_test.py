@@ -29,7 +29,7 @@ class WholeJob(unittest.TestCase):
     def test_the_bus_tool_alone_can_do_the_whole_job(self):
         with World() as world:
             send = functools.partial(busctl_send, world.address)
-            self.assertEqual(send(command=PING), DONE)
+            self.assertEqual(repr(send(command=PING)), repr(DONE), "a Boolean, and nothing else")
             added = send(command=ADD, VeltoID="Jane.Roe@Example.com", hashedpassword=hashed(PASSWORD))
             self.assertTrue(added["success"])
             self.assertEqual(added["accountinfo"]["encDsId"], added["encDsId"])

@@ -140,13 +140,9 @@ class Issuance(AgentCase):
                 self.assertEqual(self.stored(), (0, 0))
 
     def test_certificates_are_taken_as_they_come(self):
-        for name, settings in [("of another authority", {"wrongIntermediate": True}),
-                               ("expired yesterday", {"certificateLifetime": -DAY}),
-                               ("expired in the last century", {"certificateLifetime": -1e12}),
-                               ("ends now", {"certificateLifetime": 0}),
-                               ("never ends", {"certificateLifetime": 1e12}),
-                               ("date as text", {"expiresAsText": True})]:
-            with self.case(name, **settings):
+        for settings in [{"wrongIntermediate": True}, {"expiresAsText": True}, {"certificateLifetime": -DAY},
+                         {"certificateLifetime": -1e12}, {"certificateLifetime": 0}, {"certificateLifetime": 1e12}]:
+            with self.case(str(settings), **settings):
                 self.assertTrue(self.add_with_certificate())
                 self.assertEqual(self.stored(), (1, 2))
                 entry = self.entry()
