@@ -20,7 +20,6 @@ from unittest import mock
 
 from harness.world import ACCOUNT, PASSWORD, STATUS, World, hashed, openssl, wait_until
 
-
 PROGRAM = os.environ["VELTOID_CLIENT"]
 
 
@@ -35,8 +34,9 @@ class CommandLine(unittest.TestCase):
     def setUpClass(cls):
         cls.world = cls.enterClassContext(World())
 
-    def run_client(self, *arguments, stdin="", text=True, **more):
-        return subprocess.run([PROGRAM, *arguments], input=stdin, text=text, capture_output=True,
+    def run_client(self, *arguments, stdin="", **more):
+        """What the client prints is a text if it is given one."""
+        return subprocess.run([PROGRAM, *arguments], input=stdin, text=isinstance(stdin, str), capture_output=True,
                               env=self.world.environment, check=False, timeout=60, **more)
 
     def run_table(self, cases):
@@ -212,7 +212,7 @@ class CommandLine(unittest.TestCase):
         self.assertEqual(json.loads(self.run_client("certificate", ACCOUNT, "--chain", "--json").stdout)
                          ["certificate"]["PEM"], chain)
 
-        record = self.run_client("certificate", ACCOUNT, "--validation-record", stdin=b"", text=False).stdout
+        record = self.run_client("certificate", ACCOUNT, "--validation-record", stdin=b"").stdout
         file.write_bytes(record)
         self.assertIn(ACCOUNT.encode(), openssl("cms", "-verify", "-inform", "DER", "-in", file, "-purpose", "any",
                                                 "-CAfile", self.world.server.authority))
@@ -222,15 +222,14 @@ class CommandLine(unittest.TestCase):
         self.add_account("--certificate")
         folder = self.new_folder()
         secret = "grüße 密码"
-        pem, pkcs12, unprotected, piped = (folder / name for name in ("pem", "pkcs12", "unprotected", "piped"))
+        pem, pkcs12, unprotected = (folder / name for name in ("pem", "pkcs12", "unprotected"))
         export = ["certificate", "export", ACCOUNT]
         for arguments, stdin in [(["--pem", pem], ""), (["--pkcs12", pkcs12, "--password-stdin"], secret + "\n"),
                                  (["--pkcs12", unprotected, "--no-password"], "")]:
             run = self.run_client(*export, *arguments, stdin=stdin, umask=0)
             self.assertEqual(run.returncode, 0, run.stderr)
             self.assertEqual(stat.S_IMODE(arguments[1].stat().st_mode), 0o600)
-        piped.write_text(self.run_client(*export, "--pem", "-").stdout)
-        self.assertEqual(pem.read_text(), piped.read_text())
+        self.assertEqual(self.run_client(*export, "--pem", "-").stdout, pem.read_text())
         self.assertEqual(pem.read_text().count("BEGIN"), 3)
         self.run_table([([*export, "--pkcs12", folder / "f", "--password-stdin"], "\n", 1, "there is no password")])
 
@@ -316,7 +315,7 @@ class CommandLine(unittest.TestCase):
             (["breadcrumb", "get", *own], "wrong", 1, "password are incorrect"),
             (["breadcrumb", "set", *own, "--input", folder / "none"], PASSWORD, 1, "No such file")])
         self.assertEqual(fetched.read_bytes(), data)
-        piped = self.run_client("breadcrumb", "get", *own, stdin=PASSWORD.encode(), text=False)
+        piped = self.run_client("breadcrumb", "get", *own, stdin=PASSWORD.encode())
         self.assertEqual(piped.stdout, data)
         status, shown = self.at_terminal("breadcrumb", "get", ACCOUNT, "key", dialogue=[(b"Password", PASSWORD)])
         self.assertEqual((status, data.hex().encode() in shown), (0, True), shown)
