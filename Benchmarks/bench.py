@@ -28,9 +28,9 @@ from collections.abc import Iterator
 from dataclasses import dataclass
 
 ROOT = pathlib.Path(__file__).resolve().parent.parent
-sys.path[:0] = [str(ROOT / "Tests" / "harness"), str(ROOT / "Tests")]
-from world import (ACCOUNT, ADD, INFO, LIST, PASSWORD, PING, SERVICE, STATUS, Client, IdentityServer,  # noqa: E402
-                     World, hashed)
+sys.path.insert(0, str(ROOT / "Tests"))
+from harness.world import (ACCOUNT, ADD, INFO, LIST, PASSWORD, PING, SERVICE, STATUS, Client,  # noqa: E402
+                           IdentityServer, World, hashed)
 from load_test import CLIENTS as LOAD_CLIENTS, ping_times  # noqa: E402
 from jeepney import message_bus  # noqa: E402
 from jeepney.io.blocking import Proxy  # noqa: E402
@@ -133,7 +133,7 @@ def bus_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
     with programs.world(server=False) as world:
         def load(*arguments) -> tuple[float, float]:
             output = programs.run("bus_load", *arguments, SERVICE, MINIMAL,
-                                  environment={"DBUS_SESSION_BUS_ADDRESS": world.bus.address})
+                                  environment={"DBUS_SESSION_BUS_ADDRESS": world.address})
             result = medians(output)
             return result[SERVICE], result[MINIMAL]
 

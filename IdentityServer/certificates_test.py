@@ -5,18 +5,12 @@ Run like `identity_server_test.py`.
 
 from __future__ import annotations
 
-import contextlib
-import hashlib
-import http.client
 import ssl
-import subprocess
-import sys
 import unittest
 import xmlrpc.client
 from datetime import datetime, timedelta
 from pathlib import Path
 from typing import Any
-from urllib.parse import urlsplit
 
 from cryptography import x509
 from cryptography.hazmat.primitives import hashes, serialization
@@ -24,11 +18,10 @@ from cryptography.hazmat.primitives.asymmetric import ec, rsa
 from cryptography.x509.name import _ASN1Type as StringType
 from cryptography.x509.oid import NameOID
 
-sys.path.insert(0, str(Path(__file__).resolve().parent))
-
-from control_client import IdentityServer  # noqa: E402
-from server_case import (JANE, SIGN_IN, TIMEOUT, ServerTest, call, directory, fault_of, server,  # noqa: E402
-                         setUpModule)
+from control_client import IdentityServer
+from openssl_program import openssl
+from server_case import (JANE, JOHN, JOHN_HASH, SIGN_IN, ServerTest, call, directory, exchange, fault_of, server,
+                         setUpModule, signed_in)
 
 KEY = rsa.generate_private_key(65537, 2048)
 KEY_TEXT = KEY.private_bytes(serialization.Encoding.PEM, serialization.PrivateFormat.PKCS8,
@@ -47,35 +40,19 @@ def csr(subject: Any = GOOD_SUBJECT, key: Any = KEY, kind: StringType = StringTy
     return request.public_bytes(serialization.Encoding.PEM).decode()
 
 
-def openssl(*arguments: str, text: str = "") -> str:
-    """What the program prints; AssertionError with its complaint when it fails."""
-    done = subprocess.run(["openssl", *arguments], input=text, capture_output=True, text=True, timeout=TIMEOUT)
-    if done.returncode != 0:
-        raise AssertionError(done.stdout + done.stderr)
-    return done.stdout
-
-
-def verify(certificate: str, authority: str = "", intermediate: str = "") -> None:
-    openssl("verify", "-purpose", "sslclient", "-x509_strict", "-CAfile", authority or server.authority,
-            "-untrusted", intermediate or server.intermediate, text=certificate)
+def verify(certificate: str, intermediate: str = "") -> None:
+    openssl("verify", "-purpose", "sslclient", "-x509_strict", "-CAfile", server.authority,
+            "-untrusted", intermediate or server.intermediate, stdin=certificate)
 
 
 class CertificateTest(ServerTest):
     def setUp(self) -> None:
         super().setUp()
-        self.enc_ds_id = call("authenticate", SIGN_IN)["encDsId"]
-        self.owner = self.session | {"encDsId": self.enc_ds_id}
         self.order = self.owner | {"CSR": csr(), "RequestedCertificateLifetimeInSeconds": WEEK}
 
     def issued(self, **settings: Any) -> dict[str, Any]:
         server.settings(issuance="at-once", **settings)
         return call("createCert", self.order)["dsCert"]
-
-    def john(self) -> dict[str, Any]:
-        """The session of another account."""
-        password_hash = hashlib.sha256(b"battery staple").hexdigest()
-        reply = call("authenticate", {"veltoConnect": "john.doe@example.com", "pwdHash": password_hash})
-        return {"dsSession": reply["dsSession"], "encDsId": reply["encDsId"]}
 
 
 class RequestTest(CertificateTest):
@@ -84,7 +61,7 @@ class RequestTest(CertificateTest):
         reply = self.issued()
         certificate = reply["Certificate"]
         verify(certificate)
-        read = openssl("x509", "-noout", "-serial", "-text", text=certificate)
+        read = openssl("x509", "-noout", "-serial", "-text", stdin=certificate)
         self.assertIn(f"serial={reply['SerialNumber']}\n", read)
         self.assertRegex(read, r"Key Usage: critical\s+Digital Signature, Key Encipherment\n")
         self.assertRegex(read, r"Extended Key Usage: \s+TLS Web Client Authentication\n")
@@ -103,13 +80,12 @@ class RequestTest(CertificateTest):
 
     def test_a_request_of_another_program_is_understood(self) -> None:
         server.accounts({"name": PLAIN_NAME, "pwdHash": SIGN_IN["pwdHash"]})
-        reply = call("authenticate", SIGN_IN | {"veltoConnect": PLAIN_NAME})
+        owner = signed_in(PLAIN_NAME)
         made = openssl("req", "-new", "-newkey", "rsa:3072", "-nodes", "-keyout", "/dev/null", "-config", "/dev/stdin",
-                       text="[req]\nprompt=no\ndistinguished_name=n\nstring_mask=default\n"
-                            f"[n]\nCN={PLAIN_NAME}\nC=US\nO=Velto, Inc.\n")
-        order = self.order | {"CSR": made, "dsSession": reply["dsSession"], "encDsId": reply["encDsId"]}
-        verify(call("createCert", order)["dsCert"]["Certificate"])
-        self.assertEqual(server.certificates(PLAIN_NAME)[-1]["encDsId"], reply["encDsId"])
+                       stdin="[req]\nprompt=no\ndistinguished_name=n\nstring_mask=default\n"
+                             f"[n]\nCN={PLAIN_NAME}\nC=US\nO=Velto, Inc.\n")
+        verify(call("createCert", self.order | owner | {"CSR": made})["dsCert"]["Certificate"])
+        self.assertEqual(server.certificates(PLAIN_NAME)[-1]["encDsId"], owner["encDsId"])
 
     def test_requests_that_are_wrong_are_refused(self) -> None:
         count = len(server.certificates())
@@ -117,7 +93,7 @@ class RequestTest(CertificateTest):
         signed = x509.load_pem_x509_csr(csr().encode()).public_bytes(serialization.Encoding.DER)
         tampered = x509.load_der_x509_csr(signed[:-1] + bytes((signed[-1] ^ 1,)))
         forged = tampered.public_bytes(serialization.Encoding.PEM).decode()
-        other_name = ((NAME, "john.doe@example.com"), *GOOD_SUBJECT[1:])
+        other_name = ((NAME, JOHN), *GOOD_SUBJECT[1:])
         for label, change in (
                 ("no session", {"dsSession": "x"}), ("other account's id", {"encDsId": "000100-05-0"}),
                 ("no request", {"CSR": ""}), ("no PEM", {"CSR": "text"}), ("wrong signature", {"CSR": forged}),
@@ -171,7 +147,7 @@ class IssuanceTest(CertificateTest):
         self.assertEqual(fault_of("fetchCert", claim), PENDING)
         server.settings(issuance="token")
         for method in ("fetchCert", "downloadCertComplete"):
-            self.assertEqual(fault_of(method, claim | self.john()), -1)
+            self.assertEqual(fault_of(method, claim | signed_in(JOHN, JOHN_HASH)), -1)
         first = call("fetchCert", claim)
         self.assertEqual(call("fetchCert", claim), first)
         self.assertEqual(call("downloadCertComplete", claim), {})
@@ -197,7 +173,7 @@ class IssuanceTest(CertificateTest):
         (entry,) = call("fetchCert", claim)["dsCert"]
         self.assertRegex(entry["Expires"], r"^\d{4}-\d\d-\d\dT\d\d:\d\d:\d\dZ$")
         self.assertEqual(server.certificates()[-1], {
-            "serial": entry["SerialNumber"], "account": JANE, "encDsId": self.enc_ds_id, "revoked": False,
+            "serial": entry["SerialNumber"], "account": JANE, "encDsId": self.owner["encDsId"], "revoked": False,
             "notAfter": entry["Expires"]})
         other_key = self.issued(wrongKey=True)["Certificate"]
         verify(other_key)
@@ -222,7 +198,7 @@ class StateTest(CertificateTest):
 
     def test_validity_is_told_to_who_names_a_certificate(self) -> None:
         good, expired = (self.issued(certificateLifetime=life)["SerialNumber"] for life in (None, -5))
-        john = self.john()
+        john = signed_in(JOHN, JOHN_HASH)
         for label, serial, expected in (("good", good, (True, True)), ("expired", expired, (False, False)),
                                         ("unknown", "00", (False, False))):
             with self.subTest(label):
@@ -246,12 +222,8 @@ class PageTest(CertificateTest):
             file = Path(directory.name) / "client.pem"
             file.write_text(certificate + KEY_TEXT)
             context.load_cert_chain(file)
-        address = urlsplit(server.client_certificate_url)
-        connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=context)
-        with contextlib.closing(connection):
-            connection.request("GET", address.path)
-            response = connection.getresponse()
-            return response.status, response.read().decode()
+        status, text = exchange(None, server.client_certificate_url, "GET", context)
+        return status, text.decode()
 
     def test_the_page_shows_certificates_that_count(self) -> None:
         good = self.issued()
@@ -261,7 +233,7 @@ class PageTest(CertificateTest):
             self.assertEqual(self.get(good["Certificate"], newest), (200, text))
         server.revoke(good["SerialNumber"])
         self.assertEqual(self.get(good["Certificate"])[0], 403)
-        self_made = openssl("req", "-x509", "-key", "/dev/stdin", "-subj", "/CN=self-made", text=KEY_TEXT)
+        self_made = openssl("req", "-x509", "-key", "/dev/stdin", "-subj", "/CN=self-made", stdin=KEY_TEXT)
         expired = self.issued(certificateLifetime=-5)["Certificate"]
         # By TLS 1.2, where the client waits for the verdict; by 1.3 it may be writing when that comes.
         for certificate, reason in (("", "HANDSHAKE_FAILURE"), (expired, "CERTIFICATE_EXPIRED"),
@@ -271,18 +243,13 @@ class PageTest(CertificateTest):
 
 
 class RestartTest(CertificateTest):
-    def test_what_was_issued_stays_verifiable(self) -> None:
-        issued = self.issued()["Certificate"]
-        with IdentityServer(Path(server.authority).parent) as second:
-            verify(issued, second.authority, second.intermediate)
-
     def test_a_root_that_allows_no_intermediate_is_renewed_under_its_key(self) -> None:
         state = Path(directory.name) / "old"
         state.mkdir()
         old = state / "old.pem"
-        key = openssl("ecparam", "-name", "prime256v1", "-genkey", "-noout")
+        key = openssl("ecparam", "-name", "prime256v1", "-genkey", "-noout", stdin="")
         old.write_text(openssl("req", "-x509", "-key", "/dev/stdin", "-subj", "/CN=Velto ID development authority",
-                               "-addext", "basicConstraints=critical,CA:TRUE,pathlen:0", text=key))
+                               "-addext", "basicConstraints=critical,CA:TRUE,pathlen:0", stdin=key))
         (state / "authority-key.pem").write_text(key + old.read_text())
         anchors, intermediates = set(), set()
         for _ in range(2):
@@ -291,7 +258,7 @@ class RestartTest(CertificateTest):
                 intermediates.add(Path(renewed.intermediate).read_text())
                 openssl("verify", "-x509_strict", "-CAfile", renewed.authority, renewed.intermediate)
         self.assertEqual((len(anchors), len(intermediates)), (1, 1))
-        public = {openssl("x509", "-noout", "-pubkey", text=text) for text in (*anchors, old.read_text())}
+        public = {openssl("x509", "-noout", "-pubkey", stdin=text) for text in (*anchors, old.read_text())}
         self.assertEqual(len(public), 1)
         self.assertEqual((state / "intermediate-key.pem").stat().st_mode & 0o777, 0o600)
         (state / "authority-key.pem").unlink()

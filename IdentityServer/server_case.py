@@ -3,10 +3,10 @@
 from __future__ import annotations
 
 import atexit
+import contextlib
 import hashlib
 import http.client
 import ssl
-import sys
 import tempfile
 import unittest
 import xmlrpc.client
@@ -14,13 +14,13 @@ from pathlib import Path
 from typing import Any
 from urllib.parse import urlsplit
 
-sys.path.insert(0, str(Path(__file__).resolve().parent))
-
-from control_client import IdentityServer  # noqa: E402
+from control_client import IdentityServer
 
 PREFIX = "com.velto.dir.idm.web.collaboration.PersonService."
 JANE = "jane.roe@example.com"
 JANE_HASH = hashlib.sha256(b"correct horse").hexdigest()
+JOHN = "john.doe@example.com"
+JOHN_HASH = hashlib.sha256(b"battery staple").hexdigest()
 SIGN_IN = {"veltoConnect": JANE, "pwdHash": JANE_HASH}
 TIMEOUT = 20
 
@@ -37,17 +37,16 @@ def setUpModule() -> None:
     trust = ssl.create_default_context(cafile=server.authority)
 
 
-def exchange(body: bytes | None, url: str = "", verb: str = "POST", **headers: str) -> tuple[int, bytes]:
+def exchange(body: bytes | None, url: str = "", verb: str = "POST", context: ssl.SSLContext | None = None,
+             **headers: str) -> tuple[int, bytes]:
     """One HTTPS request; status and body of the answer."""
     address = urlsplit(url or server.url)
-    connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=trust)
-    try:
+    connection = http.client.HTTPSConnection(address.netloc, timeout=TIMEOUT, context=context or trust)
+    with contextlib.closing(connection):
         fields = {name.replace("_", "-"): value for name, value in headers.items()}
         connection.request(verb, address.path, body, {"Content-Type": "text/xml"} | fields)
         response = connection.getresponse()
         return response.status, response.read()
-    finally:
-        connection.close()
 
 
 def call(method: str, parameters: Any, url: str = "") -> dict[str, Any]:
@@ -56,6 +55,12 @@ def call(method: str, parameters: Any, url: str = "") -> dict[str, Any]:
     if status != 200:
         raise AssertionError(f"{status}: {body!r}")
     return xmlrpc.client.loads(body, use_builtin_types=True)[0][0]
+
+
+def signed_in(name: str = JANE, password_hash: str = JANE_HASH) -> dict[str, str]:
+    """A new session and the id that goes with it, as the calls of an account carry them."""
+    reply = call("authenticate", {"veltoConnect": name, "pwdHash": password_hash})
+    return {key: reply[key] for key in ("dsSession", "encDsId")}
 
 
 def fault_of(method: str, parameters: Any) -> int | None:
@@ -70,5 +75,6 @@ class ServerTest(unittest.TestCase):
     def setUp(self) -> None:
         server.clear_next()
         server.reset_settings()
-        self.session = {"dsSession": call("authenticate", SIGN_IN)["dsSession"]}
+        self.owner = signed_in()
+        self.session = {"dsSession": self.owner["dsSession"]}
         server.clear_received()

@@ -6,36 +6,21 @@ from __future__ import annotations
 import base64
 import contextlib
 import datetime
-import pathlib
 import plistlib
-import sqlite3
-import subprocess
-import sys
 import unittest
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
-from world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB,  # noqa: E402
-                   INFO, OTHER_ACCOUNT, PASSWORD, PING, SET_BREADCRUMB, VERIFY, World, hashed)
+from harness.world import (ACCOUNT, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB, INFO,
+                           OTHER_ACCOUNT, PASSWORD, PING, SET_BREADCRUMB, World, hashed, openssl, references)
 
 KEYS, CERTIFICATES = 1, 2
-REFERENCES = ("CertificateReference", "CertificatePrivateKeyReference", "IntermediateCertificateReference")
 LOOKS = 50  # at something that the agent may be about to change
 DAY = 86_400
-
-
-def openssl(*arguments, stdin: bytes | str = b"") -> bytes:
-    """Fails when the command line does."""
-    stdin = stdin.encode() if isinstance(stdin, str) else stdin
-    run = subprocess.run(["openssl", *map(str, arguments)], input=stdin, capture_output=True, check=False)
-    if run.returncode != 0:
-        raise AssertionError(f"openssl {arguments[0]}: {run.stderr.decode()}")
-    return run.stdout
 
 
 def seconds(moment: datetime.datetime | str) -> float:
     """A date without zone (UTC), or as texts give it, in seconds since 1970."""
     if isinstance(moment, str):
-        moment = datetime.datetime.fromisoformat(moment.removesuffix("Z"))
+        moment = datetime.datetime.fromisoformat(moment)
     return moment.replace(tzinfo=datetime.timezone.utc).timestamp()
 
 
@@ -52,29 +37,21 @@ class AgentCase(unittest.TestCase):
     def case(self, name, account=ACCOUNT, **settings):
         """A fresh agent without accounts, a server with these settings. In the end the account is forgotten, and
         nothing of it may be left in the keychain."""
-        with self.subTest(name):
+        with self.subTest(name), self.world.running_agent() as self.client:
             self.server.clear_received()
             self.server.settings(**settings)
-            self.world.start_agent()
-            self.client = self.world.client()
             try:
                 yield
-                self.client.call(FORGET, VeltoID=account)
-                self.assertEqual(self.items(), {})
-                self.assertTrue(self.client.call(PING)["success"])
             finally:
-                self.client.call(FORGET, VeltoID=account)
-                self.client.close()
-                self.world.stop_agent()
                 self.server.clear_next()
                 self.server.reset_settings()
+                self.client.call(FORGET, VeltoID=account)
+            self.assertEqual(self.world.keychain_items(), {})
+            self.assertTrue(self.client.call(PING)["success"])
 
-    def add(self, account=ACCOUNT, password=PASSWORD, timeout=30, **options):
-        return self.client.call(ADD, timeout, VeltoID=account, hashedpassword=hashed(password), options=options)
-
-    def add_with_certificate(self, timeout=30, **options):
+    def add_with_certificate(self, account=ACCOUNT, timeout=30, **options):
         """The account as the add answers it, None when the add did not come to its end."""
-        return self.add(CreateCSRAsynchronously=False, timeout=timeout, **options).get("accountinfo")
+        return self.client.add(account, timeout=timeout, CreateCSRAsynchronously=False, **options).get("accountinfo")
 
     def database(self):
         return self.client.call(DATABASE)["result"]
@@ -82,25 +59,17 @@ class AgentCase(unittest.TestCase):
     def record(self):
         return self.database()["Accounts"][ACCOUNT]
 
-    def entry(self):
-        return self.database()["AuthCertificates"][self.record()["encDsId"]]
-
-    def items(self):
-        """The keychain's items: class by reference."""
-        file = f"file:{self.world.state_files() / 'keychain.db'}?mode=ro"
-        with contextlib.closing(sqlite3.connect(file, uri=True)) as database:
-            return dict(database.execute("SELECT id, class FROM items"))
+    def entry(self, account=ACCOUNT):
+        database = self.database()
+        return database["AuthCertificates"][database["Accounts"][account]["encDsId"]]
 
     def stored(self):
-        """How many keys and certificates there are. Each is referred to, and each reference leads to one."""
+        """How many keys and certificates there are. Each item is referred to, and each reference leads to one."""
         for _ in range(LOOKS):
-            items, database = self.items(), self.database()
-            holders = [*database["Accounts"].values(), *database["AuthCertificates"].values()]
-            known = {holder[key] for holder in holders for key in REFERENCES if key in holder}
-            owned = {item for item, kind in items.items() if kind in (KEYS, CERTIFICATES)}
-            if owned == known:
+            items, known = self.world.keychain_items(), references(self.database())
+            if items.keys() == known:
                 return tuple(list(items.values()).count(kind) for kind in (KEYS, CERTIFICATES))
-        self.fail(f"items {owned}, references {known}")
+        self.fail(f"items {items}, references {known}")
 
     def verify(self, pem, *purpose):
         openssl("verify", *purpose, "-CAfile", self.server.authority, "-untrusted", self.server.intermediate, stdin=pem)
@@ -112,38 +81,37 @@ class Issuance(AgentCase):
         for account in (ACCOUNT, f"{'x' * 30}@example.com"):
             with self.case(account, account):
                 self.server.accounts({"name": account, "password": PASSWORD})
-                self.assertIn("accountinfo", self.add(account, CreateCSRAsynchronously=False))
+                self.assertIsNotNone(self.add_with_certificate(account))
                 request = self.server.received("createCert")[-1]["parameters"]["CSR"]
                 openssl("req", "-verify", "-noout", stdin=request)
-                self.assertEqual(openssl("req", "-outform", "PEM", stdin=request).decode(), request)
-                text = openssl("req", "-noout", "-text", stdin=request).decode()
+                self.assertEqual(openssl("req", "-outform", "PEM", stdin=request), request)
+                text = openssl("req", "-noout", "-text", stdin=request)
                 for part in (f'Subject: CN = {account}, C = US, O = "Velto, Inc."\n', "Public-Key: (2048 bit)",
                              "X509v3 Key Usage: critical\n                    Digital Signature, Key Encipherment\n",
                              "Signature Algorithm: sha256WithRSAEncryption"):
                     self.assertIn(part, text)
-                database = self.database()
-                entry = database["AuthCertificates"][database["Accounts"][account]["encDsId"]]
+                entry = self.entry(account)
                 self.verify(entry["Certificate"], "-purpose", "sslclient")
-                keys = [openssl(command, "-noout", "-pubkey", stdin=pem) for command, pem in
-                        (("req", request), ("x509", entry["Certificate"]))]
-                self.assertEqual(keys[0], keys[1])
+                self.assertEqual(openssl("req", "-noout", "-pubkey", stdin=request),
+                                 openssl("x509", "-noout", "-pubkey", stdin=entry["Certificate"]))
                 self.assertEqual(self.stored(), (1, 2))
 
     def test_a_renewal_leaves_nothing_of_what_it_replaces(self):
         with self.case("renewal"):
             self.add_with_certificate()
-            first, items = self.entry(), self.items()
+            first, items = self.entry(), self.world.keychain_items()
             self.add_with_certificate()
             self.assertEqual(self.entry()["SerialNumber"], first["SerialNumber"], "there is one already")
             self.add_with_certificate(ForceCertificateCreation=True)
             self.assertNotEqual(self.entry()["SerialNumber"], first["SerialNumber"])
             self.assertEqual(self.stored(), (1, 2))
-            self.assertNotIn(first["CertificateReference"], self.items())
-            self.assertEqual(len(self.items()), len(items))
+            renewed = self.world.keychain_items()
+            self.assertNotIn(first["CertificateReference"], renewed)
+            self.assertEqual(len(renewed), len(items))
 
     def test_the_agent_itself_fetches_what_is_not_there_at_once(self):
         with self.case("polls", issuance="token", pendingPolls=1, pendingAnswer="dsCert", issuanceDelay=1):
-            self.assertIn("accountinfo", self.add(CreateCSRAsynchronously=False, certwaitduration=60, timeout=90))
+            self.assertIsNotNone(self.add_with_certificate(certwaitduration=60, timeout=90))
             self.assertEqual(self.entry()["CertStatus"], "CERT_ISSUED")
             self.verify(self.entry()["Certificate"])
             self.assertNotIn("CertificateToken", self.record())
@@ -172,17 +140,13 @@ class Issuance(AgentCase):
                 self.assertEqual(self.stored(), (0, 0))
 
     def test_certificates_are_taken_as_they_come(self):
-        for name, settings in [("of another authority", {"wrongIntermediate": True}),
-                               ("expired yesterday", {"certificateLifetime": -DAY}),
-                               ("expired in the last century", {"certificateLifetime": -1e12}),
-                               ("ends now", {"certificateLifetime": 0}),
-                               ("never ends", {"certificateLifetime": 1e12}),
-                               ("date as text", {"expiresAsText": True})]:
-            with self.case(name, **settings):
+        for settings in [{"wrongIntermediate": True}, {"expiresAsText": True}, {"certificateLifetime": -DAY},
+                         {"certificateLifetime": -1e12}, {"certificateLifetime": 0}, {"certificateLifetime": 1e12}]:
+            with self.case(str(settings), **settings):
                 self.assertTrue(self.add_with_certificate())
                 self.assertEqual(self.stored(), (1, 2))
                 entry = self.entry()
-                end = openssl("x509", "-noout", "-enddate", "-dateopt", "iso_8601", stdin=entry["Certificate"]).decode()
+                end = openssl("x509", "-noout", "-enddate", "-dateopt", "iso_8601", stdin=entry["Certificate"])
                 expires, made = entry["Expires"]["date"], entry["CreationDate"]["date"]
                 self.assertEqual(expires, seconds(end.strip().removeprefix("notAfter=")))
                 renewal = entry.get("NextRenewalAttempt", {}).get("date")
@@ -265,7 +229,7 @@ class ValidationRecords(AgentCase):
                 ("of openssl, streamed", {}, self.signed(attached, "-stream")),
                 ("of openssl, PSS", {}, self.signed(attached, "-md", "sha512", "-keyopt", "rsa_padding_mode:pss"))]:
             with self.case(name, **settings):
-                self.add()
+                self.client.add()
                 data, next_check = self.ask(changes)
                 content = openssl("cms", "-verify", "-noverify", "-binary", "-inform", "DER", stdin=data)
                 payload = plistlib.loads(content)
@@ -286,7 +250,7 @@ class ValidationRecords(AgentCase):
                 ("of openssl, without certificate", {}, self.signed("-nodetach", "-nocerts")),
                 ("cut off", {}, damaged), ("no identifier", {}, {"VIDVRecordIdentifier": None})]:
             with self.case(name):
-                self.add()
+                self.client.add()
                 self.assertIsNotNone(self.ask()[0])
                 self.server.settings(**settings)
                 self.assertEqual(self.ask(changes), (None, None))
@@ -301,25 +265,15 @@ class People(AgentCase):
         reply = self.client.call(command, criteria={criterion: list(values)})
         return [person["VeltoID"] for person in reply.get("result", [])]
 
-    def test_whom_the_server_found_is_known_afterwards(self):
+    def test_people_and_breadcrumbs_outlive_the_agent(self):
         jane, john = ("email", "jane@roe.example"), ("VeltoID", OTHER_ACCOUNT)
+        mine = {"VeltoID": ACCOUNT, "hashedpassword": hashed(PASSWORD)}
         with self.case("people"):
-            self.add()
+            self.client.add()
             self.assertEqual(self.find(FIND_CACHED, *jane), [])
             self.assertEqual(self.find(FIND, *jane, "nobody@roe.example"), [ACCOUNT])
             self.server.settings(findPersonValidInterval=-1)
             self.assertEqual(self.find(FIND, *john), [OTHER_ACCOUNT])
-            self.world.stop_agent()
-            self.world.start_agent()
-            self.assertEqual(self.find(FIND_CACHED, *jane), [ACCOUNT])
-            self.assertEqual(self.find(FIND_CACHED, *john), [], "the server said that he is not to be remembered")
-            self.assertEqual(self.find(FIND_CACHED, "phone", jane[1]), [])
-            self.assertEqual(self.server.counts()["findPerson"], 2)
-
-    def test_breadcrumbs_come_back_to_whoever_knows_the_password(self):
-        with self.case("breadcrumbs"):
-            self.add()
-            mine = {"VeltoID": ACCOUNT, "hashedpassword": hashed(PASSWORD)}
             for identifier, data in [("a", b"\0"), ("b", bytes(range(256)) * 200), ("a", b"later"), ("ü/ \n", b"x")]:
                 stored = self.client.call(SET_BREADCRUMB, **mine, identifier=identifier, breadcrumb=data)
                 self.assertTrue(stored["success"], stored)
@@ -327,11 +281,15 @@ class People(AgentCase):
                 self.assertEqual(fetched.get("breadcrumb"), data)
             self.world.stop_agent()
             self.world.start_agent()
+            self.assertEqual(self.find(FIND_CACHED, *jane), [ACCOUNT])
+            self.assertEqual(self.find(FIND_CACHED, *john), [], "the server said that he is not to be remembered")
+            self.assertEqual(self.find(FIND_CACHED, "phone", jane[1]), [])
+            self.assertEqual(self.server.counts()["findPerson"], 2)
             self.assertEqual(self.client.call(GET_BREADCRUMB, **mine, identifier="a")["breadcrumb"], b"later")
             self.assertFalse(self.client.call(GET_BREADCRUMB, **mine, identifier="none")["success"])
             refused = self.client.call(GET_BREADCRUMB, **{**mine, "hashedpassword": hashed("wrong")}, identifier="a")
             self.assertEqual((refused["success"], refused["error"]["Code"]), (False, -101))
-            self.assertTrue(self.client.call(VERIFY, **mine)["success"])
+            self.assertTrue(self.client.verify()["success"])
 
 
 if __name__ == "__main__":

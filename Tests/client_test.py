@@ -13,44 +13,31 @@ import shutil
 import ssl
 import stat
 import subprocess
-import pathlib
-import sys
 import time
 import unittest
 import urllib.request
+from unittest import mock
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
-from systemd_world import wait_until  # noqa: E402
-from world import ACCOUNT, PASSWORD, STATUS, World, hashed  # noqa: E402
+from harness.world import ACCOUNT, PASSWORD, STATUS, World, hashed, openssl, wait_until
 
-
-def client_program() -> str:
-    return os.environ["VELTOID_CLIENT"]
+PROGRAM = os.environ["VELTOID_CLIENT"]
 
 
 def keyring_is_permitted() -> bool:
     """Asks the kernel itself: add_key(2) to the user keyring, which is number -4."""
     number = {"x86_64": 248, "aarch64": 217}.get(platform.machine())
-    secret = b"x"
-    return number is not None and ctypes.CDLL(None).syscall(number, b"user", b"veltoid test", secret, len(secret), -4) >= 0
+    return number is not None and ctypes.CDLL(None).syscall(number, b"user", b"veltoid test", b"x", 1, -4) >= 0
 
 
 class CommandLine(unittest.TestCase):
     @classmethod
     def setUpClass(cls):
-        cls.world = World()
+        cls.world = cls.enterClassContext(World())
 
-    @classmethod
-    def tearDownClass(cls):
-        cls.world.__exit__()
-
-    def environment(self):
-        return {**os.environ, **self.world.environment, "DBUS_SESSION_BUS_ADDRESS": self.world.bus.address}
-
-    def run_client(self, *arguments, stdin="", address=None, **more):
-        environment = {**self.environment(), **({"DBUS_SESSION_BUS_ADDRESS": address} if address else {})}
-        return subprocess.run([client_program(), *arguments], input=stdin, text=more.pop("text", True),
-                              capture_output=True, env=environment, check=False, timeout=60, **more)
+    def run_client(self, *arguments, stdin="", **more):
+        """What the client prints is a text if it is given one."""
+        return subprocess.run([PROGRAM, *arguments], input=stdin, text=isinstance(stdin, str), capture_output=True,
+                              env=self.world.environment, check=False, timeout=60, **more)
 
     def run_table(self, cases):
         """Runs (arguments, standard input, status, text that is printed)."""
@@ -64,7 +51,7 @@ class CommandLine(unittest.TestCase):
         """Runs the client at a terminal of its own, answering (prompt, answer); returns status and what was shown."""
         pid, terminal = pty.fork()
         if pid == 0:
-            os.execve(client_program(), ["veltoidctl", *arguments], self.environment())
+            os.execve(PROGRAM, ["veltoidctl", *arguments], self.world.environment)
         shown = b""
         for prompt, answer in dialogue:
             seen = len(shown)
@@ -90,11 +77,8 @@ class CommandLine(unittest.TestCase):
         self.addCleanup(shutil.rmtree, folder)
         return folder
 
-    def openssl(self, *arguments, stdin=""):
-        return subprocess.run(["openssl", *arguments], input=stdin, text=True, capture_output=True, check=True).stdout
-
     def test_an_account_s_life_ends_with_the_right_statuses(self):
-        steps = [
+        self.run_table([
             (["ping"], "", 0, "the agent answers"),
             (["list"], "", 0, "no accounts"),
             (["info", ACCOUNT], "", 1, "no such account on this device (HWIdentityErrorDomain -108)"),
@@ -108,41 +92,35 @@ class CommandLine(unittest.TestCase):
             (["database"], "", 0, "AccessorVersions"),
             (["verify", ACCOUNT, "--password-stdin"], "wrong", 1, "The Velto ID account or password are incorrect."),
             (["status"], "", 0, "PasswordInvalid"),
-            (["forget", ACCOUNT], "", 0, "is forgotten"),
-        ]
-        self.run_table(steps)
+            (["forget", ACCOUNT], "", 0, "is forgotten")])
 
     def test_json_is_the_whole_reply_of_every_command(self):
         for command in (["ping"], ["list"], ["status"], ["database"], ["info", "nobody"], ["forget", "nobody"]):
-            with self.subTest(command):
-                self.assertIn("success", json.loads(self.run_client("--json", *command).stdout))
-                self.assertIn("success", json.loads(self.run_client(*command, "--json").stdout))
+            for arguments in (["--json", *command], [*command, "--json"]):
+                with self.subTest(arguments):
+                    self.assertIn("success", json.loads(self.run_client(*arguments).stdout))
 
     def test_wrong_use_is_explained(self):
-        cases = [
-            ([], "", 2, "A subcommand is required"),
-            (["dance"], "", 2, "subcommand"),
-            (["add"], "", 2, "NAME is required"),
-            (["add", "x", "--password-stdin"], "", 1, "there is no password"),
-            (["add", "x", "--password-stdin", "--hashed-password-stdin"], "", 2, "excludes"),
-            (["--timeout", "0", "ping"], "", 2, "timeout"),
-            (["--service", "no.such.agent", "ping"], "", 3, "not installed on this bus"),
-            (["add", "x", "--no-sign-in", "--certificate"], "", 2, "excludes"),
-            (["certificate"], "", 2, "NAME is required"),
-            (["certificate", "x", "--pem", "--validation-record"], "", 2, "excludes"),
-            (["certificate", "export", "x"], "", 2, "--pem,--pkcs12"),
-            (["certificate", "export", "x", "--pem", "f", "--pkcs12", "f"], "", 2, "--pem,--pkcs12"),
-            (["certificate", "export", "x", "y", "--pem", "f"], "", 2, "excludes"),
-            (["certificate", "export", "x", "--pem", "f", "--no-password"], "", 2, "requires --pkcs12"),
-            (["certificate", "export", "x", "--pkcs12", "f", "--no-password", "--password-stdin"], "", 2, "excludes"),
-            (["certificate", "export", "x", "--pem", "-", "--json"], "", 2, "room for one"),
-            (["find", "email"], "", 2, "VALUE is required"),
-            (["breadcrumb", "get", "x"], "", 2, "KEY is required"),
-            (["breadcrumb", "set", "x", "k", "--password-stdin"], PASSWORD, 2, "cannot both be standard input"),
-            (["breadcrumb", "set", "x", "k", "--password-stdin", "--input", "/dev/null"], PASSWORD, 1, "is empty"),
-        ]
-        self.run_table(cases)
-        self.assertEqual(self.run_client("ping", address="unix:path=/nowhere/bus").returncode, 3)
+        for command, status, said in [
+                ("", 2, "A subcommand is required"), ("dance", 2, "subcommand"), ("--timeout 0 ping", 2, "timeout"),
+                ("--service no.such.agent ping", 3, "not installed on this bus"), ("add", 2, "NAME is required"),
+                ("add x --password-stdin", 1, "there is no password"), ("certificate", 2, "NAME is required"),
+                ("add x --password-stdin --hashed-password-stdin", 2, "excludes"),
+                ("add x --no-sign-in --certificate", 2, "excludes"),
+                ("certificate x --pem --validation-record", 2, "excludes"),
+                ("certificate export x", 2, "--pem,--pkcs12"),
+                ("certificate export x --pem f --pkcs12 f", 2, "--pem,--pkcs12"),
+                ("certificate export x y --pem f", 2, "excludes"),
+                ("certificate export x --pem f --no-password", 2, "requires --pkcs12"),
+                ("certificate export x --pkcs12 f --no-password --password-stdin", 2, "excludes"),
+                ("certificate export x --pem - --json", 2, "room for one"),
+                ("find email", 2, "VALUE is required"), ("breadcrumb get x", 2, "KEY is required")]:
+            self.run_table([(command.split(), "", status, said)])
+        keep = ["breadcrumb", "set", "x", "k", "--password-stdin"]
+        self.run_table([(keep, PASSWORD, 2, "cannot both be standard input"),
+                        ([*keep, "--input", "/dev/null"], PASSWORD, 1, "is empty")])
+        with mock.patch.dict(self.world.environment, DBUS_SESSION_BUS_ADDRESS="unix:path=/nowhere/bus"):
+            self.run_table([(["ping"], "", 3, "")])
 
     def test_the_password_is_asked_for_without_echo(self):
         status, shown = self.at_terminal("verify", ACCOUNT, dialogue=[(b"Password for", PASSWORD)])
@@ -227,37 +205,36 @@ class CommandLine(unittest.TestCase):
                                            "next renewal"])
 
         pem, chain = (self.run_client("certificate", ACCOUNT, form).stdout for form in ("--pem", "--chain"))
-        self.assertIn(serial, self.openssl("x509", "-noout", "-serial", stdin=pem))
+        self.assertIn(serial, openssl("x509", "-noout", "-serial", stdin=pem))
         file = self.new_folder() / "chain.pem"
         file.write_text(chain)
-        self.openssl("verify", "-CAfile", self.world.server.authority, "-untrusted", file, stdin=pem)
+        openssl("verify", "-CAfile", self.world.server.authority, "-untrusted", file, stdin=pem)
         self.assertEqual(json.loads(self.run_client("certificate", ACCOUNT, "--chain", "--json").stdout)
                          ["certificate"]["PEM"], chain)
 
-        record = self.run_client("certificate", ACCOUNT, "--validation-record", stdin=b"", text=False).stdout
+        record = self.run_client("certificate", ACCOUNT, "--validation-record", stdin=b"").stdout
         file.write_bytes(record)
-        self.assertIn(ACCOUNT, self.openssl("cms", "-verify", "-inform", "DER", "-in", file, "-purpose", "any",
-                                            "-CAfile", self.world.server.authority))
+        self.assertIn(ACCOUNT.encode(), openssl("cms", "-verify", "-inform", "DER", "-in", file, "-purpose", "any",
+                                                "-CAfile", self.world.server.authority))
         self.assertEqual(self.at_terminal("certificate", ACCOUNT, "--validation-record")[0], 1)
 
     def test_an_exported_identity_serves_other_programs(self):
         self.add_account("--certificate")
         folder = self.new_folder()
         secret = "grüße 密码"
-        pem, pkcs12, unprotected, piped = (folder / name for name in ("pem", "pkcs12", "unprotected", "piped"))
+        pem, pkcs12, unprotected = (folder / name for name in ("pem", "pkcs12", "unprotected"))
         export = ["certificate", "export", ACCOUNT]
         for arguments, stdin in [(["--pem", pem], ""), (["--pkcs12", pkcs12, "--password-stdin"], secret + "\n"),
                                  (["--pkcs12", unprotected, "--no-password"], "")]:
             run = self.run_client(*export, *arguments, stdin=stdin, umask=0)
             self.assertEqual(run.returncode, 0, run.stderr)
             self.assertEqual(stat.S_IMODE(arguments[1].stat().st_mode), 0o600)
-        piped.write_text(self.run_client(*export, "--pem", "-").stdout)
-        self.assertEqual(pem.read_text(), piped.read_text())
+        self.assertEqual(self.run_client(*export, "--pem", "-").stdout, pem.read_text())
         self.assertEqual(pem.read_text().count("BEGIN"), 3)
         self.run_table([([*export, "--pkcs12", folder / "f", "--password-stdin"], "\n", 1, "there is no password")])
 
         for file, password in ((pkcs12, secret), (unprotected, "")):
-            text = self.openssl("pkcs12", "-in", file, "-passin", "stdin", "-nodes", stdin=password + "\n")
+            text = openssl("pkcs12", "-in", file, "-passin", "stdin", "-nodes", stdin=password + "\n")
             self.assertEqual(text.count("BEGIN"), 3)
             file.write_text(text)
         for file in (pem, pkcs12, unprotected):
@@ -268,7 +245,7 @@ class CommandLine(unittest.TestCase):
                 with urllib.request.urlopen(self.world.server.client_certificate_url, context=context) as page:
                     self.assertIn(self.world.server.certificates(ACCOUNT)[-1]["serial"], page.read().decode())
 
-    def test_an_export_spares_what_is_there(self):
+    def test_an_export_spares_what_is_there_and_asks_at_a_terminal(self):
         self.add_account("--certificate")
         folder = self.new_folder()
         file, link, dangling = folder / "file", folder / "link", folder / "dangling"
@@ -294,10 +271,6 @@ class CommandLine(unittest.TestCase):
         self.assertIn("PRIVATE KEY", file.read_text())
         self.assertEqual(stat.S_IMODE(file.stat().st_mode), 0o600)
         self.assertEqual((folder / "other").read_text(), "mine")
-
-    def test_an_export_at_a_terminal(self):
-        self.add_account("--certificate")
-        folder = self.new_folder()
         mistyped, typed = str(folder / "mistyped"), str(folder / "typed")
         for arguments, dialogue, status in [
                 (["--pem", "-"], [], 1),
@@ -309,7 +282,7 @@ class CommandLine(unittest.TestCase):
                 self.assertEqual(ended, status, shown)
                 self.assertEqual(b"PRIVATE KEY" in shown, "--force" in arguments)
                 self.assertNotIn(b"secret", shown)
-        self.assertEqual(os.listdir(folder), ["typed"])
+        self.assertEqual({path.name for path in folder.iterdir()}, {"file", "link", "dangling", "other", "typed"})
 
     def test_people_are_found_and_remembered(self):
         self.run_table([(["find", "email", "jane@roe.example"], "", 1, "HWIdentityErrorDomain")])
@@ -342,7 +315,7 @@ class CommandLine(unittest.TestCase):
             (["breadcrumb", "get", *own], "wrong", 1, "password are incorrect"),
             (["breadcrumb", "set", *own, "--input", folder / "none"], PASSWORD, 1, "No such file")])
         self.assertEqual(fetched.read_bytes(), data)
-        piped = self.run_client("breadcrumb", "get", *own, stdin=PASSWORD.encode(), text=False)
+        piped = self.run_client("breadcrumb", "get", *own, stdin=PASSWORD.encode())
         self.assertEqual(piped.stdout, data)
         status, shown = self.at_terminal("breadcrumb", "get", ACCOUNT, "key", dialogue=[(b"Password", PASSWORD)])
         self.assertEqual((status, data.hex().encode() in shown), (0, True), shown)

@@ -9,12 +9,9 @@ import os
 import random
 import signal
 import threading
-import pathlib
-import sys
 import unittest
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
-from world import ADD, DATABASE, FORGET, LIST, SET_VALUE, STATUS, BusError, World, hashed  # noqa: E402
+from harness.world import ADD, DATABASE, FORGET, LIST, SET_VALUE, STATUS, BusError, World, hashed
 
 ROUNDS = int(os.environ.get("VELTOID_CRASH_ROUNDS", "200"))
 LONGEST_TRAFFIC = 0.25
@@ -66,17 +63,15 @@ class KilledAgent(unittest.TestCase):
         with World(server=False) as world:
             for round_number in range(ROUNDS):
                 agent = world.start_agent()
-                client = world.client(starts_agent=False)
-                traffic = Traffic(client, rng, model)
-                killer = threading.Timer(rng.random() * LONGEST_TRAFFIC, agent.send_signal, [signal.SIGKILL])
-                killer.start()
-                answered += traffic.run()
+                with world.client(starts_agent=False) as client:
+                    traffic = Traffic(client, rng, model)
+                    killer = threading.Timer(rng.random() * LONGEST_TRAFFIC, agent.send_signal, [signal.SIGKILL])
+                    killer.start()
+                    answered += traffic.run()
                 killer.join()
-                agent.wait()
-                client.close()
                 with self.subTest(round=round_number):
+                    self.assertEqual(agent.wait(), -signal.SIGKILL)
                     self.check(world, model, traffic.uncertain)
-                world.stop_agent()
             log = world.log_text()
         self.assertGreater(answered, ROUNDS, "hardly anything was under way when the agent was killed")
         for trouble in ("corrupt", "damaged", "moved aside", "Failed to get password"):
@@ -84,36 +79,21 @@ class KilledAgent(unittest.TestCase):
 
     def check(self, world, model, uncertain):
         """Starts the agent again and compares what it has with what it answered."""
-        world.stop_agent()
-        world.start_agent()
-        with world.client() as client:
+        with world.running_agent() as client:
             accounts = client.call(LIST)["result"]
-            meta = client.call(DATABASE)["result"]["MetaInfo"]
-            for name, value in model.items():
-                allowed = uncertain.get(name, {value})
-                if name == "account":
-                    self.assertLessEqual(set(accounts), allowed | {value}, "an account came back, or is a stranger")
-                    if "account" not in uncertain:
-                        self.assertEqual(accounts, [value] if value else [])
-                    model["account"] = accounts[-1] if accounts else None
-                    for account in accounts:
-                        self.password_is_readable(client, account)
-                else:
-                    self.assertIn(meta.get(name), allowed)
-                    model[name] = meta.get(name)
+            stored = {**client.call(DATABASE)["result"]["MetaInfo"], "account": accounts[-1] if accounts else None}
+            known = uncertain.get("account", {model.get("account")})
+            self.assertLessEqual(set(accounts), known, "an account came back, or is a stranger")
+            for name in {*model, *uncertain}:
+                self.assertIn(stored.get(name), uncertain.get(name, {model.get(name)}), name)
+                model[name] = stored.get(name)
+            for account in accounts:
+                # The state says whether the keychain still gives the password out.
+                status = client.call(STATUS)["status"]["AccountStatuses"][account]
+                self.assertEqual(status["AccountState"], "NoEncodedDSID", account)
             # A kill between the two steps of an add leaves the old account beside the new one, until the next add.
             for account in accounts[:-1]:
                 self.assertTrue(client.call(FORGET, VeltoID=account)["success"])
-            for name in uncertain:
-                if name != "account":
-                    model[name] = meta.get(name)
-                elif "account" not in model:
-                    model["account"] = accounts[-1] if accounts else None
-
-    def password_is_readable(self, client, account):
-        """The account's state says whether the keychain still gives its password out."""
-        status = client.call(STATUS)["status"]["AccountStatuses"][account]
-        self.assertEqual(status["AccountState"], "NoEncodedDSID", account)
 
 
 if __name__ == "__main__":

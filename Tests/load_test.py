@@ -14,20 +14,15 @@ import multiprocessing
 import os
 import pathlib
 import signal
-import sqlite3
 import statistics
-import sys
 import time
 import unittest
 from collections import Counter
 from dataclasses import dataclass
 
-sys.path.insert(0, str(pathlib.Path(__file__).resolve().parent / "harness"))
-from load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, is_success, mix,
-                          sleep_until, success_with, wait_for_certificate)
-from world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, PING, World, hashed
-from jeepney import message_bus
-from jeepney.io.blocking import Proxy
+from harness.load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, is_success, mix,
+                                  sleep_until, success_with, wait_for_certificate)
+from harness.world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, PING, World, hashed, references
 
 SECONDS = float(os.environ.get("VELTOID_LOAD_SECONDS", "8"))
 CALM_SHARE = 0.5  # of that, before
@@ -42,8 +37,6 @@ MOST_GROWTH = 256 << 20 if "thread" in SANITIZED else 64 << 20
 # A sanitizer keeps what was freed for a while, but not so much that it looks like growth.
 SANITIZER = {"ASAN_OPTIONS": os.environ.get("ASAN_OPTIONS", "") + ":quarantine_size_mb=16"}
 
-REFERENCES = ("HashedPasswordRef", "CertificateReference", "CertificatePrivateKeyReference",
-              "IntermediateCertificateReference")
 NEVER_SUCCEED = {"unknown", "set nothing", "verify wrong", "linked identity", "flood"}
 
 
@@ -65,12 +58,11 @@ class Load:
 def put_under_load(world: World, agent: int, seconds: float) -> Load:
     world.server.accounts(*({"name": name, "password": password} for name, password in PASSWORDS.items()),
                           {"name": WAITING_ACCOUNT, "password": PASSWORD})
-    allow_unanswered_requests(world)
     begin = time.monotonic() + TIME_TO_CONNECT
     calm = begin + TIME_TO_SETTLE
     rush = calm + seconds * CALM_SHARE
     timetable = Timetable(begin, calm, rush, rush + seconds)
-    address = world.bus.address
+    address = world.address
     with concurrent.futures.ProcessPoolExecutor(CLIENTS, multiprocessing.get_context("fork")) as pool:
         clients = [pool.submit(mix, number, address, agent, timetable) for number in range(CLIENTS - 2)]
         clients += [pool.submit(client, address, timetable) for client in (wait_for_certificate, flood)]
@@ -79,15 +71,6 @@ def put_under_load(world: World, agent: int, seconds: float) -> Load:
         before = resident(agent)
         findings = [client.result() for client in clients]
     return Load(findings, (before, resident(agent)))
-
-
-def allow_unanswered_requests(world: World):
-    """As many as the bus of a session allows; a bus that is told nothing allows 128."""
-    file = world.folder / "bus.conf"
-    limit = '<limit name="max_replies_per_connection">50000</limit>'
-    file.write_text(file.read_text().replace("</busconfig>", f"{limit}</busconfig>"))
-    with world.client() as client:
-        Proxy(message_bus, client.connection).ReloadConfig()
 
 
 def resident(process: int) -> int:
@@ -101,18 +84,12 @@ def ping_times(seconds: float) -> tuple[float, float]:
         return put_under_load(world, world.start_agent().pid, seconds).slowest_pings()
 
 
-class LoadCase(unittest.TestCase):
-    def check_keychain(self, world: World, contents: dict):
-        """Each item is referred to, and each reference leads to one."""
-        file = f"file:{world.state_files() / 'keychain.db'}?mode=ro"
-        with contextlib.closing(sqlite3.connect(file, uri=True)) as database:
-            items = dict(database.execute("SELECT id, class FROM items"))
-        holders = [*contents["Accounts"].values(), *contents["AuthCertificates"].values()]
-        references = {holder[key] for holder in holders for key in REFERENCES if key in holder}
-        self.assertEqual(set(items), references, f"items {items}")
+def loose_ends(world: World, contents: dict) -> set:
+    """Items of the keychain that are not referred to, and references that lead to none."""
+    return references(contents) ^ world.keychain_items().keys()
 
 
-class ManyClients(LoadCase):
+class ManyClients(unittest.TestCase):
     def test_every_request_has_its_reply_and_nothing_is_left_behind(self):
         with World(environment=SANITIZER) as world:
             agent = world.start_agent()
@@ -133,19 +110,18 @@ class ManyClients(LoadCase):
 
     def check_what_is_stored(self, world: World, load: Load):
         # By a fresh agent, which leaves its accounts alone for its first ten seconds.
-        world.start_agent()
-        with world.client() as client:
+        with world.running_agent() as client:
             contents = client.call(DATABASE)["result"]
             accounts, entries = contents["Accounts"], contents["AuthCertificates"]
             self.assertEqual(client.call(LIST).get("result", []), list(accounts))
             self.assertLessEqual(len(accounts), 1)
             self.assertLessEqual(set(entries), {record.get("encDsId") for record in accounts.values()})
-            self.check_keychain(world, contents)
+            self.assertEqual(loose_ends(world, contents), set())
             for one in load.findings:
                 self.assertLessEqual(one.stored.items(), contents["MetaInfo"].items())
             for name in accounts:
                 self.assertTrue(client.call(FORGET, VeltoID=name)["success"])
-            self.check_keychain(world, client.call(DATABASE)["result"])
+            self.assertEqual(loose_ends(world, client.call(DATABASE)["result"]), set())
 
     @staticmethod
     def report(load: Load):
@@ -161,7 +137,7 @@ class Turns(unittest.TestCase):
     def test_who_asks_once_does_not_wait_for_who_asks_ahead(self):
         with World(server=False) as world, contextlib.ExitStack() as stack:
             agent = world.start_agent()
-            ahead, other = (stack.enter_context(Conversation(world.bus.address)) for _ in range(2))
+            ahead, other = (stack.enter_context(Conversation(world.address)) for _ in range(2))
             for client in (ahead, other):
                 client.time_ping()
             agent.send_signal(signal.SIGSTOP)
@@ -169,7 +145,7 @@ class Turns(unittest.TestCase):
                 for _ in range(requests):
                     client.ask("ping", is_success, PING)
                 # Its reply tells that the bus has passed the requests on.
-                Proxy(message_bus, client.connection).GetId()
+                client.connection.bus_proxy.GetId()
             agent.send_signal(signal.SIGCONT)
             # The agent numbers its replies.
             sent = {client: [client.take() for _ in range(len(client.awaited))] for client in (other, ahead)}
@@ -177,11 +153,11 @@ class Turns(unittest.TestCase):
             self.assertGreater(overtaken, self.AHEAD / 4)
 
 
-class OneAccount(LoadCase):
+class OneAccount(unittest.TestCase):
     def test_adding_and_forgetting_at_the_same_time_leaves_no_loose_ends(self):
         with World(server=False) as world, contextlib.ExitStack() as stack:
             world.start_agent()
-            clients = [stack.enter_context(Conversation(world.bus.address)) for _ in range(QUARRELLERS)]
+            clients = [stack.enter_context(Conversation(world.address)) for _ in range(QUARRELLERS)]
             for _ in range(QUARRELS):
                 for number, client in enumerate(clients):
                     for command in (ADD, FORGET, ADD) if number % 2 else (FORGET, ADD, FORGET):
@@ -189,7 +165,7 @@ class OneAccount(LoadCase):
                                    hashedpassword=hashed(PASSWORD), options={"DoNotCheckPassword": True})
                 for client in clients:
                     client.take_all()
-                self.check_keychain(world, clients[0].call(DATABASE)["result"])
+                self.assertEqual(loose_ends(world, clients[0].call(DATABASE)["result"]), set())
 
 
 if __name__ == "__main__":

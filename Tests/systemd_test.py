@@ -1,69 +1,57 @@
-"""The agent's on-demand life under a real systemd: started by messages and by its timer, gone when idle, nothing lost."""
+"""The agent's life on demand under a real systemd: started by messages and its timer, gone when idle, nothing lost."""
 
 from __future__ import annotations
 
 import contextlib
 import os
 import random
-import subprocess
 import sys
 import time
 import unittest
 
+from harness.systemd_world import UserSession, run_inside
+from harness.world import (ACCOUNT, PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE,
+                           TIMER, UNIT, BusError, NameOwner, busctl_send)
 from shutdown_test import Writer
-from systemd_world import TIMER, UNIT, UserSession, run_inside
-from world import (ACCOUNT, ADD, INTERFACE, OBJECT, PASSWORD_SERVICE, PING, SERVICE, SET_VALUE, SET_VALUE_QUIETLY, STATUS,
-                   TERMINATE, BusError, NameOwner, hashed)
 
 MICROSECONDS = 1_000_000
 
 
-class SystemdTest(unittest.TestCase):
-    def session(self, **environment: str) -> UserSession:
-        session = UserSession(**environment)
-        self.addCleanup(session.close)
-        return session
-
-
-class ComingAndGoing(SystemdTest):
-    def busctl_ping(self, session, service):
-        run = subprocess.run(["busctl", f"--address={session.address}", "call", service, OBJECT, INTERFACE, "Send",
-                              "a{sv}", "1", "command", "x", "1"], capture_output=True, text=True, check=True)
-        return run.stdout.strip()
-
+class ComingAndGoing(unittest.TestCase):
     def test_a_message_to_either_name_starts_it_and_idleness_ends_it(self):
-        session = self.session(HARBWELL_IDLE_EXIT="1")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="1"))
         for service in (SERVICE, PASSWORD_SERVICE):
             with self.subTest(service):
                 self.assertEqual(session.unit_property("ActiveState"), "inactive")
-                self.assertEqual(self.busctl_ping(session, service), 'a{sv} 1 "success" b true')
+                self.assertEqual(busctl_send(session.address, service=service, command=PING), {"success": True})
                 session.wait_for_state("active")
                 session.wait_for_state("inactive")
                 self.assertEqual(session.unit_property("Result", interface="Service"), "success")
                 self.assertEqual(session.unit_property("ExecMainStatus", interface="Service"), 0)
-        self.assertIn(TIMER, session.systemctl("list-timers"), "nothing brings it back")
+        self.assertEqual(session.unit_property("ActiveState", TIMER), "active", "nothing brings it back")
 
     def test_an_unreadable_idle_time_is_the_default(self):
-        session = self.session(HARBWELL_IDLE_EXIT="soon")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="soon"))
         with session.client() as client:
             client.call(SET_VALUE, domain="MetaInfo", key="k", value=1)
-        self.assertIn("HARBWELL_IDLE_EXIT is not a number of seconds; using 30.", session.log_text())
+        log = (session.folder / "log" / "agent.log").read_text(errors="replace")
+        self.assertIn("HARBWELL_IDLE_EXIT is not a number of seconds; using 30.", log)
 
 
-class BroughtBack(SystemdTest):
+class BroughtBack(unittest.TestCase):
     def test_the_timer_starts_it_when_its_time_has_come(self):
-        session = self.session(HARBWELL_IDLE_EXIT="0")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0"))
         with session.client() as client:
-            client.call(ADD, VeltoID=ACCOUNT, hashedpassword=hashed("p"), options={"DoNotCheckPassword": True})
+            client.add(DoNotCheckPassword=True)
         # As a date, as a date that is almost too near for one, and as a delay.
         for seconds in (8, 5.5, 1.9):
             with self.subTest(seconds), NameOwner(session.address) as owner, session.client() as client:
                 date = time.time() + seconds
                 for key, value in (("Dirty", ("g", "")), ("EarliestAllowedConnectionDate", ("(d)", (date,)))):
-                    self.assertTrue(client.call(SET_VALUE_QUIETLY, domain="Accounts", item=ACCOUNT, key=key, value=value,
-                                                options={"Dirty": False})["success"])
-                with self.assertRaises(BusError):
-                    client.call(TERMINATE)
+                    reply = client.call(SET_VALUE_QUIETLY, domain="Accounts", item=ACCOUNT, key=key, value=value,
+                                        options={"Dirty": False})
+                    self.assertTrue(reply["success"])
+                self.assertRaises(BusError, client.call, TERMINATE)
                 owner.wait(False)
                 owner.wait(True)
                 started = session.unit_property("InactiveExitTimestamp") / MICROSECONDS
@@ -71,9 +59,9 @@ class BroughtBack(SystemdTest):
                 self.assertLess(started, date + 2)
 
 
-class NothingIsLost(SystemdTest):
+class NothingIsLost(unittest.TestCase):
     def test_stop_and_restart_in_the_middle_of_requests(self):
-        session = self.session(HARBWELL_IDLE_EXIT="0")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0"))
         with NameOwner(session.address) as owner, Writer(session.client()) as writer:
             owner.wait(True)
             for method in ("StopUnit", "RestartUnit") * 5:
@@ -85,7 +73,7 @@ class NothingIsLost(SystemdTest):
             self.assertEqual(writer.lost(client), {})
 
     def test_a_thousand_messages_across_twenty_idle_exits(self):
-        session = self.session(HARBWELL_IDLE_EXIT="0.2")
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0.2"))
         rng = random.Random(20260211)
         answered = 0
         with session.client() as client, NameOwner(session.address) as owner:
@@ -100,7 +88,6 @@ class NothingIsLost(SystemdTest):
                 else:
                     with contextlib.suppress(TimeoutError):  # about when it decides to leave
                         owner.wait(False, timeout=rng.uniform(0.195, 0.205))
-
 
 
 if __name__ == "__main__":

@@ -14,8 +14,8 @@ import textwrap
 ROOT = pathlib.Path(__file__).resolve().parent.parent
 BUILD = ROOT / "build" / "release"
 os.environ.setdefault("VELTOID_AGENT", str(BUILD / "VeltoIDAuthentication" / "VeltoIDAuthd" / "veltoidauthd"))
-sys.path.insert(0, str(ROOT / "Tests" / "harness"))
-from world import ACCOUNT, INTERFACE, OBJECT, OTHER_ACCOUNT, PASSWORD, SERVICE, World  # noqa: E402
+sys.path.insert(0, str(ROOT / "Tests"))
+from harness.world import ACCOUNT, INTERFACE, OBJECT, OTHER_ACCOUNT, PASSWORD, SERVICE, World  # noqa: E402
 
 
 def say(text: str):
@@ -38,7 +38,7 @@ class Story:
         result = subprocess.run([program, *command[1:]], input=stdin, text=True, stdout=subprocess.PIPE,
                                 stderr=subprocess.STDOUT, check=False,
                                 env={**os.environ, **self.world.environment,
-                                     "DBUS_SESSION_BUS_ADDRESS": self.world.bus.address})
+                                     "DBUS_SESSION_BUS_ADDRESS": self.world.address})
         print(textwrap.indent(result.stdout.rstrip(), "    "), flush=True)
         if result.returncode != expected and (expected is not None or result.returncode == 0):
             sys.exit(f"demo: expected exit status {expected}, got {result.returncode}")
@@ -73,7 +73,7 @@ class Story:
         say(f"A message bus of our own is up, and beside it an identity server at {url}: a separate program in Python "
             "that answers XML-RPC over TLS with a certificate of its own test authority. The agent is not running: the "
             "bus starts it with the first message. Any D-Bus client will do, here the bus's own tool:")
-        self.run("busctl", f"--address={world.bus.address}", "call", SERVICE, OBJECT, INTERFACE, "Send", "a{sv}", "1",
+        self.run("busctl", f"--address={world.address}", "call", SERVICE, OBJECT, INTERFACE, "Send", "a{sv}", "1",
                  "command", "x", "1", shown=f"busctl --user call {SERVICE} {OBJECT} {INTERFACE} Send 'a{{sv}}' 1 command x 1")
 
         say("That was a ping. Now an account. The password is hashed by the client, so the agent never sees it; the agent "

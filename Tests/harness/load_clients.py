@@ -3,19 +3,19 @@
 from __future__ import annotations
 
 import contextlib
-import pathlib
 import random
 import select
 import struct
-import sys
 import time
 from collections import Counter, defaultdict, deque
 from dataclasses import dataclass, field
 
-from world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB,  # noqa: E402
-                   INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD, PASSWORD_SERVICE, PING, SERVICE, SET_BREADCRUMB,
-                   SET_VALUE, SET_VALUE_QUIETLY, STATUS, UPDATE_LINKED_IDENTITY, VERIFY, Client, hashed, plain, variant)
-from jeepney import HeaderFields, MessageType, new_method_call  # noqa: E402
+from jeepney import HeaderFields, MessageType
+
+from harness.world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FIND, FIND_CACHED, FORGET, GET_BREADCRUMB, INFO,
+                           LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD, PASSWORD_SERVICE, PING, SERVICE,
+                           SET_BREADCRUMB, SET_VALUE, SET_VALUE_QUIETLY, STATUS, UPDATE_LINKED_IDENTITY, VERIFY, Client,
+                           hashed, plain)
 
 UNKNOWN_COMMAND = 0x121
 PASSWORDS = {ACCOUNT: PASSWORD, OTHER_ACCOUNT: OTHER_PASSWORD, "kim@example.com": "a third one"}
@@ -61,21 +61,8 @@ class Findings:
     stored: dict[str, int] = field(default_factory=dict)
 
 
-class Trouble(Exception):
-    pass
-
-
 def sleep_until(moment: float):
     time.sleep(max(moment - time.monotonic(), 0))
-
-
-@contextlib.contextmanager
-def noting(findings: Findings, who: str):
-    """What goes wrong in a client's process is for the test to tell."""
-    try:
-        yield
-    except Exception as error:
-        findings.troubles.append(f"{who}: {type(error).__name__}: {error}")
 
 
 class Conversation(Client):
@@ -86,14 +73,12 @@ class Conversation(Client):
         self.awaited: deque = deque()
         self.findings = Findings()
 
-    def serialised(self, request: dict) -> tuple[int, bytes]:
-        message = new_method_call(self.peer, "Send", "a{sv}", (variant(request)[1],))
-        message.header.flags |= self.flags
+    def serialised(self, command: int | None, **arguments) -> tuple[int, bytes]:
         serial = next(self.connection.outgoing_serial)
-        return serial, message.serialise(serial=serial)
+        return serial, self.request(command, **arguments).serialise(serial=serial)
 
     def ask(self, name: str, check, command: int | None, **arguments):
-        serial, data = self.serialised(arguments if command is None else {"command": command, **arguments})
+        serial, data = self.serialised(command, **arguments)
         self.awaited.append((serial, name, check))
         self.connection.sock.sendall(data)
 
@@ -102,16 +87,14 @@ class Conversation(Client):
         serial, name, check = self.awaited.popleft()
         message = self.receive(name)
         answers = message.header.fields[HeaderFields.reply_serial]
-        if answers != serial:
-            later = [other for number, other, _ in self.awaited if number == answers]
-            raise Trouble(f"{name}: overtaken by a later {later[0]}" if later else f"{name}: a second reply came")
-        if message.header.message_type == MessageType.error:
-            raise Trouble(f"{name}: {message.header.fields[HeaderFields.error_name]} {message.body}")
+        later = [other for number, other, _ in self.awaited if number == answers]
+        assert answers == serial, f"{name}: " + (f"overtaken by a later {later[0]}" if later else "a second reply came")
+        failure = message.header.fields.get(HeaderFields.error_name)
+        assert failure is None, f"{name}: {failure} {message.body}"
         reply = plain(("a{sv}", message.body[0]))
         self.findings.answered[name] += 1
         self.findings.succeeded[name] += reply["success"]
-        if not check(reply):
-            raise Trouble(f"{name}: the reply is {reply}")
+        assert check(reply), f"{name}: the reply is {reply}"
         return message.header.serial
 
     def receive(self, name: str):
@@ -120,7 +103,7 @@ class Conversation(Client):
             while (message := self.connection.receive(timeout=PATIENCE)).header.message_type == MessageType.signal:
                 pass
         except TimeoutError:
-            raise Trouble(f"{name}: no reply") from None
+            raise AssertionError(f"{name}: no reply") from None
         return message
 
     def take_all(self):
@@ -129,10 +112,8 @@ class Conversation(Client):
 
     def time_ping(self) -> float:
         """Microseconds from the request to its reply, with nothing else under way."""
-        serial, data = self.serialised({"command": PING})
-        self.awaited.append((serial, "ping", is_success))
         start = time.perf_counter()
-        self.connection.sock.sendall(data)
+        self.ask("ping", is_success, PING)
         self.take()
         return (time.perf_counter() - start) * 1e6
 
@@ -141,7 +122,7 @@ class Conversation(Client):
         self.take_all()
         self.time_ping()
         with contextlib.suppress(TimeoutError):
-            raise Trouble(f"nobody asked for {self.connection.receive(timeout=0)}")
+            raise AssertionError(f"nobody asked for {self.connection.receive(timeout=0)}")
 
 
 # --- What a reply may be
@@ -174,6 +155,7 @@ class Mixer:
 
     def __init__(self, conversation: Conversation, number: int, agent: int):
         self.conversation, self.number, self.agent = conversation, number, agent
+        self.ask = conversation.ask
         self.rng = random.Random(number)
         self.key = f"client {number}"
         self.value: int | None = None
@@ -203,21 +185,16 @@ class Mixer:
         account = self.someone()
         return {"VeltoID": account, "hashedpassword": hashed(PASSWORDS[account])}
 
-    def ask(self, *arguments, **more):
-        self.conversation.ask(*arguments, **more)
-
     def ping(self):
         self.ask("ping", is_success, PING)
 
     def unknown(self):
         self.ask("unknown", is_refusal, self.rng.choice((UNKNOWN_COMMAND, 0, 2**40, None)))
 
-    def set_value(self, name="set", command=SET_VALUE):
+    def set_value(self):
+        name, command = self.rng.choices((("set", SET_VALUE), ("set quietly", SET_VALUE_QUIETLY)), (3, 2))[0]
         self.value = (self.value or 0) + 1
         self.ask(name, is_success, command, domain="MetaInfo", key=self.key, value=self.value)
-
-    def set_quietly(self):
-        self.set_value("set quietly", SET_VALUE_QUIETLY)
 
     def set_nothing(self):
         self.ask("set nothing", is_refusal, SET_VALUE, domain="Nowhere", key=self.key, value=1)
@@ -281,7 +258,7 @@ class Mixer:
                  GET_BREADCRUMB, **signed_in, identifier=self.key)
 
     # The server is written in Python: it can be asked for less than the agent.
-    KINDS = ((ping, 20), (unknown, 10), (set_value, 12), (set_nothing, 6), (set_quietly, 8), (contents, 6), (names, 8),
+    KINDS = ((ping, 20), (unknown, 10), (set_value, 20), (set_nothing, 6), (contents, 6), (names, 8),
              (status, 6), (check, 8), (certificate, 4), (record, 4), (info, 4), (find_cached, 8), (add, 2), (forget, 2),
              (verify, 1), (find, 1), (breadcrumb, 1))
 
@@ -309,7 +286,7 @@ class Flood:
         self.awaited: deque[int] = deque()
         self.received = b""
         conversation.time_ping()  # whatever else the bus has to say comes before its reply
-        serial, request = conversation.serialised({"command": PING})
+        serial, request = conversation.serialised(PING)
         self.request = request[:SERIAL_AT], request[SERIAL_AT + 4:]
         self.socket.sendall(request)
         reply = self.socket.recv(4096)
@@ -331,46 +308,54 @@ class Flood:
     def take(self, patience: float):
         """The replies that are there."""
         if not select.select([self.socket], [], [], patience)[0]:
-            if patience:
-                raise Trouble(f"{len(self.awaited)} pings without reply")
+            assert not patience, f"{len(self.awaited)} pings without reply"
             return
         self.received += self.socket.recv(1 << 16)
         whole = len(self.received) // self.reply.size * self.reply.size
         for head, middle, serial, tail in self.reply.iter_unpack(self.received[:whole]):
-            if (head, middle, serial, tail) != (self.head, self.middle, self.awaited.popleft(), self.tail):
-                raise Trouble(f"not the reply to the oldest ping: {self.received[:whole]}"[:1000])
+            is_next = (head, middle, serial, tail) == (self.head, self.middle, self.awaited.popleft(), self.tail)
+            assert is_next, f"not the reply to the oldest ping: {self.received[:whole]}"[:1000]
             self.findings.answered["flood"] += 1
         self.received = self.received[whole:]
 
 
 # --- Their processes
 
-def mix(number: int, address: str, agent: int, timetable: Timetable) -> Findings:
-    kind, service = (PasswordMixer, PASSWORD_SERVICE) if number < PASSWORD_CLIENTS else (Mixer, SERVICE)
-    with Conversation(address, service) as conversation, noting(conversation.findings, service):
-        sleep_until(timetable.begin)
-        kind(conversation, number, agent).run(timetable)
-        conversation.finish()
+def converse(address: str, service: str, begin: float, what) -> Findings:
+    """What goes wrong in a client's process is for the test to tell."""
+    with Conversation(address, service) as conversation:
+        try:
+            sleep_until(begin)
+            what(conversation)
+            conversation.finish()
+        except Exception as error:
+            conversation.findings.troubles.append(f"{what.__name__} at {service}: {type(error).__name__}: {error}")
     return conversation.findings
+
+
+def mix(number: int, address: str, agent: int, timetable: Timetable) -> Findings:
+    def mixer(conversation: Conversation):
+        kind(conversation, number, agent).run(timetable)
+
+    kind, service = (PasswordMixer, PASSWORD_SERVICE) if number < PASSWORD_CLIENTS else (Mixer, SERVICE)
+    return converse(address, service, timetable.begin, mixer)
 
 
 def wait_for_certificate(address: str, timetable: Timetable) -> Findings:
     """Adds an account and waits for its certificate, again and again, with a ping behind that waits its turn."""
-    with Conversation(address) as conversation, noting(conversation.findings, "waiting"):
-        sleep_until(timetable.rush)
+    def waiting(conversation: Conversation):
         while (left := timetable.end - time.monotonic()) > 0:
             # Others that add accounts put an end to this one.
             conversation.ask("waiting add", anything, ADD, VeltoID=WAITING_ACCOUNT, hashedpassword=hashed(PASSWORD),
                              options={"certwaitduration": min(left, LONGEST_WAIT)})
             conversation.ask("ping", is_success, PING)
             conversation.take_all()
-        conversation.finish()
-    return conversation.findings
+
+    return converse(address, SERVICE, timetable.rush, waiting)
 
 
 def flood(address: str, timetable: Timetable) -> Findings:
-    with Conversation(address) as conversation, noting(conversation.findings, "flood"):
-        sleep_until(timetable.rush)
+    def flooding(conversation: Conversation):
         Flood(conversation).run(timetable.end)
-        conversation.finish()
-    return conversation.findings
+
+    return converse(address, SERVICE, timetable.rush, flooding)

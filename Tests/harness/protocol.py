@@ -12,20 +12,14 @@ def _constants(header: str, value: str) -> dict[str, str]:
     return dict(re.findall(rf"inline constexpr [\w:\* ]*?\b(k\w+) =\s*{value};", (_ROOM / header).read_text()))
 
 
-def _numbers() -> dict[str, int]:
-    """SET_VALUE for kSetValue."""
-    return {re.sub(r"(?<=[a-z])(?=[A-Z])", "_", name[1:]).upper(): int(number, 0)
-            for name, number in _constants("Commands.h", r"(0x[0-9A-Fa-f]+|\d+)").items()}
-
-
 _NAMES = _constants("Names.h", r'"([^"]*)"')
 
-globals().update(_numbers())
+# SET_VALUE for kSetValue.
+globals().update({re.sub(r"(?<=[a-z])(?=[A-Z])", "_", name[1:]).upper(): int(number, 0)
+                  for name, number in _constants("Commands.h", r"(0x[0-9A-Fa-f]+|\d+)").items()})
 SERVICE = _NAMES["kVeltoIDAuthenticationServiceName"]
 PASSWORD_SERVICE = _NAMES["kVeltoIDPasswordCheckServiceName"]
 OBJECT = _NAMES["kVeltoIDObjectPath"]
 INTERFACE = _NAMES["kVeltoIDMessageInterface"]
 UNIT = _NAMES["kVeltoIDServiceUnit"]
 TIMER = _NAMES["kVeltoIDRelaunchTimerUnit"]
-
-__all__ = [name for name in dir() if name.isupper() and not name.startswith("_")]

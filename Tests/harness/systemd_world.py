@@ -11,17 +11,16 @@ import os
 import pathlib
 import pwd
 import select
-import shutil
 import subprocess
 import sys
 import tempfile
-import time
 
-from jeepney import DBusAddress, DBusErrorResponse, MatchRule, Properties, message_bus, new_method_call
-from jeepney.io.blocking import Proxy, open_dbus_connection
+from jeepney import DBusAddress, MatchRule, Properties, new_method_call
+from jeepney.io.blocking import open_dbus_connection
+from jeepney.wrappers import unwrap_msg
 
-from protocol import TIMER, UNIT  # noqa: E402, F401
-from world import Client, complaint_of_a_sanitizer  # noqa: E402
+from harness.protocol import UNIT
+from harness.world import BUS_CONFIGURATION, BusError, Client, complaint_of_a_sanitizer, wait_until
 
 USER = pwd.getpwnam("nobody")
 RUNTIME = pathlib.Path(f"/run/user/{USER.pw_uid}")
@@ -66,9 +65,7 @@ ExecStart=/lib/systemd/systemd --user --log-target=null
 
 USER_UNITS = {
     "default.target": "[Unit]\nWants=dbus.socket timers.target\n",
-    "basic.target": "",
-    "timers.target": "",
-    "sockets.target": "",
+    **dict.fromkeys(("basic.target", "timers.target", "sockets.target"), "[Unit]\n"),
     "shutdown.target": "[Unit]\nDefaultDependencies=no\n",
     "dbus.socket": "[Socket]\nListenStream=%t/bus\n",
     "dbus.service": """[Unit]
@@ -80,37 +77,17 @@ StandardError=append:{folder}/log/bus.log
 """,
 }
 
-BUS_CONFIGURATION = """<!DOCTYPE busconfig PUBLIC "-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN"
- "http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd">
-<busconfig>
-  <type>session</type>
-  <listen>systemd:</listen>
-  <auth>EXTERNAL</auth>
-  <servicedir>{folder}/usr/share/dbus-1/services</servicedir>
-  <policy context="default">
-    <allow user="*"/>
-    <allow send_destination="*" eavesdrop="true"/>
-    <allow eavesdrop="true"/>
-    <allow own="*"/>
-  </policy>
-</busconfig>
-"""
-
-
-def write_units(directory: pathlib.Path, units: dict[str, str], **places):
-    directory.mkdir(parents=True)
-    for name, text in units.items():
-        (directory / name).write_text(text.format(**places) if text else "[Unit]\n")
-
 
 def lay_out(folder: pathlib.Path):
     folder.chmod(0o755)
     subprocess.run(["cmake", "--install", os.environ["VELTOID_BUILD"], "--prefix", folder / "usr"], check=True,
                    stdout=subprocess.DEVNULL)
-    places = {"folder": folder, "runtime": RUNTIME, "uid": USER.pw_uid}
-    write_units(folder / "system", SYSTEM_UNITS, **places)
-    write_units(folder / "user", USER_UNITS, **places)
-    (folder / "bus.conf").write_text(BUS_CONFIGURATION.format(folder=folder))
+    for manager, units in (("system", SYSTEM_UNITS), ("user", USER_UNITS)):
+        (folder / manager).mkdir()
+        for name, text in units.items():
+            (folder / manager / name).write_text(text.format(folder=folder, runtime=RUNTIME, uid=USER.pw_uid))
+    (folder / "bus.conf").write_text(BUS_CONFIGURATION.format(
+        listen="systemd:", services=folder / "usr/share/dbus-1/services"))
     for name in ("home", "log"):
         (folder / name).mkdir()
         os.chown(folder / name, USER.pw_uid, USER.pw_gid)
@@ -138,13 +115,6 @@ def why_not() -> str | None:
                             "-ec", "mount -t tmpfs tmpfs /run; umount -R /sys/fs/cgroup; "
                             "mount -t cgroup2 cgroup2 /sys/fs/cgroup"], capture_output=True, text=True, check=False)
     return tried.stderr.strip().replace("\n", " ") if tried.returncode != 0 else None
-
-
-def wait_until(condition, seconds: float, what: str):
-    deadline = time.monotonic() + seconds
-    while not condition():
-        assert time.monotonic() < deadline, what
-        time.sleep(0.01)
 
 
 def remove_control_group(group: pathlib.Path):
@@ -179,22 +149,20 @@ def run_inside(program: list[str]) -> int:
     if reason := why_not():
         print(f"skipped: systemd cannot be booted in namespaces here: {reason}")
         return SKIPPED
-    folder = pathlib.Path(tempfile.mkdtemp(prefix="veltoid-"))
-    try:
+    with tempfile.TemporaryDirectory(prefix="veltoid-") as name:
+        folder = pathlib.Path(name)
         lay_out(folder)
         with booted(folder) as init:
-            status = subprocess.run(["nsenter", "--target", init, "--mount", "--pid", "--cgroup", *program], check=False,
-                                    env={**os.environ, "VELTOID_INSIDE": str(folder)}).returncode
+            status = subprocess.run(["nsenter", "--target", init, "--mount", "--pid", "--cgroup", *program],
+                                    env={**os.environ, "VELTOID_INSIDE": name}, check=False).returncode
         for log in (folder / "log").iterdir():
             if complaint := complaint_of_a_sanitizer(log.read_text(errors="replace")):
                 print(complaint, file=sys.stderr)
                 return 1
         return status
-    finally:
-        shutil.rmtree(folder)
 
 
-class UserSession:
+class UserSession(contextlib.AbstractContextManager):
     """The bus and the service manager of the user, as seen by a program inside. The agent's settings are its own."""
 
     def __init__(self, **agent_environment: str):
@@ -206,15 +174,14 @@ class UserSession:
         wait_until(self.manager_answers, 20, "the service manager is not on the bus")
         self.configure_agent(agent_environment)
 
-    def close(self):
+    def __exit__(self, *_):
         self.call("StopUnit", "ss", (UNIT, "replace"))
         self.wait_for_state("inactive")
         self.connection.close()
 
     def manager_answers(self) -> bool:
-        with contextlib.suppress(DBusErrorResponse):
-            self.call("Subscribe")
-            return True
+        with contextlib.suppress(BusError):
+            return self.call("Subscribe") == ()
         return False
 
     def configure_agent(self, environment: dict[str, str]):
@@ -229,38 +196,23 @@ class UserSession:
         self.call("Reload")
 
     def call(self, method: str, signature: str | None = None, body: tuple = ()):
-        reply = self.connection.send_and_get_reply(new_method_call(self.manager, method, signature, body), timeout=30)
-        return reply_body(reply)
+        message = new_method_call(self.manager, method, signature, body)
+        return unwrap_msg(self.connection.send_and_get_reply(message, timeout=30))
 
     def unit_property(self, name: str, unit: str = UNIT, interface: str = "Unit"):
-        path = self.call("LoadUnit", "s", (unit,))[0]
-        address = DBusAddress(path, bus_name="org.freedesktop.systemd1", interface=f"org.freedesktop.systemd1.{interface}")
-        return reply_body(self.connection.send_and_get_reply(Properties(address).get(name), timeout=30))[0][1]
+        address = DBusAddress(self.call("LoadUnit", "s", (unit,))[0], bus_name="org.freedesktop.systemd1",
+                              interface=f"org.freedesktop.systemd1.{interface}")
+        return unwrap_msg(self.connection.send_and_get_reply(Properties(address).get(name), timeout=30))[0][1]
 
     def wait_for_state(self, state: str):
         """Blocks until the agent's unit is in that state."""
         path = self.call("LoadUnit", "s", (UNIT,))[0]
-        rule = MatchRule(type="signal", interface="org.freedesktop.DBus.Properties", member="PropertiesChanged", path=path)
-        Proxy(message_bus, self.connection).AddMatch(rule)
+        rule = MatchRule(type="signal", interface="org.freedesktop.DBus.Properties", member="PropertiesChanged",
+                         path=path)
+        self.connection.bus_proxy.AddMatch(rule)
         with self.connection.filter(rule, bufsize=1000) as changes:
             while self.unit_property("ActiveState") != state:
                 self.connection.recv_until_filtered(changes, timeout=30)
-        Proxy(message_bus, self.connection).RemoveMatch(rule)
-
-    def systemctl(self, *arguments: str) -> str:
-        run = subprocess.run(["systemctl", "--user", *arguments], capture_output=True, text=True, check=True,
-                             user=USER.pw_uid, group=USER.pw_gid, extra_groups=[],
-                             env={**os.environ, "XDG_RUNTIME_DIR": str(RUNTIME)})
-        return run.stdout
-
-    def log_text(self) -> str:
-        return (self.folder / "log" / "agent.log").read_text(errors="replace")
 
     def client(self) -> Client:
         return Client(self.address)
-
-
-def reply_body(reply):
-    if reply.header.message_type.name == "error":
-        raise DBusErrorResponse(reply)
-    return reply.body
