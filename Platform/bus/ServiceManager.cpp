@@ -70,24 +70,18 @@ Message callTo(sd_bus* bus, const char* method) {
 }
 
 int appendTimer(sd_bus_message* call, double date) {
+    const auto append = [call](auto... schedule) {
+        return sd_bus_message_append(call, "ssa(sv)a(sa(sv))", product().timerUnit, "replace", 5,  //
+                                     "Description", "s", product().timerDescription,               //
+                                     "AccuracyUSec", "t", kTimerAccuracy,                          //
+                                     "RemainAfterElapse", "b", 0,                                  //
+                                     "CollectMode", "s", "inactive-or-failed", schedule..., 0);
+    };
     const double left = date - Clock::shared().now();
-    int result = sd_bus_message_append(call, "ss", product().timerUnit, "replace");
-    if (result >= 0) result = sd_bus_message_open_container(call, 'a', "(sv)");
-    if (result >= 0)
-        result = sd_bus_message_append(call, "(sv)(sv)(sv)(sv)",                        //
-                                       "Description", "s", product().timerDescription,  //
-                                       "AccuracyUSec", "t", kTimerAccuracy,             //
-                                       "RemainAfterElapse", "b", 0,                     //
-                                       "CollectMode", "s", "inactive-or-failed");
-    if (result >= 0 && left < kNearestDate)
-        result =
-            sd_bus_message_append(call, "(sv)", "TimersMonotonic", "a(st)", 1, "OnActiveSec",
-                                  static_cast<uint64_t>(std::max(left, kMinDelay) * kMicrosecondsPerSecond));
-    else if (result >= 0)
-        result = sd_bus_message_append(call, "(sv)", "TimersCalendar", "a(ss)", 1, "OnCalendar",
-                                       calendarDate(date).c_str());
-    if (result >= 0) result = sd_bus_message_close_container(call);
-    return result >= 0 ? sd_bus_message_append(call, "a(sa(sv))", 0) : result;
+    if (left >= kNearestDate)
+        return append("TimersCalendar", "a(ss)", 1, "OnCalendar", calendarDate(date).c_str());
+    const auto delay = static_cast<uint64_t>(std::max(left, kMinDelay) * kMicrosecondsPerSecond);
+    return append("TimersMonotonic", "a(st)", 1, "OnActiveSec", delay);
 }
 
 bool isServiceUnit(sd_bus_message* reply) {

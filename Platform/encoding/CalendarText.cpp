@@ -47,14 +47,9 @@ CalendarDate calendarDate(double seconds) {
 
 std::optional<std::string> calendarText(double seconds, const char* format) {
     if (!(seconds >= kEarliest && seconds <= kLatest)) return std::nullopt;
-    const CalendarDate date = calendarDate(seconds);
+    const auto time = static_cast<time_t>(std::floor(seconds));
     std::tm fields{};
-    fields.tm_year = static_cast<int>(date.year - 1900);
-    fields.tm_mon = static_cast<int>(date.month - 1);
-    fields.tm_mday = static_cast<int>(date.day);
-    fields.tm_hour = static_cast<int>(date.hour);
-    fields.tm_min = static_cast<int>(date.minute);
-    fields.tm_sec = static_cast<int>(date.second);
+    gmtime_r(&time, &fields);
     char text[64];
     return std::string(text, std::strftime(text, sizeof text, format, &fields));
 }

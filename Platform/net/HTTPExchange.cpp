@@ -7,24 +7,25 @@
 namespace platform {
 namespace {
 
-bool isSameFieldName(std::string_view a, std::string_view b) {
-    return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
+auto fieldNamed(std::string_view name, auto& fields) {
+    return std::ranges::find_if(fields, [name](const auto& field) {
+        return field.first.size() == name.size() &&
+               strncasecmp(field.first.data(), name.data(), name.size()) == 0;
+    });
 }
 
 }  // namespace
 
 void HTTPRequest::setHeaderField(std::string_view name, std::string_view value) {
-    for (auto& [fieldName, fieldValue] : headerFields) {
-        if (!isSameFieldName(fieldName, name)) continue;
-        fieldValue = value;
-        return;
-    }
-    headerFields.emplace_back(name, value);
+    const auto field = fieldNamed(name, headerFields);
+    if (field == headerFields.end())
+        headerFields.emplace_back(name, value);
+    else
+        field->second = value;
 }
 
 const std::string* HTTPRequest::headerField(std::string_view name) const {
-    const auto field = std::find_if(headerFields.begin(), headerFields.end(),
-                                    [=](const auto& each) { return isSameFieldName(each.first, name); });
+    const auto field = fieldNamed(name, headerFields);
     return field == headerFields.end() ? nullptr : &field->second;
 }
 
