@@ -46,8 +46,6 @@ struct CheckState {
 
 CheckState& state() { return platform::Lifetime::current().state<CheckState>(); }
 
-const platform::Semaphore& checkSemaphore() { return state().semaphore; }
-
 bool isEnding() { return platform::Lifetime::current().isEnding(); }
 
 /// Accounts that a pass left as due as it found them.
@@ -61,11 +59,10 @@ class Deferrals {
 
     /// After a pass over the account.
     void note(const String& accountName) {
-        std::optional<double> next;
-        const bool isForeseen = copyNextActionDateForAccount(accountName, &next) && next;
+        const auto next = nextActionOf(accountName);
         const bool isChanged =
             __VeltoIDDBCopyAccountValue(accountName, kVeltoIDDirtyKey).asBoolean().value_or(false);
-        if (!isForeseen || isChanged || *next > platform::now()) {
+        if (!next || isChanged || *next > platform::now()) {
             deferrals_.erase(accountName.text());
             return;
         }
@@ -119,7 +116,7 @@ class AccountCheckLoop {
     /// Waits for a signal without a transaction; true when one came. A jump of the clock ends it too.
     bool wait(double seconds) {
         transaction_.close();
-        const bool signalled = checkSemaphore().wait(seconds);
+        const bool signalled = state().semaphore.wait(seconds);
         transaction_.reopen();
         return signalled;
     }
@@ -135,7 +132,7 @@ class AccountCheckLoop {
             (void)neverSignalled.wait(missing);
             transaction_.reopen();
         }
-        while (checkSemaphore().wait(0)) {
+        while (state().semaphore.wait(0)) {
         }
         lastPass_ = platform::now();
     }
@@ -143,11 +140,10 @@ class AccountCheckLoop {
     Plan plan() const {
         if (auto changed = __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll))
             return {std::move(*changed), platform::now(), true};
-        std::optional<double> ignored;
-        Plan plan{copyAccountsNeedingAction(&ignored), {}, false};
+        Plan plan{copyAccountsNeedingAction(nullptr), {}, false};
         for (const Value& name : plan.accounts) {
-            std::optional<double> date;
-            if (!copyNextActionDateForAccount(name.asString(), &date) || !date) continue;
+            const auto date = nextActionOf(name.asString());
+            if (!date) continue;
             const double deferred = deferrals_.dateFor(name.asString(), *date);
             plan.date = plan.date ? std::min(*plan.date, deferred) : deferred;
         }
@@ -173,8 +169,7 @@ class AccountCheckLoop {
             __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDDirtyKey, Value::boolean(true), Notify::No);
     }
 
-    /// False when the sleep has ended before its time, by a change or by the clock: the plan may be another
-    /// one now.
+    /// False when a change or the clock has ended the sleep early: the plan may be another one now.
     bool sleepUntilTimeFor(const Plan& next) {
         if (next.accounts.empty() || !next.date || !platform::isHTTPSClientAvailable()) {
             scheduleRelaunch(platform::now() + relaunchInterval());
@@ -215,7 +210,7 @@ void startAccountCheck(double firstDelaySeconds, std::function<void()> onPass) {
 }
 
 void wakeAccountCheck() {
-    if (state().isStarted) checkSemaphore().signal();
+    if (state().isStarted) state().semaphore.signal();
 }
 
 }  // namespace veltoid

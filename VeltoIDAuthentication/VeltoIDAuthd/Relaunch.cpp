@@ -63,8 +63,8 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
     std::optional<double> earliest;
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names) {
-        std::optional<double> date;
-        if (!copyNextActionDateForAccount(name.asString(), &date) || !date) continue;
+        const auto date = nextActionOf(name.asString());
+        if (!date) continue;
         needing.append(name);
         if (!earliest || *date < *earliest) earliest = date;
     }

@@ -209,8 +209,7 @@ class FindPersonCache {
         writeQueue_.asyncAfter(database::flushDelay(), [this] { write(); });
     }
 
-    /// On the write queue. The entries are shared, so that the lock is held for no longer than it takes to
-    /// count them.
+    /// On the write queue. The entries are shared, so that the lock is held only to count them.
     bool write() {
         const Transaction keepAlive("VeltoIDFindPersonCacheWrite");
         std::vector<std::pair<String, Dictionary>> kept;

@@ -108,9 +108,8 @@ void checkAccount(const AccountRecord& record) {
 bool renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
                                 OldCertificate old) {
     if (old == OldCertificate::Remove) {
-        VELTOID_LOG(kNotice, "Removing certificate for Velto ID "
-                                 << describeAccountForLog(accountName) << " dsID=" << describeValue(encDsId)
-                                 << " because it has expired or been revoked.");
+        VELTOID_LOG(kNotice, "Removing certificate for Velto ID ", describeAccountForLog(accountName),
+                    " dsID=", describeValue(encDsId), " because it has expired or been revoked.");
         discardCertificate(OwnershipLock(), encDsId);
     } else {
         const double interval = metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey,
@@ -118,23 +117,21 @@ bool renewCertificateForAccount(const String& accountName, const String& encDsId
         __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateNextRenewalAttemptDateKey,
                                        Value::date(platform::now() + interval), Notify::No);
     }
-    AccountRecord record;
-    __VeltoIDDBCopyVeltoIDAccount(accountName, &record);
-    if (const auto next = nextRequestDate(record); next && platform::now() < *next) return false;
+    const auto next = nextRequestDate(accountRecordOf(accountName));
+    if (next && platform::now() < *next) return false;
     return __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, nullptr);
 }
 
 void fetchValidationRecordForAccount(const AccountRecord& record, const Dictionary& options) {
     const String& accountName = record.accountName();
-    VELTOID_LOG(kNotice, "Fetching VeltoIDValidationRecord for veltoid " << describeValue(accountName));
+    VELTOID_LOG(kNotice, "Fetching VeltoIDValidationRecord for veltoid ", describeValue(accountName));
     Dictionary fetchOptions = options;
     fetchOptions.set(option::kForceValidationRecordFetch, Value::boolean(true));
     if (const Value& interval = record.values()[kNextCheckInterval]; interval.isNumber())
         fetchOptions.set(kNextCheckInterval, interval);
     const double before = platform::now();
     __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
-    AccountRecord after;
-    __VeltoIDDBCopyVeltoIDAccount(accountName, &after);
+    const AccountRecord after = accountRecordOf(accountName);
     // Information of a known account is given out whether the server answers or not: the date tells.
     const bool isAnswered = after.lastValidation().value_or(before - 1) >= before;
     const auto nextCheck = after.validationRecordNextCheck();

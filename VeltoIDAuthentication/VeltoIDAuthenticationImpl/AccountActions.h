@@ -3,7 +3,7 @@
 #pragma once
 
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/AccountRecord.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 

@@ -5,6 +5,7 @@
 
 #include "Certificates/ValidationRecord.h"
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
@@ -16,9 +17,10 @@
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/EntryTable.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -30,6 +32,16 @@ constexpr double kRecordCheckShare = 0.75;
 // Keys of the signed record.
 constexpr std::string_view kValidAsOfKey = "ValidAsOf";
 constexpr std::string_view kSuggestedDurationKey = "SuggestValidDuration";
+
+/// Of the record, in an account's information.
+constexpr TakenEntry kRecordEntries[] = {
+    {kVeltoIDAccountFirstNameKey, Value::Kind::String},
+    {kVeltoIDAccountLastNameKey, Value::Kind::String},
+    {kVeltoIDAccountEmailAddressesKey, Value::Kind::Array, message::kAllEmails},
+    {kVeltoIDAccountValidatedEmailKey, Value::Kind::Array},
+    {kVeltoIDAccountValidatedPhonesKey, Value::Kind::Array},
+    {kVeltoIDAccountLastValidationDateKey, Value::Kind::Date},
+};
 
 std::optional<double> finiteNumber(const Dictionary& dictionary, std::string_view key) {
     const auto number = dictionary.number(key);
@@ -60,25 +72,13 @@ class InformationRequest {
     }
 
     Dictionary answer() const {
-        CertificateEntry entry;
-        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
-        const Dictionary& values = record_.values();
-        Dictionary info;
-        info.set(message::kAccount, name_);
-        info.set(message::kEncDsId, encDsId_);
-        for (const std::string_view key : {kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey})
-            info.set(key, values.string(key));
-        if (const Array* all = values.array(kVeltoIDAccountEmailAddressesKey))
-            info.set(message::kAllEmails, *all);
-        for (const std::string_view key :
-             {kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey})
-            if (const Array* items = values.array(key)) info.set(key, *items);
-        if (const auto date = record_.lastValidation())
-            info.set(kVeltoIDAccountLastValidationDateKey, Value::date(*date));
-        info.set(message::kCertificatePEM, entry.values()[kVeltoIDCertificatePEMKey]);
-        info.set(message::kCertificateExpiration, entry.values()[kVeltoIDCertificateExpirationDateKey]);
-        info.set(kVeltoIDCertificateSerialNumberKey, entry.values()[kVeltoIDCertificateSerialNumberKey]);
-        info.set(message::kCertificateDate, entry.values()[kVeltoIDCertificateDateKey]);
+        Dictionary info = {{message::kAccount, name_}, {message::kEncDsId, encDsId_}};
+        takeEntries(record_.values(), kRecordEntries, info);
+        const Dictionary entry = certificateEntryOf(encDsId_).values();
+        info.set(message::kCertificatePEM, entry[kVeltoIDCertificatePEMKey]);
+        info.set(message::kCertificateExpiration, entry[kVeltoIDCertificateExpirationDateKey]);
+        info.set(kVeltoIDCertificateSerialNumberKey, entry[kVeltoIDCertificateSerialNumberKey]);
+        info.set(message::kCertificateDate, entry[kVeltoIDCertificateDateKey]);
         return info;
     }
 
@@ -142,13 +142,11 @@ class InformationRequest {
 
     /// What the agent has already; an empty identifier makes the server send its record.
     Dictionary fetchParameters() const {
-        CertificateEntry entry;
-        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
         String identifier = record_.validationRecordIdentifier();
         if (isOn(option::kForceValidationRecordFetch) || !identifier ||
             record_.validationRecordData().size() == 0)
             identifier = "";
-        return {{kVeltoIDCertificateSerialNumberKey, entry.serialNumber()},
+        return {{kVeltoIDCertificateSerialNumberKey, certificateEntryOf(encDsId_).serialNumber()},
                 {kVeltoIDAccountValidationRecordIdentifierKey, identifier}};
     }
 
@@ -171,11 +169,9 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
                                        Value::date(platform::now()));
         return;
     }
-    VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice,
-                     "Marking certificate for Velto ID "
-                         << accountName.view() << " dsID=" << describeValue(encDsId)
-                         << "as invalid because the server said CertificateIsValid = false. ("
-                         << describeValue(isValid));
+    VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice, "Marking certificate for Velto ID ",
+                     accountName, " dsID=", describeValue(encDsId),
+                     "as invalid because the server said CertificateIsValid = false. (", isValid);
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid);
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey,
                                    Value::date(platform::now()));
@@ -185,8 +181,7 @@ bool bothPresentAndDifferent(const Value& before, const Value& after) {
     return !before.isAbsent() && !after.isAbsent() && before != after;
 }
 
-/// What the signed record says of itself goes into the values; the date at which to look at it again, if it
-/// tells one.
+/// What the signed record says of itself goes into the values; when to look at it again, if it tells that.
 std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values) {
     const Data content = verifyValidationRecord(signedRecord);
     const auto payload = content ? parseValidationRecordPayload(content) : std::nullopt;
@@ -200,9 +195,8 @@ std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values)
     return *validAsOf + kRecordCheckShare * duration.value_or(0);
 }
 
-/// Record data is kept only with an identifier and a date at which it is looked at again, from the server or
-/// from the record itself; otherwise the stored one goes. True when the account has another record than
-/// before.
+/// Record data is kept only with an identifier and a date at which to look at it again, from the server or
+/// from the record itself; otherwise the stored one goes. True when the account's record is another one now.
 bool applyValidationRecord(const AccountRecord& before, const Dictionary& answer, Dictionary& values) {
     const String identifier = answer.string(kVeltoIDAccountValidationRecordIdentifierKey);
     const Data data = answer.data(kVeltoIDAccountValidationRecordDataKey);
@@ -242,13 +236,11 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
         return true;
     }
     handleServerError(request.name(), request.sentPasswordHash(), request.error());
-    fillError(error, request.error() ? *request.error() : VELTOID_ERROR(identity_error::kUnknown));
-    return false;
+    return failWith(error, request.error().value_or(VELTOID_ERROR(identity_error::kUnknown)));
 }
 
 void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer) {
-    AccountRecord before;
-    const bool existed = __VeltoIDDBCopyVeltoIDAccount(accountName, &before);
+    const AccountRecord before = accountRecordOf(accountName);
     Dictionary values = answer;
     values.set(kVeltoIDAccountLastValidationDateKey, Value::date(platform::now()));
     // Records keep the list of all addresses under their own name for it.
@@ -256,10 +248,9 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
     values.remove(message::kAllEmails);
     applyCertificateValidity(accountName, answer);
 
-    bool notify = false;
-    if (answer.contains(kVeltoIDAccountValidationRecordDataKey))
-        notify = applyValidationRecord(before, answer, values);
-    notify = notify || !existed || visibleDetailsChanged(before, values);
+    const bool hasOtherRecord = answer.contains(kVeltoIDAccountValidationRecordDataKey) &&
+                                applyValidationRecord(before, answer, values);
+    const bool notify = hasOtherRecord || !before.accountName() || visibleDetailsChanged(before, values);
 
     values.set(kVeltoIDAccountForceValidationKey, Value::null());
     values.set(kVeltoIDAccountNextValidationDateKey, Value::null());
@@ -268,13 +259,10 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
 }
 
 bool __VeltoIDCopyVeltoIDs(const Dictionary& /*options*/, Array* names, ErrorOut error) {
-    std::optional<Error> databaseError;
+    std::optional<Error> held;
     Array all;
-    if (!__VeltoIDDBCopyVeltoIDs(&all, &databaseError) && databaseError &&
-        databaseError->code != identity_error::kNoAccounts) {
-        fillError(error, databaseError);
-        return false;
-    }
+    if (!__VeltoIDDBCopyVeltoIDs(&all, &held) && held && held->code != identity_error::kNoAccounts)
+        return failWith(error, *held);
     fill(names, std::move(all));
     return true;
 }

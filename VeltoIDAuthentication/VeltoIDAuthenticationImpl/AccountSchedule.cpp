@@ -5,7 +5,6 @@
 
 #include "Platform/runtime/Clock.h"
 #include "Values/DictionaryAccess.h"
-#include "Values/Error.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
@@ -204,16 +203,10 @@ std::optional<double> AccountSchedule::endOfEmbargo() const {
     return now_ + kNeverForOldClients;
 }
 
-bool copyNextActionDateForAccount(const String& accountName, std::optional<double>* date) {
-    fill(date, std::optional<double>());
-    AccountRecord record;
-    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record) ||
-        !record.values().contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-        return false;
-    CertificateEntry entry;
-    __VeltoIDDBCopyCertificateInfo(record.encDsId(), &entry);
-    fill(date, AccountSchedule(record, entry, {}).nextAction());
-    return true;
+std::optional<double> nextActionOf(const String& accountName) {
+    const AccountRecord record = accountRecordOf(accountName);
+    if (!record.values().contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey)) return std::nullopt;
+    return AccountSchedule(record, certificateEntryOf(record.encDsId()), {}).nextAction();
 }
 
 }  // namespace veltoid

@@ -3,6 +3,7 @@
 #include <algorithm>
 
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
@@ -75,10 +76,8 @@ AddedAccount readd(const String& accountName) {
     std::optional<Error> copyError;
     AddedAccount added;
     copyOutcome(accountName, added, &copyError);
-    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
-                     "VeltoIDAuth: Already existing account " << accountName.view() << " re-added; "
-                                                              << (added.encDsId ? "succeeded." : "failed, ")
-                                                              << describeError(copyError));
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Already existing account ", accountName,
+                     " re-added; ", (added.encDsId ? "succeeded." : "failed, "), describeError(copyError));
     return added;
 }
 
@@ -97,10 +96,8 @@ AddedAccount addAnew(const String& accountName, const String& hashedPassword, co
     }
     AddedAccount added{encDsId, {}};
     const bool succeeded = proceeds && copyOutcome(accountName, added, &held);
-    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
-                     "VeltoIDAuth: Adding account " << accountName.view() << " "
-                                                    << (succeeded ? "succeeded." : "failed, ")
-                                                    << describeError(held));
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Adding account ", accountName, " ",
+                     (succeeded ? "succeeded." : "failed, "), describeError(held));
     return added;
 }
 
@@ -117,10 +114,8 @@ void forgetOtherAccounts(const String& added) {
 /// Lets some time pass before the account is looked at again: until its next action, but not for long.
 void waitForNextAction(const String& accountName) {
     const double now = platform::now();
-    std::optional<double> next;
-    if (!copyNextActionDateForAccount(accountName, &next) || !next || *next <= now) next = now + kMinWait;
-    const platform::Semaphore neverSignalled;
-    (void)neverSignalled.wait(std::clamp(*next - now, kMinWait, kMaxWait));
+    const double next = nextActionOf(accountName).value_or(now);
+    (void)platform::Semaphore().wait(std::clamp(next - now, kMinWait, kMaxWait));
 }
 
 bool waitForCertificate(const String& accountName, const Dictionary& options,
@@ -152,14 +147,11 @@ bool waitForCertificate(const String& accountName, const Dictionary& options,
 
 bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPassword, const Dictionary& options,
                            AddedAccount* added, ErrorOut error) {
-    if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr)) {
-        fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-        return false;
-    }
-    AccountRecord record;
-    __VeltoIDDBCopyVeltoIDAccount(accountName, &record);
-    AddedAccount outcome = isAlreadyOnItsWay(record, options) ? readd(accountName)
-                                                              : addAnew(accountName, hashedPassword, options);
+    if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr))
+        return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+    AddedAccount outcome = isAlreadyOnItsWay(accountRecordOf(accountName), options)
+                               ? readd(accountName)
+                               : addAnew(accountName, hashedPassword, options);
     platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
     fill(added, std::move(outcome));
     return true;

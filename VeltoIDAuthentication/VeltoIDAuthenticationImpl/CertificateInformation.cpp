@@ -1,23 +1,20 @@
 #include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 
+#include "Logging/Failure.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/EntryTable.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 
 namespace veltoid {
 namespace {
 
-struct InformationEntry {
-    std::string_view key;
-    Value::Kind kind;
-};
-
-constexpr InformationEntry kEntries[] = {
+constexpr TakenEntry kEntries[] = {
     {kVeltoIDAccountDSIDKey, Value::Kind::String},
     {kVeltoIDCertificateStatusKey, Value::Kind::String},
     {kVeltoIDCertificateTypeKey, Value::Kind::String},
@@ -27,22 +24,15 @@ constexpr InformationEntry kEntries[] = {
     {kVeltoIDCertificateModificationDateKey, Value::Kind::Date},
 };
 
-constexpr InformationEntry kReferences[] = {
+constexpr TakenEntry kReferences[] = {
     {kVeltoIDCertificateCertificatePersistentReferenceKey, Value::Kind::Data},
     {kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::Kind::Data},
 };
 
-constexpr InformationEntry kDetails[] = {
+constexpr TakenEntry kDetails[] = {
     {kVeltoIDCertificateIntermediateCertificateReferenceKey, Value::Kind::Data},
     {kVeltoIDCertificateNextRenewalAttemptDateKey, Value::Kind::Date},
 };
-
-void takeEntries(const Dictionary& entry, std::span<const InformationEntry> entries,
-                 Dictionary& information) {
-    for (const InformationEntry& wanted : entries)
-        if (const Value& value = entry[wanted.key]; value.kind() == wanted.kind)
-            information.set(wanted.key, value);
-}
 
 /// The encDsId that is asked for; null when there is none, or the account has another one.
 String requestedEncDsId(const String& accountName, const String& encDsId) {
@@ -56,15 +46,9 @@ String requestedEncDsId(const String& accountName, const String& encDsId) {
 bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
                                   Dictionary* information, ErrorOut error) {
     const String requested = requestedEncDsId(accountName, encDsId);
-    CertificateEntry entry;
-    if (!requested) {
-        fillError(error, Error{String(kOSStatusErrorDomain), -1, {}});
-        return false;
-    }
-    if (!__VeltoIDDBCopyCertificateInfo(requested, &entry)) {
-        fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-        return false;
-    }
+    if (!requested) return failWith(error, {kOSStatusErrorDomain, -1, {}});
+    const CertificateEntry entry = certificateEntryOf(requested);
+    if (!entry.exists()) return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
     Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
     takeEntries(entry.values(), kEntries, found);
     if (getBool(&options, option::kCertificateDetails, false)) takeEntries(entry.values(), kDetails, found);

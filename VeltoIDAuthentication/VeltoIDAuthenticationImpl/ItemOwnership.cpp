@@ -31,10 +31,9 @@ bool isReferredTo(const Data& reference) {
     Array encDsIds;
     __VeltoIDDBCopyCertificateKeys(&encDsIds);
     return std::any_of(encDsIds.begin(), encDsIds.end(), [&](const Value& encDsId) {
-        CertificateEntry entry;
-        return __VeltoIDDBCopyCertificateInfo(encDsId.asString(), &entry) &&
-               (entry.reference() == reference || entry.privateKeyReference() == reference ||
-                entry.intermediateReference() == reference);
+        const CertificateEntry entry = certificateEntryOf(encDsId.asString());
+        return entry.reference() == reference || entry.privateKeyReference() == reference ||
+               entry.intermediateReference() == reference;
     });
 }
 
@@ -50,8 +49,7 @@ std::set<std::string> encDsIdsOfAccounts() {
     Array names;
     __VeltoIDDBCopyVeltoIDs(&names);
     for (const Value& name : names) {
-        AccountRecord record;
-        if (!__VeltoIDDBCopyVeltoIDAccount(name.asString(), &record)) continue;
+        const AccountRecord record = accountRecordOf(name.asString());
         if (const String encDsId = record.encDsId()) encDsIds.insert(encDsId.text());
         const auto embargo = record.earliestConnection();
         if (embargo && *embargo < platform::now())
@@ -62,8 +60,8 @@ std::set<std::string> encDsIdsOfAccounts() {
 }
 
 bool isOfUse(const String& encDsId) {
-    CertificateEntry entry;
-    return __VeltoIDDBCopyCertificateInfo(encDsId, &entry) && !entry.isInvalid() &&
+    const CertificateEntry entry = certificateEntryOf(encDsId);
+    return !entry.isInvalid() &&
            entry.values().contains(kVeltoIDCertificateCertificatePersistentReferenceKey) &&
            entry.values().contains(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
 }
@@ -99,8 +97,8 @@ void discardReplacedItems(const OwnershipLock& /*ownership*/, const CertificateE
 }
 
 void discardCertificate(const OwnershipLock& ownership, const String& encDsId, const DroppedItems& dropped) {
-    CertificateEntry entry;
-    if (!__VeltoIDDBCopyCertificateInfo(encDsId, &entry)) return;
+    const CertificateEntry entry = certificateEntryOf(encDsId);
+    if (!entry.exists()) return;
     __VeltoIDDBRemoveCertificateInfo(encDsId);
     Dictionary kept;
     if (!dropped.certificate)
@@ -135,10 +133,10 @@ void cleanUpAccountsAndCertificates(const OwnershipLock& ownership) {
         if (owned.contains(encDsId.text()) && isOfUse(encDsId)) continue;
         String accountName;
         __VeltoIDDBCopyVeltoIDForDSID(encDsId, &accountName);
-        VELTOID_LOG_FROM("__VeltoIDCleanupAccountsAndCertificates", kNotice,
-                         "Removing certificate and private key  from keychain, and certificate from db, for "
-                         "account "
-                             << accountName.view() << " / dsID=" << encDsId.view());
+        VELTOID_LOG_FROM(
+            "__VeltoIDCleanupAccountsAndCertificates", kNotice,
+            "Removing certificate and private key  from keychain, and certificate from db, for account ",
+            accountName, " / dsID=", encDsId);
         discardCertificate(ownership, encDsId);
     }
 }

@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
-#include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/crypto/TrustEvaluation.h"
 #include "Platform/runtime/Clock.h"
@@ -15,7 +14,7 @@
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -51,17 +50,14 @@ class AccountCheck {
     std::optional<AccountState> examinePassword() const {
         const Data reference = record_.passwordReference();
         if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice,
-                             "checkAccount: Velto ID " << accountName_.view()
-                                                       << " doesn't have a password; no next action.");
+            VELTOID_LOG_FROM(kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
+                             " doesn't have a password; no next action.");
             return AccountState::PasswordInvalid;
         }
         if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) return std::nullopt;
-        VELTOID_LOG_FROM(kFunction, kNotice,
-                         "checkAccount: Velto ID "
-                             << accountName_.view()
-                             << " doesn't have a password or the password has been removed "
-                                "from the keychain; no next action.");
+        VELTOID_LOG_FROM(
+            kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
+            " doesn't have a password or the password has been removed from the keychain; no next action.");
         return AccountState::PasswordInaccessibleInKeychain;
     }
 
@@ -153,16 +149,16 @@ class AccountCheck {
         const Data reference = entry_.reference();
         if (!reference) {
             VELTOID_LOG_FROM(kFunction, kNotice,
-                             "Failed trying to get certificate from keychain for veltoID "
-                                 << accountName_.view() << " because certRef=NULL");
+                             "Failed trying to get certificate from keychain for veltoID ", accountName_,
+                             " because certRef=NULL");
             return false;
         }
         if (copyCertificateFromKeychainGivenPersistentRef(reference, certificate) && *certificate)
             return true;
         VELTOID_LOG_FROM(
             kFunction, kNotice,
-            "Failed trying to get certificate from keychain from persistent reference for veltoID "
-                << accountName_.view() << " certRef=" << describeValue(reference));
+            "Failed trying to get certificate from keychain from persistent reference for veltoID ",
+            accountName_, " certRef=", reference);
         return false;
     }
 
@@ -171,13 +167,12 @@ class AccountCheck {
             "Failed trying to get private key from keychain from persistent reference for veltoID ";
         const Data reference = entry_.privateKeyReference();
         if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice, kText << accountName_.view() << " privateKeyRef=NULL");
+            VELTOID_LOG_FROM(kFunction, kNotice, kText, accountName_, " privateKeyRef=NULL");
             return false;
         }
         // That it can be unsealed says enough: reading a key costs as much as all the rest of a check.
         if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return true;
-        VELTOID_LOG_FROM(kFunction, kNotice,
-                         kText << accountName_.view() << " certRef=" << describeValue(reference));
+        VELTOID_LOG_FROM(kFunction, kNotice, kText, accountName_, " certRef=", reference);
         return false;
     }
 
@@ -204,12 +199,9 @@ class AccountCheck {
             case RecoverableFailure:
                 return AccountState::CertificateAssumedOK;
             case Deny:
-                VELTOID_LOG_FROM(
-                    kFunction, kNotice,
-                    "Removing certificate, serial#="
-                        << entry_.serialNumber().view() << " for veltoID " << accountName_.view()
-                        << " dsID=" << encDsId_.view()
-                        << " because it is not present in the certificates the server has for us.");
+                VELTOID_LOG_FROM(kFunction, kNotice, "Removing certificate, serial#=", entry_.serialNumber(),
+                                 " for veltoID ", accountName_, " dsID=", encDsId_,
+                                 " because it is not present in the certificates the server has for us.");
                 return AccountState::CertificateRevoked;
             case FatalFailure:
                 return AccountState::CertificateRevoked;

@@ -27,10 +27,9 @@ bool updateItem(const Data& reference, const Certificate& certificate, const Str
          label.text(), kKeychainAccessGroup});
     if (status == platform::kKeychainSuccess) return true;
     const Dictionary attributes = {{"accessGroup", kKeychainAccessGroup}, {"label", label}};
-    VELTOID_LOG_FROM("addCertificateToKeychain", kNotice,
-                     "SetItemUpdate(" << keychain_items::describeItemQuery("cert", reference)
-                                      << ", attrs=" << describeValue(attributes) << " err=" << status
-                                      << " so deleting and re-adding item.");
+    VELTOID_LOG_FROM("addCertificateToKeychain", kNotice, "SetItemUpdate(",
+                     keychain_items::describeItemQuery("cert", reference), ", attrs=", attributes,
+                     " err=", status, " so deleting and re-adding item.");
     return false;
 }
 
@@ -42,8 +41,8 @@ Data addItem(const Certificate& certificate, const String& label) {
     const KeychainStatus status =
         platform::keychain::add(attributes, Accessibility::Always, certificate.der, &added);
     if (status == platform::kKeychainSuccess) return keychain_items::dataOf(added);
-    VELTOID_LOG_FROM("addCertificateToKeychain", kError,
-                     "Certificate " << describeValue(label) << " not added to keychain; err=" << status);
+    VELTOID_LOG_FROM("addCertificateToKeychain", kError, "Certificate ", describeValue(label),
+                     " not added to keychain; err=", status);
     return {};
 }
 
@@ -102,11 +101,9 @@ bool removeCertificateFromKeychainGivenPersistentRef(const Data& persistentRefer
         const KeychainStatus status = platform::keychain::remove(
             keychain_items::queryForReference(KeychainItemClass::Certificate, persistentReference));
         if (status == platform::kKeychainSuccess || status == platform::kKeychainItemNotFound) return true;
-        VELTOID_LOG_FROM("removeCertificateFromKeychainGivenPersistentRef", kError,
-                         "Error #" << status
-                                   << " from keychain::remove(), "
-                                      "removeCertificateFromKeychainGivenPersistentRef #"
-                                   << __LINE__);
+        VELTOID_LOG_FROM("removeCertificateFromKeychainGivenPersistentRef", kError, "Error #", status,
+                         " from keychain::remove(), removeCertificateFromKeychainGivenPersistentRef #",
+                         __LINE__);
         return false;
     });
 }

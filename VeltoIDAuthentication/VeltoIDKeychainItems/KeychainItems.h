@@ -73,11 +73,14 @@ class MemoryTable {
         items_.emplace_back(uuidBytes(platform::randomUUID()), item);
         return items_.back().first;
     }
-    /// Null when there is none.
-    const Item* find(const Data& reference) const {
-        for (const auto& [known, item] : items_)
-            if (known == reference) return &item;
-        return nullptr;
+    /// True and the item, when there is one.
+    bool copy(const Data& reference, Item* out) const {
+        for (const auto& [known, item] : items_) {
+            if (known != reference) continue;
+            if (out != nullptr) *out = item;
+            return true;
+        }
+        return false;
     }
     bool remove(const Data& reference) {
         return std::erase_if(items_, [&](const auto& item) { return item.first == reference; }) > 0;

@@ -39,8 +39,7 @@ KeychainStatus updateItem(const Data& reference, const Key& key, const std::stri
                                        accessibilityOf(key), label, kKeychainAccessGroup});
 }
 
-/// Adds the item. If the keychain reports a duplicate that the search did not find, that one is removed and
-/// the addition tried once more.
+/// Adds the item; a duplicate that the search did not find makes room for it once.
 Data addItem(const Key& key, const std::string& label) {
     KeychainAttributes attributes = identityOf(key);
     attributes.label = label;
@@ -111,11 +110,7 @@ bool copyPersistentRefForKey(const Key& key, Data* persistentReference) {
 bool copyKeyFromKeychainGivenPersistentRef(const Data& persistentReference, Key* key) {
     if (!persistentReference) return false;
     return keychainQueue().sync([&] {
-        if (!usesSystemKeychain()) {
-            const Key* found = memoryItems().find(persistentReference);
-            if (found != nullptr && key != nullptr) *key = *found;
-            return found != nullptr;
-        }
+        if (!usesSystemKeychain()) return memoryItems().copy(persistentReference, key);
         platform::SecretBytes data;
         const auto query = keychain_items::queryForReference(KeychainItemClass::Key, persistentReference);
         if (platform::keychain::copyMatchingData(query, &data) != platform::kKeychainSuccess) return false;

@@ -51,10 +51,8 @@ void applyRelaunch(const Dictionary& reply) {
     const int32_t interval = getInt32(&reply, wire::kNextLaunchInterval, 0);
     if (interval < 1) return;
     const double date = platform::now() + interval;
-    VELTOID_LOG_FROM("xmlInvoke", kNotice,
-                     "Received 'NextLaunchTimeInterval' == " << interval
-                                                             << " from server, so setting NextLaunchDate to "
-                                                             << describeValue(Value::date(date)));
+    VELTOID_LOG_FROM("xmlInvoke", kNotice, "Received 'NextLaunchTimeInterval' == ", interval,
+                     " from server, so setting NextLaunchDate to ", Value::date(date));
     requestRelaunch(date);
 }
 

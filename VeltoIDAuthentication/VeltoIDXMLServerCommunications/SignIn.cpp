@@ -82,11 +82,10 @@ class SignIn {
     bool mayConnect() {
         if (!hasRecord_) return true;
         if (record_.isClientTooOld()) {
-            VELTOID_LOG_FROM(
-                kOperation, kNotice,
-                "Not connecting to VeltoID authentication server because clientTooOld = true is set "
-                "for this account "
-                    << accountName_.view() << ".");
+            VELTOID_LOG_FROM(kOperation, kNotice,
+                             "Not connecting to VeltoID authentication server because clientTooOld = true is "
+                             "set for this account ",
+                             accountName_, ".");
             held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
             return false;
         }
@@ -94,9 +93,8 @@ class SignIn {
         if (earliest && *earliest > now_) {
             VELTOID_LOG_FROM(kOperation, kNotice,
                              "Not connecting to VeltoID authentication server because there is an "
-                             "earliest-allowed-connection-date set for this account "
-                                 << accountName_.view() << ", " << describeValue(Value::date(*earliest))
-                                 << " which is before now.");
+                             "earliest-allowed-connection-date set for this account ",
+                             accountName_, ", ", Value::date(*earliest), " which is before now.");
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
             return false;
         }
@@ -113,9 +111,8 @@ class SignIn {
                                                   signInError(identity_error::kUnknown, __LINE__));
         }
         if (session_) return;
-        VELTOID_LOG_FROM(kOperation, kNotice,
-                         "Didn't succeed with .authenticate, and error is "
-                             << describeValue(held_ ? Value(*held_) : Value()) << " so releasing session.");
+        VELTOID_LOG_FROM(kOperation, kNotice, "Didn't succeed with .authenticate, and error is ",
+                         held_ ? Value(*held_) : Value(), " so releasing session.");
     }
 
     Dictionary authenticateParameters() {
@@ -133,9 +130,7 @@ class SignIn {
         oldEncDsId_ = record_.encDsId();
         oldRecordIdentifier_ = record_.validationRecordIdentifier();
         parameters.set(wire::kKnownRecordIdentifier, oldRecordIdentifier_);
-        CertificateEntry entry;
-        __VeltoIDDBCopyCertificateInfo(oldEncDsId_, &entry);
-        parameters.set(wire::kKnownSerialNumber, entry.serialNumber());
+        parameters.set(wire::kKnownSerialNumber, certificateEntryOf(oldEncDsId_).serialNumber());
         const String uuid = record_.uuid();
         parameters.set(wire::kAccountUUID, uuid);
         parameters.set(wire::kMachineUUID, uuid);
@@ -189,10 +184,9 @@ class SignIn {
     }
 
     void disableCertificatesOfChangedAccount() {
-        VELTOID_LOG_FROM(kOperation, kError,
-                         "Got back a different encDSID for our account, "
-                             << describeValue(encDsId_) << " vs " << describeValue(oldEncDsId_)
-                             << " so disabling the certs and VeltoIDValidationRecord on this account.");
+        VELTOID_LOG_FROM(kOperation, kError, "Got back a different encDSID for our account, ",
+                         describeValue(encDsId_), " vs ", describeValue(oldEncDsId_),
+                         " so disabling the certs and VeltoIDValidationRecord on this account.");
         for (const String& encDsId : {oldEncDsId_, encDsId_})
             __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey,
                                            kVeltoIDCertificateStatusInvalid);
@@ -250,8 +244,8 @@ class SignIn {
 Session __VeltoIDSessionDoCreateSession(const String& accountName, const String& passwordHash,
                                         const Dictionary& options, String* encDsId,
                                         std::optional<Dictionary>* result, ErrorOut error) {
-    if (encDsId != nullptr) *encDsId = nullptr;
-    if (result != nullptr) result->reset();
+    fill(encDsId, {});
+    fill(result, {});
     if (!accountName || !passwordHash) return nullptr;
     return copySessionQueueForAccount(accountName).sync([&] {
         SignIn signIn(accountName, passwordHash, options);
@@ -260,8 +254,8 @@ Session __VeltoIDSessionDoCreateSession(const String& accountName, const String&
         if (!session) {
             fillError(error, signIn.error());
         } else {
-            if (encDsId != nullptr) *encDsId = signIn.encDsId();
-            if (result != nullptr) *result = signIn.result();
+            fill(encDsId, signIn.encDsId());
+            fill(result, signIn.result());
         }
         return session;
     });
