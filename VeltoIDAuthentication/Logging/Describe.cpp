@@ -16,13 +16,8 @@
 namespace veltoid {
 namespace {
 
-struct ErrorName {
-    int64_t code;
-    const char* name;
-};
-
 /// Codes of kIdentityErrorDomain.
-constexpr ErrorName kErrorNames[] = {
+constexpr std::pair<int64_t, const char*> kErrorNames[] = {
     {-100, "kHWIdentityVeltoIDUnknownError"},
     {-99, "kHWIdentityInvalidParametersErr"},
     {-10, "kHWIdentityCertificateDoesNotContainRequestedValueErr"},
@@ -166,8 +161,8 @@ void appendError(std::string& text, const Error& error) {
     text += " #" + std::to_string(error.code);
     if (error.domain.view() == kIdentityErrorDomain) {
         const auto* name = std::find_if(std::begin(kErrorNames), std::end(kErrorNames),
-                                        [&](const ErrorName& entry) { return entry.code == error.code; });
-        if (name != std::end(kErrorNames)) text.append(" ").append(name->name);
+                                        [&](const auto& entry) { return entry.first == error.code; });
+        if (name != std::end(kErrorNames)) text.append(" ").append(name->second);
     }
     if (error.userInfo.empty()) return;
     text += ' ';

@@ -123,13 +123,12 @@ class AccountCheckLoop {
 
     /// Waits until a pass is allowed again; what signals meanwhile is looked at by that pass.
     void keepDistance() {
-        const platform::Semaphore neverSignalled;
         while (lastPass_ && !isEnding()) {
             const double missing = *lastPass_ + kMinTimeBetweenPasses - platform::now();
             // A clock that was set back is no reason to wait for longer.
             if (missing <= 0 || missing > kMinTimeBetweenPasses) break;
             transaction_.close();
-            (void)neverSignalled.wait(missing);
+            (void)platform::Semaphore().wait(missing);
             transaction_.reopen();
         }
         while (state().semaphore.wait(0)) {

@@ -22,7 +22,6 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
-#include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/ServerRequests.h"

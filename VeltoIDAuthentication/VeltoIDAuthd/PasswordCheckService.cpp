@@ -19,16 +19,10 @@ bool updateLinkedIdentity(const Request& request, const LinkedIdentityHandler& u
 }
 
 bool run(Request& request, const LinkedIdentityHandler& linkedIdentity, ErrorOut error) {
-    switch (request.command()) {
-        case command::kPing:
-            return true;
-        case command::kVerify:
-            return verifyRequestedPassword(request, error);
-        case command::kUpdateLinkedIdentity:
-            return updateLinkedIdentity(request, linkedIdentity, error);
-        default:
-            return false;
-    }
+    if (request.command() == command::kPing) return true;
+    if (request.command() == command::kVerify) return verifyRequestedPassword(request, error);
+    return request.command() == command::kUpdateLinkedIdentity &&
+           updateLinkedIdentity(request, linkedIdentity, error);
 }
 
 }  // namespace

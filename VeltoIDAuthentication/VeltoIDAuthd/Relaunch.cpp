@@ -74,8 +74,8 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
 
 void computeRelaunchFromAccounts() {
     std::optional<double> earliest;
-    const Array accounts = copyAccountsNeedingAction(&earliest);
-    if (!accounts.empty() && earliest) scheduleRelaunch(earliest);
+    copyAccountsNeedingAction(&earliest);
+    if (earliest) scheduleRelaunch(earliest);
     __VeltoIDDBSynchronize();
 }
 

@@ -149,15 +149,10 @@ class FindPersonCache {
 
     void seed() {
         if (isSeeded_ || !usesPreferences_) return;
-        ValueBuilder stored;
-        const auto result = domain().read(kVeltoIDFindPersonCacheKey, stored);
-        if (result == Preferences::ReadResult::Failed) return;
-        // What is damaged is kept aside, so that nothing written later takes its place.
-        if (result == Preferences::ReadResult::Damaged && !domain().setAside(kVeltoIDFindPersonCacheKey))
-            return;
+        const auto stored = database::readStored(domain(), kVeltoIDFindPersonCacheKey);
+        if (!stored) return;
         isSeeded_ = true;
-        const Dictionary* people = stored.value().asDictionary();
-        if (result == Preferences::ReadResult::Found && people != nullptr) seedFrom(*people);
+        if (const Dictionary* people = stored->asDictionary()) seedFrom(*people);
     }
 
     /// What is here already has been added since and is newer than anything stored.

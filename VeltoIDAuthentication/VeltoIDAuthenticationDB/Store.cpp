@@ -43,15 +43,13 @@ std::pair<std::string, platform::ValueWriter> preference(std::string_view key, c
 
 enum class OtherEntries { Drop, Keep };
 
-/// A stored section; none when it cannot be read now. Entries that are no dictionaries are dropped or kept. A
-/// damaged section is kept aside, so that nothing that is written later takes its place.
+/// A stored section; none when it cannot be read now. Entries that are no dictionaries are dropped or kept.
 std::optional<Dictionary> readSection(const platform::Preferences& domain, std::string_view key,
                                       OtherEntries others) {
-    const StoredValue stored = readPreference(domain, key);
-    if (stored.result == ReadResult::Failed) return std::nullopt;
-    if (stored.result == ReadResult::Damaged && !domain.setAside(key)) return std::nullopt;
+    const auto stored = readStored(domain, key);
+    if (!stored) return std::nullopt;
     Dictionary section;
-    if (const Dictionary* entries = stored.value.asDictionary())
+    if (const Dictionary* entries = stored->asDictionary())
         for (const auto& [name, value] : *entries)
             if (others == OtherEntries::Keep || value.isDictionary()) section.set(name, value);
     return section;
@@ -82,6 +80,13 @@ std::string_view keyOf(Dictionary Store::*section) {
 }
 
 }  // namespace
+
+std::optional<Value> readStored(const platform::Preferences& domain, std::string_view key) {
+    const StoredValue stored = readPreference(domain, key);
+    if (stored.result == ReadResult::Failed) return std::nullopt;
+    if (stored.result == ReadResult::Damaged && !domain.setAside(key)) return std::nullopt;
+    return stored.value;
+}
 
 double flushDelay() { return platform::Lifetime::current().isEnding() ? 0 : kVeltoIDDBFlushDelay; }
 

@@ -106,6 +106,10 @@ bool change(Dictionary& dictionary, const String& key, const Value& value);
 
 Array keysOf(const Dictionary& section);
 
+/// The stored value; absent when there is none, or a damaged one, which is kept aside so that nothing that is
+/// written later takes its place. None when it cannot be read now.
+std::optional<Value> readStored(const platform::Preferences& domain, std::string_view key);
+
 /// How long what has changed waits for more to be written with it; not at all when the lifetime ends.
 double flushDelay();
 

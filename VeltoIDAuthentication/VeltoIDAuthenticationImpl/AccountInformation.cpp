@@ -19,6 +19,8 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/EntryTable.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
@@ -115,29 +117,21 @@ class InformationRequest {
     }
 
     bool askServer(bool fresh) {
-        std::optional<Error> sessionError;
         encDsId_ = nullptr;
         password_ = __VeltoIDDBCopyHashedPassword(record_);
         const Session session =
-            __VeltoIDSessionDoCreateSession(name_, password_, options_, &encDsId_, nullptr, &sessionError);
-        if (!session) {
-            if (sessionError) held_ = sessionError;
-            if (known_ && !fresh) markForValidation();
-            return known_;
-        }
-        return fetch(*session);
+            __VeltoIDSessionDoCreateSession(name_, password_, options_, &encDsId_, nullptr, &held_);
+        if (session) return fetch(*session);
+        if (known_ && !fresh) markForValidation();
+        return known_;
     }
 
     bool fetch(VeltoIDAuthenticationSessionInfo& session) {
         Dictionary result;
-        std::optional<Error> fetchError;
-        if (_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result,
-                                       &fetchError)) {
-            updateAccountWithGetMyInfoResult(name_, result);
-            return __VeltoIDDBCopyVeltoIDAccount(name_, &record_, &held_);
-        }
-        held_ = fetchError;
-        return known_ && __VeltoIDDBCopyVeltoIDAccount(name_, &record_);
+        if (!_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result, &held_))
+            return known_ && __VeltoIDDBCopyVeltoIDAccount(name_, &record_);
+        updateAccountWithGetMyInfoResult(name_, result);
+        return __VeltoIDDBCopyVeltoIDAccount(name_, &record_, &held_);
     }
 
     /// What the agent has already; an empty identifier makes the server send its record.
@@ -226,6 +220,33 @@ bool visibleDetailsChanged(const AccountRecord& before, const Dictionary& values
     });
 }
 
+constexpr TakenEntry kCertificateEntries[] = {
+    {kVeltoIDAccountDSIDKey, Value::Kind::String},
+    {kVeltoIDCertificateStatusKey, Value::Kind::String},
+    {kVeltoIDCertificateTypeKey, Value::Kind::String},
+    {kVeltoIDCertificateSerialNumberKey, Value::Kind::String},
+    {kVeltoIDCertificateExpirationDateKey, Value::Kind::Date},
+    {kVeltoIDCertificateCreationDateKey, Value::Kind::Date},
+    {kVeltoIDCertificateModificationDateKey, Value::Kind::Date},
+};
+
+constexpr TakenEntry kCertificateReferences[] = {
+    {kVeltoIDCertificateCertificatePersistentReferenceKey, Value::Kind::Data},
+    {kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::Kind::Data},
+};
+
+constexpr TakenEntry kCertificateDetails[] = {
+    {kVeltoIDCertificateIntermediateCertificateReferenceKey, Value::Kind::Data},
+    {kVeltoIDCertificateNextRenewalAttemptDateKey, Value::Kind::Date},
+};
+
+/// The encDsId that is asked for; null when there is none, or the account has another one.
+String requestedEncDsId(const String& accountName, const String& encDsId) {
+    if (!accountName) return encDsId;
+    const String own = __VeltoIDDBCopyAccountValue(accountName, kVeltoIDAccountDSIDKey).asString();
+    return !encDsId || encDsId == own ? own : String();
+}
+
 }  // namespace
 
 bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, Dictionary* result,
@@ -256,6 +277,27 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
     values.set(kVeltoIDAccountNextValidationDateKey, Value::null());
     __VeltoIDDBSetAccountValues(accountName, values);
     if (notify) platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
+}
+
+bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
+                                  Dictionary* information, ErrorOut error) {
+    const String requested = requestedEncDsId(accountName, encDsId);
+    if (!requested) return failWith(error, {kOSStatusErrorDomain, -1, {}});
+    const CertificateEntry entry = certificateEntryOf(requested);
+    if (!entry.exists()) return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+    Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
+    takeEntries(entry.values(), kCertificateEntries, found);
+    if (getBool(&options, option::kCertificateDetails, false))
+        takeEntries(entry.values(), kCertificateDetails, found);
+    std::optional<platform::Certificate> certificate;
+    if (usesSystemKeychain()) {
+        takeEntries(entry.values(), kCertificateReferences, found);
+    } else if (copyCertificateFromKeychainGivenPersistentRef(entry.reference(), &certificate) &&
+               certificate) {
+        found.set(message::kCertificateData, Data(certificate->der));
+    }
+    fill(information, std::move(found));
+    return true;
 }
 
 bool __VeltoIDCopyVeltoIDs(const Dictionary& /*options*/, Array* names, ErrorOut error) {

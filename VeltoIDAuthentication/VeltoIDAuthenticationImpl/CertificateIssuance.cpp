@@ -42,7 +42,14 @@ class SigningRequest {
     SigningRequest(const OwnershipLock& ownership, const String& accountName, const Dictionary& options)
         : ownership_(ownership), accountName_(accountName), options_(options) {}
 
-    bool run() {
+    bool run(String* encDsId, ErrorOut error) {
+        const bool succeeded = perform();
+        if (encDsId_) fill(encDsId, encDsId_);
+        return succeeded || fail(accountName_, password_, held_, error);
+    }
+
+  private:
+    bool perform() {
         AccountRecord record;
         if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_) ||
             !admitCertificateRequest(record, &held_))
@@ -58,11 +65,6 @@ class SigningRequest {
         return succeeded;
     }
 
-    const String& encDsId() const { return encDsId_; }
-    const String& sentPasswordHash() const { return password_; }
-    const std::optional<Error>& error() const { return held_; }
-
-  private:
     /// The request takes the place of one that was pending.
     void begin(const AccountRecord& record) {
         setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now())},
@@ -195,10 +197,7 @@ bool fetch(const OwnershipLock& ownership, VeltoIDAuthenticationSessionInfo& ses
 bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
                                                    String* encDsId, ErrorOut error) {
     const OwnershipLock ownership;
-    SigningRequest request(ownership, accountName, options);
-    const bool succeeded = request.run();
-    if (encDsId != nullptr && request.encDsId()) *encDsId = request.encDsId();
-    return succeeded || fail(accountName, request.sentPasswordHash(), request.error(), error);
+    return SigningRequest(ownership, accountName, options).run(encDsId, error);
 }
 
 bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,

@@ -65,15 +65,16 @@ class AccountCheck {
         validationIsDue_ = schedule().isDue(DueReason::Validation);
         if (!validationIsDue_) return;
         if (record_.isValidationForced()) {
-            setInRecord(kVeltoIDAccountForceValidationKey, Value::null(), Notify::No);
+            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountForceValidationKey, Value::null(),
+                                       Notify::No);
         } else if (record_.nextValidation()) {
             postponeValidation(Notify::Yes);
         }
     }
 
     void postponeValidation(Notify notify) const {
-        setInRecord(kVeltoIDAccountNextValidationDateKey,
-                    Value::date(platform::now() + kValidationPostponement), notify);
+        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountNextValidationDateKey,
+                                   Value::date(platform::now() + kValidationPostponement), notify);
     }
 
     /// Asks the server about the account if its information is old or its validation due. A state only when
@@ -147,32 +148,22 @@ class AccountCheck {
 
     bool readCertificate(std::optional<platform::Certificate>* certificate) const {
         const Data reference = entry_.reference();
-        if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice,
-                             "Failed trying to get certificate from keychain for veltoID ", accountName_,
-                             " because certRef=NULL");
-            return false;
-        }
         if (copyCertificateFromKeychainGivenPersistentRef(reference, certificate) && *certificate)
             return true;
-        VELTOID_LOG_FROM(
-            kFunction, kNotice,
-            "Failed trying to get certificate from keychain from persistent reference for veltoID ",
-            accountName_, " certRef=", reference);
+        VELTOID_LOG_FROM(kFunction, kNotice, "Failed trying to get certificate from keychain ",
+                         reference ? "from persistent reference for veltoID " : "for veltoID ", accountName_,
+                         reference ? logText(" certRef=", reference) : " because certRef=NULL");
         return false;
     }
 
     bool readPrivateKey() const {
-        constexpr const char* kText =
-            "Failed trying to get private key from keychain from persistent reference for veltoID ";
         const Data reference = entry_.privateKeyReference();
-        if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice, kText, accountName_, " privateKeyRef=NULL");
-            return false;
-        }
         // That it can be unsealed says enough: reading a key costs as much as all the rest of a check.
         if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return true;
-        VELTOID_LOG_FROM(kFunction, kNotice, kText, accountName_, " certRef=", reference);
+        VELTOID_LOG_FROM(
+            kFunction, kNotice,
+            "Failed trying to get private key from keychain from persistent reference for veltoID ",
+            accountName_, reference ? logText(" certRef=", reference) : " privateKeyRef=NULL");
         return false;
     }
 
@@ -228,9 +219,6 @@ class AccountCheck {
         return session_ != nullptr;
     }
 
-    void setInRecord(std::string_view key, const Value& value, Notify notify) const {
-        __VeltoIDDBSetAccountValue(accountName_, key, value, notify);
-    }
     void setInEntry(std::string_view key, const Value& value) const {
         __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::No);
     }

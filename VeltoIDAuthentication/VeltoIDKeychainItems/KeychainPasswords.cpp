@@ -1,7 +1,5 @@
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
-#include <vector>
-
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/keychain/Keychain.h"
@@ -71,11 +69,9 @@ KeychainStatus addItem(const KeychainAttributes& attributes, const String& passw
 
 /// The reference of the account's item; null when the keychain refuses.
 Data addOrUpdate(const String& accountName, const String& passwordHash, const String& label) {
-    std::vector<PersistentReference> found;
-    KeychainStatus status = platform::keychain::copyMatchingReferences(queryForAccount(accountName), &found);
-    Data reference;
-    if (status == platform::kKeychainSuccess && !found.empty()) {
-        reference = keychain_items::dataOf(found.front());
+    KeychainStatus status = platform::kKeychainSuccess;
+    Data reference = keychain_items::copyReference(queryForAccount(accountName).attributes, &status);
+    if (reference) {
         status = updateItem(reference, passwordHash);
         if (status != platform::kKeychainSuccess && !keychain_items::mayPass(status)) {
             platform::keychain::remove(queryForAccount(accountName));

@@ -41,7 +41,19 @@ class SignIn {
     SignIn(const String& accountName, const String& passwordHash, const Dictionary& options)
         : accountName_(accountName), passwordHash_(passwordHash), options_(options) {}
 
-    void run() {
+    Session run(String* encDsId, std::optional<Dictionary>* result, ErrorOut error) {
+        perform();
+        if (session_) {
+            fill(encDsId, encDsId_);
+            fill(result, result_);
+        } else {
+            fillError(error, held_);
+        }
+        return Session(session_.release());
+    }
+
+  private:
+    void perform() {
         hasRecord_ = __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
         const String url = serverURL();
         if (!getBool(&options_, option::kDoNotUseCachedSession, false))
@@ -56,12 +68,6 @@ class SignIn {
         keepBooks();
     }
 
-    Session takeSession() { return Session(session_.release()); }
-    const String& encDsId() const { return encDsId_; }
-    const std::optional<Dictionary>& result() const { return result_; }
-    const std::optional<Error>& error() const { return held_; }
-
-  private:
     void count(std::string_view counter) {
         __VeltoIDDBIncrementMetaInfoCounter(accountName_, options_, counter, 1);
     }
@@ -248,16 +254,7 @@ Session __VeltoIDSessionDoCreateSession(const String& accountName, const String&
     fill(result, {});
     if (!accountName || !passwordHash) return nullptr;
     return copySessionQueueForAccount(accountName).sync([&] {
-        SignIn signIn(accountName, passwordHash, options);
-        signIn.run();
-        Session session = signIn.takeSession();
-        if (!session) {
-            fillError(error, signIn.error());
-        } else {
-            fill(encDsId, signIn.encDsId());
-            fill(result, signIn.result());
-        }
-        return session;
+        return SignIn(accountName, passwordHash, options).run(encDsId, result, error);
     });
 }
 

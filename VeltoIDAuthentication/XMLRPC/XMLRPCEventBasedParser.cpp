@@ -45,12 +45,41 @@ XMLRPCTag tagNamed(std::string_view name) {
     }
 }
 
+bool isNode(XMLRPCTag tag) {
+    return tag == XMLRPCTag::Value || tag == XMLRPCTag::Member || tag == XMLRPCTag::Name;
+}
+
+void addMember(Dictionary& dictionary, const String& key, Value value) {
+    if (!key) return;
+    if (value.isNull()) {
+        dictionary.remove(key.view());
+    } else {
+        dictionary.set(key, std::move(value));
+    }
+}
+
 }  // namespace
 
-XMLRPCEventBasedParserDelegate::Node::Node() { text.reserve(kTextCapacity); }
+XMLRPCEventBasedParser::Node::Node() { text.reserve(kTextCapacity); }
 
-bool XMLRPCEventBasedParserDelegate::push(XMLRPCTag type) {
-    if (depth_ == kMaxXMLRPCDepth) return false;
+Value XMLRPCEventBasedParser::parse() {
+    if (!myParser.read(*this)) return {};
+    return std::move(result_);
+}
+
+void XMLRPCEventBasedParser::startElement(std::string_view name) {
+    const XMLRPCTag tag = tagNamed(name);
+    if (isOpen() ? isNode(tag) : tag == XMLRPCTag::Value && !hasStarted_) {
+        push(tag == XMLRPCTag::Value ? XMLRPCTag::String : tag);
+    } else if (isOpen()) {
+        if (tag <= XMLRPCTag::Data) setType(tag);
+    } else if (tag == XMLRPCTag::Fault && !hasStarted_) {
+        myIsFault = true;
+    }
+}
+
+void XMLRPCEventBasedParser::push(XMLRPCTag type) {
+    if (depth_ == kMaxXMLRPCDepth) return abortParsing();
     if (depth_ == nodes_.size()) nodes_.emplace_back();
     Node& node = nodes_[depth_++];
     node.type = type;
@@ -58,16 +87,9 @@ bool XMLRPCEventBasedParserDelegate::push(XMLRPCTag type) {
     node.memberName = nullptr;
     node.memberValue = Value();
     hasStarted_ = true;
-    return true;
 }
 
-bool XMLRPCEventBasedParserDelegate::startElement(XMLRPCTag tag) {
-    if (isNode(tag)) return push(tag == XMLRPCTag::Value ? XMLRPCTag::String : tag);
-    if (tag <= XMLRPCTag::Data) setType(tag);
-    return true;
-}
-
-void XMLRPCEventBasedParserDelegate::setType(XMLRPCTag type) {
+void XMLRPCEventBasedParser::setType(XMLRPCTag type) {
     Node& node = nodes_[depth_ - 1];
     node.type = type;
     if (holdsText(type)) return;
@@ -76,13 +98,12 @@ void XMLRPCEventBasedParserDelegate::setType(XMLRPCTag type) {
     node.dictionary = Dictionary();
 }
 
-void XMLRPCEventBasedParserDelegate::characters(std::string_view text) {
-    Node& node = nodes_[depth_ - 1];
-    if (holdsText(node.type)) node.text.append(text);
+void XMLRPCEventBasedParser::characters(std::string_view text) {
+    if (isOpen() && holdsText(nodes_[depth_ - 1].type)) nodes_[depth_ - 1].text.append(text);
 }
 
-void XMLRPCEventBasedParserDelegate::endElement(XMLRPCTag tag) {
-    if (!isNode(tag)) return;
+void XMLRPCEventBasedParser::endElement(std::string_view name) {
+    if (!isOpen() || !isNode(tagNamed(name))) return;
     Node& node = nodes_[--depth_];
     if (depth_ == 0) {
         result_ = elementValue(node);
@@ -91,7 +112,7 @@ void XMLRPCEventBasedParserDelegate::endElement(XMLRPCTag tag) {
     }
 }
 
-Value XMLRPCEventBasedParserDelegate::elementValue(Node& node) {
+Value XMLRPCEventBasedParser::elementValue(Node& node) {
     const auto text = [&] { return xmlrpc::parseString(node.text); };
     switch (node.type) {
         case XMLRPCTag::Array:
@@ -116,7 +137,7 @@ Value XMLRPCEventBasedParserDelegate::elementValue(Node& node) {
     }
 }
 
-void XMLRPCEventBasedParserDelegate::addToParent(Node& node, Node& parent) {
+void XMLRPCEventBasedParser::addToParent(Node& node, Node& parent) {
     if (parent.type == XMLRPCTag::Array) {
         parent.array.append(elementValue(node));
     } else if (parent.type == XMLRPCTag::Struct) {
@@ -128,41 +149,10 @@ void XMLRPCEventBasedParserDelegate::addToParent(Node& node, Node& parent) {
     }
 }
 
-void XMLRPCEventBasedParserDelegate::addMember(Dictionary& dictionary, const String& key, Value value) {
-    if (!key) return;
-    if (value.isNull()) {
-        dictionary.remove(key.view());
-    } else {
-        dictionary.set(key, std::move(value));
-    }
-}
-
-String XMLRPCEventBasedParserDelegate::sharedName(std::string_view name) {
+String XMLRPCEventBasedParser::sharedName(std::string_view name) {
     String& slot = names_[hashOf(name) % names_.size()];
     if (!slot || slot.view() != name) slot = name;
     return slot;
-}
-
-Value XMLRPCEventBasedParser::parse() {
-    if (!myParser.read(*this)) return {};
-    return myParserDelegate.takeElementValue();
-}
-
-void XMLRPCEventBasedParser::startElement(std::string_view name) {
-    const XMLRPCTag tag = tagNamed(name);
-    if (myParserDelegate.isOpen() || (tag == XMLRPCTag::Value && !myParserDelegate.hasStarted())) {
-        if (!myParserDelegate.startElement(tag)) abortParsing();
-    } else if (tag == XMLRPCTag::Fault && !myParserDelegate.hasStarted()) {
-        myIsFault = true;
-    }
-}
-
-void XMLRPCEventBasedParser::endElement(std::string_view name) {
-    if (myParserDelegate.isOpen()) myParserDelegate.endElement(tagNamed(name));
-}
-
-void XMLRPCEventBasedParser::characters(std::string_view text) {
-    if (myParserDelegate.isOpen()) myParserDelegate.characters(text);
 }
 
 }  // namespace veltoid

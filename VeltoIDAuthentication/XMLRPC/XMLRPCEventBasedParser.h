@@ -36,54 +36,6 @@ enum class XMLRPCTag : uint8_t {
     Other
 };
 
-/// Assembles a value from the elements inside one `value` element. Used by one thread for one document.
-class XMLRPCEventBasedParserDelegate {
-  public:
-    /// The first one, which must be a Value, opens the root. False when there are too many open nodes.
-    bool startElement(XMLRPCTag tag);
-    void endElement(XMLRPCTag tag);
-    void characters(std::string_view text);
-
-    bool hasStarted() const { return hasStarted_; }
-    /// Between the start and the end of the root.
-    bool isOpen() const { return depth_ > 0; }
-
-    /// The root's value once it has ended; absent before.
-    Value takeElementValue() { return std::move(result_); }
-
-  private:
-    struct Node {
-        Node();
-
-        XMLRPCTag type = XMLRPCTag::String;
-        platform::SecretText text;
-        Array array;
-        Dictionary dictionary;
-        /// A Member's name and value.
-        String memberName;
-        Value memberValue;
-    };
-
-    static bool isNode(XMLRPCTag tag) {
-        return tag == XMLRPCTag::Value || tag == XMLRPCTag::Member || tag == XMLRPCTag::Name;
-    }
-    bool push(XMLRPCTag type);
-    void setType(XMLRPCTag type);
-    Value elementValue(Node& node);
-    void addToParent(Node& node, Node& parent);
-    static void addMember(Dictionary& dictionary, const String& key, Value value);
-    /// The same handle for the same name, as long as no other name took its place.
-    String sharedName(std::string_view name);
-
-    /// Records are never removed; the open ones come first.
-    std::vector<Node> nodes_;
-    size_t depth_ = 0;
-    bool hasStarted_ = false;
-    Value result_;
-    const String empty_ = "";
-    std::array<String, 256> names_;
-};
-
 /// Used by one thread for one `parse`.
 class XMLRPCEventBasedParser : private platform::XMLEvents {
   public:
@@ -104,13 +56,40 @@ class XMLRPCEventBasedParser : private platform::XMLEvents {
     bool isFault() const { return myIsFault; }
 
   private:
+    struct Node {
+        Node();
+
+        XMLRPCTag type = XMLRPCTag::String;
+        platform::SecretText text;
+        Array array;
+        Dictionary dictionary;
+        /// A Member's name and value.
+        String memberName;
+        Value memberValue;
+    };
+
     void startElement(std::string_view name) override;
     void endElement(std::string_view name) override;
     void characters(std::string_view text) override;
 
+    /// Between the start and the end of the root.
+    bool isOpen() const { return depth_ > 0; }
+    void push(XMLRPCTag type);
+    void setType(XMLRPCTag type);
+    Value elementValue(Node& node);
+    void addToParent(Node& node, Node& parent);
+    /// The same handle for the same name, as long as no other name took its place.
+    String sharedName(std::string_view name);
+
     platform::XMLReader myParser;
-    XMLRPCEventBasedParserDelegate myParserDelegate;
     bool myIsFault = false;
+    /// Records are never removed; the open ones come first.
+    std::vector<Node> nodes_;
+    size_t depth_ = 0;
+    bool hasStarted_ = false;
+    Value result_;
+    const String empty_ = "";
+    std::array<String, 256> names_;
 };
 
 }  // namespace veltoid
