@@ -60,9 +60,7 @@ class Deferrals {
     /// After a pass over the account.
     void note(const String& accountName) {
         const auto next = nextActionOf(accountName);
-        const bool isChanged =
-            __VeltoIDDBCopyAccountValue(accountName, kVeltoIDDirtyKey).asBoolean().value_or(false);
-        if (!next || isChanged || *next > platform::now()) {
+        if (!next || *next > platform::now() || accountRecordOf(accountName).isDirty()) {
             deferrals_.erase(accountName.text());
             return;
         }
@@ -114,9 +112,9 @@ class AccountCheckLoop {
     }
 
     /// Waits for a signal without a transaction; true when one came. A jump of the clock ends it too.
-    bool wait(double seconds) {
+    bool wait(double seconds, const platform::Semaphore& semaphore = state().semaphore) {
         transaction_.close();
-        const bool signalled = state().semaphore.wait(seconds);
+        const bool signalled = semaphore.wait(seconds);
         transaction_.reopen();
         return signalled;
     }
@@ -127,9 +125,7 @@ class AccountCheckLoop {
             const double missing = *lastPass_ + kMinTimeBetweenPasses - platform::now();
             // A clock that was set back is no reason to wait for longer.
             if (missing <= 0 || missing > kMinTimeBetweenPasses) break;
-            transaction_.close();
-            (void)platform::Semaphore().wait(missing);
-            transaction_.reopen();
+            (void)wait(missing, platform::Semaphore());
         }
         while (state().semaphore.wait(0)) {
         }

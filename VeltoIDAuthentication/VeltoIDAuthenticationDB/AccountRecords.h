@@ -70,7 +70,10 @@ class AccountRecord : Dictionary {
     // A certificate request: dates of those that were sent, and what is known of the pending one.
     Date requestGeneration() const { return date(kVeltoIDAccountCSRGenerationDateKey); }
     Seconds requestGenerationInterval() const { return number(kVeltoIDAccountCSRGenerationIntervalKey); }
-    const Array* requestDates() const { return array(kVeltoIDAccountCertificateRequestDatesKey); }
+    Array requestDates() const {
+        const Array* dates = array(kVeltoIDAccountCertificateRequestDatesKey);
+        return dates != nullptr ? *dates : Array();
+    }
     Date requestsHeldUntil() const { return date(kVeltoIDAccountCertificateRequestsHeldUntilKey); }
     Data pendingKeyReference() const { return data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey); }
     String certificateToken() const { return string(kVeltoIDAccountCertificateTokenKey); }

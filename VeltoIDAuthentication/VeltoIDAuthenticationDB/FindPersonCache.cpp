@@ -88,7 +88,6 @@ struct Entry {
     /// If so, both dates are finite.
     bool isEverGood() const { return std::isfinite(validUntil); }
     bool isGoodAt(double now) const { return validFrom <= now && now <= validUntil; }
-    bool hasEndedBy(double now) const { return now > validUntil; }
 };
 
 class FindPersonCache {
@@ -194,7 +193,7 @@ class FindPersonCache {
         const double now = platform::now();
         for (auto entry = entries_.begin(); entry != entries_.end();) {
             const auto current = entry++;
-            if (current->hasEndedBy(now)) drop(current);
+            if (now > current->validUntil) drop(current);
         }
     }
 

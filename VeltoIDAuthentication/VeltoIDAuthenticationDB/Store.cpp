@@ -141,23 +141,15 @@ bool Store::load() {
     const Array* stored = storedVersions.value.asArray();
     Array versions = stored != nullptr ? *stored : Array();
     const MigrationOutcome migrated = migrate(accounts, metaInfo, versions);
-    if (migrated.versionsCut) {
+    const Value own = Value::real(kVeltoIDDBAccessorVersion);
+    const bool isNew = std::find(versions.begin(), versions.end(), own) == versions.end();
+    if (isNew) versions.append(own);
+    if (isNew || migrated.versionsCut) {
         domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
         domain.synchronize();
     }
-    const bool recorded = recordAccessor(domain, versions);
-    if (migrated.sectionsChanged || recorded)
+    if (isNew || migrated.sectionsChanged)
         writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
-    return true;
-}
-
-/// Adds this agent to the versions that have opened the domain. True when it was not among them.
-bool Store::recordAccessor(const platform::Preferences& domain, Array versions) {
-    const Value own = Value::real(kVeltoIDDBAccessorVersion);
-    if (std::find(versions.begin(), versions.end(), own) != versions.end()) return false;
-    versions.append(own);
-    domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
-    domain.synchronize();
     return true;
 }
 

@@ -89,7 +89,6 @@ class Store {
     platform::Preferences preferences() const;
     bool load();
     bool writeSections(std::initializer_list<Dictionary Store::*> sections);
-    bool recordAccessor(const platform::Preferences& domain, Array versions);
     void planFlush();
     void synchronize();
 

@@ -69,8 +69,7 @@ class InformationRequest {
         }
         const bool mustAsk = isOn(option::kForceValidationRecordFetch) ||
                              isOn(option::kValidateCertificateSerialNumber) || isOn(option::kForceValidation);
-        if (mustAsk || !fresh || !record_.isComplete()) return askServer(fresh);
-        return true;
+        return (!mustAsk && fresh && record_.isComplete()) || askServer(fresh);
     }
 
     Dictionary answer() const {
@@ -243,7 +242,7 @@ constexpr TakenEntry kCertificateDetails[] = {
 /// The encDsId that is asked for; null when there is none, or the account has another one.
 String requestedEncDsId(const String& accountName, const String& encDsId) {
     if (!accountName) return encDsId;
-    const String own = __VeltoIDDBCopyAccountValue(accountName, kVeltoIDAccountDSIDKey).asString();
+    const String own = accountRecordOf(accountName).encDsId();
     return !encDsId || encDsId == own ? own : String();
 }
 

@@ -29,6 +29,10 @@ constexpr double kRecordValidShare = 0.75;
 /// Share of a certificate's own lifetime in which it is renewed at the latest.
 constexpr double kLastShareOfLifetime = 0.25;
 
+// What is validated again after which interval.
+constexpr std::string_view kOfInformation = kVeltoIDMetaAccountValidationIntervalKey;
+constexpr std::string_view kOfCertificate = kVeltoIDMetaCertificateValidationIntervalKey;
+
 using enum DueReason;
 // The certificate is wanted already: so an account whose sign-in keeps failing stays due and is put off for
 // longer and longer, rather than tried every five minutes.
@@ -119,7 +123,7 @@ AccountSchedule::Date AccountSchedule::validation() const {
     // While a certificate is pending, the examination does not look at how old the information is.
     if (record_.certificateToken()) return std::nullopt;
     const auto validated = record_.lastValidation();
-    return validated > now_ ? rightNow() : after(validated, informationInterval());
+    return validated > now_ ? rightNow() : after(validated, validationInterval(kOfInformation));
 }
 
 AccountSchedule::Date AccountSchedule::pendingFetch() const {
@@ -152,14 +156,15 @@ AccountSchedule::Date AccountSchedule::preExpiry() const {
 AccountSchedule::Date AccountSchedule::certificateValidation() const {
     const auto validated = entry_.lastSuccessfulValidation();
     if (!validated || *validated > now_) return rightNow();
-    const double old = *validated + evaluationInterval();
+    const double old = *validated + validationInterval(kOfCertificate);
     const auto attempt = after(entry_.lastValidationAttempt(), kValidationAttemptSpacing);
     return attempt && attempt->date >= old ? attempt : at(old);
 }
 
 bool AccountSchedule::isCertificateValidationPutOff() const {
     const auto validated = entry_.lastSuccessfulValidation();
-    return validated && *validated + evaluationInterval() <= now_ && !isDue(DueReason::CertificateValidation);
+    return validated && *validated + validationInterval(kOfCertificate) <= now_ &&
+           !isDue(DueReason::CertificateValidation);
 }
 
 AccountSchedule::Date AccountSchedule::validationRecord() const {
@@ -176,17 +181,11 @@ AccountSchedule::Date AccountSchedule::validationRecord() const {
 
 bool AccountSchedule::isInformationFresh() const {
     const auto validated = record_.lastValidation();
-    return validated && *validated <= now_ && now_ <= *validated + informationInterval();
+    return validated && *validated <= now_ && now_ <= *validated + validationInterval(kOfInformation);
 }
 
-double AccountSchedule::informationInterval() const {
-    return metaInterval(record_.accountName(), {}, kVeltoIDMetaAccountValidationIntervalKey,
-                        kDefaultValidationInterval);
-}
-
-double AccountSchedule::evaluationInterval() const {
-    return metaInterval(record_.accountName(), {}, kVeltoIDMetaCertificateValidationIntervalKey,
-                        kDefaultValidationInterval);
+double AccountSchedule::validationInterval(std::string_view key) const {
+    return metaInterval(record_.accountName(), {}, key, kDefaultValidationInterval);
 }
 
 double AccountSchedule::certificateLifetime() const {

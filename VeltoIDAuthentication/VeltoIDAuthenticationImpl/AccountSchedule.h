@@ -78,8 +78,7 @@ class AccountSchedule {
     Date preExpiry() const;
     Date certificateValidation() const;
     Date validationRecord() const;
-    double informationInterval() const;
-    double evaluationInterval() const;
+    double validationInterval(std::string_view key) const;
     double certificateLifetime() const;
     std::optional<double> endOfEmbargo() const;
 

@@ -26,6 +26,8 @@
 namespace veltoid {
 namespace {
 
+using enum AccountState;
+
 // How long an add that waits for its certificate lets pass between two looks at the account (seconds). The
 // account check, which does the work, makes a pass every five seconds at the most.
 constexpr double kMinWait = 0.25;
@@ -129,12 +131,12 @@ bool waitForCertificate(const String& accountName, const Dictionary& options,
          platform::now() <= deadline && !lifetime.isEnding();) {
         wakeAccountCheck();
         switch (checkAccountAndDetermineNextAction(accountName, checkOptions)) {
-            case AccountState::NoEncodedDSID:
-            case AccountState::PasswordInaccessibleInKeychain:
-            case AccountState::PasswordInvalid:
+            case NoEncodedDSID:
+            case PasswordInaccessibleInKeychain:
+            case PasswordInvalid:
                 return false;
-            case AccountState::CertificateOK:
-            case AccountState::CertificateAssumedOK:
+            case CertificateOK:
+            case CertificateAssumedOK:
                 return true;
             default:
                 waitForNextAction(accountName);

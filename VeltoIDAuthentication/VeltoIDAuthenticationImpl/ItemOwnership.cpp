@@ -75,9 +75,7 @@ OwnershipLock::OwnershipLock() {
 OwnershipLock::~OwnershipLock() { ownershipSemaphore().signal(); }
 
 void discardPendingKey(const OwnershipLock& /*ownership*/, const String& accountName) {
-    const Data reference =
-        __VeltoIDDBCopyAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey)
-            .asData();
+    const Data reference = accountRecordOf(accountName).pendingKeyReference();
     if (!reference) return;
     removeKeyFromKeychainGivenPersistentRef(reference);
     __VeltoIDDBSetAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey,

@@ -20,6 +20,8 @@
 namespace veltoid {
 namespace {
 
+using enum AccountState;
+
 constexpr const char* kFunction = "checkAccountAndDetermineNextAction";
 
 /// Until a validation that was due is tried again (seconds).
@@ -34,15 +36,15 @@ class AccountCheck {
           networkAllowed_(getBool(&options, option::kCheckNetwork, false)) {}
 
     AccountState run() {
-        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record_)) return AccountState::NoCertificate;
+        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record_)) return NoCertificate;
         if (schedule().isEmbargoed()) networkAllowed_ = false;
         if (const auto state = examinePassword()) return *state;
         encDsId_ = record_.encDsId();
-        if (!encDsId_) return AccountState::NoEncodedDSID;
+        if (!encDsId_) return NoEncodedDSID;
         takeDueValidation();
-        if (record_.certificateToken()) return AccountState::CertificatePending;
+        if (record_.certificateToken()) return CertificatePending;
         if (const auto state = validateAccount()) return *state;
-        if (!__VeltoIDDBCopyCertificateInfo(encDsId_, &entry_)) return AccountState::NoCertificate;
+        if (!__VeltoIDDBCopyCertificateInfo(encDsId_, &entry_)) return NoCertificate;
         return examineCertificate();
     }
 
@@ -52,13 +54,13 @@ class AccountCheck {
         if (!reference) {
             VELTOID_LOG_FROM(kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
                              " doesn't have a password; no next action.");
-            return AccountState::PasswordInvalid;
+            return PasswordInvalid;
         }
         if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) return std::nullopt;
         VELTOID_LOG_FROM(
             kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
             " doesn't have a password or the password has been removed from the keychain; no next action.");
-        return AccountState::PasswordInaccessibleInKeychain;
+        return PasswordInaccessibleInKeychain;
     }
 
     void takeDueValidation() {
@@ -84,10 +86,10 @@ class AccountCheck {
         // What is too old is asked for again, and in an hour once more if the server cannot be reached.
         if (validationIsDue_ && !record_.isValidationForced() && !record_.nextValidation())
             postponeValidation(Notify::No);
-        if (!password()) return AccountState::PasswordInaccessibleInKeychain;
+        if (!password()) return PasswordInaccessibleInKeychain;
         std::optional<Error> error;
         if (!openSession(&error))
-            return refusesPassword(error) ? std::optional(AccountState::PasswordInvalid) : std::nullopt;
+            return refusesPassword(error) ? std::optional(PasswordInvalid) : std::nullopt;
         if (validationIsDue_) {
             const Dictionary forced = {{option::kForceValidation, Value::boolean(true)}};
             __VeltoIDDoGetMyInfo(accountName_, forced, nullptr);
@@ -99,33 +101,32 @@ class AccountCheck {
     AccountState examineCertificate() {
         AccountState state = classify();
         if (triedRecently_) return withValidationRecord(state);
-        if (state == AccountState::Unknown) {
+        if (state == Unknown) {
             askAboutCertificate();
             // The server's word counts at once.
             __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
-            if (entry_.isInvalid()) return AccountState::CertificateRevoked;
+            if (entry_.isInvalid()) return CertificateRevoked;
         }
         if (static_cast<int>(state) < 0) return state;
         std::optional<platform::Certificate> certificate;
-        if (!readItems(&certificate)) return AccountState::NoCertificate;
-        if (state == AccountState::Unknown)
-            state = networkAllowed_ ? evaluate(*certificate) : AccountState::CertificateAssumedOK;
-        if (state != AccountState::CertificateOK && state != AccountState::CertificateAssumedOK) return state;
+        if (!readItems(&certificate)) return NoCertificate;
+        if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate) : CertificateAssumedOK;
+        if (state != CertificateOK && state != CertificateAssumedOK) return state;
         return schedule().isDue(DueReason::Renewal) || schedule().isDue(DueReason::PreExpiry)
-                   ? AccountState::CertificateShouldBeRenewed
+                   ? CertificateShouldBeRenewed
                    : withValidationRecord(state);
     }
 
     /// By the entry alone.
     AccountState classify() {
-        if (entry_.isInvalid()) return AccountState::CertificateRevoked;
+        if (entry_.isInvalid()) return CertificateRevoked;
         const AccountSchedule now = schedule();
-        if (now.isDue(DueReason::Expiry)) return AccountState::CertificateExpired;
+        if (now.isDue(DueReason::Expiry)) return CertificateExpired;
         if (entry_.isDirty() || getBool(&options_, option::kForceValidation, false) ||
             now.isDue(DueReason::CertificateValidation))
-            return AccountState::Unknown;
+            return Unknown;
         triedRecently_ = now.isCertificateValidationPutOff();
-        return AccountState::CertificateAssumedOK;
+        return CertificateAssumedOK;
     }
 
     void askAboutCertificate() {
@@ -173,10 +174,10 @@ class AccountCheck {
         std::vector<platform::Certificate> chain;
         if (intermediate) chain.push_back(*intermediate);
         const auto result = platform::evaluateTrust(certificate, chain);
-        if (!result) return AccountState::Unknown;
+        if (!result) return Unknown;
         const AccountState state = stateOf(*result);
         setInEntry(kVeltoIDCertificateLastValidationAttemptDateKey, Value::date(platform::now()));
-        if (state == AccountState::CertificateOK || state == AccountState::CertificateAssumedOK)
+        if (state == CertificateOK || state == CertificateAssumedOK)
             setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now()));
         return state;
     }
@@ -186,27 +187,26 @@ class AccountCheck {
         switch (result) {
             case Proceed:
             case Unspecified:
-                return AccountState::CertificateOK;
+                return CertificateOK;
             case RecoverableFailure:
-                return AccountState::CertificateAssumedOK;
+                return CertificateAssumedOK;
             case Deny:
                 VELTOID_LOG_FROM(kFunction, kNotice, "Removing certificate, serial#=", entry_.serialNumber(),
                                  " for veltoID ", accountName_, " dsID=", encDsId_,
                                  " because it is not present in the certificates the server has for us.");
-                return AccountState::CertificateRevoked;
+                return CertificateRevoked;
             case FatalFailure:
-                return AccountState::CertificateRevoked;
+                return CertificateRevoked;
             case Invalid:
             case Confirm:
             case OtherError:
                 break;
         }
-        return AccountState::Unknown;
+        return Unknown;
     }
 
     AccountState withValidationRecord(AccountState state) const {
-        return schedule().isDue(DueReason::ValidationRecord) ? AccountState::ValidationRecordNeedsToBeUpdated
-                                                             : state;
+        return schedule().isDue(DueReason::ValidationRecord) ? ValidationRecordNeedsToBeUpdated : state;
     }
 
     AccountSchedule schedule() const { return {record_, entry_, options_}; }
@@ -240,7 +240,7 @@ AccountState checkAccountAndDetermineNextAction(const String& accountName, const
                                                 ErrorOut error) {
     if (accountName) return AccountCheck(accountName, options).run();
     fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-    return AccountState::Unknown;
+    return Unknown;
 }
 
 }  // namespace veltoid

@@ -26,9 +26,7 @@ double generationInterval(const AccountRecord& record) {
 /// The dates of the requests within the window.
 Array recentRequests(const AccountRecord& record) {
     Array recent;
-    const Array* stored = record.requestDates();
-    if (stored == nullptr) return recent;
-    for (const Value& date : *stored) {
+    for (const Value& date : record.requestDates()) {
         const auto seconds = date.asDate();
         if (seconds && *seconds <= platform::now() && platform::now() < *seconds + kRequestWindow)
             recent.append(date);

@@ -40,7 +40,7 @@ Data addItem(const Certificate& certificate, const String& label) {
     platform::PersistentReference added;
     const KeychainStatus status =
         platform::keychain::add(attributes, Accessibility::Always, certificate.der, &added);
-    if (status == platform::kKeychainSuccess) return keychain_items::dataOf(added);
+    if (status == platform::kKeychainSuccess) return Data(added);
     VELTOID_LOG_FROM("addCertificateToKeychain", kError, "Certificate ", describeValue(label),
                      " not added to keychain; err=", status);
     return {};

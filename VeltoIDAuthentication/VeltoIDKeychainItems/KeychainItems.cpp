@@ -45,7 +45,7 @@ Data copyReference(const platform::KeychainAttributes& attributes, platform::Key
     std::vector<platform::PersistentReference> found;
     const auto result = platform::keychain::copyMatchingReferences({attributes, {}}, &found);
     if (status != nullptr) *status = result;
-    return result == platform::kKeychainSuccess ? dataOf(found.front()) : Data();
+    return result == platform::kKeychainSuccess ? Data(found.front()) : Data();
 }
 
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes) {
@@ -53,7 +53,7 @@ std::optional<Array> copyReferences(const platform::KeychainAttributes& attribut
     if (platform::keychain::copyMatchingReferences({attributes, {}}, &found) != platform::kKeychainSuccess)
         return std::nullopt;
     Array references;
-    for (const auto& reference : found) references.append(dataOf(reference));
+    for (const auto& reference : found) references.append(Data(reference));
     return references;
 }
 

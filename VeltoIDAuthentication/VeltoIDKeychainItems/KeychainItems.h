@@ -30,8 +30,6 @@ platform::WorkQueue keychainQueue();
 /// For the rooms' own sources: their callers use the operations of the other headers.
 namespace keychain_items {
 
-inline Data dataOf(const platform::PersistentReference& reference) { return Data(reference); }
-
 /// The item of that class and reference.
 platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass, const Data& reference);
 

@@ -52,7 +52,7 @@ Data addItem(const Key& key, const std::string& label) {
     if (status == platform::kKeychainDuplicateItem &&
         platform::keychain::remove({identityOf(key), {}}) == platform::kKeychainSuccess)
         status = add();
-    return status == platform::kKeychainSuccess ? keychain_items::dataOf(added) : Data();
+    return status == platform::kKeychainSuccess ? Data(added) : Data();
 }
 
 /// The reference of the key's item; null when the keychain refuses.

@@ -63,7 +63,7 @@ KeychainStatus addItem(const KeychainAttributes& attributes, const String& passw
     if (status == platform::kKeychainDuplicateItem &&
         platform::keychain::remove({attributes, {}}) == platform::kKeychainSuccess)
         status = platform::keychain::add(attributes, accessibility, data, &added);
-    if (status == platform::kKeychainSuccess) *reference = keychain_items::dataOf(added);
+    if (status == platform::kKeychainSuccess) *reference = Data(added);
     return status;
 }
 

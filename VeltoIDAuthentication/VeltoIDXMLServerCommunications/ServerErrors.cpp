@@ -18,6 +18,14 @@ bool refusesClient(const std::optional<Error>& error) {
     return isIdentityError(error, identity_error::kServerNoLongerSupported);
 }
 
+/// The verdict on a failed call that was made with this password hash: the account's password is removed,
+/// which disables the account until a client adds it again, when the server refuses it, has disabled the
+/// account, or no longer supports this client (-105). Nothing for any other error.
+void judgeRefusal(const String& accountName, const String& /*sentPasswordHash*/,
+                  const std::optional<Error>& error) {
+    if (refusesPassword(error) || refusesClient(error)) __VeltoIDDBRemovePassword(accountName);
+}
+
 }  // namespace
 
 Error copyAndHandleXMLErrorResponse(const String& accountName, const String& passwordHash,
@@ -50,11 +58,6 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
 bool refusesPassword(const std::optional<Error>& error) {
     return isIdentityError(error, identity_error::kInvalidAccountOrPassword) ||
            isIdentityError(error, identity_error::kAccountLogonDisabled);
-}
-
-void judgeRefusal(const String& accountName, const String& /*sentPasswordHash*/,
-                  const std::optional<Error>& error) {
-    if (refusesPassword(error) || refusesClient(error)) __VeltoIDDBRemovePassword(accountName);
 }
 
 void handleServerError(const String& accountName, const String& sentPasswordHash,

@@ -22,13 +22,8 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
 /// Whether the server refuses the password (-101) or has disabled the account (-102).
 bool refusesPassword(const std::optional<Error>& error);
 
-/// The verdict on a failed call that was made with this password hash: the account's password is removed,
-/// which disables the account until a client adds it again, when the server refuses it, has disabled the
-/// account, or no longer supports this client (-105); nothing for other errors. Any queue but the database's.
-void judgeRefusal(const String& accountName, const String& sentPasswordHash,
-                  const std::optional<Error>& error);
-
-/// The same at the end of an operation of the engine: the log says so.
+/// Judges the failure of an operation of the engine that used this password hash, as above; the log says what
+/// becomes of the account. Any queue but the database's.
 void handleServerError(const String& accountName, const String& sentPasswordHash,
                        const std::optional<Error>& error);
 
