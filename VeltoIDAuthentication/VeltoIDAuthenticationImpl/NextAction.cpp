@@ -184,25 +184,13 @@ class AccountCheck {
 
     AccountState stateOf(platform::TrustResult result) const {
         using enum platform::TrustResult;
-        switch (result) {
-            case Proceed:
-            case Unspecified:
-                return CertificateOK;
-            case RecoverableFailure:
-                return CertificateAssumedOK;
-            case Deny:
-                VELTOID_LOG_FROM(kFunction, kNotice, "Removing certificate, serial#=", entry_.serialNumber(),
-                                 " for veltoID ", accountName_, " dsID=", encDsId_,
-                                 " because it is not present in the certificates the server has for us.");
-                return CertificateRevoked;
-            case FatalFailure:
-                return CertificateRevoked;
-            case Invalid:
-            case Confirm:
-            case OtherError:
-                break;
-        }
-        return Unknown;
+        if (result == Proceed || result == Unspecified) return CertificateOK;
+        if (result == RecoverableFailure) return CertificateAssumedOK;
+        if (result == Deny)
+            VELTOID_LOG_FROM(kFunction, kNotice, "Removing certificate, serial#=", entry_.serialNumber(),
+                             " for veltoID ", accountName_, " dsID=", encDsId_,
+                             " because it is not present in the certificates the server has for us.");
+        return result == Deny || result == FatalFailure ? CertificateRevoked : Unknown;
     }
 
     AccountState withValidationRecord(AccountState state) const {

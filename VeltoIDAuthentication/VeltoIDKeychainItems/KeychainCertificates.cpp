@@ -55,14 +55,6 @@ Data addOrUpdate(const Certificate& certificate, const String& label) {
     return addItem(certificate, label);
 }
 
-/// Those with the label, or all.
-std::optional<Array> copyReferencesOf(const std::optional<std::string>& label) {
-    return keychainQueue().sync([&]() -> std::optional<Array> {
-        if (!usesSystemKeychain()) return std::nullopt;
-        return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Certificate, label));
-    });
-}
-
 }  // namespace
 
 bool addCertificateToKeychain(const Certificate& certificate, const String& label,
@@ -108,10 +100,13 @@ bool removeCertificateFromKeychainGivenPersistentRef(const Data& persistentRefer
     });
 }
 
-std::optional<Array> copyAllCertificatesFromKeychain() { return copyReferencesOf({}); }
+std::optional<Array> copyAllCertificatesFromKeychain() {
+    return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Certificate));
+}
 
 std::optional<Array> copyCertificatesFromKeychainGivenLabel(const String& label) {
-    return copyReferencesOf(label.text());
+    return keychain_items::copyReferences(
+        keychain_items::itemsOf(KeychainItemClass::Certificate, label.text()));
 }
 
 }  // namespace veltoid

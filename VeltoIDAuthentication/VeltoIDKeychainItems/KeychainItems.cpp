@@ -49,12 +49,15 @@ Data copyReference(const platform::KeychainAttributes& attributes, platform::Key
 }
 
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes) {
-    std::vector<platform::PersistentReference> found;
-    if (platform::keychain::copyMatchingReferences({attributes, {}}, &found) != platform::kKeychainSuccess)
-        return std::nullopt;
-    Array references;
-    for (const auto& reference : found) references.append(Data(reference));
-    return references;
+    return keychainQueue().sync([&]() -> std::optional<Array> {
+        std::vector<platform::PersistentReference> found;
+        if (!usesSystemKeychain() || platform::keychain::copyMatchingReferences({attributes, {}}, &found) !=
+                                         platform::kKeychainSuccess)
+            return std::nullopt;
+        Array references;
+        for (const auto& reference : found) references.append(Data(reference));
+        return references;
+    });
 }
 
 }  // namespace keychain_items

@@ -45,7 +45,7 @@ inline bool mayPass(platform::KeychainStatus status) {
 Data copyReference(const platform::KeychainAttributes& attributes,
                    platform::KeychainStatus* status = nullptr);
 
-/// The references of all items that match; none when there are none.
+/// The references of all items that match; none when there are none. Runs on the keychain queue.
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes);
 
 /// The attributes of all items of the class, or of those with the label.

@@ -132,9 +132,9 @@ bool removeKeyFromKeychainGivenPersistentRef(const Data& persistentReference) {
 }
 
 std::optional<Array> copyAllKeysFromKeychain() {
-    return keychainQueue().sync([]() -> std::optional<Array> {
-        if (usesSystemKeychain())
-            return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Key));
+    if (usesSystemKeychain())
+        return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Key));
+    return keychainQueue().sync([] {
         Array references;
         for (const auto& [reference, key] : memoryItems().items()) references.append(reference);
         return references.empty() ? std::nullopt : std::optional(references);
@@ -142,11 +142,8 @@ std::optional<Array> copyAllKeysFromKeychain() {
 }
 
 std::optional<Array> copyKeysFromKeychainGivenOwner(const String& owner, const String& kind) {
-    return keychainQueue().sync([&]() -> std::optional<Array> {
-        if (!usesSystemKeychain()) return std::nullopt;
-        return keychain_items::copyReferences(
-            keychain_items::itemsOf(KeychainItemClass::Key, labelOf(owner, kind)));
-    });
+    return keychain_items::copyReferences(
+        keychain_items::itemsOf(KeychainItemClass::Key, labelOf(owner, kind)));
 }
 
 }  // namespace veltoid
