@@ -4,7 +4,6 @@
 
 #include "Logging/Log.h"
 #include "Platform/keychain/LockState.h"
-#include "Platform/runtime/Clock.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"

@@ -2,7 +2,6 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
-#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"

@@ -58,11 +58,9 @@ void scheduleRelaunch(std::optional<double> date, RelaunchDate rule) {
 }
 
 Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
-    Array names;
     Array needing;
     std::optional<double> earliest;
-    __VeltoIDDBCopyVeltoIDs(&names);
-    for (const Value& name : names) {
+    for (const Value& name : accountNames()) {
         const auto date = nextActionOf(name.asString());
         if (!date) continue;
         needing.append(name);

@@ -84,6 +84,10 @@ bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     });
 }
 
+Array accountNames() {
+    return database::perform([](const Store& store) { return database::keysOf(store.accounts); });
+}
+
 std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountRequirements& required) {
     return database::perform([&](const Store& store) {
         return firstRecord(store, [&](const AccountRecord& record) {

@@ -89,6 +89,8 @@ class AccountRecord : Dictionary {
 
 /// The names of all accounts; -107 when there is none.
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error = nullptr);
+/// The same; empty when there is none.
+Array accountNames();
 
 /// What an account must have to be found.
 struct AccountRequirements {

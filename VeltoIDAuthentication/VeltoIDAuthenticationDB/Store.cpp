@@ -1,7 +1,6 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 
 #include <algorithm>
-#include <atomic>
 #include <vector>
 
 #include "Platform/runtime/Clock.h"

@@ -105,10 +105,8 @@ AddedAccount addAnew(const String& accountName, const String& hashedPassword, co
 
 /// The agent keeps one account.
 void forgetOtherAccounts(const String& added) {
-    Array names;
-    __VeltoIDDBCopyVeltoIDs(&names);
     const String addedInLowerCase = lowerCased(added);
-    for (const Value& name : names)
+    for (const Value& name : accountNames())
         if (name.isString() && lowerCased(name.asString()) != addedInLowerCase)
             __VeltoIDForgetVeltoID(name.asString(), {{option::kRemovePrivateKey, Value::boolean(true)}});
 }

@@ -46,9 +46,7 @@ void removeUnlessReferredTo(const std::optional<Array>& references, bool (*remov
 /// The encDsIds of all accounts; lifts their embargoes on the way.
 std::set<std::string> encDsIdsOfAccounts() {
     std::set<std::string> encDsIds;
-    Array names;
-    __VeltoIDDBCopyVeltoIDs(&names);
-    for (const Value& name : names) {
+    for (const Value& name : accountNames()) {
         const AccountRecord record = accountRecordOf(name.asString());
         if (const String encDsId = record.encDsId()) encDsIds.insert(encDsId.text());
         const auto embargo = record.earliestConnection();

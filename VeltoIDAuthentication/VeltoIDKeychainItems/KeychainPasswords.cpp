@@ -1,6 +1,5 @@
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
-#include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/keychain/Keychain.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"

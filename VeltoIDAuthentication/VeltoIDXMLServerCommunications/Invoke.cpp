@@ -5,7 +5,6 @@
 #include <cstdio>
 #include <cstdlib>
 
-#include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
