@@ -2,6 +2,7 @@
 
 #include "Platform/crypto/KeyPair.h"
 #include "Values/Base64.h"
+#include "Values/Error.h"
 #include "Values/PEM.h"
 
 namespace veltoid {
@@ -26,11 +27,6 @@ String makeRequest(const String& accountName, platform::Bytes privateKey) {
                                                   {Type::OrganizationName, "Velto, Inc."}};
     const auto der = platform::createCertificationRequest(privateKey, subject);
     return der ? pemText(*der) : String();
-}
-
-template <typename Output>
-void fill(Output* output, Output value) {
-    if (output != nullptr) *output = std::move(value);
 }
 
 }  // namespace

@@ -11,7 +11,7 @@ namespace {
 constexpr std::string_view kErrorKey = "error";
 constexpr std::string_view kUpperCaseLetters = "ABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
-const MessageDictionary* dictionaryOf(const MessageObject& message) {
+MessageDictionary* dictionaryOf(const MessageObject& message) {
     return message ? std::get_if<MessageDictionary>(&message->content) : nullptr;
 }
 
@@ -29,7 +29,7 @@ IPCMessage::IPCMessage(std::span<const String> keys, std::span<const MessageValu
 }
 
 void IPCMessage::setValue(const String& key, const Value& value) {
-    auto* dictionary = message_ ? std::get_if<MessageDictionary>(&message_->content) : nullptr;
+    MessageDictionary* dictionary = dictionaryOf(message_);
     if (dictionary == nullptr || !key || value.isAbsent()) return;
     MessageValue converted = messageFromValue(value);
     if (!std::holds_alternative<std::monostate>(converted.content))

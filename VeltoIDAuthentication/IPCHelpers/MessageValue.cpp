@@ -1,8 +1,8 @@
 #include "IPCHelpers/MessageValue.h"
 
 #include <algorithm>
-#include <cstdio>
 
+#include "Logging/Log.h"
 #include "Platform/encoding/CalendarText.h"
 #include "Platform/encoding/HexText.h"
 
@@ -88,12 +88,6 @@ std::string describeArray(const MessageArray& array) {
     return text + "]";
 }
 
-std::string decimal(double number) {
-    std::string text(32, '\0');
-    text.resize(static_cast<size_t>(std::snprintf(text.data(), text.size(), "%g", number)));
-    return text;
-}
-
 }  // namespace
 
 Value valueFromMessage(const MessageValue& value) {
@@ -148,7 +142,7 @@ std::string describe(const MessageValue& value) {
             [](bool boolean) -> std::string { return boolean ? "true" : "false"; },
             [](int64_t integer) { return std::to_string(integer); },
             [](uint64_t integer) { return std::to_string(integer) + "U"; },
-            [](double real) { return "ipc object:" + decimal(real) + " "; },
+            [](double real) { return logText("ipc object:", real, " "); },
             [](const String& text) { return "\"" + text.text() + "\""; },
             [](const Data& data) { return platform::hexText(data.bytes()); },
             [](MessageDate date) { return describeDate(date.seconds); },

@@ -2,7 +2,6 @@
 #pragma once
 
 #include <array>
-#include <memory>
 #include <string>
 #include <utility>
 #include <variant>

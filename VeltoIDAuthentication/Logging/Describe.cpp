@@ -16,14 +16,8 @@
 namespace veltoid {
 namespace {
 
-struct ErrorName {
-    int64_t code;
-    const char* name;
-};
-
-/// Codes of kIdentityErrorDomain; the first entry of a code names it. The last names of -101 and -102 belong
-/// to the same failures seen from a client's side and are never printed.
-constexpr ErrorName kErrorNames[] = {
+/// Codes of kIdentityErrorDomain.
+constexpr std::pair<int64_t, const char*> kErrorNames[] = {
     {-100, "kHWIdentityVeltoIDUnknownError"},
     {-99, "kHWIdentityInvalidParametersErr"},
     {-10, "kHWIdentityCertificateDoesNotContainRequestedValueErr"},
@@ -36,8 +30,6 @@ constexpr ErrorName kErrorNames[] = {
     {-106, "kHWIdentityVeltoIDNoCertificateForAccountErr"},
     {-107, "kHWIdentityVeltoIDNoAccounts"},
     {-108, "kHWIdentityUnknownAccountErr"},
-    {-101, "kHWIdentityAuthenticationFailedErr"},
-    {-102, "kHWIdentityAuthenticationDisabledErr"},
     {-110, "kHWIdentityVeltoIDValidationRecordCorruptErr"},
     {-111, "kHWIdentityVeltoIDValidationRecordBadVersionErr"},
     {-112, "kHWIdentityVeltoIDValidationRecordValidAsOfNotCurrentErr"},
@@ -107,17 +99,15 @@ void appendData(std::string& text, std::span<const uint8_t> bytes) {
 
 void appendDate(std::string& text, double date) {
     const double distance = date - platform::now();
-    std::ostringstream relative;
     if (distance >= -1 && distance <= 0) {
-        relative << "now-ish ";
+        text += "now-ish ";
     } else if (distance > 0 && distance <= 1) {
-        relative << "soon-ish ";
+        text += "soon-ish ";
     } else if (distance > 1 && distance <= kRelativeWordingLimit) {
-        relative << distance << " seconds from now, ";
+        text += (std::ostringstream() << distance << " seconds from now, ").str();
     } else if (distance < -1 && distance >= -kRelativeWordingLimit) {
-        relative << std::llround(-distance) << " seconds ago, ";
+        text += std::to_string(std::llround(-distance)) + " seconds ago, ";
     }
-    text += relative.str();
 
     std::tm calendar{};
     // Years beyond what the calendar can hold: nothing sensible to print.
@@ -133,9 +123,7 @@ void appendDate(std::string& text, double date) {
 
 void appendFloating(std::string& text, double number) {
     if (std::isnan(number)) return void(text += "NAN");
-    std::ostringstream stream;
-    stream << std::showpoint << number;
-    text += stream.str();
+    text += (std::ostringstream() << std::showpoint << number).str();
 }
 
 /// The bytes of a number of a kind without a decimal form, in memory order.
@@ -173,8 +161,8 @@ void appendError(std::string& text, const Error& error) {
     text += " #" + std::to_string(error.code);
     if (error.domain.view() == kIdentityErrorDomain) {
         const auto* name = std::find_if(std::begin(kErrorNames), std::end(kErrorNames),
-                                        [&](const ErrorName& entry) { return entry.code == error.code; });
-        if (name != std::end(kErrorNames)) text.append(" ").append(name->name);
+                                        [&](const auto& entry) { return entry.first == error.code; });
+        if (name != std::end(kErrorNames)) text.append(" ").append(name->second);
     }
     if (error.userInfo.empty()) return;
     text += ' ';

@@ -23,18 +23,16 @@ void write(int level, const std::string& text, platform::LogOrigin origin) {
     platform::SystemLog::shared().write(static_cast<platform::LogPriority>(level), text, origin);
 }
 
-/// Passes by the level filter: a log without the moment of its start is hard to read.
-void writeStartBanner() {
-    std::ostringstream banner;
-    banner << kPrefix << "Starting logging for veltoidauthentication " << std::string(46, '*')
-           << " euid=" << geteuid() << " uid=" << getuid() << " BUILT approximately " << __DATE__ << " "
-           << __TIME__;
-    write(log_level::kInfo, banner.str(), {});
-}
-
+/// Writes the start banner, which passes by the level filter: a log without the moment of its start is hard
+/// to read.
 void openOnce() {
     static std::once_flag opened;
-    std::call_once(opened, writeStartBanner);
+    std::call_once(opened, [] {
+        write(log_level::kInfo,
+              logText(kPrefix, "Starting logging for veltoidauthentication ", std::string(46, '*'), " euid=",
+                      geteuid(), " uid=", getuid(), " BUILT approximately ", __DATE__, " ", __TIME__),
+              {});
+    });
 }
 
 const char* fileNameOf(const char* path) {

@@ -4,6 +4,9 @@
 
 #include <sstream>
 #include <string>
+#include <type_traits>
+
+#include "Logging/Describe.h"
 
 namespace veltoid {
 
@@ -25,22 +28,31 @@ bool logLevelEnabled(int level);
 void logLine(int level, const char* sourcePath, const char* functionName, int lineNumber,
              const char* message);
 
+/// The pieces one after the other: a String as it is, every other value described.
+template <typename... Pieces>
+std::string logText(const Pieces&... pieces) {
+    std::ostringstream text;
+    const auto add = [&](const auto& piece) {
+        if constexpr (std::is_same_v<decltype(piece), const String&>) {
+            text << piece.view();
+        } else if constexpr (requires { text << piece; }) {
+            text << piece;
+        } else {
+            text << describeValue(piece);
+        }
+    };
+    (add(pieces), ...);
+    return text.str();
+}
+
 }  // namespace veltoid
 
-// NOLINTBEGIN(bugprone-macro-parentheses): what is streamed is a chain of "<<", which parentheses would turn
-// into a shift
-
-/// Composes the line only when its level is recorded: VELTOID_LOG(kNotice, "text " << value).
-#define VELTOID_LOG_FROM(function, level, streamed)                                         \
+/// Composes the line only when its level is recorded: VELTOID_LOG(kNotice, "text ", value).
+#define VELTOID_LOG_FROM(function, level, ...)                                              \
     do {                                                                                    \
-        if (::veltoid::logLevelEnabled(::veltoid::log_level::level)) {                      \
-            std::ostringstream veltoidLogText;                                              \
-            veltoidLogText << streamed;                                                     \
+        if (::veltoid::logLevelEnabled(::veltoid::log_level::level))                        \
             ::veltoid::logLine(::veltoid::log_level::level, __FILE__, (function), __LINE__, \
-                               veltoidLogText.str().c_str());                               \
-        }                                                                                   \
+                               ::veltoid::logText(__VA_ARGS__).c_str());                    \
     } while (false)
 
-#define VELTOID_LOG(level, streamed) VELTOID_LOG_FROM(__func__, level, streamed)
-
-// NOLINTEND(bugprone-macro-parentheses)
+#define VELTOID_LOG(level, ...) VELTOID_LOG_FROM(__func__, level, __VA_ARGS__)

@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "Logging/Describe.h"
+#include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 
 namespace veltoid {
@@ -84,9 +85,7 @@ std::string describeDispatchTime(std::optional<double> time) {
     if (!time) return "forever";
     const double left = *time - platform::now();
     if (left <= 0) return "now";
-    std::ostringstream text;
-    text << left << "s";
-    return text.str();
+    return logText(left, "s");
 }
 
 std::string describeDuration(double seconds) {

@@ -32,8 +32,8 @@ TEST(Log, FilteredLevelsComposeNothing) {
     int composed = 0;
     for (int level = -1; level <= 8; ++level)
         EXPECT_EQ(logLevelEnabled(level), level >= 0 && level <= 5) << level;
-    VELTOID_LOG(kInfo, "not " << ++composed);
-    VELTOID_LOG(kNotice, "once " << ++composed);
+    VELTOID_LOG(kInfo, "not ", ++composed);
+    VELTOID_LOG(kNotice, "once ", ++composed);
     EXPECT_EQ(composed, 1);
     EXPECT_EQ(log.count("once 1 (TestBody()/Log_test.cpp #"), 1);
 }

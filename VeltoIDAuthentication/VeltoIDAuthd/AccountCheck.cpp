@@ -46,8 +46,6 @@ struct CheckState {
 
 CheckState& state() { return platform::Lifetime::current().state<CheckState>(); }
 
-const platform::Semaphore& checkSemaphore() { return state().semaphore; }
-
 bool isEnding() { return platform::Lifetime::current().isEnding(); }
 
 /// Accounts that a pass left as due as it found them.
@@ -61,11 +59,8 @@ class Deferrals {
 
     /// After a pass over the account.
     void note(const String& accountName) {
-        std::optional<double> next;
-        const bool isForeseen = copyNextActionDateForAccount(accountName, &next) && next;
-        const bool isChanged =
-            __VeltoIDDBCopyAccountValue(accountName, kVeltoIDDirtyKey).asBoolean().value_or(false);
-        if (!isForeseen || isChanged || *next > platform::now()) {
+        const auto next = nextActionOf(accountName);
+        if (!next || *next > platform::now() || accountRecordOf(accountName).isDirty()) {
             deferrals_.erase(accountName.text());
             return;
         }
@@ -117,25 +112,22 @@ class AccountCheckLoop {
     }
 
     /// Waits for a signal without a transaction; true when one came. A jump of the clock ends it too.
-    bool wait(double seconds) {
+    bool wait(double seconds, const platform::Semaphore& semaphore = state().semaphore) {
         transaction_.close();
-        const bool signalled = checkSemaphore().wait(seconds);
+        const bool signalled = semaphore.wait(seconds);
         transaction_.reopen();
         return signalled;
     }
 
     /// Waits until a pass is allowed again; what signals meanwhile is looked at by that pass.
     void keepDistance() {
-        const platform::Semaphore neverSignalled;
         while (lastPass_ && !isEnding()) {
             const double missing = *lastPass_ + kMinTimeBetweenPasses - platform::now();
             // A clock that was set back is no reason to wait for longer.
             if (missing <= 0 || missing > kMinTimeBetweenPasses) break;
-            transaction_.close();
-            (void)neverSignalled.wait(missing);
-            transaction_.reopen();
+            (void)wait(missing, platform::Semaphore());
         }
-        while (checkSemaphore().wait(0)) {
+        while (state().semaphore.wait(0)) {
         }
         lastPass_ = platform::now();
     }
@@ -143,11 +135,10 @@ class AccountCheckLoop {
     Plan plan() const {
         if (auto changed = __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll))
             return {std::move(*changed), platform::now(), true};
-        std::optional<double> ignored;
-        Plan plan{copyAccountsNeedingAction(&ignored), {}, false};
+        Plan plan{copyAccountsNeedingAction(nullptr), {}, false};
         for (const Value& name : plan.accounts) {
-            std::optional<double> date;
-            if (!copyNextActionDateForAccount(name.asString(), &date) || !date) continue;
+            const auto date = nextActionOf(name.asString());
+            if (!date) continue;
             const double deferred = deferrals_.dateFor(name.asString(), *date);
             plan.date = plan.date ? std::min(*plan.date, deferred) : deferred;
         }
@@ -173,8 +164,7 @@ class AccountCheckLoop {
             __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDDirtyKey, Value::boolean(true), Notify::No);
     }
 
-    /// False when the sleep has ended before its time, by a change or by the clock: the plan may be another
-    /// one now.
+    /// False when a change or the clock has ended the sleep early: the plan may be another one now.
     bool sleepUntilTimeFor(const Plan& next) {
         if (next.accounts.empty() || !next.date || !platform::isHTTPSClientAvailable()) {
             scheduleRelaunch(platform::now() + relaunchInterval());
@@ -215,7 +205,7 @@ void startAccountCheck(double firstDelaySeconds, std::function<void()> onPass) {
 }
 
 void wakeAccountCheck() {
-    if (state().isStarted) checkSemaphore().signal();
+    if (state().isStarted) state().semaphore.signal();
 }
 
 }  // namespace veltoid

@@ -4,7 +4,6 @@
 
 #include "Logging/Log.h"
 #include "Platform/keychain/LockState.h"
-#include "Platform/runtime/Clock.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -26,8 +25,8 @@ std::optional<bool> userActionOverride() {
     if (!text) return std::nullopt;
     const bool required = text != "0";
     VELTOID_LOG_FROM("copyAccountStatusesDictionary", kWarning,
-                     "copyAccountStatusesDictionaryVeltoIDAccountStatusRequiresUserAction override value "
-                         << (required ? 1 : 0));
+                     "copyAccountStatusesDictionaryVeltoIDAccountStatusRequiresUserAction override value ",
+                     (required ? 1 : 0));
     return required;
 }
 
@@ -41,13 +40,9 @@ std::optional<bool> requiresUserAction(AccountState state) {
 
 Dictionary copyAccountStatus(const String& name, const Dictionary& options) {
     Dictionary status;
-    AccountRecord record;
-    if (__VeltoIDDBCopyVeltoIDAccount(name, &record))
-        status.set(kVeltoIDAccountLastValidationDateKey,
-                   record.values()[kVeltoIDAccountLastValidationDateKey]);
-    std::optional<double> nextAction;
-    if (copyNextActionDateForAccount(name, &nextAction) && nextAction)
-        status.set(message::kNextActionTime, Value::date(*nextAction));
+    const AccountRecord record = accountRecordOf(name);
+    status.set(kVeltoIDAccountLastValidationDateKey, record.values()[kVeltoIDAccountLastValidationDateKey]);
+    if (const auto next = nextActionOf(name)) status.set(message::kNextActionTime, Value::date(*next));
 
     const AccountState state = checkAccountAndDetermineNextAction(name, options);
     status.set(message::kAccountState, nameOf(state));

@@ -64,9 +64,7 @@ void startServices(const Agent::Configuration& configuration) {
 /// Every account is validated, at once unless the account check is about to start anyway, and clients that
 /// know the connection may ask for more: enough work for a leak checker.
 void workForLeakChecker() {
-    Array names;
-    __VeltoIDDBCopyVeltoIDs(&names);
-    for (const Value& name : names)
+    for (const Value& name : accountNames())
         __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true));
     startAccountCheck(0);
     registerAuthenticationListener({});

@@ -2,7 +2,6 @@
 
 #include "IPCHelpers/Transaction.h"
 #include "Logging/Log.h"
-#include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
@@ -22,11 +21,9 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
-#include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
-#include "VeltoIDAuthenticationImpl/CertificateInformation.h"
-#include "VeltoIDAuthenticationImpl/FindPerson.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
+#include "VeltoIDAuthenticationImpl/ServerRequests.h"
 
 namespace veltoid {
 namespace {
@@ -43,8 +40,6 @@ void countFor(const String& account, const Request& request, std::string_view co
 // Each handler answers one command: it fills the reply, and returns whether it succeeded, with an error if
 // there is one to tell.
 
-bool ping(Request& /*request*/, ErrorOut /*error*/) { return true; }
-
 /// Sets the database value that the request names; none when section, item or key is missing or unknown.
 std::optional<bool> setDatabaseValue(const Request& request) {
     const String section = request.string(message::kSection);
@@ -59,14 +54,6 @@ std::optional<bool> setDatabaseValue(const Request& request) {
     if (item && section == message::kCertificatesSection)
         return __VeltoIDDBSetCertificateValue(item, key, value, notify);
     return std::nullopt;
-}
-
-bool setValueOrFail(Request& request, ErrorOut /*error*/) {
-    return setDatabaseValue(request).value_or(false);
-}
-
-bool setValueIfPossible(Request& request, ErrorOut /*error*/) {
-    return setDatabaseValue(request).value_or(true);
 }
 
 bool addAccount(Request& request, ErrorOut error) {
@@ -86,23 +73,18 @@ bool getMyInfo(Request& request, ErrorOut error) {
     return succeeded;
 }
 
-Dictionary criteriaOf(const Request& request) {
-    const Value criteria = request.value(message::kCriteria);
-    const Dictionary* dictionary = criteria.asDictionary();
-    return dictionary != nullptr ? *dictionary : Dictionary();
-}
-
 bool findPerson(Request& request, ErrorOut error) {
     std::optional<Array> results;
-    const bool succeeded = __VeltoIDDoFindPerson(request.account(), request.string(message::kHashedPassword),
-                                                 criteriaOf(request), request.options(), &results, error);
+    const bool succeeded =
+        __VeltoIDDoFindPerson(request.account(), request.string(message::kHashedPassword),
+                              request.dictionary(message::kCriteria), request.options(), &results, error);
     countFor(request.account(), request, kVeltoIDFindCountKey);
     if (succeeded && results) request.answer(message::kResult, *results);
     return succeeded;
 }
 
 bool findCachedPerson(Request& request, ErrorOut /*error*/) {
-    const auto results = __VeltoIDDBCopyCachedFindPersonResults(criteriaOf(request));
+    const auto results = __VeltoIDDBCopyCachedFindPersonResults(request.dictionary(message::kCriteria));
     countFor(request.account(), request, kVeltoIDFindCachedCountKey);
     if (results) request.answer(message::kResult, *results);
     return results.has_value();
@@ -182,8 +164,7 @@ void terminateAfterReply() {
     platform::WorkQueue::main().asyncAfter(kTerminationDelay, [] {
         VELTOID_LOG_FROM(
             kHandlerName, kNotice,
-            "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey "
-            "request.");
+            "Shutting down server after receiving kVeltoIDAuthenticationStatusTerminateServerKey request.");
         shutDownByCommand();
     });
 }
@@ -203,9 +184,11 @@ struct Command {
 };
 
 constexpr Command kCommands[] = {
-    {command::kPing, ping},
-    {command::kSetValue, setValueOrFail},
-    {command::kSetValueQuietly, setValueIfPossible},
+    {command::kPing, [](Request&, ErrorOut) { return true; }},
+    {command::kSetValue,
+     [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(false); }},
+    {command::kSetValueQuietly,
+     [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(true); }},
     {command::kAdd, addAccount},
     {command::kInfo, getMyInfo},
     {command::kFind, findPerson},

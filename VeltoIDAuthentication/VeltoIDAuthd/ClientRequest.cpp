@@ -16,8 +16,13 @@ MessageObject readMessage(platform::IncomingMessage& message) {
 Request::Request(platform::IncomingMessage& message) : message_(message), request_(readMessage(message)) {
     command_ = request_.copyValue(message::kCommand, Value::Kind::Number).asInt64().value_or(0);
     account_ = request_.copyAccountName(message::kAccount);
-    const Value options = request_.copyValue(message::kOptions);
-    if (const Dictionary* given = options.asDictionary()) options_ = *given;
+    options_ = dictionary(message::kOptions);
+}
+
+Dictionary Request::dictionary(std::string_view key) const {
+    const Value given = value(key);
+    const Dictionary* dictionary = given.asDictionary();
+    return dictionary != nullptr ? *dictionary : Dictionary();
 }
 
 void Request::finish(bool success, const std::optional<Error>& error) {

@@ -27,6 +27,8 @@ class Request {
     }
     Data data(std::string_view key) const { return request_.copyValue(key, Value::Kind::Data).asData(); }
     Value value(std::string_view key) const { return request_.copyValue(key); }
+    /// Empty when absent.
+    Dictionary dictionary(std::string_view key) const;
 
     /// Adds an entry to the reply; an absent value adds nothing.
     void answer(const String& key, const Value& value) { reply_.setValue(key, value); }

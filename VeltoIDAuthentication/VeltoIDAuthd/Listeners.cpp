@@ -26,8 +26,7 @@ bool isAnsweredAtOnce(platform::IncomingMessage& incoming) {
 
 void serve(PeerConnection& peer, const RequestHandler& handle) {
     peer.setTargetQueue(platform::WorkQueue("client " + std::to_string(peer.processID())));
-    // The queue ends with the last event that uses it, so the end of the connection needs no action of its
-    // own.
+    // The queue ends with the last event that uses it: the end of the connection needs no action.
     peer.setEventHandler([handle](const platform::PeerEvent& event) {
         if (const auto* message = std::get_if<std::shared_ptr<platform::IncomingMessage>>(&event))
             handle(**message);
@@ -36,8 +35,7 @@ void serve(PeerConnection& peer, const RequestHandler& handle) {
     peer.resume();
 }
 
-/// Anything but the notice that the process is about to be ended means that clients may not reach it any
-/// more.
+/// After anything but the notice that the process is about to end, clients may not reach it any more.
 void handleAuthenticationListenerError(ConnectionError error) {
     if (error != ConnectionError::TerminationImminent) computeRelaunchFromAccounts();
     __VeltoIDDBSynchronize();

@@ -1,37 +1,28 @@
 #include "VeltoIDAuthd/PasswordCheckService.h"
 
 #include "IPCHelpers/Transaction.h"
+#include "Logging/Failure.h"
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
-#include "VeltoIDAuthenticationImpl/PasswordVerification.h"
+#include "VeltoIDAuthenticationImpl/ServerRequests.h"
 
 namespace veltoid {
 namespace {
 
-bool linkedIdentityUnsupported(ErrorOut error) {
-    fillError(error, VELTOID_ERROR(identity_error::kUnsupportedFeature));
-    return false;
-}
-
 bool updateLinkedIdentity(const Request& request, const LinkedIdentityHandler& update, ErrorOut error) {
     const Data reference = request.value(message::kIdentityReference).asData();
     if (!reference) return false;
-    return update ? update(reference, error) : linkedIdentityUnsupported(error);
+    return update ? update(reference, error)
+                  : failWith(error, VELTOID_ERROR(identity_error::kUnsupportedFeature));
 }
 
 bool run(Request& request, const LinkedIdentityHandler& linkedIdentity, ErrorOut error) {
-    switch (request.command()) {
-        case command::kPing:
-            return true;
-        case command::kVerify:
-            return verifyRequestedPassword(request, error);
-        case command::kUpdateLinkedIdentity:
-            return updateLinkedIdentity(request, linkedIdentity, error);
-        default:
-            return false;
-    }
+    if (request.command() == command::kPing) return true;
+    if (request.command() == command::kVerify) return verifyRequestedPassword(request, error);
+    return request.command() == command::kUpdateLinkedIdentity &&
+           updateLinkedIdentity(request, linkedIdentity, error);
 }
 
 }  // namespace

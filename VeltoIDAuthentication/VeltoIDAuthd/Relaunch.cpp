@@ -58,13 +58,11 @@ void scheduleRelaunch(std::optional<double> date, RelaunchDate rule) {
 }
 
 Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
-    Array names;
     Array needing;
     std::optional<double> earliest;
-    __VeltoIDDBCopyVeltoIDs(&names);
-    for (const Value& name : names) {
-        std::optional<double> date;
-        if (!copyNextActionDateForAccount(name.asString(), &date) || !date) continue;
+    for (const Value& name : accountNames()) {
+        const auto date = nextActionOf(name.asString());
+        if (!date) continue;
         needing.append(name);
         if (!earliest || *date < *earliest) earliest = date;
     }
@@ -74,8 +72,8 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
 
 void computeRelaunchFromAccounts() {
     std::optional<double> earliest;
-    const Array accounts = copyAccountsNeedingAction(&earliest);
-    if (!accounts.empty() && earliest) scheduleRelaunch(earliest);
+    copyAccountsNeedingAction(&earliest);
+    if (earliest) scheduleRelaunch(earliest);
     __VeltoIDDBSynchronize();
 }
 

@@ -49,8 +49,8 @@ double idleExitSeconds() {
     if (error == std::errc() && end == number.data() + number.size() && std::isfinite(seconds) &&
         seconds >= 0)
         return seconds;
-    VELTOID_LOG_FROM("idleExitSeconds", kError,
-                     kIdleExitVariable << " is not a number of seconds; using " << kDefaultIdleExit << ".");
+    VELTOID_LOG_FROM("idleExitSeconds", kError, kIdleExitVariable, " is not a number of seconds; using ",
+                     kDefaultIdleExit, ".");
     return kDefaultIdleExit;
 }
 

@@ -30,8 +30,8 @@ void keepMemoryPrivate() {
 
 int showUsage(int argc, char* const* argv, const CommandLineError& error) {
     const platform::Lifetime lifetime(kProduct);
-    VELTOID_LOG_FROM("main", kError,
-                     "Got an unexpected argument; ch = " << error.option << " index=" << error.index);
+    VELTOID_LOG_FROM("main", kError, "Got an unexpected argument; ch = ", error.option,
+                     " index=", error.index);
     std::printf("%s : [ --checkpassword ] [ --authentication ]\n", argc > 0 ? argv[0] : "unknown");
     return -1;
 }

@@ -1,5 +1,6 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
@@ -35,19 +36,17 @@ std::optional<AccountRecord> firstRecord(const Store& store, Condition condition
 
 /// Whether the keychain holds exactly this password for the record.
 bool keychainHoldsPassword(const Dictionary& record, const String& hashedPassword) {
-    const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
     String stored;
-    return reference && copyPasswordFromKeychainGivenPersistentRef(reference, &stored) &&
+    return copyPasswordFromKeychainGivenPersistentRef(
+               record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey), &stored) &&
            stored == hashedPassword;
 }
 
 /// Brings the password into the keychain and its reference into the record.
 bool storePassword(const String& name, const String& hashedPassword, Dictionary& record) {
     if (keychainHoldsPassword(record, hashedPassword)) {
-        VELTOID_LOG_FROM("__VeltoIDDBCreateVeltoIDAccount", kNotice,
-                         "Password being added for account "
-                             << name.view()
-                             << " matches password on keychain, so skipping over addPasswordToKeychain");
+        VELTOID_LOG_FROM("__VeltoIDDBCreateVeltoIDAccount", kNotice, "Password being added for account ",
+                         name, " matches password on keychain, so skipping over addPasswordToKeychain");
         return true;
     }
     Data reference;
@@ -76,17 +75,17 @@ void removeDirtyMarks(Dictionary& section) {
 }  // namespace
 
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
-    bool loaded = false;
-    Array all = database::perform([&](const Store& store) {
-        loaded = store.isLoaded();
-        return database::keysOf(store.accounts);
+    return database::perform([&](const Store& store) {
+        if (store.accounts.empty())
+            return failWith(error, identityError(store.isLoaded() ? identity_error::kNoAccounts
+                                                                  : identity_error::kUnspecified));
+        fill(names, database::keysOf(store.accounts));
+        return true;
     });
-    if (all.empty()) {
-        fillError(error, identityError(loaded ? identity_error::kNoAccounts : identity_error::kUnspecified));
-        return false;
-    }
-    if (names != nullptr) *names = std::move(all);
-    return true;
+}
+
+Array accountNames() {
+    return database::perform([](const Store& store) { return database::keysOf(store.accounts); });
 }
 
 std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountRequirements& required) {
@@ -98,19 +97,19 @@ std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountReq
 }
 
 bool __VeltoIDDBCopyVeltoIDAccount(const String& name, AccountRecord* record, ErrorOut error) {
-    if (!name) {
-        fillError(error, identityError(identity_error::kInvalidParameters));
-        return false;
-    }
+    if (!name) return failWith(error, identityError(identity_error::kInvalidParameters));
     return database::perform([&](const Store& store) {
         auto found = recordOf(store, name);
-        if (!found) {
-            fillError(error, identityError(missingAccountCode(store)));
-        } else if (record != nullptr) {
-            *record = std::move(*found);
-        }
-        return found.has_value();
+        if (!found) return failWith(error, identityError(missingAccountCode(store)));
+        fill(record, std::move(*found));
+        return true;
     });
+}
+
+AccountRecord accountRecordOf(const String& name) {
+    AccountRecord record;
+    __VeltoIDDBCopyVeltoIDAccount(name, &record);
+    return record;
 }
 
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error) {
@@ -118,12 +117,10 @@ bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut
         return firstRecord(
             store, [&](const AccountRecord& record) { return encDsId && record.encDsId() == encDsId; });
     });
-    if (!found) {
-        fillError(error, makeError(identity_error::kUnspecified, {"Unknown error", "?", "?"}, {}, __func__,
-                                   __FILE_NAME__, __LINE__));
-        return false;
-    }
-    if (name != nullptr) *name = found->accountName();
+    if (!found)
+        return failWith(error, makeError(identity_error::kUnspecified, {"Unknown error", "?", "?"}, {},
+                                         __func__, __FILE_NAME__, __LINE__));
+    fill(name, found->accountName());
     return true;
 }
 
@@ -162,8 +159,8 @@ bool __VeltoIDDBRemovePassword(const String& name) {
             return true;
         Dictionary record = *existing;
         record.remove(kVeltoIDAccountHashedPasswordKey);
-        if (const Data reference = record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-            removePasswordFromKeychainGivenPersistentRef(reference);
+        removePasswordFromKeychainGivenPersistentRef(
+            record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey));
         record.remove(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
         markDirty(record);
         return store.set(&Store::accounts, name, record, Notify::Yes);
@@ -205,26 +202,19 @@ Value __VeltoIDDBCopyAccountValue(const String& name, const String& key) {
 }
 
 bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
-    if (!name) {
-        fillError(error, Error{String(kOSStatusErrorDomain), -1, {}});
-        return false;
-    }
+    if (!name) return failWith(error, {kOSStatusErrorDomain, -1, {}});
     return database::perform([&](Store& store) {
-        Dictionary accounts = store.accounts;
-        const bool existed = accounts.remove(name.view());
-        if (existed && store.replace(&Store::accounts, std::move(accounts), Notify::Yes)) return true;
-        fillError(error, identityError(existed ? identity_error::kUnspecified : missingAccountCode(store)));
-        return false;
+        const bool exists = store.accounts.contains(name.view());
+        if (store.remove(&Store::accounts, name)) return true;
+        return failWith(error,
+                        identityError(exists ? identity_error::kUnspecified : missingAccountCode(store)));
     });
 }
 
 bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, AccountRecord* removed) {
     return database::perform([&](Store& store) {
         const auto record = recordOf(store, name);
-        if (!record) return false;
-        Dictionary accounts = store.accounts;
-        accounts.remove(name.view());
-        if (!store.replace(&Store::accounts, std::move(accounts), Notify::Yes)) return false;
+        if (!record || !store.remove(&Store::accounts, name)) return false;
         removePasswordFromKeychainGivenPersistentRef(record->passwordReference());
         *removed = *record;
         return true;
@@ -251,8 +241,7 @@ bool __VeltoIDDBDeriveAccountUUIDs(const String& name, Dictionary& record) {
 }
 
 bool __VeltoIDDBHasValidCertificate(const String& name) {
-    AccountRecord record;
-    return __VeltoIDDBCopyVeltoIDAccount(name, &record) && hasValidCertificateEntry(record.encDsId());
+    return hasValidCertificateEntry(accountRecordOf(name).encDsId());
 }
 
 bool __VeltoIDDBHasCertificateToken(const String& name) {

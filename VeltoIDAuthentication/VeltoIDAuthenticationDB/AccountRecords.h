@@ -1,22 +1,96 @@
-// Account records: the stored state of one identity account, in the section "Accounts" under the account's
-// name.
+// Account records: the stored state of each identity account, in the section "Accounts" under its name.
 //
 // Bodies run on the database queue; records come out as copies. "Writes" means to the preference store
-// (Store.h); Notify.h says what else a change may do. Errors are of domain HWIdentityErrorDomain
-// unless said otherwise.
+// (Store.h); Notify.h says what else a change may do. Errors are of kIdentityErrorDomain unless said
+// otherwise.
 #pragma once
 
 #include <optional>
+#include <utility>
 
+#include "Protocol/RecordKeys.h"
 #include "Values/Error.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/AccountRecord.h"
 #include "VeltoIDAuthenticationDB/Notify.h"
 
 namespace veltoid {
 
+/// A record as its readers see it: the stored dictionary under the names of its entries. Shares the stored
+/// value and copies nothing; entries of the wrong type count as absent.
+class AccountRecord : Dictionary {
+  public:
+    using Date = std::optional<double>;
+    using Seconds = std::optional<double>;
+
+    AccountRecord() = default;
+    AccountRecord(String accountName, Dictionary values)
+        : Dictionary(std::move(values)), accountName_(std::move(accountName)) {}
+
+    /// The database's key, by which every operation knows the account; null for a record that was never
+    /// found.
+    const String& accountName() const { return accountName_; }
+    const Dictionary& values() const { return *this; }
+
+    String encDsId() const { return string(kVeltoIDAccountDSIDKey); }
+    String uuid() const { return string(kVeltoIDAccountUUIDKey); }
+    String stableUUID() const { return string(kVeltoIDAccountStableUUIDKey); }
+    String serverURL() const { return string(kVeltoIDAccountServerURLKey); }
+    bool isDirty() const { return boolean(kVeltoIDDirtyKey).value_or(false); }
+    /// Whether name, encDsId and a validated address or phone are known.
+    bool isComplete() const {
+        return contains(kVeltoIDAccountNameKey) && contains(kVeltoIDAccountDSIDKey) &&
+               (contains(kVeltoIDAccountValidatedEmailKey) || contains(kVeltoIDAccountValidatedPhonesKey));
+    }
+
+    // Password: an item of the keychain, or (old records) a hash of the record's own.
+    Data passwordReference() const { return data(kVeltoIDAccountHashedPasswordKeychainReferenceKey); }
+    String ownPasswordHash() const { return string(kVeltoIDAccountHashedPasswordKey); }
+    bool hasPassword() const { return passwordReference() || ownPasswordHash(); }
+
+    // Connecting to the server.
+    Date lastConnectAttempt() const { return date(kVeltoIDMetaLastConnectAttemptKey); }
+    Date earliestConnection() const { return date(kVeltoIDAccountEarliestAllowedConnectionDateKey); }
+    bool isClientTooOld() const { return boolean(kVeltoIDAccountClientTooOldKey).value_or(false); }
+
+    // Validation of the account's information.
+    Date lastValidation() const { return date(kVeltoIDAccountLastValidationDateKey); }
+    Date nextValidation() const { return date(kVeltoIDAccountNextValidationDateKey); }
+    bool isValidationForced() const { return boolean(kVeltoIDAccountForceValidationKey).value_or(false); }
+    Seconds validForInterval() const { return number(kVeltoIDAccountValidForIntervalKey); }
+
+    // The signed validation record.
+    String validationRecordIdentifier() const { return string(kVeltoIDAccountValidationRecordIdentifierKey); }
+    Data validationRecordData() const { return data(kVeltoIDAccountValidationRecordDataKey); }
+    Date validationRecordValidAsOf() const { return date(kVeltoIDAccountValidationRecordValidAsOfKey); }
+    Date validationRecordNextCheck() const { return date(kVeltoIDAccountValidationRecordNextCheckDateKey); }
+    Seconds validationRecordNextCheckInterval() const {
+        return number(kVeltoIDAccountValidationRecordNextCheckIntervalKey);
+    }
+
+    // A certificate request: dates of those that were sent, and what is known of the pending one.
+    Date requestGeneration() const { return date(kVeltoIDAccountCSRGenerationDateKey); }
+    Seconds requestGenerationInterval() const { return number(kVeltoIDAccountCSRGenerationIntervalKey); }
+    Array requestDates() const {
+        const Array* dates = array(kVeltoIDAccountCertificateRequestDatesKey);
+        return dates != nullptr ? *dates : Array();
+    }
+    Date requestsHeldUntil() const { return date(kVeltoIDAccountCertificateRequestsHeldUntilKey); }
+    Data pendingKeyReference() const { return data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey); }
+    String certificateToken() const { return string(kVeltoIDAccountCertificateTokenKey); }
+    Date certificateTokenExpiration() const { return date(kVeltoIDAccountCertificateTokenExpirationKey); }
+    Date nextCertificateFetch() const { return date(kVeltoIDAccountCertificateNextCertificateFetchDateKey); }
+    Seconds nextCertificateFetchDelta() const {
+        return number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey);
+    }
+
+  private:
+    String accountName_;
+};
+
 /// The names of all accounts; -107 when there is none.
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error = nullptr);
+/// The same; empty when there is none.
+Array accountNames();
 
 /// What an account must have to be found.
 struct AccountRequirements {
@@ -29,6 +103,9 @@ std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountReq
 
 /// -99 for no name, -108 for no record.
 bool __VeltoIDDBCopyVeltoIDAccount(const String& name, AccountRecord* record, ErrorOut error = nullptr);
+
+/// The record; without one, a record that has no name and no values.
+AccountRecord accountRecordOf(const String& name);
 
 /// The name of the first account with that encDsId; -1 with texts when there is none.
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error = nullptr);

@@ -1,5 +1,6 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
+#include "Logging/Failure.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
@@ -21,17 +22,12 @@ void applyInfo(Dictionary& entry, const Dictionary& info) {
 }  // namespace
 
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
-    bool loaded = false;
-    Array all = database::perform([&](const Store& store) {
-        loaded = store.isLoaded();
-        return database::keysOf(store.certificates);
+    return database::perform([&](const Store& store) {
+        if (!store.isLoaded())
+            return failWith(error, identityError(identity_error::kNoCertificateForAccount));
+        fill(keys, database::keysOf(store.certificates));
+        return true;
     });
-    if (!loaded) {
-        fillError(error, identityError(identity_error::kNoCertificateForAccount));
-        return false;
-    }
-    if (keys != nullptr) *keys = std::move(all);
-    return true;
 }
 
 bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Dictionary>& info) {
@@ -73,26 +69,27 @@ bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, co
 }
 
 bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* entry) {
+    CertificateEntry found = certificateEntryOf(encDsId);
+    const bool exists = found.exists();
+    if (exists) fill(entry, std::move(found));
+    return exists;
+}
+
+CertificateEntry certificateEntryOf(const String& encDsId) {
     return database::perform([&](const Store& store) {
         const Dictionary* found = Store::find(store.certificates, encDsId);
-        if (found != nullptr && entry != nullptr) *entry = CertificateEntry(encDsId, *found);
-        return found != nullptr;
+        return found != nullptr ? CertificateEntry(encDsId, *found) : CertificateEntry();
     });
 }
 
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {
-    return database::perform([&](Store& store) {
-        Dictionary certificates = store.certificates;
-        return encDsId && certificates.remove(encDsId.view()) &&
-               store.replace(&Store::certificates, std::move(certificates), Notify::Yes);
-    });
+    return database::perform([&](Store& store) { return store.remove(&Store::certificates, encDsId); });
 }
 
 bool hasValidCertificateEntry(const String& encDsId) {
-    CertificateEntry entry;
-    if (!__VeltoIDDBCopyCertificateInfo(encDsId, &entry) || !entry.isIssued()) return false;
+    const CertificateEntry entry = certificateEntryOf(encDsId);
     const auto expires = entry.expires();
-    return !expires || *expires > platform::now() - kVeltoIDCertificateExpirationGrace;
+    return entry.isIssued() && (!expires || *expires > platform::now() - kVeltoIDCertificateExpirationGrace);
 }
 
 }  // namespace veltoid

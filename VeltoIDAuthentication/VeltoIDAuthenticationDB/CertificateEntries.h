@@ -3,13 +3,54 @@
 #pragma once
 
 #include <optional>
+#include <utility>
 
+#include "Protocol/RecordKeys.h"
 #include "Values/Error.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/CertificateEntry.h"
 #include "VeltoIDAuthenticationDB/Notify.h"
 
 namespace veltoid {
+
+/// An entry as its readers see it: the stored dictionary under the names of its entries. Shares the stored
+/// value and copies nothing; entries of the wrong type count as absent.
+class CertificateEntry : Dictionary {
+  public:
+    using Date = std::optional<double>;
+
+    CertificateEntry() = default;
+    CertificateEntry(String encDsId, Dictionary values)
+        : Dictionary(std::move(values)), encDsId_(std::move(encDsId)) {}
+
+    /// Whether the database has the entry.
+    bool exists() const { return static_cast<bool>(encDsId_); }
+    /// The database's key; null when there is no entry.
+    const String& encDsId() const { return encDsId_; }
+    const Dictionary& values() const { return *this; }
+
+    // The items in the keychain.
+    Data reference() const { return data(kVeltoIDCertificateCertificatePersistentReferenceKey); }
+    Data privateKeyReference() const { return data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey); }
+    Data intermediateReference() const {
+        return data(kVeltoIDCertificateIntermediateCertificateReferenceKey);
+    }
+
+    String serialNumber() const { return string(kVeltoIDCertificateSerialNumberKey); }
+    bool isIssued() const { return has(kVeltoIDCertificateStatusIssued); }
+    bool isInvalid() const { return has(kVeltoIDCertificateStatusInvalid); }
+    Date expires() const { return date(kVeltoIDCertificateExpirationDateKey); }
+    Date nextRenewalAttempt() const { return date(kVeltoIDCertificateNextRenewalAttemptDateKey); }
+    Date lastSuccessfulValidation() const { return date(kVeltoIDCertificateLastSuccessfulValidationDateKey); }
+    Date lastValidationAttempt() const { return date(kVeltoIDCertificateLastValidationAttemptDateKey); }
+    bool isDirty() const { return boolean(kVeltoIDDirtyKey).value_or(false); }
+
+  private:
+    bool has(std::string_view status) const {
+        return (*this)[kVeltoIDCertificateStatusKey].asText() == status;
+    }
+
+    String encDsId_;
+};
 
 /// An issued certificate counts as valid until one day after it has expired (seconds).
 inline constexpr double kVeltoIDCertificateExpirationGrace = 86'400;
@@ -29,6 +70,8 @@ bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, co
 
 /// True and a copy of the entry when there is one.
 bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* entry);
+/// The same; without one, an entry that does not exist.
+CertificateEntry certificateEntryOf(const String& encDsId);
 
 /// True when an entry was removed.
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId);

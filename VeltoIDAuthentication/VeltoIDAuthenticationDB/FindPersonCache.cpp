@@ -88,7 +88,6 @@ struct Entry {
     /// If so, both dates are finite.
     bool isEverGood() const { return std::isfinite(validUntil); }
     bool isGoodAt(double now) const { return validFrom <= now && now <= validUntil; }
-    bool hasEndedBy(double now) const { return now > validUntil; }
 };
 
 class FindPersonCache {
@@ -149,15 +148,10 @@ class FindPersonCache {
 
     void seed() {
         if (isSeeded_ || !usesPreferences_) return;
-        ValueBuilder stored;
-        const auto result = domain().read(kVeltoIDFindPersonCacheKey, stored);
-        if (result == Preferences::ReadResult::Failed) return;
-        // What is damaged is kept aside, so that nothing written later takes its place.
-        if (result == Preferences::ReadResult::Damaged && !domain().setAside(kVeltoIDFindPersonCacheKey))
-            return;
+        const auto stored = database::readStored(domain(), kVeltoIDFindPersonCacheKey);
+        if (!stored) return;
         isSeeded_ = true;
-        const Dictionary* people = stored.value().asDictionary();
-        if (result == Preferences::ReadResult::Found && people != nullptr) seedFrom(*people);
+        if (const Dictionary* people = stored->asDictionary()) seedFrom(*people);
     }
 
     /// What is here already has been added since and is newer than anything stored.
@@ -199,7 +193,7 @@ class FindPersonCache {
         const double now = platform::now();
         for (auto entry = entries_.begin(); entry != entries_.end();) {
             const auto current = entry++;
-            if (current->hasEndedBy(now)) drop(current);
+            if (now > current->validUntil) drop(current);
         }
     }
 
@@ -209,8 +203,7 @@ class FindPersonCache {
         writeQueue_.asyncAfter(database::flushDelay(), [this] { write(); });
     }
 
-    /// On the write queue. The entries are shared, so that the lock is held for no longer than it takes to
-    /// count them.
+    /// On the write queue. The entries are shared, so that the lock is held only to count them.
     bool write() {
         const Transaction keepAlive("VeltoIDFindPersonCacheWrite");
         std::vector<std::pair<String, Dictionary>> kept;

@@ -29,31 +29,22 @@ Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& opti
                                    std::optional<Value::Kind> requiredKind) {
     if (!key) return {};
     if (const Value& given = options[key.view()]; fits(given, requiredKind)) return given;
-    Value stored = database::perform([&](const Store& store) {
-        if (const Dictionary* own = Store::find(store.metaInfo, section))
-            if (const Value& value = (*own)[key.view()]; fits(value, requiredKind)) return value;
-        const Value& value = store.metaInfo[key.view()];
-        return fits(value, requiredKind) ? value : Value();
+    return database::perform([&](const Store& store) {
+        for (const Dictionary* level : {Store::find(store.metaInfo, section), &store.metaInfo, &defaults()})
+            if (level != nullptr)
+                if (const Value& value = (*level)[key.view()]; fits(value, requiredKind)) return value;
+        return Value();
     });
-    if (!stored.isAbsent()) return stored;
-    const Value& standard = defaults()[key.view()];
-    return fits(standard, requiredKind) ? standard : Value();
 }
 
 bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const Value& value) {
     if (!key) return false;
     return database::perform([&](Store& store) {
-        Dictionary metaInfo = store.metaInfo;
-        bool changed = false;
-        if (section) {
-            const Dictionary* existing = Store::find(metaInfo, section);
-            Dictionary own = existing != nullptr ? *existing : Dictionary();
-            changed = database::change(own, key, value);
-            metaInfo.set(section, own);
-        } else {
-            changed = database::change(metaInfo, key, value);
-        }
-        return !changed || store.replace(&Store::metaInfo, std::move(metaInfo), Notify::No);
+        const Dictionary* stored = section ? Store::find(store.metaInfo, section) : &store.metaInfo;
+        Dictionary changed = stored != nullptr ? *stored : Dictionary();
+        if (!database::change(changed, key, value)) return true;
+        return section ? store.set(&Store::metaInfo, section, changed, Notify::No)
+                       : store.replace(&Store::metaInfo, std::move(changed), Notify::No);
     });
 }
 

@@ -1,7 +1,6 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 
 #include <algorithm>
-#include <atomic>
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
@@ -13,23 +12,15 @@
 namespace veltoid {
 namespace database {
 
-struct StoreState {
-    Store store;
-    const platform::WorkQueue queue{"VeltoIDDBQueue"};
-    std::atomic<bool> isLoaded{false};
-
-    /// What waits to be flushed is flushed now.
-    void lifetimeEnds() {
-        queue.async([this] {
-            if (store.pendingFlush_) store.synchronize();
-        });
-    }
-};
-
 namespace {
 
-StoreState& state() { return platform::Lifetime::current().state<StoreState>(); }
-Store& store() { return state().store; }
+Store& store() { return platform::Lifetime::current().state<Store>(); }
+
+/// Whether the stored data can be loaded or not.
+template <typename Body>
+void onQueue(Body body) {
+    store().queue.sync([&] { body(store()); });
+}
 
 using ReadResult = platform::Preferences::ReadResult;
 
@@ -51,24 +42,16 @@ std::pair<std::string, platform::ValueWriter> preference(std::string_view key, c
 
 enum class OtherEntries { Drop, Keep };
 
-/// The entries of a stored section; those that are no dictionaries are dropped or kept.
-Dictionary sectionFrom(const Value& stored, OtherEntries others) {
-    Dictionary section;
-    if (const Dictionary* entries = stored.asDictionary()) {
-        for (const auto& [name, value] : *entries)
-            if (others == OtherEntries::Keep || value.isDictionary()) section.set(name, value);
-    }
-    return section;
-}
-
-/// A stored section; none when it cannot be read now. A damaged one is kept aside, so that nothing that is
-/// written later takes its place.
+/// A stored section; none when it cannot be read now. Entries that are no dictionaries are dropped or kept.
 std::optional<Dictionary> readSection(const platform::Preferences& domain, std::string_view key,
                                       OtherEntries others) {
-    const StoredValue stored = readPreference(domain, key);
-    if (stored.result == ReadResult::Failed) return std::nullopt;
-    if (stored.result == ReadResult::Damaged && !domain.setAside(key)) return std::nullopt;
-    return sectionFrom(stored.value, others);
+    const auto stored = readStored(domain, key);
+    if (!stored) return std::nullopt;
+    Dictionary section;
+    if (const Dictionary* entries = stored->asDictionary())
+        for (const auto& [name, value] : *entries)
+            if (others == OtherEntries::Keep || value.isDictionary()) section.set(name, value);
+    return section;
 }
 
 bool isUsableVersion(const Value& version) {
@@ -97,19 +80,24 @@ std::string_view keyOf(Dictionary Store::*section) {
 
 }  // namespace
 
-platform::WorkQueue queue() { return state().queue; }
+std::optional<Value> readStored(const platform::Preferences& domain, std::string_view key) {
+    const StoredValue stored = readPreference(domain, key);
+    if (stored.result == ReadResult::Failed) return std::nullopt;
+    if (stored.result == ReadResult::Damaged && !domain.setAside(key)) return std::nullopt;
+    return stored.value;
+}
 
 double flushDelay() { return platform::Lifetime::current().isEnding() ? 0 : kVeltoIDDBFlushDelay; }
 
 Store& loadedStore() {
-    StoreState& current = state();
-    if (!current.isLoaded.load(std::memory_order_acquire)) {
+    Store& current = store();
+    if (!current.isReady_.load(std::memory_order_acquire)) {
         current.queue.sync([&] {
-            if (!current.isLoaded.load(std::memory_order_relaxed))
-                current.isLoaded.store(current.store.load(), std::memory_order_release);
+            if (!current.isReady_.load(std::memory_order_relaxed))
+                current.isReady_.store(current.load(), std::memory_order_release);
         });
     }
-    return current.store;
+    return current;
 }
 
 bool change(Dictionary& dictionary, const String& key, const Value& value) {
@@ -152,23 +140,15 @@ bool Store::load() {
     const Array* stored = storedVersions.value.asArray();
     Array versions = stored != nullptr ? *stored : Array();
     const MigrationOutcome migrated = migrate(accounts, metaInfo, versions);
-    if (migrated.versionsCut) {
+    const Value own = Value::real(kVeltoIDDBAccessorVersion);
+    const bool isNew = std::find(versions.begin(), versions.end(), own) == versions.end();
+    if (isNew) versions.append(own);
+    if (isNew || migrated.versionsCut) {
         domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
         domain.synchronize();
     }
-    const bool recorded = recordAccessor(domain, versions);
-    if (migrated.sectionsChanged || recorded)
+    if (isNew || migrated.sectionsChanged)
         writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
-    return true;
-}
-
-/// Adds this agent to the versions that have opened the domain. True when it was not among them.
-bool Store::recordAccessor(const platform::Preferences& domain, Array versions) {
-    const Value own = Value::real(kVeltoIDDBAccessorVersion);
-    if (std::find(versions.begin(), versions.end(), own) != versions.end()) return false;
-    versions.append(own);
-    domain.set({preference(kVeltoIDDBAccessorVersionsKey, versions)});
-    domain.synchronize();
     return true;
 }
 
@@ -176,6 +156,11 @@ bool Store::set(Dictionary Store::*section, const String& key, const Dictionary&
     Dictionary changed = this->*section;
     changed.set(key, entry);
     return replace(section, std::move(changed), notify);
+}
+
+bool Store::remove(Dictionary Store::*section, const String& key) {
+    Dictionary changed = this->*section;
+    return key && changed.remove(key.view()) && replace(section, std::move(changed), Notify::Yes);
 }
 
 bool Store::replace(Dictionary Store::*section, Dictionary changed, Notify notify) {
@@ -202,7 +187,13 @@ bool Store::writeSections(std::initializer_list<Dictionary Store::*> sections) {
 void Store::planFlush() {
     if (pendingFlush_) return;
     pendingFlush_ = std::make_unique<Transaction>("VeltoIDDBFlush");
-    queue().asyncAfter(flushDelay(), [this] { synchronize(); });
+    queue.asyncAfter(flushDelay(), [this] { synchronize(); });
+}
+
+void Store::lifetimeEnds() {
+    queue.async([this] {
+        if (pendingFlush_) synchronize();
+    });
 }
 
 /// A flush that fails is logged by the preference store; the data survives the process all the same.
@@ -217,12 +208,11 @@ void Store::synchronize() {
 using database::Store;
 
 void __VeltoIDDBSetPreferencesDomainName(const String& name) {
-    database::queue().sync([&] { database::store().domainName_ = name; });
+    database::onQueue([&](Store& store) { store.domainName_ = name; });
 }
 
 void __VeltoIDDBSetUsePreferences(bool usePreferences) {
-    database::queue().sync([&] {
-        Store& store = database::store();
+    database::onQueue([&](Store& store) {
         if (store.usePreferences_)
             store.writeSections({&Store::accounts, &Store::certificates, &Store::metaInfo});
         store.usePreferences_ = usePreferences;
@@ -230,15 +220,14 @@ void __VeltoIDDBSetUsePreferences(bool usePreferences) {
 }
 
 void __VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore) {
-    database::queue().sync([&] { database::store().changeSemaphore_ = semaphore; });
+    database::onQueue([&](Store& store) { store.changeSemaphore_ = semaphore; });
 }
 
 bool __VeltoIDDBSynchronize() {
-    return database::queue().sync([] {
-        Store& store = database::store();
+    database::onQueue([](Store& store) {
         if (store.usePreferences_) store.synchronize();
-        return true;
     });
+    return true;
 }
 
 bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {

@@ -9,6 +9,7 @@
 // until it has run.
 #pragma once
 
+#include <atomic>
 #include <initializer_list>
 #include <memory>
 #include <optional>
@@ -69,6 +70,14 @@ class Store {
     /// The same with one entry of the section set.
     bool set(Dictionary Store::*section, const String& key, const Dictionary& entry, Notify notify);
 
+    /// The same with one entry removed, with signal; false also when there is none.
+    bool remove(Dictionary Store::*section, const String& key);
+
+    /// What waits to be flushed is flushed now.
+    void lifetimeEnds();
+
+    const platform::WorkQueue queue{"VeltoIDDBQueue"};
+
   private:
     friend void veltoid::__VeltoIDDBSetPreferencesDomainName(const String& name);
     friend void veltoid::__VeltoIDDBSetUsePreferences(bool usePreferences);
@@ -76,15 +85,14 @@ class Store {
     friend bool veltoid::__VeltoIDDBSynchronize();
     friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
     friend Store& loadedStore();
-    friend struct StoreState;
 
     platform::Preferences preferences() const;
     bool load();
     bool writeSections(std::initializer_list<Dictionary Store::*> sections);
-    bool recordAccessor(const platform::Preferences& domain, Array versions);
     void planFlush();
     void synchronize();
 
+    std::atomic<bool> isReady_{false};
     bool usePreferences_ = false;
     bool loaded_ = false;
     String domainName_;
@@ -92,12 +100,14 @@ class Store {
     std::optional<platform::Semaphore> changeSemaphore_;
 };
 
-platform::WorkQueue queue();
-
 /// Sets one value, an absent or Null one removing it; false when that changes nothing.
 bool change(Dictionary& dictionary, const String& key, const Value& value);
 
 Array keysOf(const Dictionary& section);
+
+/// The stored value; absent when there is none, or a damaged one, which is kept aside so that nothing that is
+/// written later takes its place. None when it cannot be read now.
+std::optional<Value> readStored(const platform::Preferences& domain, std::string_view key);
 
 /// How long what has changed waits for more to be written with it; not at all when the lifetime ends.
 double flushDelay();
@@ -111,7 +121,7 @@ Store& loadedStore();
 template <typename Body>
 auto perform(Body&& body) {
     Store& store = loadedStore();
-    return queue().sync([&] { return body(store); });
+    return store.queue.sync([&] { return body(store); });
 }
 
 }  // namespace database

@@ -23,6 +23,8 @@
 namespace veltoid {
 namespace {
 
+using enum AccountState;
+
 // Seconds.
 constexpr double kRenewalInterval = 86'400;
 constexpr double kRecordRetryInterval = 180;
@@ -70,47 +72,16 @@ Dictionary laterAttempt(const AccountRecord& record) {
             {kNextCheckInterval, Value::real(grown)}};
 }
 
-}  // namespace
+/// What becomes of the certificate that the account has: one that has expired or was revoked is removed.
+enum class OldCertificate { Keep, Remove };
 
-void checkAccount(const AccountRecord& record) {
-    const Dictionary options = {{option::kCheckNetwork, Value::boolean(true)}};
-    const String& accountName = record.accountName();
-    const String encDsId = record.encDsId();
-    switch (checkAccountAndDetermineNextAction(accountName, options)) {
-        case AccountState::NoEncodedDSID:
-            return __VeltoIDDoFetchEncodedDSIDForVeltoID(accountName, options);
-        case AccountState::PasswordInaccessibleInKeychain:
-            return dropLostPassword(record);
-        case AccountState::PasswordInvalid:
-            return disable(record);
-        case AccountState::CertificateRevoked:
-        case AccountState::CertificateExpired:
-            renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Remove);
-            return;
-        case AccountState::NoCertificate:
-        case AccountState::CertificateShouldBeRenewed:
-        case AccountState::CertificateMustBeRenewed:
-            renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Keep);
-            return;
-        case AccountState::CertificateOK:
-            return noteValidation(encDsId);
-        case AccountState::ValidationRecordNeedsToBeUpdated:
-            return fetchValidationRecordForAccount(record, options);
-        case AccountState::CertificatePending:
-            __VeltoIDDoFetchCertificateForVeltoID(accountName, FetchTime::WhenDue, options);
-            return;
-        case AccountState::Unknown:
-        case AccountState::CertificateAssumedOK:
-            return;
-    }
-}
-
-bool renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
+/// Asks for a new certificate, unless it is not time yet. The old one is removed first, or else the next
+/// attempt is planned first.
+void renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
                                 OldCertificate old) {
     if (old == OldCertificate::Remove) {
-        VELTOID_LOG(kNotice, "Removing certificate for Velto ID "
-                                 << describeAccountForLog(accountName) << " dsID=" << describeValue(encDsId)
-                                 << " because it has expired or been revoked.");
+        VELTOID_LOG(kNotice, "Removing certificate for Velto ID ", describeAccountForLog(accountName),
+                    " dsID=", describeValue(encDsId), " because it has expired or been revoked.");
         discardCertificate(OwnershipLock(), encDsId);
     } else {
         const double interval = metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey,
@@ -118,23 +89,54 @@ bool renewCertificateForAccount(const String& accountName, const String& encDsId
         __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateNextRenewalAttemptDateKey,
                                        Value::date(platform::now() + interval), Notify::No);
     }
-    AccountRecord record;
-    __VeltoIDDBCopyVeltoIDAccount(accountName, &record);
-    if (const auto next = nextRequestDate(record); next && platform::now() < *next) return false;
-    return __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, nullptr);
+    const auto next = nextRequestDate(accountRecordOf(accountName));
+    if (!next || platform::now() >= *next)
+        __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, nullptr);
+}
+
+}  // namespace
+
+void checkAccount(const AccountRecord& record) {
+    const Dictionary options = {{option::kCheckNetwork, Value::boolean(true)}};
+    const String& accountName = record.accountName();
+    const String encDsId = record.encDsId();
+    switch (checkAccountAndDetermineNextAction(accountName, options)) {
+        case NoEncodedDSID:
+            return __VeltoIDDoFetchEncodedDSIDForVeltoID(accountName, options);
+        case PasswordInaccessibleInKeychain:
+            return dropLostPassword(record);
+        case PasswordInvalid:
+            return disable(record);
+        case CertificateRevoked:
+        case CertificateExpired:
+            return renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Remove);
+        case NoCertificate:
+        case CertificateShouldBeRenewed:
+        case CertificateMustBeRenewed:
+            return renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Keep);
+        case CertificateOK:
+            return noteValidation(encDsId);
+        case ValidationRecordNeedsToBeUpdated:
+            return fetchValidationRecordForAccount(record, options);
+        case CertificatePending:
+            __VeltoIDDoFetchCertificateForVeltoID(accountName, FetchTime::WhenDue, options);
+            return;
+        case Unknown:
+        case CertificateAssumedOK:
+            return;
+    }
 }
 
 void fetchValidationRecordForAccount(const AccountRecord& record, const Dictionary& options) {
     const String& accountName = record.accountName();
-    VELTOID_LOG(kNotice, "Fetching VeltoIDValidationRecord for veltoid " << describeValue(accountName));
+    VELTOID_LOG(kNotice, "Fetching VeltoIDValidationRecord for veltoid ", describeValue(accountName));
     Dictionary fetchOptions = options;
     fetchOptions.set(option::kForceValidationRecordFetch, Value::boolean(true));
     if (const Value& interval = record.values()[kNextCheckInterval]; interval.isNumber())
         fetchOptions.set(kNextCheckInterval, interval);
     const double before = platform::now();
     __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
-    AccountRecord after;
-    __VeltoIDDBCopyVeltoIDAccount(accountName, &after);
+    const AccountRecord after = accountRecordOf(accountName);
     // Information of a known account is given out whether the server answers or not: the date tells.
     const bool isAnswered = after.lastValidation().value_or(before - 1) >= before;
     const auto nextCheck = after.validationRecordNextCheck();

@@ -3,7 +3,7 @@
 #pragma once
 
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/AccountRecord.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 
@@ -11,15 +11,6 @@ namespace veltoid {
 /// password that cannot be used, ask for a certificate or fetch it, fetch the validation record. `record` is
 /// the account's, as it was before.
 void checkAccount(const AccountRecord& record);
-
-/// What becomes of the certificate that the account has: one that has expired or was revoked is removed.
-enum class OldCertificate { Keep, Remove };
-
-/// Asks for a new certificate. The old one is removed first, or else the next attempt is planned first.
-/// False, without asking, until the account's "CSRGenerationInterval" has passed since its
-/// "CSRGenerationDate", and while its requests are held up.
-bool renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
-                                OldCertificate old);
 
 /// Fetches the validation record; after a failure plans the next attempt, later each time.
 void fetchValidationRecordForAccount(const AccountRecord& record, const Dictionary& options);

@@ -5,6 +5,7 @@
 
 #include "Certificates/ValidationRecord.h"
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
@@ -16,9 +17,12 @@
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/EntryTable.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -30,6 +34,16 @@ constexpr double kRecordCheckShare = 0.75;
 // Keys of the signed record.
 constexpr std::string_view kValidAsOfKey = "ValidAsOf";
 constexpr std::string_view kSuggestedDurationKey = "SuggestValidDuration";
+
+/// Of the record, in an account's information.
+constexpr TakenEntry kRecordEntries[] = {
+    {kVeltoIDAccountFirstNameKey, Value::Kind::String},
+    {kVeltoIDAccountLastNameKey, Value::Kind::String},
+    {kVeltoIDAccountEmailAddressesKey, Value::Kind::Array, message::kAllEmails},
+    {kVeltoIDAccountValidatedEmailKey, Value::Kind::Array},
+    {kVeltoIDAccountValidatedPhonesKey, Value::Kind::Array},
+    {kVeltoIDAccountLastValidationDateKey, Value::Kind::Date},
+};
 
 std::optional<double> finiteNumber(const Dictionary& dictionary, std::string_view key) {
     const auto number = dictionary.number(key);
@@ -55,30 +69,17 @@ class InformationRequest {
         }
         const bool mustAsk = isOn(option::kForceValidationRecordFetch) ||
                              isOn(option::kValidateCertificateSerialNumber) || isOn(option::kForceValidation);
-        if (mustAsk || !fresh || !record_.isComplete()) return askServer(fresh);
-        return true;
+        return (!mustAsk && fresh && record_.isComplete()) || askServer(fresh);
     }
 
     Dictionary answer() const {
-        CertificateEntry entry;
-        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
-        const Dictionary& values = record_.values();
-        Dictionary info;
-        info.set(message::kAccount, name_);
-        info.set(message::kEncDsId, encDsId_);
-        for (const std::string_view key : {kVeltoIDAccountFirstNameKey, kVeltoIDAccountLastNameKey})
-            info.set(key, values.string(key));
-        if (const Array* all = values.array(kVeltoIDAccountEmailAddressesKey))
-            info.set(message::kAllEmails, *all);
-        for (const std::string_view key :
-             {kVeltoIDAccountValidatedEmailKey, kVeltoIDAccountValidatedPhonesKey})
-            if (const Array* items = values.array(key)) info.set(key, *items);
-        if (const auto date = record_.lastValidation())
-            info.set(kVeltoIDAccountLastValidationDateKey, Value::date(*date));
-        info.set(message::kCertificatePEM, entry.values()[kVeltoIDCertificatePEMKey]);
-        info.set(message::kCertificateExpiration, entry.values()[kVeltoIDCertificateExpirationDateKey]);
-        info.set(kVeltoIDCertificateSerialNumberKey, entry.values()[kVeltoIDCertificateSerialNumberKey]);
-        info.set(message::kCertificateDate, entry.values()[kVeltoIDCertificateDateKey]);
+        Dictionary info = {{message::kAccount, name_}, {message::kEncDsId, encDsId_}};
+        takeEntries(record_.values(), kRecordEntries, info);
+        const Dictionary entry = certificateEntryOf(encDsId_).values();
+        info.set(message::kCertificatePEM, entry[kVeltoIDCertificatePEMKey]);
+        info.set(message::kCertificateExpiration, entry[kVeltoIDCertificateExpirationDateKey]);
+        info.set(kVeltoIDCertificateSerialNumberKey, entry[kVeltoIDCertificateSerialNumberKey]);
+        info.set(message::kCertificateDate, entry[kVeltoIDCertificateDateKey]);
         return info;
     }
 
@@ -115,40 +116,30 @@ class InformationRequest {
     }
 
     bool askServer(bool fresh) {
-        std::optional<Error> sessionError;
         encDsId_ = nullptr;
         password_ = __VeltoIDDBCopyHashedPassword(record_);
         const Session session =
-            __VeltoIDSessionDoCreateSession(name_, password_, options_, &encDsId_, nullptr, &sessionError);
-        if (!session) {
-            if (sessionError) held_ = sessionError;
-            if (known_ && !fresh) markForValidation();
-            return known_;
-        }
-        return fetch(*session);
+            __VeltoIDSessionDoCreateSession(name_, password_, options_, &encDsId_, nullptr, &held_);
+        if (session) return fetch(*session);
+        if (known_ && !fresh) markForValidation();
+        return known_;
     }
 
     bool fetch(VeltoIDAuthenticationSessionInfo& session) {
         Dictionary result;
-        std::optional<Error> fetchError;
-        if (_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result,
-                                       &fetchError)) {
-            updateAccountWithGetMyInfoResult(name_, result);
-            return __VeltoIDDBCopyVeltoIDAccount(name_, &record_, &held_);
-        }
-        held_ = fetchError;
-        return known_ && __VeltoIDDBCopyVeltoIDAccount(name_, &record_);
+        if (!_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result, &held_))
+            return known_ && __VeltoIDDBCopyVeltoIDAccount(name_, &record_);
+        updateAccountWithGetMyInfoResult(name_, result);
+        return __VeltoIDDBCopyVeltoIDAccount(name_, &record_, &held_);
     }
 
     /// What the agent has already; an empty identifier makes the server send its record.
     Dictionary fetchParameters() const {
-        CertificateEntry entry;
-        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry);
         String identifier = record_.validationRecordIdentifier();
         if (isOn(option::kForceValidationRecordFetch) || !identifier ||
             record_.validationRecordData().size() == 0)
             identifier = "";
-        return {{kVeltoIDCertificateSerialNumberKey, entry.serialNumber()},
+        return {{kVeltoIDCertificateSerialNumberKey, certificateEntryOf(encDsId_).serialNumber()},
                 {kVeltoIDAccountValidationRecordIdentifierKey, identifier}};
     }
 
@@ -171,11 +162,9 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
                                        Value::date(platform::now()));
         return;
     }
-    VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice,
-                     "Marking certificate for Velto ID "
-                         << accountName.view() << " dsID=" << describeValue(encDsId)
-                         << "as invalid because the server said CertificateIsValid = false. ("
-                         << describeValue(isValid));
+    VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice, "Marking certificate for Velto ID ",
+                     accountName, " dsID=", describeValue(encDsId),
+                     "as invalid because the server said CertificateIsValid = false. (", isValid);
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid);
     __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey,
                                    Value::date(platform::now()));
@@ -185,8 +174,7 @@ bool bothPresentAndDifferent(const Value& before, const Value& after) {
     return !before.isAbsent() && !after.isAbsent() && before != after;
 }
 
-/// What the signed record says of itself goes into the values; the date at which to look at it again, if it
-/// tells one.
+/// What the signed record says of itself goes into the values; when to look at it again, if it tells that.
 std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values) {
     const Data content = verifyValidationRecord(signedRecord);
     const auto payload = content ? parseValidationRecordPayload(content) : std::nullopt;
@@ -200,9 +188,8 @@ std::optional<double> applyPayload(const Data& signedRecord, Dictionary& values)
     return *validAsOf + kRecordCheckShare * duration.value_or(0);
 }
 
-/// Record data is kept only with an identifier and a date at which it is looked at again, from the server or
-/// from the record itself; otherwise the stored one goes. True when the account has another record than
-/// before.
+/// Record data is kept only with an identifier and a date at which to look at it again, from the server or
+/// from the record itself; otherwise the stored one goes. True when the account's record is another one now.
 bool applyValidationRecord(const AccountRecord& before, const Dictionary& answer, Dictionary& values) {
     const String identifier = answer.string(kVeltoIDAccountValidationRecordIdentifierKey);
     const Data data = answer.data(kVeltoIDAccountValidationRecordDataKey);
@@ -232,6 +219,33 @@ bool visibleDetailsChanged(const AccountRecord& before, const Dictionary& values
     });
 }
 
+constexpr TakenEntry kCertificateEntries[] = {
+    {kVeltoIDAccountDSIDKey, Value::Kind::String},
+    {kVeltoIDCertificateStatusKey, Value::Kind::String},
+    {kVeltoIDCertificateTypeKey, Value::Kind::String},
+    {kVeltoIDCertificateSerialNumberKey, Value::Kind::String},
+    {kVeltoIDCertificateExpirationDateKey, Value::Kind::Date},
+    {kVeltoIDCertificateCreationDateKey, Value::Kind::Date},
+    {kVeltoIDCertificateModificationDateKey, Value::Kind::Date},
+};
+
+constexpr TakenEntry kCertificateReferences[] = {
+    {kVeltoIDCertificateCertificatePersistentReferenceKey, Value::Kind::Data},
+    {kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::Kind::Data},
+};
+
+constexpr TakenEntry kCertificateDetails[] = {
+    {kVeltoIDCertificateIntermediateCertificateReferenceKey, Value::Kind::Data},
+    {kVeltoIDCertificateNextRenewalAttemptDateKey, Value::Kind::Date},
+};
+
+/// The encDsId that is asked for; null when there is none, or the account has another one.
+String requestedEncDsId(const String& accountName, const String& encDsId) {
+    if (!accountName) return encDsId;
+    const String own = accountRecordOf(accountName).encDsId();
+    return !encDsId || encDsId == own ? own : String();
+}
+
 }  // namespace
 
 bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, Dictionary* result,
@@ -242,13 +256,11 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
         return true;
     }
     handleServerError(request.name(), request.sentPasswordHash(), request.error());
-    fillError(error, request.error() ? *request.error() : VELTOID_ERROR(identity_error::kUnknown));
-    return false;
+    return failWith(error, request.error().value_or(VELTOID_ERROR(identity_error::kUnknown)));
 }
 
 void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer) {
-    AccountRecord before;
-    const bool existed = __VeltoIDDBCopyVeltoIDAccount(accountName, &before);
+    const AccountRecord before = accountRecordOf(accountName);
     Dictionary values = answer;
     values.set(kVeltoIDAccountLastValidationDateKey, Value::date(platform::now()));
     // Records keep the list of all addresses under their own name for it.
@@ -256,10 +268,9 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
     values.remove(message::kAllEmails);
     applyCertificateValidity(accountName, answer);
 
-    bool notify = false;
-    if (answer.contains(kVeltoIDAccountValidationRecordDataKey))
-        notify = applyValidationRecord(before, answer, values);
-    notify = notify || !existed || visibleDetailsChanged(before, values);
+    const bool hasOtherRecord = answer.contains(kVeltoIDAccountValidationRecordDataKey) &&
+                                applyValidationRecord(before, answer, values);
+    const bool notify = hasOtherRecord || !before.accountName() || visibleDetailsChanged(before, values);
 
     values.set(kVeltoIDAccountForceValidationKey, Value::null());
     values.set(kVeltoIDAccountNextValidationDateKey, Value::null());
@@ -267,14 +278,32 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
     if (notify) platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
 }
 
-bool __VeltoIDCopyVeltoIDs(const Dictionary& /*options*/, Array* names, ErrorOut error) {
-    std::optional<Error> databaseError;
-    Array all;
-    if (!__VeltoIDDBCopyVeltoIDs(&all, &databaseError) && databaseError &&
-        databaseError->code != identity_error::kNoAccounts) {
-        fillError(error, databaseError);
-        return false;
+bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
+                                  Dictionary* information, ErrorOut error) {
+    const String requested = requestedEncDsId(accountName, encDsId);
+    if (!requested) return failWith(error, {kOSStatusErrorDomain, -1, {}});
+    const CertificateEntry entry = certificateEntryOf(requested);
+    if (!entry.exists()) return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+    Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
+    takeEntries(entry.values(), kCertificateEntries, found);
+    if (getBool(&options, option::kCertificateDetails, false))
+        takeEntries(entry.values(), kCertificateDetails, found);
+    std::optional<platform::Certificate> certificate;
+    if (usesSystemKeychain()) {
+        takeEntries(entry.values(), kCertificateReferences, found);
+    } else if (copyCertificateFromKeychainGivenPersistentRef(entry.reference(), &certificate) &&
+               certificate) {
+        found.set(message::kCertificateData, Data(certificate->der));
     }
+    fill(information, std::move(found));
+    return true;
+}
+
+bool __VeltoIDCopyVeltoIDs(const Dictionary& /*options*/, Array* names, ErrorOut error) {
+    std::optional<Error> held;
+    Array all;
+    if (!__VeltoIDDBCopyVeltoIDs(&all, &held) && held && held->code != identity_error::kNoAccounts)
+        return failWith(error, *held);
     fill(names, std::move(all));
     return true;
 }

@@ -1,4 +1,5 @@
-// Who an account is: answered from its record while that is fresh, else asked from the server.
+// What clients are told of an account: who it is, answered from its record while that is fresh, else asked
+// from the server; and its certificate.
 #pragma once
 
 #include "Values/Error.h"
@@ -25,6 +26,15 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
 /// Applies the server's answer to the account's record and certificate entry, and posts the change
 /// notification when something that clients see changed.
 void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer);
+
+/// The certificate entry of the account, or of the encDsId when no account is named, as far as it is known:
+/// "encDsId", "CertStatus", "CertType", "SerialNumber", "Expires", "CreationDate", "ModificationDate", and
+/// the keychain references "CertificateReference" and "CertificatePrivateKeyReference" (without the system
+/// keychain "CertificateData", the DER, instead). Option "CertificateDetails" (Boolean, false): also
+/// "IntermediateCertificateReference" and "NextRenewalAttempt". Unknown account, no encDsId, or one that is
+/// not the account's: status-code domain, -1; no entry: -100. Caller's queue; no network.
+bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
+                                  Dictionary* information, ErrorOut error = nullptr);
 
 /// The names of all accounts, none being no error.
 bool __VeltoIDCopyVeltoIDs(const Dictionary& options, Array* names, ErrorOut error = nullptr);

@@ -5,7 +5,6 @@
 
 #include "Platform/runtime/Clock.h"
 #include "Values/DictionaryAccess.h"
-#include "Values/Error.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
@@ -29,6 +28,10 @@ constexpr double kDefaultSuggestedDuration = 2'592'000;
 constexpr double kRecordValidShare = 0.75;
 /// Share of a certificate's own lifetime in which it is renewed at the latest.
 constexpr double kLastShareOfLifetime = 0.25;
+
+// What is validated again after which interval.
+constexpr std::string_view kOfInformation = kVeltoIDMetaAccountValidationIntervalKey;
+constexpr std::string_view kOfCertificate = kVeltoIDMetaCertificateValidationIntervalKey;
 
 using enum DueReason;
 // The certificate is wanted already: so an account whose sign-in keeps failing stays due and is put off for
@@ -120,7 +123,7 @@ AccountSchedule::Date AccountSchedule::validation() const {
     // While a certificate is pending, the examination does not look at how old the information is.
     if (record_.certificateToken()) return std::nullopt;
     const auto validated = record_.lastValidation();
-    return validated > now_ ? rightNow() : after(validated, informationInterval());
+    return validated > now_ ? rightNow() : after(validated, validationInterval(kOfInformation));
 }
 
 AccountSchedule::Date AccountSchedule::pendingFetch() const {
@@ -153,14 +156,15 @@ AccountSchedule::Date AccountSchedule::preExpiry() const {
 AccountSchedule::Date AccountSchedule::certificateValidation() const {
     const auto validated = entry_.lastSuccessfulValidation();
     if (!validated || *validated > now_) return rightNow();
-    const double old = *validated + evaluationInterval();
+    const double old = *validated + validationInterval(kOfCertificate);
     const auto attempt = after(entry_.lastValidationAttempt(), kValidationAttemptSpacing);
     return attempt && attempt->date >= old ? attempt : at(old);
 }
 
 bool AccountSchedule::isCertificateValidationPutOff() const {
     const auto validated = entry_.lastSuccessfulValidation();
-    return validated && *validated + evaluationInterval() <= now_ && !isDue(DueReason::CertificateValidation);
+    return validated && *validated + validationInterval(kOfCertificate) <= now_ &&
+           !isDue(DueReason::CertificateValidation);
 }
 
 AccountSchedule::Date AccountSchedule::validationRecord() const {
@@ -177,17 +181,11 @@ AccountSchedule::Date AccountSchedule::validationRecord() const {
 
 bool AccountSchedule::isInformationFresh() const {
     const auto validated = record_.lastValidation();
-    return validated && *validated <= now_ && now_ <= *validated + informationInterval();
+    return validated && *validated <= now_ && now_ <= *validated + validationInterval(kOfInformation);
 }
 
-double AccountSchedule::informationInterval() const {
-    return metaInterval(record_.accountName(), {}, kVeltoIDMetaAccountValidationIntervalKey,
-                        kDefaultValidationInterval);
-}
-
-double AccountSchedule::evaluationInterval() const {
-    return metaInterval(record_.accountName(), {}, kVeltoIDMetaCertificateValidationIntervalKey,
-                        kDefaultValidationInterval);
+double AccountSchedule::validationInterval(std::string_view key) const {
+    return metaInterval(record_.accountName(), {}, key, kDefaultValidationInterval);
 }
 
 double AccountSchedule::certificateLifetime() const {
@@ -204,16 +202,10 @@ std::optional<double> AccountSchedule::endOfEmbargo() const {
     return now_ + kNeverForOldClients;
 }
 
-bool copyNextActionDateForAccount(const String& accountName, std::optional<double>* date) {
-    fill(date, std::optional<double>());
-    AccountRecord record;
-    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record) ||
-        !record.values().contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-        return false;
-    CertificateEntry entry;
-    __VeltoIDDBCopyCertificateInfo(record.encDsId(), &entry);
-    fill(date, AccountSchedule(record, entry, {}).nextAction());
-    return true;
+std::optional<double> nextActionOf(const String& accountName) {
+    const AccountRecord record = accountRecordOf(accountName);
+    if (!record.values().contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey)) return std::nullopt;
+    return AccountSchedule(record, certificateEntryOf(record.encDsId()), {}).nextAction();
 }
 
 }  // namespace veltoid

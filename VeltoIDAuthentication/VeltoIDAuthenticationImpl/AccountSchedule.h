@@ -6,8 +6,8 @@
 #include <optional>
 
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/AccountRecord.h"
-#include "VeltoIDAuthenticationDB/CertificateEntry.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
 namespace veltoid {
 
@@ -78,8 +78,7 @@ class AccountSchedule {
     Date preExpiry() const;
     Date certificateValidation() const;
     Date validationRecord() const;
-    double informationInterval() const;
-    double evaluationInterval() const;
+    double validationInterval(std::string_view key) const;
     double certificateLifetime() const;
     std::optional<double> endOfEmbargo() const;
 
@@ -89,8 +88,8 @@ class AccountSchedule {
     const double now_;
 };
 
-/// When the account next needs attention (seconds since 1970; none: no action is foreseen). False for an
-/// account without password reference. Caller's queue.
-bool copyNextActionDateForAccount(const String& accountName, std::optional<double>* date);
+/// When the account next needs attention (seconds since 1970); none: no action is foreseen, as for an account
+/// without password reference. Caller's queue.
+std::optional<double> nextActionOf(const String& accountName);
 
 }  // namespace veltoid

@@ -3,6 +3,7 @@
 #include <algorithm>
 
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
@@ -24,6 +25,8 @@
 
 namespace veltoid {
 namespace {
+
+using enum AccountState;
 
 // How long an add that waits for its certificate lets pass between two looks at the account (seconds). The
 // account check, which does the work, makes a pass every five seconds at the most.
@@ -75,10 +78,8 @@ AddedAccount readd(const String& accountName) {
     std::optional<Error> copyError;
     AddedAccount added;
     copyOutcome(accountName, added, &copyError);
-    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
-                     "VeltoIDAuth: Already existing account " << accountName.view() << " re-added; "
-                                                              << (added.encDsId ? "succeeded." : "failed, ")
-                                                              << describeError(copyError));
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Already existing account ", accountName,
+                     " re-added; ", (added.encDsId ? "succeeded." : "failed, "), describeError(copyError));
     return added;
 }
 
@@ -97,19 +98,15 @@ AddedAccount addAnew(const String& accountName, const String& hashedPassword, co
     }
     AddedAccount added{encDsId, {}};
     const bool succeeded = proceeds && copyOutcome(accountName, added, &held);
-    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice,
-                     "VeltoIDAuth: Adding account " << accountName.view() << " "
-                                                    << (succeeded ? "succeeded." : "failed, ")
-                                                    << describeError(held));
+    VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Adding account ", accountName, " ",
+                     (succeeded ? "succeeded." : "failed, "), describeError(held));
     return added;
 }
 
 /// The agent keeps one account.
 void forgetOtherAccounts(const String& added) {
-    Array names;
-    __VeltoIDDBCopyVeltoIDs(&names);
     const String addedInLowerCase = lowerCased(added);
-    for (const Value& name : names)
+    for (const Value& name : accountNames())
         if (name.isString() && lowerCased(name.asString()) != addedInLowerCase)
             __VeltoIDForgetVeltoID(name.asString(), {{option::kRemovePrivateKey, Value::boolean(true)}});
 }
@@ -117,10 +114,8 @@ void forgetOtherAccounts(const String& added) {
 /// Lets some time pass before the account is looked at again: until its next action, but not for long.
 void waitForNextAction(const String& accountName) {
     const double now = platform::now();
-    std::optional<double> next;
-    if (!copyNextActionDateForAccount(accountName, &next) || !next || *next <= now) next = now + kMinWait;
-    const platform::Semaphore neverSignalled;
-    (void)neverSignalled.wait(std::clamp(*next - now, kMinWait, kMaxWait));
+    const double next = nextActionOf(accountName).value_or(now);
+    (void)platform::Semaphore().wait(std::clamp(next - now, kMinWait, kMaxWait));
 }
 
 bool waitForCertificate(const String& accountName, const Dictionary& options,
@@ -134,12 +129,12 @@ bool waitForCertificate(const String& accountName, const Dictionary& options,
          platform::now() <= deadline && !lifetime.isEnding();) {
         wakeAccountCheck();
         switch (checkAccountAndDetermineNextAction(accountName, checkOptions)) {
-            case AccountState::NoEncodedDSID:
-            case AccountState::PasswordInaccessibleInKeychain:
-            case AccountState::PasswordInvalid:
+            case NoEncodedDSID:
+            case PasswordInaccessibleInKeychain:
+            case PasswordInvalid:
                 return false;
-            case AccountState::CertificateOK:
-            case AccountState::CertificateAssumedOK:
+            case CertificateOK:
+            case CertificateAssumedOK:
                 return true;
             default:
                 waitForNextAction(accountName);
@@ -152,14 +147,11 @@ bool waitForCertificate(const String& accountName, const Dictionary& options,
 
 bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPassword, const Dictionary& options,
                            AddedAccount* added, ErrorOut error) {
-    if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr)) {
-        fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-        return false;
-    }
-    AccountRecord record;
-    __VeltoIDDBCopyVeltoIDAccount(accountName, &record);
-    AddedAccount outcome = isAlreadyOnItsWay(record, options) ? readd(accountName)
-                                                              : addAnew(accountName, hashedPassword, options);
+    if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr))
+        return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+    AddedAccount outcome = isAlreadyOnItsWay(accountRecordOf(accountName), options)
+                               ? readd(accountName)
+                               : addAnew(accountName, hashedPassword, options);
     platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
     fill(added, std::move(outcome));
     return true;

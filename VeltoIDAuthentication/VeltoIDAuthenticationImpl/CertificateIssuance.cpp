@@ -2,6 +2,7 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
@@ -11,7 +12,7 @@
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -28,8 +29,7 @@ Error statusCodeError() { return {String(kOSStatusErrorDomain), -1, {}}; }
 bool fail(const String& accountName, const String& sentPasswordHash, const std::optional<Error>& held,
           ErrorOut error) {
     handleServerError(accountName, sentPasswordHash, held);
-    fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
-    return false;
+    return failWith(error, held.value_or(VELTOID_ERROR(identity_error::kUnknown)));
 }
 
 bool isPending(const Dictionary& result) {
@@ -42,14 +42,20 @@ class SigningRequest {
     SigningRequest(const OwnershipLock& ownership, const String& accountName, const Dictionary& options)
         : ownership_(ownership), accountName_(accountName), options_(options) {}
 
-    bool run() {
+    bool run(String* encDsId, ErrorOut error) {
+        const bool succeeded = perform();
+        if (encDsId_) fill(encDsId, encDsId_);
+        return succeeded || fail(accountName_, password_, held_, error);
+    }
+
+  private:
+    bool perform() {
         AccountRecord record;
         if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_) ||
             !admitCertificateRequest(record, &held_))
             return false;
         password_ = __VeltoIDDBCopyHashedPassword(record);
-        VELTOID_LOG_FROM(kRequestFunction, kNotice,
-                         "VeltoIDAuth: Creating CSR for " << accountName_.view() << ".");
+        VELTOID_LOG_FROM(kRequestFunction, kNotice, "VeltoIDAuth: Creating CSR for ", accountName_, ".");
         begin(record);
         const Session session =
             __VeltoIDSessionDoCreateSession(accountName_, password_, options_, &encDsId_, nullptr, &held_);
@@ -59,11 +65,6 @@ class SigningRequest {
         return succeeded;
     }
 
-    const String& encDsId() const { return encDsId_; }
-    const String& sentPasswordHash() const { return password_; }
-    const std::optional<Error>& error() const { return held_; }
-
-  private:
     /// The request takes the place of one that was pending.
     void begin(const AccountRecord& record) {
         setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now())},
@@ -78,10 +79,9 @@ class SigningRequest {
     }
 
     bool adoptEncDsId(const AccountRecord& record) {
-        if (record.encDsId() == encDsId_ || __VeltoIDDBCreateVeltoIDAccount(accountName_, nullptr, encDsId_))
-            return true;
-        held_ = statusCodeError();
-        return false;
+        return record.encDsId() == encDsId_ ||
+               __VeltoIDDBCreateVeltoIDAccount(accountName_, nullptr, encDsId_) ||
+               failWith(&held_, statusCodeError());
     }
 
     bool makeKeys() {
@@ -89,11 +89,9 @@ class SigningRequest {
             createKeyPairAndCertificateRequest(accountName_, &request_, &publicKey_, &privateKey_);
         if (status == 0 && request_ && privateKey_) return true;
         VELTOID_LOG_FROM(kRequestFunction, kError,
-                         "Failed to generate a CSR or privateKey for the dsID, err="
-                             << status << " " << describeValue(request_) << " "
-                             << describeValue(privateKey_.description()));
-        held_ = statusCodeError();
-        return false;
+                         "Failed to generate a CSR or privateKey for the dsID, err=", status, " ",
+                         describeValue(request_), " ", privateKey_.description());
+        return failWith(&held_, statusCodeError());
     }
 
     bool send(VeltoIDAuthenticationSessionInfo& session) {
@@ -105,9 +103,8 @@ class SigningRequest {
             return false;
         setInRecord({{kVeltoIDAccountCSRCreationDateKey, Value::date(sent)}}, Notify::No);
         if (token.view().size() > kMaxCertificateTokenBytes) {
-            VELTOID_LOG_FROM(
-                kRequestFunction, kError,
-                "The server's certificate token is refused: it has " << token.view().size() << " bytes.");
+            VELTOID_LOG_FROM(kRequestFunction, kError, "The server's certificate token is refused: it has ",
+                             token.view().size(), " bytes.");
             return false;
         }
         if (!keepPrivateKey()) return false;
@@ -128,10 +125,9 @@ class SigningRequest {
     }
 
     bool keepToken(const String& token, const Value& delay) {
-        VELTOID_LOG_FROM(kRequestFunction, kNotice,
-                         "VeltoIDAuth: CSR sent to Velto ID server for account "
-                             << accountName_.view() << ", certificateToken=, certToken="
-                             << describeValue(token) << ", delay=" << describeValue(delay) << ".");
+        VELTOID_LOG_FROM(kRequestFunction, kNotice, "VeltoIDAuth: CSR sent to Velto ID server for account ",
+                         accountName_, ", certificateToken=, certToken=", describeValue(token),
+                         ", delay=", delay, ".");
         if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}))
             setInRecord({{kVeltoIDAccountCertificateTokenExpirationKey,
                           Value::date(platform::now() + kVeltoIDCertificateTokenLifetime)}});
@@ -181,21 +177,17 @@ void putOffFetchAfterFailedSignIn(const AccountRecord& record) {
 /// Asks with the token and applies the answer.
 bool fetch(const OwnershipLock& ownership, VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
            const String& token, const Dictionary& options, std::optional<Error>* held) {
-    const String accountName = session.fAccountName;
     CertificateAnswer answer;
     if (!__VeltoIDSessionDoFetchCSRResult(session, encDsId, token, options, &answer, held)) {
         VELTOID_LOG_FROM("__VeltoIDDoFetchCertificateForVeltoID", kNotice,
-                         "Failed while fetching result for certificate token "
-                             << token.view() << ", error="
-                             << (*held ? describeValue(**held) : describeValue({})) << " so discarding it.");
+                         "Failed while fetching result for certificate token ", token,
+                         ", error=", *held ? Value(**held) : Value(), " so discarding it.");
         __VeltoIDSessionDoCompleteCertificate(session, encDsId, token, options, nullptr);
         return false;
     }
-    if (!updateAccountWithCertificateResult(ownership, accountName, encDsId, answer, held)) return false;
-    if (isPending(*answer.result)) {
-        *held = VELTOID_ERROR(identity_error::kNotYet);
+    if (!updateAccountWithCertificateResult(ownership, session.fAccountName, encDsId, answer, held))
         return false;
-    }
+    if (isPending(*answer.result)) return failWith(held, VELTOID_ERROR(identity_error::kNotYet));
     __VeltoIDSessionDoCompleteCertificate(session, encDsId, token, options, nullptr);
     return true;
 }
@@ -205,10 +197,7 @@ bool fetch(const OwnershipLock& ownership, VeltoIDAuthenticationSessionInfo& ses
 bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
                                                    String* encDsId, ErrorOut error) {
     const OwnershipLock ownership;
-    SigningRequest request(ownership, accountName, options);
-    const bool succeeded = request.run();
-    if (encDsId != nullptr && request.encDsId()) *encDsId = request.encDsId();
-    return succeeded || fail(accountName, request.sentPasswordHash(), request.error(), error);
+    return SigningRequest(ownership, accountName, options).run(encDsId, error);
 }
 
 bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,
@@ -223,9 +212,8 @@ bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime 
     if (time == FetchTime::WhenDue && !AccountSchedule(record, {}, options).isDue(DueReason::PendingFetch)) {
         const Dictionary information = {{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
                                          Value::date(record.nextCertificateFetch().value_or(0))}};
-        fillError(error,
-                  makeError(identity_error::kNotYet, {}, information, __func__, __FILE_NAME__, __LINE__));
-        return false;
+        return failWith(
+            error, makeError(identity_error::kNotYet, {}, information, __func__, __FILE_NAME__, __LINE__));
     }
     const String password = __VeltoIDDBCopyHashedPassword(record);
     String encDsId;
@@ -254,7 +242,7 @@ void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dict
             __VeltoIDSessionDoCreateSession(accountName, password, options, &encDsId, nullptr, &held);
         if (encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, encDsId);
     }
-    fillError(error, held ? *held : VELTOID_ERROR(identity_error::kUnknown));
+    fillError(error, held.value_or(VELTOID_ERROR(identity_error::kUnknown)));
 }
 
 }  // namespace veltoid

@@ -8,8 +8,7 @@
 // "CertificatePrivateKeyReference" (the pending request's key). When the certificate is there, all of it
 // goes, and the entry has certificate, intermediate certificate and key.
 //
-// All operations run on the caller's queue and block while the server is asked (up to 5 seconds for each
-// call).
+// All operations run on the caller's queue and block while the server is asked (up to 5 seconds a call).
 #pragma once
 
 #include "Values/Error.h"

@@ -4,8 +4,8 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "TestSupport/CertificateFixture.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
-#include "VeltoIDAuthenticationImpl/CertificateInformation.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"

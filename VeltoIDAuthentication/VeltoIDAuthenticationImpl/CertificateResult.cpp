@@ -2,6 +2,7 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
@@ -32,9 +33,8 @@ class CertificateResult {
           accountName_(accountName),
           encDsId_(encDsId),
           result_(answer.result.value_or(Dictionary())),
-          delay_(answer.delay) {
-        __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
-    }
+          delay_(answer.delay),
+          record_(accountRecordOf(accountName)) {}
 
     bool apply() {
         const String status = result_.string(kVeltoIDCertificateStatusKey);
@@ -45,18 +45,14 @@ class CertificateResult {
 
   private:
     bool applyIssued() {
-        VELTOID_LOG_FROM(kFunction, kNotice,
-                         "VeltoIDAuth: Adding certificate for "
-                             << accountName_.view() << ", " << encDsId_.view() << " to keychain, serial#="
-                             << result_.string(kVeltoIDCertificateSerialNumberKey).view());
-        CertificateEntry before;
-        __VeltoIDDBCopyCertificateInfo(encDsId_, &before);
+        VELTOID_LOG_FROM(kFunction, kNotice, "VeltoIDAuth: Adding certificate for ", accountName_, ", ",
+                         encDsId_,
+                         " to keychain, serial#=", result_.string(kVeltoIDCertificateSerialNumberKey));
+        const CertificateEntry before = certificateEntryOf(encDsId_);
         const bool stored = storeEntry() && storeCertificate() && storeIntermediate() && movePrivateKey();
         if (stored) {
             planRenewal();
-            CertificateEntry after;
-            __VeltoIDDBCopyCertificateInfo(encDsId_, &after);
-            discardReplacedItems(ownership_, before, after);
+            discardReplacedItems(ownership_, before, certificateEntryOf(encDsId_));
         } else {
             discardPendingKey(ownership_, accountName_);
         }
@@ -131,9 +127,8 @@ class CertificateResult {
         if (!certificate || !copyKeyFromKeychainGivenPersistentRef(record_.pendingKeyReference(), &pending) ||
             pending.publicPart == Data(certificate->publicKey))
             return false;
-        VELTOID_LOG_FROM(kFunction, kError,
-                         "The certificate that the server issued for "
-                             << accountName_.view() << " is not for the key that was requested.");
+        VELTOID_LOG_FROM(kFunction, kError, "The certificate that the server issued for ", accountName_,
+                         " is not for the key that was requested.");
         return true;
     }
 
@@ -154,26 +149,20 @@ class CertificateResult {
     }
 
     bool giveUp() {
-        VELTOID_LOG_FROM(kFunction, kNotice,
-                         "VeltoIDAuth: Failed generating certificate for "
-                             << accountName_.view() << ", " << encDsId_.view() << ", certToken=" << token()
-                             << ".");
-        VELTOID_LOG_FROM(kFunction, kWarning,
-                         "Certificate issuance request for "
-                             << accountName_.view() << " dsID=" << encDsId_.view() << " certToken=" << token()
-                             << " failed to be issued by the server.");
+        VELTOID_LOG_FROM(kFunction, kNotice, "VeltoIDAuth: Failed generating certificate for ", accountName_,
+                         ", ", encDsId_, ", certToken=", token(), ".");
+        VELTOID_LOG_FROM(kFunction, kWarning, "Certificate issuance request for ", accountName_,
+                         " dsID=", encDsId_, " certToken=", token(), " failed to be issued by the server.");
         dropRequest();
         return false;
     }
 
     bool applyUnknown() {
         VELTOID_LOG_FROM(kFunction, kNotice,
-                         "VeltoIDAuth: Unknown state after trying to fetch certifitate for "
-                             << accountName_.view() << ", " << encDsId_.view() << " ");
-        VELTOID_LOG_FROM(kFunction, kWarning,
-                         "UNKNOWN Certificate issuance request for "
-                             << accountName_.view() << " dsID=" << encDsId_.view() << " certToken=" << token()
-                             << ", status=" << statusText() << ".");
+                         "VeltoIDAuth: Unknown state after trying to fetch certifitate for ", accountName_,
+                         ", ", encDsId_, " ");
+        VELTOID_LOG_FROM(kFunction, kWarning, "UNKNOWN Certificate issuance request for ", accountName_,
+                         " dsID=", encDsId_, " certToken=", token(), ", status=", statusText(), ".");
         const auto expiration = record_.certificateTokenExpiration();
         if (expiration && *expiration < platform::now()) {
             dropRequest();
@@ -203,7 +192,7 @@ class CertificateResult {
                       Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}});
     }
 
-    std::string token() const { return record_.certificateToken().text(); }
+    String token() const { return record_.certificateToken(); }
 
     std::string statusText() const {
         const Value& status = result_[kVeltoIDCertificateStatusKey];
@@ -219,7 +208,7 @@ class CertificateResult {
     const String& encDsId_;
     const Dictionary result_;
     const Value& delay_;
-    AccountRecord record_;
+    const AccountRecord record_;
 };
 
 }  // namespace
@@ -227,9 +216,8 @@ class CertificateResult {
 bool updateAccountWithCertificateResult(const OwnershipLock& ownership, const String& accountName,
                                         const String& encDsId, const CertificateAnswer& answer,
                                         ErrorOut error) {
-    if (CertificateResult(ownership, accountName, encDsId, answer).apply()) return true;
-    fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-    return false;
+    return CertificateResult(ownership, accountName, encDsId, answer).apply() ||
+           failWith(error, VELTOID_ERROR(identity_error::kUnknown));
 }
 
 }  // namespace veltoid

@@ -2,12 +2,10 @@
 #include "TestSupport/EngineFixture.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
-#include "VeltoIDAuthenticationImpl/Breadcrumbs.h"
-#include "VeltoIDAuthenticationImpl/FindPerson.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
-#include "VeltoIDAuthenticationImpl/PasswordVerification.h"
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "VeltoIDAuthenticationImpl/ServerRequests.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
@@ -321,20 +319,16 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
             for (const auto& [key, value] : *each.entry)
                 __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
         }
-        std::optional<double> next = -1;
-        EXPECT_TRUE(copyNextActionDateForAccount(kName, &next)) << each.what;
+        const auto next = nextActionOf(kName);
         EXPECT_EQ(next ? Value::date(*next) : Value(), each.next ? date(*each.next) : Value()) << each.what;
     }
     __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(100));
     setValue("ValidationDate", date(-30));
     setValue(kNextCheck, date(1000));
-    std::optional<double> next;
-    EXPECT_TRUE(copyNextActionDateForAccount(kName, &next));
-    EXPECT_EQ(next, now() + 70);
-    EXPECT_FALSE(copyNextActionDateForAccount("nobody", &next));
-    EXPECT_EQ(next, std::nullopt);
+    EXPECT_EQ(nextActionOf(kName), now() + 70);
+    EXPECT_EQ(nextActionOf("nobody"), std::nullopt);
     ASSERT_TRUE(__VeltoIDDBRemovePassword(kName));
-    EXPECT_FALSE(copyNextActionDateForAccount(kName, &next)) << "without a password nothing can be done";
+    EXPECT_EQ(nextActionOf(kName), std::nullopt) << "without a password nothing can be done";
 }
 
 }  // namespace

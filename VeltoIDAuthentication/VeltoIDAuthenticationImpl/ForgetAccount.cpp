@@ -1,5 +1,6 @@
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Protocol/Names.h"
@@ -30,7 +31,7 @@ void forget(const String& accountName, const DroppedItems& dropped) {
 
 bool __VeltoIDForgetVeltoID(const String& accountName, const Dictionary& options, ErrorOut error) {
     if (accountName) {
-        VELTOID_LOG(kNotice, "VeltoIDAuth: Forgetting account " << accountName.view() << ".");
+        VELTOID_LOG(kNotice, "VeltoIDAuth: Forgetting account ", accountName, ".");
         auto& notifications = platform::Notifications::shared();
         if (__VeltoIDDBCopyVeltoIDAccount(accountName, nullptr)) {
             forget(accountName, {getBool(&options, option::kRemoveCertificate, true),
@@ -41,8 +42,7 @@ bool __VeltoIDForgetVeltoID(const String& accountName, const Dictionary& options
         }
         notifications.post(kVeltoIDAccountChangeNotification);
     }
-    fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-    return false;
+    return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
 }
 
 }  // namespace veltoid

@@ -31,10 +31,9 @@ bool isReferredTo(const Data& reference) {
     Array encDsIds;
     __VeltoIDDBCopyCertificateKeys(&encDsIds);
     return std::any_of(encDsIds.begin(), encDsIds.end(), [&](const Value& encDsId) {
-        CertificateEntry entry;
-        return __VeltoIDDBCopyCertificateInfo(encDsId.asString(), &entry) &&
-               (entry.reference() == reference || entry.privateKeyReference() == reference ||
-                entry.intermediateReference() == reference);
+        const CertificateEntry entry = certificateEntryOf(encDsId.asString());
+        return entry.reference() == reference || entry.privateKeyReference() == reference ||
+               entry.intermediateReference() == reference;
     });
 }
 
@@ -47,11 +46,8 @@ void removeUnlessReferredTo(const std::optional<Array>& references, bool (*remov
 /// The encDsIds of all accounts; lifts their embargoes on the way.
 std::set<std::string> encDsIdsOfAccounts() {
     std::set<std::string> encDsIds;
-    Array names;
-    __VeltoIDDBCopyVeltoIDs(&names);
-    for (const Value& name : names) {
-        AccountRecord record;
-        if (!__VeltoIDDBCopyVeltoIDAccount(name.asString(), &record)) continue;
+    for (const Value& name : accountNames()) {
+        const AccountRecord record = accountRecordOf(name.asString());
         if (const String encDsId = record.encDsId()) encDsIds.insert(encDsId.text());
         const auto embargo = record.earliestConnection();
         if (embargo && *embargo < platform::now())
@@ -62,8 +58,8 @@ std::set<std::string> encDsIdsOfAccounts() {
 }
 
 bool isOfUse(const String& encDsId) {
-    CertificateEntry entry;
-    return __VeltoIDDBCopyCertificateInfo(encDsId, &entry) && !entry.isInvalid() &&
+    const CertificateEntry entry = certificateEntryOf(encDsId);
+    return !entry.isInvalid() &&
            entry.values().contains(kVeltoIDCertificateCertificatePersistentReferenceKey) &&
            entry.values().contains(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
 }
@@ -77,9 +73,7 @@ OwnershipLock::OwnershipLock() {
 OwnershipLock::~OwnershipLock() { ownershipSemaphore().signal(); }
 
 void discardPendingKey(const OwnershipLock& /*ownership*/, const String& accountName) {
-    const Data reference =
-        __VeltoIDDBCopyAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey)
-            .asData();
+    const Data reference = accountRecordOf(accountName).pendingKeyReference();
     if (!reference) return;
     removeKeyFromKeychainGivenPersistentRef(reference);
     __VeltoIDDBSetAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey,
@@ -99,8 +93,8 @@ void discardReplacedItems(const OwnershipLock& /*ownership*/, const CertificateE
 }
 
 void discardCertificate(const OwnershipLock& ownership, const String& encDsId, const DroppedItems& dropped) {
-    CertificateEntry entry;
-    if (!__VeltoIDDBCopyCertificateInfo(encDsId, &entry)) return;
+    const CertificateEntry entry = certificateEntryOf(encDsId);
+    if (!entry.exists()) return;
     __VeltoIDDBRemoveCertificateInfo(encDsId);
     Dictionary kept;
     if (!dropped.certificate)
@@ -135,10 +129,10 @@ void cleanUpAccountsAndCertificates(const OwnershipLock& ownership) {
         if (owned.contains(encDsId.text()) && isOfUse(encDsId)) continue;
         String accountName;
         __VeltoIDDBCopyVeltoIDForDSID(encDsId, &accountName);
-        VELTOID_LOG_FROM("__VeltoIDCleanupAccountsAndCertificates", kNotice,
-                         "Removing certificate and private key  from keychain, and certificate from db, for "
-                         "account "
-                             << accountName.view() << " / dsID=" << encDsId.view());
+        VELTOID_LOG_FROM(
+            "__VeltoIDCleanupAccountsAndCertificates", kNotice,
+            "Removing certificate and private key  from keychain, and certificate from db, for account ",
+            accountName, " / dsID=", encDsId);
         discardCertificate(ownership, encDsId);
     }
 }

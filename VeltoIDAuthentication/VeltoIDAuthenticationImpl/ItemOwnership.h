@@ -8,7 +8,7 @@
 
 #include "Values/Error.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/CertificateEntry.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
 namespace veltoid {
 

@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
-#include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/crypto/TrustEvaluation.h"
 #include "Platform/runtime/Clock.h"
@@ -15,11 +14,13 @@
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
 namespace veltoid {
 namespace {
+
+using enum AccountState;
 
 constexpr const char* kFunction = "checkAccountAndDetermineNextAction";
 
@@ -35,15 +36,15 @@ class AccountCheck {
           networkAllowed_(getBool(&options, option::kCheckNetwork, false)) {}
 
     AccountState run() {
-        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record_)) return AccountState::NoCertificate;
+        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record_)) return NoCertificate;
         if (schedule().isEmbargoed()) networkAllowed_ = false;
         if (const auto state = examinePassword()) return *state;
         encDsId_ = record_.encDsId();
-        if (!encDsId_) return AccountState::NoEncodedDSID;
+        if (!encDsId_) return NoEncodedDSID;
         takeDueValidation();
-        if (record_.certificateToken()) return AccountState::CertificatePending;
+        if (record_.certificateToken()) return CertificatePending;
         if (const auto state = validateAccount()) return *state;
-        if (!__VeltoIDDBCopyCertificateInfo(encDsId_, &entry_)) return AccountState::NoCertificate;
+        if (!__VeltoIDDBCopyCertificateInfo(encDsId_, &entry_)) return NoCertificate;
         return examineCertificate();
     }
 
@@ -51,33 +52,31 @@ class AccountCheck {
     std::optional<AccountState> examinePassword() const {
         const Data reference = record_.passwordReference();
         if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice,
-                             "checkAccount: Velto ID " << accountName_.view()
-                                                       << " doesn't have a password; no next action.");
-            return AccountState::PasswordInvalid;
+            VELTOID_LOG_FROM(kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
+                             " doesn't have a password; no next action.");
+            return PasswordInvalid;
         }
         if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) return std::nullopt;
-        VELTOID_LOG_FROM(kFunction, kNotice,
-                         "checkAccount: Velto ID "
-                             << accountName_.view()
-                             << " doesn't have a password or the password has been removed "
-                                "from the keychain; no next action.");
-        return AccountState::PasswordInaccessibleInKeychain;
+        VELTOID_LOG_FROM(
+            kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
+            " doesn't have a password or the password has been removed from the keychain; no next action.");
+        return PasswordInaccessibleInKeychain;
     }
 
     void takeDueValidation() {
         validationIsDue_ = schedule().isDue(DueReason::Validation);
         if (!validationIsDue_) return;
         if (record_.isValidationForced()) {
-            setInRecord(kVeltoIDAccountForceValidationKey, Value::null(), Notify::No);
+            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountForceValidationKey, Value::null(),
+                                       Notify::No);
         } else if (record_.nextValidation()) {
             postponeValidation(Notify::Yes);
         }
     }
 
     void postponeValidation(Notify notify) const {
-        setInRecord(kVeltoIDAccountNextValidationDateKey,
-                    Value::date(platform::now() + kValidationPostponement), notify);
+        __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountNextValidationDateKey,
+                                   Value::date(platform::now() + kValidationPostponement), notify);
     }
 
     /// Asks the server about the account if its information is old or its validation due. A state only when
@@ -87,10 +86,10 @@ class AccountCheck {
         // What is too old is asked for again, and in an hour once more if the server cannot be reached.
         if (validationIsDue_ && !record_.isValidationForced() && !record_.nextValidation())
             postponeValidation(Notify::No);
-        if (!password()) return AccountState::PasswordInaccessibleInKeychain;
+        if (!password()) return PasswordInaccessibleInKeychain;
         std::optional<Error> error;
         if (!openSession(&error))
-            return refusesPassword(error) ? std::optional(AccountState::PasswordInvalid) : std::nullopt;
+            return refusesPassword(error) ? std::optional(PasswordInvalid) : std::nullopt;
         if (validationIsDue_) {
             const Dictionary forced = {{option::kForceValidation, Value::boolean(true)}};
             __VeltoIDDoGetMyInfo(accountName_, forced, nullptr);
@@ -102,33 +101,32 @@ class AccountCheck {
     AccountState examineCertificate() {
         AccountState state = classify();
         if (triedRecently_) return withValidationRecord(state);
-        if (state == AccountState::Unknown) {
+        if (state == Unknown) {
             askAboutCertificate();
             // The server's word counts at once.
             __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
-            if (entry_.isInvalid()) return AccountState::CertificateRevoked;
+            if (entry_.isInvalid()) return CertificateRevoked;
         }
         if (static_cast<int>(state) < 0) return state;
         std::optional<platform::Certificate> certificate;
-        if (!readItems(&certificate)) return AccountState::NoCertificate;
-        if (state == AccountState::Unknown)
-            state = networkAllowed_ ? evaluate(*certificate) : AccountState::CertificateAssumedOK;
-        if (state != AccountState::CertificateOK && state != AccountState::CertificateAssumedOK) return state;
+        if (!readItems(&certificate)) return NoCertificate;
+        if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate) : CertificateAssumedOK;
+        if (state != CertificateOK && state != CertificateAssumedOK) return state;
         return schedule().isDue(DueReason::Renewal) || schedule().isDue(DueReason::PreExpiry)
-                   ? AccountState::CertificateShouldBeRenewed
+                   ? CertificateShouldBeRenewed
                    : withValidationRecord(state);
     }
 
     /// By the entry alone.
     AccountState classify() {
-        if (entry_.isInvalid()) return AccountState::CertificateRevoked;
+        if (entry_.isInvalid()) return CertificateRevoked;
         const AccountSchedule now = schedule();
-        if (now.isDue(DueReason::Expiry)) return AccountState::CertificateExpired;
+        if (now.isDue(DueReason::Expiry)) return CertificateExpired;
         if (entry_.isDirty() || getBool(&options_, option::kForceValidation, false) ||
             now.isDue(DueReason::CertificateValidation))
-            return AccountState::Unknown;
+            return Unknown;
         triedRecently_ = now.isCertificateValidationPutOff();
-        return AccountState::CertificateAssumedOK;
+        return CertificateAssumedOK;
     }
 
     void askAboutCertificate() {
@@ -151,33 +149,22 @@ class AccountCheck {
 
     bool readCertificate(std::optional<platform::Certificate>* certificate) const {
         const Data reference = entry_.reference();
-        if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice,
-                             "Failed trying to get certificate from keychain for veltoID "
-                                 << accountName_.view() << " because certRef=NULL");
-            return false;
-        }
         if (copyCertificateFromKeychainGivenPersistentRef(reference, certificate) && *certificate)
             return true;
-        VELTOID_LOG_FROM(
-            kFunction, kNotice,
-            "Failed trying to get certificate from keychain from persistent reference for veltoID "
-                << accountName_.view() << " certRef=" << describeValue(reference));
+        VELTOID_LOG_FROM(kFunction, kNotice, "Failed trying to get certificate from keychain ",
+                         reference ? "from persistent reference for veltoID " : "for veltoID ", accountName_,
+                         reference ? logText(" certRef=", reference) : " because certRef=NULL");
         return false;
     }
 
     bool readPrivateKey() const {
-        constexpr const char* kText =
-            "Failed trying to get private key from keychain from persistent reference for veltoID ";
         const Data reference = entry_.privateKeyReference();
-        if (!reference) {
-            VELTOID_LOG_FROM(kFunction, kNotice, kText << accountName_.view() << " privateKeyRef=NULL");
-            return false;
-        }
         // That it can be unsealed says enough: reading a key costs as much as all the rest of a check.
         if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return true;
-        VELTOID_LOG_FROM(kFunction, kNotice,
-                         kText << accountName_.view() << " certRef=" << describeValue(reference));
+        VELTOID_LOG_FROM(
+            kFunction, kNotice,
+            "Failed trying to get private key from keychain from persistent reference for veltoID ",
+            accountName_, reference ? logText(" certRef=", reference) : " privateKeyRef=NULL");
         return false;
     }
 
@@ -187,43 +174,27 @@ class AccountCheck {
         std::vector<platform::Certificate> chain;
         if (intermediate) chain.push_back(*intermediate);
         const auto result = platform::evaluateTrust(certificate, chain);
-        if (!result) return AccountState::Unknown;
+        if (!result) return Unknown;
         const AccountState state = stateOf(*result);
         setInEntry(kVeltoIDCertificateLastValidationAttemptDateKey, Value::date(platform::now()));
-        if (state == AccountState::CertificateOK || state == AccountState::CertificateAssumedOK)
+        if (state == CertificateOK || state == CertificateAssumedOK)
             setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now()));
         return state;
     }
 
     AccountState stateOf(platform::TrustResult result) const {
         using enum platform::TrustResult;
-        switch (result) {
-            case Proceed:
-            case Unspecified:
-                return AccountState::CertificateOK;
-            case RecoverableFailure:
-                return AccountState::CertificateAssumedOK;
-            case Deny:
-                VELTOID_LOG_FROM(
-                    kFunction, kNotice,
-                    "Removing certificate, serial#="
-                        << entry_.serialNumber().view() << " for veltoID " << accountName_.view()
-                        << " dsID=" << encDsId_.view()
-                        << " because it is not present in the certificates the server has for us.");
-                return AccountState::CertificateRevoked;
-            case FatalFailure:
-                return AccountState::CertificateRevoked;
-            case Invalid:
-            case Confirm:
-            case OtherError:
-                break;
-        }
-        return AccountState::Unknown;
+        if (result == Proceed || result == Unspecified) return CertificateOK;
+        if (result == RecoverableFailure) return CertificateAssumedOK;
+        if (result == Deny)
+            VELTOID_LOG_FROM(kFunction, kNotice, "Removing certificate, serial#=", entry_.serialNumber(),
+                             " for veltoID ", accountName_, " dsID=", encDsId_,
+                             " because it is not present in the certificates the server has for us.");
+        return result == Deny || result == FatalFailure ? CertificateRevoked : Unknown;
     }
 
     AccountState withValidationRecord(AccountState state) const {
-        return schedule().isDue(DueReason::ValidationRecord) ? AccountState::ValidationRecordNeedsToBeUpdated
-                                                             : state;
+        return schedule().isDue(DueReason::ValidationRecord) ? ValidationRecordNeedsToBeUpdated : state;
     }
 
     AccountSchedule schedule() const { return {record_, entry_, options_}; }
@@ -236,9 +207,6 @@ class AccountCheck {
         return session_ != nullptr;
     }
 
-    void setInRecord(std::string_view key, const Value& value, Notify notify) const {
-        __VeltoIDDBSetAccountValue(accountName_, key, value, notify);
-    }
     void setInEntry(std::string_view key, const Value& value) const {
         __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::No);
     }
@@ -260,7 +228,7 @@ AccountState checkAccountAndDetermineNextAction(const String& accountName, const
                                                 ErrorOut error) {
     if (accountName) return AccountCheck(accountName, options).run();
     fillError(error, VELTOID_ERROR(identity_error::kUnknown));
-    return AccountState::Unknown;
+    return Unknown;
 }
 
 }  // namespace veltoid

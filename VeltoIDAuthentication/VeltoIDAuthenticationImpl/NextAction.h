@@ -14,8 +14,7 @@ namespace veltoid {
 /// Options (Booleans, default false): "CheckNetwork" (the server may be asked, unless the account is under an
 /// embargo), "ForceValidation" (evaluate the certificate even if that was done not long ago);
 /// "PreExpirationInterval" (a Number of seconds). What is stored changes only as far as the examination goes:
-/// dates of attempts, due dates put off, what the server says. Caller's queue; blocks while the server is
-/// asked.
+/// dates of attempts, due dates put off, what the server says. Caller's queue; blocks for the server.
 AccountState checkAccountAndDetermineNextAction(const String& accountName, const Dictionary& options,
                                                 ErrorOut error = nullptr);
 

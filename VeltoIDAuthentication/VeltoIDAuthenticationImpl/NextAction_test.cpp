@@ -2,7 +2,7 @@
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 #include "TestSupport/CertificateFixture.h"
-#include "VeltoIDAuthenticationImpl/PasswordVerification.h"
+#include "VeltoIDAuthenticationImpl/ServerRequests.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {

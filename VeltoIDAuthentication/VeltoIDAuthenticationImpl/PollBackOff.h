@@ -4,7 +4,7 @@
 #include <optional>
 
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/AccountRecord.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 

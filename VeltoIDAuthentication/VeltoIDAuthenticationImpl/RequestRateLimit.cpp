@@ -3,7 +3,7 @@
 #include <algorithm>
 #include <cmath>
 
-#include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
 #include "Platform/runtime/Clock.h"
@@ -26,9 +26,7 @@ double generationInterval(const AccountRecord& record) {
 /// The dates of the requests within the window.
 Array recentRequests(const AccountRecord& record) {
     Array recent;
-    const Array* stored = record.requestDates();
-    if (stored == nullptr) return recent;
-    for (const Value& date : *stored) {
+    for (const Value& date : record.requestDates()) {
         const auto seconds = date.asDate();
         if (seconds && *seconds <= platform::now() && platform::now() < *seconds + kRequestWindow)
             recent.append(date);
@@ -60,26 +58,21 @@ bool admitCertificateRequest(const AccountRecord& record, ErrorOut error) {
         heldUntil = platform::now() + generationInterval(record);
         __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCertificateRequestsHeldUntilKey,
                                    Value::date(*heldUntil), Notify::No);
-        VELTOID_LOG(
-            kError,
-            "Velto ID " << describeAccountForLog(record.accountName()) << " has asked for "
-                        << kMaxRequestsInWindow
-                        << " certificates within an hour and wants another one; its requests are held "
-                           "up until "
-                        << describeValue(Value::date(*heldUntil)) << ".");
+        VELTOID_LOG(kError, "Velto ID ", describeAccountForLog(record.accountName()), " has asked for ",
+                    kMaxRequestsInWindow,
+                    " certificates within an hour and wants another one; its requests are held up until ",
+                    Value::date(*heldUntil), ".");
     }
     const Dictionary information = {
         {kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::date(*heldUntil)}};
-    fillError(error, makeError(identity_error::kNotYet,
-                               {"This account has asked for too many certificates within an hour.", {}, {}},
-                               information, __func__, __FILE_NAME__, __LINE__));
-    return false;
+    return failWith(error,
+                    makeError(identity_error::kNotYet,
+                              {"This account has asked for too many certificates within an hour.", {}, {}},
+                              information, __func__, __FILE_NAME__, __LINE__));
 }
 
 void noteCertificateRequest(const String& accountName) {
-    AccountRecord record;
-    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) return;
-    Array requests = recentRequests(record);
+    Array requests = recentRequests(accountRecordOf(accountName));
     requests.append(Value::date(platform::now()));
     __VeltoIDDBSetAccountValues(accountName,
                                 {{kVeltoIDAccountCertificateRequestDatesKey, requests},

@@ -9,7 +9,7 @@
 
 #include "Values/Error.h"
 #include "Values/Value.h"
-#include "VeltoIDAuthenticationDB/AccountRecord.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 

@@ -27,10 +27,9 @@ bool updateItem(const Data& reference, const Certificate& certificate, const Str
          label.text(), kKeychainAccessGroup});
     if (status == platform::kKeychainSuccess) return true;
     const Dictionary attributes = {{"accessGroup", kKeychainAccessGroup}, {"label", label}};
-    VELTOID_LOG_FROM("addCertificateToKeychain", kNotice,
-                     "SetItemUpdate(" << keychain_items::describeItemQuery("cert", reference)
-                                      << ", attrs=" << describeValue(attributes) << " err=" << status
-                                      << " so deleting and re-adding item.");
+    VELTOID_LOG_FROM("addCertificateToKeychain", kNotice, "SetItemUpdate(",
+                     keychain_items::describeItemQuery("cert", reference), ", attrs=", attributes,
+                     " err=", status, " so deleting and re-adding item.");
     return false;
 }
 
@@ -41,9 +40,9 @@ Data addItem(const Certificate& certificate, const String& label) {
     platform::PersistentReference added;
     const KeychainStatus status =
         platform::keychain::add(attributes, Accessibility::Always, certificate.der, &added);
-    if (status == platform::kKeychainSuccess) return keychain_items::dataOf(added);
-    VELTOID_LOG_FROM("addCertificateToKeychain", kError,
-                     "Certificate " << describeValue(label) << " not added to keychain; err=" << status);
+    if (status == platform::kKeychainSuccess) return Data(added);
+    VELTOID_LOG_FROM("addCertificateToKeychain", kError, "Certificate ", describeValue(label),
+                     " not added to keychain; err=", status);
     return {};
 }
 
@@ -54,14 +53,6 @@ Data addOrUpdate(const Certificate& certificate, const String& label) {
         platform::keychain::remove({identityOf(certificate), {}});
     }
     return addItem(certificate, label);
-}
-
-/// Those with the label, or all.
-std::optional<Array> copyReferencesOf(const std::optional<std::string>& label) {
-    return keychainQueue().sync([&]() -> std::optional<Array> {
-        if (!usesSystemKeychain()) return std::nullopt;
-        return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Certificate, label));
-    });
 }
 
 }  // namespace
@@ -102,19 +93,20 @@ bool removeCertificateFromKeychainGivenPersistentRef(const Data& persistentRefer
         const KeychainStatus status = platform::keychain::remove(
             keychain_items::queryForReference(KeychainItemClass::Certificate, persistentReference));
         if (status == platform::kKeychainSuccess || status == platform::kKeychainItemNotFound) return true;
-        VELTOID_LOG_FROM("removeCertificateFromKeychainGivenPersistentRef", kError,
-                         "Error #" << status
-                                   << " from keychain::remove(), "
-                                      "removeCertificateFromKeychainGivenPersistentRef #"
-                                   << __LINE__);
+        VELTOID_LOG_FROM("removeCertificateFromKeychainGivenPersistentRef", kError, "Error #", status,
+                         " from keychain::remove(), removeCertificateFromKeychainGivenPersistentRef #",
+                         __LINE__);
         return false;
     });
 }
 
-std::optional<Array> copyAllCertificatesFromKeychain() { return copyReferencesOf({}); }
+std::optional<Array> copyAllCertificatesFromKeychain() {
+    return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Certificate));
+}
 
 std::optional<Array> copyCertificatesFromKeychainGivenLabel(const String& label) {
-    return copyReferencesOf(label.text());
+    return keychain_items::copyReferences(
+        keychain_items::itemsOf(KeychainItemClass::Certificate, label.text()));
 }
 
 }  // namespace veltoid

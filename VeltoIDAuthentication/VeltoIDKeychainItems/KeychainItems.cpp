@@ -45,16 +45,19 @@ Data copyReference(const platform::KeychainAttributes& attributes, platform::Key
     std::vector<platform::PersistentReference> found;
     const auto result = platform::keychain::copyMatchingReferences({attributes, {}}, &found);
     if (status != nullptr) *status = result;
-    return result == platform::kKeychainSuccess ? dataOf(found.front()) : Data();
+    return result == platform::kKeychainSuccess ? Data(found.front()) : Data();
 }
 
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes) {
-    std::vector<platform::PersistentReference> found;
-    if (platform::keychain::copyMatchingReferences({attributes, {}}, &found) != platform::kKeychainSuccess)
-        return std::nullopt;
-    Array references;
-    for (const auto& reference : found) references.append(dataOf(reference));
-    return references;
+    return keychainQueue().sync([&]() -> std::optional<Array> {
+        std::vector<platform::PersistentReference> found;
+        if (!usesSystemKeychain() || platform::keychain::copyMatchingReferences({attributes, {}}, &found) !=
+                                         platform::kKeychainSuccess)
+            return std::nullopt;
+        Array references;
+        for (const auto& reference : found) references.append(Data(reference));
+        return references;
+    });
 }
 
 }  // namespace keychain_items

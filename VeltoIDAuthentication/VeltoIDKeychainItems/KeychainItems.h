@@ -30,8 +30,6 @@ platform::WorkQueue keychainQueue();
 /// For the rooms' own sources: their callers use the operations of the other headers.
 namespace keychain_items {
 
-inline Data dataOf(const platform::PersistentReference& reference) { return Data(reference); }
-
 /// The item of that class and reference.
 platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass, const Data& reference);
 
@@ -47,7 +45,7 @@ inline bool mayPass(platform::KeychainStatus status) {
 Data copyReference(const platform::KeychainAttributes& attributes,
                    platform::KeychainStatus* status = nullptr);
 
-/// The references of all items that match; none when there are none.
+/// The references of all items that match; none when there are none. Runs on the keychain queue.
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes);
 
 /// The attributes of all items of the class, or of those with the label.
@@ -73,11 +71,14 @@ class MemoryTable {
         items_.emplace_back(uuidBytes(platform::randomUUID()), item);
         return items_.back().first;
     }
-    /// Null when there is none.
-    const Item* find(const Data& reference) const {
-        for (const auto& [known, item] : items_)
-            if (known == reference) return &item;
-        return nullptr;
+    /// True and the item, when there is one.
+    bool copy(const Data& reference, Item* out) const {
+        for (const auto& [known, item] : items_) {
+            if (known != reference) continue;
+            if (out != nullptr) *out = item;
+            return true;
+        }
+        return false;
     }
     bool remove(const Data& reference) {
         return std::erase_if(items_, [&](const auto& item) { return item.first == reference; }) > 0;

@@ -39,8 +39,7 @@ KeychainStatus updateItem(const Data& reference, const Key& key, const std::stri
                                        accessibilityOf(key), label, kKeychainAccessGroup});
 }
 
-/// Adds the item. If the keychain reports a duplicate that the search did not find, that one is removed and
-/// the addition tried once more.
+/// Adds the item; a duplicate that the search did not find makes room for it once.
 Data addItem(const Key& key, const std::string& label) {
     KeychainAttributes attributes = identityOf(key);
     attributes.label = label;
@@ -53,7 +52,7 @@ Data addItem(const Key& key, const std::string& label) {
     if (status == platform::kKeychainDuplicateItem &&
         platform::keychain::remove({identityOf(key), {}}) == platform::kKeychainSuccess)
         status = add();
-    return status == platform::kKeychainSuccess ? keychain_items::dataOf(added) : Data();
+    return status == platform::kKeychainSuccess ? Data(added) : Data();
 }
 
 /// The reference of the key's item; null when the keychain refuses.
@@ -111,11 +110,7 @@ bool copyPersistentRefForKey(const Key& key, Data* persistentReference) {
 bool copyKeyFromKeychainGivenPersistentRef(const Data& persistentReference, Key* key) {
     if (!persistentReference) return false;
     return keychainQueue().sync([&] {
-        if (!usesSystemKeychain()) {
-            const Key* found = memoryItems().find(persistentReference);
-            if (found != nullptr && key != nullptr) *key = *found;
-            return found != nullptr;
-        }
+        if (!usesSystemKeychain()) return memoryItems().copy(persistentReference, key);
         platform::SecretBytes data;
         const auto query = keychain_items::queryForReference(KeychainItemClass::Key, persistentReference);
         if (platform::keychain::copyMatchingData(query, &data) != platform::kKeychainSuccess) return false;
@@ -137,9 +132,9 @@ bool removeKeyFromKeychainGivenPersistentRef(const Data& persistentReference) {
 }
 
 std::optional<Array> copyAllKeysFromKeychain() {
-    return keychainQueue().sync([]() -> std::optional<Array> {
-        if (usesSystemKeychain())
-            return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Key));
+    if (usesSystemKeychain())
+        return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Key));
+    return keychainQueue().sync([] {
         Array references;
         for (const auto& [reference, key] : memoryItems().items()) references.append(reference);
         return references.empty() ? std::nullopt : std::optional(references);
@@ -147,11 +142,8 @@ std::optional<Array> copyAllKeysFromKeychain() {
 }
 
 std::optional<Array> copyKeysFromKeychainGivenOwner(const String& owner, const String& kind) {
-    return keychainQueue().sync([&]() -> std::optional<Array> {
-        if (!usesSystemKeychain()) return std::nullopt;
-        return keychain_items::copyReferences(
-            keychain_items::itemsOf(KeychainItemClass::Key, labelOf(owner, kind)));
-    });
+    return keychain_items::copyReferences(
+        keychain_items::itemsOf(KeychainItemClass::Key, labelOf(owner, kind)));
 }
 
 }  // namespace veltoid

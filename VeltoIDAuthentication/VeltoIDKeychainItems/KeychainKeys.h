@@ -1,7 +1,6 @@
 // Keys in the keychain, as key items named by their persistent references.
 //
-// Every operation runs synchronously on KeychainDispatchQueue; outputs are set only on success and may be
-// null.
+// Every operation runs synchronously on KeychainDispatchQueue; outputs are set only on success, may be null.
 #pragma once
 
 #include "Platform/runtime/SecureMemory.h"

@@ -1,8 +1,5 @@
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
-#include <vector>
-
-#include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/keychain/Keychain.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
@@ -42,19 +39,16 @@ platform::SecretBytes secretBytes(const String& passwordHash) {
     return {bytes.begin(), bytes.end()};
 }
 
-/// Changes the item's password in place; an item that was bound to this device may move with its backup from
-/// then on.
+/// Changes the item's password in place; one bound to this device may move with its backup from then on.
 KeychainStatus updateItem(const Data& reference, const String& passwordHash) {
     VELTOID_LOG_FROM("addPasswordToKeychain", kError,
-                     "Password already in keychain; updating it to (new) value.  persistentRef="
-                         << describeValue(reference));
+                     "Password already in keychain; updating it to (new) value.  persistentRef=", reference);
     const KeychainStatus status = platform::keychain::update(
         queryForReference(reference), {secretBytes(passwordHash), Accessibility::AfterFirstUnlock, {}, {}});
     if (status == platform::kKeychainSuccess || keychain_items::mayPass(status)) return status;
-    VELTOID_LOG_FROM("addPasswordToKeychain", kNotice,
-                     "SetItemUpdate(" << keychain_items::describeItemQuery("genp", reference)
-                                      << ", attrs=(supressed) err=" << status
-                                      << " so deleting and re-adding item.");
+    VELTOID_LOG_FROM("addPasswordToKeychain", kNotice, "SetItemUpdate(",
+                     keychain_items::describeItemQuery("genp", reference), ", attrs=(supressed) err=", status,
+                     " so deleting and re-adding item.");
     return status;
 }
 
@@ -68,17 +62,15 @@ KeychainStatus addItem(const KeychainAttributes& attributes, const String& passw
     if (status == platform::kKeychainDuplicateItem &&
         platform::keychain::remove({attributes, {}}) == platform::kKeychainSuccess)
         status = platform::keychain::add(attributes, accessibility, data, &added);
-    if (status == platform::kKeychainSuccess) *reference = keychain_items::dataOf(added);
+    if (status == platform::kKeychainSuccess) *reference = Data(added);
     return status;
 }
 
 /// The reference of the account's item; null when the keychain refuses.
 Data addOrUpdate(const String& accountName, const String& passwordHash, const String& label) {
-    std::vector<PersistentReference> found;
-    KeychainStatus status = platform::keychain::copyMatchingReferences(queryForAccount(accountName), &found);
-    Data reference;
-    if (status == platform::kKeychainSuccess && !found.empty()) {
-        reference = keychain_items::dataOf(found.front());
+    KeychainStatus status = platform::kKeychainSuccess;
+    Data reference = keychain_items::copyReference(queryForAccount(accountName).attributes, &status);
+    if (reference) {
         status = updateItem(reference, passwordHash);
         if (status != platform::kKeychainSuccess && !keychain_items::mayPass(status)) {
             platform::keychain::remove(queryForAccount(accountName));
@@ -88,8 +80,8 @@ Data addOrUpdate(const String& accountName, const String& passwordHash, const St
     if (status == platform::kKeychainItemNotFound)
         status = addItem(creationAttributes(accountName, label), passwordHash, &reference);
     if (status == platform::kKeychainSuccess) return reference;
-    VELTOID_LOG_FROM("addPasswordToKeychain", kError,
-                     "Failed to add password to keychain,err=" << status << " ref=" << describeValue({}));
+    VELTOID_LOG_FROM("addPasswordToKeychain", kError, "Failed to add password to keychain,err=", status,
+                     " ref=", Value());
     return {};
 }
 
@@ -107,18 +99,14 @@ bool addPasswordToKeychain(const String& accountName, const String& passwordHash
 bool copyPasswordFromKeychainGivenPersistentRef(const Data& persistentReference, String* passwordHash) {
     if (!persistentReference) return false;
     return keychainQueue().sync([&] {
-        if (!usesSystemKeychain()) {
-            const String* found = memoryItems().find(persistentReference);
-            if (found != nullptr && passwordHash != nullptr) *passwordHash = *found;
-            return found != nullptr;
-        }
+        if (!usesSystemKeychain()) return memoryItems().copy(persistentReference, passwordHash);
         platform::SecretBytes data;
         const KeychainStatus status =
             platform::keychain::copyMatchingData(queryForReference(persistentReference), &data);
         if (status != platform::kKeychainSuccess) {
             VELTOID_LOG_FROM("copyPasswordFromKeychainGivenPersistentRef", kError,
-                             "Failed to get password from keychain given persistentRef, err="
-                                 << status << " ref=" << describeValue(persistentReference));
+                             "Failed to get password from keychain given persistentRef, err=", status,
+                             " ref=", persistentReference);
             return false;
         }
         if (passwordHash != nullptr) *passwordHash = String(platform::textOf(data));
@@ -132,9 +120,8 @@ bool removePasswordFromKeychainGivenPersistentRef(const Data& persistentReferenc
         if (!usesSystemKeychain()) return memoryItems().remove(persistentReference);
         const KeychainStatus status = platform::keychain::remove(queryForReference(persistentReference));
         if (status == platform::kKeychainSuccess) return true;
-        VELTOID_LOG_FROM("removePasswordFromKeychainGivenPersistentRef", kError,
-                         "Error " << status << " ? deleting item from keychain with persistentRef="
-                                  << describeValue(persistentReference));
+        VELTOID_LOG_FROM("removePasswordFromKeychainGivenPersistentRef", kError, "Error ", status,
+                         " ? deleting item from keychain with persistentRef=", persistentReference);
         return false;
     });
 }

@@ -5,7 +5,6 @@
 #include <cstdio>
 #include <cstdlib>
 
-#include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
@@ -29,12 +28,6 @@ String frameworkVersionText() {
     return buffer;
 }
 
-bool metaSwitchIsOn(const String& accountName, const Dictionary& options, std::string_view key) {
-    return __VeltoIDDBCopyMetaInfoValue(accountName, options, key, Value::Kind::Boolean)
-        .asBoolean()
-        .value_or(false);
-}
-
 /// The server writes the text "NULL" where a value is to be removed.
 Value commandValue(const Value& value) {
     return value.asText() == std::string_view("NULL") ? Value::null() : value;
@@ -51,10 +44,8 @@ void applyRelaunch(const Dictionary& reply) {
     const int32_t interval = getInt32(&reply, wire::kNextLaunchInterval, 0);
     if (interval < 1) return;
     const double date = platform::now() + interval;
-    VELTOID_LOG_FROM("xmlInvoke", kNotice,
-                     "Received 'NextLaunchTimeInterval' == " << interval
-                                                             << " from server, so setting NextLaunchDate to "
-                                                             << describeValue(Value::date(date)));
+    VELTOID_LOG_FROM("xmlInvoke", kNotice, "Received 'NextLaunchTimeInterval' == ", interval,
+                     " from server, so setting NextLaunchDate to ", Value::date(date));
     requestRelaunch(date);
 }
 
@@ -98,11 +89,14 @@ Dictionary createCallParameters(const String& accountName, const String& session
     const platform::SystemVersion& system = platform::systemVersion();
     if (system.productName) parameters.set(wire::kProductName, *system.productName);
     if (system.buildVersion) parameters.set(wire::kSystemVersion, *system.buildVersion);
-    if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerMetaInformationItemsKey)) {
-        if (auto information = __VeltoIDDBCopyMetaInformation(accountName, options))
+    const auto isOn = [&](std::string_view key) {
+        return __VeltoIDDBCopyMetaInfoValue(accountName, options, key, Value::Kind::Boolean).asBoolean() ==
+               true;
+    };
+    if (isOn(kVeltoIDMetaSendServerMetaInformationItemsKey))
+        if (const auto information = __VeltoIDDBCopyMetaInformation(accountName, options))
             parameters.set(wire::kMetaInformation, *information);
-    }
-    if (metaSwitchIsOn(accountName, options, kVeltoIDMetaSendServerAccountInformationItemsKey)) {
+    if (isOn(kVeltoIDMetaSendServerAccountInformationItemsKey)) {
         AccountRecord record;
         if (__VeltoIDDBCopyVeltoIDAccount(accountName, &record))
             parameters.set(wire::kAccountInformation, record.values());

@@ -1,7 +1,5 @@
 #include "VeltoIDXMLServerCommunications/Methods.h"
 
-#include <span>
-
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
@@ -9,6 +7,7 @@
 #include "Values/DateText.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/EntryTable.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -53,40 +52,31 @@ void count(VeltoIDAuthenticationSessionInfo& session, const Method& method, cons
         __VeltoIDDBIncrementMetaInfoCounter(session.fAccountName, options, method.counter, 1);
 }
 
-/// A failed call: hands out the translated error; the session is not used for anything else.
-void fail(VeltoIDAuthenticationSessionInfo& session, const Call& call, ErrorOut error) {
+/// A failed call: hands out the translated error; the session is not used for anything else. False.
+bool fail(VeltoIDAuthenticationSessionInfo& session, const Call& call, ErrorOut error) {
     fillError(error, copyAndHandleXMLErrorResponse(session.fAccountName, session.fPasswordHash, call.reply,
                                                    call.error));
     session.spoil();
+    return false;
 }
 
-/// The reply, or none and the translated error.
-std::optional<Dictionary> call(VeltoIDAuthenticationSessionInfo& session, const Method& method,
-                               const Dictionary& own, const Dictionary& options, ErrorOut error) {
-    Call made = invoke(session, method, own, options);
-    if (!made.isAnswered()) {
-        fail(session, made, error);
-        return std::nullopt;
-    }
-    count(session, method, options);
-    return std::move(made.reply);
-}
-
-/// The same on the session's queue; `take` gets the reply.
+/// One call; `take` gets the reply.
 template <typename Take>
-bool callOnQueue(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
-                 const Dictionary& options, ErrorOut error, Take take) {
-    return session.fDispatchQueue.sync([&] {
-        const auto reply = call(session, method, own, options, error);
-        if (reply) take(*reply);
-        return reply.has_value();
-    });
+bool call(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
+          const Dictionary& options, ErrorOut error, Take take) {
+    const Call made = invoke(session, method, own, options);
+    if (!made.isAnswered()) return fail(session, made, error);
+    count(session, method, options);
+    take(*made.reply);
+    return true;
 }
 
-/// Where nothing of the reply is wanted.
-bool callOnQueue(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
-                 const Dictionary& options, ErrorOut error) {
-    return callOnQueue(session, method, own, options, error, [](const Dictionary&) {});
+/// The same on the session's queue.
+template <typename Take = void (*)(const Dictionary&)>
+bool callOnQueue(
+    VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
+    const Dictionary& options, ErrorOut error, Take take = [](const Dictionary&) {}) {
+    return session.fDispatchQueue.sync([&] { return call(session, method, own, options, error, take); });
 }
 
 void takeValidationRecord(const Dictionary& reply, Dictionary& result) {
@@ -99,13 +89,7 @@ void takeValidationRecord(const Dictionary& reply, Dictionary& result) {
         result.set(kVeltoIDAccountValidationRecordNextCheckDateKey, Value::date(*nextCheck));
 }
 
-struct ReplyEntry {
-    std::string_view replyKey;
-    Value::Kind kind;
-    std::string_view resultKey;
-};
-
-constexpr ReplyEntry kGetMyInfoEntries[] = {
+constexpr TakenEntry kGetMyInfoEntries[] = {
     {wire::kEncDsId, Value::Kind::String, kVeltoIDAccountDSIDKey},
     {wire::kLastName, Value::Kind::String, kVeltoIDAccountLastNameKey},
     {wire::kFirstName, Value::Kind::String, kVeltoIDAccountFirstNameKey},
@@ -118,19 +102,13 @@ constexpr ReplyEntry kGetMyInfoEntries[] = {
     {wire::kValidForInterval, Value::Kind::Number, kVeltoIDAccountValidForIntervalKey},
 };
 
-constexpr ReplyEntry kCertificateEntries[] = {
+constexpr TakenEntry kCertificateEntries[] = {
     {wire::kCertificate, Value::Kind::String, kVeltoIDCertificateCertificateKey},
     {wire::kCertificateType, Value::Kind::String, kVeltoIDCertificateTypeKey},
     {wire::kSerialNumber, Value::Kind::String, kVeltoIDCertificateSerialNumberKey},
     {wire::kCertificateStatus, Value::Kind::String, kVeltoIDCertificateStatusKey},
     {wire::kIntermediateCertificate, Value::Kind::String, kVeltoIDCertificateIntermediateCertificateKey},
 };
-
-void takeEntries(const Dictionary& reply, std::span<const ReplyEntry> entries, Dictionary& result) {
-    for (const ReplyEntry& entry : entries)
-        if (const Value& value = reply[entry.replyKey]; value.kind() == entry.kind)
-            result.set(entry.resultKey, value);
-}
 
 Dictionary getMyInfoResult(const Dictionary& reply) {
     Dictionary result;
@@ -139,18 +117,18 @@ Dictionary getMyInfoResult(const Dictionary& reply) {
     return result;
 }
 
-std::optional<Dictionary> copyCertificateResultFromDsCert(const Dictionary* dsCert) {
-    if (dsCert == nullptr) return std::nullopt;
+Value delayOf(const Dictionary& reply) {
+    const Value& delay = reply[wire::kDelay];
+    return delay.isNumber() ? delay : Value();
+}
+
+CertificateAnswer certificateAnswer(const Dictionary& reply, const Dictionary* dsCert) {
+    if (dsCert == nullptr) return {std::nullopt, delayOf(reply)};
     Dictionary result;
     takeEntries(*dsCert, kCertificateEntries, result);
     if (const auto expires = dateFromValue((*dsCert)[wire::kCertificateExpiration]))
         result.set(kVeltoIDCertificateExpirationDateKey, Value::date(*expires));
-    return result.empty() ? std::nullopt : std::optional(result);
-}
-
-Value delayOf(const Dictionary& reply) {
-    const Value& delay = reply[wire::kDelay];
-    return delay.isNumber() ? delay : Value();
+    return {result.empty() ? std::nullopt : std::optional(result), delayOf(reply)};
 }
 
 /// Some servers answer with a list of certificates, the wanted one first.
@@ -178,30 +156,24 @@ Dictionary breadcrumbParameters(const String& accountName, const String& key) {
             {wire::kBreadcrumbKey, key}};
 }
 
-String serialNumberOf(const String& encDsId) {
-    CertificateEntry entry;
-    __VeltoIDDBCopyCertificateInfo(encDsId, &entry);
-    return entry.serialNumber();
-}
-
 }  // namespace
 
 bool _VeltoIDSessionDoGetMyInfo(VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
                                 const Dictionary& parameters, const Dictionary& options, Dictionary* result,
                                 ErrorOut error) {
     return session.fDispatchQueue.sync([&] {
-        const String certificateSerial = serialNumberOf(encDsId);
+        const String stored = certificateEntryOf(encDsId).serialNumber();
         const Dictionary own = {
             {wire::kEncDsId, encDsId ? encDsId : session.fEncDsId},
             {wire::kKnownSerialNumber,
-             certificateSerial ? certificateSerial : parameters.string(kVeltoIDCertificateSerialNumberKey)},
+             stored ? stored : parameters.string(kVeltoIDCertificateSerialNumberKey)},
             {wire::kKnownRecordIdentifier, parameters.string(kVeltoIDAccountValidationRecordIdentifierKey)},
         };
-        const auto reply = call(session, {"getMyInfo", kVeltoIDXMLGetMyInfoCountKey}, own, options, error);
-        if (!reply) return false;
-        if (!session.fEncDsId) session.fEncDsId = reply->string(wire::kEncDsId);
-        fill(result, getMyInfoResult(*reply));
-        return true;
+        return call(session, {"getMyInfo", kVeltoIDXMLGetMyInfoCountKey}, own, options, error,
+                    [&](const Dictionary& reply) {
+                        if (!session.fEncDsId) session.fEncDsId = reply.string(wire::kEncDsId);
+                        fill(result, getMyInfoResult(reply));
+                    });
     });
 }
 
@@ -228,12 +200,11 @@ bool __VeltoIDSessionDoSendCSR(VeltoIDAuthenticationSessionInfo& session, const 
              Value::real(metaInterval(session.fAccountName, options, kVeltoIDMetaCertificateLifetimeKey,
                                       kVeltoIDRequestedCertificateLifetime))},
         };
-        const auto reply = call(session, {"createCert", kVeltoIDXMLSendCSRCountKey}, own, options, error);
-        if (!reply) return false;
-        fill(token, reply->string(wire::kCertificateToken));
-        fill(answer,
-             {copyCertificateResultFromDsCert(reply->dictionary(wire::kCertificateEntry)), delayOf(*reply)});
-        return true;
+        return call(session, {"createCert", kVeltoIDXMLSendCSRCountKey}, own, options, error,
+                    [&](const Dictionary& reply) {
+                        fill(token, reply.string(wire::kCertificateToken));
+                        fill(answer, certificateAnswer(reply, reply.dictionary(wire::kCertificateEntry)));
+                    });
     });
 }
 
@@ -245,12 +216,11 @@ bool __VeltoIDSessionDoFetchCSRResult(VeltoIDAuthenticationSessionInfo& session,
         const Call made =
             invoke(session, kMethod, {{wire::kCertificateToken, token}, {wire::kEncDsId, encDsId}}, options);
         if (made.isAnswered()) {
-            fill(answer, {copyCertificateResultFromDsCert(dsCertOf(*made.reply)), delayOf(*made.reply)});
+            fill(answer, certificateAnswer(*made.reply, dsCertOf(*made.reply)));
         } else if (isPending(made)) {
             fill(answer, pendingAnswer(made, token));
         } else {
-            fail(session, made, error);
-            return false;
+            return fail(session, made, error);
         }
         count(session, kMethod, options);
         return true;

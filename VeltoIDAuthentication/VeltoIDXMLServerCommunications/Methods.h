@@ -1,8 +1,7 @@
 // The remote methods that the account engine calls on an open session. Each runs synchronously on the
 // session's queue and blocks for at most 5 seconds. Outputs may be null; they are handed over only on
 // success, the error only on failure. A missing or ill-typed entry of a reply leaves its output null or
-// empty; the call still succeeds. A failed call leaves the session usable for the same operation but never
-// cached.
+// empty; the call still succeeds. After a failed call the session serves the same operation but no cache.
 #pragma once
 
 #include <optional>
@@ -21,8 +20,8 @@ inline constexpr int64_t kVeltoIDPendingCertificateDelay = 300;
 
 /// What the server says of a certificate or of the request for one: a Dictionary of "Certificate" and
 /// "IntermediateCertificate" (PEM), "CertType", "SerialNumber", "CertStatus" (Strings) and "Expires" (Date),
-/// each as far as given; none when nothing is. `delay`: the Number of seconds after which to ask again, or
-/// absent.
+/// each as far as given; none when nothing is. `delay`: the Number of seconds until it is asked again, if
+/// any.
 struct CertificateAnswer {
     std::optional<Dictionary> result;
     Value delay;

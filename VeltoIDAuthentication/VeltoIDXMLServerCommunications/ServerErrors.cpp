@@ -1,6 +1,7 @@
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 
-#include "VeltoIDXMLServerCommunications/PasswordRefusal.h"
+#include "Logging/Log.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 namespace {
@@ -8,6 +9,22 @@ namespace {
 constexpr int64_t kFaultInvalidAccount = -20101;
 constexpr int64_t kFaultInvalidPassword = -20283;
 constexpr int64_t kFaultAccountDisabled = -20209;
+
+bool isIdentityError(const std::optional<Error>& error, int64_t code) {
+    return error && error->domain.view() == kIdentityErrorDomain && error->code == code;
+}
+
+bool refusesClient(const std::optional<Error>& error) {
+    return isIdentityError(error, identity_error::kServerNoLongerSupported);
+}
+
+/// The verdict on a failed call that was made with this password hash: the account's password is removed,
+/// which disables the account until a client adds it again, when the server refuses it, has disabled the
+/// account, or no longer supports this client (-105). Nothing for any other error.
+void judgeRefusal(const String& accountName, const String& /*sentPasswordHash*/,
+                  const std::optional<Error>& error) {
+    if (refusesPassword(error) || refusesClient(error)) __VeltoIDDBRemovePassword(accountName);
+}
 
 }  // namespace
 
@@ -36,6 +53,25 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
     Error translated = makeError(code, texts, userInfo, __func__, __FILE_NAME__, __LINE__);
     judgeRefusal(accountName, passwordHash, translated);
     return translated;
+}
+
+bool refusesPassword(const std::optional<Error>& error) {
+    return isIdentityError(error, identity_error::kInvalidAccountOrPassword) ||
+           isIdentityError(error, identity_error::kAccountLogonDisabled);
+}
+
+void handleServerError(const String& accountName, const String& sentPasswordHash,
+                       const std::optional<Error>& error) {
+    if (refusesClient(error))
+        VELTOID_LOG(kWarning,
+                    "VeltoIDAuth: The server has reported that it no longer supports this client, so "
+                    "removing the password from the system and disabling the account ",
+                    accountName);
+    if (refusesPassword(error))
+        VELTOID_LOG(kNotice, "VeltoIDAuth: The password for account ", accountName,
+                    " is incorrect or the account has been disabled, so removing this password from the "
+                    "system and disabling the account.");
+    judgeRefusal(accountName, sentPasswordHash, error);
 }
 
 }  // namespace veltoid

@@ -23,11 +23,6 @@ struct Sessions {
 
 Sessions& state() { return platform::Lifetime::current().state<Sessions>(); }
 
-platform::WorkQueue globalQueue() { return state().globalQueue; }
-
-/// On the global queue only.
-std::vector<IdleSession>& cachedSessions() { return state().cached; }
-
 /// Has the session destroyed on its own queue.
 void destroy(IdleSession session) {
     const platform::WorkQueue queue = session->fDispatchQueue;
@@ -36,8 +31,8 @@ void destroy(IdleSession session) {
 
 /// Keeps the session; those whose time has passed go.
 void cache(IdleSession session) {
-    globalQueue().sync([&] {
-        auto& sessions = cachedSessions();
+    state().globalQueue.sync([&] {
+        auto& sessions = state().cached;
         const double now = platform::now();
         const auto expired =
             std::stable_partition(sessions.begin(), sessions.end(),
@@ -62,8 +57,8 @@ platform::WorkQueue copySessionQueueForAccount(const String& accountName) {
 IdleSession takeCachedSession(const String& accountName, const String& passwordHash,
                               const String& serverURL) {
     if (!accountName || !passwordHash || !serverURL) return nullptr;
-    return globalQueue().sync([&]() -> IdleSession {
-        auto& sessions = cachedSessions();
+    return state().globalQueue.sync([&]() -> IdleSession {
+        auto& sessions = state().cached;
         const double now = platform::now();
         const auto match = std::find_if(sessions.begin(), sessions.end(), [&](const IdleSession& session) {
             return session->fAccountName == accountName && session->fPasswordHash == passwordHash &&
@@ -78,14 +73,7 @@ IdleSession takeCachedSession(const String& accountName, const String& passwordH
 
 void __VeltoIDSessionRelease(VeltoIDAuthenticationSessionInfo* session) {
     const platform::WorkQueue queue = session->fDispatchQueue;
-    queue.sync([&] {
-        IdleSession idle(session);
-        if (idle->isReusableAt(platform::now())) {
-            cache(std::move(idle));
-        } else {
-            destroy(std::move(idle));
-        }
-    });
+    queue.sync([&] { (session->isReusableAt(platform::now()) ? cache : destroy)(IdleSession(session)); });
 }
 
 }  // namespace veltoid

@@ -41,7 +41,19 @@ class SignIn {
     SignIn(const String& accountName, const String& passwordHash, const Dictionary& options)
         : accountName_(accountName), passwordHash_(passwordHash), options_(options) {}
 
-    void run() {
+    Session run(String* encDsId, std::optional<Dictionary>* result, ErrorOut error) {
+        perform();
+        if (session_) {
+            fill(encDsId, encDsId_);
+            fill(result, result_);
+        } else {
+            fillError(error, held_);
+        }
+        return Session(session_.release());
+    }
+
+  private:
+    void perform() {
         hasRecord_ = __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
         const String url = serverURL();
         if (!getBool(&options_, option::kDoNotUseCachedSession, false))
@@ -56,12 +68,6 @@ class SignIn {
         keepBooks();
     }
 
-    Session takeSession() { return Session(session_.release()); }
-    const String& encDsId() const { return encDsId_; }
-    const std::optional<Dictionary>& result() const { return result_; }
-    const std::optional<Error>& error() const { return held_; }
-
-  private:
     void count(std::string_view counter) {
         __VeltoIDDBIncrementMetaInfoCounter(accountName_, options_, counter, 1);
     }
@@ -82,11 +88,10 @@ class SignIn {
     bool mayConnect() {
         if (!hasRecord_) return true;
         if (record_.isClientTooOld()) {
-            VELTOID_LOG_FROM(
-                kOperation, kNotice,
-                "Not connecting to VeltoID authentication server because clientTooOld = true is set "
-                "for this account "
-                    << accountName_.view() << ".");
+            VELTOID_LOG_FROM(kOperation, kNotice,
+                             "Not connecting to VeltoID authentication server because clientTooOld = true is "
+                             "set for this account ",
+                             accountName_, ".");
             held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
             return false;
         }
@@ -94,9 +99,8 @@ class SignIn {
         if (earliest && *earliest > now_) {
             VELTOID_LOG_FROM(kOperation, kNotice,
                              "Not connecting to VeltoID authentication server because there is an "
-                             "earliest-allowed-connection-date set for this account "
-                                 << accountName_.view() << ", " << describeValue(Value::date(*earliest))
-                                 << " which is before now.");
+                             "earliest-allowed-connection-date set for this account ",
+                             accountName_, ", ", Value::date(*earliest), " which is before now.");
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
             return false;
         }
@@ -113,9 +117,8 @@ class SignIn {
                                                   signInError(identity_error::kUnknown, __LINE__));
         }
         if (session_) return;
-        VELTOID_LOG_FROM(kOperation, kNotice,
-                         "Didn't succeed with .authenticate, and error is "
-                             << describeValue(held_ ? Value(*held_) : Value()) << " so releasing session.");
+        VELTOID_LOG_FROM(kOperation, kNotice, "Didn't succeed with .authenticate, and error is ",
+                         held_ ? Value(*held_) : Value(), " so releasing session.");
     }
 
     Dictionary authenticateParameters() {
@@ -133,9 +136,7 @@ class SignIn {
         oldEncDsId_ = record_.encDsId();
         oldRecordIdentifier_ = record_.validationRecordIdentifier();
         parameters.set(wire::kKnownRecordIdentifier, oldRecordIdentifier_);
-        CertificateEntry entry;
-        __VeltoIDDBCopyCertificateInfo(oldEncDsId_, &entry);
-        parameters.set(wire::kKnownSerialNumber, entry.serialNumber());
+        parameters.set(wire::kKnownSerialNumber, certificateEntryOf(oldEncDsId_).serialNumber());
         const String uuid = record_.uuid();
         parameters.set(wire::kAccountUUID, uuid);
         parameters.set(wire::kMachineUUID, uuid);
@@ -189,10 +190,9 @@ class SignIn {
     }
 
     void disableCertificatesOfChangedAccount() {
-        VELTOID_LOG_FROM(kOperation, kError,
-                         "Got back a different encDSID for our account, "
-                             << describeValue(encDsId_) << " vs " << describeValue(oldEncDsId_)
-                             << " so disabling the certs and VeltoIDValidationRecord on this account.");
+        VELTOID_LOG_FROM(kOperation, kError, "Got back a different encDSID for our account, ",
+                         describeValue(encDsId_), " vs ", describeValue(oldEncDsId_),
+                         " so disabling the certs and VeltoIDValidationRecord on this account.");
         for (const String& encDsId : {oldEncDsId_, encDsId_})
             __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey,
                                            kVeltoIDCertificateStatusInvalid);
@@ -250,20 +250,11 @@ class SignIn {
 Session __VeltoIDSessionDoCreateSession(const String& accountName, const String& passwordHash,
                                         const Dictionary& options, String* encDsId,
                                         std::optional<Dictionary>* result, ErrorOut error) {
-    if (encDsId != nullptr) *encDsId = nullptr;
-    if (result != nullptr) result->reset();
+    fill(encDsId, {});
+    fill(result, {});
     if (!accountName || !passwordHash) return nullptr;
     return copySessionQueueForAccount(accountName).sync([&] {
-        SignIn signIn(accountName, passwordHash, options);
-        signIn.run();
-        Session session = signIn.takeSession();
-        if (!session) {
-            fillError(error, signIn.error());
-        } else {
-            if (encDsId != nullptr) *encDsId = signIn.encDsId();
-            if (result != nullptr) *result = signIn.result();
-        }
-        return session;
+        return SignIn(accountName, passwordHash, options).run(encDsId, result, error);
     });
 }
 

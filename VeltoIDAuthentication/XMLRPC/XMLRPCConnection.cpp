@@ -62,12 +62,6 @@ class SynchronousExchange : public platform::HTTPSessionEvents {
     std::optional<Error> error_;
 };
 
-void logLine(platform::LogPriority priority, const std::string& text, int line, std::string_view function) {
-    const std::string* queue = platform::WorkQueue::currentLabel();
-    platform::SystemLog::shared().write(priority, text,
-                                        {__FILE_NAME__, line, function, queue ? *queue : std::string_view()});
-}
-
 }  // namespace
 
 std::optional<XMLRPCResponse> XMLRPCConnection::sendSynchronousXMLRPCRequest(const XMLRPCRequest& request,
@@ -99,12 +93,10 @@ std::shared_ptr<XMLRPCConnection> XMLRPCConnection::initWithXMLRPCRequest(
     connection->session_ = platform::HTTPSession::create(events, platform::WorkQueue::main());
     const std::string name = connection->identifier_.text();
     if (!connection->session_) {
-        logLine(platform::LogPriority::Error, "The session, " + name + ", could not be established!",
-                __LINE__, __func__);
+        VELTOID_PLATFORM_LOG(Error, "The session, " + name + ", could not be established!");
         return nullptr;
     }
-    logLine(platform::LogPriority::Notice, "The session, " + name + ", has been established!", __LINE__,
-            __func__);
+    VELTOID_PLATFORM_LOG(Notice, "The session, " + name + ", has been established!");
     return connection;
 }
 
@@ -150,10 +142,9 @@ void XMLRPCConnection::completed(const std::optional<platform::HTTPError>& error
 }
 
 void XMLRPCConnection::sessionBecameInvalid(const Error& error) {
-    logLine(platform::LogPriority::Error,
-            "The connection, " + identifier_.text() +
-                ", failed with the following error: " + error.userInfo.string(kErrorDescriptionKey).text(),
-            __LINE__, __func__);
+    VELTOID_PLATFORM_LOG(Error, "The connection, " + identifier_.text() +
+                                    ", failed with the following error: " +
+                                    error.userInfo.string(kErrorDescriptionKey).text());
     delegate_->didFailWithError(*request_, error);
     whenEnded_(identifier_);
 }

@@ -108,16 +108,12 @@ class ElementWriter {
     void date(double seconds) {
         const platform::CalendarDate date = platform::calendarDate(seconds);
         out_ += "<value><dateTime.iso8601>";
-        padded(date.year, 4);
-        padded(date.month, 2);
-        padded(date.day, 2);
-        out_ += 'T';
-        padded(date.hour, 2);
-        out_ += ':';
-        padded(date.minute, 2);
-        out_ += ':';
-        padded(date.second, 2);
-        out_ += "Z</dateTime.iso8601></value>";
+        padded(date.year, 4, "");
+        padded(date.month, 2, "");
+        padded(date.day, 2, "T");
+        padded(date.hour, 2, ":");
+        padded(date.minute, 2, ":");
+        padded(date.second, 2, "Z</dateTime.iso8601></value>");
     }
 
     void data(platform::Bytes bytes) {
@@ -134,8 +130,8 @@ class ElementWriter {
         out_.append(std::begin(digits), end);
     }
 
-    /// At least `width` digits, filled up with zeros.
-    void padded(int64_t number, ptrdiff_t width) {
+    /// At least `width` digits, filled up with zeros, and what comes after them.
+    void padded(int64_t number, ptrdiff_t width, std::string_view after) {
         char digits[24];
         const char* const end = std::to_chars(std::begin(digits), std::end(digits), std::abs(number)).ptr;
         if (number < 0) {
@@ -144,7 +140,8 @@ class ElementWriter {
         }
         const ptrdiff_t size = end - std::begin(digits);
         out_.append(static_cast<size_t>(std::max<ptrdiff_t>(width - size, 0)), '0')
-            .append(digits, static_cast<size_t>(size));
+            .append(digits, static_cast<size_t>(size))
+            .append(after);
     }
 
     SecretText& out_;

@@ -34,11 +34,7 @@ void XMLRPCRequest::setEncoder(std::shared_ptr<XMLRPCDefaultEncoder> encoder) {
 }
 
 void XMLRPCRequest::setMethod(const String& method, const Value& parameter) {
-    if (parameter.isAbsent()) {
-        setMethod(method);
-    } else {
-        setMethod(method, Array{parameter});
-    }
+    myXMLEncoder->setMethod(method, parameter.isAbsent() ? std::nullopt : std::optional(Array{parameter}));
 }
 
 platform::HTTPRequest XMLRPCRequest::request() const {

@@ -62,8 +62,7 @@ bool isTooLarge(std::string_view number) {
     return exponent > -place;
 }
 
-/// Takes fixed-width fields off the front of a text; once something does not fit, everything after it fails
-/// too.
+/// Takes fixed-width fields off the front of a text; once something does not fit, all that follows fails.
 class FieldReader {
   public:
     explicit FieldReader(std::string_view text) : left_(text) {}

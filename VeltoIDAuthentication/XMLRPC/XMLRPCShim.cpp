@@ -4,8 +4,8 @@
 #include <limits>
 
 #include "Logging/Describe.h"
+#include "Logging/Failure.h"
 #include "Platform/runtime/SystemLog.h"
-#include "Platform/runtime/WorkQueue.h"
 #include "Values/DictionaryAccess.h"
 #include "XMLRPC/XMLRPCConnection.h"
 #include "XMLRPC/XMLRPCScalarTexts.h"
@@ -54,34 +54,27 @@ void logServerMessage(const Dictionary& answer) {
     const auto priority = static_cast<platform::LogPriority>(
         std::clamp(level, static_cast<int32_t>(platform::LogPriority::Emergency),
                    static_cast<int32_t>(platform::LogPriority::Debug)));
-    const std::string* queue = platform::WorkQueue::currentLabel();
-    platform::SystemLog::shared().write(
-        priority, "VeltoIDAuthentication: Message from server \"" + describeValue(message) + "\"",
-        {__FILE_NAME__, __LINE__, __func__, queue ? *queue : std::string_view()});
+    platform::logPlatform(priority,
+                          "VeltoIDAuthentication: Message from server \"" + describeValue(message) + "\"",
+                          __FILE__, __LINE__, __func__);
 }
 
 }  // namespace
 
 bool xmlInvoke(const String& url, const String& methodName, const Value& parameter,
                std::optional<Dictionary>* result, ErrorOut error) {
-    if (result != nullptr) result->reset();
+    fill(result, {});
     XMLRPCRequest request(url);
     request.setMethod(methodName, parameter);
     request.setUserAgent(kUserAgent);
 
     std::optional<Error> transportError;
     const auto response = XMLRPCConnection::sendSynchronousXMLRPCRequest(request, &transportError);
-    if (!response) {
-        fillError(error, noResponseError(std::move(transportError)));
-        return false;
-    }
-    if (response->isFault()) {
-        fillError(error, faultError(*response));
-        return false;
-    }
+    if (!response) return failWith(error, noResponseError(std::move(transportError)));
+    if (response->isFault()) return failWith(error, faultError(*response));
     if (const Dictionary* answer = response->object().asDictionary()) {
         logServerMessage(*answer);
-        if (result != nullptr) *result = *answer;
+        fill(result, {*answer});
     }
     return true;
 }
