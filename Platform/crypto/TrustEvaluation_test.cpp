@@ -58,14 +58,7 @@ TEST_F(TrustTest, FollowsThePathToAnAuthority) {
     Certificate broken = good;
     broken.der.back() ^= 1;
     using enum TrustResult;
-    struct Case {
-        const char* what;
-        std::string authorities;
-        Certificate certificate;
-        std::vector<Certificate> intermediates;
-        TrustResult result;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, std::string, Certificate, std::vector<Certificate>, TrustResult> cases[] = {
         {"a path", root, good, {above_}, Unspecified},
         {"among others", both, good, {wrong_, above_}, Unspecified},
         {"an intermediate authority", pemOf(intermediate_.certificate()), good, {}, Unspecified},
@@ -77,9 +70,9 @@ TEST_F(TrustTest, FollowsThePathToAnAuthority) {
         {"not yet", root, issue(early), {above_}, RecoverableFailure},
         {"over, and no path", root, issue(over), {}, FatalFailure},
     };
-    for (const Case& each : cases) {
-        setAuthorities(each.authorities);
-        EXPECT_EQ(evaluateTrust(each.certificate, each.intermediates), each.result) << each.what;
+    for (const auto& [what, authorities, certificate, intermediates, result] : cases) {
+        setAuthorities(authorities);
+        EXPECT_EQ(evaluateTrust(certificate, intermediates), result) << what;
     }
 }
 
