@@ -115,6 +115,7 @@ class ServerTest : public DatabaseTest {
   protected:
     static constexpr const char* kName = "jane@velto.example";
     static constexpr const char* kPassword = "hash of a password";
+    static constexpr const char* kURL = "https://server.example/rpc";
 
     static void createAccount(const String& encDsId = "d1") {
         ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, kPassword, encDsId));
@@ -141,6 +142,13 @@ class ServerTest : public DatabaseTest {
     static Value meta(const char* key, const String& section = nullptr) {
         return __VeltoIDDBCopyMetaInfoValue(section, {}, key);
     }
+    /// A session of the account, as a sign-in that many seconds ago has yielded it.
+    Session session(const String& encDsId = "d1", double age = 0, double validity = 100,
+                    const String& id = "s1") const {
+        return Session(new VeltoIDAuthenticationSessionInfo{kName, kPassword, kURL, id, now() - age, validity,
+                                                            encDsId, copySessionQueueForAccount(kName)});
+    }
+
     /// A counter of the account.
     static int64_t count(std::string_view key) {
         return __VeltoIDDBCopyMetaInfoValue(kName, {}, key).asInt64().value_or(0);
