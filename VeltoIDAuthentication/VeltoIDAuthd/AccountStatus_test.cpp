@@ -39,19 +39,17 @@ class AccountStatusTest : public CertificateTest {
 };
 
 TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
-    struct Case {
-        const char* state;
-        std::function<void()> comeAbout;
-        bool asksTheServer;
-        bool requiresAction;
-        /// When something happens next, from now; none: nothing will.
-        std::optional<double> next;
-    };
     const auto after = [this](double seconds) { clock_.advanceBy(seconds); };
     const auto setEntry = [](const char* key, const Value& value) {
         __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
     };
-    const Case cases[] = {
+    const struct {
+        const char* state;
+        std::function<void()> comeAbout;
+        bool asksTheServer, requiresAction;
+        /// When something happens next, from now; none: nothing will.
+        std::optional<double> next;
+    } cases[] = {
         {"NoEncodedDSID",
          [&] {
              server_.refuse("authenticate", 503);
@@ -125,16 +123,16 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
          },
          false, false, 70},
     };
-    for (const Case& each : cases) {
+    for (const auto& [state, comeAbout, asksTheServer, requiresAction, next] : cases) {
         server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(100)}});
         issueAtOnce();
         trust(root_);
-        each.comeAbout();
-        const Dictionary status = statusOf({{"CheckNetwork", flag(each.asksTheServer)}});
-        EXPECT_EQ(status["AccountState"], Value(each.state));
-        EXPECT_EQ(status["AccountRequiresUserAction"], flag(each.requiresAction)) << each.state;
-        EXPECT_EQ(status["NextActionTime"], each.next ? date(*each.next) : Value()) << each.state;
-        EXPECT_EQ(status.contains("NextFetchAttempt"), std::string_view(each.state) == "CertificatePending");
+        comeAbout();
+        const Dictionary status = statusOf({{"CheckNetwork", flag(asksTheServer)}});
+        EXPECT_EQ(status["AccountState"], Value(state));
+        EXPECT_EQ(status["AccountRequiresUserAction"], flag(requiresAction)) << state;
+        EXPECT_EQ(status["NextActionTime"], next ? date(*next) : Value()) << state;
+        EXPECT_EQ(status.contains("NextFetchAttempt"), std::string_view(state) == "CertificatePending");
         __VeltoIDForgetVeltoID(kName, {});
         clock_.advanceBy(2 * kDay);
     }

@@ -86,38 +86,29 @@ const Dictionary kSuccess = {{"success", kOn}};
 const Dictionary kFailure = {{"success", kOff}};
 
 TEST_F(ServiceTest, OnlyKnownCommandsSucceed) {
-    struct Case {
-        Value command;
-        bool succeeds;
-    };
-    const Case cases[] = {{number(1), true},   {Value::uint64(1), true}, {number(2), false},
-                          {number(-1), false}, {number(0x9998), false},  {"1", false},
-                          {{}, false},         {Value::real(1.5), false}};
-    for (const Case& each : cases) {
-        EXPECT_EQ(send(each.command), each.succeeds ? kSuccess : kFailure)
-            << testing::PrintToString(each.command);
+    const std::pair<Value, bool> cases[] = {{number(1), true},   {Value::uint64(1), true}, {number(2), false},
+                                            {number(-1), false}, {number(0x9998), false},  {"1", false},
+                                            {{}, false},         {Value::real(1.5), false}};
+    for (const auto& [command, succeeds] : cases) {
+        EXPECT_EQ(send(command), succeeds ? kSuccess : kFailure) << testing::PrintToString(command);
     }
 }
 
 TEST_F(ServiceTest, SetsDatabaseValues) {
     createAccount("d1");
     __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
-    struct Case {
-        const char* what;
-        Value domain;
-        Value item;
-        Value key;
-        /// By the command that fails when nothing can be set, and by the one that does not.
-        bool succeeds;
-        bool succeedsIfPossible;
-        std::function<Value()> stored;
-        int signals;
-    };
     const auto inRecord = [] { return record()["k"]; };
     const auto inEntry = [] { return certificateEntry()["k"]; };
     const auto inMeta = [] { return meta("k"); };
     const auto inSection = [] { return meta("k", "item"); };
-    const Case cases[] = {
+    const struct {
+        const char* what;
+        Value domain, item, key;
+        /// By the command that fails when nothing can be set, and by the one that does not.
+        bool wantedSucceeds, succeedsIfPossible;
+        std::function<Value()> stored;
+        int signals;
+    } cases[] = {
         {"an account", "Accounts", kName, "k", true, true, inRecord, 1},
         {"no such account", "Accounts", "x", "k", false, false, inRecord, 0},
         {"a certificate", "Certificates", "d1", "k", true, true, inEntry, 1},
@@ -130,18 +121,19 @@ TEST_F(ServiceTest, SetsDatabaseValues) {
         {"an unknown domain", "Other", kName, "k", false, true, inRecord, 0},
         {"a key of the wrong kind", "MetaInfo", {}, number(1), false, true, inMeta, 0},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, domain, item, key, wantedSucceeds, succeedsIfPossible, stored, signals] : cases) {
+        SCOPED_TRACE(what);
         for (const int64_t command : {command::kSetValue, command::kSetValueQuietly}) {
             (void)takeSignals();
-            Dictionary request = {{"domain", each.domain}, {"item", each.item}, {"key", each.key}};
+            Dictionary request = {{"domain", domain}, {"item", item}, {"key", key}};
             const Dictionary removal = request;
             request.set("value", "v");
-            const bool succeeds = command == command::kSetValue ? each.succeeds : each.succeedsIfPossible;
-            EXPECT_EQ(send(command, request), succeeds ? kSuccess : kFailure) << each.what << command;
-            EXPECT_EQ(each.stored(), each.succeeds ? Value("v") : Value()) << each.what << command;
-            EXPECT_EQ(takeSignals(), each.signals) << each.what << command;
+            const bool succeeds = command == command::kSetValue ? wantedSucceeds : succeedsIfPossible;
+            EXPECT_EQ(send(command, request), succeeds ? kSuccess : kFailure) << command;
+            EXPECT_EQ(stored(), wantedSucceeds ? Value("v") : Value()) << command;
+            EXPECT_EQ(takeSignals(), signals) << command;
             send(command, removal);
-            EXPECT_TRUE(each.stored().isAbsent()) << each.what << command << ": no value removes";
+            EXPECT_TRUE(stored().isAbsent()) << command << ": no value removes";
         }
     }
     (void)takeSignals();

@@ -35,17 +35,16 @@ class RelaunchTest : public DatabaseTest {
 };
 
 TEST_F(RelaunchTest, TheServiceManagerIsAskedForTheEarliestUnlessForced) {
-    struct Case {
+    constexpr uint32_t kMost = 4'294'967'295;
+    // One after the other, at the same time.
+    const struct {
         const char* what;
         /// Seconds from now.
         std::optional<double> date;
         bool force;
         std::optional<uint32_t> handed;
         std::optional<double> next;
-    };
-    constexpr uint32_t kMost = 4'294'967'295;
-    // One after the other, at the same time.
-    const Case cases[] = {
+    } cases[] = {
         {"no particular time", {}, false, kMost, 1e10},
         {"earlier", 100, false, 100, 100},
         {"later", 200, false, {}, 100},
@@ -63,14 +62,14 @@ TEST_F(RelaunchTest, TheServiceManagerIsAskedForTheEarliestUnlessForced) {
         {"not positive is no particular time", -now(), true, kMost, 1e10},
     };
     EXPECT_EQ(nextLaunchDate(), std::nullopt);
-    for (const Case& each : cases) {
-        scheduleRelaunch(each.date ? std::optional(now() + *each.date) : std::nullopt,
-                         each.force ? RelaunchDate::Replaces : RelaunchDate::OnlyIfEarlier);
+    for (const auto& [what, date, force, handed, next] : cases) {
+        SCOPED_TRACE(what);
+        scheduleRelaunch(date ? std::optional(now() + *date) : std::nullopt,
+                         force ? RelaunchDate::Replaces : RelaunchDate::OnlyIfEarlier);
         clock_.settle();
-        EXPECT_EQ(manager_.take(), each.handed) << each.what;
-        EXPECT_EQ(nextLaunchDate(), each.next ? std::optional(now() + *each.next) : std::nullopt)
-            << each.what;
-        EXPECT_EQ(platform::transactions::openCount(), 0) << each.what;
+        EXPECT_EQ(manager_.take(), handed);
+        EXPECT_EQ(nextLaunchDate(), next ? std::optional(now() + *next) : std::nullopt);
+        EXPECT_EQ(platform::transactions::openCount(), 0);
     }
 }
 

@@ -38,16 +38,9 @@ std::shared_ptr<XMLRPCRequest> someRequest() {
 }
 
 TEST(SynchronousSend, AResponseIsABodyOfAGoodStatus) {
-    struct Case {
-        const char* what;
-        FakeHTTPAnswer answer;
-        bool isResponse;
-        Value object;
-        std::optional<Error> error;
-    };
     FakeHTTPAnswer inPieces = answer(200, kDocument);
     inPieces.pieceBytes = 7;
-    const Case cases[] = {
+    const std::tuple<const char*, FakeHTTPAnswer, bool, Value, std::optional<Error>> cases[] = {
         {"200", answer(200, kDocument), true, "x", {}},
         {"a body in pieces", inPieces, true, "x", {}},
         {"399", answer(399, kDocument), true, "x", {}},
@@ -62,14 +55,15 @@ TEST(SynchronousSend, AResponseIsABodyOfAGoodStatus) {
          {},
          transportError(18, "cut")},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, answer, isResponse, object, wantedError] : cases) {
+        SCOPED_TRACE(what);
         platform::FakeHTTPTransport transport;
-        transport.enqueue(each.answer);
+        transport.enqueue(answer);
         std::optional<Error> error;
         const auto response = XMLRPCConnection::sendSynchronousXMLRPCRequest(*someRequest(), &error);
-        EXPECT_EQ(response.has_value(), each.isResponse) << each.what;
-        EXPECT_EQ(response ? response->object() : Value(), each.object) << each.what;
-        EXPECT_EQ(error, each.error) << each.what;
+        EXPECT_EQ(response.has_value(), isResponse);
+        EXPECT_EQ(response ? response->object() : Value(), object);
+        EXPECT_EQ(error, wantedError);
         ASSERT_EQ(transport.requests().size(), 1U);
         EXPECT_EQ(transport.requests()[0].body, someRequest()->body());
         EXPECT_EQ(transport.sessionsCreated(), 1);
@@ -204,15 +198,10 @@ TEST_F(AsynchronousConnection, TellsTheDelegateOfEveryOutcome) {
 
 TEST_F(AsynchronousConnection, HandsChallengesToADelegateThatTakesThem) {
     using platform::ChallengeAnswer;
-    struct Case {
-        std::optional<bool> canAuthenticate;
-        std::optional<ChallengeAnswer> answer;
-        Recorder::Lines lines;
-    };
     const std::string may = "may authenticate at server.example";
     const std::string challenge = "challenge of server.example";
     const std::string refused = "failure HWTransportErrorDomain 42";
-    const Case cases[] = {
+    const std::tuple<std::optional<bool>, std::optional<ChallengeAnswer>, Recorder::Lines> cases[] = {
         {std::nullopt, std::nullopt, {may, challenge, "response x to m"}},
         {true, ChallengeAnswer::PerformDefaultHandling, {may, challenge, "response x to m"}},
         {true, ChallengeAnswer::Cancel, {may, challenge, refused}},
@@ -220,10 +209,10 @@ TEST_F(AsynchronousConnection, HandsChallengesToADelegateThatTakesThem) {
     };
     FakeHTTPAnswer challenging = answer(200, kDocument);
     challenging.challenge = platform::ProtectionSpace{"server.example", 443, "ServerTrust"};
-    for (const Case& each : cases) {
-        recorder_->canAuthenticate = each.canAuthenticate;
-        recorder_->challengeAnswer = each.answer;
-        EXPECT_EQ(linesOf(challenging), each.lines);
+    for (const auto& [canAuthenticate, answer, lines] : cases) {
+        recorder_->canAuthenticate = canAuthenticate;
+        recorder_->challengeAnswer = answer;
+        EXPECT_EQ(linesOf(challenging), lines);
     }
 }
 

@@ -86,14 +86,9 @@ TEST_F(XMLRPCShim, OnlyADictionaryIsAResult) {
 }
 
 TEST_F(XMLRPCShim, AFaultIsAnErrorWithItsCodeAndText) {
-    struct Case {
-        std::string members;
-        int64_t code;
-        Dictionary userInfo;
-    };
     const std::string text = member("faultString", "not you");
     const Dictionary description{{kErrorDescriptionKey, "not you"}};
-    const Case cases[] = {
+    const std::tuple<std::string, int64_t, Dictionary> cases[] = {
         {member("faultCode", "<int>-20101</int>") + text, -20101, description},
         {member("faultCode", "<int>-20101</int>"), -20101, {}},
         {text, -1, description},
@@ -105,11 +100,12 @@ TEST_F(XMLRPCShim, AFaultIsAnErrorWithItsCodeAndText) {
         {member("faultCode", "none"), 0, {}},
         {member("faultCode", "<array/>"), 0, {}},
     };
-    for (const Case& each : cases) {
-        const Outcome outcome = invoke(fault(each.members));
-        EXPECT_FALSE(outcome.success) << each.members;
-        EXPECT_FALSE(outcome.result) << each.members;
-        EXPECT_EQ(outcome.error, (Error{kXMLErrorDomain, each.code, each.userInfo})) << each.members;
+    for (const auto& [members, code, userInfo] : cases) {
+        SCOPED_TRACE(members);
+        const Outcome outcome = invoke(fault(members));
+        EXPECT_FALSE(outcome.success);
+        EXPECT_FALSE(outcome.result);
+        EXPECT_EQ(outcome.error, (Error{kXMLErrorDomain, code, userInfo}));
     }
 }
 
@@ -135,13 +131,9 @@ TEST_F(XMLRPCShim, NoResponseIsAnErrorOfItsOwn) {
 }
 
 TEST_F(XMLRPCShim, AMessageOfTheServerGoesToTheSystemLog) {
-    struct Case {
-        std::string members;
-        std::optional<platform::LogPriority> priority;
-    };
     const std::string hello = member("LogString", "hello");
     const auto level = [&](const std::string& value) { return hello + member("LogStringLevel", value); };
-    const Case cases[] = {
+    const std::pair<std::string, std::optional<platform::LogPriority>> cases[] = {
         {hello, platform::LogPriority::Error},
         {level("<i4>5</i4>"), platform::LogPriority::Notice},
         {level("five"), platform::LogPriority::Error},
@@ -150,15 +142,15 @@ TEST_F(XMLRPCShim, AMessageOfTheServerGoesToTheSystemLog) {
         {member("LogString", "<i4>1</i4>"), std::nullopt},
         {member("LogStringLevel", "<i4>1</i4>"), std::nullopt},
     };
-    for (const Case& each : cases) {
+    for (const auto& [members, priority] : cases) {
         const size_t before = log_.lines().size();
-        const Outcome outcome = invoke(document(structure(each.members)));
+        const Outcome outcome = invoke(document(structure(members)));
         ASSERT_TRUE(outcome.success && outcome.result);
         const auto lines = log_.lines();
-        ASSERT_EQ(lines.size() - before, each.priority ? 1U : 0U) << each.members;
-        if (!each.priority) continue;
+        ASSERT_EQ(lines.size() - before, priority ? 1U : 0U) << members;
+        if (!priority) continue;
         EXPECT_EQ(lines.back().text, "VeltoIDAuthentication: Message from server \"\"hello\"\"");
-        EXPECT_EQ(lines.back().priority, *each.priority) << each.members;
+        EXPECT_EQ(lines.back().priority, *priority) << members;
         EXPECT_TRUE(outcome.result->contains("LogString"));
     }
     invoke(document(structure(member("LogString", "two\nlines"))));
