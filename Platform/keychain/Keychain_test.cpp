@@ -12,6 +12,7 @@
 #include "Platform/encoding/HexText.h"
 #include "Platform/keychain/KeychainSealing.h"
 #include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/KeychainCases.h"
 #include "TestSupport/SQLiteEdit.h"
 
 namespace platform {
@@ -21,16 +22,6 @@ namespace fs = std::filesystem;
 using keychain::Changes;
 
 const std::string kSecret = "a secret that is long enough to be found in a file";
-
-using Text = std::optional<std::string>;
-
-KeychainAttributes password(Text account, Text service = "service") {
-    return {KeychainItemClass::GenericPassword, std::move(account), std::move(service), {}, {}, {}, {}, {}};
-}
-
-KeychainAttributes object(KeychainItemClass itemClass, Text keyClass, Text value) {
-    return {itemClass, {}, {}, {}, {}, {}, std::move(keyClass), std::move(value)};
-}
 
 Changes newData(std::string_view text) { return {SecretBytes(text.begin(), text.end()), {}, {}, {}}; }
 
@@ -126,7 +117,7 @@ TEST_F(KeychainTest, QueriesMatchByTheAttributesThatTheyName) {
                                                     added(password("a", "t")),
                                                     added(object(KeychainItemClass::Key, "private", "v")),
                                                     added(object(KeychainItemClass::Key, "public", "v"))};
-    const auto only = [](Text KeychainAttributes::*field, const char* value) {
+    const auto only = [](std::optional<std::string> KeychainAttributes::*field, const char* value) {
         KeychainAttributes attributes;
         attributes.*field = value;
         return attributes;
