@@ -3,13 +3,10 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
-#include <filesystem>
-#include <fstream>
-#include <functional>
-
 #include "Platform/crypto/KeyPair.h"
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/SimulatedClock.h"
+#include "TestSupport/TemporaryStateDirectory.h"
 #include "TestSupport/TestAuthority.h"
 
 namespace platform {
@@ -22,16 +19,12 @@ using veltoid::testing_support::TestAuthority;
 class TrustTest : public testing::Test {
   protected:
     TrustTest() {
-        std::string name = (std::filesystem::temp_directory_path() / "veltoid-config-XXXXXX").string();
-        EXPECT_NE(mkdtemp(name.data()), nullptr);
-        configuration_ = name;
-        std::filesystem::create_directory(configuration_ / "harbwell");
-        setenv("XDG_CONFIG_HOME", name.c_str(), 1);
+        std::filesystem::create_directory(directory_.base() / "harbwell");
+        setenv("XDG_CONFIG_HOME", directory_.base().c_str(), 1);
     }
-    ~TrustTest() override { std::filesystem::remove_all(configuration_); }
 
     void setAuthorities(const std::string& pem) const {
-        std::ofstream(configuration_ / "harbwell" / "identity-authority.pem") << pem;
+        TemporaryStateDirectory::writeFile(directory_.base() / "harbwell" / "identity-authority.pem", pem);
     }
 
     Certificate issue(const CertificateContent& content = {}) const {
@@ -40,7 +33,7 @@ class TrustTest : public testing::Test {
 
     SimulatedClock clock_{1'750'000'000};  // 2025-06-15
     FakeSystemLog log_;
-    std::filesystem::path configuration_;
+    TemporaryStateDirectory directory_;
     const KeyPair key_ = *generateRSAKeyPair(2048);
     const TestAuthority root_{"Root"};
     const TestAuthority intermediate_{"Intermediate", &root_};
