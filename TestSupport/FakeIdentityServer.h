@@ -130,6 +130,10 @@ class ServerTest : public DatabaseTest {
         __VeltoIDDBCopyCertificateInfo(encDsId, &entry);
         return entry.values();
     }
+    /// Sets values of the account's certificate entry; Null removes.
+    static void setInEntry(const Dictionary& values) {
+        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
+    }
     static void setValue(const char* key, const Value& value) {
         ASSERT_TRUE(__VeltoIDDBSetAccountValue(kName, key, value, Notify::No));
     }

@@ -62,12 +62,12 @@ TEST(CommandLineTest, IsUnderstood) {
         {{"ignored", "too"}, ""},
         {{"-a", "--", "-c=1"}, "authentication [-c|1] "},
     };
-    for (const auto& [wantedArguments, wantedSummary] : cases) {
-        Arguments arguments(wantedArguments);
+    for (const auto& [given, understood] : cases) {
+        Arguments arguments(given);
         CommandLineError error;
         const auto line = parseCommandLine(arguments.count(), arguments.pointers.data(), error);
-        ASSERT_TRUE(line) << join(wantedArguments);
-        EXPECT_EQ(summary(*line), wantedSummary) << join(wantedArguments);
+        ASSERT_TRUE(line) << join(given);
+        EXPECT_EQ(summary(*line), understood) << join(given);
     }
 }
 

@@ -22,14 +22,10 @@ class NextActionTest : public CertificateTest {
         issueAtOnce();
         ASSERT_TRUE(request());
         setValues({{"Dirty", kGone}, {"ValidationDate", date()}, {"CertificateRequestDates", kGone}});
-        set({{"Dirty", kGone}});
+        setInEntry({{"Dirty", kGone}});
         (void)server_.take();
     }
-    /// Sets values of the entry; Null removes.
-    static void set(const Dictionary& values) {
-        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
-    }
-    static AccountState check(const Dictionary& options = {{"CheckNetwork", flag(true)}}) {
+    static AccountState check(const Dictionary& options = {{"CheckNetwork", kOn}}) {
         return checkAccountAndDetermineNextAction(kName, options);
     }
     static AccountState checkOffline() { return check({}); }
@@ -89,13 +85,13 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
     prepare();
     const Dictionary fresh = certificateEntry();
     const auto restore = [&] {
-        for (const auto& [key, value] : certificateEntry()) set({{key.view(), kGone}});
-        set(fresh);
+        for (const auto& [key, value] : certificateEntry()) setInEntry({{key.view(), kGone}});
+        setInEntry(fresh);
     };
     for (const auto& [what, entry, found, methods] : cases) {
         SCOPED_TRACE(what);
         restore();
-        set(entry);
+        setInEntry(entry);
         EXPECT_EQ(checkOffline(), found.first);
         EXPECT_EQ(server_.takeMethods(), "");
         EXPECT_EQ(check(), found.second);
@@ -109,7 +105,7 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
          {std::pair(Value::real(-200'000), CertificateShouldBeRenewed),
           std::pair(number(10), CertificateAssumedOK), std::pair(Value("x"), CertificateAssumedOK)}) {
         restore();
-        set({{"Expires", date(129'500)}});
+        setInEntry({{"Expires", date(129'500)}});
         EXPECT_EQ(check({{"PreExpirationInterval", interval}}), state) << testing::PrintToString(interval);
     }
 }
@@ -117,7 +113,7 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
 TEST_F(NextActionTest, ACertificateIsEvaluatedUnderTheAuthority) {
     prepare();
     const auto evaluated = [this] {
-        set({{"Dirty", kOn}, {kValidated, date(-5)}, {kAttempt, kGone}});
+        setInEntry({{"Dirty", kOn}, {kValidated, date(-5)}, {kAttempt, kGone}});
         const AccountState state = check();
         EXPECT_EQ(certificateEntry()[kValidated] == date(),
                   state == CertificateOK || state == CertificateAssumedOK);
@@ -125,7 +121,7 @@ TEST_F(NextActionTest, ACertificateIsEvaluatedUnderTheAuthority) {
         return state;
     };
     EXPECT_EQ(evaluated(), CertificateOK);
-    set({{"IntermediateCertificateReference", kGone}});
+    setInEntry({{"IntermediateCertificateReference", kGone}});
     EXPECT_EQ(evaluated(), CertificateRevoked) << "no path to the authority";
     trust(intermediate_);
     EXPECT_EQ(evaluated(), CertificateOK);
@@ -135,8 +131,8 @@ TEST_F(NextActionTest, ACertificateIsEvaluatedUnderTheAuthority) {
     EXPECT_EQ(evaluated(), Unknown) << "nobody to ask";
     trust(root_);
 
-    server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", flag(false)}});
-    set({{"Dirty", kOn}});
+    server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", kOff}});
+    setInEntry({{"Dirty", kOn}});
     EXPECT_EQ(check(), CertificateRevoked) << "the server's word counts at once";
     EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERTIFICATE_INVALID"));
 }
@@ -155,10 +151,10 @@ TEST_F(NextActionTest, WhatCannotBeReadFromTheKeychainIsMissing) {
     prepare();
     for (const auto& [key, reference, line] : cases) {
         const Value before = certificateEntry()[key];
-        set({{key, reference}});
+        setInEntry({{key, reference}});
         EXPECT_EQ(check(), NoCertificate) << line;
         EXPECT_EQ(log_.count(line), 1) << line;
-        set({{key, before}});
+        setInEntry({{key, before}});
     }
     EXPECT_EQ(check(), CertificateAssumedOK);
 }
