@@ -75,13 +75,12 @@ TEST(MessageValueTest, WhatHasNoOtherFormIsLeftOut) {
         EXPECT_EQ(describe(messageFromValue(Array{"a", value, "b"})), "[\"a\"\"b\"]");
         EXPECT_EQ(describe(messageFromValue(Dictionary{{"a", value}, {"b", "c"}})), "{1 b=\"c\", }");
     }
-    const MessageValue foreign[] = {{},
-                                    {MessageError{"e"}},
-                                    {MessageConnection()},
-                                    {MessageFileDescriptor()},
-                                    {MessageSharedMemory()},
-                                    {MessageOther{"o"}}};
-    for (const MessageValue& message : foreign) {
+    for (const MessageValue& message : std::vector<MessageValue>{{},
+                                                                 {MessageError{"e"}},
+                                                                 {MessageConnection()},
+                                                                 {MessageFileDescriptor()},
+                                                                 {MessageSharedMemory()},
+                                                                 {MessageOther{"o"}}}) {
         EXPECT_TRUE(valueFromMessage(message).isAbsent());
         EXPECT_EQ(valueFromMessage(array({message, {String("a")}})), Value(Array{"a"}));
         EXPECT_EQ(valueFromMessage(dictionary({{"x", message}})), Value(Dictionary()));
