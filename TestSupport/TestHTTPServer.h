@@ -124,6 +124,9 @@ class TestHTTPServer {
     }
 
   private:
+    /// By its whole name, from which it finds its library: another one may come first on PATH.
+    static constexpr const char* kPython = "/usr/bin/python3";
+
     void run() {
         std::array<int, 2> in{};
         std::array<int, 2> out{};
@@ -134,7 +137,7 @@ class TestHTTPServer {
             dup2(in[0], STDIN_FILENO);
             dup2(out[1], STDOUT_FILENO);
             if (chdir(directory_.c_str()) == 0)
-                execl("/usr/bin/python3", "python3", "server.py", "good", "wrong-name", "stranger", nullptr);
+                execl(kPython, kPython, "server.py", "good", "wrong-name", "stranger", nullptr);
             _exit(1);
         }
         close(in[0]);
