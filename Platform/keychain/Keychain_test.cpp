@@ -143,7 +143,7 @@ TEST_F(KeychainTest, QueriesMatchByTheAttributesThatTheyName) {
         {{{}, References{{}}}, {}},
     };
     for (const auto& [query, matches] : cases) {
-        SCOPED_TRACE(&matches - &cases[0].second);
+        SCOPED_TRACE(testing::PrintToString(matches));
         References expected;
         for (const size_t item : matches) expected.push_back(items[item]);
         References found;
