@@ -19,7 +19,7 @@ TEST(TransactionsTest, IdleTimeCountsFromTheEndOfTheLastOne) {
         const char* what;
         std::vector<Step> steps;
         /// When the process is found idle for ten seconds; 0 for not within a hundred.
-        double wantedIdleAt;
+        double expected;
     } cases[] = {
         {"nothing was open yet", {}, 0},
         {"one", {{1, 1}, {3, -1}}, 13},
@@ -29,7 +29,7 @@ TEST(TransactionsTest, IdleTimeCountsFromTheEndOfTheLastOne) {
         {"never closed", {{0, 1}, {1, -1}, {2, 1}}, 0},
         {"two at a time", {{0, 2}, {1, -1}, {20, -1}}, 30},
     };
-    for (const auto& [what, steps, wantedIdleAt] : cases) {
+    for (const auto& [what, steps, expected] : cases) {
         SimulatedClock clock;
         const double start = clock.now();
         double idleAt = 0;
@@ -44,8 +44,8 @@ TEST(TransactionsTest, IdleTimeCountsFromTheEndOfTheLastOne) {
             for (int i = 0; i > step.change; --i) ended();
         }
         clock.advanceBy(100 - (clock.now() - start));
-        EXPECT_DOUBLE_EQ(idleAt, wantedIdleAt) << what;
-        EXPECT_EQ(calls, wantedIdleAt > 0 ? 1 : 0) << what;
+        EXPECT_DOUBLE_EQ(idleAt, expected) << what;
+        EXPECT_EQ(calls, expected > 0 ? 1 : 0) << what;
         while (openCount() > 0) ended();
         clock.advanceBy(20);
     }

@@ -174,14 +174,14 @@ TEST_F(Information, TellsTheServerWhichRecordItHas) {
         {"empty data", {}, "v1", noBytes, ""},
     };
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
-    for (const auto& [what, options, identifier, data, wantedSent] : cases) {
+    for (const auto& [what, options, identifier, data, told] : cases) {
         SCOPED_TRACE(what);
         prepare(30'000);
         setValue(kIdentifier, identifier);
         setValue(kData, data);
         ASSERT_TRUE(get(options));
         const Dictionary sent = server_.take().back().parameters;
-        EXPECT_EQ(sent["ClientVIDVRecordIdentifier"], Value(wantedSent));
+        EXPECT_EQ(sent["ClientVIDVRecordIdentifier"], Value(told));
         EXPECT_EQ(sent["CertificateSerialNumber"], Value("7"));
     }
 }
