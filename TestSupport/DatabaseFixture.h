@@ -32,6 +32,35 @@ inline void PrintTo(const Error& value, std::ostream* stream) { *stream << descr
 inline Value flag(bool value) { return Value::boolean(value); }
 inline Value number(int64_t value) { return Value::int64(value); }
 
+inline const Value kOn = flag(true);
+inline const Value kOff = flag(false);
+/// Removes a value where one is set.
+inline const Value kGone = Value::null();
+inline constexpr double kDay = 86'400;
+
+// Keys of records.
+inline constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
+inline constexpr const char* kData = "VeltoIDAccountValidationRecordData";
+inline constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
+inline constexpr const char* kAsOf = "VeltoIDAccountValidationRecordValidAsOfKey";
+inline constexpr const char* kDuration = "VeltoIDAccountValidationRecordSuggestedValidIntervalKey";
+inline constexpr const char* kEmbargo = "EarliestAllowedConnectionDate";
+inline constexpr const char* kToken = "CertificateToken";
+inline constexpr const char* kFetchDate = "NextCertificateFetchDate";
+// Keys of certificate entries.
+inline constexpr const char* kKeyReference = "CertificatePrivateKeyReference";
+inline constexpr const char* kCertificateReference = "CertificateReference";
+inline constexpr const char* kValidated = "LastSuccessfulValidation";
+inline constexpr const char* kAttempt = "LastValidationAttempt";
+inline constexpr const char* kRenewal = "NextRenewalAttempt";
+
+/// An array within an array and so on.
+inline Value nestedArrays(int depth) {
+    Value value = Array();
+    for (; depth > 0; --depth) value = Array{value};
+    return value;
+}
+
 /// The keys of a dictionary.
 inline std::set<std::string> keysOf(const Dictionary& dictionary) {
     std::set<std::string> keys;
@@ -97,12 +126,16 @@ class DatabaseTest : public testing::Test {
         database::loadedStore();
         (void)takeWritten();
         (void)takeSignals();
+        operationDate_ = now();
         operation();
         const int signals = takeSignals();
         std::string effects = takeWritten() ? "written" : "";
         for (int i = 0; i < signals; ++i) effects += ", signalled";
         return effects;
     }
+
+    /// When the last operation was done whose effects were asked for.
+    Value operationDate() const { return Value::date(operationDate_); }
 
     // The preference store behind the database's back.
     static platform::Preferences domain(std::string_view name = kVeltoIDDBDefaultDomain) {
@@ -132,6 +165,7 @@ class DatabaseTest : public testing::Test {
 
   private:
     bool isComparedWithDisk_ = true;
+    double operationDate_ = 0;
 };
 
 }  // namespace veltoid

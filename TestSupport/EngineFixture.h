@@ -10,15 +10,7 @@
 
 namespace veltoid {
 
-inline const Value kOn = flag(true);
-inline const Value kOff = flag(false);
 inline const Array kEmails{"jane@velto.example"};
-
-// Keys of records.
-inline constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
-inline constexpr const char* kData = "VeltoIDAccountValidationRecordData";
-inline constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
-inline constexpr const char* kEmbargo = "EarliestAllowedConnectionDate";
 inline const Value kRecordData = Data(std::vector<uint8_t>{1, 2});
 
 enum class Server { Up, Down, NoSignIn, NoAnswer, RefusesPassword };

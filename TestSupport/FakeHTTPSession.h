@@ -18,15 +18,15 @@ namespace platform {
 /// What becomes of one exchange.
 struct FakeHTTPAnswer {
     int status = 200;
-    /// Delivered in pieces of at most `pieceBytes`.
-    std::string body;
-    size_t pieceBytes = SIZE_MAX;
+    std::string body = {};
     /// How the exchange ends; with `status` 0 not even a header came.
-    std::optional<HTTPError> error;
+    std::optional<HTTPError> error = {};
+    /// The body is delivered in pieces of at most this size.
+    size_t pieceBytes = SIZE_MAX;
     /// Comes first; turned down, it ends the exchange with an error.
-    std::optional<ProtectionSpace> challenge;
+    std::optional<ProtectionSpace> challenge = {};
     /// Bytes sent and expected, as they are reported before the header.
-    std::vector<std::pair<uint64_t, uint64_t>> progress;
+    std::vector<std::pair<uint64_t, uint64_t>> progress = {};
     /// Seconds on the Clock before anything comes; kForever: never.
     double delaySeconds = 0;
 };

@@ -115,6 +115,7 @@ class ServerTest : public DatabaseTest {
   protected:
     static constexpr const char* kName = "jane@velto.example";
     static constexpr const char* kPassword = "hash of a password";
+    static constexpr const char* kURL = "https://server.example/rpc";
 
     static void createAccount(const String& encDsId = "d1") {
         ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, kPassword, encDsId));
@@ -129,6 +130,10 @@ class ServerTest : public DatabaseTest {
         __VeltoIDDBCopyCertificateInfo(encDsId, &entry);
         return entry.values();
     }
+    /// Sets values of the account's certificate entry; Null removes.
+    static void setInEntry(const Dictionary& values) {
+        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
+    }
     static void setValue(const char* key, const Value& value) {
         ASSERT_TRUE(__VeltoIDDBSetAccountValue(kName, key, value, Notify::No));
     }
@@ -141,6 +146,13 @@ class ServerTest : public DatabaseTest {
     static Value meta(const char* key, const String& section = nullptr) {
         return __VeltoIDDBCopyMetaInfoValue(section, {}, key);
     }
+    /// A session of the account, as a sign-in that many seconds ago has yielded it.
+    Session session(const String& encDsId = "d1", double age = 0, double validity = 100,
+                    const String& id = "s1") const {
+        return Session(new VeltoIDAuthenticationSessionInfo{kName, kPassword, kURL, id, now() - age, validity,
+                                                            encDsId, copySessionQueueForAccount(kName)});
+    }
+
     /// A counter of the account.
     static int64_t count(std::string_view key) {
         return __VeltoIDDBCopyMetaInfoValue(kName, {}, key).asInt64().value_or(0);

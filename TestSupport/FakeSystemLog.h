@@ -50,4 +50,15 @@ class FakeSystemLog : public SystemLog {
     std::vector<Line> lines_;
 };
 
+/// Drops what is logged.
+class SilentLog : public SystemLog {
+  public:
+    SilentLog() { replaceShared(this); }
+    ~SilentLog() override { replaceShared(nullptr); }
+    SilentLog(const SilentLog&) = delete;
+    SilentLog& operator=(const SilentLog&) = delete;
+    void open(std::string_view) override {}
+    void write(LogPriority, std::string_view, const LogOrigin&) override {}
+};
+
 }  // namespace platform

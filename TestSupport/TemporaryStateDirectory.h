@@ -66,6 +66,27 @@ class TemporaryStateDirectory {
     std::filesystem::path base_;
 };
 
+/// Something in the way of a file of the state directory: while it lives, the file cannot be opened.
+class Obstacle {
+  public:
+    explicit Obstacle(std::string_view name) : file_(TemporaryStateDirectory::file(name)) {
+        if (std::filesystem::exists(file_)) std::filesystem::rename(file_, aside());
+        std::filesystem::create_directory(file_);
+    }
+    ~Obstacle() {
+        EXPECT_TRUE(std::filesystem::remove(file_));
+        if (std::filesystem::exists(aside())) std::filesystem::rename(aside(), file_);
+    }
+    Obstacle(const Obstacle&) = delete;
+    Obstacle& operator=(const Obstacle&) = delete;
+
+    /// Where the file is meanwhile.
+    std::filesystem::path aside() const { return file_.parent_path().parent_path() / "aside"; }
+
+  private:
+    const std::filesystem::path file_;
+};
+
 /// A forked process that runs `work` (returning whether all went well) and ends without any clean-up, so that
 /// what it leaves on disk is what a crash would leave. Fork before this process opens the store: an open one
 /// does not survive.

@@ -4,25 +4,17 @@
 #include <gtest/gtest.h>
 #include <malloc.h>
 #include <pthread.h>
-#include <spawn.h>
-#include <sys/wait.h>
-#include <systemd/sd-bus.h>
-#include <unistd.h>
 
 #include <chrono>
-#include <csignal>
 #include <filesystem>
-#include <memory>
 #include <thread>
 
-#include "Platform/bus/BusMessage.h"
-#include "Platform/runtime/SystemLog.h"
 #include "Protocol/Commands.h"
-#include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
+#include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/PrivateBus.h"
 #include "TestSupport/TemporaryStateDirectory.h"
 #include "TestSupport/TestLifetime.h"
-#include "Values/ValueStream.h"
 #include "VeltoIDAuthd/Agent.h"
 
 #ifdef VELTOID_SANITIZED
@@ -48,106 +40,6 @@ constexpr size_t kMaxGrowth = 100'000;
 constexpr const char* kAccount = "jane@velto.example";
 /// Refuses connections.
 constexpr const char* kNoServer = "https://127.0.0.1:1/";
-
-class Bus {
-  public:
-    Bus() {
-        int ends[2];
-        if (pipe(ends) != 0) throw std::runtime_error("no pipe");
-        posix_spawn_file_actions_t actions;
-        posix_spawn_file_actions_init(&actions);
-        posix_spawn_file_actions_adddup2(&actions, ends[1], STDOUT_FILENO);
-        posix_spawn_file_actions_addclose(&actions, ends[0]);
-        const char* arguments[] = {"dbus-daemon", "--session",       "--nofork",
-                                   "--nopidfile", "--print-address", nullptr};
-        const int error = posix_spawnp(&process_, arguments[0], &actions, nullptr,
-                                       const_cast<char* const*>(arguments), environ);
-        posix_spawn_file_actions_destroy(&actions);
-        close(ends[1]);
-        std::string address;
-        for (char c = 0; error == 0 && read(ends[0], &c, 1) == 1 && c != '\n';) address += c;
-        close(ends[0]);
-        if (address.empty()) throw std::runtime_error("no dbus-daemon");
-        setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
-    }
-    ~Bus() {
-        kill(process_, SIGTERM);
-        waitpid(process_, nullptr, 0);
-    }
-    Bus(const Bus&) = delete;
-    Bus& operator=(const Bus&) = delete;
-
-  private:
-    pid_t process_ = -1;
-};
-
-/// A client of the agent, on a thread of its own in each life.
-class Client {
-  public:
-    Client() {
-        EXPECT_GE(sd_bus_open_user(&bus_), 0);
-        EXPECT_GE(sd_bus_match_signal(bus_, nullptr, kDaemon, kDaemonPath, kDaemon, "NameOwnerChanged",
-                                      nullptr, nullptr),
-                  0);
-    }
-    ~Client() { sd_bus_flush_close_unref(bus_); }
-    Client(const Client&) = delete;
-    Client& operator=(const Client&) = delete;
-
-    void waitForAgent() {
-        while (!agentIsThere()) {
-            sd_bus_wait(bus_, UINT64_MAX);
-            while (sd_bus_process(bus_, nullptr) > 0) {
-            }
-        }
-    }
-
-    /// Empty when there is no reply.
-    Dictionary call(int64_t command, Dictionary request = {}) {
-        request.set(message::kCommand, Value::int64(command));
-        sd_bus_message* call = nullptr;
-        sd_bus_message* reply = nullptr;
-        EXPECT_GE(sd_bus_message_new_method_call(bus_, &call, kVeltoIDAuthenticationServiceName,
-                                                 kVeltoIDObjectPath, kVeltoIDMessageInterface, "Send"),
-                  0);
-        EXPECT_GE(platform::bus::appendDictionary(
-                      call, [&](platform::ValueSink& sink) { writeValue(Value(request), sink); }),
-                  0);
-        ValueBuilder builder;
-        if (sd_bus_call(bus_, call, 0, nullptr, &reply) >= 0) platform::bus::readDictionary(reply, builder);
-        sd_bus_message_unref(reply);
-        sd_bus_message_unref(call);
-        const Dictionary* answer = reply != nullptr ? builder.value().asDictionary() : nullptr;
-        return answer != nullptr ? *answer : Dictionary();
-    }
-
-  private:
-    static constexpr const char* kDaemon = "org.freedesktop.DBus";
-    static constexpr const char* kDaemonPath = "/org/freedesktop/DBus";
-
-    bool agentIsThere() {
-        sd_bus_message* reply = nullptr;
-        int isThere = 0;
-        EXPECT_GE(sd_bus_call_method(bus_, kDaemon, kDaemonPath, kDaemon, "NameHasOwner", nullptr, &reply,
-                                     "s", kVeltoIDAuthenticationServiceName),
-                  0);
-        EXPECT_GE(sd_bus_message_read(reply, "b", &isThere), 0);
-        sd_bus_message_unref(reply);
-        return isThere != 0;
-    }
-
-    sd_bus* bus_ = nullptr;
-};
-
-class SilentLog : public platform::SystemLog {
-  public:
-    SilentLog() { replaceShared(this); }
-    ~SilentLog() override { replaceShared(nullptr); }
-    SilentLog(const SilentLog&) = delete;
-    SilentLog& operator=(const SilentLog&) = delete;
-    void open(std::string_view) override {}
-    void write(platform::LogPriority, std::string_view, const platform::LogOrigin&) override {}
-};
 
 size_t entriesOf(const char* directory) {
     return static_cast<size_t>(std::distance(std::filesystem::directory_iterator(directory), {}));
@@ -220,9 +112,9 @@ class AgentRestartTest : public testing::Test {
     }
 
     const platform::TemporaryStateDirectory directory_;
-    const Bus bus_;
-    SilentLog log_;
-    Client client_;
+    const PrivateBus bus_;
+    platform::SilentLog log_;
+    BusClient client_;
     const pthread_t main_ = pthread_self();
 };
 

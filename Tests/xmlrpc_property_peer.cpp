@@ -8,7 +8,6 @@
 // dictionary of the N pairs of string and value that follow.
 #include <charconv>
 #include <cmath>
-#include <cstdio>
 #include <cstdlib>
 #include <iostream>
 #include <sstream>
@@ -29,82 +28,55 @@ std::string bytesOfBase64(const std::string& text) {
     return std::string(platform::textOf(xmlrpcBase64Decode(text).bytes()));
 }
 
-void describe(std::ostream& out, const Value& value) {
-    switch (value.kind()) {
-        case Value::Kind::Null:
-            out << " n";
-            break;
-        case Value::Kind::Boolean:
-            out << " b" << *value.asBoolean();
-            break;
-        case Value::Kind::Number: {
-            char digits[32];
-            const auto end = value.isFloating()
-                                 ? std::to_chars(std::begin(digits), std::end(digits), *value.asDouble()).ptr
-                                 : std::to_chars(std::begin(digits), std::end(digits), *value.asInt64()).ptr;
-            out << (value.isFloating() ? " d" : " i") << std::string_view(digits, end);
-            break;
-        }
-        case Value::Kind::Date:
-            out << " t" << std::llround(*value.asDate());
-            break;
-        case Value::Kind::String:
-            out << " s" << base64(*value.asText());
-            break;
-        case Value::Kind::Data:
-            out << " x" << base64(platform::textOf(value.asData().bytes()));
-            break;
-        case Value::Kind::Array:
-            out << " a" << value.asArray()->size();
-            for (const Value& element : *value.asArray()) describe(out, element);
-            break;
-        case Value::Kind::Dictionary:
-            out << " m" << value.asDictionary()->size();
-            for (const auto& [key, member] : *value.asDictionary()) {
-                out << " s" << base64(key.view());
-                describe(out, member);
-            }
-            break;
-        default:
-            std::abort();
+template <typename Number>
+std::string digits(Number number) {
+    char text[32];
+    return {text, std::to_chars(std::begin(text), std::end(text), number).ptr};
+}
+
+std::string described(const Value& value) {
+    if (value.isNull()) return " n";
+    if (const auto flag = value.asBoolean()) return *flag ? " b1" : " b0";
+    if (const auto date = value.asDate()) return " t" + digits(std::llround(*date));
+    if (value.isString()) return " s" + base64(*value.asText());
+    if (value.kind() == Value::Kind::Data) return " x" + base64(platform::textOf(value.asData().bytes()));
+    if (const Array* array = value.asArray()) {
+        std::string text = " a" + digits(array->size());
+        for (const Value& element : *array) text += described(element);
+        return text;
     }
+    if (const Dictionary* dictionary = value.asDictionary()) {
+        std::string text = " m" + digits(dictionary->size());
+        for (const auto& [key, member] : *dictionary) text += described(key) + described(member);
+        return text;
+    }
+    if (value.kind() != Value::Kind::Number) std::abort();
+    return value.isFloating() ? " d" + digits(*value.asDouble()) : " i" + digits(*value.asInt64());
 }
 
 Value readValue(std::istream& in) {
     std::string word;
     if (!(in >> word)) std::abort();
+    const char kind = word[0];
     const std::string rest = word.substr(1);
-    switch (word[0]) {
-        case 'n':
-            return Value::null();
-        case 'b':
-            return Value::boolean(rest == "1");
-        case 'i':
-            return Value::int64(std::stoll(rest));
-        case 'd':
-            return Value::real(std::strtod(rest.c_str(), nullptr));
-        case 't':
-            return Value::date(std::strtod(rest.c_str(), nullptr));
-        case 's':
-            return bytesOfBase64(rest);
-        case 'x':
-            return xmlrpcBase64Decode(rest);
-        case 'a': {
-            Array array;
-            for (long left = std::stol(rest); left > 0; --left) array.append(readValue(in));
-            return array;
-        }
-        case 'm': {
-            Dictionary dictionary;
-            for (long left = std::stol(rest); left > 0; --left) {
-                const String key = readValue(in).asString();
-                dictionary.set(key, readValue(in));
-            }
-            return dictionary;
-        }
-        default:
-            std::abort();
+    if (kind == 'n') return Value::null();
+    if (kind == 'b') return Value::boolean(rest == "1");
+    if (kind == 'i') return Value::int64(std::stoll(rest));
+    if (kind == 'd') return Value::real(std::strtod(rest.c_str(), nullptr));
+    if (kind == 't') return Value::date(std::strtod(rest.c_str(), nullptr));
+    if (kind == 's') return bytesOfBase64(rest);
+    if (kind == 'x') return xmlrpcBase64Decode(rest);
+    Array array;
+    Dictionary dictionary;
+    for (long left = std::stol(rest); left > 0; --left) {
+        const Value first = readValue(in);
+        if (kind == 'a')
+            array.append(first);
+        else
+            dictionary.set(first.asString(), readValue(in));
     }
+    if (kind != 'a' && kind != 'm') std::abort();
+    return kind == 'a' ? Value(array) : Value(dictionary);
 }
 
 void parse(std::istream& task) {
@@ -112,13 +84,10 @@ void parse(std::istream& task) {
     task >> encoded;
     const std::string document = bytesOfBase64(encoded);
     const XMLRPCResponse response({document.begin(), document.end()});
-    if (response.object().isAbsent()) {
+    if (response.object().isAbsent())
         std::cout << "none" << std::endl;
-        return;
-    }
-    std::cout << (response.isFault() ? "fault" : "value");
-    describe(std::cout, response.object());
-    std::cout << std::endl;
+    else
+        std::cout << (response.isFault() ? "fault" : "value") << described(response.object()) << std::endl;
 }
 
 void encode(std::istream& task) {

@@ -17,18 +17,13 @@ SecretBytes bytesFromHex(std::string_view text) {
 }
 
 TEST(Crypto, DigestsAreThePublishedOnes) {
-    const struct {
-        std::string text;
-        std::string_view digest;
-    } cases[] = {
+    const std::pair<std::string, std::string_view> cases[] = {
         {"", "e3b0c44298fc1c149afbf4c8996fb92427ae41e4649b934ca495991b7852b855"},
         {"abc", "ba7816bf8f01cfea414140de5dae2223b00361a396177a9cb410ff61f20015ad"},
         {std::string(1000000, 'a'), "cdc76e5c9914fb9281a1c7e284d73e67f1809a48a497200e046d39ccc7112cd0"},
     };
-    for (const auto& test : cases) {
-        const auto digest = sha256(bytesOf(test.text));
-        EXPECT_TRUE(std::ranges::equal(digest, bytesFromHex(test.digest))) << test.text.size();
-    }
+    for (const auto& [text, digest] : cases)
+        EXPECT_TRUE(std::ranges::equal(sha256(bytesOf(text)), bytesFromHex(digest))) << text.size();
 }
 
 TEST(Crypto, RandomBytesFillTheWholeSpan) {

@@ -3,13 +3,10 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
-#include <filesystem>
-#include <fstream>
-#include <functional>
-
 #include "Platform/crypto/KeyPair.h"
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/SimulatedClock.h"
+#include "TestSupport/TemporaryStateDirectory.h"
 #include "TestSupport/TestAuthority.h"
 
 namespace platform {
@@ -22,16 +19,12 @@ using veltoid::testing_support::TestAuthority;
 class TrustTest : public testing::Test {
   protected:
     TrustTest() {
-        std::string name = (std::filesystem::temp_directory_path() / "veltoid-config-XXXXXX").string();
-        EXPECT_NE(mkdtemp(name.data()), nullptr);
-        configuration_ = name;
-        std::filesystem::create_directory(configuration_ / "harbwell");
-        setenv("XDG_CONFIG_HOME", name.c_str(), 1);
+        std::filesystem::create_directory(directory_.base() / "harbwell");
+        setenv("XDG_CONFIG_HOME", directory_.base().c_str(), 1);
     }
-    ~TrustTest() override { std::filesystem::remove_all(configuration_); }
 
     void setAuthorities(const std::string& pem) const {
-        std::ofstream(configuration_ / "harbwell" / "identity-authority.pem") << pem;
+        TemporaryStateDirectory::writeFile(directory_.base() / "harbwell" / "identity-authority.pem", pem);
     }
 
     Certificate issue(const CertificateContent& content = {}) const {
@@ -40,7 +33,7 @@ class TrustTest : public testing::Test {
 
     SimulatedClock clock_{1'750'000'000};  // 2025-06-15
     FakeSystemLog log_;
-    std::filesystem::path configuration_;
+    TemporaryStateDirectory directory_;
     const KeyPair key_ = *generateRSAKeyPair(2048);
     const TestAuthority root_{"Root"};
     const TestAuthority intermediate_{"Intermediate", &root_};
@@ -58,14 +51,7 @@ TEST_F(TrustTest, FollowsThePathToAnAuthority) {
     Certificate broken = good;
     broken.der.back() ^= 1;
     using enum TrustResult;
-    struct Case {
-        const char* what;
-        std::string authorities;
-        Certificate certificate;
-        std::vector<Certificate> intermediates;
-        TrustResult result;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, std::string, Certificate, std::vector<Certificate>, TrustResult> cases[] = {
         {"a path", root, good, {above_}, Unspecified},
         {"among others", both, good, {wrong_, above_}, Unspecified},
         {"an intermediate authority", pemOf(intermediate_.certificate()), good, {}, Unspecified},
@@ -77,9 +63,9 @@ TEST_F(TrustTest, FollowsThePathToAnAuthority) {
         {"not yet", root, issue(early), {above_}, RecoverableFailure},
         {"over, and no path", root, issue(over), {}, FatalFailure},
     };
-    for (const Case& each : cases) {
-        setAuthorities(each.authorities);
-        EXPECT_EQ(evaluateTrust(each.certificate, each.intermediates), each.result) << each.what;
+    for (const auto& [what, authorities, certificate, intermediates, result] : cases) {
+        setAuthorities(authorities);
+        EXPECT_EQ(evaluateTrust(certificate, intermediates), result) << what;
     }
 }
 

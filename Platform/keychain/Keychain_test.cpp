@@ -2,21 +2,18 @@
 
 #include <gtest/gtest.h>
 #include <linux/keyctl.h>
-#include <sqlite3.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
-#include <algorithm>
-#include <filesystem>
 #include <functional>
 #include <set>
-#include <string>
 #include <vector>
 
 #include "Platform/encoding/HexText.h"
 #include "Platform/keychain/KeychainSealing.h"
 #include "TestSupport/FakeSystemLog.h"
-#include "TestSupport/TemporaryStateDirectory.h"
+#include "TestSupport/KeychainCases.h"
+#include "TestSupport/SQLiteEdit.h"
 
 namespace platform {
 namespace {
@@ -26,24 +23,7 @@ using keychain::Changes;
 
 const std::string kSecret = "a secret that is long enough to be found in a file";
 
-KeychainAttributes password(std::optional<std::string> account,
-                            std::optional<std::string> service = "service") {
-    KeychainAttributes attributes;
-    attributes.account = std::move(account);
-    attributes.service = std::move(service);
-    return attributes;
-}
-
-KeychainAttributes object(KeychainItemClass itemClass, std::optional<std::string> keyClass,
-                          std::optional<std::string> value) {
-    KeychainAttributes attributes;
-    attributes.itemClass = itemClass;
-    attributes.keyClass = std::move(keyClass);
-    attributes.applicationValue = std::move(value);
-    return attributes;
-}
-
-SecretBytes secretBytes(std::string_view text) { return {text.begin(), text.end()}; }
+Changes newData(std::string_view text) { return {SecretBytes(text.begin(), text.end()), {}, {}, {}}; }
 
 KeychainQuery byReference(const PersistentReference& reference,
                           KeychainItemClass itemClass = KeychainItemClass::GenericPassword) {
@@ -85,15 +65,7 @@ class KeychainTest : public testing::Test {
         }
     }
 
-    /// Edits the store as any other program could.
-    static void edit(const std::string& sql) {
-        sqlite3* database = nullptr;
-        EXPECT_EQ(sqlite3_open(TemporaryStateDirectory::file("keychain.db").c_str(), &database), SQLITE_OK);
-        sqlite3_busy_timeout(database, 1000);
-        EXPECT_EQ(sqlite3_exec(database, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK)
-            << sql << ": " << sqlite3_errmsg(database);
-        sqlite3_close(database);
-    }
+    static void edit(const std::string& sql) { editDatabase("keychain.db", sql); }
 
     TemporaryStateDirectory directory_;
     FakeSystemLog log_;
@@ -106,10 +78,7 @@ const std::string kLocked = std::to_string(kKeychainLocked);
 
 TEST_F(KeychainTest, RefusesDuplicates) {
     using enum KeychainItemClass;
-    const struct {
-        KeychainAttributes first, second;
-        bool duplicate;
-    } cases[] = {
+    const std::tuple<KeychainAttributes, KeychainAttributes, bool> cases[] = {
         {password("a", "s"), password("a", "s"), true},
         {password("b", "s"), password("b", "t"), false},
         {password("c", "s"), password("d", "s"), false},
@@ -155,10 +124,7 @@ TEST_F(KeychainTest, QueriesMatchByTheAttributesThatTheyName) {
     };
     using References = std::vector<PersistentReference>;
     const PersistentReference unknown(16, 9);
-    const struct {
-        KeychainQuery query;
-        std::vector<size_t> expected;
-    } cases[] = {
+    const std::pair<KeychainQuery, std::vector<size_t>> cases[] = {
         {{}, {0, 1, 2}},
         {{password("a", {}), {}}, {0, 2}},
         {{password("a", "t"), {}}, {2}},
@@ -176,29 +142,26 @@ TEST_F(KeychainTest, QueriesMatchByTheAttributesThatTheyName) {
         {{{}, References{}}, {}},
         {{{}, References{{}}}, {}},
     };
-    for (size_t i = 0; i < std::size(cases); ++i) {
+    for (const auto& [query, matches] : cases) {
+        SCOPED_TRACE(testing::PrintToString(matches));
         References expected;
-        for (const size_t item : cases[i].expected) expected.push_back(items[item]);
+        for (const size_t item : matches) expected.push_back(items[item]);
         References found;
-        EXPECT_EQ(keychain::copyMatchingReferences(cases[i].query, &found),
-                  expected.empty() ? kKeychainItemNotFound : kKeychainSuccess)
-            << i;
-        EXPECT_EQ(found, expected) << i;
+        EXPECT_EQ(keychain::copyMatchingReferences(query, &found),
+                  expected.empty() ? kKeychainItemNotFound : kKeychainSuccess);
+        EXPECT_EQ(found, expected);
     }
 }
 
 TEST_F(KeychainTest, UpdatesInPlace) {
     const auto first = added(password("a"), "old", Accessibility::AfterFirstUnlockThisDeviceOnly);
     added(password("b"), "other");
-    Changes changes;
-    changes.data = secretBytes(kSecret);
+    Changes changes = newData(kSecret);
     changes.accessibility = Accessibility::Always;
     changes.label = "new label";
     changes.accessGroup = "new group";
     EXPECT_EQ(keychain::update(byReference(first), changes), kKeychainSuccess);
-    Changes labelOnly;
-    labelOnly.label = "newer label";
-    EXPECT_EQ(keychain::update(byReference(first), labelOnly), kKeychainSuccess);
+    EXPECT_EQ(keychain::update(byReference(first), {{}, {}, "newer label", {}}), kKeychainSuccess);
 
     KeychainAttributes expected = password("a");
     expected.label = "newer label";
@@ -211,53 +174,49 @@ TEST_F(KeychainTest, UpdatesInPlace) {
     EXPECT_EQ(all.front(), first) << "an updated item keeps its age";
     EXPECT_EQ(keychain::update({password("nobody"), {}}, changes), kKeychainItemNotFound);
 
-    changes.data = secretBytes("all of them");
-    EXPECT_EQ(keychain::update({}, changes), kKeychainSuccess);
+    EXPECT_EQ(keychain::update({}, newData("all of them")), kKeychainSuccess);
     for (const auto& reference : all) EXPECT_EQ(valueOf(byReference(reference)), "all of them");
 }
 
 TEST_F(KeychainTest, RefusesRowsThatWereChangedFromOutside) {
-    const std::string cases[] = {
-        "UPDATE items SET sealed = (SELECT sealed FROM items WHERE account = 'other') WHERE account = "
-        "'victim'",
-        "UPDATE items SET account = 'renamed' WHERE account = 'victim'",
-        "UPDATE items SET service = NULL WHERE account = 'victim'",
-        "UPDATE items SET label = '' WHERE account = 'victim'",
-        "UPDATE items SET description = account WHERE account = 'victim'",
-        "UPDATE items SET access_group = 'theirs' WHERE account = 'victim'",
-        "UPDATE items SET key_class = 'private' WHERE account = 'victim'",
-        "UPDATE items SET application_value = 'v' WHERE account = 'victim'",
-        "UPDATE items SET accessibility = 0 WHERE account = 'victim'",
-        "UPDATE items SET accessibility = 2 WHERE account = 'victim'",
-        "UPDATE items SET accessibility = 77 WHERE account = 'victim'",
-        "UPDATE items SET sealed = x'' WHERE account = 'victim'",
-        "UPDATE items SET sealed = 'text' WHERE account = 'victim'",
-        "UPDATE items SET sealed = substr(sealed, 1, length(sealed) - 1) WHERE account = 'victim'",
-        "UPDATE items SET sealed = zeroblob(length(sealed)) WHERE account = 'victim'",
-        "UPDATE items SET account = account || 'x', sealed = (SELECT sealed FROM items WHERE account = "
-        "'other')"
-        " WHERE account = 'victim'",
+    const std::string sealOfOther = "sealed = (SELECT sealed FROM items WHERE account = 'other')";
+    const std::string changes[] = {sealOfOther,
+                                   "account = 'renamed'",
+                                   "service = NULL",
+                                   "label = ''",
+                                   "description = account",
+                                   "access_group = 'theirs'",
+                                   "key_class = 'private'",
+                                   "application_value = 'v'",
+                                   "accessibility = 0",
+                                   "accessibility = 2",
+                                   "accessibility = 77",
+                                   "sealed = x''",
+                                   "sealed = 'text'",
+                                   "sealed = substr(sealed, 1, length(sealed) - 1)",
+                                   "sealed = zeroblob(length(sealed))",
+                                   "account = account || 'x', " + sealOfOther};
+    const auto spoil = [](const std::string& change) {
+        edit("UPDATE items SET " + change + " WHERE account = 'victim'");
     };
+    const Changes fresh = newData("new");
     const auto other = added(password("other"), "unharmed");
     added(password("always"), "unharmed too", Accessibility::Always);
-    for (const auto& sql : cases) {
+    for (const auto& change : changes) {
+        SCOPED_TRACE(change);
         const auto victim = added(password("victim"));
-        edit(sql);
+        spoil(change);
         const FakeSystemLog log;
-        EXPECT_EQ(valueOf(byReference(victim)), kCorrupt) << sql;
-        EXPECT_TRUE(log.contains(hexText(victim))) << sql;
-        Changes changes;
-        changes.data = secretBytes("new");
-        EXPECT_EQ(keychain::update(byReference(victim), changes), kKeychainItemCorrupt) << sql;
-        EXPECT_FALSE(log.contains(kSecret)) << sql;
-        EXPECT_EQ(keychain::remove(byReference(victim)), kKeychainSuccess) << sql;
+        EXPECT_EQ(valueOf(byReference(victim)), kCorrupt);
+        EXPECT_TRUE(log.contains(hexText(victim)));
+        EXPECT_EQ(keychain::update(byReference(victim), fresh), kKeychainItemCorrupt);
+        EXPECT_FALSE(log.contains(kSecret));
+        EXPECT_EQ(keychain::remove(byReference(victim)), kKeychainSuccess);
     }
     // One bad item among several: none is changed.
     const auto victim = added(password("victim"));
-    edit(cases[0]);
-    Changes changes;
-    changes.data = secretBytes("new");
-    EXPECT_EQ(keychain::update({}, changes), kKeychainItemCorrupt);
+    spoil(sealOfOther);
+    EXPECT_EQ(keychain::update({}, fresh), kKeychainItemCorrupt);
     EXPECT_EQ(valueOf(byReference(other)), "unharmed");
     // Another item's id with that item's seal is still not that item.
     edit("DELETE FROM items WHERE account = 'other'");
@@ -307,13 +266,13 @@ TEST_F(KeychainTest, IsNotAvailableWithoutASoundDeviceKey) {
         fs::remove(path);
         if (content) TemporaryStateDirectory::writeFile(path, *content);
         const FakeSystemLog log;
-        EXPECT_EQ(valueOf(byReference(item)), kNotAvailable) << name;
-        EXPECT_TRUE(log.contains(path.string())) << name;
+        SCOPED_TRACE(name);
+        EXPECT_EQ(valueOf(byReference(item)), kNotAvailable);
+        EXPECT_TRUE(log.contains(path.string()));
         EXPECT_EQ(keychain::add(password("b"), Accessibility::Always, bytesOf(kSecret), nullptr),
-                  kKeychainNotAvailable)
-            << name;
-        EXPECT_EQ(fs::exists(path), content.has_value()) << name;
-        EXPECT_EQ(TemporaryStateDirectory::readFile(path), content.value_or("")) << "replaced: " << name;
+                  kKeychainNotAvailable);
+        EXPECT_EQ(fs::exists(path), content.has_value());
+        EXPECT_EQ(TemporaryStateDirectory::readFile(path), content.value_or("")) << "replaced";
     }
     fs::remove(path);
     fs::create_directory(path);
@@ -351,12 +310,8 @@ TEST_F(PassphraseTest, OpensAndClosesAllButTheAlwaysAccessible) {
     const auto always = byReference(added(password("b"), kSecret, Accessibility::Always));
     const auto set = [](std::string_view text) { return keychain::setPassphrase(bytesOf(text)); };
     const auto unlock = [](std::string_view text) { return keychain::unlock(bytesOf(text)); };
-    const struct {
-        const char* step;
-        std::function<KeychainStatus()> action;
-        KeychainStatus expected;
-        keychain::Protection after;
-    } steps[] = {
+    using Action = std::function<KeychainStatus()>;
+    const std::tuple<const char*, Action, KeychainStatus, keychain::Protection> steps[] = {
         {"nothing to unlock", [&] { return unlock("anything"); }, kKeychainSuccess, NoPassphrase},
         {"nothing to lock", keychain::lock, kKeychainSuccess, NoPassphrase},
         {"nothing to remove", keychain::removePassphrase, kKeychainSuccess, NoPassphrase},
@@ -375,13 +330,13 @@ TEST_F(PassphraseTest, OpensAndClosesAllButTheAlwaysAccessible) {
         {"lock no more", keychain::lock, kKeychainSuccess, NoPassphrase},
     };
     for (const auto& [step, action, expected, after] : steps) {
-        EXPECT_EQ(action(), expected) << step;
-        EXPECT_EQ(keychain::protection(), after) << step;
-        EXPECT_EQ(valueOf(item), after == Locked ? kLocked : kSecret) << step;
+        SCOPED_TRACE(step);
+        EXPECT_EQ(action(), expected);
+        EXPECT_EQ(keychain::protection(), after);
+        EXPECT_EQ(valueOf(item), after == Locked ? kLocked : kSecret);
         EXPECT_EQ(keychain::add(password(step), Accessibility::AfterFirstUnlock, bytesOf("x"), nullptr),
-                  after == Locked ? kKeychainLocked : kKeychainSuccess)
-            << step;
-        EXPECT_EQ(valueOf(always), kSecret) << step;
+                  after == Locked ? kKeychainLocked : kKeychainSuccess);
+        EXPECT_EQ(valueOf(always), kSecret);
         expectNoSecretInFiles();
     }
 }
@@ -394,9 +349,7 @@ TEST_F(PassphraseTest, EarlierCopiesOpenNothingThatCameLater) {
     ASSERT_EQ(keychain::setPassphrase(bytesOf(passphrase_)), kKeychainSuccess);
     EXPECT_EQ(valueOf(item), "old");
     EXPECT_EQ(valueOf(corrupt), kCorrupt);
-    Changes changes;
-    changes.data = secretBytes(kSecret);
-    ASSERT_EQ(keychain::update(item, changes), kKeychainSuccess);
+    ASSERT_EQ(keychain::update(item, newData(kSecret)), kKeychainSuccess);
     edit("CREATE TABLE sound AS SELECT * FROM class_keys");
     edit("INSERT OR REPLACE INTO class_keys SELECT * FROM earlier");
     EXPECT_EQ(valueOf(item), kCorrupt);
@@ -407,10 +360,7 @@ TEST_F(PassphraseTest, EarlierCopiesOpenNothingThatCameLater) {
 TEST_F(PassphraseTest, DamageIsToldFromAWrongPassphrase) {
     const auto item = byReference(added(password("a")));
     ASSERT_EQ(keychain::setPassphrase(bytesOf(passphrase_)), kKeychainSuccess);
-    const struct {
-        const char* change;
-        KeychainStatus unlocking;
-    } cases[] = {
+    const std::pair<const char*, KeychainStatus> cases[] = {
         {"wrapped = x''", kKeychainNotAvailable},
         {"wrapped = 'text'", kKeychainNotAvailable},
         {"wrapped = substr(wrapped, 1, 20)", kKeychainNotAvailable},

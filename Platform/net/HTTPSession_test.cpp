@@ -1,162 +1,20 @@
-// Against a real TLS server: Python's, with certificates of an authority made for the test.
+// Against a real TLS server.
 #include "Platform/net/HTTPSession.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
-#include <array>
 #include <atomic>
 #include <chrono>
-#include <cstdlib>
-#include <filesystem>
-#include <fstream>
 #include <mutex>
 #include <thread>
 
 #include "Platform/runtime/Clock.h"
+#include "TestSupport/TestHTTPServer.h"
 
 namespace platform {
 namespace {
 
 using namespace std::literals;
-
-/// Prints the ports of a server whose certificate names localhost, of one whose certificate does not, of one
-/// that an unknown authority vouches for, and of one without TLS. What it does depends on the path.
-constexpr const char* kServerScript = R"python(
-import http.server, json, ssl, sys, threading, time
-
-class Handler(http.server.BaseHTTPRequestHandler):
-    protocol_version = "HTTP/1.1"
-
-    def log_message(self, *arguments): pass
-
-    def send(self, status, body, length=None, headers={}):
-        self.send_response(status)
-        self.send_header("Content-Length", str(len(body) if length is None else length))
-        for name, value in headers.items(): self.send_header(name, value)
-        self.end_headers()
-        self.wfile.write(body)
-
-    def do_GET(self):
-        body = self.rfile.read(int(self.headers.get("Content-Length", 0)))
-        self.close_connection = True
-        if self.path == "/echo":
-            self.send(200, json.dumps([self.command, self.headers.items(), body.decode()]).encode(),
-                      headers={"Set-Cookie": "a=b"})
-        elif self.path == "/status": self.send(500, b"<html>oops</html>")
-        elif self.path == "/empty": self.send(204, b"")
-        elif self.path == "/half": self.send(200, b"<methodResp")
-        elif self.path == "/continue":
-            self.wfile.write(b"HTTP/1.1 100 Continue\r\n\r\nHTTP/1.1 103 Early Hints\r\n\r\n")
-            self.send(200, b"after")
-        elif self.path == "/redirect": self.send(302, b"", headers={"Location": "/echo"})
-        elif self.path == "/limit": self.send(200, b"x" * (16 << 20))
-        elif self.path == "/announced": self.send(200, b"x", length=17 << 20)
-        elif self.path == "/unannounced":
-            self.wfile.write(b"HTTP/1.0 200 OK\r\n\r\n")
-            for _ in range(17): self.wfile.write(b"x" * (1 << 20))
-        elif self.path == "/close-inside": self.send(200, b"half", length=8)
-        elif self.path == "/silence":
-            self.send(200, b"x", length=2)
-            self.rfile.read()
-
-    do_POST = do_PUT = do_GET
-
-class Server(http.server.ThreadingHTTPServer):
-    request_queue_size = 64
-
-    def __init__(self, certificate):
-        super().__init__(("127.0.0.1", 0), Handler)
-        if certificate:
-            context = ssl.SSLContext(ssl.PROTOCOL_TLS_SERVER)
-            context.load_cert_chain(certificate + ".crt", certificate + ".key")
-            self.socket = context.wrap_socket(self.socket, server_side=True)
-        threading.Thread(target=self.serve_forever, daemon=True).start()
-
-    def handle_error(self, *arguments): pass
-
-servers = [Server(name) for name in sys.argv[1:]] + [Server(None)]
-print(*(server.server_port for server in servers), flush=True)
-sys.stdin.read()
-)python";
-
-constexpr const char* kMakeCertificates = R"shell(
-set -e
-key() { openssl ecparam -name prime256v1 -genkey -noout -out "$1.key"; }
-authority() {
-  key "$1"
-  openssl req -x509 -new -key "$1.key" -subj "/CN=$1" -days 2 -out "$1.crt"
-}
-certificate() {
-  key "$1"
-  openssl req -new -key "$1.key" -subj "/CN=$1" -out "$1.csr"
-  printf 'subjectAltName=%s' "$3" > "$1.ext"
-  openssl x509 -req -in "$1.csr" -CA "$2.crt" -CAkey "$2.key" -CAcreateserial -days 2 -extfile "$1.ext" -out "$1.crt"
-}
-authority known
-authority unknown
-certificate good known DNS:localhost
-certificate wrong-name known DNS:elsewhere.example
-certificate stranger unknown DNS:localhost
-)shell";
-
-/// The server, for as long as the object lives.
-class Server {
-  public:
-    enum Kind { Good, WrongName, Stranger, Plain };
-
-    Server() {
-        char pattern[] = "/tmp/https-test-XXXXXX";
-        directory_ = mkdtemp(pattern);
-        const std::string make = "cd " + directory_ + " && { " + kMakeCertificates + "} >make.log 2>&1";
-        if (std::system(make.c_str()) != 0) throw std::runtime_error("cannot make certificates");
-        std::ofstream(directory_ + "/server.py") << kServerScript;
-        setenv("SSL_CERT_FILE", (directory_ + "/known.crt").c_str(), 1);
-        run();
-    }
-
-    ~Server() {
-        close(input_);
-        waitpid(process_, nullptr, 0);
-        std::filesystem::remove_all(directory_);
-    }
-    Server(const Server&) = delete;
-    Server& operator=(const Server&) = delete;
-
-    std::string url(const std::string& path, Kind kind = Good, const std::string& scheme = "https") const {
-        return scheme + "://localhost:" + std::to_string(ports_.at(kind)) + path;
-    }
-
-  private:
-    void run() {
-        std::array<int, 2> in{};
-        std::array<int, 2> out{};
-        if (pipe2(in.data(), O_CLOEXEC) != 0 || pipe2(out.data(), O_CLOEXEC) != 0)
-            throw std::runtime_error("pipe");
-        process_ = fork();
-        if (process_ == 0) {
-            dup2(in[0], STDIN_FILENO);
-            dup2(out[1], STDOUT_FILENO);
-            if (chdir(directory_.c_str()) == 0)
-                execl("/usr/bin/python3", "python3", "server.py", "good", "wrong-name", "stranger", nullptr);
-            _exit(1);
-        }
-        close(in[0]);
-        close(out[1]);
-        input_ = in[1];
-        FILE* lines = fdopen(out[0], "r");
-        for (int& port : ports_)
-            if (std::fscanf(lines, "%d", &port) != 1) throw std::runtime_error("the server does not run");
-        std::fclose(lines);
-    }
-
-    std::string directory_;
-    pid_t process_ = 0;
-    int input_ = -1;
-    std::array<int, 4> ports_{};
-};
 
 /// Collects the events of one exchange.
 class Outcome : public HTTPSessionEvents {
@@ -212,7 +70,7 @@ std::shared_ptr<Outcome> exchange(const HTTPRequest& request,
 }
 
 TEST(HTTPSession, SendsExactlyTheRequestAndDeliversTheResponse) {
-    const Server server;
+    const TestHTTPServer server;
     HTTPRequest request = requestTo(server.url("/echo"));
     request.method = "POST";
     request.body = std::string(3000, 'b').c_str();
@@ -225,7 +83,7 @@ TEST(HTTPSession, SendsExactlyTheRequestAndDeliversTheResponse) {
     const auto outcome = exchange(request);
     EXPECT_FALSE(outcome->error);
     EXPECT_EQ(outcome->statuses, std::vector{200});
-    const std::string host = server.url("", Server::Good).substr(strlen("https://"));
+    const std::string host = server.url("", TestHTTPServer::Good).substr(strlen("https://"));
     EXPECT_EQ(outcome->body,
               R"(["POST", [["Host", ")" + host +
                   R"("], ["content-type", "text/xml"], ["Accept", "text/xml"], ["User-Agent", "test"], )"
@@ -237,16 +95,10 @@ TEST(HTTPSession, SendsExactlyTheRequestAndDeliversTheResponse) {
 }
 
 TEST(HTTPSession, KeepsOutcomesApart) {
-    struct Case {
-        const char* path;
-        std::vector<int> statuses;
-        std::optional<int> error;
-        size_t bodyBytes;
-    };
     constexpr int kPartial = 18;
     constexpr int kTooLarge = 63;
     constexpr int kNoAnswer = 52;
-    const Case cases[] = {
+    const std::tuple<const char*, std::vector<int>, std::optional<int>, size_t> cases[] = {
         {"/status", {500}, std::nullopt, strlen("<html>oops</html>")},
         {"/empty", {204}, std::nullopt, 0},
         {"/half", {200}, std::nullopt, strlen("<methodResp")},
@@ -258,44 +110,39 @@ TEST(HTTPSession, KeepsOutcomesApart) {
         {"/close-inside", {200}, kPartial, 4},
         {"/close-before", {}, kNoAnswer, 0},
     };
-    const Server server;
-    for (const Case& each : cases) {
-        const auto outcome = exchange(requestTo(server.url(each.path)));
-        EXPECT_EQ(outcome->statuses, each.statuses) << each.path;
-        EXPECT_EQ(outcome->error ? std::optional(outcome->error->code) : std::nullopt, each.error)
-            << each.path;
-        if (each.error == kTooLarge) {
-            EXPECT_LE(outcome->body.size(), each.bodyBytes) << each.path;
+    const TestHTTPServer server;
+    for (const auto& [path, statuses, error, bodyBytes] : cases) {
+        SCOPED_TRACE(path);
+        const auto outcome = exchange(requestTo(server.url(path)));
+        EXPECT_EQ(outcome->statuses, statuses);
+        EXPECT_EQ(outcome->error ? std::optional(outcome->error->code) : std::nullopt, error);
+        if (error == kTooLarge) {
+            EXPECT_LE(outcome->body.size(), bodyBytes);
         } else {
-            EXPECT_EQ(outcome->body.size(), each.bodyBytes) << each.path;
+            EXPECT_EQ(outcome->body.size(), bodyBytes);
         }
     }
 }
 
 TEST(HTTPSession, TalksOnlyToServersThatItCanVerify) {
-    struct Case {
-        const char* what;
-        Server::Kind kind;
-        const char* scheme;
-        int code;
-    };
     constexpr int kBadCertificate = 60;
     constexpr int kNoSuchProtocol = 1;
     constexpr int kNoTLS = 35;
-    const Case cases[] = {
-        {"a name that the certificate lacks", Server::WrongName, "https", kBadCertificate},
-        {"an authority that nobody trusts", Server::Stranger, "https", kBadCertificate},
-        {"no TLS behind https", Server::Plain, "https", kNoTLS},
-        {"plain http", Server::Plain, "http", kNoSuchProtocol},
-        {"a protocol of files", Server::Plain, "ftp", kNoSuchProtocol},
+    const std::tuple<const char*, TestHTTPServer::Kind, const char*, int> cases[] = {
+        {"a name that the certificate lacks", TestHTTPServer::WrongName, "https", kBadCertificate},
+        {"an authority that nobody trusts", TestHTTPServer::Stranger, "https", kBadCertificate},
+        {"no TLS behind https", TestHTTPServer::Plain, "https", kNoTLS},
+        {"plain http", TestHTTPServer::Plain, "http", kNoSuchProtocol},
+        {"a protocol of files", TestHTTPServer::Plain, "ftp", kNoSuchProtocol},
     };
-    const Server server;
-    for (const Case& each : cases) {
-        const auto outcome = exchange(requestTo(server.url("/echo", each.kind, each.scheme)));
-        ASSERT_TRUE(outcome->error) << each.what;
-        EXPECT_EQ(outcome->error->code, each.code) << each.what;
-        EXPECT_FALSE(outcome->error->description.empty()) << each.what;
-        EXPECT_TRUE(outcome->body.empty()) << each.what;
+    const TestHTTPServer server;
+    for (const auto& [what, kind, scheme, code] : cases) {
+        SCOPED_TRACE(what);
+        const auto outcome = exchange(requestTo(server.url("/echo", kind, scheme)));
+        ASSERT_TRUE(outcome->error);
+        EXPECT_EQ(outcome->error->code, code);
+        EXPECT_FALSE(outcome->error->description.empty());
+        EXPECT_TRUE(outcome->body.empty());
     }
     // Without the variable the system's authorities count, and none of those knows this server's.
     unsetenv("SSL_CERT_FILE");
@@ -318,7 +165,7 @@ TEST(HTTPSession, RefusesHeaderFieldsThatWouldEndAndStartAnother) {
 }
 
 TEST(HTTPSession, AChallengeThatIsTurnedDownEndsTheExchange) {
-    const Server server;
+    const TestHTTPServer server;
     auto outcome = std::make_shared<Outcome>();
     outcome->answer = ChallengeAnswer::Cancel;
     const auto session = HTTPSession::create(outcome);
@@ -329,7 +176,7 @@ TEST(HTTPSession, AChallengeThatIsTurnedDownEndsTheExchange) {
 }
 
 TEST(HTTPSession, DeliversOnTheEventQueueInOrder) {
-    const Server server;
+    const TestHTTPServer server;
     const auto outcome = exchange(requestTo(server.url("/limit")), WorkQueue("events"));
     EXPECT_EQ(outcome->queueLabel, "events");
     EXPECT_EQ(outcome->statuses, std::vector{200});
@@ -345,7 +192,7 @@ void waitUntilOver(std::shared_ptr<HTTPSession>& session) {
 
 TEST(HTTPSession, ACancelledExchangeEndsAtOnceAndInSilence) {
     constexpr auto kMuchLessThanAnExchangeMayTake = 20s;
-    const Server server;
+    const TestHTTPServer server;
     const auto outcome = std::make_shared<Outcome>();
     auto session = HTTPSession::create(outcome);
     session->start(requestTo(server.url("/silence")));

@@ -3,57 +3,42 @@
 #include <gtest/gtest.h>
 
 #include <array>
-#include <cstdlib>
-#include <filesystem>
-#include <limits>
 #include <random>
-#include <string>
 #include <tuple>
-#include <utility>
 #include <vector>
 
 #include "TestSupport/PropertyListCases.h"
-#include "TestSupport/TemporaryStateDirectory.h"
 
 namespace platform {
 namespace {
 
 std::string readBack(Bytes list) { return readBack(list, readBinaryPropertyList); }
 
-void writeSample(ValueSink& sink) {
+/// An array of the same element.
+ValueWriter repeated(int times, ValueWriter element) {
+    return [=](ValueSink& sink) {
+        sink.beginArray();
+        for (int i = 0; i < times; ++i) element(sink);
+        sink.endArray();
+    };
+}
+
+/// The sample of both forms, and what only this form has or writes in several ways.
+void writeLargeSample(ValueSink& sink) {
     const std::array<uint8_t, 16> uuid = {1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16};
     const std::string longText(300, 'x');
-    sink.beginDictionary();
-    sink.key("null"), sink.null();
-    sink.key("booleans"), sink.beginArray(), sink.boolean(true), sink.boolean(false), sink.endArray();
-    sink.key("integers"), sink.beginArray();
-    for (const int64_t value :
-         {int64_t{0}, int64_t{-1}, int64_t{127}, int64_t{128}, int64_t{255}, int64_t{256}, int64_t{65535},
-          int64_t{65536}, int64_t{UINT32_MAX}, int64_t{UINT32_MAX} + 1, INT64_MAX, INT64_MIN}) {
-        sink.integer(value);
-    }
-    sink.unsignedInteger(UINT64_MAX), sink.unsignedInteger(uint64_t{1} << 63U), sink.endArray();
-    sink.key("reals"), sink.beginArray(), sink.real(0.1), sink.real(-0.0), sink.singleReal(1.5F);
-    sink.real(std::numeric_limits<double>::infinity()), sink.endArray();
-    sink.key("dates"), sink.beginArray(), sink.date(1700000000.25), sink.date(0), sink.date(-5e9),
-        sink.endArray();
-    sink.key("uuid"), sink.uuid(uuid);
-    sink.key("data"), sink.beginArray(), sink.data({}), sink.data(uuid), sink.data(bytesOf(longText)),
-        sink.endArray();
-    sink.key("texts"), sink.beginArray();
-    for (const std::string_view text :
-         {"", "plain", "\x7F", "Zoë", "\u07FF\u0800\uFFFD", "\U00010000\U0010FFFF", "plain"}) {
-        sink.string(text);
-    }
-    sink.string(longText), sink.string(std::string_view("a\0b", 3)), sink.endArray();
-    sink.key("Schlüssel"), sink.beginDictionary(), sink.endDictionary();
-    sink.key(""), sink.beginArray(), sink.endArray();
-    sink.endDictionary();
+    sink.beginArray(), writeSample(sink), sink.null(), sink.singleReal(1.5F), sink.uuid(uuid);
+    for (const int64_t value : {127, 128, 255, 256, 65535, 65536}) sink.integer(value);
+    sink.integer(UINT32_MAX), sink.integer(int64_t{UINT32_MAX} + 1);
+    for (const double seconds : {1700000000.25, -5e9}) sink.date(seconds);
+    sink.data(uuid), sink.data(bytesOf(longText)), sink.string(longText);
+    for (const std::string_view text : {"plain", "Zoë", "plain"}) sink.string(text);
+    sink.string(std::string_view("a\0b", 3)), sink.endArray();
 }
 
 TEST(PropertyList, EveryKindReadsBackAsWritten) {
     const std::pair<const char*, ValueWriter> cases[] = {
-        {"sample", writeSample},
+        {"sample", writeLargeSample},
         {"deepest", nested(kMaxPropertyListDepth)},
         {"many members",
          [](ValueSink& sink) {
@@ -95,16 +80,13 @@ TEST(PropertyList, RefusesToWriteWhatCouldNotBeRead) {
 }
 
 TEST(PropertyList, SharesEqualTexts) {
-    const auto list = writeBinaryPropertyList([](ValueSink& sink) {
-        sink.beginArray();
-        for (int i = 0; i < 100; ++i) sink.string("the same text of some length");
-        sink.endArray();
-    });
+    const auto list = writeBinaryPropertyList(
+        repeated(100, [](ValueSink& sink) { sink.string("the same text of some length"); }));
     EXPECT_LT(list.size(), 250U);
 }
 
 TEST(PropertyList, DamagedListsAreRefusedOrAreOtherLists) {
-    const SecretBytes list = writeBinaryPropertyList(writeSample);
+    const SecretBytes list = writeBinaryPropertyList(writeLargeSample);
     for (size_t size = 0; size < list.size(); ++size) {
         // A copy of exactly this size, so that reading beyond it is seen.
         EXPECT_EQ(readBack(SecretBytes(list.begin(), list.begin() + static_cast<ptrdiff_t>(size))), "refused")
@@ -144,10 +126,7 @@ SecretBytes listOf(const std::vector<std::vector<uint8_t>>& objects) {
 }
 
 TEST(PropertyList, ReadsOtherWritersForms) {
-    const struct {
-        std::vector<std::vector<uint8_t>> objects;
-        const char* text;
-    } cases[] = {
+    const std::pair<std::vector<std::vector<uint8_t>>, const char*> cases[] = {
         {{{0x13, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFE}}, "i-2"},
         {{{0x12, 0xFF, 0xFF, 0xFF, 0xFE}}, "i4294967294"},
         {{{0x14, 0, 0, 0, 0, 0, 0, 0, 0, 0x7F, 0, 0, 0, 0, 0, 0, 0}}, "i9151314442816847872"},
@@ -158,7 +137,7 @@ TEST(PropertyList, ReadsOtherWritersForms) {
         {{{0xAF, 0x10, 1, 1}, {0x00}}, "[ null ]"},
         {{{0x5F, 0x13, 0, 0, 0, 0, 0, 0, 0, 1, 'z'}}, "\"z\""},
     };
-    for (const auto& test : cases) EXPECT_EQ(readBack(listOf(test.objects)), test.text);
+    for (const auto& [objects, text] : cases) EXPECT_EQ(readBack(listOf(objects)), text);
 }
 
 TEST(PropertyList, RefusesHostileLists) {
@@ -259,20 +238,11 @@ TEST(PropertyList, SharedObjectsCannotMultiplyBeyondTheLimits) {
 
     // A mebibyte of text a hundred times over: few objects, too much payload.
     const std::string megabyte(1U << 20U, 'x');
-    const auto repeated = [&](int times) {
-        return [&megabyte, times](ValueSink& sink) {
-            sink.beginArray();
-            for (int i = 0; i < times; ++i) sink.data(bytesOf(megabyte));
-            sink.endArray();
-        };
-    };
-    EXPECT_FALSE(writeBinaryPropertyList(repeated(2)).empty());
-    EXPECT_TRUE(writeBinaryPropertyList(repeated(65)).empty());
-    const SecretBytes list = writeBinaryPropertyList([&](ValueSink& sink) {
-        sink.beginArray();
-        for (int i = 0; i < 60; ++i) sink.string(megabyte);
-        sink.endArray();
-    });
+    const auto data = [&](ValueSink& sink) { sink.data(bytesOf(megabyte)); };
+    EXPECT_FALSE(writeBinaryPropertyList(repeated(2, data)).empty());
+    EXPECT_TRUE(writeBinaryPropertyList(repeated(65, data)).empty());
+    const SecretBytes list =
+        writeBinaryPropertyList(repeated(60, [&](ValueSink& sink) { sink.string(megabyte); }));
     ASSERT_LT(list.size(), 2U << 20U);
     EXPECT_NE(readBack(list), "refused");
 }

@@ -6,10 +6,9 @@
 #include <atomic>
 #include <chrono>
 #include <mutex>
-#include <thread>
-#include <vector>
 
 #include "Platform/runtime/WorkQueue.h"
+#include "TestSupport/SideBySide.h"
 
 namespace platform {
 namespace {
@@ -78,7 +77,7 @@ TEST_F(ClockTest, ACancelledTimerNeverFires) {
 }
 
 TEST_F(ClockTest, EveryTimerEitherFiresOrIsCancelled) {
-    constexpr size_t kThreads = 4;
+    constexpr int kThreads = 4;
     constexpr size_t kTimers = 500;
     std::array<std::atomic<int>, kThreads * kTimers> ends{};
     std::atomic<size_t> ended = 0;
@@ -87,20 +86,16 @@ TEST_F(ClockTest, EveryTimerEitherFiresOrIsCancelled) {
         ++ends[index];
         if (++ended == ends.size()) allEnded.signal();
     };
-    std::vector<std::thread> threads;
-    for (size_t thread = 0; thread < kThreads; ++thread) {
-        threads.emplace_back([&, thread] {
-            std::vector<Clock::TimerID> timers;
-            for (size_t i = 0; i < kTimers; ++i) {
-                const size_t index = thread * kTimers + i;
-                timers.push_back(clock_.callAfter(static_cast<double>(i % 10) * 0.001,
-                                                  i % 2 == 0 ? Clock::Use::WaitForDate : Clock::Use::Task,
-                                                  [&end, index] { end(index); }));
-                if (i % 3 == 0 && clock_.cancel(timers[i / 2])) end(thread * kTimers + i / 2);
-            }
-        });
-    }
-    for (std::thread& thread : threads) thread.join();
+    sideBySide(kThreads, [&](int thread) {
+        const size_t first = static_cast<size_t>(thread) * kTimers;
+        std::vector<Clock::TimerID> timers;
+        for (size_t i = 0; i < kTimers; ++i) {
+            timers.push_back(clock_.callAfter(static_cast<double>(i % 10) * 0.001,
+                                              i % 2 == 0 ? Clock::Use::WaitForDate : Clock::Use::Task,
+                                              [&end, index = first + i] { end(index); }));
+            if (i % 3 == 0 && clock_.cancel(timers[i / 2])) end(first + i / 2);
+        }
+    });
     ASSERT_TRUE(allEnded.wait(kBound));
     for (const auto& count : ends) ASSERT_EQ(count, 1);
 }

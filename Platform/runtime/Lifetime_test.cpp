@@ -3,34 +3,30 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
-#include <string>
 #include <thread>
-#include <utility>
 
 #include "Platform/runtime/Clock.h"
-#include "Platform/runtime/WorkQueue.h"
+#include "TestSupport/Journal.h"
 #include "TestSupport/TestLifetime.h"
 
 namespace platform {
 namespace {
 
 /// What the states of a test have done.
-std::string& journal() {
-    static std::string text;
-    return text;
+Journal& journal() {
+    static Journal events;
+    return events;
 }
-
-std::string takeJournal() { return std::exchange(journal(), {}); }
 
 template <char Name>
 struct Recorded {
-    Recorded() { journal() += std::string("+") + Name; }
-    ~Recorded() { journal() += std::string("-") + Name; }
+    Recorded() { journal().add(std::string("+") + Name); }
+    ~Recorded() { journal().add(std::string("-") + Name); }
     Recorded(const Recorded&) = delete;
     Recorded& operator=(const Recorded&) = delete;
     void lifetimeEnds() {
         EXPECT_TRUE(Lifetime::current().isEnding());
-        journal() += std::string("!") + Name;
+        journal().add(std::string("!") + Name);
     }
 };
 
@@ -49,7 +45,7 @@ class LifetimeTest : public testing::Test {
   protected:
     LifetimeTest() { TestLifetime::end(); }
     ~LifetimeTest() override { TestLifetime::begin(); }
-    void TearDown() override { takeJournal(); }
+    void TearDown() override { journal().take(); }
 };
 
 using LifetimeDeathTest = LifetimeTest;
@@ -58,12 +54,12 @@ TEST_F(LifetimeTest, StatesAreMadeOnceAndEndInReverseOrder) {
     for (int life = 0; life < 2; ++life) {
         {
             const Lifetime lifetime({});
-            EXPECT_EQ(takeJournal(), "");
+            EXPECT_EQ(journal().take(), "");
             EXPECT_EQ(&state<'a'>(), &state<'a'>());
             Lifetime::current().state<Upper>();
-            EXPECT_EQ(takeJournal(), "+a+u+l");
+            EXPECT_EQ(journal().take(), "+a +u +l");
         }
-        EXPECT_EQ(takeJournal(), "!u!l!a-u-l-a");
+        EXPECT_EQ(journal().take(), "!u !l !a -u -l -a");
     }
 }
 

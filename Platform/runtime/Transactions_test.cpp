@@ -15,13 +15,12 @@ TEST(TransactionsTest, IdleTimeCountsFromTheEndOfTheLastOne) {
         /// How many begin (or end) then.
         int change;
     };
-    struct Case {
+    const struct {
         const char* what;
         std::vector<Step> steps;
         /// When the process is found idle for ten seconds; 0 for not within a hundred.
-        double idleAt;
-    };
-    const Case cases[] = {
+        double expected;
+    } cases[] = {
         {"nothing was open yet", {}, 0},
         {"one", {{1, 1}, {3, -1}}, 13},
         {"again before the time is over", {{0, 1}, {1, -1}, {9, 1}, {9.5, -1}}, 19.5},
@@ -30,7 +29,7 @@ TEST(TransactionsTest, IdleTimeCountsFromTheEndOfTheLastOne) {
         {"never closed", {{0, 1}, {1, -1}, {2, 1}}, 0},
         {"two at a time", {{0, 2}, {1, -1}, {20, -1}}, 30},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, steps, expected] : cases) {
         SimulatedClock clock;
         const double start = clock.now();
         double idleAt = 0;
@@ -39,14 +38,14 @@ TEST(TransactionsTest, IdleTimeCountsFromTheEndOfTheLastOne) {
             idleAt = clock.now() - start;
             ++calls;
         });
-        for (const Step& step : each.steps) {
+        for (const Step& step : steps) {
             clock.advanceBy(step.at - (clock.now() - start));
             for (int i = 0; i < step.change; ++i) began();
             for (int i = 0; i > step.change; --i) ended();
         }
         clock.advanceBy(100 - (clock.now() - start));
-        EXPECT_DOUBLE_EQ(idleAt, each.idleAt) << each.what;
-        EXPECT_EQ(calls, each.idleAt > 0 ? 1 : 0) << each.what;
+        EXPECT_DOUBLE_EQ(idleAt, expected) << what;
+        EXPECT_EQ(calls, expected > 0 ? 1 : 0) << what;
         while (openCount() > 0) ended();
         clock.advanceBy(20);
     }

@@ -6,11 +6,9 @@
 #include <atomic>
 #include <cmath>
 #include <memory>
-#include <mutex>
-#include <string>
-#include <thread>
-#include <vector>
 
+#include "TestSupport/Journal.h"
+#include "TestSupport/SideBySide.h"
 #include "TestSupport/SimulatedClock.h"
 
 namespace platform {
@@ -19,40 +17,6 @@ namespace {
 constexpr double kDay = 86'400;
 /// Far beyond what anything here takes: a wait that reaches it has failed.
 constexpr double kBound = 60;
-
-/// What happened, in order.
-class Journal {
-  public:
-    void add(const std::string& event) {
-        const std::lock_guard lock(mutex_);
-        text_ += text_.empty() ? event : " " + event;
-    }
-    std::string take() {
-        const std::lock_guard lock(mutex_);
-        return std::exchange(text_, {});
-    }
-
-  private:
-    std::mutex mutex_;
-    std::string text_;
-};
-
-/// Occupies a queue from construction until it is opened.
-class Gate {
-  public:
-    explicit Gate(const WorkQueue& queue) {
-        queue.async([started = started_, opened = opened_] {
-            started.signal();
-            opened.wait();
-        });
-        started_.wait();
-    }
-    void open() const { opened_.signal(); }
-
-  private:
-    Semaphore started_;
-    Semaphore opened_;
-};
 
 TEST(WorkQueueTest, RunsTasksOneByOneInTheOrderInWhichTheyCame) {
     const WorkQueue queue("one");
@@ -154,18 +118,16 @@ TEST(WorkQueueTest, DelayedTasksRunAtTheirTimes) {
     SimulatedClock clock(1000);
     const WorkQueue queue("delayed");
     Journal journal;
-    const auto after = [&](double seconds, const std::string& name) {
-        queue.asyncAfter(seconds, [&clock, &journal, name] {
+    for (const auto& [seconds, name] : {std::pair(30 * kDay, "month"),
+                                        {3, "late"},
+                                        {2, "tie1"},
+                                        {2, "tie2"},
+                                        {0, "zero"},
+                                        {-5, "negative"},
+                                        {std::nan(""), "nan"}})
+        queue.asyncAfter(seconds, [&clock, &journal, name = std::string(name)] {
             journal.add(name + "@" + std::to_string(std::lround(clock.now() - 1000)));
         });
-    };
-    after(30 * kDay, "month");
-    after(3, "late");
-    after(2, "tie1");
-    after(2, "tie2");
-    after(0, "zero");
-    after(-5, "negative");
-    after(std::nan(""), "nan");
     clock.settle();
     EXPECT_EQ(journal.take(), "zero@0 negative@0 nan@0");
     clock.advanceBy(1.999);
@@ -213,7 +175,7 @@ TEST(WorkQueueTest, TheMainQueueWaitsForTheLoopThatHasAdoptedIt) {
 
 TEST(WorkQueueTest, ManyThreadsHammerManyQueues) {
     constexpr size_t kQueues = 12;
-    constexpr unsigned kThreads = 8;
+    constexpr int kThreads = 8;
     constexpr unsigned kRounds = 2000;
     struct Counted {
         WorkQueue queue{"hammered"};
@@ -222,57 +184,43 @@ TEST(WorkQueueTest, ManyThreadsHammerManyQueues) {
     };
     std::array<Counted, kQueues> all;
     std::atomic<uint64_t> done = 0;
-    std::vector<std::thread> threads;
-    for (unsigned seed = 0; seed < kThreads; ++seed) {
-        threads.emplace_back([&, random = 2 * seed + 1]() mutable {
-            const auto add = [&](Counted& counted) {
-                ++counted.count;
-                done.fetch_add(1);
-            };
-            for (unsigned round = 0; round < kRounds; ++round) {
-                random = random * 1'664'525U + 1'013'904'223U;
-                // Always from a lower queue onto a higher one, so that no two of them wait for each other.
-                const size_t low = (random >> 8U) % (kQueues - 1);
-                const size_t high = low + 1 + (random >> 16U) % (kQueues - 1 - low);
-                Counted& a = all[low];
-                Counted& b = all[high];
-                switch ((random >> 24U) % 4) {
-                    case 0:
-                        a.queue.async([&a, add] { add(a); });
-                        break;
-                    case 1:
-                        a.queue.async([&, add] { b.queue.sync([&] { add(b); }); });
-                        break;
-                    case 2:
-                        a.queue.sync([&] { b.queue.sync([&] { add(b); }); });
-                        break;
-                    default:
-                        if (!a.queue.tryRunNow([&] { add(a); })) a.queue.async([&a, add] { add(a); });
-                }
-            }
-        });
-    }
-    for (std::thread& thread : threads) thread.join();
+    const auto add = [&](Counted& counted) {
+        ++counted.count;
+        done.fetch_add(1);
+    };
+    sideBySide(kThreads, [&](int seed) {
+        unsigned random = 2 * static_cast<unsigned>(seed) + 1;
+        for (unsigned round = 0; round < kRounds; ++round) {
+            random = random * 1'664'525U + 1'013'904'223U;
+            // Always from a lower queue onto a higher one, so that no two of them wait for each other.
+            const size_t low = (random >> 8U) % (kQueues - 1);
+            const size_t high = low + 1 + (random >> 16U) % (kQueues - 1 - low);
+            Counted& a = all[low];
+            Counted& b = all[high];
+            const unsigned way = (random >> 24U) % 4;
+            if (way == 0 || (way == 3 && !a.queue.tryRunNow([&] { add(a); })))
+                a.queue.async([&a, add] { add(a); });
+            else if (way == 1)
+                a.queue.async([&b, add] { b.queue.sync([&] { add(b); }); });
+            else if (way == 2)
+                a.queue.sync([&] { b.queue.sync([&] { add(b); }); });
+        }
+    });
     uint64_t sum = 0;
     // From the lowest upwards: what is queued on one may still reach the ones above.
     for (Counted& counted : all) counted.queue.sync([] {});
     for (Counted& counted : all) sum += counted.queue.sync([&] { return counted.count; });
-    EXPECT_EQ(sum, uint64_t{kThreads} * kRounds);
+    EXPECT_EQ(sum, kThreads * kRounds);
     EXPECT_EQ(done, sum);
 }
 
 TEST(SemaphoreTest, CountsSignals) {
-    struct Case {
-        long initial;
-        int signals;
-        int taken;
-    };
-    for (const auto& [initial, signals, taken] :
-         std::initializer_list<Case>{{0, 0, 0}, {2, 0, 2}, {0, 3, 3}, {1, 1, 2}}) {
+    for (const auto& [initial, signals] : {std::pair(0, 0), {2, 0}, {0, 3}, {1, 1}}) {
         const Semaphore semaphore(initial);
         const Semaphore same = semaphore;
         for (int i = 0; i < signals; ++i) same.signal();
-        for (int i = 0; i < taken; ++i) EXPECT_TRUE(semaphore.wait(0)) << initial << "+" << signals;
+        for (int i = 0; i < initial + signals; ++i)
+            EXPECT_TRUE(semaphore.wait(0)) << initial << "+" << signals;
         for (const double seconds : {0.0, -1.0, std::nan("")}) EXPECT_FALSE(semaphore.wait(seconds));
     }
 }

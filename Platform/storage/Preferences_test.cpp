@@ -1,18 +1,13 @@
 #include "Platform/storage/Preferences.h"
 
 #include <gtest/gtest.h>
-#include <pwd.h>
-#include <sqlite3.h>
 
-#include <filesystem>
 #include <stdexcept>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/RecordingSink.h"
-#include "TestSupport/TemporaryStateDirectory.h"
+#include "TestSupport/SQLiteEdit.h"
 
 namespace platform {
 namespace {
@@ -80,13 +75,9 @@ TEST_F(PreferencesTest, SetsAllOrNothing) {
 
 TEST_F(PreferencesTest, ADamagedValueIsToldApartAndHarmsNoOther) {
     ASSERT_TRUE(domain_.set({{"bad", text("confidential")}, {"good", text("fine")}}));
-    sqlite3* database = nullptr;
-    ASSERT_EQ(sqlite3_open(TemporaryStateDirectory::file("preferences.db").c_str(), &database), SQLITE_OK);
-    for (const char* damaged :
+    for (const std::string damaged :
          {"substr(value, 1, length(value) - 1)", "x''", "12", "'text'", "zeroblob(64)"}) {
-        const std::string sql =
-            std::string("UPDATE preferences SET value = ") + damaged + " WHERE key = 'bad'";
-        ASSERT_EQ(sqlite3_exec(database, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK) << damaged;
+        editDatabase("preferences.db", "UPDATE preferences SET value = " + damaged + " WHERE key = 'bad'");
         const FakeSystemLog log;
         RecordingSink sink;
         EXPECT_EQ(domain_.read("bad", sink), Preferences::ReadResult::Damaged) << damaged;
@@ -94,7 +85,6 @@ TEST_F(PreferencesTest, ADamagedValueIsToldApartAndHarmsNoOther) {
         EXPECT_TRUE(log.contains("\"bad\" is damaged")) << damaged;
         EXPECT_FALSE(log.contains("confidential")) << damaged;
     }
-    sqlite3_close(database);
     EXPECT_TRUE(domain_.setAside("bad"));
     EXPECT_EQ(domain_.keys(), std::vector<std::string>{"good"});
     EXPECT_EQ(Preferences("com.example.one.damaged").keys().size(), 1U);
@@ -158,11 +148,8 @@ TEST_F(PreferencesTest, ProcessesAndThreadsWriteTogether) {
 TEST(StateDirectory, IsWhereTheEnvironmentSays) {
     const TemporaryStateDirectory directory;
     const std::string base = directory.base().string();
-    const struct {
-        const char* name;
-        std::optional<std::string> state, home;
-        std::string expected;
-    } cases[] = {
+    using Text = std::optional<std::string>;
+    const std::tuple<const char*, Text, Text, std::string> cases[] = {
         {"state home", base + "/s", base + "/h", base + "/s/harbwell/"},
         {"several missing components", base + "/a/b/c", std::nullopt, base + "/a/b/c/harbwell/"},
         {"home", std::nullopt, base + "/h", base + "/h/.local/state/harbwell/"},
@@ -170,15 +157,15 @@ TEST(StateDirectory, IsWhereTheEnvironmentSays) {
         {"an empty state home", "", base + "/h", base + "/h/.local/state/harbwell/"},
         {"nowhere", "/proc/nowhere", base, ""},
     };
-    const auto setOrUnset = [](const char* name, const std::optional<std::string>& to) {
+    const auto setOrUnset = [](const char* name, const Text& to) {
         to ? setenv(name, to->c_str(), 1) : unsetenv(name);
     };
-    for (const auto& test : cases) {
-        setOrUnset("XDG_STATE_HOME", test.state);
-        setOrUnset("HOME", test.home);
+    for (const auto& [name, state, home, expected] : cases) {
+        setOrUnset("XDG_STATE_HOME", state);
+        setOrUnset("HOME", home);
         const std::string found = stateDirectory();
         const std::string machine = found.substr(found.rfind('/') + 1);
-        EXPECT_EQ(found.substr(0, found.size() - machine.size()), test.expected) << test.name;
+        EXPECT_EQ(found.substr(0, found.size() - machine.size()), expected) << name;
         if (found.empty()) continue;
         EXPECT_TRUE(machine == "no-machine-id" || machine.size() == 32) << machine;
         EXPECT_EQ(stateDirectory(), found) << "not the same once it exists";

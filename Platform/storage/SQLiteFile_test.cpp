@@ -2,19 +2,14 @@
 
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <sqlite3.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 
-#include <filesystem>
-#include <optional>
+#include <functional>
 #include <random>
-#include <string>
-#include <vector>
 
 #include "TestSupport/FakeSystemLog.h"
-#include "TestSupport/SimulatedClock.h"
-#include "TestSupport/TemporaryStateDirectory.h"
+#include "TestSupport/SQLiteEdit.h"
 
 namespace platform {
 namespace {
@@ -47,17 +42,16 @@ std::optional<std::string> get(SQLiteFile& file, const std::string& name) {
 
 class SQLiteFileTest : public testing::Test {
   protected:
-    /// Runs SQL on the file as any other program would.
-    static void edit(const std::string& sql) {
-        sqlite3* database = nullptr;
-        EXPECT_EQ(sqlite3_open(path().c_str(), &database), SQLITE_OK);
-        EXPECT_EQ(sqlite3_exec(database, sql.c_str(), nullptr, nullptr, nullptr), SQLITE_OK)
-            << sqlite3_errmsg(database);
-        sqlite3_close(database);
-    }
-
+    static void edit(const std::string& sql) { editDatabase(kFormat.name, sql); }
     static fs::path path() { return TemporaryStateDirectory::file(kFormat.name); }
     static std::string content() { return TemporaryStateDirectory::readFile(path()); }
+    static void setContent(const std::string& bytes) { TemporaryStateDirectory::writeFile(path(), bytes); }
+
+    /// Nothing is left but a file of this content.
+    static void beginWith(const std::string& bytes) {
+        for (const auto& old : fs::directory_iterator(stateDirectory())) fs::remove(old.path());
+        setContent(bytes);
+    }
 
     /// Files that were moved aside, without companions.
     static std::vector<fs::path> movedAside() {
@@ -145,43 +139,35 @@ TEST_F(SQLiteFileTest, MovesADamagedFileAsideAndStartsAFreshOne) {
     ASSERT_GT(sound.size(), 5 * 4096U);
     const std::string other = "PRAGMA application_id = 7; PRAGMA user_version = 1";
     const std::pair<const char*, std::function<void()>> cases[] = {
-        {"text",
-         [] {
-             TemporaryStateDirectory::writeFile(path(), "this is no database, only some text in a file\n");
-         }},
-        {"a cut header", [&] { TemporaryStateDirectory::writeFile(path(), sound.substr(0, 50)); }},
-        {"one page", [&] { TemporaryStateDirectory::writeFile(path(), sound.substr(0, 4096)); }},
-        {"a page less",
-         [&] { TemporaryStateDirectory::writeFile(path(), sound.substr(0, sound.size() - 4096)); }},
-        {"half a page less",
-         [&] { TemporaryStateDirectory::writeFile(path(), sound.substr(0, sound.size() - 2000)); }},
+        {"text", [] { setContent("this is no database, only some text in a file\n"); }},
+        {"a cut header", [&] { setContent(sound.substr(0, 50)); }},
+        {"one page", [&] { setContent(sound.substr(0, 4096)); }},
+        {"a page less", [&] { setContent(sound.substr(0, sound.size() - 4096)); }},
+        {"half a page less", [&] { setContent(sound.substr(0, sound.size() - 2000)); }},
         {"pages of zeros",
-         [&] {
-             TemporaryStateDirectory::writeFile(
-                 path(), sound.substr(0, 4096) + std::string(sound.size() - 4096, '\0'));
-         }},
+         [&] { setContent(sound.substr(0, 4096) + std::string(sound.size() - 4096, '\0')); }},
         {"another program's file", [&] { edit(other); }},
         {"another program's tables", [] { fs::remove(path()), edit("CREATE TABLE theirs (a)"); }},
         {"tables that were changed", [] { edit("ALTER TABLE rows RENAME TO columns"); }},
     };
     for (const auto& [name, damage] : cases) {
-        for (const auto& old : fs::directory_iterator(stateDirectory())) fs::remove(old.path());
-        TemporaryStateDirectory::writeFile(path(), sound);
+        SCOPED_TRACE(name);
+        beginWith(sound);
         damage();
         const std::string damaged = content();
         const FakeSystemLog log;
         SQLiteFile file(kFormat);
-        EXPECT_EQ(get(file, "row 39"), std::nullopt) << name;
-        EXPECT_EQ(put(file, "new", "value"), Outcome::Done) << name;
+        EXPECT_EQ(get(file, "row 39"), std::nullopt);
+        EXPECT_EQ(put(file, "new", "value"), Outcome::Done);
         SQLiteFile again(kFormat);
-        EXPECT_EQ(get(again, "new"), "value") << name;
+        EXPECT_EQ(get(again, "new"), "value");
 
         const auto aside = movedAside();
-        ASSERT_EQ(aside.size(), 1U) << name;
-        EXPECT_EQ(TemporaryStateDirectory::readFile(aside.front()), damaged) << name;
-        ASSERT_EQ(log.lines().size(), 1U) << name;
+        ASSERT_EQ(aside.size(), 1U);
+        EXPECT_EQ(TemporaryStateDirectory::readFile(aside.front()), damaged);
+        ASSERT_EQ(log.lines().size(), 1U);
         EXPECT_EQ(log.lines().front().priority, LogPriority::Error);
-        EXPECT_TRUE(log.contains(path().string() + ":") && log.contains(aside.front().string())) << name;
+        EXPECT_TRUE(log.contains(path().string() + ":") && log.contains(aside.front().string()));
     }
 }
 
@@ -190,13 +176,12 @@ TEST_F(SQLiteFileTest, SurvivesFlippedBytes) {
     const std::string sound = content();
     std::minstd_rand random(4);
     for (int round = 0; round < 150; ++round) {
-        for (const auto& old : fs::directory_iterator(stateDirectory())) fs::remove(old.path());
         std::string flipped = sound;
         // The first hundred bytes hold version numbers: there a flip may make the file one that is to be left
         // alone.
         const size_t at = 100 + random() % (sound.size() - 100);
         flipped[at] = static_cast<char>(flipped[at] ^ (1 << random() % 8));
-        TemporaryStateDirectory::writeFile(path(), flipped);
+        beginWith(flipped);
         SQLiteFile file(kFormat);
         for (int i = 0; i < 40; ++i)
             EXPECT_NE(get(file, "row " + std::to_string(i)), "failed") << "flipped at " << at;
@@ -230,34 +215,34 @@ TEST_F(SQLiteFileTest, WaitsOutTroubleOfTheSurroundings) {
     const fs::path base = directory_.base();
     const fs::path database = path();
     const fs::path kept = base / "kept";
+    const auto setHome = [](const fs::path& path) { setenv("XDG_STATE_HOME", path.c_str(), 1); };
+    const auto goHome = [&] { setHome(base); };
+    const auto putBack = [&] { fs::remove(database), fs::rename(kept, database); };
     const std::tuple<const char*, std::function<void()>, std::function<void()>> cases[] = {
-        {"a file in the place of the directory",
-         [&] { setenv("XDG_STATE_HOME", (kept.string()).c_str(), 1); },
-         [&] { setenv("XDG_STATE_HOME", base.c_str(), 1); }},
-        {"a directory that cannot be created", [] { setenv("XDG_STATE_HOME", "/proc/nowhere", 1); },
-         [&] { setenv("XDG_STATE_HOME", base.c_str(), 1); }},
+        {"a file in the place of the directory", [&] { setHome(kept); }, goHome},
+        {"a directory that cannot be created", [&] { setHome("/proc/nowhere"); }, goHome},
         {"a directory in the place of the file",
-         [&] { fs::rename(database, kept), fs::create_directory(database); },
-         [&] { fs::remove(database), fs::rename(kept, database); }},
+         [&] { fs::rename(database, kept), fs::create_directory(database); }, putBack},
         {"a link to nothing", [&] { fs::rename(database, kept), fs::create_symlink("nowhere", database); },
-         [&] { fs::remove(database), fs::rename(kept, database); }},
+         putBack},
     };
     fill();
     for (const auto& [name, spoil, restore] : cases) {
+        SCOPED_TRACE(name);
         if (!fs::exists(kept)) TemporaryStateDirectory::writeFile(kept, "a file");
         const FakeSystemLog log;
         SQLiteFile file(kFormat);
         spoil();
         for (int i = 0; i < 3; ++i) {
-            EXPECT_EQ(get(file, "row 1"), "failed") << name;
-            EXPECT_EQ(put(file, "row 1", "x"), Outcome::Failed) << name;
+            EXPECT_EQ(get(file, "row 1"), "failed");
+            EXPECT_EQ(put(file, "row 1", "x"), Outcome::Failed);
         }
-        EXPECT_EQ(log.lines().size(), 1U) << name;
+        EXPECT_EQ(log.lines().size(), 1U);
         restore();
-        EXPECT_NE(get(file, "row 1"), "failed") << name;
-        EXPECT_EQ(put(file, "row 1", name), Outcome::Done) << name;
-        EXPECT_EQ(get(file, "row 2"), std::string(500, 'v')) << name;
-        EXPECT_TRUE(movedAside().empty()) << name;
+        EXPECT_NE(get(file, "row 1"), "failed");
+        EXPECT_EQ(put(file, "row 1", name), Outcome::Done);
+        EXPECT_EQ(get(file, "row 2"), std::string(500, 'v'));
+        EXPECT_TRUE(movedAside().empty());
     }
 }
 
@@ -283,8 +268,7 @@ TEST_F(SQLiteFileTest, AFullDiskFailsWritesOnlyAndKeepsTheFile) {
 
 TEST_F(SQLiteFileTest, TwoProcessesMoveADamagedFileAsideOnce) {
     for (int round = 0; round < 30; ++round) {
-        for (const auto& old : fs::directory_iterator(stateDirectory())) fs::remove(old.path());
-        TemporaryStateDirectory::writeFile(path(), "not a database, and long enough to be looked at");
+        beginWith("not a database, and long enough to be looked at");
         // Both wait for the other end to close, so that they begin at the same moment.
         int start[2];
         ASSERT_EQ(pipe(start), 0);

@@ -16,24 +16,21 @@ using testing_support::readRequest;
 using testing_support::TestAuthority;
 
 struct Made {
-    std::string text;
-    Key publicKey;
-    Key privateKey;
+    String text;
+    Key publicKey, privateKey;
 };
 
 Made make(const String& accountName) {
-    String request;
     Made made;
-    EXPECT_EQ(createKeyPairAndCertificateRequest(accountName, &request, &made.publicKey, &made.privateKey),
+    EXPECT_EQ(createKeyPairAndCertificateRequest(accountName, &made.text, &made.publicKey, &made.privateKey),
               0);
-    made.text = request.text();
     return made;
 }
 
 TEST(CertificateRequest, SaysWhoseItIsInTheOrderThatTheServerWants) {
     for (const std::string name : {"jane.roe@velto.example", "Jane Roe", "jürgen_#+,\"=<>;\\", ""}) {
         const Made made = make(name);
-        const auto content = readRequest(made.text);
+        const auto content = readRequest(made.text.text());
         EXPECT_TRUE(content.signatureVerifies) << name;
         EXPECT_EQ(content.subject,
                   (std::vector<std::string>{"PRINTABLESTRING/CN=" + name, "PRINTABLESTRING/C=US",
@@ -67,7 +64,7 @@ TEST(CertificateRequest, IsPEMEvenWhenItsLastLineIsFull) {
     size_t last = 0;
     for (int attempt = 0; attempt < 5 && last != 64; ++attempt) {
         length += 3 * ((64 - last) / 4 % 16);
-        last = checkedLastLine(make(std::string(length, 'n')).text);
+        last = checkedLastLine(make(std::string(length, 'n')).text.text());
     }
     EXPECT_EQ(last, 64U);
 }

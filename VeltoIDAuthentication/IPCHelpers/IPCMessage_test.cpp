@@ -26,11 +26,7 @@ MessageValue dictionary(std::initializer_list<std::pair<const char*, MessageValu
 }
 
 TEST(MessageValueTest, EveryKindIsConvertedBothWays) {
-    struct Case {
-        const char* description;
-        Value value;
-    };
-    const Case cases[] = {
+    const std::pair<const char*, Value> cases[] = {
         {"null", Value::null()},
         {"true", Value::boolean(true)},
         {"false", Value::boolean(false)},
@@ -53,20 +49,21 @@ TEST(MessageValueTest, EveryKindIsConvertedBothWays) {
         {"{2 success=true, status=3, }",
          Dictionary{{"success", Value::boolean(true)}, {"status", Value::int64(3)}}},
     };
-    for (const Case& each : cases) {
-        const MessageValue message = messageFromValue(each.value);
-        EXPECT_EQ(describe(message), each.description);
+    for (const auto& [description, value] : cases) {
+        SCOPED_TRACE(description);
+        const MessageValue message = messageFromValue(value);
+        EXPECT_EQ(describe(message), description);
         const Value back = valueFromMessage(message);
-        EXPECT_EQ(back, each.value) << each.description;
-        EXPECT_EQ(back.isFloating(), each.value.isFloating()) << each.description;
+        EXPECT_EQ(back, value);
+        EXPECT_EQ(back.isFloating(), value.isFloating());
 
         // And over the platform's event form.
         MessageValueBuilder builder;
         writeMessageValue(message, builder);
-        EXPECT_EQ(describe(builder.take()), each.description);
+        EXPECT_EQ(describe(builder.take()), description);
         ValueBuilder values;
         writeMessageValue(message, values);
-        EXPECT_EQ(values.value(), each.value) << each.description;
+        EXPECT_EQ(values.value(), value);
     }
 }
 
@@ -78,13 +75,12 @@ TEST(MessageValueTest, WhatHasNoOtherFormIsLeftOut) {
         EXPECT_EQ(describe(messageFromValue(Array{"a", value, "b"})), "[\"a\"\"b\"]");
         EXPECT_EQ(describe(messageFromValue(Dictionary{{"a", value}, {"b", "c"}})), "{1 b=\"c\", }");
     }
-    const MessageValue foreign[] = {{},
-                                    {MessageError{"e"}},
-                                    {MessageConnection()},
-                                    {MessageFileDescriptor()},
-                                    {MessageSharedMemory()},
-                                    {MessageOther{"o"}}};
-    for (const MessageValue& message : foreign) {
+    for (const MessageValue& message : std::vector<MessageValue>{{},
+                                                                 {MessageError{"e"}},
+                                                                 {MessageConnection()},
+                                                                 {MessageFileDescriptor()},
+                                                                 {MessageSharedMemory()},
+                                                                 {MessageOther{"o"}}}) {
         EXPECT_TRUE(valueFromMessage(message).isAbsent());
         EXPECT_EQ(valueFromMessage(array({message, {String("a")}})), Value(Array{"a"}));
         EXPECT_EQ(valueFromMessage(dictionary({{"x", message}})), Value(Dictionary()));

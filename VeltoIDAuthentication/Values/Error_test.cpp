@@ -29,11 +29,10 @@ TEST(Error, SurvivesTheWayThroughADictionaryWithWhatLiesUnderneath) {
 }
 
 TEST(Error, DictionariesOfAnotherShapeAreNone) {
-    EXPECT_EQ(dictionaryToError(Value()), std::nullopt);
-    EXPECT_EQ(dictionaryToError("text"), std::nullopt);
-    EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}}), std::nullopt);
-    EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}, {"Code", "1"}}), std::nullopt);
-    EXPECT_EQ(dictionaryToError(Dictionary{{"Domain", "d"}, {"Code", Value::real(1.5)}}), std::nullopt);
+    for (const Value& none : {Value(), Value("text"), Value(Dictionary{{"Domain", "d"}}),
+                              Value(Dictionary{{"Domain", "d"}, {"Code", "1"}}),
+                              Value(Dictionary{{"Domain", "d"}, {"Code", Value::real(1.5)}})})
+        EXPECT_EQ(dictionaryToError(none), std::nullopt);
     const auto odd =
         dictionaryToError(Dictionary{{"Domain", "d"},
                                      {"Code", Value::int32(1)},

@@ -17,14 +17,10 @@ namespace veltoid {
 namespace {
 
 TEST(Value, NumbersAreReadExactlyOrNotAtAll) {
-    struct Case {
-        Value number;
-        std::optional<int64_t> asInt64;
-        std::optional<int32_t> asInt32;
-        std::optional<uint64_t> asUInt64;
-    };
     constexpr int64_t kMax = std::numeric_limits<int64_t>::max();
-    const Case cases[] = {
+    // As 64 bits, as 32 bits, and as 64 bits without sign.
+    using std::optional;
+    const std::tuple<Value, optional<int64_t>, optional<int32_t>, optional<uint64_t>> cases[] = {
         {Value::int32(-7), -7, -7, std::nullopt},
         {Value::int64(5'000'000'000), 5'000'000'000, std::nullopt, 5'000'000'000U},
         {Value::uint64(~uint64_t{0}), std::nullopt, std::nullopt, ~uint64_t{0}},
@@ -37,10 +33,10 @@ TEST(Value, NumbersAreReadExactlyOrNotAtAll) {
         {Value("5"), std::nullopt, std::nullopt, std::nullopt},
         {Value::boolean(true), std::nullopt, std::nullopt, std::nullopt},
     };
-    for (const Case& c : cases) {
-        EXPECT_EQ(c.number.asInt64(), c.asInt64);
-        EXPECT_EQ(c.number.asInt32(), c.asInt32);
-        EXPECT_EQ(c.number.asUInt64(), c.asUInt64);
+    for (const auto& [number, asInt64, asInt32, asUInt64] : cases) {
+        EXPECT_EQ(number.asInt64(), asInt64);
+        EXPECT_EQ(number.asInt32(), asInt32);
+        EXPECT_EQ(number.asUInt64(), asUInt64);
     }
 }
 
@@ -170,22 +166,16 @@ TEST(ValueStream, EveryStoredKindComesBackFromItsStoredForm) {
 
 TEST(DateText, FormsOfOneInstantAgreeAndOthersAreRefused) {
     const double instant = 1'394'039'040;  // 2014-03-05 17:04:00 UTC
-    const std::pair<const char*, std::optional<double>> cases[] = {
-        {"2014-03-05T17:04:00Z", instant},
-        {"2014-03-05T18:04:00+0100", instant},
-        {"2014-03-05 09:04:00 -0800", instant},
-        {"2014-03-05T22:49:00+0545", instant},
-        {"2014-03-05T17:04:00", std::nullopt},
-        {"2014-03-05", std::nullopt},
-        {"", std::nullopt},
-        {"2014-13-05T17:04:00Z", std::nullopt},
-        {"2015-02-29T00:00:00Z", std::nullopt},
-        {"99999999999999999999-01-01T00:00:00Z", std::nullopt},
-        {"2014-03-05T17:04:00+99999", std::nullopt},
-        {"1969-12-31T23:59:59Z", -1.0},
-        {"2000-02-29T00:00:00Z", 951'782'400.0},
+    const std::pair<const char*, double> cases[] = {
+        {"2014-03-05T17:04:00Z", instant},      {"2014-03-05T18:04:00+0100", instant},
+        {"2014-03-05 09:04:00 -0800", instant}, {"2014-03-05T22:49:00+0545", instant},
+        {"1969-12-31T23:59:59Z", -1.0},         {"2000-02-29T00:00:00Z", 951'782'400.0},
     };
     for (const auto& [text, expected] : cases) EXPECT_EQ(dateFromValue(String(text)), expected) << text;
+    for (const char* text :
+         {"2014-03-05T17:04:00", "2014-03-05", "", "2014-13-05T17:04:00Z", "2015-02-29T00:00:00Z",
+          "99999999999999999999-01-01T00:00:00Z", "2014-03-05T17:04:00+99999"})
+        EXPECT_EQ(dateFromValue(String(text)), std::nullopt) << text;
     EXPECT_EQ(dateFromValue(Value::date(5)), 5);
     EXPECT_EQ(dateFromValue(Value::int32(5)), std::nullopt);
     EXPECT_EQ(dateFromValue(std::string(129, '1')), std::nullopt);

@@ -59,7 +59,7 @@ class Deferrals {
 
     /// After a pass over the account.
     void note(const String& accountName) {
-        const auto next = nextActionOf(accountName);
+        const auto next = copyNextActionDateForAccount(accountName);
         if (!next || *next > platform::now() || accountRecordOf(accountName).isDirty()) {
             deferrals_.erase(accountName.text());
             return;
@@ -137,7 +137,7 @@ class AccountCheckLoop {
             return {std::move(*changed), platform::now(), true};
         Plan plan{copyAccountsNeedingAction(nullptr), {}, false};
         for (const Value& name : plan.accounts) {
-            const auto date = nextActionOf(name.asString());
+            const auto date = copyNextActionDateForAccount(name.asString());
             if (!date) continue;
             const double deferred = deferrals_.dateFor(name.asString(), *date);
             plan.date = plan.date ? std::min(*plan.date, deferred) : deferred;

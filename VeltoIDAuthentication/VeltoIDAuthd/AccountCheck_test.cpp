@@ -11,11 +11,8 @@
 namespace veltoid {
 namespace {
 
-constexpr double kDay = 86'400;
 constexpr double kFortnight = 14 * kDay;
-constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
 constexpr const char* kCheckInterval = "VeltoIDAccountValidationRecordNextCheckIntervalKey";
-constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
 
 class AccountCheckTest : public CertificateTest {
   protected:
@@ -43,6 +40,9 @@ class AccountCheckTest : public CertificateTest {
         return server_.takeMethods();
     }
     void check() { checkAccount({kName, record()}); }
+    bool asksForCertificateIn(double seconds) {
+        return methodsIn(seconds).find("createCert") != std::string::npos;
+    }
 };
 
 TEST_F(AccountCheckTest, WithoutAccountsItSleepsUntilThereIsOne) {
@@ -57,8 +57,8 @@ TEST_F(AccountCheckTest, WithoutAccountsItSleepsUntilThereIsOne) {
     issueAtOnce();
     createAccount("d1");
     EXPECT_EQ(methodsIn(4.9), "");
-    EXPECT_NE(methodsIn(10.2).find("createCert"), std::string::npos);
-    EXPECT_TRUE(certificateEntry().contains("CertificateReference"));
+    EXPECT_TRUE(asksForCertificateIn(10.2));
+    EXPECT_TRUE(certificateEntry().contains(kCertificateReference));
 }
 
 class LockedDeviceTest : public AccountCheckTest {
@@ -67,35 +67,34 @@ class LockedDeviceTest : public AccountCheckTest {
 };
 
 TEST_F(LockedDeviceTest, TheDeviceHasToBeUnlockedFirst) {
-    platform::FakeLockState& lock = lock_;
     issueAtOnce();
-    setValue("Dirty", flag(true));
+    setValue("Dirty", kOn);
     start();
     EXPECT_EQ(relaunch(), kDay);
     EXPECT_EQ(methodsIn(1.5 * kDay), "");
     EXPECT_EQ(relaunch(), 0.5 * kDay);
-    EXPECT_TRUE(lock.isWatched());
-    lock.unlock();
+    EXPECT_TRUE(lock_.isWatched());
+    lock_.unlock();
     EXPECT_NE(methodsIn(6), "");
-    EXPECT_FALSE(lock.isWatched());
+    EXPECT_FALSE(lock_.isWatched());
 
-    lock.lock();
-    __VeltoIDDBSetAccountValue(kName, "Dirty", flag(true), Notify::Yes);
+    lock_.lock();
+    __VeltoIDDBSetAccountValue(kName, "Dirty", kOn, Notify::Yes);
     clock_.advanceBy(1.5 * kDay);
-    EXPECT_TRUE(lock.isWatched());
+    EXPECT_TRUE(lock_.isWatched());
     EXPECT_LE(relaunch(), 0.5 * kDay + 10);
-    lock.unlock();
+    lock_.unlock();
     clock_.advanceBy(6);
-    EXPECT_TRUE(certificateEntry().contains("LastSuccessfulValidation")) << "what was due is done";
+    EXPECT_TRUE(certificateEntry().contains(kValidated)) << "what was due is done";
 }
 
 TEST_F(AccountCheckTest, PassesKeepTheirDistance) {
-    setValues({{"encDsId", Value::null()}, {"LastConnectAttempt", Value::null()}});
+    setValues({{"encDsId", kGone}, {"LastConnectAttempt", kGone}});
     server_.refuse("authenticate", 503);
     start();
     (void)methodsIn(6);
     for (int i = 0; i < 100; ++i) {
-        setValues({{"LastConnectAttempt", Value::null()}});
+        setValues({{"LastConnectAttempt", kGone}});
         __VeltoIDDBSetAccountValue(kName, "x", number(i), Notify::Yes);
         wakeAccountCheck();
         clock_.advanceBy(0.1);
@@ -115,45 +114,45 @@ TEST_F(AccountCheckTest, AnAccountThatAPassCannotHelpIsPutOff) {
     EXPECT_GT(calls.size(), 20U) << "but it is not given up";
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
     issueAtOnce();
-    setValue("CSRGenerationDate", Value::null());
+    setValue("CSRGenerationDate", kGone);
     __VeltoIDDBSetAccountValue(kName, "x", "y", Notify::Yes);
-    EXPECT_NE(methodsIn(11).find("createCert"), std::string::npos) << "a change counts at once";
+    EXPECT_TRUE(asksForCertificateIn(11)) << "a change counts at once";
 }
 
 TEST_F(AccountCheckTest, AClockThatIsSetMakesItLookAgain) {
     issueAtOnce();
-    setValue("EarliestAllowedConnectionDate", date(1'000));
+    setValue(kEmbargo, date(1'000));
     start();
     clock_.jumpTo(now() - 5'000);
     EXPECT_EQ(methodsIn(2'000), "") << "the date counts, not the time that was slept";
-    EXPECT_NE(methodsIn(4'100).find("createCert"), std::string::npos);
+    EXPECT_TRUE(asksForCertificateIn(4'100));
     clock_.advanceBy(60);
     (void)server_.take();
     clock_.jumpTo(now() + 80 * kDay);
-    EXPECT_NE(methodsIn(30).find("createCert"), std::string::npos) << "the renewal has come meanwhile";
+    EXPECT_TRUE(asksForCertificateIn(30)) << "the renewal has come meanwhile";
 }
 
 TEST_F(AccountCheckTest, EveryStateHasItsConsequence) {
     issueAtOnce();
-    setValue("encDsId", Value::null());
+    setValue("encDsId", kGone);
     check();
     EXPECT_EQ(server_.takeMethods(), "authenticate");
     EXPECT_EQ(record()["encDsId"], Value("d1"));
     EXPECT_EQ(record()["LastConnectAttempt"], date()) << "not again for a while";
 
     check();
-    EXPECT_NE(server_.takeMethods().find("createCert"), std::string::npos) << "no certificate";
-    __VeltoIDDBSetCertificateValue("d1", "Dirty", flag(true), Notify::No);
+    EXPECT_TRUE(asksForCertificateIn(0)) << "no certificate";
+    setInEntry({{"Dirty", kOn}});
     check();
-    EXPECT_EQ(certificateEntry()["LastSuccessfulValidation"], date());
-    EXPECT_EQ(certificateEntry()["Dirty"], flag(false)) << "evaluated and good";
+    EXPECT_EQ(certificateEntry()[kValidated], date());
+    EXPECT_EQ(certificateEntry()["Dirty"], kOff) << "evaluated and good";
 
-    __VeltoIDDBSetCertificateValue("d1", "NextRenewalAttempt", date(-1), Notify::No);
-    const Value key = certificateEntry()["CertificatePrivateKeyReference"];
+    setInEntry({{kRenewal, date(-1)}});
+    const Value key = certificateEntry()[kKeyReference];
     check();
-    EXPECT_NE(certificateEntry()["CertificatePrivateKeyReference"], key) << "renewed";
+    EXPECT_NE(certificateEntry()[kKeyReference], key) << "renewed";
 
-    __VeltoIDDBSetCertificateValue("d1", "CertStatus", "CERTIFICATE_INVALID", Notify::No);
+    setInEntry({{"CertStatus", "CERTIFICATE_INVALID"}});
     server_.fault("createCert", -1);
     check();
     EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr)) << "revoked";
@@ -163,16 +162,16 @@ TEST_F(AccountCheckTest, EveryStateHasItsConsequence) {
 
     (void)server_.take();
     check();
-    EXPECT_EQ(server_.takeMethods().find("createCert"), std::string::npos) << "too early for another request";
+    EXPECT_FALSE(asksForCertificateIn(0)) << "too early for another request";
 
     for (const auto& [ahead, fetches] : {std::pair(5.0, false), std::pair(2 * kDay, false),
                                          std::pair(8 * kDay, true), std::pair(-1.0, true)}) {
-        setValues({{"CertificateToken", "t"}, {"NextCertificateFetchDate", date(ahead)}});
+        setValues({{kToken, "t"}, {kFetchDate, date(ahead)}});
         check();
         EXPECT_EQ(server_.takeMethods().find("fetchCert") != std::string::npos, fetches) << ahead;
     }
     server_.fault("authenticate", -20101);
-    setValues({{"CertificateToken", Value::null()}, {"ValidationDate", Value::null()}});
+    setValues({{kToken, kGone}, {"ValidationDate", kGone}});
     check();
     EXPECT_FALSE(hasPassword());
     EXPECT_FALSE(record().contains("encDsId")) << "the password is refused";

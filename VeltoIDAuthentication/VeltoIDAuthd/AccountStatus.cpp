@@ -42,7 +42,8 @@ Dictionary copyAccountStatus(const String& name, const Dictionary& options) {
     Dictionary status;
     const AccountRecord record = accountRecordOf(name);
     status.set(kVeltoIDAccountLastValidationDateKey, record.values()[kVeltoIDAccountLastValidationDateKey]);
-    if (const auto next = nextActionOf(name)) status.set(message::kNextActionTime, Value::date(*next));
+    if (const auto next = copyNextActionDateForAccount(name))
+        status.set(message::kNextActionTime, Value::date(*next));
 
     const AccountState state = checkAccountAndDetermineNextAction(name, options);
     status.set(message::kAccountState, nameOf(state));

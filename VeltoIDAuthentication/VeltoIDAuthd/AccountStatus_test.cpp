@@ -11,8 +11,6 @@
 namespace veltoid {
 namespace {
 
-constexpr double kDay = 86'400;
-
 class AccountStatusTest : public CertificateTest {
   protected:
     void SetUp() override {
@@ -39,19 +37,21 @@ class AccountStatusTest : public CertificateTest {
 };
 
 TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
-    struct Case {
+    const auto addAndPass = [this](double seconds) {
+        add(true);
+        clock_.advanceBy(seconds);
+    };
+    const auto addWith = [this](const char* key, const Value& value) {
+        add(true);
+        setInEntry({{key, value}});
+    };
+    const struct {
         const char* state;
         std::function<void()> comeAbout;
-        bool asksTheServer;
-        bool requiresAction;
+        bool asksTheServer, requiresAction;
         /// When something happens next, from now; none: nothing will.
         std::optional<double> next;
-    };
-    const auto after = [this](double seconds) { clock_.advanceBy(seconds); };
-    const auto setEntry = [](const char* key, const Value& value) {
-        __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
-    };
-    const Case cases[] = {
+    } cases[] = {
         {"NoEncodedDSID",
          [&] {
              server_.refuse("authenticate", 503);
@@ -70,7 +70,7 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
          [&] {
              add(true);
              server_.fault("authenticate", -20101);
-             after(15 * kDay);
+             clock_.advanceBy(15 * kDay);
              check();
          },
          true,
@@ -79,37 +79,23 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
         {"NoCertificate", [&] { add(false); }, false, false, 0},
         {"CertificateRevoked",
          [&] {
-             add(true);
-             server_.answer("authenticate",
-                            Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", flag(false)}});
-             after(15 * kDay);
+             addAndPass(15 * kDay);
+             server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", kOff}});
          },
          true, false, -kDay - 1},
-        {"CertificateExpired",
-         [&] {
-             add(true);
-             after(101 * kDay);
-         },
-         false, false, -87 * kDay - 1},
+        {"CertificateExpired", [&] { addAndPass(101 * kDay); }, false, false, -87 * kDay - 1},
         {"Unknown",
          [&] {
-             add(true);
+             addWith("Dirty", kOn);
              std::filesystem::remove(directory_.base() / "harbwell" / "identity-authority.pem");
-             setEntry("Dirty", flag(true));
          },
          true, false, 14 * kDay - 1},
-        {"CertificateOK",
-         [&] {
-             add(true);
-             setEntry("Dirty", flag(true));
-         },
-         true, false, 14 * kDay - 1},
+        {"CertificateOK", [&] { addWith("Dirty", kOn); }, true, false, 14 * kDay - 1},
         {"CertificateAssumedOK", [&] { add(true); }, false, false, 14 * kDay - 1},
         {"CertificateShouldBeRenewed",
          [&] {
-             add(true);
-             setEntry("LastSuccessfulValidation", date(75 * kDay));
-             after(75 * kDay + 1);
+             addWith(kValidated, date(75 * kDay));
+             clock_.advanceBy(75 * kDay + 1);
          },
          false, false, -61 * kDay - 1},
         {"VeltoIDValidationRecordNeedsToBeUpdated",
@@ -125,16 +111,16 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
          },
          false, false, 70},
     };
-    for (const Case& each : cases) {
+    for (const auto& [state, comeAbout, asksTheServer, requiresAction, next] : cases) {
         server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(100)}});
         issueAtOnce();
         trust(root_);
-        each.comeAbout();
-        const Dictionary status = statusOf({{"CheckNetwork", flag(each.asksTheServer)}});
-        EXPECT_EQ(status["AccountState"], Value(each.state));
-        EXPECT_EQ(status["AccountRequiresUserAction"], flag(each.requiresAction)) << each.state;
-        EXPECT_EQ(status["NextActionTime"], each.next ? date(*each.next) : Value()) << each.state;
-        EXPECT_EQ(status.contains("NextFetchAttempt"), std::string_view(each.state) == "CertificatePending");
+        comeAbout();
+        const Dictionary status = statusOf({{"CheckNetwork", flag(asksTheServer)}});
+        EXPECT_EQ(status["AccountState"], Value(state));
+        EXPECT_EQ(status["AccountRequiresUserAction"], flag(requiresAction)) << state;
+        EXPECT_EQ(status["NextActionTime"], next ? date(*next) : Value()) << state;
+        EXPECT_EQ(status.contains("NextFetchAttempt"), std::string_view(state) == "CertificatePending");
         __VeltoIDForgetVeltoID(kName, {});
         clock_.advanceBy(2 * kDay);
     }
@@ -150,13 +136,13 @@ TEST_F(LockedDeviceStatusTest, SaysNothingOfAPasswordThatMayYetBecomeReadable) {
     removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef"));
     EXPECT_EQ(statusOf({})["AccountState"], Value("PasswordInaccessibleInKeychain"));
     EXPECT_FALSE(statusOf({}).contains("AccountRequiresUserAction"));
-    EXPECT_EQ(copyAccountStatusesDictionary({})["DeviceUnlockedSinceBoot"], flag(false));
+    EXPECT_EQ(copyAccountStatusesDictionary({})["DeviceUnlockedSinceBoot"], kOff);
 }
 
 TEST_F(AccountStatusTest, TellsWhatHasChangedAndWhatIsHeldUp) {
     add(false);
     EXPECT_FALSE(copyAccountStatusesDictionary({}).contains("DirtyAccounts"));
-    setValue("Dirty", flag(true));
+    setValue("Dirty", kOn);
     for (const char* key : {"DirtyAccounts", "DirtyAccountsAndCertificates"})
         EXPECT_EQ(copyAccountStatusesDictionary({})[key], Value(Array{kName})) << "told, not taken";
     for (int i = 0; i < 3; ++i) EXPECT_TRUE(request());

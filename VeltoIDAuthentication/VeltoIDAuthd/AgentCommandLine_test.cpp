@@ -40,11 +40,7 @@ std::string summary(const CommandLine& line) {
 }
 
 TEST(CommandLineTest, IsUnderstood) {
-    struct Case {
-        std::vector<std::string> arguments;
-        const char* summary;
-    };
-    const Case cases[] = {
+    const std::pair<std::vector<std::string>, const char*> cases[] = {
         {{}, "authentication "},
         {{"-a"}, "authentication "},
         {{"-c"}, "checkpassword "},
@@ -66,12 +62,12 @@ TEST(CommandLineTest, IsUnderstood) {
         {{"ignored", "too"}, ""},
         {{"-a", "--", "-c=1"}, "authentication [-c|1] "},
     };
-    for (const Case& each : cases) {
-        Arguments arguments(each.arguments);
+    for (const auto& [given, understood] : cases) {
+        Arguments arguments(given);
         CommandLineError error;
         const auto line = parseCommandLine(arguments.count(), arguments.pointers.data(), error);
-        ASSERT_TRUE(line) << join(each.arguments);
-        EXPECT_EQ(summary(*line), each.summary) << join(each.arguments);
+        ASSERT_TRUE(line) << join(given);
+        EXPECT_EQ(summary(*line), understood) << join(given);
     }
 }
 

@@ -5,6 +5,7 @@
 
 #include "Protocol/Commands.h"
 #include "TestSupport/FakeIdentityServer.h"
+#include "TestSupport/FakeMessage.h"
 #include "TestSupport/FakeNotifications.h"
 #include "VeltoIDAuthd/AccountStatus.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
@@ -14,35 +15,6 @@
 
 namespace veltoid {
 namespace {
-
-const Value kOn = flag(true);
-const Value kOff = flag(false);
-
-class FakeMessage : public platform::IncomingMessage {
-  public:
-    explicit FakeMessage(Dictionary request) : request_(std::move(request)) {}
-
-    std::optional<int64_t> peekInteger(std::string_view key) override { return request_[key].asInt64(); }
-    void read(platform::ValueSink& sink) override {
-        EXPECT_GT(platform::transactions::openCount(), 0) << "the agent must not leave now";
-        writeValue(request_, sink);
-    }
-    void reply(platform::ValueWriter writer) override {
-        ValueBuilder builder;
-        writer(builder);
-        EXPECT_EQ(replies_++, 0) << "one reply to a request";
-        EXPECT_TRUE(builder.value().isDictionary());
-        if (const Dictionary* dictionary = builder.value().asDictionary()) reply_ = *dictionary;
-    }
-
-    const Dictionary& reply() const { return reply_; }
-    int replies() const { return replies_; }
-
-  private:
-    Dictionary request_;
-    Dictionary reply_;
-    int replies_ = 0;
-};
 
 class ServiceTest : public ServerTest {
   protected:
@@ -82,42 +54,33 @@ class ServiceTest : public ServerTest {
     platform::FakeNotifications notifications_;
 };
 
+constexpr const char* kAction = "AccountRequiresUserAction";
 const Dictionary kSuccess = {{"success", kOn}};
 const Dictionary kFailure = {{"success", kOff}};
 
 TEST_F(ServiceTest, OnlyKnownCommandsSucceed) {
-    struct Case {
-        Value command;
-        bool succeeds;
-    };
-    const Case cases[] = {{number(1), true},   {Value::uint64(1), true}, {number(2), false},
-                          {number(-1), false}, {number(0x9998), false},  {"1", false},
-                          {{}, false},         {Value::real(1.5), false}};
-    for (const Case& each : cases) {
-        EXPECT_EQ(send(each.command), each.succeeds ? kSuccess : kFailure)
-            << testing::PrintToString(each.command);
-    }
+    const std::pair<Value, bool> cases[] = {{number(1), true},   {Value::uint64(1), true}, {number(2), false},
+                                            {number(-1), false}, {number(0x9998), false},  {"1", false},
+                                            {{}, false},         {Value::real(1.5), false}};
+    for (const auto& [command, succeeds] : cases)
+        EXPECT_EQ(send(command), succeeds ? kSuccess : kFailure) << testing::PrintToString(command);
 }
 
 TEST_F(ServiceTest, SetsDatabaseValues) {
     createAccount("d1");
     __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
-    struct Case {
-        const char* what;
-        Value domain;
-        Value item;
-        Value key;
-        /// By the command that fails when nothing can be set, and by the one that does not.
-        bool succeeds;
-        bool succeedsIfPossible;
-        std::function<Value()> stored;
-        int signals;
-    };
     const auto inRecord = [] { return record()["k"]; };
     const auto inEntry = [] { return certificateEntry()["k"]; };
     const auto inMeta = [] { return meta("k"); };
     const auto inSection = [] { return meta("k", "item"); };
-    const Case cases[] = {
+    const struct {
+        const char* what;
+        Value domain, item, key;
+        /// By the command that fails when nothing can be set, and by the one that does not.
+        bool sets, succeedsIfPossible;
+        std::function<Value()> stored;
+        int signals;
+    } cases[] = {
         {"an account", "Accounts", kName, "k", true, true, inRecord, 1},
         {"no such account", "Accounts", "x", "k", false, false, inRecord, 0},
         {"a certificate", "Certificates", "d1", "k", true, true, inEntry, 1},
@@ -130,18 +93,19 @@ TEST_F(ServiceTest, SetsDatabaseValues) {
         {"an unknown domain", "Other", kName, "k", false, true, inRecord, 0},
         {"a key of the wrong kind", "MetaInfo", {}, number(1), false, true, inMeta, 0},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, domain, item, key, sets, succeedsIfPossible, stored, signals] : cases) {
+        SCOPED_TRACE(what);
         for (const int64_t command : {command::kSetValue, command::kSetValueQuietly}) {
             (void)takeSignals();
-            Dictionary request = {{"domain", each.domain}, {"item", each.item}, {"key", each.key}};
+            Dictionary request = {{"domain", domain}, {"item", item}, {"key", key}};
             const Dictionary removal = request;
             request.set("value", "v");
-            const bool succeeds = command == command::kSetValue ? each.succeeds : each.succeedsIfPossible;
-            EXPECT_EQ(send(command, request), succeeds ? kSuccess : kFailure) << each.what << command;
-            EXPECT_EQ(each.stored(), each.succeeds ? Value("v") : Value()) << each.what << command;
-            EXPECT_EQ(takeSignals(), each.signals) << each.what << command;
+            const bool succeeds = command == command::kSetValue ? sets : succeedsIfPossible;
+            EXPECT_EQ(send(command, request), succeeds ? kSuccess : kFailure) << command;
+            EXPECT_EQ(stored(), sets ? Value("v") : Value()) << command;
+            EXPECT_EQ(takeSignals(), signals) << command;
             send(command, removal);
-            EXPECT_TRUE(each.stored().isAbsent()) << each.what << command << ": no value removes";
+            EXPECT_TRUE(stored().isAbsent()) << command << ": no value removes";
         }
     }
     (void)takeSignals();
@@ -154,8 +118,6 @@ TEST_F(ServiceTest, SetsDatabaseValues) {
 
 TEST_F(ServiceTest, AnswersFromWhatIsStored) {
     constexpr const char* kRecordType = "VeltoIDValidatedItemsRecordDataCertificateType";
-    constexpr const char* kRecord = "VeltoIDAccountValidationRecordData";
-    constexpr const char* kAsOf = "VeltoIDAccountValidationRecordValidAsOfKey";
     const Value data = Data(std::vector<uint8_t>{1, 2});
     const Dictionary criteria = {{"email", Array{"a"}}};
     const Dictionary person = {{"matched", "email"}, {"value", "a"}};
@@ -172,9 +134,9 @@ TEST_F(ServiceTest, AnswersFromWhatIsStored) {
     createAccount("d1");
     EXPECT_EQ(send(command::kCertificate, recordRequest),
               (Dictionary{{"success", kOn}, {"result", Dictionary()}}));
-    setValues({{kRecord, data}, {kAsOf, date()}});
+    setValues({{kData, data}, {kAsOf, date()}});
     EXPECT_EQ(send(command::kCertificate, recordRequest)["result"],
-              Value(Dictionary{{kRecord, data}, {kAsOf, date()}}));
+              Value(Dictionary{{kData, data}, {kAsOf, date()}}));
     EXPECT_EQ(errorCode(send(command::kCertificate, certificateRequest)), -100) << "no certificate";
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
     for (const Dictionary& request : {certificateRequest, Dictionary{{"encDsId", "d1"}}}) {
@@ -202,42 +164,39 @@ TEST_F(ServiceTest, WhatNeedsTheServerFailsWithoutOne) {
 
 TEST_F(ServiceTest, StatusOfAnAccount) {
     createAccount(nullptr);
-    setValue("Dirty", {});
-    setValue("LastConnectAttempt", date(-100));
-    setValue("ValidationDate", "whatever is stored");
+    setValues(
+        {{"Dirty", kGone}, {"LastConnectAttempt", date(-100)}, {"ValidationDate", "whatever is stored"}});
     EXPECT_EQ(firstStatus(), (Dictionary{{"ValidationDate", "whatever is stored"},
                                          {"NextActionTime", date()},
                                          {"AccountState", "NoEncodedDSID"},
-                                         {"AccountRequiresUserAction", kOff}}));
+                                         {kAction, kOff}}));
     setValue("encDsId", "d1");
     EXPECT_EQ(firstStatus()["AccountState"], Value("NoCertificate"));
-    setValue("CertificateToken", "t");
-    setValue("NextCertificateFetchDate", date(70));
+    setValues({{kToken, "t"}, {kFetchDate, date(70)}});
     EXPECT_EQ(firstStatus()["AccountState"], Value("CertificatePending"));
     EXPECT_EQ(firstStatus()["NextFetchAttempt"], date(70));
     ASSERT_TRUE(removePasswordFromKeychainGivenPersistentRef(record().data("HashedPasswordRef")));
     EXPECT_EQ(firstStatus()["AccountState"], Value("PasswordInaccessibleInKeychain"));
-    EXPECT_EQ(firstStatus()["AccountRequiresUserAction"], kOn) << "the device is unlocked";
+    EXPECT_EQ(firstStatus()[kAction], kOn) << "the device is unlocked";
     EXPECT_TRUE(log_.contains("or the password has been removed from the keychain; no next action."));
     __VeltoIDDBRemovePassword(kName);
     EXPECT_EQ(firstStatus()["AccountState"], Value("PasswordInvalid"));
     EXPECT_TRUE(log_.contains(std::string(kName) + " doesn't have a password; no next action."));
-    EXPECT_EQ(firstStatus()["AccountRequiresUserAction"], kOn);
+    EXPECT_EQ(firstStatus()[kAction], kOn);
     EXPECT_FALSE(firstStatus().contains("NextActionTime"));
 
-    __VeltoIDDBSetMetaInfoValue(nullptr, "AccountRequiresUserAction", "0");
-    EXPECT_EQ(firstStatus()["AccountRequiresUserAction"], kOff);
+    const auto overriddenBy = [](const Value& value) {
+        __VeltoIDDBSetMetaInfoValue(nullptr, kAction, value);
+        return firstStatus()[kAction];
+    };
+    EXPECT_EQ(overriddenBy("0"), kOff);
     EXPECT_EQ(
         log_.count("copyAccountStatusesDictionaryVeltoIDAccountStatusRequiresUserAction override value 0"),
         1);
-    __VeltoIDDBSetMetaInfoValue(nullptr, "AccountRequiresUserAction", "no");
-    EXPECT_EQ(firstStatus()["AccountRequiresUserAction"], kOn);
-    __VeltoIDDBSetMetaInfoValue(nullptr, "AccountRequiresUserAction", number(0));
+    EXPECT_EQ(overriddenBy("no"), kOn);
     createAccount("d1");
-    EXPECT_EQ(firstStatus()["AccountRequiresUserAction"], kOff) << "an override is a text";
+    EXPECT_EQ(overriddenBy(number(0)), kOff) << "an override is a text";
 }
-
-// --- The end
 
 }  // namespace
 }  // namespace veltoid

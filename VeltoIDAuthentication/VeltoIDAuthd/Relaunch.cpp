@@ -61,7 +61,7 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
     Array needing;
     std::optional<double> earliest;
     for (const Value& name : accountNames()) {
-        const auto date = nextActionOf(name.asString());
+        const auto date = copyNextActionDateForAccount(name.asString());
         if (!date) continue;
         needing.append(name);
         if (!earliest || *date < *earliest) earliest = date;

@@ -2,6 +2,7 @@
 
 #include "Platform/bus/ServiceManager.h"
 #include "TestSupport/DatabaseFixture.h"
+#include "TestSupport/Journal.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
@@ -22,30 +23,29 @@ class FakeServiceManager : public platform::ServiceManager {
 
 class RelaunchTest : public DatabaseTest {
   protected:
-    /// An account that needs attention at that time from now, or (none) never.
-    void createAccount(const char* name, std::optional<double> action, const char* password = "hash") {
-        ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, password ? String(password) : String(), nullptr));
-        Dictionary values = {{"Dirty", Value::null()}, {"LastConnectAttempt", date(1e12)}};
+    /// An account that needs attention at that time from now.
+    void createAccount(const char* name, double action, const String& password = "hash") {
+        ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, password, nullptr));
         // Under an embargo nothing but its end counts.
-        if (action) values.set("EarliestAllowedConnectionDate", date(*action));
-        ASSERT_TRUE(__VeltoIDDBSetAccountValues(name, values, Notify::No));
+        ASSERT_TRUE(__VeltoIDDBSetAccountValues(
+            name, {{"Dirty", kGone}, {"LastConnectAttempt", date(1e12)}, {kEmbargo, date(action)}},
+            Notify::No));
     }
 
     FakeServiceManager manager_;
 };
 
 TEST_F(RelaunchTest, TheServiceManagerIsAskedForTheEarliestUnlessForced) {
-    struct Case {
+    constexpr uint32_t kMost = 4'294'967'295;
+    // One after the other, at the same time.
+    const struct {
         const char* what;
         /// Seconds from now.
         std::optional<double> date;
         bool force;
         std::optional<uint32_t> handed;
         std::optional<double> next;
-    };
-    constexpr uint32_t kMost = 4'294'967'295;
-    // One after the other, at the same time.
-    const Case cases[] = {
+    } cases[] = {
         {"no particular time", {}, false, kMost, 1e10},
         {"earlier", 100, false, 100, 100},
         {"later", 200, false, {}, 100},
@@ -63,29 +63,23 @@ TEST_F(RelaunchTest, TheServiceManagerIsAskedForTheEarliestUnlessForced) {
         {"not positive is no particular time", -now(), true, kMost, 1e10},
     };
     EXPECT_EQ(nextLaunchDate(), std::nullopt);
-    for (const Case& each : cases) {
-        scheduleRelaunch(each.date ? std::optional(now() + *each.date) : std::nullopt,
-                         each.force ? RelaunchDate::Replaces : RelaunchDate::OnlyIfEarlier);
+    for (const auto& [what, date, force, handed, next] : cases) {
+        SCOPED_TRACE(what);
+        scheduleRelaunch(date ? std::optional(now() + *date) : std::nullopt,
+                         force ? RelaunchDate::Replaces : RelaunchDate::OnlyIfEarlier);
         clock_.settle();
-        EXPECT_EQ(manager_.take(), each.handed) << each.what;
-        EXPECT_EQ(nextLaunchDate(), each.next ? std::optional(now() + *each.next) : std::nullopt)
-            << each.what;
-        EXPECT_EQ(platform::transactions::openCount(), 0) << each.what;
+        EXPECT_EQ(manager_.take(), handed);
+        EXPECT_EQ(nextLaunchDate(), next ? std::optional(now() + *next) : std::nullopt);
+        EXPECT_EQ(platform::transactions::openCount(), 0);
     }
 }
 
 TEST_F(RelaunchTest, ATransactionIsOpenUntilTheServiceManagerIsAsked) {
-    const platform::Semaphore started;
-    const platform::Semaphore opened;
-    platform::WorkQueue::main().async([started, opened] {
-        started.signal();
-        opened.wait();
-    });
-    started.wait();
+    const platform::Gate gate(platform::WorkQueue::main());
     scheduleRelaunch(now() + 5);
     EXPECT_EQ(platform::transactions::openCount(), 1);
     EXPECT_EQ(manager_.take(), std::nullopt);
-    opened.signal();
+    gate.open();
     clock_.settle();
     EXPECT_EQ(platform::transactions::openCount(), 0);
     EXPECT_EQ(manager_.take(), 5U);
@@ -97,10 +91,9 @@ TEST_F(RelaunchTest, AccountsThatNeedAnActionAndWhen) {
     EXPECT_EQ(earliest, std::nullopt);
     createAccount("no password", 5, nullptr);
     EXPECT_TRUE(copyAccountsNeedingAction(nullptr).empty());
-    createAccount("late", 2000);
-    createAccount("early", 1000);
-    createAccount("as early", 1000);
-    createAccount("later", 3000);
+    for (const auto& [name, action] :
+         {std::pair("late", 2000), {"early", 1000}, {"as early", 1000}, {"later", 3000}})
+        createAccount(name, action);
     EXPECT_EQ(copyAccountsNeedingAction(&earliest), (Array{"late", "early", "as early", "later"}));
     EXPECT_EQ(earliest, now() + 1000);
 }

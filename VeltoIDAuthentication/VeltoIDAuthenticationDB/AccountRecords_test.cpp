@@ -9,6 +9,8 @@ namespace veltoid {
 namespace {
 
 constexpr const char* kName = "jane.roe@velto.example";
+constexpr const char* kReference = "HashedPasswordRef";
+constexpr const char* kPassword = "HashedPassword";
 constexpr const char* kUserUUID = "0F8FAD5B-D9CB-469F-A165-70867728950E";
 constexpr const char* kOtherUserUUID = "7C9E6679-7425-40DE-944B-E07FC1F90AE7";
 // SHA-256 of name and device identifier, folded in half; worked out apart from this code.
@@ -23,10 +25,9 @@ class AccountsTest : public DatabaseTest {
         return record.values();
     }
 
-    static void create(const char* name = kName, const char* password = nullptr,
-                       const char* encDsId = nullptr) {
-        const auto text = [](const char* given) { return given != nullptr ? String(given) : String(); };
-        ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, text(password), text(encDsId)));
+    static void create(const char* name = kName, const String& password = nullptr,
+                       const String& encDsId = nullptr) {
+        ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, password, encDsId));
     }
 
     static void setValues(const char* name, const Dictionary& values) {
@@ -40,7 +41,7 @@ TEST_F(AccountsTest, ARecordOfNothingButAName) {
     EXPECT_EQ(keysOf(created),
               (std::set<std::string>{"AccountUUID", "CreationDate", "Dirty", "ModificationDate", "VeltoID"}));
     EXPECT_EQ(created["VeltoID"], Value(kName));
-    EXPECT_EQ(created["Dirty"], flag(true));
+    EXPECT_EQ(created["Dirty"], kOn);
     EXPECT_EQ(created["CreationDate"], created["ModificationDate"]);
     EXPECT_EQ(created.string("AccountUUID").view().size(), 36U);
     EXPECT_FALSE(__VeltoIDDBCreateVeltoIDAccount(nullptr, "hash", "d"));
@@ -48,12 +49,12 @@ TEST_F(AccountsTest, ARecordOfNothingButAName) {
 
 TEST_F(AccountsTest, CreatingAgainUpdatesTheRecord) {
     create(kName, nullptr, "first");
-    setValues(kName, {{"FirstName", "Jane"}, {"Dirty", Value::null()}});
+    setValues(kName, {{"FirstName", "Jane"}, {"Dirty", kGone}});
     const Dictionary before = record();
     clock_.advanceBy(60);
-    create(kName, nullptr, nullptr);
+    create();
     Dictionary expected = before;
-    expected.set("Dirty", flag(true));
+    expected.set("Dirty", kOn);
     expected.set("ModificationDate", date());
     EXPECT_EQ(record(), expected) << "what is not given stays";
     create(kName, nullptr, "second");
@@ -63,21 +64,19 @@ TEST_F(AccountsTest, CreatingAgainUpdatesTheRecord) {
 
 TEST_F(AccountsTest, ThePasswordGoesToTheKeychainOnce) {
     create(kName, "hash one");
-    const Data reference = record().data("HashedPasswordRef");
+    const Data reference = record().data(kReference);
     String stored;
     ASSERT_TRUE(copyPasswordFromKeychainGivenPersistentRef(reference, &stored));
     EXPECT_EQ(stored, "hash one");
-    EXPECT_FALSE(record().contains("HashedPassword"));
+    EXPECT_FALSE(record().contains(kPassword));
 
     EXPECT_EQ(effectsOf([] { create(kName, "hash one"); }), "written, signalled");
-    EXPECT_EQ(
-        log_.count("Password being added for account jane.roe@velto.example matches password on keychain, "
-                   "so skipping over addPasswordToKeychain"),
-        1);
+    const std::string same = "Password being added for account " + std::string(kName);
+    EXPECT_EQ(log_.count(same + " matches password on keychain, so skipping over addPasswordToKeychain"), 1);
     EXPECT_FALSE(log_.contains("Password already in keychain"));
 
     create(kName, "hash two");
-    EXPECT_EQ(record().data("HashedPasswordRef"), reference);
+    EXPECT_EQ(record().data(kReference), reference);
     EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, record()}), "hash two");
     EXPECT_FALSE(log_.contains("hash one") || log_.contains("hash two"));
 }
@@ -85,8 +84,7 @@ TEST_F(AccountsTest, ThePasswordGoesToTheKeychainOnce) {
 TEST_F(AccountsTest, APasswordThatTheKeychainRefusesLeavesTheRecordAsItWas) {
     create();
     const Dictionary before = record();
-    // A directory in the place of its file: the keychain cannot be opened.
-    std::filesystem::create_directory(platform::TemporaryStateDirectory::file("keychain.db"));
+    const platform::Obstacle noKeychain("keychain.db");
     EXPECT_EQ(effectsOf([] { EXPECT_FALSE(__VeltoIDDBCreateVeltoIDAccount(kName, "hash", "new")); }), "");
     EXPECT_EQ(record(), before);
     EXPECT_FALSE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", nullptr));
@@ -95,16 +93,13 @@ TEST_F(AccountsTest, APasswordThatTheKeychainRefusesLeavesTheRecordAsItWas) {
 }
 
 TEST_F(AccountsTest, IdentifiersOfAnAccount) {
-    struct Case {
+    const struct {
         const char* what;
-        const char* name;
-        Value uuid;
-        Value stableUUID;
-        const char* userUUID;
+        String name;
+        Value givenUUID, stableUUID, userUUID;
         bool changes;
-        const char* newStableUUID;
-    };
-    const Case cases[] = {
+        Value newStableUUID;
+    } cases[] = {
         {"a new record", kName, {}, {}, kUserUUID, true, kStableUUID},
         {"whatever the case of the name", "Jane.Roe@Velto.Example", "U", {}, kUserUUID, true, kStableUUID},
         {"another device", kName, "U", {}, kOtherUserUUID, true, kOtherStableUUID},
@@ -112,20 +107,17 @@ TEST_F(AccountsTest, IdentifiersOfAnAccount) {
         {"a new identifier makes the other one void", kName, {}, "S", kUserUUID, true, kStableUUID},
         {"wrong kinds", kName, number(1), number(2), kUserUUID, true, kStableUUID},
         {"a stable one of the wrong kind", kName, "U", number(2), kUserUUID, true, kStableUUID},
-        {"no device identifier", kName, "U", {}, nullptr, false, nullptr},
-        {"no device identifier, a new record", kName, {}, "S", nullptr, true, nullptr},
+        {"no device identifier", kName, "U", {}, {}, false, {}},
+        {"no device identifier, a new record", kName, {}, "S", {}, true, {}},
     };
-    for (const Case& each : cases) {
-        __VeltoIDDBSetMetaInfoValue(nullptr, "UserUUID",
-                                    each.userUUID != nullptr ? Value(each.userUUID) : Value());
-        Dictionary record = {{"AccountUUID", each.uuid}, {"AccountStableUUID", each.stableUUID}};
-        EXPECT_EQ(__VeltoIDDBDeriveAccountUUIDs(each.name, record), each.changes) << each.what;
+    for (const auto& [what, name, givenUUID, stableUUID, userUUID, changes, newStableUUID] : cases) {
+        SCOPED_TRACE(what);
+        __VeltoIDDBSetMetaInfoValue(nullptr, "UserUUID", userUUID);
+        Dictionary record = {{"AccountUUID", givenUUID}, {"AccountStableUUID", stableUUID}};
+        EXPECT_EQ(__VeltoIDDBDeriveAccountUUIDs(name, record), changes);
         const String uuid = record.string("AccountUUID");
-        EXPECT_TRUE(each.uuid.isString() ? uuid == each.uuid.asString() : uuid.view().size() == 36)
-            << each.what;
-        EXPECT_EQ(record["AccountStableUUID"],
-                  each.newStableUUID != nullptr ? Value(each.newStableUUID) : Value())
-            << each.what;
+        EXPECT_TRUE(givenUUID.isString() ? uuid == givenUUID.asString() : uuid.view().size() == 36);
+        EXPECT_EQ(record["AccountStableUUID"], newStableUUID);
     }
 }
 
@@ -139,10 +131,11 @@ TEST_F(AccountsTest, ErrorsOfLookUps) {
     Array names{"left over"};
     EXPECT_EQ(codeOf([&](ErrorOut error) { return __VeltoIDDBCopyVeltoIDs(&names, error); }), -107);
     EXPECT_EQ(names, Array{"left over"}) << "filled only on success";
-    EXPECT_EQ(codeOf([](ErrorOut error) { return __VeltoIDDBCopyVeltoIDAccount(nullptr, nullptr, error); }),
-              -99);
-    EXPECT_EQ(codeOf([](ErrorOut error) { return __VeltoIDDBCopyVeltoIDAccount("x", nullptr, error); }),
-              -108);
+    for (const auto& [name, code] : {std::pair(String(), -99), std::pair(String("x"), -108)})
+        EXPECT_EQ(codeOf([&, name = name](ErrorOut error) {
+                      return __VeltoIDDBCopyVeltoIDAccount(name, nullptr, error);
+                  }),
+                  code);
     EXPECT_EQ(codeOf([](ErrorOut error) { return __VeltoIDDBRemoveVeltoIDAccount("x", error); }), -108);
 
     std::optional<Error> error;
@@ -152,8 +145,8 @@ TEST_F(AccountsTest, ErrorsOfLookUps) {
         EXPECT_FALSE(__VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr, &error));
         EXPECT_EQ(error->code, -1);
         EXPECT_EQ(error->userInfo[kErrorFailureReasonKey], Value("Unknown error"));
-        EXPECT_EQ(error->userInfo[kErrorDescriptionKey], Value("?"));
-        EXPECT_EQ(error->userInfo[kErrorRecoverySuggestionKey], Value("?"));
+        for (const std::string_view key : {kErrorDescriptionKey, kErrorRecoverySuggestionKey})
+            EXPECT_EQ(error->userInfo[key], Value("?"));
         EXPECT_EQ(error->userInfo["function"], Value("__VeltoIDDBCopyVeltoIDForDSID"));
     }
     EXPECT_FALSE(__VeltoIDDBSetAccountValues("x", {{"a", "b"}}, Notify::Yes));
@@ -166,9 +159,9 @@ TEST_F(AccountsTest, ErrorsOfLookUps) {
 TEST_F(AccountsTest, FindsAccounts) {
     create("nothing");
     create("own hash");
-    setValues("own hash", {{"HashedPassword", "h"}, {"HashedPasswordRef", "no data"}});
+    setValues("own hash", {{kPassword, "h"}, {kReference, "no data"}});
     create("dsid", nullptr, "d1");
-    setValues("dsid", {{"HashedPassword", number(1)}});
+    setValues("dsid", {{kPassword, number(1)}});
     create("both", "hash", "d2");
     create("wrong dsid", "hash");
     setValues("wrong dsid", {{"encDsId", number(3)}});
@@ -194,50 +187,43 @@ TEST_F(AccountsTest, FindsAccounts) {
 }
 
 TEST_F(AccountsTest, SettingValues) {
-    struct Case {
+    using enum Notify;
+    constexpr const char* kAll = "written, signalled";
+    const struct {
         const char* what;
         Dictionary values;
-        bool signal;
-        const char* effects;
+        Notify notify;
+        std::string effects;
         /// Of the record afterwards: its value of "k" and its mark.
-        Value k;
-        Value dirty;
-    };
-    const Value on = flag(true);
-    const Value off = flag(false);
-    const Value null = Value::null();
-    const Case cases[] = {
-        {"a new value", {{"k", "b"}}, true, "written, signalled", "b", on},
-        {"quietly", {{"k", "b"}}, false, "written", "b", {}},
-        {"an equal value", {{"k", "a"}}, true, "", "a", {}},
-        {"an equal number of another form", {{"n", Value::real(1)}}, true, "", "a", {}},
-        {"another kind", {{"k", number(1)}}, false, "written", number(1), {}},
-        {"Null removes", {{"k", null}}, true, "written, signalled", {}, on},
-        {"Null for nothing", {{"x", null}}, true, "", "a", {}},
-        {"the mark alone", {{"Dirty", on}}, true, "written", "a", on},
-        {"a change without mark", {{"Dirty", off}, {"k", "b"}}, true, "written, signalled", "b", off},
-        {"the mark removed", {{"Dirty", null}, {"k", "b"}}, true, "written, signalled", "b", on},
-        {"the modification date alone", {{"ModificationDate", "x"}}, true, "written", "a", on},
-        {"the mark, and an equal value", {{"Dirty", on}, {"k", "a"}}, true, "written, signalled", "a", on},
+        Value k, dirty;
+    } cases[] = {
+        {"a new value", {{"k", "b"}}, Yes, kAll, "b", kOn},
+        {"quietly", {{"k", "b"}}, No, "written", "b", {}},
+        {"an equal value", {{"k", "a"}}, Yes, "", "a", {}},
+        {"an equal number of another form", {{"n", Value::real(1)}}, Yes, "", "a", {}},
+        {"another kind", {{"k", number(1)}}, No, "written", number(1), {}},
+        {"Null removes", {{"k", kGone}}, Yes, kAll, {}, kOn},
+        {"Null for nothing", {{"x", kGone}}, Yes, "", "a", {}},
+        {"the mark alone", {{"Dirty", kOn}}, Yes, "written", "a", kOn},
+        {"a change without mark", {{"Dirty", kOff}, {"k", "b"}}, Yes, kAll, "b", kOff},
+        {"the mark removed", {{"Dirty", kGone}, {"k", "b"}}, Yes, kAll, "b", kOn},
+        {"the modification date alone", {{"ModificationDate", "x"}}, Yes, "written", "a", kOn},
+        {"the mark, and an equal value", {{"Dirty", kOn}, {"k", "a"}}, Yes, kAll, "a", kOn},
     };
     create();
-    for (const Case& each : cases) {
+    for (const auto& [what, values, notify, effects, k, dirty] : cases) {
+        SCOPED_TRACE(what);
         // Out of the way first, so that each case starts from the same record.
-        setValues(kName, {{"k", "a"}, {"n", number(1)}, {"Dirty", null}});
+        setValues(kName, {{"k", "a"}, {"n", number(1)}, {"Dirty", kGone}});
         const Value modified = record()["ModificationDate"];
         clock_.advanceBy(10);
-        double changedAt = 0;
-        EXPECT_EQ(effectsOf([&] {
-                      changedAt = now();
-                      EXPECT_TRUE(__VeltoIDDBSetAccountValues(kName, each.values,
-                                                              each.signal ? Notify::Yes : Notify::No));
+        EXPECT_EQ(effectsOf([&, &values = values, notify = notify] {
+                      EXPECT_TRUE(__VeltoIDDBSetAccountValues(kName, values, notify));
                   }),
-                  each.effects)
-            << each.what;
-        const bool changed = std::string_view(each.effects) != "";
-        EXPECT_EQ(record()["k"], each.k) << each.what;
-        EXPECT_EQ(record()["Dirty"], each.dirty) << each.what;
-        EXPECT_EQ(record()["ModificationDate"], changed ? Value::date(changedAt) : modified) << each.what;
+                  effects);
+        EXPECT_EQ(record()["k"], k);
+        EXPECT_EQ(record()["Dirty"], dirty);
+        EXPECT_EQ(record()["ModificationDate"], effects.empty() ? modified : operationDate());
     }
     EXPECT_FALSE(__VeltoIDDBSetAccountValues(kName, {}, Notify::Yes));
     EXPECT_FALSE(__VeltoIDDBSetAccountValues(nullptr, {{"k", "v"}}, Notify::Yes));
@@ -257,56 +243,52 @@ TEST_F(AccountsTest, SettingOneValue) {
 
 TEST_F(AccountsTest, ThePasswordOfARecord) {
     create(kName, "from keychain");
-    const Data reference = record().data("HashedPasswordRef");
     const Data unknown(std::vector<uint8_t>(16, 7));
-    EXPECT_EQ(
-        __VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", reference}, {"HashedPassword", "own"}}}),
-        "from keychain");
-    EXPECT_EQ(
-        __VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", unknown}, {"HashedPassword", "own"}}}),
-        "own");
-    EXPECT_EQ(
-        __VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", "text"}, {"HashedPassword", "own"}}}),
-        "own");
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, {{"HashedPasswordRef", unknown}}}), String());
-    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, {{"HashedPassword", number(1)}}}), String());
+    const std::pair<Dictionary, String> cases[] = {
+        {{{kReference, record().data(kReference)}, {kPassword, "own"}}, "from keychain"},
+        {{{kReference, unknown}, {kPassword, "own"}}, "own"},
+        {{{kReference, "text"}, {kPassword, "own"}}, "own"},
+        {{{kReference, unknown}}, {}},
+        {{{kPassword, number(1)}}, {}},
+    };
+    for (const auto& [values, password] : cases)
+        EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, values}), password) << testing::PrintToString(values);
 }
 
 TEST_F(AccountsTest, RemovingThePassword) {
     create(kName, "hash");
-    const Data reference = record().data("HashedPasswordRef");
-    setValues(kName, {{"HashedPassword", "own"}, {"Dirty", Value::null()}});
+    const Data reference = record().data(kReference);
+    setValues(kName, {{kPassword, "own"}, {"Dirty", kGone}});
     EXPECT_EQ(effectsOf([] { EXPECT_TRUE(__VeltoIDDBRemovePassword(kName)); }), "written, signalled");
-    EXPECT_FALSE(record().contains("HashedPassword") || record().contains("HashedPasswordRef"));
-    EXPECT_EQ(record()["Dirty"], flag(true));
+    EXPECT_FALSE(record().contains(kPassword) || record().contains(kReference));
+    EXPECT_EQ(record()["Dirty"], kOn);
     EXPECT_FALSE(copyPasswordFromKeychainGivenPersistentRef(reference, nullptr));
     EXPECT_EQ(effectsOf([] { EXPECT_TRUE(__VeltoIDDBRemovePassword(kName)); }), "")
         << "there is nothing left to remove";
-    setValues(kName, {{"HashedPasswordRef", "text"}});
+    setValues(kName, {{kReference, "text"}});
     EXPECT_TRUE(__VeltoIDDBRemovePassword(kName));
-    EXPECT_FALSE(record().contains("HashedPasswordRef"));
+    EXPECT_FALSE(record().contains(kReference));
 }
 
 TEST_F(AccountsTest, DirtyAccounts) {
-    create("a");
-    create("b");
-    create("c");
+    for (const char* name : {"a", "b", "c"}) create(name);
     ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
-    setValues("b", {{"Dirty", flag(false)}});
+    setValues("b", {{"Dirty", kOff}});
     setValues("c", {{"Dirty", "true"}});
     EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::Keep), Array{"a"});
-    EXPECT_EQ(
-        effectsOf([] { EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearOfAccounts), Array{"a"}); }),
-        "")
+    const auto clear = [] { return __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearOfAccounts); };
+    EXPECT_EQ(effectsOf([&] { EXPECT_EQ(clear(), Array{"a"}); }), "")
         << "in memory only, until the section is next written";
-    EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearOfAccounts), std::nullopt);
+    EXPECT_EQ(clear(), std::nullopt);
     EXPECT_FALSE(record("b").contains("Dirty") || record("c").contains("Dirty"));
-    CertificateEntry entry;
-    ASSERT_TRUE(__VeltoIDDBCopyCertificateInfo("d", &entry));
-    EXPECT_TRUE(entry.isDirty());
+    const auto entryIsDirty = [] {
+        CertificateEntry entry;
+        EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("d", &entry));
+        return entry.isDirty();
+    };
+    EXPECT_TRUE(entryIsDirty());
     EXPECT_EQ(__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll), std::nullopt);
-    ASSERT_TRUE(__VeltoIDDBCopyCertificateInfo("d", &entry));
-    EXPECT_FALSE(entry.isDirty());
+    EXPECT_FALSE(entryIsDirty());
     setValues("a", {{"x", "y"}});
     ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "x", "y", Notify::No));
 }
@@ -315,9 +297,9 @@ TEST_F(AccountsTest, CertificateStateOfAnAccount) {
     create();
     EXPECT_FALSE(__VeltoIDDBHasValidCertificate(kName));
     EXPECT_FALSE(__VeltoIDDBHasCertificateToken(kName));
-    setValues(kName, {{"encDsId", "d"}, {"CertificateToken", number(5)}});
+    setValues(kName, {{"encDsId", "d"}, {kToken, number(5)}});
     EXPECT_FALSE(__VeltoIDDBHasCertificateToken(kName));
-    setValues(kName, {{"CertificateToken", "t"}});
+    setValues(kName, {{kToken, "t"}});
     EXPECT_TRUE(__VeltoIDDBHasCertificateToken(kName));
     EXPECT_FALSE(__VeltoIDDBHasValidCertificate(kName));
     __VeltoIDDBSetCertificateInfo("d", Dictionary{{"CertStatus", "CERT_ISSUED"}});

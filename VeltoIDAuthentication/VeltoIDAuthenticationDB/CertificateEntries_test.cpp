@@ -18,80 +18,66 @@ class CertificatesTest : public DatabaseTest {
 const Data kReference(std::vector<uint8_t>{1, 2, 3});
 
 TEST_F(CertificatesTest, AnEntryTakesWhatTheResultHolds) {
-    const double created = now();
-    EXPECT_EQ(
-        effectsOf([&] {
-            EXPECT_TRUE(__VeltoIDDBSetCertificateInfo("d", Dictionary{{"CertificateReference", kReference},
-                                                                      {"Expires", Value::date(5)},
-                                                                      {"CertStatus", "CERT_ISSUED"},
-                                                                      {"SerialNumber", "7"},
-                                                                      {"CertType", "not taken over"}}));
-        }),
-        "written, signalled");
-    EXPECT_EQ(entry(), (Dictionary{{"CreationDate", Value::date(created + kVeltoIDDBFlushDelay)},
-                                   {"encDsId", "d"},
-                                   {"CertificateReference", kReference},
-                                   {"Expires", Value::date(5)},
-                                   {"CertStatus", "CERT_ISSUED"},
-                                   {"SerialNumber", "7"},
-                                   {"Dirty", flag(true)},
-                                   {"ModificationDate", Value::date(created + kVeltoIDDBFlushDelay)}}));
+    const Dictionary result = {{kCertificateReference, kReference},
+                               {"Expires", Value::date(5)},
+                               {"CertStatus", "CERT_ISSUED"},
+                               {"SerialNumber", "7"},
+                               {"CertType", "not taken over"}};
+    EXPECT_EQ(effectsOf([&] { EXPECT_TRUE(__VeltoIDDBSetCertificateInfo("d", result)); }),
+              "written, signalled");
+    const Value created = operationDate();
+    Dictionary expected = result;
+    expected.remove("CertType");
+    for (const auto& [key, value] : {std::pair("encDsId", Value("d")),
+                                     {"CreationDate", created},
+                                     {"Dirty", kOn},
+                                     {"ModificationDate", created}})
+        expected.set(key, value);
+    EXPECT_EQ(entry(), expected);
     ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "CertType", "stays", Notify::No));
-    const double updated = now();
     EXPECT_TRUE(__VeltoIDDBSetCertificateInfo(
         "d", Dictionary{
-                 {"CertificateReference", "no data"}, {"Expires", "any kind"}, {"SerialNumber", number(7)}}));
-    EXPECT_EQ(entry(), (Dictionary{{"CreationDate", Value::date(created + kVeltoIDDBFlushDelay)},
+                 {kCertificateReference, "no data"}, {"Expires", "any kind"}, {"SerialNumber", number(7)}}));
+    EXPECT_EQ(entry(), (Dictionary{{"CreationDate", created},
                                    {"encDsId", "d"},
-                                   {"CertificateReference", kReference},
+                                   {kCertificateReference, kReference},
                                    {"Expires", "any kind"},
                                    {"CertType", "stays"},
-                                   {"Dirty", flag(true)},
-                                   {"ModificationDate", Value::date(updated)}}));
+                                   {"Dirty", kOn},
+                                   {"ModificationDate", date()}}));
     EXPECT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
-    EXPECT_EQ(entry(), (Dictionary{{"Dirty", flag(true)}, {"ModificationDate", Value::date(updated)}}));
+    EXPECT_EQ(entry(), (Dictionary{{"Dirty", kOn}, {"ModificationDate", date()}}));
     EXPECT_FALSE(__VeltoIDDBSetCertificateInfo(nullptr, std::nullopt));
 }
 
 TEST_F(CertificatesTest, SettingAValue) {
-    struct Case {
-        const char* what;
-        const char* key;
-        Value value;
-        bool signal;
-        const char* effects;
-        Value dirty;
+    using enum Notify;
+    constexpr const char* kAll = "written, signalled";
+    const std::tuple<const char*, const char*, Value, Notify, std::string, Value> cases[] = {
+        {"a new value", "k", "b", Yes, kAll, kOn},
+        {"quietly", "k", "b", No, "written", {}},
+        {"an equal one", "k", "a", Yes, "", {}},
+        {"none", "k", {}, Yes, kAll, kOn},
+        {"Null", "k", kGone, Yes, kAll, kOn},
+        {"none for nothing", "x", {}, Yes, "", {}},
+        {"the mark", "Dirty", kOff, Yes, "written", kOff},
+        {"the modification date", "ModificationDate", Value::date(1), Yes, "written", kOn},
     };
-    const Case cases[] = {
-        {"a new value", "k", "b", true, "written, signalled", flag(true)},
-        {"quietly", "k", "b", false, "written", {}},
-        {"an equal one", "k", "a", true, "", {}},
-        {"none", "k", {}, true, "written, signalled", flag(true)},
-        {"Null", "k", Value::null(), true, "written, signalled", flag(true)},
-        {"none for nothing", "x", {}, true, "", {}},
-        {"the mark", "Dirty", flag(false), true, "written", flag(false)},
-        {"the modification date", "ModificationDate", Value::date(1), true, "written", flag(true)},
-    };
-    for (const Case& each : cases) {
+    for (const auto& [what, key, value, notify, effects, dirty] : cases) {
+        SCOPED_TRACE(what);
         ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
         ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", "a", Notify::No));
         ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d", "Dirty", {}, Notify::No));
         const Value modified = entry()["ModificationDate"];
-        double changedAt = 0;
         clock_.advanceBy(10);
-        EXPECT_EQ(effectsOf([&] {
-                      changedAt = now();
-                      EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", each.key, each.value,
-                                                                 each.signal ? Notify::Yes : Notify::No));
+        EXPECT_EQ(effectsOf([&, key = key, &value = value, notify = notify] {
+                      EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", key, value, notify));
                   }),
-                  each.effects)
-            << each.what;
-        EXPECT_EQ(entry()["Dirty"], each.dirty) << each.what;
-        EXPECT_EQ(entry()["ModificationDate"],
-                  std::string_view(each.effects).empty() ? modified : Value::date(changedAt))
-            << each.what;
+                  effects);
+        EXPECT_EQ(entry()["Dirty"], dirty);
+        EXPECT_EQ(entry()["ModificationDate"], effects.empty() ? modified : operationDate());
     }
-    EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", Value::null(), Notify::No));
+    EXPECT_TRUE(__VeltoIDDBSetCertificateValue("d", "k", kGone, Notify::No));
     EXPECT_FALSE(entry().contains("k"));
     EXPECT_FALSE(__VeltoIDDBSetCertificateValue("e", "k", "a", Notify::Yes));
     EXPECT_FALSE(__VeltoIDDBSetCertificateValue(nullptr, "k", "a", Notify::Yes));
@@ -99,8 +85,7 @@ TEST_F(CertificatesTest, SettingAValue) {
 }
 
 TEST_F(CertificatesTest, KeysAndRemoval) {
-    EXPECT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
-    EXPECT_TRUE(__VeltoIDDBSetCertificateInfo("e", std::nullopt));
+    for (const char* key : {"d", "e"}) EXPECT_TRUE(__VeltoIDDBSetCertificateInfo(key, std::nullopt));
     Array keys;
     EXPECT_TRUE(__VeltoIDDBCopyCertificateKeys(&keys));
     EXPECT_EQ(keys, (Array{"d", "e"}));
@@ -114,13 +99,7 @@ TEST_F(CertificatesTest, KeysAndRemoval) {
 
 TEST_F(CertificatesTest, ValidUntilADayAfterItHasExpired) {
     constexpr double kHour = 3600;
-    struct Case {
-        const char* what;
-        Value status;
-        Value expires;
-        bool isValid;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, Value, Value, bool> cases[] = {
         {"no expiry", "CERT_ISSUED", {}, true},
         {"an expiry that is no date", "CERT_ISSUED", "yesterday", true},
         {"in time", "CERT_ISSUED", date(kHour), true},
@@ -132,10 +111,10 @@ TEST_F(CertificatesTest, ValidUntilADayAfterItHasExpired) {
         {"no status", {}, date(kHour), false},
         {"a status that is no text", number(1), date(kHour), false},
     };
-    for (const Case& each : cases) {
-        ASSERT_TRUE(__VeltoIDDBSetCertificateInfo(
-            "d", Dictionary{{"CertStatus", each.status}, {"Expires", each.expires}}));
-        EXPECT_EQ(hasValidCertificateEntry("d"), each.isValid) << each.what;
+    for (const auto& [what, status, expires, isValid] : cases) {
+        ASSERT_TRUE(
+            __VeltoIDDBSetCertificateInfo("d", Dictionary{{"CertStatus", status}, {"Expires", expires}}));
+        EXPECT_EQ(hasValidCertificateEntry("d"), isValid) << what;
     }
     EXPECT_FALSE(hasValidCertificateEntry("nobody"));
     EXPECT_FALSE(hasValidCertificateEntry(nullptr));

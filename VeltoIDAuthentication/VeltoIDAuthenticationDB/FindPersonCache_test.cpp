@@ -1,16 +1,13 @@
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
 
-#include <algorithm>
-#include <filesystem>
 #include <limits>
-#include <thread>
 
 #include "TestSupport/DatabaseFixture.h"
+#include "TestSupport/SideBySide.h"
 
 namespace veltoid {
 namespace {
 
-constexpr double kDay = 86'400;
 constexpr std::string_view kKey = "findPersonCache";
 
 class FindPersonCacheTest : public DatabaseTest {
@@ -53,43 +50,38 @@ class FindPersonCacheTest : public DatabaseTest {
 };
 
 TEST_F(FindPersonCacheTest, AnEntryIsGoodForItsInterval) {
-    constexpr double kInfinity = std::numeric_limits<double>::infinity();
-    struct Case {
-        const char* what;
-        Value interval;
-        /// How long it is found; negative: never.
-        double seconds;
-    };
-    const Case cases[] = {
+    using Limits = std::numeric_limits<double>;
+    // How long it is found; negative: never.
+    const std::tuple<const char*, Value, double> cases[] = {
         {"none", {}, 14 * kDay},
         {"a minute", number(60), 60},
         {"no time", number(0), 0},
         {"no number", "60", 14 * kDay},
         {"negative", number(-1), -1},
-        {"not a number", Value::real(std::numeric_limits<double>::quiet_NaN()), -1},
-        {"endless", Value::real(kInfinity), 365 * kDay},
+        {"not a number", Value::real(Limits::quiet_NaN()), -1},
+        {"endless", Value::real(Limits::infinity()), 365 * kDay},
         {"nearly endless", Value::uint64(std::numeric_limits<uint64_t>::max()), 365 * kDay},
-        {"endless backwards", Value::real(-kInfinity), -1},
+        {"endless backwards", Value::real(-Limits::infinity()), -1},
     };
     const double start = now();
-    for (const Case& each : cases) {
+    for (const auto& [what, interval, seconds] : cases) {
+        SCOPED_TRACE(what);
         clock_.jumpTo(start);
-        add({person("a", each.interval)});
-        EXPECT_EQ(isFound("a"), each.seconds >= 0) << each.what;
+        add({person("a", interval)});
+        EXPECT_EQ(isFound("a"), seconds >= 0);
         clock_.jumpTo(start - 1);
-        EXPECT_FALSE(isFound("a")) << each.what << ": before it was stored";
-        clock_.jumpTo(start + std::max(each.seconds, 0.0));
-        EXPECT_EQ(isFound("a"), each.seconds >= 0) << each.what;
-        clock_.jumpTo(start + std::max(each.seconds, 0.0) + 1);
-        EXPECT_FALSE(isFound("a")) << each.what;
+        EXPECT_FALSE(isFound("a")) << "before it was stored";
+        const double end = start + std::max(seconds, 0.0);
+        clock_.jumpTo(end);
+        EXPECT_EQ(isFound("a"), seconds >= 0);
+        clock_.jumpTo(end + 1);
+        EXPECT_FALSE(isFound("a"));
     }
 }
 
 TEST_F(FindPersonCacheTest, FindsWhatMatchedInTheOrderOfTheCriteria) {
-    Value tooDeep = Array();
-    for (int depth = 0; depth < 70; ++depth) tooDeep = Array{tooDeep};
     Dictionary deepPerson = person("deep");
-    deepPerson.set("x", tooDeep);
+    deepPerson.set("x", nestedArrays(70));
     const Dictionary phone = {{"matched", "phone"}, {"value", "1"}, {"FirstName", "P"}};
     add({person("a"), "text", Dictionary{{"matched", "email"}}, Dictionary{{"value", "v"}},
          Dictionary{{"matched", "email"}, {"value", number(1)}}, deepPerson, phone, person("b")});
@@ -154,18 +146,12 @@ TEST_F(FindPersonCacheTest, WhatCannotBeReadNowIsReadLaterAndNeverOverwritten) {
                                      {"email-both", dated(person("both", number(1)), date())}});
                     return true;
                 }).succeeded());
-    // Something in the way of the file: it cannot be opened now, and may be later.
-    const auto file = platform::TemporaryStateDirectory::file("preferences.db");
-    const auto aside = directory_.base() / "aside";
-    std::filesystem::rename(file, aside);
-    std::filesystem::create_directory(file);
+    std::optional<platform::Obstacle> obstacle("preferences.db");
     add({person("both")});
     EXPECT_TRUE(isFound("both"));
     EXPECT_FALSE(isFound("stored"));
     flush();
-    std::filesystem::remove(file);
-    std::filesystem::rename(aside, file);
-
+    obstacle.reset();
     EXPECT_TRUE(isFound("stored"));
     EXPECT_EQ(find(Array{"both"}), Array{dated(person("both"), date(-kVeltoIDDBFlushDelay))})
         << "the newer one";
@@ -223,18 +209,14 @@ TEST_F(FindPersonCacheTest, TheOldestGoWhenThereAreTooMany) {
 }
 
 TEST_F(FindPersonCacheTest, ManyMayUseItAtOnce) {
-    std::vector<std::thread> threads;
-    for (int i = 0; i < 4; ++i) {
-        threads.emplace_back([i] {
-            for (int round = 0; round < 50; ++round) {
-                const String name = std::to_string(i) + "," + std::to_string(round);
-                add({person(name), person("all")});
-                EXPECT_TRUE(isFound(name) && isFound("all"));
-                EXPECT_TRUE(round % 10 != 0 || __VeltoIDDBWriteFindPersonCache());
-            }
-        });
-    }
-    for (std::thread& thread : threads) thread.join();
+    platform::sideBySide(4, [](int i) {
+        for (int round = 0; round < 50; ++round) {
+            const String name = std::to_string(i) + "," + std::to_string(round);
+            add({person(name), person("all")});
+            EXPECT_TRUE(isFound(name) && isFound("all"));
+            EXPECT_TRUE(round % 10 != 0 || __VeltoIDDBWriteFindPersonCache());
+        }
+    });
     flush();
     EXPECT_EQ(stored().size(), 4U * 50U + 1U);
 }

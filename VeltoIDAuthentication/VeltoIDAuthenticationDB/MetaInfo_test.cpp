@@ -14,18 +14,15 @@ constexpr auto kNumber = Value::Kind::Number;
 const Value kDefaultURL = "https://identity.velto.example/dsservices/dsxmlrpc";
 
 TEST_F(MetaInfoTest, TheNearestValueOfTheRightKindIsFound) {
-    struct Case {
+    const Value one = number(1);
+    const struct {
         const char* what;
         const char* key;
         /// What the options, the account's section and the top level hold.
-        Value option;
-        Value own;
-        Value top;
+        Value option, own, top;
         std::optional<Value::Kind> kind;
         Value found;
-    };
-    const Value one = number(1);
-    const Case cases[] = {
+    } cases[] = {
         {"options first", "k", "o", "s", "t", {}, "o"},
         {"then the account's", "k", {}, "s", "t", {}, "s"},
         {"then the device's", "k", {}, {}, "t", {}, "t"},
@@ -39,49 +36,40 @@ TEST_F(MetaInfoTest, TheNearestValueOfTheRightKindIsFound) {
         {"before the built-in one", "ServerURL", {}, {}, "t", kString, "t"},
         {"the other built-in one", "PreExpirationInterval", {}, {}, {}, {}, Value::real(129'600)},
     };
-    for (const Case& each : cases) {
-        __VeltoIDDBSetMetaInfoValue("account", each.key, each.own);
-        __VeltoIDDBSetMetaInfoValue(nullptr, each.key, each.top);
-        EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue("account", {{each.key, each.option}}, each.key, each.kind),
-                  each.found)
-            << each.what;
+    for (const auto& [what, key, option, own, top, kind, found] : cases) {
+        __VeltoIDDBSetMetaInfoValue("account", key, own);
+        __VeltoIDDBSetMetaInfoValue(nullptr, key, top);
+        EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue("account", {{key, option}}, key, kind), found) << what;
     }
     __VeltoIDDBSetMetaInfoValue("account", "k", "own");
     __VeltoIDDBSetMetaInfoValue(nullptr, "k", "top");
-    EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue(nullptr, {}, "k"), Value("top"));
-    EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue("somebody else", {}, "k"), Value("top"));
-    EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue("k", {}, "k"), Value("top")) << "a section that is no dictionary";
+    // The last is a section that is no dictionary.
+    for (const String& section : {String(), String("somebody else"), String("k")})
+        EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue(section, {}, "k"), Value("top")) << section.view();
     EXPECT_TRUE(__VeltoIDDBCopyMetaInfoValue("account", {}, nullptr).isAbsent());
 }
 
 TEST_F(MetaInfoTest, SettingWritesChangesAndNeverSignals) {
-    struct Case {
+    // One after the other.
+    const struct {
         const char* what;
-        String section;
+        String where;
         Value value;
         const char* effects;
-        Value top;
-        Value own;
+        Value top, own;
+    } cases[] = {
+        {"nothing to remove", nullptr, {}, "", {}, {}},  {"a value", nullptr, "t", "written", "t", {}},
+        {"the same", nullptr, "t", "", "t", {}},         {"in a section", "s", "own", "written", "t", "own"},
+        {"the same there", "s", "own", "", "t", "own"},  {"none removes", nullptr, {}, "written", {}, "own"},
+        {"Null removes", "s", kGone, "written", {}, {}}, {"nothing left there", "s", kGone, "", {}, {}},
     };
-    // One after the other.
-    const Case cases[] = {
-        {"nothing to remove", nullptr, {}, "", {}, {}},
-        {"a value", nullptr, "t", "written", "t", {}},
-        {"the same", nullptr, "t", "", "t", {}},
-        {"in a section", "s", "own", "written", "t", "own"},
-        {"the same there", "s", "own", "", "t", "own"},
-        {"none removes", nullptr, {}, "written", {}, "own"},
-        {"Null removes", "s", Value::null(), "written", {}, {}},
-        {"nothing left there", "s", Value::null(), "", {}, {}},
-    };
-    for (const Case& each : cases) {
-        EXPECT_EQ(effectsOf([&] { EXPECT_TRUE(__VeltoIDDBSetMetaInfoValue(each.section, "k", each.value)); }),
-                  each.effects)
-            << each.what;
+    for (const auto& [what, where, value, effects, top, own] : cases) {
+        SCOPED_TRACE(what);
+        EXPECT_EQ(effectsOf([&] { EXPECT_TRUE(__VeltoIDDBSetMetaInfoValue(where, "k", value)); }), effects);
         database::perform([&](const database::Store& store) {
-            EXPECT_EQ(store.metaInfo["k"], each.top) << each.what;
+            EXPECT_EQ(store.metaInfo["k"], top);
             const Dictionary* section = store.metaInfo.dictionary("s");
-            EXPECT_EQ(section != nullptr ? (*section)["k"] : Value(), each.own) << each.what;
+            EXPECT_EQ(section != nullptr ? (*section)["k"] : Value(), own);
         });
     }
     EXPECT_FALSE(__VeltoIDDBSetMetaInfoValue("s", nullptr, "v"));
@@ -89,13 +77,7 @@ TEST_F(MetaInfoTest, SettingWritesChangesAndNeverSignals) {
 
 TEST_F(MetaInfoTest, CountersCount) {
     constexpr int64_t kMost = std::numeric_limits<int64_t>::max();
-    struct Case {
-        const char* what;
-        Value stored;
-        int64_t delta;
-        int64_t sum;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, Value, int64_t, int64_t> cases[] = {
         {"absent", {}, 5, 5},
         {"counted before", number(5), 2, 7},
         {"downwards", number(5), -6, -1},
@@ -104,16 +86,18 @@ TEST_F(MetaInfoTest, CountersCount) {
         {"a fraction", Value::real(4.5), 1, 1},
         {"beyond the range", number(kMost), 1, std::numeric_limits<int64_t>::min()},
     };
-    for (const Case& each : cases) {
-        __VeltoIDDBSetMetaInfoValue(nullptr, "c", each.stored);
-        EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter(nullptr, {}, "c", each.delta), each.sum) << each.what;
+    for (const auto& [what, before, delta, sum] : cases) {
+        SCOPED_TRACE(what);
+        __VeltoIDDBSetMetaInfoValue(nullptr, "c", before);
+        EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter(nullptr, {}, "c", delta), sum);
         const Value stored = __VeltoIDDBCopyMetaInfoValue(nullptr, {}, "c");
-        EXPECT_EQ(stored, number(each.sum)) << each.what;
-        EXPECT_EQ(stored.numberKind(), NumberKind::Int64) << each.what;
+        EXPECT_EQ(stored, number(sum));
+        EXPECT_EQ(stored.numberKind(), NumberKind::Int64);
     }
     __VeltoIDDBSetMetaInfoValue(nullptr, "c", number(100));
-    EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {}, "c", 1), 101) << "from where it is found";
-    EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {}, "c", 1), 102);
+    for (const int sum : {101, 102})
+        EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {}, "c", 1), sum)
+            << "from where it is found";
     EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {{"c", number(1)}}, "c", 1), 2);
     EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue(nullptr, {}, "c"), number(100)) << "the device's own stays";
     EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {}, nullptr, 1), 0);

@@ -1,9 +1,7 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 
-#include <filesystem>
-#include <thread>
-
 #include "TestSupport/DatabaseFixture.h"
+#include "TestSupport/SideBySide.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
@@ -78,7 +76,7 @@ const VersionCase kVersionCases[] = {
     {"WholeDouble", Value::real(100), true},
     {"Fraction", Value::real(100.5), false},
     {"Text", "100", false},
-    {"Boolean", flag(true), false},
+    {"Boolean", kOn, false},
 };
 INSTANTIATE_TEST_SUITE_P(Versions, StoredVersion, testing::ValuesIn(kVersionCases),
                          [](const auto& each) { return each.param.name; });
@@ -138,6 +136,7 @@ Array reals(std::initializer_list<double> values) {
     return array;
 }
 
+const Array kNotPositive = {"x", number(0), Value::real(-300)};
 const MigrationCase kMigrationCases[] = {
     {"None", {}, {}, reals({727.8})},
     {"NoArray", "300", {}, reals({727.8})},
@@ -158,10 +157,7 @@ const MigrationCase kMigrationCases[] = {
     {"Mixture", reals({300, 500, 600}), {"dirty", "uuid", "lists"}, reals({600, 500, 300, 727.8})},
     {"OldAndOwn", reals({300, 727.8}), {"dirty"}, reals({727.8, 300}), false},
     {"UUIDAndOwn", reals({500, 727.8}), {"uuid"}, reals({500, 727.8})},
-    {"NotPositive",
-     Array{"x", number(0), Value::real(-300)},
-     {},
-     Array{"x", number(0), Value::real(-300), kOwnVersion}},
+    {"NotPositive", kNotPositive, {}, Array{"x", number(0), Value::real(-300), kOwnVersion}},
     {"OthersBehindOldOnes", Array{"x", Value::real(300), number(0)}, {"dirty"}, reals({300, 727.8})},
 };
 INSTANTIATE_TEST_SUITE_P(Accessors, Migration, testing::ValuesIn(kMigrationCases),
@@ -232,21 +228,16 @@ TEST_F(StoreTest, OnlyTheChangedSectionIsWritten) {
     ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("a", nullptr, nullptr));
     ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
     ASSERT_TRUE(__VeltoIDDBSetMetaInfoValue(nullptr, "m", "1"));
-    struct Case {
-        std::string_view section;
-        std::function<void()> change;
-    };
-    const Case cases[] = {
+    const std::pair<std::string_view, std::function<void()>> cases[] = {
         {"Accounts", [] { __VeltoIDDBSetAccountValue("a", "x", "1", Notify::No); }},
         {"AuthCertificates", [] { __VeltoIDDBSetCertificateValue("d", "x", "1", Notify::No); }},
         {"MetaInfo", [] { __VeltoIDDBSetMetaInfoValue(nullptr, "x", "1"); }},
     };
-    for (const Case& each : cases) {
+    for (const auto& [changed, change] : cases) {
         ASSERT_TRUE(domain().remove({"Accounts", "AuthCertificates", "MetaInfo"}));
-        each.change();
-        const Dictionary stored = storedDomain();
-        for (const std::string_view section : {"Accounts", "AuthCertificates", "MetaInfo"})
-            EXPECT_EQ(stored.contains(section), section == each.section) << section << " " << each.section;
+        change();
+        EXPECT_EQ(keysOf(storedDomain()), (std::set<std::string>{"AccessorVersions", "CreationDate",
+                                                                 "Version", std::string(changed)}));
     }
     __VeltoIDDBSetUsePreferences(true);
 }
@@ -317,12 +308,8 @@ TEST_F(StoreTest, AStoreThatCannotBeReadIsNeverOverwritten) {
                     return __VeltoIDDBCreateVeltoIDAccount("kept", nullptr, nullptr) &&
                            __VeltoIDDBSynchronize();
                 }).succeeded());
-    // Something in the way of the file: it cannot be opened now, and may be later.
-    const auto file = platform::TemporaryStateDirectory::file("preferences.db");
-    const auto aside = directory_.base() / "aside";
-    std::filesystem::rename(file, aside);
-    std::filesystem::create_directory(file);
-    const auto before = platform::TemporaryStateDirectory::readFile(aside);
+    std::optional<platform::Obstacle> obstacle("preferences.db");
+    const auto before = platform::TemporaryStateDirectory::readFile(obstacle->aside());
     std::optional<Error> error;
     EXPECT_FALSE(__VeltoIDDBCopyVeltoIDs(nullptr, &error));
     EXPECT_EQ(error->code, -1) << "not that there are no accounts";
@@ -335,10 +322,8 @@ TEST_F(StoreTest, AStoreThatCannotBeReadIsNeverOverwritten) {
     __VeltoIDDBSetUsePreferences(true);
     EXPECT_EQ(takeSignals(), 0);
     EXPECT_FALSE(log_.contains("Password not in keychain")) << "an item that no record names";
-    std::filesystem::remove(file);
-    EXPECT_EQ(platform::TemporaryStateDirectory::readFile(aside), before);
-    std::filesystem::rename(aside, file);
-
+    EXPECT_EQ(platform::TemporaryStateDirectory::readFile(obstacle->aside()), before);
+    obstacle.reset();
     EXPECT_EQ(accountNames(), Array{"kept"}) << "readable again, without a restart";
     EXPECT_TRUE(__VeltoIDDBCopyMetaInfoValue(nullptr, {}, "lost").isAbsent());
     EXPECT_TRUE(__VeltoIDDBSetAccountValue("kept", "x", "y", Notify::Yes));
@@ -348,8 +333,7 @@ TEST_F(StoreTest, WhatCannotBeStoredIsNotKeptInMemoryEither) {
     ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("a", nullptr, nullptr));
     ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d", std::nullopt));
     const Dictionary before = account("a");
-    Value tooDeep = Array();
-    for (int depth = 0; depth < 1000; ++depth) tooDeep = Array{tooDeep};
+    const Value tooDeep = nestedArrays(1000);
     EXPECT_EQ(effectsOf([&] {
                   EXPECT_FALSE(__VeltoIDDBSetAccountValue("a", "x", tooDeep, Notify::Yes));
                   EXPECT_FALSE(__VeltoIDDBSetCertificateValue("d", "x", tooDeep, Notify::Yes));
@@ -361,19 +345,15 @@ TEST_F(StoreTest, WhatCannotBeStoredIsNotKeptInMemoryEither) {
 }
 
 TEST_F(StoreTest, ConcurrentFirstCallersShareOneLoad) {
-    std::vector<std::thread> threads;
-    for (int i = 0; i < 8; ++i) {
-        threads.emplace_back([i] {
-            const std::string name = "account" + std::to_string(i);
-            EXPECT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, nullptr, nullptr));
-            for (int round = 0; round < 20; ++round) {
-                EXPECT_TRUE(__VeltoIDDBSetAccountValue(name, "round", number(round), Notify::Yes));
-                EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter(name, {}, "rounds", 1), round + 1);
-                EXPECT_TRUE(__VeltoIDDBSynchronize());
-            }
-        });
-    }
-    for (std::thread& thread : threads) thread.join();
+    platform::sideBySide(8, [](int i) {
+        const std::string name = "account" + std::to_string(i);
+        EXPECT_TRUE(__VeltoIDDBCreateVeltoIDAccount(name, nullptr, nullptr));
+        for (int round = 0; round < 20; ++round) {
+            EXPECT_TRUE(__VeltoIDDBSetAccountValue(name, "round", number(round), Notify::Yes));
+            EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter(name, {}, "rounds", 1), round + 1);
+            EXPECT_TRUE(__VeltoIDDBSynchronize());
+        }
+    });
     EXPECT_EQ(accountNames().size(), 8U);
 }
 

@@ -2,6 +2,7 @@
 
 #include "TestSupport/EngineFixture.h"
 #include "TestSupport/TestAuthority.h"
+#include "Values/DictionaryAccess.h"
 
 namespace veltoid {
 namespace {
@@ -11,12 +12,11 @@ class Information : public EngineTest {
     /// A complete record, validated `age` seconds ago.
     void prepare(double age) {
         createAccount("d1");
-        const Dictionary values = {{"ValidatedEmail", kEmails},
-                                   {"ValidationDate", date(-age)},
-                                   {"ForceValidation", Value::null()},
-                                   {"NextValidationDate", Value::null()},
-                                   {"Dirty", Value::null()}};
-        setValues(values);
+        setValues({{"ValidatedEmail", kEmails},
+                   {"ValidationDate", date(-age)},
+                   {"ForceValidation", kGone},
+                   {"NextValidationDate", kGone},
+                   {"Dirty", kGone}});
     }
 
     bool get(const Dictionary& options, const String& name = kName) {
@@ -30,14 +30,7 @@ class Information : public EngineTest {
 };
 
 TEST_F(Information, IsFreshForSomeTime) {
-    struct Case {
-        const char* what;
-        double age;
-        Value own;
-        Value presumed;
-        bool isFresh;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, double, Value, Value, bool> cases[] = {
         {"now", 0, {}, {}, true},
         {"two hours", 7200, {}, {}, true},
         {"eight hours", 28'800, {}, {}, true},
@@ -55,11 +48,11 @@ TEST_F(Information, IsFreshForSomeTime) {
         {"presumed caps its own", 31, number(50), number(30), false},
         {"presumed is no number", 28'800, {}, "5", true},
     };
-    for (const Case& each : cases) {
-        prepare(each.age);
-        setValue("ValidForInterval", each.own);
-        __VeltoIDDBSetMetaInfoValue(nullptr, "AccountPresumedValidInterval", each.presumed);
-        EXPECT_EQ(get({{"SkipValidation", kOn}}), each.isFresh) << each.what;
+    for (const auto& [what, age, own, presumed, isFresh] : cases) {
+        prepare(age);
+        setValue("ValidForInterval", own);
+        __VeltoIDDBSetMetaInfoValue(nullptr, "AccountPresumedValidInterval", presumed);
+        EXPECT_EQ(get({{"SkipValidation", kOn}}), isFresh) << what;
     }
     prepare(0);
     setValue("ValidationDate", "today");
@@ -70,15 +63,6 @@ TEST_F(Information, IsFreshForSomeTime) {
 TEST_F(Information, IsAskedForWhenItMustBe) {
     enum class State { Fresh, Stale, Incomplete };
     using enum State;
-    struct Case {
-        const char* what;
-        State state;
-        Dictionary options;
-        Server server;
-        bool answers;
-        const char* methods;
-        bool marks;
-    };
     constexpr const char* kRecord = "ForceValidationRecordFetch";
     constexpr const char* kSerial = "ValidateCertificateSerialNumber";
     constexpr const char* kForce = "ForceValidation";
@@ -86,9 +70,16 @@ TEST_F(Information, IsAskedForWhenItMustBe) {
     constexpr const char* kDefer = "DeferValidation";
     constexpr const char* kAsked = "authenticate getMyInfo";
     constexpr const char* kTried = "authenticate";
-    const Dictionary skipBeforeAll = {
-        {kSkip, kOn}, {kDefer, kOn}, {kRecord, kOn}, {kSerial, kOn}, {kForce, kOn}};
-    const Case cases[] = {
+    const Dictionary all = {{kSkip, kOn}, {kDefer, kOn}, {kRecord, kOn}, {kSerial, kOn}, {kForce, kOn}};
+    const struct {
+        const char* what;
+        State state;
+        Dictionary options;
+        Server server;
+        bool answers;
+        const char* methods;
+        bool marks;
+    } cases[] = {
         {"fresh", Fresh, {}, Server::Up, true, "", false},
         {"forced", Fresh, {{kForce, kOn}}, Server::Up, true, kAsked, false},
         {"record", Fresh, {{kRecord, kOn}}, Server::Up, true, kAsked, false},
@@ -99,7 +90,7 @@ TEST_F(Information, IsAskedForWhenItMustBe) {
         {"skip, fresh", Fresh, {{kSkip, kOn}}, Server::Up, true, "", false},
         {"skip, stale", Stale, {{kSkip, kOn}}, Server::Up, false, "", false},
         {"skip, incomplete", Incomplete, {{kSkip, kOn}}, Server::Up, false, "", false},
-        {"skip before all", Stale, skipBeforeAll, Server::Up, false, "", false},
+        {"skip before all", Stale, all, Server::Up, false, "", false},
         {"defer, fresh", Fresh, {{kDefer, kOn}}, Server::Up, true, "", true},
         {"defer, incomplete", Incomplete, {{kDefer, kOn}}, Server::Up, false, "", false},
         {"defer before force", Stale, {{kDefer, kOn}, {kForce, kOn}}, Server::Up, true, "", true},
@@ -109,22 +100,23 @@ TEST_F(Information, IsAskedForWhenItMustBe) {
         {"stale, no answer", Stale, {}, Server::NoAnswer, true, kAsked, false},
         {"stale, wrong password", Stale, {}, Server::RefusesPassword, true, kTried, true},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, state, options, server, answers, methods, marks] : cases) {
+        SCOPED_TRACE(what);
         __VeltoIDDBRemoveVeltoIDAccount(kName);
-        prepare(each.state == Stale ? 30'000 : 10);
-        if (each.state == Incomplete) setValue("ValidatedEmail", {});
-        serverIs(each.server);
-        EXPECT_EQ(get(each.options), each.answers) << each.what;
-        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        EXPECT_EQ(error_ ? error_->code : 0, each.answers ? 0 : -100) << each.what;
-        EXPECT_EQ(record()["ForceValidation"], each.marks ? kOn : Value()) << each.what;
-        EXPECT_EQ(record()["NextValidationDate"], each.marks ? date() : Value()) << each.what;
-        const bool validated = each.server == Server::Up && std::string_view(each.methods) == kAsked;
-        EXPECT_EQ(record()["ValidationDate"] == date(), validated) << each.what;
-        EXPECT_EQ(record().contains("Dirty"), each.marks || validated || !hasPassword()) << each.what;
-        EXPECT_EQ(hasPassword(), each.server != Server::RefusesPassword) << each.what;
-        EXPECT_EQ(info_.contains("encDsId"), each.answers && std::string_view(each.methods) != kTried)
-            << each.what << ": unknown when the sign-in failed";
+        prepare(state == Stale ? 30'000 : 10);
+        if (state == Incomplete) setValue("ValidatedEmail", {});
+        serverIs(server);
+        EXPECT_EQ(get(options), answers);
+        EXPECT_EQ(server_.takeMethods(), methods);
+        EXPECT_EQ(error_ ? error_->code : 0, answers ? 0 : -100);
+        EXPECT_EQ(record()["ForceValidation"], marks ? kOn : Value());
+        EXPECT_EQ(record()["NextValidationDate"], marks ? date() : Value());
+        const bool validated = server == Server::Up && std::string_view(methods) == kAsked;
+        EXPECT_EQ(record()["ValidationDate"] == date(), validated);
+        EXPECT_EQ(record().contains("Dirty"), marks || validated || !hasPassword());
+        EXPECT_EQ(hasPassword(), server != Server::RefusesPassword);
+        EXPECT_EQ(info_.contains("encDsId"), answers && std::string_view(methods) != kTried)
+            << "unknown when the sign-in failed";
     }
     setValue("NextValidationDate", date(77));
     ASSERT_TRUE(get({{kDefer, kOn}}));
@@ -133,29 +125,27 @@ TEST_F(Information, IsAskedForWhenItMustBe) {
 
 TEST_F(Information, AnswersWhatRecordAndCertificateEntryHold) {
     prepare(10);
-    const Dictionary values = {{"FirstName", "Jane"},
-                               {"LastName", number(1)},
-                               {"EmailAddresess", Array{"a", "b"}},
-                               {"ValidatedPhones", "no list"},
-                               {"PrimaryEmail", "not told"}};
-    setValues(values);
-    const Dictionary expected = {{"VeltoID", kName},          {"encDsId", "d1"},
+    setValues({{"FirstName", "Jane"},
+               {"LastName", number(1)},
+               {"EmailAddresess", Array{"a", "b"}},
+               {"ValidatedPhones", "no list"},
+               {"PrimaryEmail", "not told"}});
+    const Dictionary ofRecord = {{"VeltoID", kName},          {"encDsId", "d1"},
                                  {"FirstName", "Jane"},       {"AllEmails", Array{"a", "b"}},
                                  {"ValidatedEmail", kEmails}, {"ValidationDate", date(-10)}};
     ASSERT_TRUE(get({}));
-    EXPECT_EQ(info_, expected);
+    EXPECT_EQ(info_, ofRecord);
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"Expires", date(5)}, {"SerialNumber", "7"}});
     __VeltoIDDBSetCertificateValue("d1", "CertificatePEM", "pem", Notify::No);
     __VeltoIDDBSetCertificateValue("d1", "Date", date(1), Notify::No);
-    Dictionary withCertificate = expected;
-    withCertificate.set("CertificatePEM", "pem");
-    withCertificate.set("CertificateExpiration", date(5));
-    withCertificate.set("SerialNumber", "7");
-    withCertificate.set("CertificateDate", date(1));
-    ASSERT_TRUE(get({}));
-    EXPECT_EQ(info_, withCertificate);
-    ASSERT_TRUE(get({}, nullptr)) << "without a name, of the first account";
-    EXPECT_EQ(info_, withCertificate);
+    const Dictionary ofEntry = {{"CertificatePEM", "pem"},
+                                {"CertificateExpiration", date(5)},
+                                {"SerialNumber", "7"},
+                                {"CertificateDate", date(1)}};
+    for (const String& name : {String(kName), String()}) {
+        ASSERT_TRUE(get({}, name)) << "without a name, of the first account";
+        EXPECT_EQ(info_, mergeDictionaries(ofRecord, ofEntry, true));
+    }
 }
 
 TEST_F(Information, WithoutAnAccountFails) {
@@ -175,15 +165,8 @@ TEST_F(Information, WithoutAnAccountFails) {
 }
 
 TEST_F(Information, TellsTheServerWhichRecordItHas) {
-    struct Case {
-        const char* what;
-        Dictionary options;
-        Value identifier;
-        Value data;
-        const char* sent;
-    };
     const Value noBytes = Data(std::vector<uint8_t>{});
-    const Case cases[] = {
+    const std::tuple<const char*, Dictionary, Value, Value, const char*> cases[] = {
         {"both", {}, "v1", kRecordData, "v1"},
         {"forced", {{"ForceValidationRecordFetch", kOn}}, "v1", kRecordData, ""},
         {"no identifier", {}, {}, kRecordData, ""},
@@ -191,28 +174,23 @@ TEST_F(Information, TellsTheServerWhichRecordItHas) {
         {"empty data", {}, "v1", noBytes, ""},
     };
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
-    for (const Case& each : cases) {
+    for (const auto& [what, options, identifier, data, told] : cases) {
+        SCOPED_TRACE(what);
         prepare(30'000);
-        setValue(kIdentifier, each.identifier);
-        setValue(kData, each.data);
-        ASSERT_TRUE(get(each.options)) << each.what;
+        setValue(kIdentifier, identifier);
+        setValue(kData, data);
+        ASSERT_TRUE(get(options));
         const Dictionary sent = server_.take().back().parameters;
-        EXPECT_EQ(sent["ClientVIDVRecordIdentifier"], Value(each.sent)) << each.what;
-        EXPECT_EQ(sent["CertificateSerialNumber"], Value("7")) << each.what;
+        EXPECT_EQ(sent["ClientVIDVRecordIdentifier"], Value(told));
+        EXPECT_EQ(sent["CertificateSerialNumber"], Value("7"));
     }
 }
 
 TEST_F(Information, ChangesThatClientsSeeArePosted) {
-    struct Case {
-        const char* what;
-        Dictionary before;
-        Dictionary answer;
-        bool isPosted;
-    };
     const auto newRecord = [this](const char* identifier) {
         return Dictionary{{kIdentifier, identifier}, {kData, kRecordData}, {kNextCheck, date()}};
     };
-    const Case cases[] = {
+    const std::tuple<const char*, Dictionary, Dictionary, bool> cases[] = {
         {"the same", {{"FirstName", "A"}}, {{"FirstName", "A"}}, false},
         {"a first name", {{"FirstName", "A"}}, {{"FirstName", "B"}}, true},
         {"a last name", {{"LastName", "A"}}, {{"LastName", "B"}}, true},
@@ -227,20 +205,18 @@ TEST_F(Information, ChangesThatClientsSeeArePosted) {
         {"a first record", {}, newRecord("v1"), false},
         {"a record's identifier alone", {{kIdentifier, "v1"}}, {{kIdentifier, "v2"}}, false},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, before, answer, isPosted] : cases) {
+        SCOPED_TRACE(what);
         __VeltoIDDBRemoveVeltoIDAccount(kName);
         prepare(30'000);
-        setValue("ValidatedEmail", {});
-        setValues(each.before);
-        setValue("ForceValidation", kOn);
-        setValue("NextValidationDate", date());
-        updateAccountWithGetMyInfoResult(kName, each.answer);
-        EXPECT_EQ(takePosted(), each.isPosted ? "changed " : "") << each.what;
-        EXPECT_FALSE(record().contains("ForceValidation") || record().contains("NextValidationDate"))
-            << each.what;
-        EXPECT_EQ(record()["ValidationDate"], date()) << each.what;
-        for (const auto& [key, value] : each.answer)
-            EXPECT_EQ(record()[key == "AllEmails" ? "EmailAddresess" : key.view()], value) << each.what;
+        setValues({{"ValidatedEmail", kGone}, {"ForceValidation", kOn}, {"NextValidationDate", date()}});
+        setValues(before);
+        updateAccountWithGetMyInfoResult(kName, answer);
+        EXPECT_EQ(takePosted(), isPosted ? "changed " : "");
+        EXPECT_FALSE(record().contains("ForceValidation") || record().contains("NextValidationDate"));
+        EXPECT_EQ(record()["ValidationDate"], date());
+        for (const auto& [key, value] : answer)
+            EXPECT_EQ(record()[key == "AllEmails" ? "EmailAddresess" : key.view()], value);
     }
     updateAccountWithGetMyInfoResult("nobody", {{"FirstName", "A"}});
     EXPECT_EQ(takePosted(), "changed ") << "there was no record before";
@@ -251,9 +227,9 @@ TEST_F(Information, TheServersWordOnTheCertificateGoesIntoItsEntry) {
     prepare(0);
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERT_ISSUED"}, {"Expires", date(1e6)}});
     updateAccountWithGetMyInfoResult(kName, {{"encDsId", "d1"}, {"FirstName", "A"}});
-    EXPECT_FALSE(certificateEntry().contains("LastSuccessfulValidation"));
+    EXPECT_FALSE(certificateEntry().contains(kValidated));
     updateAccountWithGetMyInfoResult(kName, {{"encDsId", "d1"}, {"CertificateIsValid", kOn}});
-    EXPECT_EQ(certificateEntry()["LastSuccessfulValidation"], date());
+    EXPECT_EQ(certificateEntry()[kValidated], date());
     EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERT_ISSUED"));
     updateAccountWithGetMyInfoResult(kName, {{"encDsId", "d1"}, {"CertificateIsValid", kOff}});
     EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERTIFICATE_INVALID"));
@@ -272,45 +248,41 @@ TEST_F(Information, AValidationRecordIsKeptWithTheDateToLookAtItAgain) {
         return Data(bytes);
     };
     const std::string asOf = "<key>ValidAsOf</key><date>2025-06-15T00:00:00Z</date>";
+    const std::string asText = "<key>ValidAsOf</key><string>2025-06-14 16:00:00 -0800</string>";
     const std::string day = "<key>SuggestValidDuration</key><real>86400</real>";
-    constexpr double kAsOf = 1'749'945'600;
-    const Value none;
-    struct Case {
+    const std::string noNumber = "<key>SuggestValidDuration</key><real>nan</real>";
+    const Value start = Value::date(1'749'945'600);
+    const Value due = Value::date(1'749'945'600 + 64'800);
+    const Value length = number(86'400);
+    const Value given = date(99);
+    const struct {
         const char* what;
         Data data;
-        Value given;
-        Value nextCheck;
-        Value validAsOf;
-        Value duration;
+        Value given, nextCheck, validAsOf, duration;
+    } cases[] = {
+        {"all of it", signedRecord(asOf + day), {}, due, start, length},
+        {"no duration", signedRecord(asOf), {}, start, start, {}},
+        {"no date", signedRecord(day), {}, {}, {}, length},
+        {"a text", signedRecord(asText), {}, start, start, {}},
+        {"no dictionary", Data(authority.sign("<plist><array/></plist>")), {}, {}, {}, {}},
+        {"not signed so", signedRecord(asOf + day, false), {}, {}, {}, {}},
+        {"no record", Data(std::vector<uint8_t>{1}), {}, {}, {}, {}},
+        {"the server's date", signedRecord(asOf + day), given, given, start, length},
+        {"only the server's", signedRecord(asOf, false), given, given, {}, {}},
+        {"no number", signedRecord(asOf + noNumber), {}, start, start, {}},
     };
-    const Value validAsOf = Value::date(kAsOf);
-    const Case cases[] = {
-        {"all of it", signedRecord(asOf + day), none, Value::date(kAsOf + 64'800), validAsOf, number(86'400)},
-        {"no duration", signedRecord(asOf), none, validAsOf, validAsOf, none},
-        {"no date", signedRecord(day), none, none, none, number(86'400)},
-        {"a text", signedRecord("<key>ValidAsOf</key><string>2025-06-14 16:00:00 -0800</string>"), none,
-         validAsOf, validAsOf, none},
-        {"no dictionary", Data(authority.sign("<plist><array/></plist>")), none, none, none, none},
-        {"not signed so", signedRecord(asOf + day, false), none, none, none, none},
-        {"no record", Data(std::vector<uint8_t>{1}), none, none, none, none},
-        {"the server's date", signedRecord(asOf + day), date(99), date(99), validAsOf, number(86'400)},
-        {"only the server's", signedRecord(asOf, false), date(99), date(99), none, none},
-        {"no number", signedRecord(asOf + "<key>SuggestValidDuration</key><real>nan</real>"), none, validAsOf,
-         validAsOf, none},
-    };
-    for (const Case& each : cases) {
+    for (const auto& [what, data, given, nextCheck, validAsOf, duration] : cases) {
+        SCOPED_TRACE(what);
         __VeltoIDDBRemoveVeltoIDAccount(kName);
         prepare(0);
         setValues({{kIdentifier, "old"}, {kData, kRecordData}, {kNextCheck, date(7)}});
-        updateAccountWithGetMyInfoResult(
-            kName, {{kIdentifier, "new"}, {kData, each.data}, {kNextCheck, each.given}});
-        EXPECT_EQ(record()[kNextCheck], each.nextCheck) << each.what;
-        EXPECT_EQ(record()[kData], each.nextCheck.isAbsent() ? none : Value(each.data)) << each.what;
-        EXPECT_EQ(record().contains(kIdentifier), !each.nextCheck.isAbsent()) << each.what;
-        EXPECT_EQ(record()["VeltoIDAccountValidationRecordValidAsOfKey"], each.validAsOf) << each.what;
-        EXPECT_EQ(record()["VeltoIDAccountValidationRecordSuggestedValidIntervalKey"], each.duration)
-            << each.what;
-        EXPECT_EQ(takePosted(), "changed ") << each.what;
+        updateAccountWithGetMyInfoResult(kName, {{kIdentifier, "new"}, {kData, data}, {kNextCheck, given}});
+        EXPECT_EQ(record()[kNextCheck], nextCheck);
+        EXPECT_EQ(record()[kData], nextCheck.isAbsent() ? Value() : Value(data));
+        EXPECT_EQ(record().contains(kIdentifier), !nextCheck.isAbsent());
+        EXPECT_EQ(record()[kAsOf], validAsOf);
+        EXPECT_EQ(record()[kDuration], duration);
+        EXPECT_EQ(takePosted(), "changed ");
     }
 }
 

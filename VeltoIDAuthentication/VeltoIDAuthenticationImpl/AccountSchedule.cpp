@@ -202,7 +202,7 @@ std::optional<double> AccountSchedule::endOfEmbargo() const {
     return now_ + kNeverForOldClients;
 }
 
-std::optional<double> nextActionOf(const String& accountName) {
+std::optional<double> copyNextActionDateForAccount(const String& accountName) {
     const AccountRecord record = accountRecordOf(accountName);
     if (!record.values().contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey)) return std::nullopt;
     return AccountSchedule(record, certificateEntryOf(record.encDsId()), {}).nextAction();

@@ -90,6 +90,6 @@ class AccountSchedule {
 
 /// When the account next needs attention (seconds since 1970); none: no action is foreseen, as for an account
 /// without password reference. Caller's queue.
-std::optional<double> nextActionOf(const String& accountName);
+std::optional<double> copyNextActionDateForAccount(const String& accountName);
 
 }  // namespace veltoid

@@ -114,7 +114,7 @@ void forgetOtherAccounts(const String& added) {
 /// Lets some time pass before the account is looked at again: until its next action, but not for long.
 void waitForNextAction(const String& accountName) {
     const double now = platform::now();
-    const double next = nextActionOf(accountName).value_or(now);
+    const double next = copyNextActionDateForAccount(accountName).value_or(now);
     (void)platform::Semaphore().wait(std::clamp(next - now, kMinWait, kMaxWait));
 }
 

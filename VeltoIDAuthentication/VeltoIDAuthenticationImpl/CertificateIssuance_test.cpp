@@ -10,39 +10,60 @@
 #include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {
 
 using testing_support::pemOf;
 
-constexpr double kDay = 86'400;
-constexpr const char* kToken = "CertificateToken";
 constexpr const char* kTokenExpiration = "CertificateTokenExpiration";
 constexpr const char* kGenerated = "CSRGenerationDate";
 constexpr const char* kInterval = "CSRGenerationInterval";
 constexpr const char* kCreated = "CSRCreationDate";
-constexpr const char* kFetchDate = "NextCertificateFetchDate";
 constexpr const char* kDelta = "NextCertificateFetchDelta";
-constexpr const char* kKeyReference = "CertificatePrivateKeyReference";
-constexpr const char* kCertificateReference = "CertificateReference";
+constexpr const char* kForced = "ForceCertificateCreation";
 constexpr const char* kIntermediateReference = "IntermediateCertificateReference";
 
-using IssuanceTest = CertificateTest;
+const std::set<std::string> kNone;
+
+class IssuanceTest : public CertificateTest {
+  protected:
+    void answerRequests(const Dictionary& reply) {
+        onRequest([reply] { return reply; });
+    }
+    /// Which of these are in the record.
+    static std::set<std::string> stored(std::initializer_list<const char*> keys) {
+        std::set<std::string> found;
+        for (const char* key : keys)
+            if (record().contains(key)) found.insert(key);
+        return found;
+    }
+    /// A new key in the keychain, as one that was made for a request.
+    static Data storedKey(const String& kind = nullptr) {
+        static const Key key = Key::privateKey(platform::generateRSAKeyPair(2048)->privateKey);
+        Data reference;
+        EXPECT_TRUE(addKeyToKeychain(kName, kind, key, &reference));
+        return reference;
+    }
+    using Delays = std::pair<double, double>;
+    /// The delay until the next fetch, and the one after that.
+    Delays delays() const { return {in(kFetchDate), record().number(kDelta).value_or(-1)}; }
+};
 
 TEST_F(IssuanceTest, ACertificateThatIsIssuedAtOnceIsKeptWithAllThatBelongsToIt) {
     issueAtOnce();
     setValue(kDelta, number(5));
     ASSERT_TRUE(request({{"__CERT_FETCH_DELAY_MIN", "5"}}));
-    const auto calls = server_.take();
-    EXPECT_EQ(calls.back().parameters["__CERT_FETCH_DELAY_MIN"], Value("5"));
+    EXPECT_EQ(server_.take().back().parameters["__CERT_FETCH_DELAY_MIN"], Value("5"));
     const Dictionary entry = certificateEntry();
-    EXPECT_EQ(entry["CertStatus"], Value("CERT_ISSUED"));
-    EXPECT_EQ(entry["CertType"], Value("client")) << "whatever the server says is kept";
+    for (const auto& [key, value] : Dictionary{{"CertStatus", "CERT_ISSUED"},
+                                               {"CertType", "client"},  // whatever the server says is kept
+                                               {kValidated, date(-1)},
+                                               {kRenewal, date(75 * kDay)},
+                                               {"Dirty", kOn}})
+        EXPECT_EQ(entry[key.view()], value) << key.view();
     EXPECT_EQ(certificateFromPEM(entry.string("Certificate"))->serialNumber, "1A2B3C");
-    EXPECT_EQ(entry["LastSuccessfulValidation"], date(-1));
-    EXPECT_EQ(entry["NextRenewalAttempt"], date(75 * kDay));
-    EXPECT_EQ(entry["Dirty"], flag(true));
 
     Key key;
     std::optional<platform::Certificate> certificate;
@@ -58,9 +79,9 @@ TEST_F(IssuanceTest, ACertificateThatIsIssuedAtOnceIsKeptWithAllThatBelongsToIt)
               Array{entry.data(kCertificateReference)});
     EXPECT_EQ(copyCertificatesFromKeychainGivenLabel("Velto ID authorization intermediate certificate"),
               Array{entry.data(kIntermediateReference)});
-    for (const char* key :
-         {kToken, kTokenExpiration, kGenerated, kInterval, kFetchDate, kDelta, kKeyReference, kCreated})
-        EXPECT_FALSE(record().contains(key)) << key;
+    EXPECT_EQ(stored({kToken, kTokenExpiration, kGenerated, kInterval, kFetchDate, kDelta, kKeyReference,
+                      kCreated}),
+              kNone);
     EXPECT_EQ(notifications_.take(),
               std::vector<std::string>{"HWVeltoIDAccountConfigurationChangeNotification"});
     EXPECT_TRUE(log_.contains("VeltoIDAuth: Adding certificate for " + std::string(kName) +
@@ -92,13 +113,12 @@ TEST_F(IssuanceTest, ARenewalTakesThePlaceOfWhatWasThere) {
 }
 
 TEST_F(IssuanceTest, ATokenIsAskedWithUntilTheCertificateIsThere) {
-    onRequest([] { return Dictionary{{"CertificateToken", "t1"}, {"Delay", number(20)}}; });
+    answerRequests({{kToken, "t1"}, {"Delay", number(20)}});
     ASSERT_TRUE(request());
     EXPECT_EQ(server_.takeMethods(), "authenticate createCert");
     EXPECT_EQ(record()[kToken], Value("t1"));
     EXPECT_EQ(in(kTokenExpiration), 14 * kDay);
-    EXPECT_EQ(in(kFetchDate), 20);
-    EXPECT_EQ(record()[kDelta], number(20));
+    EXPECT_EQ(delays(), Delays(20, 20));
     EXPECT_EQ(in(kGenerated), 0);
     EXPECT_EQ(record()[kInterval], number(3600));
     EXPECT_EQ(in(kCreated), 0);
@@ -112,14 +132,12 @@ TEST_F(IssuanceTest, ATokenIsAskedWithUntilTheCertificateIsThere) {
     server_.fault("fetchCert", -4164);
     EXPECT_FALSE(fetch());
     EXPECT_EQ(takeCode(), 99);
-    EXPECT_EQ(in(kFetchDate), 300) << "a fault says nothing of the delay";
-    EXPECT_EQ(record()[kDelta], number(450));
-    EXPECT_FALSE(record().contains(kGenerated) || record().contains(kInterval));
+    EXPECT_EQ(delays(), Delays(300, 450)) << "a fault says nothing of the delay";
+    EXPECT_EQ(stored({kGenerated, kInterval}), kNone);
 
     server_.answer("fetchCert", Dictionary{{"dsCert", Dictionary{{"CertStatus", "SIGNIN_PENDING"}}}});
     EXPECT_FALSE(fetch(FetchTime::AtOnce)) << "forced before its time";
-    EXPECT_EQ(in(kFetchDate), 450);
-    EXPECT_EQ(record()[kDelta], number(675));
+    EXPECT_EQ(delays(), Delays(450, 675));
     clock_.advanceBy(450);
     (void)server_.take();
     server_.answer("fetchCert",
@@ -128,7 +146,7 @@ TEST_F(IssuanceTest, ATokenIsAskedWithUntilTheCertificateIsThere) {
     const auto calls = server_.take();
     EXPECT_EQ(calls.at(1).parameters["CertificateToken"], Value("t1"));
     EXPECT_EQ(calls.at(2).method, "downloadCertComplete");
-    EXPECT_FALSE(record().contains(kToken) || record().contains(kKeyReference));
+    EXPECT_EQ(stored({kToken, kKeyReference}), kNone);
     EXPECT_TRUE(certificateEntry().contains(kKeyReference));
     EXPECT_EQ(relaunches_, (std::vector<double>{20, 300, 450}));
     EXPECT_TRUE(fetch()) << "there is nothing to fetch";
@@ -136,25 +154,18 @@ TEST_F(IssuanceTest, ATokenIsAskedWithUntilTheCertificateIsThere) {
 }
 
 TEST_F(IssuanceTest, AFailedAttemptLeavesNoKey) {
-    struct Case {
-        const char* what;
-        std::function<void()> prepare;
-        const char* methods;
-        int64_t code;
-        /// When the next request may be made; none: an interval after this one.
-        std::optional<double> nextRequest;
+    const auto dsCert = [](const char* status) {
+        return Dictionary{{"dsCert", Dictionary{{"CertStatus", status}}}};
     };
-    const auto answering = [this](const char* key, const Value& value) {
-        onRequest([key, value] { return Dictionary{{key, value}}; });
-    };
-    const auto dsCert = [](const char* status) { return Dictionary{{"CertStatus", status}}; };
-    const Case cases[] = {
-        {"refused", [&] { answering("dsCert", dsCert("FAILED")); }, "authenticate createCert", -100, 3600},
-        {"unknown", [&] { answering("dsCert", dsCert("?")); }, "authenticate createCert", -100, 0},
-        {"a fault", [&] { server_.fault("createCert", -3); }, "authenticate createCert", -100, 0},
-        {"no server", [&] { server_.refuse("createCert", 500); }, "authenticate createCert", -100, 0},
-        {"a token without end", [&] { answering("CertificateToken", std::string(1U << 20U, 't')); },
-         "authenticate createCert", -100, 0},
+    const Dictionary endless = {{kToken, std::string(1U << 20U, 't')}};
+    constexpr const char* kAsked = "authenticate createCert";
+    // The last column says when the next request may be made.
+    const std::tuple<const char*, std::function<void()>, const char*, int64_t, double> cases[] = {
+        {"refused", [&] { answerRequests(dsCert("FAILED")); }, kAsked, -100, 3600},
+        {"unknown", [&] { answerRequests(dsCert("?")); }, kAsked, -100, 0},
+        {"a fault", [&] { server_.fault("createCert", -3); }, kAsked, -100, 0},
+        {"no server", [&] { server_.refuse("createCert", 500); }, kAsked, -100, 0},
+        {"a token without end", [&] { answerRequests(endless); }, kAsked, -100, 0},
         {"for another key",
          [&] {
              onRequest([this] {
@@ -162,31 +173,27 @@ TEST_F(IssuanceTest, AFailedAttemptLeavesNoKey) {
                  return Dictionary{{"dsCert", issued()}};
              });
          },
-         "authenticate createCert", -100, 3600},
+         kAsked, -100, 3600},
         {"no sign-in", [&] { server_.refuse("authenticate", 500); }, "authenticate", -100, 0},
         {"wrong password", [&] { server_.fault("authenticate", -20101); }, "authenticate", -101, 0},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, prepare, methods, code, nextRequest] : cases) {
+        SCOPED_TRACE(what);
         createAccount("d1");
         // The request takes the place of an older one.
-        Data older;
-        ASSERT_TRUE(addKeyToKeychain(
-            kName, nullptr, Key::privateKey(platform::generateRSAKeyPair(2048)->privateKey), &older));
         setValues({{kToken, "old"},
                    {kTokenExpiration, date()},
                    {kFetchDate, date()},
-                   {kKeyReference, older},
+                   {kKeyReference, storedKey()},
                    {kInterval, number(60)}});
-        each.prepare();
-        EXPECT_FALSE(request()) << each.what;
-        EXPECT_EQ(takeCode(), each.code) << each.what;
-        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        EXPECT_EQ(keys(), 0U) << each.what;
-        EXPECT_EQ(certificates(), 0U) << each.what;
-        for (const char* key : {kToken, kTokenExpiration, kKeyReference})
-            EXPECT_FALSE(record().contains(key)) << each.what << ": " << key;
-        EXPECT_EQ(in(kGenerated), *each.nextRequest) << each.what;
-        EXPECT_EQ(hasPassword(), each.code != -101) << each.what;
+        prepare();
+        EXPECT_FALSE(request());
+        EXPECT_EQ(takeCode(), code);
+        EXPECT_EQ(server_.takeMethods(), methods);
+        EXPECT_EQ(keys() + certificates(), 0U);
+        EXPECT_EQ(stored({kToken, kTokenExpiration, kKeyReference}), kNone);
+        EXPECT_EQ(in(kGenerated), nextRequest);
+        EXPECT_EQ(hasPassword(), code != -101);
         __VeltoIDDBRemoveVeltoIDAccount(kName);
     }
     EXPECT_FALSE(request());
@@ -196,63 +203,54 @@ TEST_F(IssuanceTest, AFailedAttemptLeavesNoKey) {
 }
 
 TEST_F(IssuanceTest, ARequestWithoutTokenOrCertificateJustWaits) {
-    onRequest([] {
-        return Dictionary{{"CertificateToken", number(1)}, {"dsCert", "none"}, {"Delay", "soon"}};
-    });
+    answerRequests({{kToken, number(1)}, {"dsCert", "none"}, {"Delay", "soon"}});
     EXPECT_TRUE(request());
-    EXPECT_FALSE(record().contains(kToken) || record().contains(kFetchDate));
+    EXPECT_EQ(stored({kToken, kFetchDate}), kNone);
     EXPECT_TRUE(record().contains(kKeyReference));
     EXPECT_EQ(keys(), 1U);
 }
 
 TEST_F(IssuanceTest, TheServersEncDsIdBecomesTheAccounts) {
     setValue("encDsId", "old");
-    onRequest([] { return Dictionary{{"CertificateToken", "t"}}; });
+    answerRequests({{kToken, "t"}});
     String encDsId;
     EXPECT_TRUE(__VeltoIDDoCreateCertificateRequestForVeltoID(kName, {}, &encDsId));
     EXPECT_EQ(encDsId, "d1");
     EXPECT_EQ(record()["encDsId"], Value("d1"));
     EXPECT_EQ(in(kFetchDate), 0) << "no delay, no wait";
-    EXPECT_FALSE(record().contains(kDelta));
+    EXPECT_EQ(stored({kDelta}), kNone);
 }
 
 TEST_F(IssuanceTest, TheDelayOfATokenIsBelievedUpToADay) {
-    struct Case {
-        Value delay;
-        double stored;
-    };
-    for (const auto& [delay, stored] :
-         {Case{number(0), 0}, Case{number(86'400), 86'400}, Case{number(100'000), 15}, Case{number(-5), 15},
-          Case{Value::real(0.5), 0.5}, Case{Value::real(1e300), 15}}) {
+    const std::pair<Value, double> cases[] = {{number(0), 0},          {number(86'400), 86'400},
+                                              {number(100'000), 15},   {number(-5), 15},
+                                              {Value::real(0.5), 0.5}, {Value::real(1e300), 15}};
+    for (const auto& [delay, stored] : cases) {
         clock_.advanceBy(3'600);
-        onRequest([delay = delay] { return Dictionary{{"CertificateToken", "t"}, {"Delay", delay}}; });
+        answerRequests({{kToken, "t"}, {"Delay", delay}});
         ASSERT_TRUE(request());
-        EXPECT_EQ(in(kFetchDate), stored);
-        EXPECT_EQ(record().number(kDelta), stored);
+        EXPECT_EQ(delays(), Delays(stored, stored));
     }
 }
 
 TEST_F(IssuanceTest, EveryAnswerIsAppliedToTheAccount) {
-    struct Case {
-        const char* what;
-        std::optional<Dictionary> result;
-        Value delay;
-        Value delta;
-        bool tokenIsOver;
-        bool succeeds;
-        /// Seconds from now; none: the key is gone.
-        std::optional<double> fetchDate;
-        double leastDelta;
-        double mostDelta;
-        /// none: gone.
-        std::optional<double> generated;
-    };
     const auto status = [](const char* text) { return Dictionary{{"CertStatus", text}}; };
     const Dictionary pending = status("SIGNIN_PENDING");
+    const Dictionary noText = {{"CertStatus", number(1)}};
     const double nan = std::numeric_limits<double>::quiet_NaN();
     const double infinity = std::numeric_limits<double>::infinity();
     const Value none;
-    const Case cases[] = {
+    const struct {
+        const char* what;
+        std::optional<Dictionary> result;
+        Value delay, notedDelta;
+        bool tokenIsOver, succeeds;
+        /// Seconds from now; none: the key is gone.
+        std::optional<double> fetchDate;
+        double leastDelta, mostDelta;
+        /// none: gone.
+        std::optional<double> generated;
+    } cases[] = {
         {"pending", pending, number(60), none, false, true, 60, 90, 90, {}},
         {"pending, noted delay", pending, none, number(100), false, true, 100, 150, 150, {}},
         {"pending, no delay", pending, none, none, false, true, 60, 90, 90, {}},
@@ -264,98 +262,76 @@ TEST_F(IssuanceTest, EveryAnswerIsAppliedToTheAccount) {
         {"pending, for ever", pending, Value::real(infinity), none, false, true, 60, 90, 90, {}},
         {"failed", status("FAILED"), number(60), number(1), false, false, {}, 0, 0, 3600},
         {"unknown", status("?"), none, number(100), false, false, 100, 150, 150, 7},
-        {"unknown, no delta", Dictionary{{"CertStatus", number(1)}}, none, none, false, false, 86'400, 86'400,
-         172'800, 7},
+        {"unknown, no delta", noText, none, none, false, false, 86'400, 86'400, 172'800, 7},
         {"unknown, no result", {}, none, number(0), false, false, 86'400, 86'400, 172'800, 7},
-        {"unknown, long", status("cert_issued"), none, number(90'000), false, false, 90'000, 86'400, 172'800,
-         7},
+        {"long", status("cert_issued"), none, number(90'000), false, false, 90'000, 86'400, 172'800, 7},
         {"expired", status("?"), none, number(100), true, false, {}, 0, 0, 3600},
         {"failed, expired", status("FAILED"), none, none, true, false, {}, 0, 0, 3600},
         {"pending, expired", pending, none, none, true, true, 60, 90, 90, {}},
     };
-    const Key key = Key::privateKey(platform::generateRSAKeyPair(2048)->privateKey);
-    for (const Case& each : cases) {
-        Data reference;
-        ASSERT_TRUE(addKeyToKeychain(kName, nullptr, key, &reference));
+    for (const auto& [what, result, delay, notedDelta, tokenIsOver, succeeds, fetchDate, leastDelta,
+                      mostDelta, generated] : cases) {
+        SCOPED_TRACE(what);
         setValues({{kToken, "t1"},
-                   {kTokenExpiration, date(each.tokenIsOver ? -1 : 1)},
+                   {kTokenExpiration, date(tokenIsOver ? -1 : 1)},
                    {kGenerated, date(7)},
                    {kInterval, number(60)},
-                   {kKeyReference, reference},
-                   {kDelta, each.delta.isAbsent() ? Value::null() : each.delta},
-                   {kFetchDate, Value::null()}});
-        EXPECT_EQ(update(each.result, each.delay), each.succeeds) << each.what;
-        EXPECT_EQ(takeCode(), each.succeeds ? 0 : -100) << each.what;
-        EXPECT_EQ(record().contains(kToken), each.fetchDate.has_value()) << each.what;
-        EXPECT_EQ(record()[kFetchDate], each.fetchDate ? date(*each.fetchDate) : none) << each.what;
-        EXPECT_EQ(record()[kGenerated], each.generated ? date(*each.generated) : none) << each.what;
+                   {kKeyReference, storedKey()},
+                   {kDelta, notedDelta.isAbsent() ? kGone : notedDelta},
+                   {kFetchDate, kGone}});
+        EXPECT_EQ(update(result, delay), succeeds);
+        EXPECT_EQ(takeCode(), succeeds ? 0 : -100);
+        EXPECT_EQ(record().contains(kToken), fetchDate.has_value());
+        EXPECT_EQ(record()[kFetchDate], fetchDate ? date(*fetchDate) : none);
+        EXPECT_EQ(record()[kGenerated], generated ? date(*generated) : none);
         const double delta = record().number(kDelta).value_or(0);
-        EXPECT_TRUE(each.leastDelta <= delta && delta <= each.mostDelta) << each.what << ": " << delta;
-        EXPECT_EQ(keys(), each.fetchDate ? 1U : 0U) << each.what;
-        EXPECT_EQ(record().contains(kKeyReference), each.fetchDate.has_value()) << each.what;
-        EXPECT_EQ(record()["Dirty"], flag(true)) << each.what;
+        EXPECT_TRUE(leastDelta <= delta && delta <= mostDelta) << delta;
+        EXPECT_EQ(keys(), fetchDate ? 1U : 0U);
+        EXPECT_EQ(record().contains(kKeyReference), fetchDate.has_value());
+        EXPECT_EQ(record()["Dirty"], flag(true));
     }
     const std::string name = kName;
-    EXPECT_EQ(log_.count("VeltoIDAuth: Failed generating certificate for " + name + ", d1, certToken=t1."),
-              2);
-    EXPECT_EQ(
-        log_.count("UNKNOWN Certificate issuance request for " + name + " dsID=d1 certToken=t1, status=?."),
-        2);
+    for (const std::string& line :
+         {"VeltoIDAuth: Failed generating certificate for " + name + ", d1, certToken=t1.",
+          "UNKNOWN Certificate issuance request for " + name + " dsID=d1 certToken=t1, status=?."})
+        EXPECT_EQ(log_.count(line), 2) << line;
 }
 
 TEST_F(IssuanceTest, WhatIsMissingInACertificateResultIsMissingInTheEntry) {
-    struct Case {
-        const char* what;
-        Dictionary changes;
-        bool hasCertificate;
-        bool hasIntermediate;
-        Value renewal;
-    };
     requested_ = platform::generateRSAKeyPair(2048)->publicKey;
-    const Value none = Value::null();
-    const Case cases[] = {
-        {"nothing", {}, true, true, date(75 * kDay)},
-        {"no certificate", {{"Certificate", none}}, false, true, date(75 * kDay)},
-        {"no DER",
-         {{"Certificate", "-----BEGIN CERTIFICATE-----\nQUJD\n-----END CERTIFICATE-----\n"}},
-         false,
-         true,
-         date(75 * kDay)},
-        {"no text", {{"Certificate", number(1)}}, false, true, date(75 * kDay)},
-        {"no intermediate", {{"IntermediateCertificate", none}}, true, false, date(75 * kDay)},
-        {"no PEM", {{"IntermediateCertificate", "hello"}}, true, false, date(75 * kDay)},
-        {"no expiry", {{"Expires", none}}, true, true, {}},
+    const Value usual = date(75 * kDay);
+    const Value end = Value::date(253'402'300'799);
+    const Value nearEnd = date(0.75 * (253'402'300'799 - now()));
+    const std::tuple<const char*, Dictionary, bool, bool, Value> cases[] = {
+        {"nothing", {}, true, true, usual},
+        {"no certificate", {{"Certificate", kGone}}, false, true, usual},
+        {"no DER", {{"Certificate", pemOf({'A', 'B', 'C'})}}, false, true, usual},
+        {"no text", {{"Certificate", number(1)}}, false, true, usual},
+        {"no intermediate", {{"IntermediateCertificate", kGone}}, true, false, usual},
+        {"no PEM", {{"IntermediateCertificate", "hello"}}, true, false, usual},
+        {"no expiry", {{"Expires", kGone}}, true, true, {}},
         {"expired", {{"Expires", date(-1)}}, true, true, {}},
-        {"for ever",
-         {{"Expires", Value::date(253'402'300'799)}},
-         true,
-         true,
-         Value::date(now() + 0.75 * (253'402'300'799 - now()))},
+        {"for ever", {{"Expires", end}}, true, true, nearEnd},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, changes, hasCertificate, hasIntermediate, renewal] : cases) {
+        SCOPED_TRACE(what);
         __VeltoIDDBRemoveCertificateInfo("d1");
         Dictionary result = issued();
         result.set("IntermediateCertificate", result["IntermediateCert"]);
-        for (const auto& [key, value] : each.changes)
+        for (const auto& [key, value] : changes)
             value.isNull() ? (void)result.remove(key.view()) : result.set(key, value);
-        EXPECT_TRUE(update(result)) << each.what;
+        EXPECT_TRUE(update(result));
         const Dictionary entry = certificateEntry();
-        EXPECT_EQ(entry.contains(kCertificateReference), each.hasCertificate) << each.what;
-        EXPECT_EQ(entry.contains(kIntermediateReference), each.hasIntermediate) << each.what;
-        EXPECT_EQ(entry["NextRenewalAttempt"], each.renewal) << each.what;
+        EXPECT_EQ(entry.contains(kCertificateReference), hasCertificate);
+        EXPECT_EQ(entry.contains(kIntermediateReference), hasIntermediate);
+        EXPECT_EQ(entry[kRenewal], renewal);
     }
 }
 
 TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
-    struct Case {
-        const char* what;
-        Dictionary values;
-        const char* methods;
-        int64_t code;
-    };
     constexpr const char* kAsked = "authenticate fetchCert downloadCertComplete";
-    const Case cases[] = {
-        {"no token", {{kToken, Value::null()}}, "", 0},
+    const std::tuple<const char*, Dictionary, const char*, int64_t> cases[] = {
+        {"no token", {{kToken, kGone}}, "", 0},
         {"no text", {{kToken, number(1)}}, "", 0},
         {"three days ahead", {{kFetchDate, date(3 * kDay)}}, "", 99},
         {"eight days ahead", {{kFetchDate, date(8 * kDay)}}, kAsked, -100},
@@ -363,24 +339,23 @@ TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
         {"no date", {{kFetchDate, "soon"}}, kAsked, -100},
     };
     server_.fault("fetchCert", -7);
-    for (const Case& each : cases) {
-        setValues({{kToken, "t1"}, {kFetchDate, Value::null()}});
-        setValues(each.values);
-        EXPECT_EQ(fetch(), each.code == 0) << each.what;
-        EXPECT_EQ(takeCode(), each.code) << each.what;
-        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
+    for (const auto& [what, values, methods, code] : cases) {
+        SCOPED_TRACE(what);
+        setValues({{kToken, "t1"}, {kFetchDate, kGone}});
+        setValues(values);
+        EXPECT_EQ(fetch(), code == 0);
+        EXPECT_EQ(takeCode(), code);
+        EXPECT_EQ(server_.takeMethods(), methods);
     }
     EXPECT_EQ(record()[kToken], Value("t1")) << "until the next result or its expiry";
     EXPECT_EQ(log_.count("Failed while fetching result for certificate token t1, error="), 3);
 
     server_.refuse("authenticate", 503);
     EXPECT_TRUE(fetch()) << "a server that cannot be reached is tried later";
-    EXPECT_EQ(in(kFetchDate), 10);
-    EXPECT_EQ(record()[kDelta], number(15));
+    EXPECT_EQ(delays(), Delays(10, 15));
     clock_.advanceBy(10);
     EXPECT_TRUE(fetch());
-    EXPECT_EQ(in(kFetchDate), 15);
-    EXPECT_EQ(record().number(kDelta), 22.5);
+    EXPECT_EQ(delays(), Delays(15, 22.5));
     setValue(kDelta, number(200'000));
     EXPECT_TRUE(fetch(FetchTime::AtOnce));
     EXPECT_EQ(in(kFetchDate), 200'000);
@@ -389,18 +364,15 @@ TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
 
 TEST_F(IssuanceTest, AnEncDsIdIsLearntByASignInNowAndThen) {
     const auto learn = [this](double sinceLastAttempt) {
-        setValues({{"encDsId", Value::null()}, {"LastConnectAttempt", date(-sinceLastAttempt)}});
+        setValues({{"encDsId", kGone}, {"LastConnectAttempt", date(-sinceLastAttempt)}});
         __VeltoIDDoFetchEncodedDSIDForVeltoID(kName, {}, &error_);
         return server_.takeMethods();
     };
-    for (const double recent : {0.0, 300.0}) {
-        EXPECT_EQ(learn(recent), "");
-        EXPECT_EQ(takeCode(), 99);
-    }
-    for (const double longAgo : {301.0, -5.0}) {
-        EXPECT_EQ(learn(longAgo), "authenticate");
-        EXPECT_EQ(takeCode(), -100) << "always filled";
-        EXPECT_EQ(record()["encDsId"], Value("d1"));
+    for (const auto& [ago, asks] :
+         {std::pair(0.0, false), std::pair(300.0, false), std::pair(301.0, true), std::pair(-5.0, true)}) {
+        EXPECT_EQ(learn(ago), asks ? "authenticate" : "") << ago;
+        EXPECT_EQ(takeCode(), asks ? -100 : 99) << ago << ": always filled";
+        EXPECT_EQ(record()["encDsId"], asks ? Value("d1") : Value()) << ago;
     }
     server_.fault("authenticate", -20209);
     EXPECT_EQ(learn(1000), "authenticate");
@@ -410,22 +382,14 @@ TEST_F(IssuanceTest, AnEncDsIdIsLearntByASignInNowAndThen) {
 }
 
 TEST_F(IssuanceTest, AnAddAsksForTheCertificateWhenItIsToldTo) {
-    struct Case {
-        const char* what;
-        Dictionary options;
-        bool hasCertificate;
-        bool asks;
-    };
-    const Value on = flag(true);
-    const Value off = flag(false);
     constexpr const char* kAsynchronously = "CreateCSRAsynchronously";
-    const Case cases[] = {
+    const std::tuple<const char*, Dictionary, bool, bool> cases[] = {
         {"later", {}, false, false},
-        {"now", {{kAsynchronously, off}}, false, true},
-        {"never", {{kAsynchronously, off}, {"DoNotCreateCSR", on}}, false, false},
-        {"not checked", {{kAsynchronously, off}, {"DoNotCheckPassword", on}}, false, false},
-        {"forced", {{kAsynchronously, off}, {"ForceCertificateCreation", on}}, true, true},
-        {"forced, later", {{"ForceCertificateCreation", on}}, true, false},
+        {"now", {{kAsynchronously, kOff}}, false, true},
+        {"never", {{kAsynchronously, kOff}, {"DoNotCreateCSR", kOn}}, false, false},
+        {"not checked", {{kAsynchronously, kOff}, {"DoNotCheckPassword", kOn}}, false, false},
+        {"forced", {{kAsynchronously, kOff}, {kForced, kOn}}, true, true},
+        {"forced, later", {{kForced, kOn}}, true, false},
     };
     const auto add = [this](const Dictionary& options) {
         AddedAccount added;
@@ -433,50 +397,43 @@ TEST_F(IssuanceTest, AnAddAsksForTheCertificateWhenItIsToldTo) {
         return added.encDsId;
     };
     issueAtOnce();
-    for (const Case& each : cases) {
+    for (const auto& [what, options, hasCertificate, asks] : cases) {
         EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
-        if (each.hasCertificate) {
+        if (hasCertificate) {
             createAccount("d1");
             ASSERT_TRUE(request());
         }
         (void)server_.take();
-        add(each.options);
-        EXPECT_EQ(server_.takeMethods().find("createCert") != std::string::npos, each.asks) << each.what;
-        EXPECT_EQ(keys(), each.asks || each.hasCertificate ? 1U : 0U) << each.what;
+        add(options);
+        EXPECT_EQ(server_.takeMethods().find("createCert") != std::string::npos, asks) << what;
+        EXPECT_EQ(keys(), asks || hasCertificate ? 1U : 0U) << what;
     }
     server_.fault("createCert", -1);
-    EXPECT_EQ(add({{kAsynchronously, off}, {"ForceCertificateCreation", on}}), "d1");
+    EXPECT_EQ(add({{kAsynchronously, kOff}, {kForced, kOn}}), "d1");
     EXPECT_EQ(log_.count("VeltoIDAuth: Adding account " + std::string(kName) + " failed, ERROR:"), 1);
 }
 
 TEST_F(IssuanceTest, ForgettingLeavesNoItemBehind) {
-    struct Case {
-        const char* what;
-        Dictionary options;
-        size_t keys;
-        size_t certificates;
-    };
-    const Value off = flag(false);
-    const Case cases[] = {
+    const std::tuple<const char*, Dictionary, size_t, size_t> cases[] = {
         {"all", {}, 0, 0},
-        {"keeps the key", {{"RemovePrivateKeyFromKeychain", off}}, 1, 0},
-        {"keeps the certificate", {{"RemoveCertificateFromKeychain", off}}, 0, 1},
+        {"keeps the key", {{"RemovePrivateKeyFromKeychain", kOff}}, 1, 0},
+        {"keeps the certificate", {{"RemoveCertificateFromKeychain", kOff}}, 0, 1},
     };
     issueAtOnce();
-    for (const Case& each : cases) {
+    for (const auto& [what, options, keptKeys, keptCertificates] : cases) {
+        SCOPED_TRACE(what);
         createAccount("d1");
-        ASSERT_TRUE(request()) << each.what;
-        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, each.options)) << each.what;
-        EXPECT_EQ(keys(), each.keys) << each.what;
-        EXPECT_EQ(certificates(), each.certificates) << each.what;
-        EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr)) << each.what;
+        ASSERT_TRUE(request());
+        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, options));
+        EXPECT_EQ(keys(), keptKeys);
+        EXPECT_EQ(certificates(), keptCertificates);
+        EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
     }
     createAccount("d1");
-    onRequest([] { return Dictionary{{"CertificateToken", "t"}}; });
+    answerRequests({{kToken, "t"}});
     ASSERT_TRUE(request()) << "pending";
     // Made just before the agent was killed: nothing refers to it.
-    ASSERT_TRUE(addKeyToKeychain(kName, "private key",
-                                 Key::privateKey(platform::generateRSAKeyPair(2048)->privateKey), nullptr));
+    (void)storedKey("private key");
     EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
     EXPECT_EQ(keys(), 0U);
 }
@@ -485,10 +442,13 @@ TEST_F(IssuanceTest, ForgettingKeepsWhatAnotherAccountShares) {
     issueAtOnce();
     ASSERT_TRUE(request());
     ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", "d1"));
+    const Data password = record().data("HashedPasswordRef");
     EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
     EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
     EXPECT_EQ(keys() + certificates(), 3U);
+    EXPECT_FALSE(copyPasswordFromKeychainGivenPersistentRef(password, nullptr));
     EXPECT_TRUE(__VeltoIDForgetVeltoID("other", {}));
+    EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
     EXPECT_EQ(keys() + certificates(), 0U);
 }
 
@@ -504,25 +464,23 @@ TEST_F(IssuanceTest, CleaningUpTakesWhatIsOfNoUse) {
         EXPECT_TRUE(__VeltoIDCleanupAccountsAndCertificates({}));
         return !__VeltoIDDBCopyCertificateInfo(encDsId, nullptr);
     };
+    const Data unknown(std::vector<uint8_t>{1});
     EXPECT_FALSE(cleanUp(references, "d1"));
-    EXPECT_TRUE(cleanUp({{kCertificateReference, Data(std::vector<uint8_t>{1})},
-                         {kKeyReference, Data(std::vector<uint8_t>{1})}},
-                        "nobody"));
+    EXPECT_TRUE(cleanUp({{kCertificateReference, unknown}, {kKeyReference, unknown}}, "nobody"));
     EXPECT_EQ(log_.count("Removing certificate and private key  from keychain, and certificate from db, for "
                          "account  / dsID=nobody"),
               1);
     EXPECT_EQ(keys() + certificates(), 3U);
     EXPECT_TRUE(cleanUp({{"CertStatus", "CERTIFICATE_INVALID"}}, "d1"));
     EXPECT_EQ(keys() + certificates(), 0U);
-    EXPECT_TRUE(cleanUp({{kCertificateReference, Data(std::vector<uint8_t>{1})}}, "d1"))
-        << "it lacks the key";
+    EXPECT_TRUE(cleanUp({{kCertificateReference, unknown}}, "d1")) << "it lacks the key";
 
-    setValue("EarliestAllowedConnectionDate", date(1));
+    setValue(kEmbargo, date(1));
     EXPECT_TRUE(__VeltoIDCleanupAccountsAndCertificates({}));
-    EXPECT_TRUE(record().contains("EarliestAllowedConnectionDate"));
+    EXPECT_TRUE(record().contains(kEmbargo));
     clock_.advanceBy(2);
     EXPECT_TRUE(__VeltoIDCleanupAccountsAndCertificates({}));
-    EXPECT_FALSE(record().contains("EarliestAllowedConnectionDate"));
+    EXPECT_EQ(stored({kEmbargo}), kNone);
 }
 
 TEST_F(IssuanceTest, AnAccountThatAsksOverAndOverIsHeldUp) {

@@ -26,17 +26,15 @@ class Adding : public EngineTest {
 };
 
 TEST_F(Adding, StoresTheAccountWhateverTheServerSays) {
-    struct Case {
+    const Dictionary noInformation = {{"VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", kOn}};
+    constexpr const char* kAll = "authenticate authenticate getMyInfo";
+    const struct {
         const char* what;
         Dictionary options;
         Server server;
         const char* methods;
-        bool signsIn;
-        bool succeeds;
-    };
-    const Dictionary noInformation = {{"VeltoIDOptionsDoNotFetchVeltoIDAuthenticationRecord", kOn}};
-    constexpr const char* kAll = "authenticate authenticate getMyInfo";
-    const Case cases[] = {
+        bool signsIn, succeeds;
+    } cases[] = {
         {"no options", {}, Server::Up, kAll, true, true},
         {"no information", noInformation, Server::Up, "authenticate", true, true},
         {"no sign-in", {{"DoNotCheckPassword", kOn}}, Server::Up, "", false, true},
@@ -45,27 +43,27 @@ TEST_F(Adding, StoresTheAccountWhateverTheServerSays) {
         {"no server", {}, Server::Down, "authenticate", false, false},
         {"wrong password", {}, Server::RefusesPassword, "authenticate", false, false},
     };
-    for (const Case& each : cases) {
-        serverIs(each.server);
-        EXPECT_TRUE(add(each.options)) << each.what;
-        EXPECT_EQ(error_, std::nullopt) << each.what;
-        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        EXPECT_EQ(added_.encDsId, each.signsIn ? String("d1") : String()) << each.what;
-        EXPECT_EQ(record().string("encDsId"), added_.encDsId) << each.what;
-        EXPECT_EQ(added_.record, each.succeeds ? std::optional(record()) : std::nullopt) << each.what;
-        EXPECT_EQ(hasPassword(), each.server != Server::RefusesPassword) << each.what;
+    for (const auto& [what, options, server, methods, signsIn, succeeds] : cases) {
+        SCOPED_TRACE(what);
+        serverIs(server);
+        EXPECT_TRUE(add(options));
+        EXPECT_EQ(error_, std::nullopt);
+        EXPECT_EQ(server_.takeMethods(), methods);
+        EXPECT_EQ(added_.encDsId, signsIn ? String("d1") : String());
+        EXPECT_EQ(record().string("encDsId"), added_.encDsId);
+        EXPECT_EQ(added_.record, succeeds ? std::optional(record()) : std::nullopt);
+        EXPECT_EQ(hasPassword(), server != Server::RefusesPassword);
         const std::string line = std::string("VeltoIDAuth: Adding account ") + kName +
-                                 (each.succeeds ? " succeeded." : " failed, ERROR:");
-        EXPECT_NE(log_.lines().back().text.find(line), std::string::npos) << each.what;
-        EXPECT_TRUE(takePosted().ends_with("added/removed ")) << each.what;
+                                 (succeeds ? " succeeded." : " failed, ERROR:");
+        EXPECT_NE(log_.lines().back().text.find(line), std::string::npos);
+        EXPECT_TRUE(takePosted().ends_with("added/removed "));
         __VeltoIDDBRemoveVeltoIDAccount(kName);
     }
 }
 
 TEST_F(Adding, FetchesTheValidationRecordAnew) {
     createAccount();
-    setValue(kIdentifier, "v1");
-    setValue(kData, Data(std::vector<uint8_t>{1}));
+    setValues({{kIdentifier, "v1"}, {kData, kRecordData}});
     ASSERT_TRUE(add({{"ForceValidationRecordFetch", kOff}}));
     const auto calls = server_.take();
     ASSERT_EQ(calls.back().method, "getMyInfo");
@@ -79,24 +77,22 @@ TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
         EXPECT_TRUE(add(options, "new hash"));
         return server_.takeMethods();
     };
-    setValue("CertificateToken", "t");
+    setValue(kToken, "t");
     EXPECT_EQ(readd(), "");
     EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, record()}), "new hash");
     EXPECT_EQ(added_.encDsId, "d1");
     EXPECT_EQ(added_.record, record());
     EXPECT_EQ(takePosted(), "added/removed ");
-    EXPECT_EQ(
-        log_.count("VeltoIDAuth: Already existing account " + std::string(kName) + " re-added; succeeded."),
-        1);
+    const std::string known = "VeltoIDAuth: Already existing account " + std::string(kName) + " re-added; ";
+    EXPECT_EQ(log_.count(known + "succeeded."), 1);
     EXPECT_NE(readd({{"ForceCertificateCreation", kOn}}), "");
 
-    setValue("CertificateToken", {});
+    setValue(kToken, {});
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERT_ISSUED"}});
     EXPECT_EQ(readd(), "");
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"CertStatus", "CERTIFICATE_INVALID"}});
     EXPECT_NE(readd(), "");
-    setValue("CertificateToken", "t");
-    setValue("encDsId", {});
+    setValues({{kToken, "t"}, {"encDsId", kGone}});
     EXPECT_EQ(readd(), "");
     EXPECT_EQ(log_.count(" re-added; failed, "), 1) << "it has no encDsId";
 }
@@ -118,25 +114,12 @@ TEST_F(EngineTest, ForgettingTakesEverythingAlong) {
     EXPECT_FALSE(copyPasswordFromKeychainGivenPersistentRef(reference, nullptr));
     EXPECT_TRUE(log_.contains("VeltoIDAuth: Forgetting account " + std::string(kName) + "."));
 
-    EXPECT_FALSE(__VeltoIDForgetVeltoID(kName, {}, &error));
-    EXPECT_EQ(error->code, -100);
-    EXPECT_EQ(takePosted(), "changed ");
-    error.reset();
-    EXPECT_FALSE(__VeltoIDForgetVeltoID(nullptr, {}, &error));
-    EXPECT_EQ(error->code, -100);
-    EXPECT_EQ(takePosted(), "");
-}
-
-TEST_F(EngineTest, ForgettingKeepsACertificateThatAnotherAccountShares) {
-    createAccount("d1");
-    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", "d1"));
-    storeCertificateEntry("d1");
-    const Data reference = record().data("HashedPasswordRef");
-    EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
-    EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
-    EXPECT_FALSE(copyPasswordFromKeychainGivenPersistentRef(reference, nullptr));
-    EXPECT_TRUE(__VeltoIDForgetVeltoID("other", {}));
-    EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
+    for (const auto& [name, posted] : {std::pair(String(kName), "changed "), std::pair(String(), "")}) {
+        error.reset();
+        EXPECT_FALSE(__VeltoIDForgetVeltoID(name, {}, &error));
+        EXPECT_EQ(error->code, -100);
+        EXPECT_EQ(takePosted(), posted);
+    }
 }
 
 // --- People and breadcrumbs
@@ -169,19 +152,24 @@ TEST_F(EngineTest, PeopleAreFoundOnBehalfOfAnAccount) {
 TEST_F(EngineTest, ABreadcrumbIsStoredAndFetched) {
     const Data data(platform::bytesOf("ABC"));
     std::optional<Error> error;
+    const auto fetch = [&](const String& password) {
+        error.reset();
+        return __VeltoIDDoCopyBreadcrumb(kName, password, "k", {}, &error);
+    };
     server_.answer("saveBreadcrumbEk", Dictionary{{"x", "y"}});
     server_.answer("fetchBreadcrumbEk", Dictionary{{"ek", "QUJD"}});
     EXPECT_TRUE(__VeltoIDDoSetBreadcrumb(kName, kPassword, "k", data, {}, &error));
-    EXPECT_EQ(__VeltoIDDoCopyBreadcrumb(kName, kPassword, "k", {}, &error), data);
+    EXPECT_EQ(error, std::nullopt);
+    EXPECT_EQ(fetch(kPassword), data);
     EXPECT_EQ(error, std::nullopt);
     server_.answer("fetchBreadcrumbEk", Dictionary{{"x", "y"}});
-    EXPECT_FALSE(__VeltoIDDoCopyBreadcrumb(kName, kPassword, "k", {}, &error));
+    EXPECT_FALSE(fetch(kPassword));
     EXPECT_EQ(error->code, -100);
     server_.fault("saveBreadcrumbEk", -20209);
     EXPECT_FALSE(__VeltoIDDoSetBreadcrumb(kName, kPassword, "k", data, {}, &error));
     EXPECT_EQ(error->code, -102);
     (void)server_.take();
-    EXPECT_FALSE(__VeltoIDDoCopyBreadcrumb(kName, nullptr, "k", {}, &error));
+    EXPECT_FALSE(fetch(nullptr));
     EXPECT_EQ(error->code, -100);
     EXPECT_EQ(server_.takeMethods(), "");
 }
@@ -213,24 +201,19 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
 }
 
 TEST_F(EngineTest, OnlyARefusalTakesThePassword) {
-    struct Case {
-        Error error;
-        bool isTaken;
-        const char* line;
-    };
-    const Case cases[] = {
+    const std::tuple<Error, bool, const char*> cases[] = {
         {identityError(-101), true, "is incorrect or the account has been disabled"},
         {identityError(-102), true, "is incorrect or the account has been disabled"},
         {identityError(-105), true, "no longer supports this client"},
         {identityError(-100), false, "removing"},
         {Error{kXMLErrorDomain, -101, {}}, false, "removing"},
     };
-    for (const Case& each : cases) {
+    for (const auto& [error, isTaken, line] : cases) {
         createAccount("d1");
-        const auto lines = log_.count(each.line);
-        handleServerError(kName, kPassword, each.error);
-        EXPECT_EQ(hasPassword(), !each.isTaken) << each.error.code;
-        EXPECT_EQ(log_.count(each.line) - lines, each.isTaken ? 1 : 0) << each.error.code;
+        const auto lines = log_.count(line);
+        handleServerError(kName, kPassword, error);
+        EXPECT_EQ(hasPassword(), !isTaken) << error.code;
+        EXPECT_EQ(log_.count(line) - lines, isTaken ? 1 : 0) << error.code;
     }
     handleServerError(kName, kPassword, std::nullopt);
     EXPECT_TRUE(hasPassword());
@@ -241,94 +224,86 @@ TEST_F(EngineTest, OnlyARefusalTakesThePassword) {
 TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
     // What is left to do for an account whose certificate was just validated.
     constexpr double kFortnight = 1'209'600;
-    struct Case {
+    constexpr const char* kRequested = "CSRGenerationDate";
+    const Dictionary entry;
+    const struct {
         const char* what;
         Dictionary values;
         std::optional<Dictionary> entry;
         /// Seconds from now.
-        std::optional<double> next;
-        bool isNewServer = false;
-    };
-    const Value none = Value::null();
-    constexpr const char* kRequested = "CSRGenerationDate";
-    constexpr const char* kRenewal = "NextRenewalAttempt";
-    constexpr const char* kFetch = "NextCertificateFetchDate";
-    constexpr const char* kToken = "CertificateToken";
-    constexpr const char* kValidated = "LastSuccessfulValidation";
-    constexpr const char* kAttempt = "LastValidationAttempt";
-    constexpr const char* kAsOf = "VeltoIDAccountValidationRecordValidAsOfKey";
-    constexpr const char* kDuration = "VeltoIDAccountValidationRecordSuggestedValidIntervalKey";
-    const auto in = [this](double seconds) { return date(seconds); };
-    const Dictionary entry;
-    const Case cases[] = {
+        double due;
+        int32_t serverVersion = 100;
+    } cases[] = {
         {"nothing else", {}, entry, kFortnight},
         {"dirty", {{"Dirty", kOn}}, entry, 0},
-        {"no encDsId", {{"encDsId", none}}, {}, 0},
-        {"tried", {{"encDsId", none}, {"LastConnectAttempt", in(-100)}, {kRequested, in(0)}}, {}, 200},
-        {"forced validation", {{"ForceValidation", kOn}, {"NextValidationDate", in(50)}}, entry, 0},
-        {"next validation", {{"NextValidationDate", in(50)}, {"ValidationDate", in(0)}}, entry, 50},
-        {"last validation", {{"ValidationDate", in(-100)}}, entry, kFortnight - 100},
-        {"embargo", {{kEmbargo, in(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}}, entry, 1000},
-        {"embargo, expiry", {{kEmbargo, in(99)}}, Dictionary{{"Expires", in(9)}, {kRenewal, in(5)}}, 9},
-        {"embargo, no certificate", {{kEmbargo, in(1000)}}, {}, 1000},
-        {"embargo is over", {{kEmbargo, in(-1)}, {"ClientTooOld", kOn}}, entry, kFortnight},
+        {"no encDsId", {{"encDsId", kGone}}, {}, 0},
+        {"tried", {{"encDsId", kGone}, {"LastConnectAttempt", date(-100)}, {kRequested, date(0)}}, {}, 200},
+        {"forced validation", {{"ForceValidation", kOn}, {"NextValidationDate", date(50)}}, entry, 0},
+        {"next validation", {{"NextValidationDate", date(50)}, {"ValidationDate", date(0)}}, entry, 50},
+        {"last validation", {{"ValidationDate", date(-100)}}, entry, kFortnight - 100},
+        {"embargo", {{kEmbargo, date(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}}, entry, 1000},
+        {"embargo, expiry", {{kEmbargo, date(99)}}, Dictionary{{"Expires", date(9)}, {kRenewal, date(5)}}, 9},
+        {"embargo, no certificate", {{kEmbargo, date(1000)}}, {}, 1000},
+        {"embargo is over", {{kEmbargo, date(-1)}, {"ClientTooOld", kOn}}, entry, kFortnight},
         {"too old", {{"ClientTooOld", kOn}, {"ForceValidation", kOn}}, {}, 3'153'600'000},
-        {"an expiry", {}, Dictionary{{"Expires", in(500)}}, 500},
-        {"a renewal", {}, Dictionary{{"Expires", in(500)}, {kRenewal, in(400)}}, 400},
-        {"a validated certificate", {}, Dictionary{{kValidated, in(-50)}}, kFortnight - 50},
-        {"a certificate never validated", {}, Dictionary{{kValidated, none}}, 0},
-        {"tried 6 h ago", {}, Dictionary{{kValidated, in(-2e6)}, {kAttempt, in(-21'600)}}, 21'600},
+        {"an expiry", {}, Dictionary{{"Expires", date(500)}}, 500},
+        {"a renewal", {}, Dictionary{{"Expires", date(500)}, {kRenewal, date(400)}}, 400},
+        {"a validated certificate", {}, Dictionary{{kValidated, date(-50)}}, kFortnight - 50},
+        {"a certificate never validated", {}, Dictionary{{kValidated, kGone}}, 0},
+        {"tried 6 h ago", {}, Dictionary{{kValidated, date(-2e6)}, {kAttempt, date(-21'600)}}, 21'600},
         {"an invalid one", {}, Dictionary{{"CertStatus", "CERTIFICATE_INVALID"}}, 0},
         {"a renewal put off, near the end",
          {},
-         Dictionary{{"Expires", in(130'000)}, {kRenewal, in(9e4)}},
+         Dictionary{{"Expires", date(130'000)}, {kRenewal, date(9e4)}},
          9e4},
         {"no certificate", {}, {}, 0},
-        {"a fetch", {{kToken, "t"}, {kFetch, in(30)}, {kRequested, in(-10)}}, {}, 30},
+        {"a fetch", {{kToken, "t"}, {kFetchDate, date(30)}, {kRequested, date(-10)}}, {}, 30},
         {"a fetch without date", {{kToken, "t"}}, {}, 0},
-        {"a fetch that is too far ahead to be believed", {{kToken, "t"}, {kFetch, in(700'000)}}, {}, 0},
-        {"a fetch comes first", {{kToken, "t"}, {kFetch, in(30)}}, Dictionary{{"Expires", in(-1)}}, 30},
-        {"a request", {{kRequested, in(-10)}}, {}, 86'390},
-        {"an interval", {{kRequested, in(-10)}, {"CSRGenerationInterval", number(60)}}, {}, 50},
-        {"a request after a refusal", {{kRequested, in(3600)}}, {}, 90'000},
-        {"requests held up", {{"CertificateRequestsHeldUntil", in(70)}}, {}, 70},
-        {"an old server's record", {{kNextCheck, in(40)}}, entry, kFortnight},
-        {"a record", {{kNextCheck, in(40)}}, entry, 40, true},
-        {"a record without data", {{kIdentifier, "v"}}, entry, 0, true},
+        {"a fetch that is too far ahead to be believed", {{kToken, "t"}, {kFetchDate, date(700'000)}}, {}, 0},
+        {"a fetch comes first",
+         {{kToken, "t"}, {kFetchDate, date(30)}},
+         Dictionary{{"Expires", date(-1)}},
+         30},
+        {"a request", {{kRequested, date(-10)}}, {}, 86'390},
+        {"an interval", {{kRequested, date(-10)}, {"CSRGenerationInterval", number(60)}}, {}, 50},
+        {"a request after a refusal", {{kRequested, date(3600)}}, {}, 90'000},
+        {"requests held up", {{"CertificateRequestsHeldUntil", date(70)}}, {}, 70},
+        {"an old server's record", {{kNextCheck, date(40)}}, entry, kFortnight},
+        {"a record", {{kNextCheck, date(40)}}, entry, 40, 101},
+        {"a record without data", {{kIdentifier, "v"}}, entry, 0, 101},
         {"a record of 100 s",
-         {{kData, kRecordData}, {kAsOf, in(0)}, {kDuration, number(100)}},
+         {{kData, kRecordData}, {kAsOf, date(0)}, {kDuration, number(100)}},
          entry,
          75,
-         true},
-        {"no record", {}, entry, 0, true},
+         101},
+        {"no record", {}, entry, 0, 101},
     };
-    for (const Case& each : cases) {
-        const bool isNewServer = each.isNewServer;
+    for (const auto& [what, values, entry, due, serverVersion] : cases) {
+        SCOPED_TRACE(what);
         server_.answer("authenticate",
-                       Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(isNewServer ? 101 : 100)}});
+                       Dictionary{{"encDsId", "d1"}, {"Version", Value::int32(serverVersion)}});
         __VeltoIDDoVerifyPassword("somebody", kPassword, {});
-        ASSERT_EQ(__VeltoIDSessionGetServerVersion(), isNewServer ? 101 : 100);
+        ASSERT_EQ(__VeltoIDSessionGetServerVersion(), serverVersion);
         __VeltoIDDBRemoveVeltoIDAccount(kName);
         createAccount("d1");
         setValue("Dirty", {});
-        setValues(each.values);
+        setValues(values);
         __VeltoIDDBRemoveCertificateInfo("d1");
-        if (each.entry) {
+        if (entry) {
             __VeltoIDDBSetCertificateInfo("d1", std::nullopt);
             __VeltoIDDBSetCertificateValue("d1", kValidated, date(), Notify::No);
-            for (const auto& [key, value] : *each.entry)
+            for (const auto& [key, value] : *entry)
                 __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
         }
-        const auto next = nextActionOf(kName);
-        EXPECT_EQ(next ? Value::date(*next) : Value(), each.next ? date(*each.next) : Value()) << each.what;
+        EXPECT_EQ(copyNextActionDateForAccount(kName), now() + due);
     }
     __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(100));
     setValue("ValidationDate", date(-30));
     setValue(kNextCheck, date(1000));
-    EXPECT_EQ(nextActionOf(kName), now() + 70);
-    EXPECT_EQ(nextActionOf("nobody"), std::nullopt);
+    EXPECT_EQ(copyNextActionDateForAccount(kName), now() + 70);
+    EXPECT_EQ(copyNextActionDateForAccount("nobody"), std::nullopt);
     ASSERT_TRUE(__VeltoIDDBRemovePassword(kName));
-    EXPECT_EQ(nextActionOf(kName), std::nullopt) << "without a password nothing can be done";
+    EXPECT_EQ(copyNextActionDateForAccount(kName), std::nullopt) << "without a password nothing can be done";
 }
 
 }  // namespace

@@ -10,10 +10,6 @@ namespace {
 
 using enum AccountState;
 
-constexpr double kDay = 86'400;
-const Value kOn = flag(true);
-const Value kGone = Value::null();
-
 class NextActionTest : public CertificateTest {
   protected:
     /// An account with a certificate of 100 days, just issued and not marked, known to a server of this
@@ -26,18 +22,13 @@ class NextActionTest : public CertificateTest {
         issueAtOnce();
         ASSERT_TRUE(request());
         setValues({{"Dirty", kGone}, {"ValidationDate", date()}, {"CertificateRequestDates", kGone}});
-        set({{"Dirty", kGone}});
+        setInEntry({{"Dirty", kGone}});
         (void)server_.take();
     }
-    /// Sets values of the entry; Null removes.
-    static void set(const Dictionary& values) {
-        for (const auto& [key, value] : values) __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
-    }
-    static AccountState check(const Dictionary& options = {{"CheckNetwork", flag(true)}}) {
+    static AccountState check(const Dictionary& options = {{"CheckNetwork", kOn}}) {
         return checkAccountAndDetermineNextAction(kName, options);
     }
     static AccountState checkOffline() { return check({}); }
-    static Data storedReference(const char* key) { return certificateEntry().data(key); }
 };
 
 TEST_F(NextActionTest, WithoutWhatASignInNeedsThereIsNothingToExamine) {
@@ -64,75 +55,49 @@ TEST_F(NextActionTest, WithoutWhatASignInNeedsThereIsNothingToExamine) {
 }
 
 TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
-    struct Case {
-        const char* what;
-        Dictionary entry;
-        AccountState offline;
-        AccountState online;
-        const char* methods;
-    };
-    constexpr const char* kValidated = "LastSuccessfulValidation";
-    constexpr const char* kAttempt = "LastValidationAttempt";
-    constexpr const char* kRenewal = "NextRenewalAttempt";
     constexpr const char* kAsked = "authenticate getMyInfo";
-    const Case cases[] = {
-        {"validated not long ago", {}, CertificateAssumedOK, CertificateAssumedOK, ""},
-        {"marked", {{"Dirty", kOn}}, CertificateAssumedOK, CertificateOK, kAsked},
-        {"never validated", {{kValidated, kGone}}, CertificateAssumedOK, CertificateOK, kAsked},
-        {"validated in the future", {{kValidated, date(5)}}, CertificateAssumedOK, CertificateOK, kAsked},
-        {"validated long ago", {{kValidated, date(-20 * kDay)}}, CertificateAssumedOK, CertificateOK, kAsked},
-        {"tried 6 h ago",
-         {{kValidated, date(-20 * kDay)}, {kAttempt, date(-21'600)}},
-         CertificateAssumedOK,
-         CertificateAssumedOK,
-         ""},
-        {"tried 13 h ago",
-         {{kValidated, date(-20 * kDay)}, {kAttempt, date(-46'800)}},
-         CertificateAssumedOK,
-         CertificateOK,
-         kAsked},
-        {"expired", {{"Expires", date(-1)}}, CertificateExpired, CertificateExpired, ""},
-        {"invalid",
-         {{"CertStatus", "CERTIFICATE_INVALID"}, {"Expires", date(-1)}},
-         CertificateRevoked,
-         CertificateRevoked,
-         ""},
-        {"to be renewed", {{kRenewal, date(-1)}}, CertificateShouldBeRenewed, CertificateShouldBeRenewed, ""},
-        {"to be renewed, evaluated",
-         {{kRenewal, date(-1)}, {"Dirty", kOn}},
-         CertificateShouldBeRenewed,
-         CertificateShouldBeRenewed,
-         kAsked},
-        {"its last 36 hours",
-         {{"Expires", date(129'000)}},
-         CertificateShouldBeRenewed,
-         CertificateShouldBeRenewed,
-         ""},
-        {"just before them", {{"Expires", date(130'000)}}, CertificateAssumedOK, CertificateAssumedOK, ""},
-        {"no plan, no renewal",
-         {{"Expires", date(100)}, {kRenewal, kGone}},
-         CertificateAssumedOK,
-         CertificateAssumedOK,
-         ""},
-        {"no number", {{"Dirty", kOn}, {"SerialNumber", kGone}}, CertificateAssumedOK, CertificateOK, ""},
+    // What is found, and, where that is another, what is found with the server's help.
+    using Found = std::pair<AccountState, AccountState>;
+    constexpr Found kGood = {CertificateAssumedOK, CertificateAssumedOK};
+    constexpr Found kEvaluated = {CertificateAssumedOK, CertificateOK};
+    constexpr Found kToBeRenewed = {CertificateShouldBeRenewed, CertificateShouldBeRenewed};
+    constexpr Found kExpired = {CertificateExpired, CertificateExpired};
+    constexpr Found kRevoked = {CertificateRevoked, CertificateRevoked};
+    const Value longAgo = date(-20 * kDay);
+    const Value past = date(-1);
+    const std::tuple<const char*, Dictionary, Found, const char*> cases[] = {
+        {"validated not long ago", {}, kGood, ""},
+        {"marked", {{"Dirty", kOn}}, kEvaluated, kAsked},
+        {"never validated", {{kValidated, kGone}}, kEvaluated, kAsked},
+        {"validated in the future", {{kValidated, date(5)}}, kEvaluated, kAsked},
+        {"validated long ago", {{kValidated, longAgo}}, kEvaluated, kAsked},
+        {"tried 6 h ago", {{kValidated, longAgo}, {kAttempt, date(-21'600)}}, kGood, ""},
+        {"tried 13 h ago", {{kValidated, longAgo}, {kAttempt, date(-46'800)}}, kEvaluated, kAsked},
+        {"expired", {{"Expires", past}}, kExpired, ""},
+        {"invalid", {{"CertStatus", "CERTIFICATE_INVALID"}, {"Expires", past}}, kRevoked, ""},
+        {"to be renewed", {{kRenewal, past}}, kToBeRenewed, ""},
+        {"to be renewed, evaluated", {{kRenewal, past}, {"Dirty", kOn}}, kToBeRenewed, kAsked},
+        {"its last 36 hours", {{"Expires", date(129'000)}}, kToBeRenewed, ""},
+        {"just before them", {{"Expires", date(130'000)}}, kGood, ""},
+        {"no plan, no renewal", {{"Expires", date(100)}, {kRenewal, kGone}}, kGood, ""},
+        {"no number", {{"Dirty", kOn}, {"SerialNumber", kGone}}, kEvaluated, ""},
     };
     prepare();
     const Dictionary fresh = certificateEntry();
     const auto restore = [&] {
-        for (const auto& [key, value] : certificateEntry()) set({{key.view(), kGone}});
-        set(fresh);
+        for (const auto& [key, value] : certificateEntry()) setInEntry({{key.view(), kGone}});
+        setInEntry(fresh);
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, entry, found, methods] : cases) {
+        SCOPED_TRACE(what);
         restore();
-        set(each.entry);
-        EXPECT_EQ(checkOffline(), each.offline) << each.what;
-        EXPECT_EQ(server_.takeMethods(), "") << each.what;
-        EXPECT_EQ(check(), each.online) << each.what;
-        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        if (each.online == CertificateOK) {
-            EXPECT_EQ(certificateEntry()["LastValidationAttempt"], date()) << each.what;
-            EXPECT_EQ(certificateEntry()[kValidated], date()) << each.what;
-        }
+        setInEntry(entry);
+        EXPECT_EQ(checkOffline(), found.first);
+        EXPECT_EQ(server_.takeMethods(), "");
+        EXPECT_EQ(check(), found.second);
+        EXPECT_EQ(server_.takeMethods(), methods);
+        if (found.second != CertificateOK) continue;
+        for (const char* key : {kAttempt, kValidated}) EXPECT_EQ(certificateEntry()[key], date()) << key;
     }
     restore();
     EXPECT_EQ(check({{"CheckNetwork", kOn}, {"ForceValidation", kOn}}), CertificateOK);
@@ -140,7 +105,7 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
          {std::pair(Value::real(-200'000), CertificateShouldBeRenewed),
           std::pair(number(10), CertificateAssumedOK), std::pair(Value("x"), CertificateAssumedOK)}) {
         restore();
-        set({{"Expires", date(129'500)}});
+        setInEntry({{"Expires", date(129'500)}});
         EXPECT_EQ(check({{"PreExpirationInterval", interval}}), state) << testing::PrintToString(interval);
     }
 }
@@ -148,15 +113,15 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
 TEST_F(NextActionTest, ACertificateIsEvaluatedUnderTheAuthority) {
     prepare();
     const auto evaluated = [this] {
-        set({{"Dirty", kOn}, {"LastSuccessfulValidation", date(-5)}, {"LastValidationAttempt", kGone}});
+        setInEntry({{"Dirty", kOn}, {kValidated, date(-5)}, {kAttempt, kGone}});
         const AccountState state = check();
-        EXPECT_EQ(certificateEntry()["LastSuccessfulValidation"] == date(),
+        EXPECT_EQ(certificateEntry()[kValidated] == date(),
                   state == CertificateOK || state == CertificateAssumedOK);
-        EXPECT_EQ(certificateEntry().contains("LastValidationAttempt"), state != Unknown);
+        EXPECT_EQ(certificateEntry().contains(kAttempt), state != Unknown);
         return state;
     };
     EXPECT_EQ(evaluated(), CertificateOK);
-    set({{"IntermediateCertificateReference", kGone}});
+    setInEntry({{"IntermediateCertificateReference", kGone}});
     EXPECT_EQ(evaluated(), CertificateRevoked) << "no path to the authority";
     trust(intermediate_);
     EXPECT_EQ(evaluated(), CertificateOK);
@@ -166,92 +131,75 @@ TEST_F(NextActionTest, ACertificateIsEvaluatedUnderTheAuthority) {
     EXPECT_EQ(evaluated(), Unknown) << "nobody to ask";
     trust(root_);
 
-    server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", flag(false)}});
-    set({{"Dirty", kOn}});
+    server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", kOff}});
+    setInEntry({{"Dirty", kOn}});
     EXPECT_EQ(check(), CertificateRevoked) << "the server's word counts at once";
     EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERTIFICATE_INVALID"));
 }
 
 TEST_F(NextActionTest, WhatCannotBeReadFromTheKeychainIsMissing) {
-    struct Case {
-        const char* key;
-        Value reference;
-        const char* line;
-    };
     const Value unknown = Data(std::vector<uint8_t>{1});
-    const Case cases[] = {
-        {"CertificateReference", kGone,
-         "get certificate from keychain for veltoID jane@velto.example because certRef=NULL"},
-        {"CertificateReference", unknown,
-         "get certificate from keychain from persistent reference for veltoID jane@velto.example certRef=$"},
-        {"CertificatePrivateKeyReference", kGone,
-         "get private key from keychain from persistent reference for veltoID jane@velto.example "
-         "privateKeyRef=NULL"},
-        {"CertificatePrivateKeyReference", unknown,
-         "get private key from keychain from persistent reference for veltoID jane@velto.example certRef=$"},
+    const std::string name = kName;
+    const std::string byReference = " from keychain from persistent reference for veltoID " + name;
+    const std::tuple<const char*, Value, std::string> cases[] = {
+        {kCertificateReference, kGone,
+         "get certificate from keychain for veltoID " + name + " because certRef=NULL"},
+        {kCertificateReference, unknown, "get certificate" + byReference + " certRef=$"},
+        {kKeyReference, kGone, "get private key" + byReference + " privateKeyRef=NULL"},
+        {kKeyReference, unknown, "get private key" + byReference + " certRef=$"},
     };
     prepare();
-    for (const Case& each : cases) {
-        const Value before = storedReference(each.key);
-        set({{each.key, each.reference}});
-        EXPECT_EQ(check(), NoCertificate) << each.line;
-        EXPECT_EQ(log_.count(each.line), 1) << each.line;
-        set({{each.key, before}});
+    for (const auto& [key, reference, line] : cases) {
+        const Value before = certificateEntry()[key];
+        setInEntry({{key, reference}});
+        EXPECT_EQ(check(), NoCertificate) << line;
+        EXPECT_EQ(log_.count(line), 1) << line;
+        setInEntry({{key, before}});
     }
     EXPECT_EQ(check(), CertificateAssumedOK);
 }
 
 TEST_F(NextActionTest, TheAccountIsValidatedWhenItIsDue) {
-    struct Case {
+    constexpr const char* kAsked = "authenticate authenticate getMyInfo";
+    constexpr const char* kDate = "ValidationDate";
+    constexpr const char* kNext = "NextValidationDate";
+    const Value soon = date(3'600);
+    const struct {
         const char* what;
         Dictionary values;
         const char* methods;
         /// What is left of the marks.
-        Value forced;
-        Value next;
-    };
-    constexpr const char* kValidated = "authenticate authenticate getMyInfo";
-    constexpr const char* kDate = "ValidationDate";
-    constexpr const char* kNext = "NextValidationDate";
-    const Value soon = date(3'600);
-    const Case cases[] = {
+        Value forced, next;
+    } cases[] = {
         {"not due", {}, "", {}, {}},
-        {"forced", {{"ForceValidation", kOn}}, kValidated, {}, {}},
-        {"planned", {{kNext, date()}}, kValidated, {}, {}},
+        {"forced", {{"ForceValidation", kOn}}, kAsked, {}, {}},
+        {"planned", {{kNext, date()}}, kAsked, {}, {}},
         {"planned for later", {{kNext, date(5)}}, "", {}, date(5)},
         {"14 days old", {{kDate, date(-14 * kDay)}}, "", {}, {}},
-        {"older", {{kDate, date(-14 * kDay - 1)}}, kValidated, {}, {}},
+        {"older", {{kDate, date(-14 * kDay - 1)}}, kAsked, {}, {}},
         {"older, tried already", {{kDate, date(-15 * kDay)}, {kNext, soon}}, "authenticate", {}, soon},
         {"unknown", {{kDate, kGone}}, "authenticate", {}, {}},
-        {"embargo", {{"ForceValidation", kOn}, {"EarliestAllowedConnectionDate", date(9)}}, "", {}, {}},
+        {"embargo", {{"ForceValidation", kOn}, {kEmbargo, date(9)}}, "", {}, {}},
     };
     prepare();
-    for (const Case& each : cases) {
-        setValues({{kDate, date()}, {kNext, kGone}, {"EarliestAllowedConnectionDate", kGone}});
-        setValues(each.values);
-        EXPECT_EQ(check(), CertificateAssumedOK) << each.what;
-        EXPECT_EQ(server_.takeMethods(), each.methods) << each.what;
-        EXPECT_EQ(record()["ForceValidation"], each.forced) << each.what;
-        EXPECT_EQ(record()[kNext], each.next) << each.what;
+    for (const auto& [what, values, methods, forced, next] : cases) {
+        SCOPED_TRACE(what);
+        setValues({{kDate, date()}, {kNext, kGone}, {kEmbargo, kGone}});
+        setValues(values);
+        EXPECT_EQ(check(), CertificateAssumedOK);
+        EXPECT_EQ(server_.takeMethods(), methods);
+        EXPECT_EQ(record()["ForceValidation"], forced);
+        EXPECT_EQ(record()[kNext], next);
     }
-    setValues({{kDate, date(-15 * kDay)}, {kNext, kGone}, {"EarliestAllowedConnectionDate", kGone}});
+    setValues({{kDate, date(-15 * kDay)}, {kNext, kGone}, {kEmbargo, kGone}});
     server_.refuse("authenticate", 503);
     EXPECT_EQ(check(), CertificateAssumedOK);
     EXPECT_EQ(record()[kNext], soon) << "a server that cannot be reached is tried again in an hour";
 }
 
 TEST_F(NextActionTest, ADueValidationRecordIsTheLastThingToLookFor) {
-    struct Case {
-        const char* what;
-        Dictionary values;
-        bool isDue;
-    };
-    constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
-    constexpr const char* kData = "VeltoIDAccountValidationRecordData";
-    constexpr const char* kAsOf = "VeltoIDAccountValidationRecordValidAsOfKey";
-    constexpr const char* kDuration = "VeltoIDAccountValidationRecordSuggestedValidIntervalKey";
     const Value data = Data(std::vector<uint8_t>{1});
-    const Case cases[] = {
+    const std::tuple<const char*, Dictionary, bool> cases[] = {
         {"no record", {}, true},
         {"a date to come", {{kNextCheck, date(1)}}, false},
         {"a date that has come", {{kNextCheck, date()}, {kData, data}, {kAsOf, date()}}, true},
@@ -265,12 +213,12 @@ TEST_F(NextActionTest, ADueValidationRecordIsTheLastThingToLookFor) {
     };
     for (const int32_t version : {100, 101}) {
         prepare(version);
-        for (const Case& each : cases) {
+        for (const auto& [what, values, isDue] : cases) {
+            SCOPED_TRACE(what + std::to_string(version));
             for (const char* key : {kNextCheck, kData, kAsOf, kDuration}) setValue(key, kGone);
-            setValues(each.values);
-            const bool isDue = version > 100 && each.isDue;
-            EXPECT_EQ(check(), isDue ? ValidationRecordNeedsToBeUpdated : CertificateAssumedOK)
-                << each.what << version;
+            setValues(values);
+            EXPECT_EQ(check(),
+                      version > 100 && isDue ? ValidationRecordNeedsToBeUpdated : CertificateAssumedOK);
         }
     }
 }

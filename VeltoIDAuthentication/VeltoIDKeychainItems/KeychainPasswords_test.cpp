@@ -1,26 +1,20 @@
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 #include <gtest/gtest.h>
-#include <sqlite3.h>
-
-#include <filesystem>
-#include <thread>
-#include <vector>
 
 #include "Platform/keychain/Keychain.h"
 #include "TestSupport/FakeSystemLog.h"
-#include "TestSupport/TemporaryStateDirectory.h"
+#include "TestSupport/KeychainCases.h"
+#include "TestSupport/SQLiteEdit.h"
+#include "TestSupport/SideBySide.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 
 namespace veltoid {
 namespace {
 
 using platform::Accessibility;
-using platform::KeychainAttributes;
 using platform::KeychainQuery;
 using platform::PersistentReference;
-
-constexpr const char* kService = "Velto ID Authentication";
 
 class PasswordsTest : public testing::Test {
   protected:
@@ -51,8 +45,7 @@ TEST_F(PasswordsTest, AHashIsKeptAndFoundByItsReference) {
     EXPECT_EQ(read(add("ümlaut", "häsh")), "häsh");
     EXPECT_EQ(read(add("empty", "")), "");
     KeychainQuery query = item(one);
-    query.attributes.account = "one";
-    query.attributes.service = kService;
+    query.attributes = platform::password("one", "Velto ID Authentication");
     query.attributes.description = "Velto ID Authentication password";
     EXPECT_EQ(platform::keychain::accessibilityOf(query), Accessibility::AfterFirstUnlockThisDeviceOnly);
     query.attributes.label = "any";
@@ -72,13 +65,9 @@ TEST_F(PasswordsTest, AnItemOfTheAccountIsUpdatedInPlace) {
     EXPECT_EQ(platform::keychain::accessibilityOf(item(reference)), Accessibility::AfterFirstUnlock);
     EXPECT_EQ(log_.count("Password already in keychain; updating it to (new) value.  persistentRef=$"), 1);
 
-    KeychainAttributes foreign;
-    foreign.account = "foreign";
-    foreign.service = "some other service";
     PersistentReference added;
-    const auto text = platform::bytesOf("theirs");
-    ASSERT_EQ(platform::keychain::add(foreign, Accessibility::Always, text, &added),
-              platform::kKeychainSuccess);
+    platform::keychain::add(platform::password("foreign", "some other service"), Accessibility::Always,
+                            platform::bytesOf("theirs"), &added);
     EXPECT_EQ(add("foreign", "ours"), Data(added)) << "whatever service it was made for";
     EXPECT_EQ(read(Data(added)), "ours");
 }
@@ -86,12 +75,7 @@ TEST_F(PasswordsTest, AnItemOfTheAccountIsUpdatedInPlace) {
 TEST_F(PasswordsTest, AnItemThatCannotBeUpdatedIsReplaced) {
     const Data damaged = add("one", "before");
     // Edited behind the keychain's back, the item does not unseal any more.
-    sqlite3* database = nullptr;
-    ASSERT_EQ(sqlite3_open(platform::TemporaryStateDirectory::file("keychain.db").c_str(), &database),
-              SQLITE_OK);
-    EXPECT_EQ(sqlite3_exec(database, "UPDATE items SET label = 'edited'", nullptr, nullptr, nullptr),
-              SQLITE_OK);
-    sqlite3_close(database);
+    platform::editDatabase("keychain.db", "UPDATE items SET label = 'edited'");
     EXPECT_EQ(read(damaged), "none");
 
     const Data fresh = add("one", "after");
@@ -127,7 +111,7 @@ TEST_F(PasswordsTest, WhatIsMissingFailsQuietly) {
 }
 
 TEST_F(PasswordsTest, AKeychainThatCannotBeOpenedRefuses) {
-    std::filesystem::create_directory(platform::TemporaryStateDirectory::file("keychain.db"));
+    const platform::Obstacle noKeychain("keychain.db");
     const Data before(std::vector<uint8_t>{1});
     Data reference = before;
     EXPECT_FALSE(addPasswordToKeychain("one", "secret hash", nullptr, &reference));
@@ -162,23 +146,18 @@ TEST_F(PasswordsTest, WithoutTheKeychainItemsLiveInMemory) {
 
 TEST_F(PasswordsTest, OperationsRunOneByOneOnTheirQueue) {
     EXPECT_EQ(keychainQueue().label(), "KeychainDispatchQueue");
-    std::vector<std::thread> threads;
-    for (int i = 0; i < 4; ++i) {
-        threads.emplace_back([i] {
-            const std::string account = "account" + std::to_string(i);
-            for (int round = 0; round < 10; ++round) {
-                const Data reference = add(account.c_str(), std::to_string(round).c_str());
-                EXPECT_EQ(read(reference), std::to_string(round));
-                EXPECT_TRUE(round % 3 != 2 || removePasswordFromKeychainGivenPersistentRef(reference));
-            }
-        });
-    }
-    for (std::thread& thread : threads) thread.join();
-    for (const auto& line : log_.lines()) {
+    platform::sideBySide(4, [](int i) {
+        const std::string account = "account" + std::to_string(i);
+        for (int round = 0; round < 10; ++round) {
+            const Data reference = add(account.c_str(), std::to_string(round).c_str());
+            EXPECT_EQ(read(reference), std::to_string(round));
+            EXPECT_TRUE(round % 3 != 2 || removePasswordFromKeychainGivenPersistentRef(reference));
+        }
+    });
+    for (const auto& line : log_.lines())
         EXPECT_TRUE(line.text.find("Password") == std::string::npos ||
                     line.text.ends_with(" KeychainDispatchQueue"))
             << line.text;
-    }
 }
 
 }  // namespace

@@ -3,6 +3,7 @@
 #include "Platform/crypto/KeyPair.h"
 #include "Platform/keychain/Keychain.h"
 #include "TestSupport/FakeSystemLog.h"
+#include "TestSupport/KeychainCases.h"
 #include "TestSupport/TemporaryStateDirectory.h"
 #include "TestSupport/TestAuthority.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
@@ -16,8 +17,7 @@ using platform::Accessibility;
 using platform::KeychainItemClass;
 
 struct Pair {
-    Key privateKey;
-    Key publicKey;
+    Key privateKey, publicKey;
 };
 
 Pair newPair() {
@@ -102,12 +102,9 @@ TEST_F(KeysTest, WhatIsNoKeyIsRefused) {
     EXPECT_FALSE(addKeyToKeychain("jane", "public key", pair.privateKey, &reference));
     EXPECT_FALSE(reference);
     EXPECT_TRUE(addKeyToKeychain(nullptr, nullptr, pair.privateKey, nullptr));
-    for (const std::vector<uint8_t>& bytes :
-         {std::vector<uint8_t>{}, std::vector<uint8_t>{0x30, 0x03, 1, 2, 3},
-          std::vector<uint8_t>(100'000, 0x30)}) {
-        EXPECT_FALSE(Key::privateKey(bytes));
-        EXPECT_FALSE(Key::publicKey(bytes));
-    }
+    using Bytes = std::vector<uint8_t>;
+    for (const Bytes& bytes : {Bytes{}, Bytes{0x30, 0x03, 1, 2, 3}, Bytes(100'000, 0x30)})
+        EXPECT_FALSE(Key::privateKey(bytes) || Key::publicKey(bytes));
     const auto encoded = pair.privateKey.encoded.bytes();
     EXPECT_FALSE(Key::privateKey(encoded.first(encoded.size() - 1)));
     EXPECT_FALSE(Key::publicKey(encoded));
@@ -115,11 +112,9 @@ TEST_F(KeysTest, WhatIsNoKeyIsRefused) {
     EXPECT_FALSE(copyKeyFromKeychainGivenPersistentRef({}, nullptr));
     EXPECT_FALSE(removeKeyFromKeychainGivenPersistentRef({}));
 
-    platform::KeychainAttributes attributes;
-    attributes.itemClass = KeychainItemClass::Key;
-    attributes.applicationValue = "other";
     platform::PersistentReference added;
-    platform::keychain::add(attributes, Accessibility::Always, platform::bytesOf("no key"), &added);
+    platform::keychain::add(platform::object(KeychainItemClass::Key, {}, "other"), Accessibility::Always,
+                            platform::bytesOf("no key"), &added);
     Key none;
     EXPECT_TRUE(copyKeyFromKeychainGivenPersistentRef(Data(added), &none)) << "the item is there";
     EXPECT_FALSE(none);
@@ -179,18 +174,18 @@ TEST_F(KeysTest, ACertificateIsKeptUnderItsLabel) {
 }
 
 TEST_F(KeysTest, AKeychainThatCannotBeOpenedRefuses) {
-    std::filesystem::create_directory(platform::TemporaryStateDirectory::file("keychain.db"));
+    const platform::Obstacle noKeychain("keychain.db");
     const testing_support::TestAuthority authority;
     const auto certificate = platform::readCertificate(authority.certificate());
     Data reference;
     EXPECT_FALSE(addKeyToKeychain("jane", nullptr, newPair().privateKey, &reference));
     EXPECT_FALSE(addCertificateToKeychain(*certificate, "the label", &reference));
     EXPECT_FALSE(reference);
-    EXPECT_EQ(log_.count("Certificate \"the label\" not added to keychain; err=-25291"), 1);
     EXPECT_FALSE(removeCertificateFromKeychainGivenPersistentRef(Data(std::vector<uint8_t>{1})));
-    EXPECT_EQ(
-        log_.count("Error #-25291 from keychain::remove(), removeCertificateFromKeychainGivenPersistentRef"),
-        1);
+    for (const char* line :
+         {"Certificate \"the label\" not added to keychain; err=-25291",
+          "Error #-25291 from keychain::remove(), removeCertificateFromKeychainGivenPersistentRef"})
+        EXPECT_EQ(log_.count(line), 1) << line;
 }
 
 }  // namespace

@@ -122,13 +122,13 @@ Value delayOf(const Dictionary& reply) {
     return delay.isNumber() ? delay : Value();
 }
 
-CertificateAnswer certificateAnswer(const Dictionary& reply, const Dictionary* dsCert) {
-    if (dsCert == nullptr) return {std::nullopt, delayOf(reply)};
+std::optional<Dictionary> copyCertificateResultFromDsCert(const Dictionary* dsCert) {
+    if (dsCert == nullptr) return std::nullopt;
     Dictionary result;
     takeEntries(*dsCert, kCertificateEntries, result);
     if (const auto expires = dateFromValue((*dsCert)[wire::kCertificateExpiration]))
         result.set(kVeltoIDCertificateExpirationDateKey, Value::date(*expires));
-    return {result.empty() ? std::nullopt : std::optional(result), delayOf(reply)};
+    return result.empty() ? std::nullopt : std::optional(result);
 }
 
 /// Some servers answer with a list of certificates, the wanted one first.
@@ -203,7 +203,9 @@ bool __VeltoIDSessionDoSendCSR(VeltoIDAuthenticationSessionInfo& session, const 
         return call(session, {"createCert", kVeltoIDXMLSendCSRCountKey}, own, options, error,
                     [&](const Dictionary& reply) {
                         fill(token, reply.string(wire::kCertificateToken));
-                        fill(answer, certificateAnswer(reply, reply.dictionary(wire::kCertificateEntry)));
+                        fill(answer,
+                             {copyCertificateResultFromDsCert(reply.dictionary(wire::kCertificateEntry)),
+                              delayOf(reply)});
                     });
     });
 }
@@ -216,7 +218,7 @@ bool __VeltoIDSessionDoFetchCSRResult(VeltoIDAuthenticationSessionInfo& session,
         const Call made =
             invoke(session, kMethod, {{wire::kCertificateToken, token}, {wire::kEncDsId, encDsId}}, options);
         if (made.isAnswered()) {
-            fill(answer, certificateAnswer(*made.reply, dsCertOf(*made.reply)));
+            fill(answer, {copyCertificateResultFromDsCert(dsCertOf(*made.reply)), delayOf(*made.reply)});
         } else if (isPending(made)) {
             fill(answer, pendingAnswer(made, token));
         } else {

@@ -15,12 +15,6 @@ class GetMyInfo : public ServerTest {
         createAccount("d1");
     }
 
-    Session session(const String& encDsId = "d1") const {
-        return Session(new VeltoIDAuthenticationSessionInfo{kName, kPassword, "https://server.example", "s1",
-                                                            now(), 100, encDsId,
-                                                            copySessionQueueForAccount(kName)});
-    }
-
     /// What the operation makes of a reply.
     Dictionary resultOf(const Dictionary& reply) {
         server_.answer("getMyInfo", reply);
@@ -31,19 +25,16 @@ class GetMyInfo : public ServerTest {
 };
 
 TEST_F(GetMyInfo, SendsWhatTheAgentHasAlready) {
-    struct Case {
-        const char* what;
-        String argument;
-        String ofSession;
-        Dictionary parameters;
-        /// What is sent of the encDsId, the serial number and the record's identifier.
-        std::array<Value, 3> sent;
-    };
-    constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
     const Dictionary given = {{"SerialNumber", "given"}, {kIdentifier, ""}, {"Other", "x"}};
     const Dictionary wrong = {{"SerialNumber", number(1)}, {kIdentifier, number(1)}};
     __VeltoIDDBSetCertificateInfo("certified", Dictionary{{"SerialNumber", "stored"}});
-    const Case cases[] = {
+    const struct {
+        const char* what;
+        String argument, ofSession;
+        Dictionary parameters;
+        /// What is sent of the encDsId, the serial number and the record's identifier.
+        std::array<Value, 3> ownParameters;
+    } cases[] = {
         {"nothing", nullptr, nullptr, {}, {}},
         {"the session's", nullptr, "s", {}, {"s"}},
         {"the argument first", "a", "s", {}, {"a"}},
@@ -54,47 +45,41 @@ TEST_F(GetMyInfo, SendsWhatTheAgentHasAlready) {
     };
     server_.answer("getMyInfo", Dictionary{{"x", "y"}});
     const std::set<std::string> common = keysOf(createCallParameters(kName, "s1", {}));
-    for (const Case& each : cases) {
-        ASSERT_TRUE(_VeltoIDSessionDoGetMyInfo(*session(each.ofSession), each.argument, each.parameters, {},
-                                               nullptr, nullptr));
+    for (const auto& [what, argument, ofSession, parameters, ownParameters] : cases) {
+        SCOPED_TRACE(what);
+        ASSERT_TRUE(
+            _VeltoIDSessionDoGetMyInfo(*session(ofSession), argument, parameters, {}, nullptr, nullptr));
         Dictionary sent = server_.take().at(0).parameters;
-        EXPECT_EQ(sent["dsSession"], Value("s1")) << each.what;
-        for (const std::string& key : common) EXPECT_TRUE(sent.remove(key)) << each.what << key;
-        EXPECT_EQ(sent, (Dictionary{{"encDsId", each.sent[0]},
-                                    {"CertificateSerialNumber", each.sent[1]},
-                                    {"ClientVIDVRecordIdentifier", each.sent[2]}}))
-            << each.what;
+        EXPECT_EQ(sent["dsSession"], Value("s1"));
+        for (const std::string& key : common) EXPECT_TRUE(sent.remove(key)) << key;
+        EXPECT_EQ(sent, (Dictionary{{"encDsId", ownParameters[0]},
+                                    {"CertificateSerialNumber", ownParameters[1]},
+                                    {"ClientVIDVRecordIdentifier", ownParameters[2]}}));
     }
     EXPECT_EQ(count("VeltoIDXMLGetMyInfoCount"), 7);
 }
 
 TEST_F(GetMyInfo, TakesEntriesOfTheRightKind) {
     const Value list = Array{"a", "b"};
-    struct Case {
-        const char* replyKey;
-        const char* resultKey;
-        Value right;
-        Value wrong;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, const char*, Value, Value> cases[] = {
         {"encDsId", "encDsId", "d", number(1)},
         {"lastNm", "LastName", "Roe", number(1)},
         {"firstNm", "FirstName", "Jane", list},
         {"ValidatedEmail", "ValidatedEmail", list, "a"},
-        {"ValidatedPhones", "ValidatedPhones", Array(), flag(true)},
+        {"ValidatedPhones", "ValidatedPhones", Array(), kOn},
         {"PrimaryEmail", "PrimaryEmail", "p", number(1)},
         {"VeltoID", "VeltoID", "v", list},
-        {"CertificateIsValid", "CertificateIsValid", flag(false), "false"},
+        {"CertificateIsValid", "CertificateIsValid", kOff, "false"},
         {"AllEmails", "AllEmails", list, "a"},
         {"ValidForInterval", "ValidForInterval", Value::real(2.5), "60"},
     };
     Dictionary right = {{"Unknown", "x"}};
     Dictionary wrong = {{"Unknown", "x"}};
     Dictionary result;
-    for (const Case& each : cases) {
-        right.set(each.replyKey, each.right);
-        wrong.set(each.replyKey, each.wrong);
-        result.set(each.resultKey, each.right);
+    for (const auto& [replyKey, resultKey, good, bad] : cases) {
+        right.set(replyKey, good);
+        wrong.set(replyKey, bad);
+        result.set(resultKey, good);
     }
     EXPECT_EQ(resultOf(right), result);
     EXPECT_EQ(resultOf(wrong), Dictionary());
@@ -104,64 +89,51 @@ TEST_F(GetMyInfo, AValidationRecordComesWithItsData) {
     const Data data(std::vector<uint8_t>{1, 2, 3});
     const Value identifier = "v1";
     const Value checked = "2030-01-02T03:04:05Z";
-    constexpr const char* kData = "VeltoIDAccountValidationRecordData";
-    constexpr const char* kIdentifier = "VeltoIDAccountValidationRecordIdentifierKey";
-    constexpr const char* kNextCheck = "VeltoIDAccountValidationRecordNextCheckDateKey";
+    const auto resultOfRecord = [this](const Value& record, const Value& name, const Value& next) {
+        return resultOf(
+            {{"VIDVRecord", record}, {"VIDVRecordIdentifier", name}, {"VIDVRecordNextCheckDate", next}});
+    };
+    const Dictionary dataAlone = {{kData, data}};
     EXPECT_EQ(
-        resultOf({{"VIDVRecord", "AQID"},
-                  {"VIDVRecordIdentifier", identifier},
-                  {"VIDVRecordNextCheckDate", checked}}),
+        resultOfRecord("AQID", identifier, checked),
         (Dictionary{{kData, data}, {kIdentifier, identifier}, {kNextCheck, Value::date(1'893'553'445)}}));
-    EXPECT_EQ(
-        resultOf(
-            {{"VIDVRecord", "AQID"}, {"VIDVRecordIdentifier", number(1)}, {"VIDVRecordNextCheckDate", "x"}}),
-        (Dictionary{{kData, data}}));
-    EXPECT_EQ(resultOf({{"VIDVRecord", "AQID"}, {"VIDVRecordNextCheckDate", date()}}),
-              (Dictionary{{kData, data}}));
+    EXPECT_EQ(resultOfRecord("AQID", number(1), "x"), dataAlone);
+    EXPECT_EQ(resultOfRecord("AQID", {}, date()), dataAlone);
     for (const Value& record : {Value(""), number(5), Value()})
-        EXPECT_EQ(resultOf({{"VIDVRecord", record},
-                            {"VIDVRecordIdentifier", identifier},
-                            {"VIDVRecordNextCheckDate", checked}}),
-                  Dictionary())
+        EXPECT_EQ(resultOfRecord(record, identifier, checked), Dictionary())
             << testing::PrintToString(record);
 }
 
 TEST_F(GetMyInfo, ASessionWithoutEncDsIdLearnsIt) {
     server_.answer("getMyInfo", Dictionary{{"encDsId", "learned"}});
-    const Session without = session(nullptr);
-    ASSERT_TRUE(_VeltoIDSessionDoGetMyInfo(*without, nullptr, {}, {}, nullptr, nullptr));
-    EXPECT_EQ(without->fEncDsId, "learned");
-    const Session with = session("own");
-    ASSERT_TRUE(_VeltoIDSessionDoGetMyInfo(*with, nullptr, {}, {}, nullptr, nullptr));
-    EXPECT_EQ(with->fEncDsId, "own");
+    for (const auto& [before, after] : {std::pair(String(), "learned"), std::pair(String("own"), "own")}) {
+        const Session called = session(before);
+        ASSERT_TRUE(_VeltoIDSessionDoGetMyInfo(*called, nullptr, {}, {}, nullptr, nullptr));
+        EXPECT_EQ(called->fEncDsId, after);
+    }
 }
 
 TEST_F(GetMyInfo, AFailedCallSpoilsTheSession) {
-    struct Case {
-        const char* what;
-        std::function<void()> prepare;
-        int64_t code;
-        bool keepsPassword;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, std::function<void()>, int64_t, bool> cases[] = {
         {"a fault", [this] { server_.fault("getMyInfo", -4); }, -100, true},
         {"wrong password", [this] { server_.fault("getMyInfo", -20283); }, -101, false},
         {"no server", [this] { server_.refuse("getMyInfo", 500); }, -100, true},
         {"no dictionary", [this] { server_.answer("getMyInfo", "hello"); }, -100, true},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, prepare, code, keepsPassword] : cases) {
+        SCOPED_TRACE(what);
         createAccount();
-        each.prepare();
+        prepare();
         Session failing = session();
         Dictionary result{{"left", "over"}};
         std::optional<Error> error;
-        EXPECT_FALSE(_VeltoIDSessionDoGetMyInfo(*failing, "d1", {}, {}, &result, &error)) << each.what;
-        EXPECT_EQ(result, (Dictionary{{"left", "over"}})) << each.what;
-        EXPECT_EQ(error->code, each.code) << each.what;
-        EXPECT_EQ(hasPassword(), each.keepsPassword) << each.what;
-        EXPECT_EQ(failing->fSessionID, String()) << each.what;
+        EXPECT_FALSE(_VeltoIDSessionDoGetMyInfo(*failing, "d1", {}, {}, &result, &error));
+        EXPECT_EQ(result, (Dictionary{{"left", "over"}}));
+        EXPECT_EQ(error->code, code);
+        EXPECT_EQ(hasPassword(), keepsPassword);
+        EXPECT_EQ(failing->fSessionID, String());
         failing.reset();
-        EXPECT_EQ(takeCachedSession(kName, kPassword, "https://server.example"), nullptr) << each.what;
+        EXPECT_EQ(takeCachedSession(kName, kPassword, kURL), nullptr);
     }
     EXPECT_EQ(count("VeltoIDXMLGetMyInfoCount"), 0);
     server_.answer("getMyInfo", Dictionary{{"x", "y"}, {"dsSessionValidityDuration", number(50)}});
@@ -169,7 +141,7 @@ TEST_F(GetMyInfo, AFailedCallSpoilsTheSession) {
     EXPECT_TRUE(_VeltoIDSessionDoGetMyInfo(*working, "d1", {}, {}, nullptr, nullptr));
     EXPECT_EQ(working->fValidityDuration, 50) << "commands of any reply are applied";
     working.reset();
-    EXPECT_NE(takeCachedSession(kName, kPassword, "https://server.example"), nullptr);
+    EXPECT_NE(takeCachedSession(kName, kPassword, kURL), nullptr);
 }
 
 // --- The other methods
@@ -191,48 +163,42 @@ class Methods : public GetMyInfo {
 };
 
 TEST_F(Methods, SendWhatTheyAreGiven) {
-    for (const char* method : {"findPerson", "createCert", "fetchCert", "downloadCertComplete", "revokeCert",
-                               "saveBreadcrumbEk", "fetchBreadcrumbEk"})
-        server_.answer(method, Dictionary{{"x", "y"}});
+    const auto methods = {"findPerson", "createCert",       "fetchCert",        "downloadCertComplete",
+                          "revokeCert", "saveBreadcrumbEk", "fetchBreadcrumbEk"};
+    for (const char* method : methods) server_.answer(method, Dictionary{{"x", "y"}});
     setValue("AccountUUID", "U");
     const Data data(platform::bytesOf("ABC"));
     const Dictionary criteria = {{"email", Array{"a@b", "c@d"}}};
-    const Value lifetime = Value::real(1'209'600);
-    struct Case {
-        const char* what;
-        std::function<bool(VeltoIDAuthenticationSessionInfo&)> call;
-        Dictionary sent;
-        const char* counter;
-    };
-    const Case cases[] = {
+    const Dictionary certificate = {{"CertificateToken", "t1"}, {"encDsId", "d1"}};
+    const Dictionary breadcrumb = {{"machineUUID", "U"}, {"breadcrumbKey", "k"}};
+    const Dictionary delays = {{"__CERT_FETCH_DELAY_MIN", "5"}, {"__CERT_FETCH_DELAY_MAX", number(10)}};
+    const Dictionary csr = {
+        {"CSR", "pem"}, {"encDsId", "d1"}, {"RequestedCertificateLifetimeInSeconds", Value::real(1'209'600)}};
+    Dictionary delayed = csr;
+    delayed.set("__CERT_FETCH_DELAY_MIN", "5");
+    Dictionary withData = breadcrumb;
+    withData.set("ek", "QUJD");
+    using Call = std::function<bool(VeltoIDAuthenticationSessionInfo&)>;
+    const std::tuple<const char*, Call, Dictionary, const char*> cases[] = {
         {"find",
          [&](auto& s) { return __VeltoIDSessionDoFindPerson(s, criteria, {}, nullptr, nullptr); },
          {{"searchCriteria", criteria}},
          "VeltoIDXMLFindPersonCount"},
         {"request",
          [](auto& s) { return __VeltoIDSessionDoSendCSR(s, "d1", "pem", {}, nullptr, nullptr, nullptr); },
-         {{"CSR", "pem"}, {"encDsId", "d1"}, {"RequestedCertificateLifetimeInSeconds", lifetime}},
-         "VeltoIDXMLSendCSRCount"},
+         csr, "VeltoIDXMLSendCSRCount"},
         {"request with delays",
-         [](auto& s) {
-             return __VeltoIDSessionDoSendCSR(
-                 s, "d1", "pem", {{"__CERT_FETCH_DELAY_MIN", "5"}, {"__CERT_FETCH_DELAY_MAX", number(10)}},
-                 nullptr, nullptr, nullptr);
+         [&](auto& s) {
+             return __VeltoIDSessionDoSendCSR(s, "d1", "pem", delays, nullptr, nullptr, nullptr);
          },
-         {{"__CERT_FETCH_DELAY_MIN", "5"},
-          {"CSR", "pem"},
-          {"encDsId", "d1"},
-          {"RequestedCertificateLifetimeInSeconds", lifetime}},
-         "VeltoIDXMLSendCSRCount"},
+         delayed, "VeltoIDXMLSendCSRCount"},
         {"fetch",
          [](auto& s) { return __VeltoIDSessionDoFetchCSRResult(s, "d1", "t1", {}, nullptr, nullptr); },
-         {{"CertificateToken", "t1"}, {"encDsId", "d1"}},
-         "VeltoIDXMLFetchCertCount"},
+         certificate, "VeltoIDXMLFetchCertCount"},
         {"complete",
          [](auto& s) { return __VeltoIDSessionDoCompleteCertificate(s, "d1", "t1", {}, nullptr); },
-         {{"CertificateToken", "t1"}, {"encDsId", "d1"}},
-         "VeltoIDXMLCompleteCertCount"},
-        {"fetch by number",
+         certificate, "VeltoIDXMLCompleteCertCount"},
+        {"by number",
          [](auto& s) {
              return __VeltoIDSessionDoFetchCertificateBySerialNumber(s, "7", {}, nullptr, nullptr);
          },
@@ -243,36 +209,32 @@ TEST_F(Methods, SendWhatTheyAreGiven) {
          {{"SerialNumber", "7"}},
          nullptr},
         {"set breadcrumb",
-         [&](auto& s) { return __VeltoIDSessionDoSetBreadcrumb(s, "k", data, {}, nullptr); },
-         {{"machineUUID", "U"}, {"breadcrumbKey", "k"}, {"ek", "QUJD"}},
+         [&](auto& s) { return __VeltoIDSessionDoSetBreadcrumb(s, "k", data, {}, nullptr); }, withData,
          nullptr},
-        {"get breadcrumb",
-         [](auto& s) { return !__VeltoIDSessionDoCopyBreadcrumb(s, "k", {}, nullptr); },
-         {{"machineUUID", "U"}, {"breadcrumbKey", "k"}},
-         nullptr},
+        {"get breadcrumb", [](auto& s) { return !__VeltoIDSessionDoCopyBreadcrumb(s, "k", {}, nullptr); },
+         breadcrumb, nullptr},
     };
-    for (const Case& each : cases) {
-        const auto counted = [&] { return each.counter != nullptr ? count(each.counter) : 0; };
+    for (const auto& [what, call, sent, counter] : cases) {
+        SCOPED_TRACE(what);
+        const auto counted = [&] { return counter != nullptr ? count(counter) : 0; };
         const int64_t before = counted();
         Session working = session();
-        EXPECT_TRUE(each.call(*working)) << each.what;
-        EXPECT_EQ(takeOwnParameters(), each.sent) << each.what;
-        EXPECT_EQ(working->fSessionID, "s1") << each.what << ": not spoiled";
-        EXPECT_EQ(counted(), before + (each.counter != nullptr ? 1 : 0)) << each.what;
+        EXPECT_TRUE(call(*working));
+        EXPECT_EQ(takeOwnParameters(), sent);
+        EXPECT_EQ(working->fSessionID, "s1") << "not spoiled";
+        EXPECT_EQ(counted(), before + (counter != nullptr ? 1 : 0));
     }
     for (const auto& [stored, sent] : {std::pair(number(60), 60.0), std::pair(Value("60"), 1'209'600.0)}) {
         __VeltoIDDBSetMetaInfoValue(nullptr, "VeltoIDMetaDefaultCertificateRequestedLifetime", stored);
-        EXPECT_TRUE(cases[1].call(*session()));
+        EXPECT_TRUE(std::get<Call>(cases[1])(*session()));
         EXPECT_EQ(takeOwnParameters()["RequestedCertificateLifetimeInSeconds"], Value::real(sent));
     }
-    for (const char* method : {"findPerson", "createCert", "fetchCert", "downloadCertComplete", "revokeCert",
-                               "saveBreadcrumbEk", "fetchBreadcrumbEk"})
-        server_.fault(method, -9);
-    for (const Case& each : cases) {
+    for (const char* method : methods) server_.fault(method, -9);
+    for (const auto& [what, call, sent, counter] : cases) {
         Session failing = session();
-        const bool isCopy = std::string_view(each.what) == "get breadcrumb";
-        EXPECT_EQ(each.call(*failing), isCopy) << each.what;
-        EXPECT_EQ(failing->fSessionID, String()) << each.what << ": spoiled";
+        const bool isCopy = std::string_view(what) == "get breadcrumb";
+        EXPECT_EQ(call(*failing), isCopy) << what;
+        EXPECT_EQ(failing->fSessionID, String()) << what << ": spoiled";
     }
 }
 

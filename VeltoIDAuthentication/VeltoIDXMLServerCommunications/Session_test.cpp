@@ -8,16 +8,8 @@
 namespace veltoid {
 namespace {
 
-constexpr const char* kURL = "https://server.example/rpc";
-
 class SessionTest : public ServerTest {
   protected:
-    Session session(double age = 0, double validity = 100, const String& encDsId = "d1",
-                    const String& id = "s") const {
-        return Session(new VeltoIDAuthenticationSessionInfo{kName, kPassword, kURL, id, now() - age, validity,
-                                                            encDsId, copySessionQueueForAccount(kName)});
-    }
-
     static std::string takeID() {
         const IdleSession taken = takeCachedSession(kName, kPassword, kURL);
         return taken ? taken->fSessionID.text() : "none";
@@ -32,14 +24,7 @@ TEST_F(SessionTest, EachAccountHasOneQueue) {
 }
 
 TEST_F(SessionTest, IsKeptWhileTheServerLetsItBeReused) {
-    struct Case {
-        const char* what;
-        double age;
-        double validity;
-        const char* encDsId;
-        bool isKept;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, double, double, String, bool> cases[] = {
         {"new", 0, 100, "d", true},
         {"at the last moment", 99.5, 100, "d", true},
         {"over", 100, 100, "d", false},
@@ -48,28 +33,27 @@ TEST_F(SessionTest, IsKeptWhileTheServerLetsItBeReused) {
         {"without encDsId", 0, 100, nullptr, false},
         {"spoiled", now(), 1e12, "d", false},
     };
-    for (const Case& each : cases) {
-        (void)session(each.age, each.validity, each.encDsId ? String(each.encDsId) : String());
-        EXPECT_EQ(takeID(), each.isKept ? "s" : "none") << each.what;
-        EXPECT_EQ(takeID(), "none") << each.what;
+    for (const auto& [what, age, validity, encDsId, isKept] : cases) {
+        (void)session(encDsId, age, validity);
+        EXPECT_EQ(takeID(), isKept ? "s1" : "none") << what;
+        EXPECT_EQ(takeID(), "none") << what;
     }
 }
 
 TEST_F(SessionTest, IsFoundByAccountPasswordAndServer) {
     (void)session();
-    EXPECT_EQ(takeCachedSession("other", kPassword, kURL), nullptr);
-    EXPECT_EQ(takeCachedSession(kName, "other", kURL), nullptr);
-    EXPECT_EQ(takeCachedSession(kName, kPassword, "other"), nullptr);
-    EXPECT_EQ(takeCachedSession(nullptr, kPassword, kURL), nullptr);
-    EXPECT_EQ(takeCachedSession(kName, nullptr, kURL), nullptr);
-    EXPECT_EQ(takeCachedSession(kName, kPassword, nullptr), nullptr);
-    EXPECT_EQ(takeID(), "s");
+    for (const String& wrong : {String("other"), String()}) {
+        EXPECT_EQ(takeCachedSession(wrong, kPassword, kURL), nullptr);
+        EXPECT_EQ(takeCachedSession(kName, wrong, kURL), nullptr);
+        EXPECT_EQ(takeCachedSession(kName, kPassword, wrong), nullptr);
+    }
+    EXPECT_EQ(takeID(), "s1");
 }
 
 TEST_F(SessionTest, TheOldestThatIsStillValidComesFirst) {
-    (void)session(0, 10, "d", "short");
-    (void)session(0, 100, "d", "first");
-    (void)session(0, 100, "d", "second");
+    (void)session("d", 0, 10, "short");
+    (void)session("d", 0, 100, "first");
+    (void)session("d", 0, 100, "second");
     clock_.advanceBy(20);
     IdleSession first = takeCachedSession(kName, kPassword, kURL);
     ASSERT_NE(first, nullptr);
@@ -104,15 +88,15 @@ TEST_F(SessionTest, TheServerIsToldMoreWhenItHasAskedForIt) {
         return std::string(parameters.contains("MetaInformation") ? "meta " : "") +
                (parameters.contains("AccountInformation") ? "account" : "");
     };
-    EXPECT_EQ(told({{kAccountSwitch, flag(true)}}), "") << "there is no account";
+    EXPECT_EQ(told({{kAccountSwitch, kOn}}), "") << "there is no account";
     createAccount();
     EXPECT_EQ(told(), "");
     EXPECT_EQ(told({{kAccountSwitch, number(1)}, {kMetaSwitch, "true"}}), "") << "only Booleans count";
-    EXPECT_EQ(told({{kAccountSwitch, flag(true)}, {kMetaSwitch, flag(true)}}), "meta account");
-    __VeltoIDDBSetMetaInfoValue(nullptr, kMetaSwitch, flag(true));
+    EXPECT_EQ(told({{kAccountSwitch, kOn}, {kMetaSwitch, kOn}}), "meta account");
+    __VeltoIDDBSetMetaInfoValue(nullptr, kMetaSwitch, kOn);
     EXPECT_EQ(told(), "meta ");
-    __VeltoIDDBSetMetaInfoValue(kName, kMetaSwitch, flag(false));
-    __VeltoIDDBSetMetaInfoValue(kName, kAccountSwitch, flag(true));
+    __VeltoIDDBSetMetaInfoValue(kName, kMetaSwitch, kOff);
+    __VeltoIDDBSetMetaInfoValue(kName, kAccountSwitch, kOn);
     EXPECT_EQ(told(), "account") << "the account's own switch comes first";
     EXPECT_EQ(createCallParameters(kName, nullptr, {})["AccountInformation"], Value(record()));
 }
@@ -128,7 +112,7 @@ class CommandsTest : public SessionTest {
     /// The session after a call that got this reply.
     Session after(const Dictionary& reply) {
         server_.answer("m", reply);
-        Session called = session(0, 7);
+        Session called = session("d1", 0, 7);
         std::optional<Dictionary> result;
         EXPECT_TRUE(xmlInvoke(*called, std::string(kVeltoIDMethodPrefix) + "m", {}, &result, nullptr));
         EXPECT_TRUE(result.has_value());
@@ -139,28 +123,22 @@ class CommandsTest : public SessionTest {
 };
 
 TEST_F(CommandsTest, ValidityOfTheSession) {
-    struct Case {
-        Value given;
-        double validity;
-    };
-    const Case cases[] = {
-        {number(60), 60},
-        {Value::real(1.5), 1.5},
-        {number(0), 0},
-        {number(-60), 0},
-        {"90", 90},
-        {"2.5", 2.5},
-        {"-5", 0},
-        {"inf", 0},
-        {"none", 0},
-        {flag(true), 7},
-        {Array{number(1)}, 7},
-        {date(), 7},
-        {{}, 7},
-    };
-    for (const Case& each : cases)
-        EXPECT_EQ(after({{"dsSessionValidityDuration", each.given}})->fValidityDuration, each.validity)
-            << testing::PrintToString(each.given);
+    const std::pair<Value, double> cases[] = {{number(60), 60},
+                                              {Value::real(1.5), 1.5},
+                                              {number(0), 0},
+                                              {number(-60), 0},
+                                              {"90", 90},
+                                              {"2.5", 2.5},
+                                              {"-5", 0},
+                                              {"inf", 0},
+                                              {"none", 0},
+                                              {kOn, 7},
+                                              {Array{number(1)}, 7},
+                                              {date(), 7},
+                                              {{}, 7}};
+    for (const auto& [given, validity] : cases)
+        EXPECT_EQ(after({{"dsSessionValidityDuration", given}})->fValidityDuration, validity)
+            << testing::PrintToString(given);
 }
 
 TEST_F(CommandsTest, MetaAndAccountInformationAreStored) {
@@ -180,26 +158,25 @@ TEST_F(CommandsTest, MetaAndAccountInformationAreStored) {
 }
 
 TEST_F(CommandsTest, ARelaunchIsScheduled) {
-    for (const Value& none : {Value(), number(0), number(-5), Value("3600"), Value::real(0.5), flag(true)})
+    for (const Value& none : {Value(), number(0), number(-5), Value("3600"), Value::real(0.5), kOn})
         after({{"NextLaunchTimeInterval", none}});
     EXPECT_TRUE(relaunches_.empty());
     EXPECT_FALSE(log_.contains("NextLaunchTimeInterval"));
     for (const Value& some : {number(1), number(3600), Value::real(60)})
         after({{"NextLaunchTimeInterval", some}});
     EXPECT_EQ(relaunches_, (std::vector<double>{1, 3600, 60}));
-    EXPECT_EQ(
-        log_.count("Received 'NextLaunchTimeInterval' == 3600 from server, so setting NextLaunchDate to "),
-        1);
+    const char* line = "Received 'NextLaunchTimeInterval' == 3600 from server, so setting NextLaunchDate to ";
+    EXPECT_EQ(log_.count(line), 1);
 }
 
 TEST_F(CommandsTest, FlushAndExitEndsTheProcessWithEverythingWritten) {
     platform::ChildProcess process([this] {
-        after({{"MetaInformation", Dictionary{{"X", "last words"}}}, {"FlushAndExit", flag(true)}});
+        after({{"MetaInformation", Dictionary{{"X", "last words"}}}, {"FlushAndExit", kOn}});
         return false;
     });
     EXPECT_TRUE(process.succeeded());
     EXPECT_EQ(meta("X"), Value("last words"));
-    after({{"FlushAndExit", flag(false)}});
+    after({{"FlushAndExit", kOff}});
     after({{"FlushAndExit", number(1)}});
 }
 
@@ -207,62 +184,58 @@ TEST_F(CommandsTest, FlushAndExitEndsTheProcessWithEverythingWritten) {
 
 TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
     const Error transport{"transport", 7, {}};
-    struct Case {
-        const char* what;
-        std::optional<Error> error;
-        std::optional<Dictionary> response;
-        int64_t code;
-        const char* reason;
-        bool removesPassword;
-        std::set<std::string> userInfo;
-    };
     const auto faultOf = [](int64_t code) { return Error{kXMLErrorDomain, code, {}}; };
     const Error sameCodeElsewhere{kIdentityErrorDomain, -20101, {}};
-    const std::set<std::string> place = {"function", "file", "line"};
-    const auto with = [&](std::set<std::string> keys) {
-        keys.insert(place.begin(), place.end());
+    const auto with = [](std::set<std::string> keys) {
+        keys.insert({"function", "file", "line"});
         return keys;
     };
     const std::string kReason(kErrorFailureReasonKey);
     const std::string kText(kErrorDescriptionKey);
     const std::string kCause(kErrorUnderlyingErrorKey);
+    constexpr const char* kCode = "XMLFaultCode";
+    constexpr const char* kResponse = "XMLResponse";
+    const Dictionary some;
     constexpr const char* kDisabled = "This Velto ID has been disabled for security reasons.";
     constexpr const char* kIncorrect = "The Velto ID account or password are incorrect.";
-    const Case cases[] = {
-        {"account", faultOf(-20101), {}, -101, kIncorrect, true, with({kReason, kCause, "XMLFaultCode"})},
-        {"password", faultOf(-20283), Dictionary(), -101, kIncorrect, true,
-         with({kReason, kCause, "XMLFaultCode", "XMLResponse"})},
-        {"disabled",
-         faultOf(-20209),
-         {},
-         -102,
-         kDisabled,
-         true,
-         with({kReason, kText, kCause, "XMLFaultCode"})},
-        {"another fault", faultOf(-4164), {}, -100, nullptr, false, with({kCause, "XMLFaultCode"})},
+    const struct {
+        const char* what;
+        std::optional<Error> given;
+        std::optional<Dictionary> response;
+        int64_t code;
+        const char* reason;
+        bool removesPassword;
+        std::set<std::string> userInfo;
+    } cases[] = {
+        {"account", faultOf(-20101), {}, -101, kIncorrect, true, with({kReason, kCause, kCode})},
+        {"password", faultOf(-20283), some, -101, kIncorrect, true,
+         with({kReason, kCause, kCode, kResponse})},
+        {"disabled", faultOf(-20209), {}, -102, kDisabled, true, with({kReason, kText, kCause, kCode})},
+        {"another fault", faultOf(-4164), {}, -100, nullptr, false, with({kCause, kCode})},
         {"another domain", sameCodeElsewhere, {}, -100, nullptr, false, with({kCause})},
-        {"the transport", transport, Dictionary(), -100, nullptr, false, with({kCause, "XMLResponse"})},
-        {"a response", {}, Dictionary(), -100, nullptr, false, with({"XMLResponse"})},
-        {"nothing", {}, {}, -100, nullptr, false, place},
+        {"the transport", transport, some, -100, nullptr, false, with({kCause, kResponse})},
+        {"a response", {}, some, -100, nullptr, false, with({kResponse})},
+        {"nothing", {}, {}, -100, nullptr, false, with({})},
     };
-    for (const Case& each : cases) {
+    for (const auto& [what, given, response, code, reason, removesPassword, userInfo] : cases) {
+        SCOPED_TRACE(what);
         createAccount();
-        const Error error = copyAndHandleXMLErrorResponse(kName, kPassword, each.response, each.error);
-        EXPECT_EQ(error.domain, kIdentityErrorDomain) << each.what;
-        EXPECT_EQ(error.code, each.code) << each.what;
-        EXPECT_EQ(error.userInfo[kErrorFailureReasonKey], each.reason ? Value(each.reason) : Value())
-            << each.what;
-        EXPECT_EQ(keysOf(error.userInfo), each.userInfo) << each.what;
-        EXPECT_EQ(error.userInfo["function"], Value("copyAndHandleXMLErrorResponse")) << each.what;
-        EXPECT_EQ(error.userInfo[kErrorUnderlyingErrorKey], each.error ? Value(*each.error) : Value())
-            << each.what;
-        EXPECT_EQ(hasPassword(), !each.removesPassword) << each.what;
+        const Error error = copyAndHandleXMLErrorResponse(kName, kPassword, response, given);
+        EXPECT_EQ(error.domain, kIdentityErrorDomain);
+        EXPECT_EQ(error.code, code);
+        EXPECT_EQ(error.userInfo[kErrorFailureReasonKey], reason ? Value(reason) : Value());
+        EXPECT_EQ(keysOf(error.userInfo), userInfo);
+        EXPECT_EQ(error.userInfo["function"], Value("copyAndHandleXMLErrorResponse"));
+        EXPECT_EQ(error.userInfo[kErrorUnderlyingErrorKey], given ? Value(*given) : Value());
+        EXPECT_EQ(hasPassword(), !removesPassword);
     }
+    const auto informationOn = [&](int64_t code) {
+        return copyAndHandleXMLErrorResponse(kName, kPassword, {}, faultOf(code)).userInfo;
+    };
     EXPECT_EQ(
-        copyAndHandleXMLErrorResponse(kName, kPassword, {}, faultOf(-20209)).userInfo[kErrorDescriptionKey],
+        informationOn(-20209)[kText],
         Value("Go to https://account.velto.example for information on how to re-enable this Velto ID."));
-    EXPECT_EQ(copyAndHandleXMLErrorResponse(kName, kPassword, {}, faultOf(-1)).userInfo["XMLFaultCode"],
-              number(-1));
+    EXPECT_EQ(informationOn(-1)[kCode], number(-1));
 }
 
 }  // namespace

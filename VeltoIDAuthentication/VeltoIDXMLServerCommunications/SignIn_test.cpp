@@ -1,8 +1,8 @@
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
-#include <thread>
-
 #include "TestSupport/FakeIdentityServer.h"
+#include "TestSupport/SideBySide.h"
+#include "Values/DictionaryAccess.h"
 
 namespace veltoid {
 namespace {
@@ -31,7 +31,12 @@ class SignInTest : public ServerTest {
     /// Signs in anew with this reply; whether it worked does not matter.
     Outcome signInWith(const Dictionary& reply) {
         server_.answer("authenticate", reply);
-        return signIn({{"DoNotUseCachedSession", flag(true)}});
+        return signIn({{"DoNotUseCachedSession", kOn}});
+    }
+
+    /// As that, with the encDsId "d1" besides.
+    Outcome signInTold(const Dictionary& commands) {
+        return signInWith(*mergeDictionaries(commands, Dictionary{{"encDsId", "d1"}}, true));
     }
 
     static std::string counts() {
@@ -71,14 +76,15 @@ TEST_F(SignInTest, ASignInYieldsASession) {
 TEST_F(SignInTest, TellsTheServerWhoIsCalling) {
     __VeltoIDDBSetMetaInfoValue(nullptr, "UserUUID", "U");
     signInWith({{"encDsId", "d1"}});
-    auto calls = server_.take();
+    const auto calls = server_.take();
     ASSERT_EQ(calls.size(), 1U);
     const Dictionary unknown = calls[0].parameters;
-    EXPECT_EQ(unknown["veltoConnect"], Value(kName));
-    EXPECT_EQ(unknown["pwdHash"], Value(kPassword));
-    EXPECT_EQ(unknown["UserUUID"], Value("U"));
-    EXPECT_EQ(unknown["ClientDateTime"], date());
-    EXPECT_FALSE(unknown.contains("dsSession"));
+    for (const auto& [key, value] : {std::pair("veltoConnect", Value(kName)),
+                                     {"pwdHash", kPassword},
+                                     {"UserUUID", "U"},
+                                     {"ClientDateTime", date()},
+                                     {"dsSession", {}}})
+        EXPECT_EQ(unknown[key], value) << key;
 
     createAccount("d1");
     const std::set<std::string> before = keysOf(unknown);
@@ -90,17 +96,15 @@ TEST_F(SignInTest, TellsTheServerWhoIsCalling) {
     };
     const Value uuid = record()["AccountUUID"];
     const Value stable = record()["AccountStableUUID"];
-    EXPECT_EQ(added(),
-              (Dictionary{{"AccountUUID", uuid}, {"machineUUID", uuid}, {"AccountStableUUID", stable}}));
-    setValue("VeltoIDAccountValidationRecordIdentifierKey", "v1");
+    Dictionary expected = {{"AccountUUID", uuid}, {"machineUUID", uuid}, {"AccountStableUUID", stable}};
+    EXPECT_EQ(added(), expected);
+    setValue(kIdentifier, "v1");
     __VeltoIDDBSetCertificateInfo("d1", Dictionary{{"SerialNumber", "7"}});
-    EXPECT_EQ(added(), (Dictionary{{"AccountUUID", uuid},
-                                   {"machineUUID", uuid},
-                                   {"AccountStableUUID", stable},
-                                   {"ClientVIDVRecordIdentifier", "v1"},
-                                   {"CertificateSerialNumber", "7"}}));
+    expected.set("ClientVIDVRecordIdentifier", "v1");
+    expected.set("CertificateSerialNumber", "7");
+    EXPECT_EQ(added(), expected);
     for (const char* key : {"AccountUUID", "AccountStableUUID", "encDsId"}) setValue(key, number(1));
-    setValue("VeltoIDAccountValidationRecordIdentifierKey", number(1));
+    setValue(kIdentifier, number(1));
     __VeltoIDDBSetMetaInfoValue(nullptr, "UserUUID", number(1));
     EXPECT_EQ(added(), Dictionary()) << "values of the wrong kind are not sent";
 }
@@ -109,7 +113,7 @@ TEST_F(SignInTest, TheNearestServerURLIsCalled) {
     createAccount();
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
     const auto called = [&](const Value& option = {}) {
-        signIn({{"ServerURL", option}, {"DoNotUseCachedSession", flag(true)}});
+        signIn({{"ServerURL", option}, {"DoNotUseCachedSession", kOn}});
         const auto calls = server_.take();
         return calls.empty() ? "none" : calls[0].url;
     };
@@ -141,10 +145,10 @@ TEST_F(SignInTest, ReusesASessionWhileItIsValid) {
     EXPECT_EQ(meta("LastConnectAttempt"), date()) << "a reused session counts as a connection";
     EXPECT_EQ(callsOf({{"ServerURL", "https://other.example"}}), 1U);
     EXPECT_EQ(callsOf({}, "another password"), 1U);
-    setValue("ClientTooOld", flag(true));
+    setValue("ClientTooOld", kOn);
     EXPECT_EQ(callsOf({}), 0U) << "the server is not contacted";
     setValue("ClientTooOld", {});
-    EXPECT_EQ(callsOf({{"DoNotUseCachedSession", flag(true)}}), 1U);
+    EXPECT_EQ(callsOf({{"DoNotUseCachedSession", kOn}}), 1U);
     clock_.advanceBy(100);
     EXPECT_EQ(callsOf({}), 1U);
 }
@@ -152,52 +156,44 @@ TEST_F(SignInTest, ReusesASessionWhileItIsValid) {
 TEST_F(SignInTest, TheServerIsLeftAloneWhileItMustBe) {
     createAccount();
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
-    struct Case {
-        const char* what;
-        Value tooOld;
-        Value embargo;
-        int64_t code;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, Value, Value, int64_t> cases[] = {
         {"nothing", {}, {}, 0},
-        {"too old", flag(true), {}, -104},
-        {"not too old", flag(false), {}, 0},
+        {"too old", kOn, {}, -104},
+        {"not too old", kOff, {}, 0},
         {"too old, but no Boolean", number(1), {}, 0},
         {"embargo", {}, date(10), -103},
         {"embargo is over", {}, date(-1), 0},
         {"embargo ends now", {}, date(), 0},
         {"embargo that is no date", {}, "tomorrow", 0},
-        {"both", flag(true), date(10), -104},
+        {"both", kOn, date(10), -104},
     };
-    for (const Case& each : cases) {
-        setValue("ClientTooOld", each.tooOld);
-        setValue("EarliestAllowedConnectionDate", each.embargo);
+    for (const auto& [what, tooOld, embargo, code] : cases) {
+        SCOPED_TRACE(what);
+        setValue("ClientTooOld", tooOld);
+        setValue(kEmbargo, embargo);
         const Outcome outcome = signIn();
-        EXPECT_EQ(outcome.session != nullptr, each.code == 0) << each.what;
-        EXPECT_EQ(outcome.code(), each.code) << each.what;
-        EXPECT_EQ(server_.take().size(), each.code == 0 ? 1U : 0U) << each.what;
+        EXPECT_EQ(outcome.session != nullptr, code == 0);
+        EXPECT_EQ(outcome.code(), code);
+        EXPECT_EQ(server_.take().size(), code == 0 ? 1U : 0U);
         EXPECT_EQ(outcome.error && outcome.error->userInfo[kErrorFailureReasonKey] == kOutOfDate,
-                  each.code == -104)
-            << each.what;
+                  code == -104);
     }
     EXPECT_EQ(counts(), "6 6 0 6 3 ");
     EXPECT_EQ(log_.count("Not connecting to VeltoID authentication server because clientTooOld = true"), 2);
-    EXPECT_EQ(log_.count("there is an earliest-allowed-connection-date set for this account " +
-                         std::string(kName) + ", "),
-              1);
+    const std::string embargo = "there is an earliest-allowed-connection-date set for this account ";
+    EXPECT_EQ(log_.count(embargo + kName + ", "), 1);
     EXPECT_FALSE(log_.contains("Didn't succeed with .authenticate"));
 }
 
 TEST_F(SignInTest, AnEmbargoInTheReplyHoldsForTheNextSignIn) {
     constexpr const char* kBefore = "DoNotConnectBeforeX";
     constexpr const char* kFor = "DoNotConnectForX";
-    struct Case {
+    const struct {
         const char* what;
-        Dictionary reply;
+        Dictionary commands;
         /// Seconds from now.
         std::optional<double> embargo;
-    };
-    const Case cases[] = {
+    } cases[] = {
         {"for some time", {{kFor, Value::int32(600)}}, 600},
         {"for no time", {{kFor, Value::int32(0)}}, {}},
         {"until a date", {{kBefore, date(50)}}, 50},
@@ -208,37 +204,29 @@ TEST_F(SignInTest, AnEmbargoInTheReplyHoldsForTheNextSignIn) {
         {"no date", {{kBefore, "soon"}, {kFor, Value::int32(5)}}, 5},
     };
     createAccount();
-    for (const Case& each : cases) {
-        setValue("EarliestAllowedConnectionDate", {});
-        Dictionary reply = each.reply;
-        reply.set("encDsId", "d1");
-        const Outcome outcome = signInWith(reply);
-        EXPECT_NE(outcome.session, nullptr) << each.what;
-        EXPECT_EQ(outcome.error, std::nullopt) << each.what;
-        EXPECT_EQ(record()["EarliestAllowedConnectionDate"], each.embargo ? date(*each.embargo) : Value())
-            << each.what;
-        EXPECT_EQ(signIn().code(), each.embargo ? -103 : 0) << each.what;
+    for (const auto& [what, commands, embargo] : cases) {
+        SCOPED_TRACE(what);
+        setValue(kEmbargo, {});
+        const Outcome outcome = signInTold(commands);
+        EXPECT_NE(outcome.session, nullptr);
+        EXPECT_EQ(outcome.error, std::nullopt);
+        EXPECT_EQ(record()[kEmbargo], embargo ? date(*embargo) : Value());
+        EXPECT_EQ(signIn().code(), embargo ? -103 : 0);
     }
-    setValue("EarliestAllowedConnectionDate", {});
-    EXPECT_NE(signInWith({{"encDsId", "d1"}, {"ClientTooOld", flag(true)}}).session, nullptr);
-    EXPECT_EQ(record()["ClientTooOld"], flag(true));
+    setValue(kEmbargo, {});
+    EXPECT_NE(signInTold({{"ClientTooOld", kOn}}).session, nullptr);
+    EXPECT_EQ(record()["ClientTooOld"], kOn);
     EXPECT_EQ(signIn().code(), -104);
 }
 
 TEST_F(SignInTest, Failures) {
-    struct Case {
-        const char* what;
-        std::function<void()> prepare;
-        int64_t code;
-        bool keepsPassword;
-    };
     const auto answers = [this](const Value& reply) {
         return [this, reply] { server_.answer("authenticate", reply); };
     };
     const auto faults = [this](int64_t code) {
         return [this, code] { server_.fault("authenticate", code); };
     };
-    const Case cases[] = {
+    const std::tuple<const char*, std::function<void()>, int64_t, bool> cases[] = {
         {"wrong password", faults(-20101), -101, false},
         {"disabled", faults(-20209), -102, false},
         {"another fault", faults(-5), -100, true},
@@ -246,23 +234,24 @@ TEST_F(SignInTest, Failures) {
         {"no encDsId", answers(Dictionary{{"dsSession", "s"}}), -104, true},
         {"an encDsId of the wrong kind", answers(Dictionary{{"encDsId", Value::int32(1)}}), -104, true},
         {"no encDsId under embargo", answers(Dictionary{{"DoNotConnectForX", Value::int32(9)}}), -103, true},
-        {"no encDsId, too old", answers(Dictionary{{"ClientTooOld", flag(true)}}), -103, true},
+        {"no encDsId, too old", answers(Dictionary{{"ClientTooOld", kOn}}), -103, true},
         {"no dictionary", answers("hello"), 1, true},
     };
     int64_t failures = 0;
-    for (const Case& each : cases) {
+    for (const auto& [what, prepare, code, keepsPassword] : cases) {
+        SCOPED_TRACE(what);
         createAccount();
-        setValue("EarliestAllowedConnectionDate", {});
+        setValue(kEmbargo, {});
         setValue("ClientTooOld", {});
-        each.prepare();
+        prepare();
         const Outcome outcome = signIn();
-        EXPECT_EQ(outcome.session, nullptr) << each.what;
-        EXPECT_EQ(outcome.encDsId, String()) << each.what;
-        EXPECT_EQ(outcome.result, std::nullopt) << each.what;
-        EXPECT_EQ(outcome.code(), each.code) << each.what;
-        EXPECT_EQ(outcome.error->domain, kIdentityErrorDomain) << each.what;
-        EXPECT_EQ(hasPassword(), each.keepsPassword) << each.what;
-        EXPECT_EQ(count("VeltoIDMetaUnsuccessfulConnectionCount"), ++failures) << each.what;
+        EXPECT_EQ(outcome.session, nullptr);
+        EXPECT_EQ(outcome.encDsId, String());
+        EXPECT_EQ(outcome.result, std::nullopt);
+        EXPECT_EQ(outcome.code(), code);
+        EXPECT_EQ(outcome.error->domain, kIdentityErrorDomain);
+        EXPECT_EQ(hasPassword(), keepsPassword);
+        EXPECT_EQ(count("VeltoIDMetaUnsuccessfulConnectionCount"), ++failures);
     }
     EXPECT_EQ(counts(), "9 5 0 0 9 ");
     EXPECT_EQ(log_.count("Didn't succeed with .authenticate, and error is "), 9);
@@ -272,13 +261,13 @@ TEST_F(SignInTest, Failures) {
 
 TEST_F(SignInTest, AnotherEncDsIdMakesCertificatesAndRecordVoid) {
     createAccount("old");
-    setValue("VeltoIDAccountValidationRecordIdentifierKey", "v1");
+    setValue(kIdentifier, "v1");
     for (const char* encDsId : {"old", "new"})
         __VeltoIDDBSetCertificateInfo(encDsId,
                                       Dictionary{{"CertStatus", "CERT_ISSUED"}, {"Expires", date(1e6)}});
     signInWith({{"encDsId", "old"}});
     EXPECT_EQ(certificateEntry("old")["CertStatus"], Value("CERT_ISSUED"));
-    EXPECT_TRUE(record().contains("VeltoIDAccountValidationRecordIdentifierKey"));
+    EXPECT_TRUE(record().contains(kIdentifier));
 
     EXPECT_EQ(signInWith({{"encDsId", "new"}}).encDsId, "new");
     EXPECT_EQ(
@@ -289,76 +278,57 @@ TEST_F(SignInTest, AnotherEncDsIdMakesCertificatesAndRecordVoid) {
         EXPECT_EQ(certificateEntry(encDsId)["CertStatus"], Value("CERTIFICATE_INVALID")) << encDsId;
     EXPECT_EQ(certificateEntry("new")["Expires"], date());
     EXPECT_EQ(certificateEntry("old")["Expires"], date(1e6));
-    EXPECT_FALSE(record().contains("VeltoIDAccountValidationRecordIdentifierKey"));
+    EXPECT_FALSE(record().contains(kIdentifier));
 }
 
 TEST_F(SignInTest, TheServersWordOnTheCertificate) {
     constexpr const char* kIsValid = "CertificateIsValid";
     constexpr const char* kIsNotValid = "CertificateNoLongerValid";
-    struct Case {
-        const char* what;
-        Dictionary reply;
-        bool isValidated;
-        bool isInvalid;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, Dictionary, bool, bool> cases[] = {
         {"no word", {}, false, false},
-        {"valid", {{kIsValid, flag(true)}}, true, false},
-        {"valid anyway", {{kIsValid, flag(true)}, {kIsNotValid, "x"}}, true, false},
-        {"not valid", {{kIsValid, flag(false)}}, false, true},
+        {"valid", {{kIsValid, kOn}}, true, false},
+        {"valid anyway", {{kIsValid, kOn}, {kIsNotValid, "x"}}, true, false},
+        {"not valid", {{kIsValid, kOff}}, false, true},
         {"valid in the wrong kind", {{kIsValid, "true"}}, false, true},
-        {"no longer valid", {{kIsNotValid, flag(false)}}, false, true},
+        {"no longer valid", {{kIsNotValid, kOff}}, false, true},
     };
     createAccount("d1");
-    for (const Case& each : cases) {
+    for (const auto& [what, commands, isValidated, isInvalid] : cases) {
+        SCOPED_TRACE(what);
         __VeltoIDDBRemoveCertificateInfo("d1");
         __VeltoIDDBSetCertificateInfo("d1",
                                       Dictionary{{"CertStatus", "CERT_ISSUED"}, {"Expires", date(1e6)}});
-        Dictionary reply = each.reply;
-        reply.set("encDsId", "d1");
-        signInWith(reply);
+        signInTold(commands);
         const Dictionary entry = certificateEntry("d1");
-        EXPECT_EQ(entry["LastSuccessfulValidation"], each.isValidated ? date() : Value()) << each.what;
-        EXPECT_EQ(entry["CertStatus"], Value(each.isInvalid ? "CERTIFICATE_INVALID" : "CERT_ISSUED"))
-            << each.what;
-        EXPECT_EQ(entry["Expires"], each.isInvalid ? date() : date(1e6)) << each.what;
+        EXPECT_EQ(entry["LastSuccessfulValidation"], isValidated ? date() : Value());
+        EXPECT_EQ(entry["CertStatus"], Value(isInvalid ? "CERTIFICATE_INVALID" : "CERT_ISSUED"));
+        EXPECT_EQ(entry["Expires"], isInvalid ? date() : date(1e6));
     }
 }
 
 TEST_F(SignInTest, AnotherValidationRecordIsFetchedAgain) {
-    struct Case {
-        Value stored;
-        Value given;
-        bool isDropped;
-    };
-    const Case cases[] = {{"v1", "v1", false},
-                          {"v1", "v2", true},
-                          {{}, "v2", true},
-                          {"v1", {}, false},
-                          {"v1", Value::int32(5), false}};
+    const std::tuple<Value, Value, bool> cases[] = {{"v1", "v1", false},
+                                                    {"v1", "v2", true},
+                                                    {{}, "v2", true},
+                                                    {"v1", {}, false},
+                                                    {"v1", Value::int32(5), false}};
     createAccount("d1");
-    for (const Case& each : cases) {
-        setValue("VeltoIDAccountValidationRecordIdentifierKey", each.stored);
-        setValue("VeltoIDAccountValidationRecordNextCheckDateKey", date(100));
-        signInWith({{"encDsId", "d1"}, {"VeltoIDRecordIdentifier", each.given}});
-        EXPECT_EQ(record()["VeltoIDAccountValidationRecordIdentifierKey"],
-                  each.isDropped ? Value() : each.stored);
-        EXPECT_EQ(record().contains("VeltoIDAccountValidationRecordNextCheckDateKey"), !each.isDropped)
-            << testing::PrintToString(each.stored) << testing::PrintToString(each.given);
+    for (const auto& [stored, given, isDropped] : cases) {
+        setValue(kIdentifier, stored);
+        setValue(kNextCheck, date(100));
+        signInWith({{"encDsId", "d1"}, {"VeltoIDRecordIdentifier", given}});
+        EXPECT_EQ(record()[kIdentifier], isDropped ? Value() : stored);
+        EXPECT_EQ(record().contains(kNextCheck), !isDropped)
+            << testing::PrintToString(stored) << testing::PrintToString(given);
     }
 }
 
 TEST_F(SignInTest, SignInsOfOneAccountDoNotOverlapAndThoseOfOthersDo) {
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"dsSessionValidityDuration", number(100)}});
-    std::vector<std::thread> threads;
-    for (int i = 0; i < 6; ++i) {
-        threads.emplace_back([i] {
-            const String name = i % 2 == 0 ? "even" : "odd";
-            for (int round = 0; round < 10; ++round)
-                (void)__VeltoIDSessionDoCreateSession(name, kPassword, {});
-        });
-    }
-    for (std::thread& thread : threads) thread.join();
+    platform::sideBySide(6, [](int i) {
+        const String name = i % 2 == 0 ? "even" : "odd";
+        for (int round = 0; round < 10; ++round) (void)__VeltoIDSessionDoCreateSession(name, kPassword, {});
+    });
     for (const char* name : {"even", "odd"}) {
         const auto counted = [&](const char* key) { return meta(key, name).asInt64().value_or(0); };
         EXPECT_EQ(counted("VeltoIDXMLAuthenticateCount") + counted("VeltoIDXMLSessionReusedCount"), 30)

@@ -5,6 +5,7 @@
 #include "TestSupport/FakeHTTPSession.h"
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/SimulatedClock.h"
+#include "TestSupport/XMLRPCDocuments.h"
 #include "XMLRPC/XMLRPCConnectionManager.h"
 
 namespace veltoid {
@@ -13,21 +14,13 @@ namespace {
 using platform::FakeHTTPAnswer;
 using platform::HTTPError;
 
-const std::string kDocument =
-    "<methodResponse><params><param><value>x</value></param></params></methodResponse>";
-const std::string kFault = "<methodResponse><fault><value>x</value></fault></methodResponse>";
+const std::string kDocument = document("<value>x</value>");
+const std::string kFault = faultDocument("<value>x</value>");
 
-FakeHTTPAnswer answer(int status, const std::string& body = {},
-                      std::optional<HTTPError> error = std::nullopt) {
-    FakeHTTPAnswer result;
-    result.status = status;
-    result.body = body;
-    result.error = std::move(error);
-    return result;
-}
+const HTTPError kCut = {18, "cut"};
 
-Error transportError(int64_t code, const char* text) {
-    return {kTransportErrorDomain, code, {{kErrorDescriptionKey, text}}};
+Error transportError(const HTTPError& error) {
+    return {kTransportErrorDomain, error.code, {{kErrorDescriptionKey, error.description}}};
 }
 
 std::shared_ptr<XMLRPCRequest> someRequest() {
@@ -38,38 +31,27 @@ std::shared_ptr<XMLRPCRequest> someRequest() {
 }
 
 TEST(SynchronousSend, AResponseIsABodyOfAGoodStatus) {
-    struct Case {
-        const char* what;
-        FakeHTTPAnswer answer;
-        bool isResponse;
-        Value object;
-        std::optional<Error> error;
+    const HTTPError refused = {7, "refused"};
+    const std::tuple<const char*, FakeHTTPAnswer, bool, Value, std::optional<Error>> cases[] = {
+        {"200", {200, kDocument}, true, "x", {}},
+        {"a body in pieces", {200, kDocument, {}, 7}, true, "x", {}},
+        {"399", {399, kDocument}, true, "x", {}},
+        {"400", {400, kDocument}, false, {}, {}},
+        {"500 with a fault", {500, kFault}, false, {}, {}},
+        {"an empty body", {200}, true, {}, {}},
+        {"no XML", {200, "<html>"}, true, {}, {}},
+        {"no connection", {0, {}, refused}, false, {}, transportError(refused)},
+        {"an end inside the body", {200, kDocument, kCut}, false, {}, transportError(kCut)},
     };
-    FakeHTTPAnswer inPieces = answer(200, kDocument);
-    inPieces.pieceBytes = 7;
-    const Case cases[] = {
-        {"200", answer(200, kDocument), true, "x", {}},
-        {"a body in pieces", inPieces, true, "x", {}},
-        {"399", answer(399, kDocument), true, "x", {}},
-        {"400", answer(400, kDocument), false, {}, {}},
-        {"500 with a fault", answer(500, kFault), false, {}, {}},
-        {"an empty body", answer(200), true, {}, {}},
-        {"no XML", answer(200, "<html>"), true, {}, {}},
-        {"no connection", answer(0, {}, HTTPError{7, "refused"}), false, {}, transportError(7, "refused")},
-        {"an end inside the body",
-         answer(200, kDocument, HTTPError{18, "cut"}),
-         false,
-         {},
-         transportError(18, "cut")},
-    };
-    for (const Case& each : cases) {
+    for (const auto& [what, answer, isResponse, object, expected] : cases) {
+        SCOPED_TRACE(what);
         platform::FakeHTTPTransport transport;
-        transport.enqueue(each.answer);
+        transport.enqueue(answer);
         std::optional<Error> error;
         const auto response = XMLRPCConnection::sendSynchronousXMLRPCRequest(*someRequest(), &error);
-        EXPECT_EQ(response.has_value(), each.isResponse) << each.what;
-        EXPECT_EQ(response ? response->object() : Value(), each.object) << each.what;
-        EXPECT_EQ(error, each.error) << each.what;
+        EXPECT_EQ(response.has_value(), isResponse);
+        EXPECT_EQ(response ? response->object() : Value(), object);
+        EXPECT_EQ(error, expected);
         ASSERT_EQ(transport.requests().size(), 1U);
         EXPECT_EQ(transport.requests()[0].body, someRequest()->body());
         EXPECT_EQ(transport.sessionsCreated(), 1);
@@ -89,9 +71,7 @@ TEST(SynchronousSend, SaysSoWhenThereIsNoClient) {
 class TimedSend : public testing::Test {
   protected:
     void send(double serverDelay) {
-        FakeHTTPAnswer late = answer(200, kDocument);
-        late.delaySeconds = serverDelay;
-        transport_.enqueue(late);
+        transport_.enqueue({.body = kDocument, .delaySeconds = serverDelay});
         caller_.async([this] {
             hasResponse_ =
                 XMLRPCConnection::sendSynchronousXMLRPCRequest(*someRequest(), &error_).has_value();
@@ -189,47 +169,38 @@ class AsynchronousConnection : public testing::Test {
 
 TEST_F(AsynchronousConnection, TellsTheDelegateOfEveryOutcome) {
     using Lines = Recorder::Lines;
-    EXPECT_EQ(linesOf(answer(200, kDocument)), Lines{"response x to m"});
-    EXPECT_EQ(linesOf(answer(200)), Lines{});
-    EXPECT_EQ(linesOf(answer(304, kDocument)), Lines{});
-    EXPECT_EQ(linesOf(answer(404)), Lines{"failure HTTP 404"});
-    EXPECT_EQ(linesOf(answer(500, kDocument)), (Lines{"failure HTTP 500", "response x to m"}));
-    EXPECT_EQ(linesOf(answer(200, kDocument, HTTPError{18, "cut"})),
-              Lines{"failure HWTransportErrorDomain 18"});
+    EXPECT_EQ(linesOf({200, kDocument}), Lines{"response x to m"});
+    EXPECT_EQ(linesOf({200}), Lines{});
+    EXPECT_EQ(linesOf({304, kDocument}), Lines{});
+    EXPECT_EQ(linesOf({404}), Lines{"failure HTTP 404"});
+    EXPECT_EQ(linesOf({500, kDocument}), (Lines{"failure HTTP 500", "response x to m"}));
+    EXPECT_EQ(linesOf({200, kDocument, kCut}), Lines{"failure HWTransportErrorDomain 18"});
     EXPECT_TRUE(log_.contains(", failed with the following error: cut"));
-    FakeHTTPAnswer slow = answer(200, kDocument);
-    slow.progress = {{1, 4}, {4, 4}};
-    EXPECT_EQ(linesOf(slow), (Lines{"sent 0.250000", "sent 1.000000", "response x to m"}));
+    EXPECT_EQ(linesOf({.body = kDocument, .progress = {{1, 4}, {4, 4}}}),
+              (Lines{"sent 0.250000", "sent 1.000000", "response x to m"}));
 }
 
 TEST_F(AsynchronousConnection, HandsChallengesToADelegateThatTakesThem) {
     using platform::ChallengeAnswer;
-    struct Case {
-        std::optional<bool> canAuthenticate;
-        std::optional<ChallengeAnswer> answer;
-        Recorder::Lines lines;
-    };
     const std::string may = "may authenticate at server.example";
     const std::string challenge = "challenge of server.example";
     const std::string refused = "failure HWTransportErrorDomain 42";
-    const Case cases[] = {
+    const std::tuple<std::optional<bool>, std::optional<ChallengeAnswer>, Recorder::Lines> cases[] = {
         {std::nullopt, std::nullopt, {may, challenge, "response x to m"}},
         {true, ChallengeAnswer::PerformDefaultHandling, {may, challenge, "response x to m"}},
         {true, ChallengeAnswer::Cancel, {may, challenge, refused}},
         {false, ChallengeAnswer::Cancel, {may, "response x to m"}},
     };
-    FakeHTTPAnswer challenging = answer(200, kDocument);
-    challenging.challenge = platform::ProtectionSpace{"server.example", 443, "ServerTrust"};
-    for (const Case& each : cases) {
-        recorder_->canAuthenticate = each.canAuthenticate;
-        recorder_->challengeAnswer = each.answer;
-        EXPECT_EQ(linesOf(challenging), each.lines);
+    const platform::ProtectionSpace space = {"server.example", 443, "ServerTrust"};
+    for (const auto& [canAuthenticate, answer, lines] : cases) {
+        recorder_->canAuthenticate = canAuthenticate;
+        recorder_->challengeAnswer = answer;
+        EXPECT_EQ(linesOf({.body = kDocument, .challenge = space}), lines);
     }
 }
 
 TEST_F(AsynchronousConnection, TheManagerHoldsConnectionsUntilTheyAreClosed) {
-    FakeHTTPAnswer never;
-    never.delaySeconds = platform::kForever;
+    const FakeHTTPAnswer never = {.delaySeconds = platform::kForever};
     const String first = spawn(never);
     const String second = spawn(never);
     const String third = spawn(never);

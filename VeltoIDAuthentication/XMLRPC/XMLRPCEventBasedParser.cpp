@@ -8,7 +8,7 @@ namespace {
 /// More than what a string keeps inside itself, where it would not be wiped.
 constexpr size_t kTextCapacity = 64;
 
-constexpr bool holdsText(XMLRPCTag type) { return type > XMLRPCTag::Member; }
+constexpr bool holdsText(XMLRPCElementType type) { return type > XMLRPCElementType::Member; }
 
 /// FNV-1a.
 uint32_t hashOf(std::string_view text) {
@@ -17,36 +17,37 @@ uint32_t hashOf(std::string_view text) {
     return hash;
 }
 
-XMLRPCTag tagNamed(std::string_view name) {
+XMLRPCElementType tagNamed(std::string_view name) {
     // By length first: one comparison decides.
     switch (name.size()) {
         case 2:
-            return name == "i4" ? XMLRPCTag::Integer : XMLRPCTag::Other;
+            return name == "i4" ? XMLRPCElementType::Integer : XMLRPCElementType::Other;
         case 3:
-            return name == "int" ? XMLRPCTag::Integer : XMLRPCTag::Other;
+            return name == "int" ? XMLRPCElementType::Integer : XMLRPCElementType::Other;
         case 4:
-            return name == "name" ? XMLRPCTag::Name : XMLRPCTag::Other;
+            return name == "name" ? XMLRPCElementType::Name : XMLRPCElementType::Other;
         case 5:
-            if (name == "value") return XMLRPCTag::Value;
-            if (name == "array") return XMLRPCTag::Array;
-            return name == "fault" ? XMLRPCTag::Fault : XMLRPCTag::Other;
+            if (name == "value") return XMLRPCElementType::Value;
+            if (name == "array") return XMLRPCElementType::Array;
+            return name == "fault" ? XMLRPCElementType::Fault : XMLRPCElementType::Other;
         case 6:
-            if (name == "member") return XMLRPCTag::Member;
-            if (name == "string") return XMLRPCTag::String;
-            if (name == "struct") return XMLRPCTag::Struct;
-            if (name == "double") return XMLRPCTag::Double;
-            return name == "base64" ? XMLRPCTag::Data : XMLRPCTag::Other;
+            if (name == "member") return XMLRPCElementType::Member;
+            if (name == "string") return XMLRPCElementType::String;
+            if (name == "struct") return XMLRPCElementType::Dictionary;
+            if (name == "double") return XMLRPCElementType::Double;
+            return name == "base64" ? XMLRPCElementType::Data : XMLRPCElementType::Other;
         case 7:
-            return name == "boolean" ? XMLRPCTag::Boolean : XMLRPCTag::Other;
+            return name == "boolean" ? XMLRPCElementType::Boolean : XMLRPCElementType::Other;
         case 16:
-            return name == "dateTime.iso8601" ? XMLRPCTag::Date : XMLRPCTag::Other;
+            return name == "dateTime.iso8601" ? XMLRPCElementType::Date : XMLRPCElementType::Other;
         default:
-            return XMLRPCTag::Other;
+            return XMLRPCElementType::Other;
     }
 }
 
-bool isNode(XMLRPCTag tag) {
-    return tag == XMLRPCTag::Value || tag == XMLRPCTag::Member || tag == XMLRPCTag::Name;
+bool isNode(XMLRPCElementType tag) {
+    return tag == XMLRPCElementType::Value || tag == XMLRPCElementType::Member ||
+           tag == XMLRPCElementType::Name;
 }
 
 void addMember(Dictionary& dictionary, const String& key, Value value) {
@@ -60,7 +61,7 @@ void addMember(Dictionary& dictionary, const String& key, Value value) {
 
 }  // namespace
 
-XMLRPCEventBasedParser::Node::Node() { text.reserve(kTextCapacity); }
+XMLRPCEventBasedParserDelegate::XMLRPCEventBasedParserDelegate() { text.reserve(kTextCapacity); }
 
 Value XMLRPCEventBasedParser::parse() {
     if (!myParser.read(*this)) return {};
@@ -68,30 +69,30 @@ Value XMLRPCEventBasedParser::parse() {
 }
 
 void XMLRPCEventBasedParser::startElement(std::string_view name) {
-    const XMLRPCTag tag = tagNamed(name);
-    if (isOpen() ? isNode(tag) : tag == XMLRPCTag::Value && !hasStarted_) {
-        push(tag == XMLRPCTag::Value ? XMLRPCTag::String : tag);
+    const XMLRPCElementType tag = tagNamed(name);
+    if (isOpen() ? isNode(tag) : tag == XMLRPCElementType::Value && !hasStarted_) {
+        push(tag == XMLRPCElementType::Value ? XMLRPCElementType::String : tag);
     } else if (isOpen()) {
-        if (tag <= XMLRPCTag::Data) setType(tag);
-    } else if (tag == XMLRPCTag::Fault && !hasStarted_) {
+        if (tag <= XMLRPCElementType::Data) setType(tag);
+    } else if (tag == XMLRPCElementType::Fault && !hasStarted_) {
         myIsFault = true;
     }
 }
 
-void XMLRPCEventBasedParser::push(XMLRPCTag type) {
+void XMLRPCEventBasedParser::push(XMLRPCElementType type) {
     if (depth_ == kMaxXMLRPCDepth) return abortParsing();
     if (depth_ == nodes_.size()) nodes_.emplace_back();
     Node& node = nodes_[depth_++];
-    node.type = type;
+    node.myElementType = type;
     node.text.clear();
-    node.memberName = nullptr;
-    node.memberValue = Value();
+    node.myElementKey = nullptr;
+    node.myMemberValue = Value();
     hasStarted_ = true;
 }
 
-void XMLRPCEventBasedParser::setType(XMLRPCTag type) {
+void XMLRPCEventBasedParser::setType(XMLRPCElementType type) {
     Node& node = nodes_[depth_ - 1];
-    node.type = type;
+    node.myElementType = type;
     if (holdsText(type)) return;
     node.text.clear();
     node.array = Array();
@@ -108,28 +109,28 @@ void XMLRPCEventBasedParser::endElement(std::string_view name) {
     if (depth_ == 0) {
         result_ = elementValue(node);
     } else {
-        addToParent(node, nodes_[depth_ - 1]);
+        addElementValueToParent(node, nodes_[depth_ - 1]);
     }
 }
 
 Value XMLRPCEventBasedParser::elementValue(Node& node) {
     const auto text = [&] { return xmlrpc::parseString(node.text); };
-    switch (node.type) {
-        case XMLRPCTag::Array:
+    switch (node.myElementType) {
+        case XMLRPCElementType::Array:
             return std::move(node.array);
-        case XMLRPCTag::Struct:
+        case XMLRPCElementType::Dictionary:
             return std::move(node.dictionary);
-        case XMLRPCTag::Member:
-            return node.memberValue.isAbsent() ? empty_ : std::move(node.memberValue);
-        case XMLRPCTag::Integer:
+        case XMLRPCElementType::Member:
+            return node.myMemberValue.isAbsent() ? empty_ : std::move(node.myMemberValue);
+        case XMLRPCElementType::Integer:
             return Value::int32(xmlrpc::parseInteger(text()));
-        case XMLRPCTag::Double:
+        case XMLRPCElementType::Double:
             return Value::real(xmlrpc::parseDouble(text()));
-        case XMLRPCTag::Boolean:
+        case XMLRPCElementType::Boolean:
             return Value::boolean(xmlrpc::parseBoolean(text()));
-        case XMLRPCTag::Date:
+        case XMLRPCElementType::Date:
             return xmlrpc::parseDate(text());
-        case XMLRPCTag::Data:
+        case XMLRPCElementType::Data:
             return xmlrpc::parseData(text());
         default:
             if (const auto trimmed = text(); !trimmed.empty()) return String(trimmed);
@@ -137,15 +138,16 @@ Value XMLRPCEventBasedParser::elementValue(Node& node) {
     }
 }
 
-void XMLRPCEventBasedParser::addToParent(Node& node, Node& parent) {
-    if (parent.type == XMLRPCTag::Array) {
+void XMLRPCEventBasedParser::addElementValueToParent(Node& node, Node& parent) {
+    if (parent.myElementType == XMLRPCElementType::Array) {
         parent.array.append(elementValue(node));
-    } else if (parent.type == XMLRPCTag::Struct) {
-        addMember(parent.dictionary, node.memberName, elementValue(node));
-    } else if (parent.type == XMLRPCTag::Member && node.type == XMLRPCTag::Name) {
-        parent.memberName = sharedName(xmlrpc::parseString(node.text));
-    } else if (parent.type == XMLRPCTag::Member) {
-        parent.memberValue = elementValue(node);
+    } else if (parent.myElementType == XMLRPCElementType::Dictionary) {
+        addMember(parent.dictionary, node.myElementKey, elementValue(node));
+    } else if (parent.myElementType == XMLRPCElementType::Member &&
+               node.myElementType == XMLRPCElementType::Name) {
+        parent.myElementKey = sharedName(xmlrpc::parseString(node.text));
+    } else if (parent.myElementType == XMLRPCElementType::Member) {
+        parent.myMemberValue = elementValue(node);
     }
 }
 

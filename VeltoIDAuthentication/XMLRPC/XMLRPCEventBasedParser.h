@@ -20,9 +20,9 @@ namespace veltoid {
 inline constexpr size_t kMaxXMLRPCDepth = 256;
 
 /// What an element's name means; those up to Data are also what a node can be.
-enum class XMLRPCTag : uint8_t {
+enum class XMLRPCElementType : uint8_t {
     Array,
-    Struct,
+    Dictionary,
     Member,
     Name,
     Integer,
@@ -34,6 +34,19 @@ enum class XMLRPCTag : uint8_t {
     Value,
     Fault,
     Other
+};
+
+/// A node: an element that is open, and what it has been given so far.
+struct XMLRPCEventBasedParserDelegate {
+    XMLRPCEventBasedParserDelegate();
+
+    XMLRPCElementType myElementType = XMLRPCElementType::String;
+    platform::SecretText text;
+    Array array;
+    Dictionary dictionary;
+    /// A Member's name and value.
+    String myElementKey;
+    Value myMemberValue;
 };
 
 /// Used by one thread for one `parse`.
@@ -56,17 +69,7 @@ class XMLRPCEventBasedParser : private platform::XMLEvents {
     bool isFault() const { return myIsFault; }
 
   private:
-    struct Node {
-        Node();
-
-        XMLRPCTag type = XMLRPCTag::String;
-        platform::SecretText text;
-        Array array;
-        Dictionary dictionary;
-        /// A Member's name and value.
-        String memberName;
-        Value memberValue;
-    };
+    using Node = XMLRPCEventBasedParserDelegate;
 
     void startElement(std::string_view name) override;
     void endElement(std::string_view name) override;
@@ -74,10 +77,10 @@ class XMLRPCEventBasedParser : private platform::XMLEvents {
 
     /// Between the start and the end of the root.
     bool isOpen() const { return depth_ > 0; }
-    void push(XMLRPCTag type);
-    void setType(XMLRPCTag type);
+    void push(XMLRPCElementType type);
+    void setType(XMLRPCElementType type);
     Value elementValue(Node& node);
-    void addToParent(Node& node, Node& parent);
+    void addElementValueToParent(Node& node, Node& parent);
     /// The same handle for the same name, as long as no other name took its place.
     String sharedName(std::string_view name);
 

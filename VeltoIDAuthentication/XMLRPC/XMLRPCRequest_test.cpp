@@ -2,10 +2,8 @@
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
-#include <filesystem>
-
 #include "Platform/storage/Preferences.h"
+#include "TestSupport/TemporaryStateDirectory.h"
 
 namespace veltoid {
 namespace {
@@ -64,10 +62,7 @@ TEST(XMLRPCRequest, KeepsMethodAndParameters) {
 }
 
 TEST(XMLRPCRequest, TakesTheUserAgentOfThePreferencesWhenNoneIsSet) {
-    char pattern[] = "/tmp/request-test-XXXXXX";
-    const std::string directory = mkdtemp(pattern);
-    setenv("XDG_STATE_HOME", directory.c_str(), 1);
-
+    const platform::TemporaryStateDirectory directory;
     XMLRPCRequest request("https://server.example/rpc");
     EXPECT_EQ(request.request().headerField("User-Agent"), nullptr);
     const platform::Preferences settings("com.velto.harbwell.veltoidauthagent");
@@ -79,8 +74,6 @@ TEST(XMLRPCRequest, TakesTheUserAgentOfThePreferencesWhenNoneIsSet) {
     EXPECT_EQ(*http.headerField("User-Agent"), "preferred");
     request.setUserAgent("own");
     EXPECT_EQ(*request.request().headerField("User-Agent"), "own");
-
-    std::filesystem::remove_all(directory);
 }
 
 }  // namespace

@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include "TestSupport/XMLRPCDocuments.h"
 #include "XMLRPC/XMLRPCEventBasedParser.h"
 
 namespace veltoid {
@@ -14,34 +15,21 @@ XMLRPCResponse responseOf(std::string_view text) {
     return XMLRPCResponse({bytes.begin(), bytes.end()});
 }
 
-std::string document(const std::string& value) {
-    return "<?xml version='1.0'?><methodResponse><params><param>" + value +
-           "</param></params></methodResponse>";
+std::string date(const std::string& text) {
+    return "<value><dateTime.iso8601>" + text + "</dateTime.iso8601></value>";
 }
 
-std::string member(const std::string& name, const std::string& value) {
-    return "<member><name>" + name + "</name>" + value + "</member>";
-}
+const std::string kOne = "<value><i4>1</i4></value>";
+const std::string kX = "<value>x</value>";
+const Value k1 = Value::int32(1);
+const Dictionary kA1 = {{"a", k1}};
+const Dictionary kB1 = {{"b", k1}};
 
-std::string structure(const std::string& members) {
-    return "<value><struct>" + members + "</struct></value>";
-}
-
-std::string array(const std::string& values) {
-    return "<value><array><data>" + values + "</data></array></value>";
-}
-
-struct Case {
-    const char* what;
-    std::string xml;
-    Value value;
-};
-
-void expectValues(std::initializer_list<Case> cases) {
-    for (const Case& each : cases) {
-        const XMLRPCResponse response = responseOf(document(each.xml));
-        EXPECT_EQ(response.object(), each.value) << each.what;
-        EXPECT_FALSE(response.isFault()) << each.what;
+void expectValues(std::initializer_list<std::tuple<const char*, std::string, Value>> cases) {
+    for (const auto& [what, xml, value] : cases) {
+        const XMLRPCResponse response = responseOf(document(xml));
+        EXPECT_EQ(response.object(), value) << what;
+        EXPECT_FALSE(response.isFault()) << what;
     }
 }
 
@@ -59,9 +47,8 @@ TEST(XMLRPCResponse, ReadsScalarsOfEachType) {
         {"no type", "<value>  padded  </value>", "padded"},
         {"nothing", "<value/>", ""},
         {"nil", "<value><nil/></value>", ""},
-        {"date", "<value><dateTime.iso8601>20260117T01:58:42</dateTime.iso8601></value>",
-         Value::date(1'768'615'122)},
-        {"no date", "<value><dateTime.iso8601>17.01.2026</dateTime.iso8601></value>", Value::null()},
+        {"date", date("20260117T01:58:42"), Value::date(1'768'615'122)},
+        {"no date", date("17.01.2026"), Value::null()},
         {"data", "<value><base64>YWJj\r\nZA==</base64></value>", dataOf("abcd")},
         {"no data", "<value><base64/></value>", dataOf("")},
     });
@@ -69,60 +56,52 @@ TEST(XMLRPCResponse, ReadsScalarsOfEachType) {
 }
 
 TEST(XMLRPCResponse, ReadsArraysAndStructs) {
-    const std::string one = "<value><i4>1</i4></value>";
-    const std::string noDate = "<value><dateTime.iso8601>x</dateTime.iso8601></value>";
+    const std::string noDate = date("x");
+    const std::string named = "<member><name>a</name>";
     expectValues({
         {"an empty array", array(""), Array()},
-        {"an array keeps its order", array("<value>b</value> <value>a</value>" + one),
-         Array{"b", "a", Value::int32(1)}},
+        {"an array keeps its order", array("<value>b</value> <value>a</value>" + kOne), Array{"b", "a", k1}},
         {"data is not needed", "<value><array><value>a</value></array></value>", Array{"a"}},
-        {"an element that is no date", array(noDate + one), Array{Value::null(), Value::int32(1)}},
+        {"an element that is no date", array(noDate + kOne), Array{Value::null(), k1}},
         {"an empty struct", structure(""), Dictionary()},
-        {"members in order", structure(" " + member("b", one) + "\n" + member("a", "<value>x</value>")),
-         Dictionary{{"b", Value::int32(1)}, {"a", "x"}}},
-        {"a name that needs trimming", structure(member(" a&amp;b\n", one)),
-         Dictionary{{"a&b", Value::int32(1)}}},
-        {"the later of two of a name", structure(member("a", "<value>x</value>") + member("a", one)),
-         Dictionary{{"a", Value::int32(1)}}},
-        {"no date removes the name", structure(member("a", one) + member("b", one) + member("a", noDate)),
-         Dictionary{{"b", Value::int32(1)}}},
-        {"a member without value", structure("<member><name>a</name></member>"), Dictionary{{"a", ""}}},
-        {"a member without name", structure("<member>" + one + "</member>" + member("a", one)),
-         Dictionary{{"a", Value::int32(1)}}},
-        {"the name after the value", structure("<member>" + one + "<name>a</name></member>"),
-         Dictionary{{"a", Value::int32(1)}}},
-        {"an empty name", structure(member("", one)), Dictionary{{"", Value::int32(1)}}},
-        {"the last of two values", structure("<member><name>a</name><value>x</value>" + one + "</member>"),
-         Dictionary{{"a", Value::int32(1)}}},
+        {"members in order", structure(" " + member("b", kOne) + "\n" + member("a", kX)),
+         Dictionary{{"b", k1}, {"a", "x"}}},
+        {"a name that needs trimming", structure(member(" a&amp;b\n", kOne)), Dictionary{{"a&b", k1}}},
+        {"the later of two of a name", structure(member("a", kX) + member("a", kOne)), kA1},
+        {"no date removes the name", structure(member("a", kOne) + member("b", kOne) + member("a", noDate)),
+         kB1},
+        {"a member without value", structure(named + "</member>"), Dictionary{{"a", ""}}},
+        {"a member without name", structure("<member>" + kOne + "</member>" + member("a", kOne)), kA1},
+        {"the name after the value", structure("<member>" + kOne + "<name>a</name></member>"), kA1},
+        {"an empty name", structure(member("", kOne)), Dictionary{{"", k1}}},
+        {"the last of two values", structure(named + kX + kOne + "</member>"), kA1},
         {"nesting",
-         structure(member("a", array(structure(member("b", array(one))) + one)) + member("c", one)),
-         Dictionary{{"a", Array{Dictionary{{"b", Array{Value::int32(1)}}}, Value::int32(1)}},
-                    {"c", Value::int32(1)}}},
+         structure(member("a", array(structure(member("b", array(kOne))) + kOne)) + member("c", kOne)),
+         Dictionary{{"a", Array{Dictionary{{"b", Array{k1}}}, k1}}, {"c", k1}}},
     });
 }
 
 TEST(XMLRPCResponse, SurvivesElementsInWrongPlaces) {
-    const std::string one = "<value><i4>1</i4></value>";
+    const std::string named = "<member><name>a</name>";
     expectValues({
         {"unknown elements everywhere", "<x/><value><y><i4><z>1</z>2</i4></y></value>", Value::int32(12)},
         {"the last type counts, all text", "<value>1<string>2</string><i4>3</i4></value>", Value::int32(123)},
-        {"a value in a value", "<value>a" + one + "b</value>", "ab"},
+        {"a value in a value", "<value>a" + kOne + "b</value>", "ab"},
         {"a type after an array", "<value><array><value>x</value></array><i4>7</i4></value>",
          Value::int32(7)},
         {"text around an array", "<value>x<array>y</array>z</value>", Array()},
-        {"a second array", "<value><array>" + one + "</array><array/></value>", Array()},
-        {"a struct after an array", "<value><array>" + one + "</array><struct/></value>", Dictionary()},
-        {"a value in a struct", structure(one), Dictionary()},
+        {"a second array", "<value><array>" + kOne + "</array><array/></value>", Array()},
+        {"a struct after an array", "<value><array>" + kOne + "</array><struct/></value>", Dictionary()},
+        {"a value in a struct", structure(kOne), Dictionary()},
         {"a name in a struct", structure("<name>a</name>"), Dictionary()},
         {"a name in an array", array("<name> a </name>"), Array{"a"}},
-        {"a typed name is a value", structure("<member><name>a</name><name><i4>2</i4></name></member>"),
+        {"a typed name is a value", structure(named + "<name><i4>2</i4></name></member>"),
          Dictionary{{"a", Value::int32(2)}}},
-        {"a typed member", structure("<member><name>a</name><i4>3</i4></member>"),
-         Dictionary{{"a", Value::int32(3)}}},
-        {"a member in an array", array(member("a", one)), Array{Value::int32(1)}},
-        {"only the first value", one + "<value>x</value>", Value::int32(1)},
+        {"a typed member", structure(named + "<i4>3</i4></member>"), Dictionary{{"a", Value::int32(3)}}},
+        {"a member in an array", array(member("a", kOne)), Array{k1}},
+        {"only the first value", kOne + kX, k1},
         {"no value", "<i4>1</i4>", Value()},
-        {"a fault after the value", one + "<fault/>", Value::int32(1)},
+        {"a fault after the value", kOne + "<fault/>", k1},
     });
 }
 
@@ -137,15 +116,13 @@ TEST(XMLRPCResponse, ARepeatedNameIsOneText) {
 TEST(XMLRPCResponse, TellsFaultsApart) {
     const std::string code = member("faultCode", "<value><int>-20101</int></value>");
     const std::string text = member("faultString", "<value><string>x</string></value>");
-    const auto fault = [](const std::string& value) {
-        return responseOf("<methodResponse><fault>" + value + "</fault></methodResponse>");
-    };
+    const auto fault = [](const std::string& value) { return responseOf(faultDocument(value)); };
     const XMLRPCResponse whole = fault(structure(code + text));
     EXPECT_TRUE(whole.isFault());
     EXPECT_EQ(whole.faultCode(), Value::int32(-20101));
     EXPECT_EQ(whole.faultString(), Value("x"));
 
-    const XMLRPCResponse noStruct = fault("<value>x</value>");
+    const XMLRPCResponse noStruct = fault(kX);
     EXPECT_TRUE(noStruct.isFault());
     EXPECT_TRUE(noStruct.faultCode().isAbsent());
 
@@ -156,7 +133,7 @@ TEST(XMLRPCResponse, TellsFaultsApart) {
 }
 
 TEST(XMLRPCResponse, ABrokenDocumentHasNoObject) {
-    const std::string good = document("<value>x</value>");
+    const std::string good = document(kX);
     const std::string bad[] = {
         "",
         "<html><body>Bad gateway<br></body></html>",
