@@ -100,7 +100,7 @@ void XMLRPCEventBasedParser::setType(XMLRPCElementType type) {
 }
 
 void XMLRPCEventBasedParser::characters(std::string_view text) {
-    if (isOpen() && holdsText(nodes_[depth_ - 1].type)) nodes_[depth_ - 1].text.append(text);
+    if (isOpen() && holdsText(nodes_[depth_ - 1].myElementType)) nodes_[depth_ - 1].text.append(text);
 }
 
 void XMLRPCEventBasedParser::endElement(std::string_view name) {
