@@ -65,19 +65,16 @@ bool createsRequest(const String& encDsId, const Dictionary& options) {
     return getBool(&options, option::kForceCertificateCreation, false) || !hasValidCertificateEntry(encDsId);
 }
 
-/// The record as it is stored now; false when it cannot be read.
-bool copyOutcome(const String& accountName, AddedAccount& added, ErrorOut error) {
+/// The account as it is stored now; nothing, with the error, when it cannot be read.
+AddedAccount storedAccount(const String& accountName, ErrorOut error) {
     AccountRecord record;
-    added = {};
-    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return false;
-    added = {record.encDsId(), record.values()};
-    return true;
+    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return {};
+    return {record.encDsId(), record.values()};
 }
 
 AddedAccount readd(const String& accountName) {
     std::optional<Error> copyError;
-    AddedAccount added;
-    copyOutcome(accountName, added, &copyError);
+    AddedAccount added = storedAccount(accountName, &copyError);
     VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Already existing account ", accountName,
                      " re-added; ", (added.encDsId ? "succeeded." : "failed, "), describeError(copyError));
     return added;
@@ -96,10 +93,9 @@ AddedAccount addAnew(const String& accountName, const String& hashedPassword, co
         encDsId = nullptr;
         proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held);
     }
-    AddedAccount added{encDsId, {}};
-    const bool succeeded = proceeds && copyOutcome(accountName, added, &held);
+    AddedAccount added = proceeds ? storedAccount(accountName, &held) : AddedAccount{encDsId, {}};
     VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Adding account ", accountName, " ",
-                     (succeeded ? "succeeded." : "failed, "), describeError(held));
+                     (added.record ? "succeeded." : "failed, "), describeError(held));
     return added;
 }
 
