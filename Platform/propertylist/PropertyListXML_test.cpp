@@ -13,6 +13,9 @@ using namespace std::literals;
 std::string readBack(std::string_view document) { return readBack(bytesOf(document), readXMLPropertyList); }
 
 std::string list(std::string_view content) { return "<plist>" + std::string(content) + "</plist>"; }
+std::string listOf(const std::string& tag, const std::string& content) {
+    return list("<" + tag + ">" + content + "</" + tag + ">");
+}
 
 /// What another program writes for the sample.
 constexpr std::string_view kSampleDocument = R"(<?xml version="1.0" encoding="UTF-8"?>
@@ -124,8 +127,7 @@ TEST(XMLPropertyList, RefusesWhatIsNoList) {
         {"string", {"\x80", "\xC0\xAF", "\xED\xA0\x80", "\x01", "\uFFFF", "&#0;", "]]>", "&b;"}},
     };
     for (const auto& [tag, contents] : scalars)
-        for (const std::string content : contents)
-            documents.push_back(list("<" + tag + ">" + content + "</" + tag + ">"));
+        for (const char* content : contents) documents.push_back(listOf(tag, content));
     for (const std::string& document : documents) {
         EXPECT_EQ(readBack(document), "refused") << document;
         EXPECT_EQ(readBack(bytesOf(document), readPropertyList), "refused") << document;

@@ -15,7 +15,7 @@ namespace {
 std::string readBack(Bytes list) { return readBack(list, readBinaryPropertyList); }
 
 /// An array of the same element.
-ValueWriter repeated(int times, ValueWriter element) {
+ValueWriter repeated(int times, const ValueWriter& element) {
     return [=](ValueSink& sink) {
         sink.beginArray();
         for (int i = 0; i < times; ++i) element(sink);

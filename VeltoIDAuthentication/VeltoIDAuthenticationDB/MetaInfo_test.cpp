@@ -65,12 +65,14 @@ TEST_F(MetaInfoTest, SettingWritesChangesAndNeverSignals) {
     };
     for (const auto& [what, where, value, effects, top, own] : cases) {
         SCOPED_TRACE(what);
-        EXPECT_EQ(effectsOf([&] { EXPECT_TRUE(__VeltoIDDBSetMetaInfoValue(where, "k", value)); }), effects);
-        database::perform([&](const database::Store& store) {
-            EXPECT_EQ(store.metaInfo["k"], top);
-            const Dictionary* section = store.metaInfo.dictionary("s");
-            EXPECT_EQ(section != nullptr ? (*section)["k"] : Value(), own);
-        });
+        const auto set = [&where = where, &value = value] {
+            EXPECT_TRUE(__VeltoIDDBSetMetaInfoValue(where, "k", value));
+        };
+        EXPECT_EQ(effectsOf(set), effects);
+        const Dictionary all = database::perform([](const database::Store& store) { return store.metaInfo; });
+        EXPECT_EQ(all["k"], top);
+        const Dictionary* section = all.dictionary("s");
+        EXPECT_EQ(section != nullptr ? (*section)["k"] : Value(), own);
     }
     EXPECT_FALSE(__VeltoIDDBSetMetaInfoValue("s", nullptr, "v"));
 }

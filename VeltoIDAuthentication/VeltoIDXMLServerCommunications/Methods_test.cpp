@@ -216,7 +216,7 @@ TEST_F(Methods, SendWhatTheyAreGiven) {
     };
     for (const auto& [what, call, sent, counter] : cases) {
         SCOPED_TRACE(what);
-        const auto counted = [&] { return counter != nullptr ? count(counter) : 0; };
+        const auto counted = [key = counter] { return key != nullptr ? count(key) : 0; };
         const int64_t before = counted();
         Session working = session();
         EXPECT_TRUE(call(*working));
