@@ -14,11 +14,8 @@ veltoid::Data dataIn(const Json& dictionary, std::string_view key) {
 void JsonBuilder::data(platform::Bytes bytes) { add(veltoid::xmlrpcBase64Encode(bytes, false).text()); }
 
 void JsonBuilder::date(double seconds) {
-    if (const auto text = platform::calendarText(seconds, platform::kISO8601)) {
-        add(*text);
-    } else {
-        add(seconds);
-    }
+    const auto text = platform::calendarText(seconds, platform::kISO8601);
+    add(text ? Json(*text) : Json(seconds));
 }
 
 void JsonBuilder::add(Json value) {

@@ -141,32 +141,22 @@ class ListReader : public XMLEvents {
         // The list is the outermost element and no other one.
         if (isInside_ == (element == Element::PropertyList)) return false;
         isInside_ = true;
-        switch (element) {
-            case Element::PropertyList:
-                return true;
-            case Element::Array:
-                return shape_.begin(Container::Array) && (sink_.beginArray(), true);
-            case Element::Dictionary:
-                return shape_.begin(Container::Dictionary) && (sink_.beginDictionary(), true);
-            default:
-                leaf_ = element;
-                text_.clear();
-                return true;
-        }
+        if (element == Element::PropertyList) return true;
+        if (element == Element::Array) return shape_.begin(Container::Array) && (sink_.beginArray(), true);
+        if (element == Element::Dictionary)
+            return shape_.begin(Container::Dictionary) && (sink_.beginDictionary(), true);
+        leaf_ = element;
+        text_.clear();
+        return true;
     }
 
     bool end(Element element) {
-        switch (element) {
-            case Element::PropertyList:
-                return true;
-            case Element::Array:
-                return shape_.end(Container::Array) && (sink_.endArray(), true);
-            case Element::Dictionary:
-                return shape_.end(Container::Dictionary) && (sink_.endDictionary(), true);
-            default:
-                leaf_ = Element::None;
-                return endLeaf(element);
-        }
+        if (element == Element::PropertyList) return true;
+        if (element == Element::Array) return shape_.end(Container::Array) && (sink_.endArray(), true);
+        if (element == Element::Dictionary)
+            return shape_.end(Container::Dictionary) && (sink_.endDictionary(), true);
+        leaf_ = Element::None;
+        return endLeaf(element);
     }
 
     bool endLeaf(Element element) {

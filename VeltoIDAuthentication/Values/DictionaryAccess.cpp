@@ -57,6 +57,11 @@ Dictionary copyDictionarySettingValue(const std::optional<Dictionary>& dictionar
     return copy;
 }
 
+void takeEntries(const Dictionary& from, std::span<const TakenEntry> entries, Dictionary& to) {
+    for (const TakenEntry& entry : entries)
+        if (const Value& value = from[entry.key]; value.kind() == entry.kind) to.set(entry.takenAs, value);
+}
+
 bool applyToArray(const Array* array, const std::function<bool(const Value&)>& function) {
     if (array == nullptr || array->empty()) return false;
     const Array held = *array;

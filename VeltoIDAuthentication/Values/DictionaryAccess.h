@@ -27,6 +27,14 @@ std::optional<Dictionary> mergeDictionaries(const std::optional<Dictionary>& bas
 Dictionary copyDictionarySettingValue(const std::optional<Dictionary>& dictionary, const String& key,
                                       const Value& value);
 
+/// What one dictionary takes over from another: an entry of that kind, under another key where one is given.
+struct TakenEntry {
+    std::string_view key;
+    Value::Kind kind;
+    std::string_view takenAs = key;
+};
+void takeEntries(const Dictionary& from, std::span<const TakenEntry> entries, Dictionary& to);
+
 // False for an absent or empty collection, false as soon as the function returns false, true otherwise.
 bool applyToArray(const Array* array, const std::function<bool(const Value&)>& function);
 bool applyToDictionary(const Dictionary* dictionary,

@@ -86,6 +86,12 @@ void fill(Output* out, Output value) {
 
 inline void fillError(ErrorOut out, std::optional<Error> error) { fill(out, std::move(error)); }
 
+/// Hands out the error of a failed operation; false.
+inline bool failWith(ErrorOut out, Error error) {
+    fillError(out, std::move(error));
+    return false;
+}
+
 }  // namespace veltoid
 
 /// An error of kIdentityErrorDomain that names the place where it was made.

@@ -1,7 +1,6 @@
 #include "VeltoIDAuthd/PasswordCheckService.h"
 
 #include "IPCHelpers/Transaction.h"
-#include "Logging/Failure.h"
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"

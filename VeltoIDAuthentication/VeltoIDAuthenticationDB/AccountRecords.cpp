@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
-#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"

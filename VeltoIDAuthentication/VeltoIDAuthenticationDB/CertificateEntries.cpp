@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
-#include "Logging/Failure.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"

@@ -5,7 +5,6 @@
 
 #include "Certificates/ValidationRecord.h"
 #include "Logging/Describe.h"
-#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"
@@ -17,7 +16,6 @@
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
-#include "VeltoIDAuthenticationDB/EntryTable.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"

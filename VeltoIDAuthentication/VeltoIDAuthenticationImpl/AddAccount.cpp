@@ -3,7 +3,6 @@
 #include <algorithm>
 
 #include "Logging/Describe.h"
-#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"

@@ -2,7 +2,6 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
-#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Platform/runtime/Clock.h"

@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 
-#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Platform/bus/Notifications.h"
 #include "Protocol/Names.h"

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <cmath>
 
-#include "Logging/Failure.h"
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
 #include "Platform/runtime/Clock.h"

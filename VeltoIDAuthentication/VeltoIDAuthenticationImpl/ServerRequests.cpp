@@ -1,6 +1,5 @@
 #include "VeltoIDAuthenticationImpl/ServerRequests.h"
 
-#include "Logging/Failure.h"
 #include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"

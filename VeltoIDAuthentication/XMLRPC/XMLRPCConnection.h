@@ -16,6 +16,10 @@ namespace veltoid {
 /// How long a synchronous call waits for the server.
 inline constexpr double kSynchronousTimeoutSeconds = 5.0;
 
+/// Who calls, for platforms whose HTTP sessions carry an identity context. Linux has none: sessions go
+/// without.
+inline constexpr const char* kIdentityContextIdentifier = "com.velto.harbwell.veltoidauthagent";
+
 /// The exchange did not take place; the code is the HTTPS client library's.
 inline constexpr std::string_view kTransportErrorDomain = "HWTransportErrorDomain";
 /// The server answered with a status of 400 or above; the code is the status.

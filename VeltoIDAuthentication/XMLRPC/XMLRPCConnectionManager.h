@@ -16,10 +16,6 @@ class XMLRPCConnectionManager {
     /// The one of this lifetime.
     static XMLRPCConnectionManager& sharedManager();
 
-    XMLRPCConnectionManager() = default;
-    XMLRPCConnectionManager(const XMLRPCConnectionManager&) = delete;
-    XMLRPCConnectionManager& operator=(const XMLRPCConnectionManager&) = delete;
-
     /// Starts an exchange whose outcome goes to the delegate. The identifier of the connection; null when
     /// there is no HTTP session to be had.
     String spawnConnectionWithXMLRPCRequest(std::shared_ptr<XMLRPCRequest> request,

@@ -4,7 +4,6 @@
 #include <limits>
 
 #include "Logging/Describe.h"
-#include "Logging/Failure.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Values/DictionaryAccess.h"
 #include "XMLRPC/XMLRPCConnection.h"
