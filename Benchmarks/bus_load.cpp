@@ -21,11 +21,10 @@
 #include <thread>
 #include <vector>
 
-#include "Platform/bus/BusConnection.h"
+#include "Protocol/Names.h"
 
 namespace {
 
-using namespace platform;
 using Moment = std::chrono::steady_clock::time_point;
 
 constexpr const char* kBus = "org.freedesktop.DBus";
@@ -67,8 +66,8 @@ class Client {
     void ping(const std::string& service) {
         sd_bus_message* request = nullptr;
         sd_bus_message* reply = nullptr;
-        require(sd_bus_message_new_method_call(bus_, &request, service.c_str(), bus::kObjectPath,
-                                               bus::kMessageInterface, "Send"),
+        require(sd_bus_message_new_method_call(bus_, &request, service.c_str(), veltoid::kVeltoIDObjectPath,
+                                               veltoid::kVeltoIDMessageInterface, "Send"),
                 "request");
         require(sd_bus_message_append(request, "a{sv}", 1, "command", "x", int64_t{1}), "request");
         require(sd_bus_call(bus_, request, 0, nullptr, &reply), "call");

@@ -7,11 +7,9 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "Platform/bus/BusConnection.h"
+#include "Protocol/Names.h"
 
 namespace {
-
-using namespace platform;
 
 int handleSend(sd_bus_message* message, void* /*context*/, sd_bus_error* /*error*/) {
     return sd_bus_reply_method_return(message, "a{sv}", 1, "success", "b", 1);
@@ -39,8 +37,8 @@ int main(int argc, char** argv) {
     require(sd_bus_open_user(&bus), "bus");
     // Without its bus it has nothing to do.
     require(sd_bus_set_exit_on_disconnect(bus, 1), "bus");
-    require(sd_bus_add_object_vtable(bus, nullptr, bus::kObjectPath, bus::kMessageInterface, kInterfaceTable,
-                                     nullptr),
+    require(sd_bus_add_object_vtable(bus, nullptr, veltoid::kVeltoIDObjectPath,
+                                     veltoid::kVeltoIDMessageInterface, kInterfaceTable, nullptr),
             "object");
     require(sd_bus_request_name(bus, argv[1], 0), "name");
     require(sd_bus_attach_event(bus, loop, SD_EVENT_PRIORITY_NORMAL), "attaching");
