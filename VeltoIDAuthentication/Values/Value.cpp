@@ -10,8 +10,9 @@ namespace veltoid {
 namespace detail {
 
 BytesNode* BytesNode::create(size_t size) {
+    if (size > std::numeric_limits<uint32_t>::max()) throw std::bad_alloc();
     auto* node = new (::operator new(sizeof(BytesNode) + size)) BytesNode;
-    node->size = size;
+    node->size = static_cast<uint32_t>(size);
     return node;
 }
 

@@ -40,12 +40,14 @@ struct Node {
     }
 };
 
-/// Bytes in one allocation behind their header; wiped when freed.
+/// Bytes in one allocation behind their header, which is small for the sake of many short ones; wiped when
+/// freed.
 struct BytesNode final : Node {
-    size_t size = 0;
+    uint32_t size = 0;
     ~BytesNode() override;
     uint8_t* bytes() { return reinterpret_cast<uint8_t*>(this + 1); }
     const uint8_t* bytes() const { return reinterpret_cast<const uint8_t*>(this + 1); }
+    /// Throws std::bad_alloc.
     static BytesNode* create(size_t size);
     /// Without the size, which is not the header's.
     static void operator delete(void* memory) { ::operator delete(memory); }
@@ -142,7 +144,7 @@ class Data {
     static Data filledBy(size_t size, Fill&& fill) {
         Data result;
         result.node_ = detail::Handle<detail::BytesNode>(detail::BytesNode::create(size));
-        result.node_->size = fill(result.node_->bytes());
+        result.node_->size = static_cast<uint32_t>(fill(result.node_->bytes()));
         return result;
     }
 
