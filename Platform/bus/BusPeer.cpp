@@ -14,8 +14,8 @@ namespace {
 /// what has been read tells which peers have something to say.
 constexpr int kServedAtOnce = 32;
 
-/// So many events of a peer wait for their turn. Further ones are handled at once, so that one peer cannot
-/// fill the memory; they wait in the peer's own queue.
+/// So many events of a peer wait here for their turn. While there are more, each one that comes sends the
+/// oldest to the peer's own queue, out of turn.
 constexpr size_t kMaxWaiting = 16'384;
 
 /// A peer that has more events than this waiting sends ahead of its replies. It rests while more than

@@ -28,7 +28,7 @@ namespace {
 using enum AccountState;
 
 // How long an add that waits for its certificate lets pass between two looks at the account (seconds). The
-// account check, which does the work, makes a pass every five seconds at the most.
+// account check, which does the work, makes at most one pass in five seconds.
 constexpr double kMinWait = 0.25;
 constexpr double kMaxWait = 3;
 

@@ -28,9 +28,9 @@ constexpr const char* kFunction = "checkAccountAndDetermineNextAction";
 constexpr double kValidationPostponement = 3'600;
 
 /// One examination of one account.
-class AccountCheck {
+class Examination {
   public:
-    AccountCheck(const String& accountName, const Dictionary& options)
+    Examination(const String& accountName, const Dictionary& options)
         : accountName_(accountName),
           options_(options),
           networkAllowed_(getBool(&options, option::kCheckNetwork, false)) {}
@@ -226,7 +226,7 @@ class AccountCheck {
 
 AccountState checkAccountAndDetermineNextAction(const String& accountName, const Dictionary& options,
                                                 ErrorOut error) {
-    if (accountName) return AccountCheck(accountName, options).run();
+    if (accountName) return Examination(accountName, options).run();
     fillError(error, VELTOID_ERROR(identity_error::kUnknown));
     return Unknown;
 }

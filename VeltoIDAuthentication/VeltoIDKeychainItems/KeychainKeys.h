@@ -1,4 +1,4 @@
-// Keys in the keychain, as key items named by their persistent references.
+// Keys in the keychain, as key items that are known by their persistent references.
 //
 // Every operation runs synchronously on KeychainDispatchQueue; outputs are set only on success, may be null.
 #pragma once
