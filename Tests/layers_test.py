@@ -30,6 +30,7 @@ INCLUDES = [
     ("a library that is not known", "Platform/net/HTTPSession.cpp", "<boost/asio.hpp>", " is neither"),
     ("the operating system in a room", f"{NEXT_ACTION}.cpp", "<fcntl.h>", " is neither"),
     ("a fake in production", f"{NEXT_ACTION}.cpp", '"TestSupport/FakeLockState.h"', " is part of the tests"),
+    ("a file outside of the tree", f"{NEXT_ACTION}.cpp", '"../../../../../../../../usr/include/zlib.h"', " is not in"),
     ("a file that does not exist", f"{NEXT_ACTION}.cpp", '"Values/Nothing.h"', " is not in the tree"),
 ]
 
@@ -42,7 +43,10 @@ LINES = [
     ("Platform/Attic.h", "#pragma once", "Platform/Attic.h is on no floor"),
     ("Platform/bus/Notifications.cpp", 'static const char* unit = "harbwell.service";', "Platform names the product"),
     ("Platform/crypto/CMakeLists.txt", "veltoid_room(X SOURCES x.cpp DEPENDS Logging Values)", "links Logging"),
+    ("veltoidctl/CMakeLists.txt", "target_link_libraries(veltoidctl PRIVATE XMLRPC)", "links XMLRPC"),
+    ("Platform/xml/Attic.hpp", "#pragma once", "neither .h nor .cpp"),
     ("layers.txt", "floor Basement", "ARCHITECTURE.md: "),
+    ("ARCHITECTURE.md", "floor Basement", "ARCHITECTURE.md: "),
 ]
 
 

@@ -55,10 +55,11 @@ std::string shortcoming(const Json& reply, const Arguments& arguments, const Cli
 }
 
 void printMatch(const Json& match) {
-    printLine(textOf(match.value("matched", Json("match"))), match.value("value", Json("")));
+    printLine(textOf(match.value(message::kMatched, Json("match"))),
+              match.value(message::kMatchedValue, Json("")));
     printEntries(match, {{veltoid::kVeltoIDAccountNameKey, "  account"},
-                         {"firstNm", "  first name"},
-                         {"lastNm", "  last name"},
+                         {message::kPersonFirstName, "  first name"},
+                         {message::kPersonLastName, "  last name"},
                          {veltoid::kVeltoIDAccountDSIDKey, "  encDsId"}});
 }
 

@@ -4,6 +4,7 @@
 #include <iostream>
 
 #include "Protocol/MessageKeys.h"
+#include "Values/Error.h"
 #include "veltoidctl/AgentRequest.h"
 
 namespace veltoidctl {
@@ -28,15 +29,15 @@ std::string withoutControls(std::string text) {
 /// The most telling text of an error, its own or that of the one underneath.
 std::string reasonOf(const Json& error, const std::string& otherwise) {
     const Json information = error.value(message::kErrorUserInfo, Json::object());
-    for (const char* key : {"HWLocalizedFailureReason", "HWLocalizedDescription"})
+    for (const std::string_view key : {veltoid::kErrorFailureReasonKey, veltoid::kErrorDescriptionKey})
         if (information.contains(key)) return textOf(information[key]);
-    if (information.contains("HWUnderlyingError"))
-        return reasonOf(information["HWUnderlyingError"], otherwise);
-    switch (error.value(message::kErrorCode, 0)) {
-        case -103:
+    if (information.contains(veltoid::kErrorUnderlyingErrorKey))
+        return reasonOf(information[veltoid::kErrorUnderlyingErrorKey], otherwise);
+    switch (error.value(message::kErrorCode, int64_t{0})) {
+        case veltoid::identity_error::kServerCannotBeReached:
             return "the server has asked not to be contacted for a while";
-        case -107:
-        case -108:
+        case veltoid::identity_error::kNoAccounts:
+        case veltoid::identity_error::kUnknownAccount:
             return "there is no such account on this device";
         default:
             return otherwise;

@@ -19,7 +19,7 @@ namespace platform::bus {
 namespace {
 
 /// Messages that are read in one go: an iteration of the event loop for each would cost a third of a ping.
-constexpr int kReadAtOnce = 64;
+constexpr int kMaxReadAtOnce = 64;
 
 /// Main thread only.
 struct State {
@@ -28,7 +28,7 @@ struct State {
     bool ended = false;
     std::function<bool()> serve;
     std::vector<std::function<void()>> disconnectHandlers;
-    /// The bus has their addresses.
+    /// The library keeps pointers to them, so they must not move.
     std::list<std::function<void()>> postedHandlers;
     sd_event_source* arrival = nullptr;
     sd_event_source* timeout = nullptr;
@@ -70,7 +70,8 @@ void enable(sd_event_source* source, int whether) {
 /// Sends what waits to be sent, and reads and dispatches what has come.
 void process(State& state) {
     int result = state.ended ? 0 : 1;
-    for (int left = kReadAtOnce; left > 0 && result > 0; --left) result = sd_bus_process(state.bus, nullptr);
+    for (int left = kMaxReadAtOnce; left > 0 && result > 0; --left)
+        result = sd_bus_process(state.bus, nullptr);
     if (result < 0) {
         if (!state.ended) logFailure("reading", result);
         sd_bus_close(state.bus);
@@ -81,7 +82,7 @@ void process(State& state) {
     enable(state.more, state.serve && state.serve() ? SD_EVENT_ON : SD_EVENT_OFF);
 }
 
-/// What every source calls, whatever it tells beside.
+/// The callback of all event sources; their further arguments are not used.
 template <typename... Details>
 int isReady(sd_event_source* /*source*/, Details... /*details*/) noexcept {
     process(shared());
@@ -108,7 +109,7 @@ int watch(State& state) {
     if (result >= 0) result = sd_event_add_time(loop, &state.timeout, CLOCK_MONOTONIC, 0, 0, isReady, &state);
     if (result >= 0) result = sd_event_source_set_enabled(state.timeout, SD_EVENT_OFF);
     if (result >= 0) result = sd_event_add_defer(loop, &state.more, isReady, &state);
-    // It is always pending while it is on, and would go before everything else.
+    // While it is on it is always ready; with the lowest priority it does not starve the others.
     if (result >= 0) result = sd_event_source_set_priority(state.more, SD_EVENT_PRIORITY_IDLE);
     if (result >= 0) result = sd_event_source_set_prepare(state.arrival, prepareWait);
     return result;

@@ -25,8 +25,8 @@ size_t unreadBytes();
 /// Emits Posted(name); nothing happens without a connection that was opened before.
 void emitPosted(const std::string& name);
 
-/// From now on calls `handler` when that name is posted, and once when the bus has begun to tell of it: what
-/// was posted before that is for the handler to find out.
+/// From now on calls `handler` when that name is posted, and once when the subscription holds: what was
+/// posted before is not delivered, so the handler looks for itself.
 void onPosted(const std::string& name, std::function<void()> handler);
 
 /// Hands everything that was sent to the bus.

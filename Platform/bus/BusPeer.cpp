@@ -10,9 +10,9 @@
 namespace platform {
 namespace {
 
-/// Events that are handled between two readings from the bus. These are fewer than are read at once: only
-/// what has been read tells which peers have something to say.
-constexpr int kServedAtOnce = 32;
+/// Events that are handled before the bus is read again. These are fewer than are read at once, since only
+/// reading shows which clients have requests.
+constexpr int kMaxServedAtOnce = 32;
 
 /// So many events of a peer wait here for their turn. While there are more, each one that comes sends the
 /// oldest to the peer's own queue, out of turn.
@@ -56,7 +56,7 @@ BusPeer::Turns& BusPeer::turns() { return Lifetime::current().state<Turns>(); }
 
 bool BusPeer::serveWaiting() {
     Turns& current = turns();
-    for (int left = kServedAtOnce; left > 0 && !current.peers.empty(); --left) {
+    for (int left = kMaxServedAtOnce; left > 0 && !current.peers.empty(); --left) {
         std::shared_ptr<BusPeer> peer = std::move(current.peers.front());
         current.peers.pop_front();
         if (peer->sendsAhead() && bus::unreadBytes() > kMaxUnread) {

@@ -1,6 +1,6 @@
-// A client's connection to one of the services, and whose turn it is when many of them want something: one
-// event of each at a time, so that a client that sends much waits for itself and not everybody for it. Main
-// thread, except that events are handled on the target queue.
+// A client's connection to one of the services, and the turns of clients: one event of each client at a time,
+// so that a client that sends much delays only itself. Main thread, except that events are handled on the
+// target queue.
 #pragma once
 
 #include <sys/types.h>

@@ -39,7 +39,7 @@ constexpr const char* kJobDone = "done";
 
 /// A date that has passed by the time the manager reads it never comes: what is nearer than this (seconds)
 /// is handed over as a delay.
-constexpr double kNearestDate = 5;
+constexpr double kMinTimeToDate = 5;
 constexpr double kMinDelay = 1;
 
 constexpr uint64_t kMicrosecondsPerSecond = 1'000'000;
@@ -78,7 +78,7 @@ int appendTimer(sd_bus_message* call, double date) {
                                      "CollectMode", "s", "inactive-or-failed", schedule..., 0);
     };
     const double left = date - Clock::shared().now();
-    if (left >= kNearestDate)
+    if (left >= kMinTimeToDate)
         return append("TimersCalendar", "a(ss)", 1, "OnCalendar", calendarDate(date).c_str());
     const auto delay = static_cast<uint64_t>(std::max(left, kMinDelay) * kMicrosecondsPerSecond);
     return append("TimersMonotonic", "a(st)", 1, "OnActiveSec", delay);

@@ -6,7 +6,7 @@
 
 namespace platform {
 
-/// Main queue. What a manager need not know has a default: there is none, and the agent stays up.
+/// Main queue. The operations that have a body are optional: it acts as if there were no manager.
 class ServiceManager {
   public:
     virtual ~ServiceManager() = default;

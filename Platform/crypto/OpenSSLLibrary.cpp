@@ -16,7 +16,7 @@ namespace {
 
 constexpr const char* kSoname = "libcrypto.so.3";
 
-// What prepares the library cannot wait for it to be prepared.
+// prepare() itself uses these functions, so they must not call it.
 constinit const LazyLibrary unprepared(kSoname);
 VELTOID_LAZY_FUNCTIONS(unprepared, CRYPTO_set_mem_functions, OPENSSL_init_crypto);
 

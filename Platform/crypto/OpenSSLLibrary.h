@@ -13,9 +13,9 @@ namespace platform::openssl {
 
 extern const LazyLibrary library;
 
-/// Loads and prepares the library, which `library` does by itself: for those who come to it by another way,
-/// being linked with it or through libcurl, before they use it. False (and one log line) when it was in use
-/// already and will not wipe. Any thread.
+/// Loads and prepares the library, as the first use of `library` does. For code that comes to it by another
+/// way (linked with it, or through libcurl), before its first use. False, with one log line, when it was in
+/// use already and will not wipe. Any thread.
 bool prepare();
 
 /// The library's own words for what just failed on the calling thread, whose error queue is empty afterwards.

@@ -12,8 +12,8 @@ constexpr double secondsAt(std::chrono::sys_days day) {
     return static_cast<double>(std::chrono::sys_seconds(day).time_since_epoch().count());
 }
 
-constexpr double kEarliest = secondsAt(std::chrono::year::min() / 1 / 1);
-constexpr double kLatest = secondsAt(std::chrono::year::max() / 12 / 31);
+constexpr double kMinSeconds = secondsAt(std::chrono::year::min() / 1 / 1);
+constexpr double kMaxSeconds = secondsAt(std::chrono::year::max() / 12 / 31);
 
 }  // namespace
 
@@ -35,7 +35,7 @@ std::optional<double> secondsOf(const CalendarDate& date) {
 
 CalendarDate calendarDate(double seconds) {
     using namespace std::chrono;
-    const double known = std::isnan(seconds) ? 0 : std::clamp(seconds, kEarliest, kLatest);
+    const double known = std::isnan(seconds) ? 0 : std::clamp(seconds, kMinSeconds, kMaxSeconds);
     const sys_seconds time{std::chrono::seconds(static_cast<int64_t>(std::floor(known)))};
     const sys_days midnight = floor<days>(time);
     const year_month_day day(midnight);
@@ -46,7 +46,7 @@ CalendarDate calendarDate(double seconds) {
 }
 
 std::optional<std::string> calendarText(double seconds, const char* format) {
-    if (!(seconds >= kEarliest && seconds <= kLatest)) return std::nullopt;
+    if (!(seconds >= kMinSeconds && seconds <= kMaxSeconds)) return std::nullopt;
     const auto time = static_cast<time_t>(std::floor(seconds));
     std::tm fields{};
     gmtime_r(&time, &fields);

@@ -30,7 +30,7 @@ struct Row {
     SecretBytes wrapped;
 };
 
-/// What could not be read is not missing.
+/// Throws when a read has failed: a row that could not be read is not a missing one.
 void requireSound(const SQLiteTransaction& transaction) {
     if (transaction.failed()) throw Failure{kKeychainNotAvailable};
 }
@@ -71,8 +71,8 @@ SecretBytes neededDeviceKey(const SQLiteTransaction& transaction, bool mayCreate
     return std::move(*key);
 }
 
-/// With class keys in the table a missing device key is lost, not yet to be made: another one would not open
-/// them.
+/// If there are class keys, a device key that is missing was lost: a new one could not open them and is not
+/// made.
 void storeUnderDeviceKey(SQLiteTransaction& transaction, ClassKey which, Bytes key) {
     const bool first = !transaction.prepare("SELECT 1 FROM class_keys").step();
     requireSound(transaction);

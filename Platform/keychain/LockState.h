@@ -26,8 +26,8 @@ class LockState {
 /// As the keychain says.
 class KeychainLockState : public LockState {
   public:
-    /// Has `handler` called on the main queue when the keychain may have been unlocked, and once when it has
-    /// begun to listen: what was posted before that is for the handler to find out.
+    /// Has `handler` called on the main queue when the keychain may have been unlocked, and once when the
+    /// subscription holds: what was posted before is not delivered, so the handler looks for itself.
     using Subscribe = std::function<void(std::function<void()> handler)>;
 
     explicit KeychainLockState(Subscribe subscribe = {}) : subscribe_(std::move(subscribe)) {}

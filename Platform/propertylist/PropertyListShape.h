@@ -26,8 +26,8 @@ class Budget {
 
 enum class Container : uint8_t { Array, Dictionary };
 
-/// Follows the events of one value. Each returns whether it may come where it comes; after the first that may
-/// not, none may.
+/// Checks the order of one value's events. Each operation returns whether its event is allowed here; after
+/// the first one that is not, none is.
 class Shape {
   public:
     bool value(size_t payload) { return settle(mayTakeValue() && budget_.spend(payload)) && takeValue(); }

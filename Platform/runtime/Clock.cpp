@@ -24,7 +24,7 @@ namespace {
 constexpr double kNanosecondsPerSecond = 1e9;
 
 /// Timers further away than this are armed for it and looked at again.
-constexpr double kFarthestDeadline = 30.0 * 365 * 86'400;
+constexpr double kMaxDeadline = 30.0 * 365 * 86'400;
 
 double secondsOf(clockid_t clock) {
     timespec time{};
@@ -67,7 +67,7 @@ class RealClock : public Clock {
     TimerID addTimer(double seconds, Use use, std::function<void()> fire) override {
         const std::lock_guard lock(mutex_);
         startThreadOnce();
-        const double deadline = secondsOf(CLOCK_BOOTTIME) + std::clamp(seconds, 0.0, kFarthestDeadline);
+        const double deadline = secondsOf(CLOCK_BOOTTIME) + std::clamp(seconds, 0.0, kMaxDeadline);
         const TimerID id = ++lastID_;
         const auto position = timers_.emplace(std::pair(deadline, id), Timer{use, std::move(fire)}).first;
         if (position == timers_.begin()) wake();
@@ -98,7 +98,7 @@ class RealClock : public Clock {
     /// A timer on the real-time clock that never expires: reading it fails when the clock is set.
     void watchForJump() const {
         itimerspec far{};
-        far.it_value = timespecOf(now() + kFarthestDeadline);
+        far.it_value = timespecOf(now() + kMaxDeadline);
         timerfd_settime(jump_.number(), TFD_TIMER_ABSTIME | TFD_TIMER_CANCEL_ON_SET, &far, nullptr);
     }
 
@@ -163,7 +163,7 @@ Clock& Clock::shared() { return Lifetime::current().part<Clock, RealClock>(); }
 
 Clock::TimerID Clock::callAfter(double seconds, Use use, std::function<void()> fire) {
     const TimerID timer = addTimer(seconds, use, std::move(fire));
-    // One that the end did not find any more.
+    // A timer that was added after lifetimeEnds had ended the others is ended here.
     if (Lifetime::current().isEnding()) endTimers();
     return timer;
 }

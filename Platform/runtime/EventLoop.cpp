@@ -24,7 +24,7 @@ namespace {
 struct Loop {
     sd_event* loop = nullptr;
     FileDescriptor wakeDescriptor;
-    /// The loop has their addresses.
+    /// The loop keeps pointers to them, so they must not move.
     std::list<std::function<void()>> signalHandlers;
 
     ~Loop() { sd_event_unref(loop); }

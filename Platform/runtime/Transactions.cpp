@@ -36,7 +36,7 @@ void timerFired() {
     state.timerArmed = false;
     if (state.open > 0 || !state.whenIdle) return;
     const double now = Clock::shared().now();
-    // Later than now when the date was set back: then it begins again.
+    // In the future if the clock was set back: then the idle time begins again.
     state.idleSince = std::min(state.idleSince, now);
     const double left = state.idleSeconds - (now - state.idleSince);
     if (left > 0) {

@@ -15,9 +15,9 @@ long openCount();
 /// Calls `function` on the main queue as soon as none is open, once; at once (queued) when none is.
 void whenNoneIsOpen(std::function<void()> function);
 
-/// Calls `function` on the main queue, once, when none has been open for `seconds`, counted from the end of
-/// one that ends after this call. One timer at most is armed for it, and none while one is open longer than
-/// that. Replaces an earlier call that has not come to its function.
+/// Calls `function` once on the main queue when no transaction was open for `seconds`, counted from the end
+/// of one that ends after this call. Replaces an earlier function that was not called yet. At most one timer
+/// is armed.
 void whenNoneWasOpenFor(double seconds, std::function<void()> function);
 
 }  // namespace platform::transactions

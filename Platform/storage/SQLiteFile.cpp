@@ -31,8 +31,8 @@ VELTOID_LAZY_FUNCTIONS(library, sqlite3_bind_blob64, sqlite3_bind_int64, sqlite3
                        sqlite3_system_errno, sqlite3_wal_checkpoint_v2);
 
 constexpr int kBusyTimeoutMilliseconds = 5000;
-/// Damage is believed when it is seen twice; then the fresh file, and once more for a file that another
-/// process replaced in between.
+/// Two attempts to be sure of damage, one with the fresh file, and one if another process has replaced the
+/// file meanwhile.
 constexpr int kMaxAttempts = 4;
 /// Pages in the write-ahead log before it is worked off (400 KiB): reading a long one would slow the next
 /// start.
@@ -194,7 +194,7 @@ SQLiteFile::Outcome SQLiteFile::run(const char* begin, const Work& work) {
         if (state == State::Failed) return Outcome::Failed;
         if (state == State::Ready) {
             const Outcome outcome = transact(begin, work);
-            // What went into a file that another process moved aside meanwhile is lost with it: once more.
+            // Another process has moved the file aside, and the changes with it: they are made again.
             if (hasMoved()) {
                 close();
                 continue;

@@ -3,12 +3,12 @@
 #include <algorithm>
 
 #include "Logging/Log.h"
+#include "Protocol/MessageKeys.h"
 #include "Values/LowerCase.h"
 
 namespace veltoid {
 namespace {
 
-constexpr std::string_view kErrorKey = "error";
 constexpr std::string_view kUpperCaseLetters = "ABCDEFGHIJKLMNOPQRSTUVWXYZ";
 
 MessageDictionary* dictionaryOf(const MessageObject& message) {
@@ -51,10 +51,10 @@ String IPCMessage::copyAccountName(std::string_view key) const {
     return lowerCased(name);
 }
 
-void IPCMessage::setError(const Error& error) { setValue(kErrorKey, errorToDictionary(error)); }
+void IPCMessage::setError(const Error& error) { setValue(message::kError, errorToDictionary(error)); }
 
 Error IPCMessage::copyError() const {
-    if (auto error = dictionaryToError(copyValue(kErrorKey))) return *error;
+    if (auto error = dictionaryToError(copyValue(message::kError))) return *error;
     Error communication{kIdentityErrorDomain, identity_error::kAgentCommunicationFailure, {}};
     if (isError()) {
         const String& description = std::get<MessageError>(message_->content).description;

@@ -18,23 +18,23 @@ namespace {
 
 /// Codes of kIdentityErrorDomain.
 constexpr std::pair<int64_t, const char*> kErrorNames[] = {
-    {-100, "kHWIdentityVeltoIDUnknownError"},
-    {-99, "kHWIdentityInvalidParametersErr"},
+    {identity_error::kUnknown, "kHWIdentityVeltoIDUnknownError"},
+    {identity_error::kInvalidParameters, "kHWIdentityInvalidParametersErr"},
     {-10, "kHWIdentityCertificateDoesNotContainRequestedValueErr"},
-    {-11, "kHWIdentityAgentCommunicationFailure"},
-    {-101, "kHWIdentityVeltoIDInvalidAccountOrPasswordErr"},
-    {-102, "kHWIdentityVeltoIDAccountLogonDisabledErr"},
-    {-103, "kHWIdentityVeltoIDServerCannotBeReachedErr"},
-    {-104, "kHWIdentityVeltoIDServerProtocolErr"},
-    {-105, "kHWIdentityVeltoIDServerNoLongerSupportedErr"},
-    {-106, "kHWIdentityVeltoIDNoCertificateForAccountErr"},
-    {-107, "kHWIdentityVeltoIDNoAccounts"},
-    {-108, "kHWIdentityUnknownAccountErr"},
+    {identity_error::kAgentCommunicationFailure, "kHWIdentityAgentCommunicationFailure"},
+    {identity_error::kInvalidAccountOrPassword, "kHWIdentityVeltoIDInvalidAccountOrPasswordErr"},
+    {identity_error::kAccountLogonDisabled, "kHWIdentityVeltoIDAccountLogonDisabledErr"},
+    {identity_error::kServerCannotBeReached, "kHWIdentityVeltoIDServerCannotBeReachedErr"},
+    {identity_error::kServerProtocol, "kHWIdentityVeltoIDServerProtocolErr"},
+    {identity_error::kServerNoLongerSupported, "kHWIdentityVeltoIDServerNoLongerSupportedErr"},
+    {identity_error::kNoCertificateForAccount, "kHWIdentityVeltoIDNoCertificateForAccountErr"},
+    {identity_error::kNoAccounts, "kHWIdentityVeltoIDNoAccounts"},
+    {identity_error::kUnknownAccount, "kHWIdentityUnknownAccountErr"},
     {-110, "kHWIdentityVeltoIDValidationRecordCorruptErr"},
     {-111, "kHWIdentityVeltoIDValidationRecordBadVersionErr"},
     {-112, "kHWIdentityVeltoIDValidationRecordValidAsOfNotCurrentErr"},
     {-113, "kHWIdentityVeltoIDValidationRecordTrustNotEstablishedErr"},
-    {-114, "kHWIdentityUnsupportedFeatureOnThisDeviceErr"},
+    {identity_error::kUnsupportedFeature, "kHWIdentityUnsupportedFeatureOnThisDeviceErr"},
 };
 
 constexpr const char* kTrustResultNames[] = {
@@ -44,7 +44,7 @@ constexpr const char* kTrustResultNames[] = {
     "TrustResultFatalTrustFailure", "TrustResultOtherError",
 };
 
-constexpr double kRelativeWordingLimit = 300;
+constexpr double kMaxRelativeWording = 300;
 
 void append(std::string& text, const Value& value);
 
@@ -103,9 +103,9 @@ void appendDate(std::string& text, double date) {
         text += "now-ish ";
     } else if (distance > 0 && distance <= 1) {
         text += "soon-ish ";
-    } else if (distance > 1 && distance <= kRelativeWordingLimit) {
+    } else if (distance > 1 && distance <= kMaxRelativeWording) {
         text += (std::ostringstream() << distance << " seconds from now, ").str();
-    } else if (distance < -1 && distance >= -kRelativeWordingLimit) {
+    } else if (distance < -1 && distance >= -kMaxRelativeWording) {
         text += std::to_string(std::llround(-distance)) + " seconds ago, ";
     }
 

@@ -55,6 +55,12 @@ inline constexpr Key kCertificatePEM = "CertificatePEM";
 inline constexpr Key kCertificateExpiration = "CertificateExpiration";
 inline constexpr Key kCertificateDate = "CertificateDate";
 
+// A person that was found: the criterion, the value that it matched, and the name.
+inline constexpr Key kMatched = "matched";
+inline constexpr Key kMatchedValue = "value";
+inline constexpr Key kPersonFirstName = "firstNm";
+inline constexpr Key kPersonLastName = "lastNm";
+
 // Certificate information, beside keys of the certificate entry.
 inline constexpr Key kCertificateData = "CertificateData";
 

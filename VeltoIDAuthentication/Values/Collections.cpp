@@ -13,7 +13,7 @@ struct ArrayNode final : Node {
 
 /// Entries in insertion order, with an open-addressing index beside them once a scan would cost more.
 struct DictionaryNode final : Node {
-    static constexpr size_t kScanLimit = 8;
+    static constexpr size_t kMaxScanned = 8;
     static constexpr uint32_t kFree = 0;
     static constexpr size_t kNotFound = std::numeric_limits<size_t>::max();
 
@@ -56,8 +56,8 @@ struct DictionaryNode final : Node {
 
     void rebuildIndex() {
         slots.clear();
-        if (entries.size() <= kScanLimit) return;
-        size_t capacity = 4 * kScanLimit;
+        if (entries.size() <= kMaxScanned) return;
+        size_t capacity = 4 * kMaxScanned;
         while (capacity < entries.size() * 4) capacity *= 2;
         slots.assign(capacity, kFree);
         for (size_t position = 0; position < entries.size(); ++position) occupy(position);

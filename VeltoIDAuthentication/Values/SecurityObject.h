@@ -43,4 +43,7 @@ struct SecurityObject {
     friend bool operator==(const SecurityObject& a, const SecurityObject& b) { return &a == &b; }
 };
 
+inline Value Value::object(SecurityObject object) { return boxed(Kind::Object, std::move(object)); }
+inline const SecurityObject* Value::asObject() const { return unboxed<SecurityObject>(Kind::Object); }
+
 }  // namespace veltoid

@@ -16,6 +16,8 @@ BytesNode* BytesNode::create(size_t size) {
     return node;
 }
 
+void Node::destroy() const noexcept { delete this; }
+
 BytesNode::~BytesNode() { platform::wipe(bytes(), size); }
 
 struct URLText {

@@ -36,8 +36,9 @@ struct Node {
     virtual ~Node() = default;
     void retain() const noexcept { references.fetch_add(1, std::memory_order_relaxed); }
     void release() const noexcept {
-        if (references.fetch_sub(1, std::memory_order_acq_rel) == 1) delete this;
+        if (references.fetch_sub(1, std::memory_order_acq_rel) == 1) destroy();
     }
+    void destroy() const noexcept;
 };
 
 /// Bytes in one allocation behind their header, which is small for the sake of many short ones; wiped when
@@ -56,8 +57,8 @@ struct BytesNode final : Node {
 struct ArrayNode;
 struct DictionaryNode;
 
-/// Content behind one pointer. Its unit alone knows the type: what is not part of this header defines how it
-/// becomes a value itself.
+/// Content of a type that this header does not declare. The source of that type also defines how it becomes a
+/// Value.
 struct BoxNode : Node {
     /// `other` holds content of the same type.
     virtual bool equals(const BoxNode& other) const = 0;
@@ -394,9 +395,9 @@ class Value {
     /// What the value refers to, or null: whatever the kind, it is one pointer.
     const detail::Node* node() const noexcept {
         const detail::Node* node = nullptr;
-        static_assert(sizeof payload_ == sizeof node);
+        static_assert(sizeof payload_ == sizeof(void*));
         if (kind_ >= Kind::String)
-            std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof node);
+            std::memcpy(static_cast<void*>(&node), static_cast<const void*>(&payload_), sizeof payload_);
         return node;
     }
 

@@ -48,7 +48,7 @@ CheckState& state() { return platform::Lifetime::current().state<CheckState>(); 
 
 bool isEnding() { return platform::Lifetime::current().isEnding(); }
 
-/// Accounts that a pass left as due as it found them.
+/// Accounts that were due before a pass and are still due after it.
 class Deferrals {
   public:
     /// When the account is next looked at, if its own date is `date`.
@@ -82,7 +82,7 @@ class Deferrals {
 struct Plan {
     Array accounts;
     std::optional<double> date;
-    /// The accounts' marks are taken: no other pass will find them.
+    /// The accounts were chosen by their marks, which are cleared now: a later pass would not find them.
     bool isForChanged = false;
 };
 

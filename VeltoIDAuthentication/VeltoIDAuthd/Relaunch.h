@@ -15,8 +15,8 @@ enum class RelaunchDate { Replaces, OnlyIfEarlier };
 /// the work is done on the main queue, inside a transaction.
 void scheduleRelaunch(std::optional<double> date, RelaunchDate rule = RelaunchDate::Replaces);
 
-/// The names of the accounts for which an action is foreseen, and the earliest of their dates. Any queue but
-/// the main one's dependants: reads the database.
+/// The names of the accounts for which an action is foreseen, and the earliest of their dates. Not on
+/// the database's queue or the keychain's, which it waits for.
 Array copyAccountsNeedingAction(std::optional<double>* earliestDate);
 
 /// Asks for a relaunch at the earliest next action, if there is one, and makes the database durable.

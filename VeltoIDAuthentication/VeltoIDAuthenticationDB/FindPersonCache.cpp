@@ -15,6 +15,7 @@
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Platform/storage/Preferences.h"
+#include "Protocol/MessageKeys.h"
 #include "Values/ValueStream.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
@@ -23,8 +24,6 @@ namespace {
 
 using platform::Preferences;
 
-constexpr std::string_view kMatched = "matched";
-constexpr std::string_view kMatchedValue = "value";
 constexpr std::string_view kValidDate = "ValidDate";
 constexpr std::string_view kValidInterval = "ValidInterval";
 
@@ -104,8 +103,8 @@ class FindPersonCache {
         for (const Value& result : results) {
             if (!result.isDictionary()) continue;
             Dictionary person = *result.asDictionary();
-            const String matched = person.string(kMatched);
-            const String value = person.string(kMatchedValue);
+            const String matched = person.string(message::kMatched);
+            const String value = person.string(message::kMatchedValue);
             if (!matched || !value) continue;
             person.set(kValidDate, now);
             insert({cacheKey(matched.view(), value.view()), std::move(person)});

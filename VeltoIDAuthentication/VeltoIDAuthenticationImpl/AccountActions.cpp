@@ -45,8 +45,8 @@ void dropLostPassword(const AccountRecord& record) {
                                Value::null());
 }
 
-/// The account is of no use until it is given its password again. One that the server refused is gone
-/// already; a hash of the record's own, without an item in the keychain, is not used.
+/// The account cannot be used until its password is given again. A password that the server refused was
+/// removed before; a hash that the record itself has, without an item in the keychain, goes here.
 void disable(const AccountRecord& record) {
     __VeltoIDDBSetAccountValues(record.accountName(), {{kVeltoIDAccountHashedPasswordKey, Value::null()},
                                                        {kVeltoIDAccountDSIDKey, Value::null()}});

@@ -34,8 +34,8 @@ constexpr std::string_view kOfInformation = kVeltoIDMetaAccountValidationInterva
 constexpr std::string_view kOfCertificate = kVeltoIDMetaCertificateValidationIntervalKey;
 
 using enum DueReason;
-// The certificate is wanted already: so an account whose sign-in keeps failing stays due and is put off for
-// longer and longer, rather than tried every five minutes.
+// Request is among them, so that an account whose sign-in keeps failing stays due and is put off for longer
+// and longer, instead of being tried every five minutes.
 constexpr DueReason kUnknownToServer[] = {Change, SignIn, Request};
 constexpr DueReason kPending[] = {Change, Validation, PendingFetch};
 constexpr DueReason kWithoutCertificate[] = {Change, Validation, Request};

@@ -20,12 +20,12 @@ std::optional<double> finite(std::optional<double> number) {
 }  // namespace
 
 double randomPollingDelay() {
-    constexpr uint32_t kHighest = 0x7FFF'FFFF;
+    constexpr uint32_t kMaxStoredDelay = 0x7FFF'FFFF;
     uint8_t bytes[sizeof(uint32_t)];
     platform::fillRandom(bytes);
     uint32_t number = 0;
     std::memcpy(&number, bytes, sizeof number);
-    return kMaxPollingDelay + kMaxPollingDelay * (number & kHighest) / kHighest;
+    return kMaxPollingDelay + kMaxPollingDelay * (number & kMaxStoredDelay) / kMaxStoredDelay;
 }
 
 double delayAfterPending(double delay) {

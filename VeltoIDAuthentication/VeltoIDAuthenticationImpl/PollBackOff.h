@@ -17,10 +17,11 @@ inline constexpr double kMaxFetchDelay = 604'800;
 /// A random delay between one and two days, so that devices that fail together do not come back together.
 double randomPollingDelay();
 
-/// The delay to note after a wait of `delay`.
+/// The delay to store after a wait of `delay`.
 double delayAfterPending(double delay);
 
-/// The delay to note after one whose fetch ended with a sign-in that failed; never longer than a random one.
+/// The delay to store after a wait of `delay` whose fetch failed at the sign-in; at most
+/// randomPollingDelay().
 double delayAfterFailedSignIn(double delay);
 
 /// The record's "NextCertificateFetchDelta", if that is a finite number.

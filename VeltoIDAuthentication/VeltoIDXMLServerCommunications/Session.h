@@ -51,7 +51,7 @@ struct SessionReleaser {
 /// The engine's handle on a session. It must not end on the session's own queue.
 using Session = std::unique_ptr<VeltoIDAuthenticationSessionInfo, SessionReleaser>;
 
-/// A session without a user: cached, or not signed in yet. It just ends.
+/// A session that no operation uses: cached, or still signing in. Its end does not put it into the cache.
 using IdleSession = std::unique_ptr<VeltoIDAuthenticationSessionInfo>;
 
 /// The account's queue, created on first use and kept. Any thread.
