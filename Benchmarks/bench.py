@@ -137,7 +137,7 @@ def bus_rows(programs: Programs, effort: Effort) -> Iterator[Row]:
             result = medians(output)
             return result[SERVICE], result[MINIMAL]
 
-        yield timing("cold start to first reply", *load("cold", effort.cold_starts), 1.6, " minimal service")
+        yield timing("cold start to first reply", *load("cold", effort.cold_starts), 1.3, " minimal service")
         yield timing("ping, one client", *load("ping", effort.runs, effort.pings), 1.3, " minimal service")
         ours, reference = load("parallel", effort.runs, CLIENTS, effort.parallel_milliseconds)
         yield Row(f"ping, {CLIENTS} clients", f"{ours:,.0f}/s", f"{reference:,.0f}/s minimal service",
