@@ -91,7 +91,7 @@ class CommandLine(unittest.TestCase):
             (["status"], "", 0, "NoCertificate"),
             (["database"], "", 0, "AccessorVersions"),
             (["verify", ACCOUNT, "--password-stdin"], "wrong", 1, "The Velto ID account or password are incorrect."),
-            (["status"], "", 0, "PasswordInvalid"),
+            (["status"], "", 0, "NoCertificate"),
             (["forget", ACCOUNT], "", 0, "is forgotten")])
 
     def test_json_is_the_whole_reply_of_every_command(self):

@@ -86,6 +86,7 @@ void BusPeer::resume() {
 }
 
 void BusPeer::deliver(PeerEvent event) {
+    if (std::holds_alternative<ConnectionError>(event)) *isGone_ = true;
     waiting_.push_back(std::move(event));
     if (!resumed_) return;
     if (waiting_.size() == 1) turns().peers.push_back(shared_from_this());

@@ -5,6 +5,7 @@
 
 #include <sys/types.h>
 
+#include <atomic>
 #include <deque>
 #include <functional>
 #include <memory>
@@ -35,6 +36,9 @@ class BusPeer : public PeerConnection, public std::enable_shared_from_this<BusPe
     /// Has the event handled when its turn has come, after those that were delivered before.
     void deliver(PeerEvent event);
 
+    /// Set when the peer's connection has ended. Any thread.
+    std::shared_ptr<const std::atomic<bool>> isGone() const { return isGone_; }
+
     /// Handles events of the peers that have some; true when others are left that may be handled now.
     static bool serveWaiting();
 
@@ -57,6 +61,7 @@ class BusPeer : public PeerConnection, public std::enable_shared_from_this<BusPe
     std::function<bool(IncomingMessage&)> answeredAtOnce_;
     std::deque<PeerEvent> waiting_;
     bool resumed_ = false;
+    const std::shared_ptr<std::atomic<bool>> isGone_ = std::make_shared<std::atomic<bool>>(false);
     std::shared_ptr<void> watchContext_;
     sd_bus_track* track_ = nullptr;
 };

@@ -68,7 +68,8 @@ Release& release() { return Lifetime::current().state<Release>(); }
 /// Holds a transaction from its arrival on: its handler opens one of its own only when its turn has come.
 class BusRequest : public IncomingMessage {
   public:
-    explicit BusRequest(sd_bus_message* message) : message_(sd_bus_message_ref(message), releaseMessage) {
+    BusRequest(sd_bus_message* message, const BusPeer& sender)
+        : message_(sd_bus_message_ref(message), releaseMessage), isSenderGone_(sender.isGone()) {
         transactions::began();
         ++release().openRequests;
     }
@@ -99,8 +100,11 @@ class BusRequest : public IncomingMessage {
         }
     }
 
+    bool isSenderGone() const override { return *isSenderGone_; }
+
   private:
     MessageHandle message_;
+    const std::shared_ptr<const std::atomic<bool>> isSenderGone_;
     bool replied_ = false;
 };
 
@@ -284,7 +288,7 @@ int handleSend(sd_bus_message* message, void* /*context*/, sd_bus_error* error) 
         if (peer == nullptr)
             return sd_bus_error_set(error, SD_BUS_ERROR_ACCESS_DENIED,
                                     "This service serves its own user only.");
-        peer->deliver(std::make_shared<BusRequest>(message));
+        peer->deliver(std::make_shared<BusRequest>(message, *peer));
         return 1;
     } catch (...) {
         return sd_bus_error_set(error, SD_BUS_ERROR_NO_MEMORY, "The request could not be handled.");

@@ -33,6 +33,9 @@ class IncomingMessage {
     /// Sends the dictionary that `writer` writes as the reply, from any thread; the first reply counts. A
     /// message that is dropped without one leaves its sender waiting until the connection ends.
     virtual void reply(ValueWriter writer) = 0;
+
+    /// Whether the sender's connection has ended since. Any thread.
+    virtual bool isSenderGone() const { return false; }
 };
 
 using PeerEvent = std::variant<ConnectionError, std::shared_ptr<IncomingMessage>>;

@@ -128,6 +128,8 @@ inline constexpr RecordKey kVeltoIDMetaSendServerAccountInformationItemsKey =
 inline constexpr RecordKey kVeltoIDMetaLastConnectAttemptKey = "LastConnectAttempt";
 inline constexpr RecordKey kVeltoIDMetaLastSuccessfulConnectKey = "LastSuccessfulConnect";
 inline constexpr RecordKey kVeltoIDMetaAccountRequiresUserActionKey = "AccountRequiresUserAction";
+/// References to items of the keychain that somebody wanted to keep when their account was forgotten.
+inline constexpr RecordKey kVeltoIDMetaKeptKeychainItemsKey = "KeptKeychainItems";
 
 // Counters of the meta information.
 inline constexpr RecordKey kVeltoIDMetaConnectionAttemptCountKey = "VeltoIDMetaConnectionAttemptCount";

@@ -58,8 +58,10 @@ std::optional<bool> setDatabaseValue(const Request& request) {
 
 bool addAccount(Request& request, ErrorOut error) {
     AddedAccount added;
+    const AddingClient client{wakeAccountCheck, [&] { return !request.isSenderGone() && !isLeaving(); }};
     const bool succeeded = addOnlyAccount(request.account(), request.string(message::kHashedPassword),
-                                          request.options(), wakeAccountCheck, &added, error);
+                                          request.options(), client, &added, error);
+    request.holdUntilFinished(added.decision);
     request.answer(message::kEncDsId, added.encDsId);
     if (added.record) request.answer(message::kAddedAccount, *added.record);
     return succeeded;
@@ -99,8 +101,8 @@ bool listAccounts(Request& request, ErrorOut error) {
 
 bool forgetAccount(Request& request, ErrorOut error) {
     AccountRecord record;
-    const bool succeeded = __VeltoIDDBCopyVeltoIDAccount(request.account(), &record, error) &&
-                           __VeltoIDForgetVeltoID(record.accountName(), request.options(), error);
+    const bool succeeded = __VeltoIDDBCopyVeltoIDAccount(request.account(), nullptr, error) &&
+                           __VeltoIDForgetVeltoID(request.account(), request.options(), error, &record);
     if (succeeded) {
         request.answer(message::kAccount, record.accountName());
         request.answer(message::kForgottenEncDsId, record.encDsId());

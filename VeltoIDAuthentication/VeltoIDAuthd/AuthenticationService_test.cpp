@@ -2,11 +2,15 @@
 #include "VeltoIDAuthd/AuthenticationService.h"
 
 #include <functional>
+#include <mutex>
+#include <tuple>
+#include <vector>
 
 #include "Protocol/Commands.h"
 #include "TestSupport/FakeIdentityServer.h"
 #include "TestSupport/FakeMessage.h"
 #include "TestSupport/FakeNotifications.h"
+#include "TestSupport/SideBySide.h"
 #include "VeltoIDAuthd/AccountStatus.h"
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -158,6 +162,74 @@ TEST_F(ServiceTest, WhatNeedsTheServerFailsWithoutOne) {
     EXPECT_EQ(server_.takeMethods(),
               "authenticate findPerson authenticate saveBreadcrumbEk authenticate fetchBreadcrumbEk");
     EXPECT_EQ(count("VeltoIDFindCount"), 1);
+}
+
+// --- Several clients
+
+/// Notes the replies of adds in the order in which they are sent.
+class AddRequest : public FakeMessage {
+  public:
+    AddRequest(const std::string& name, std::vector<std::pair<std::string, Dictionary>>& replies)
+        : FakeMessage({{"command", number(command::kAdd)}, {"VeltoID", name}, {"hashedpassword", "hash"}}),
+          name_(name),
+          replies_(replies) {}
+
+    void reply(platform::ValueWriter writer) override {
+        static std::mutex mutex;
+        FakeMessage::reply(std::move(writer));
+        const std::lock_guard lock(mutex);
+        replies_.emplace_back(name_, FakeMessage::reply());
+    }
+
+  private:
+    const std::string name_;
+    std::vector<std::pair<std::string, Dictionary>>& replies_;
+};
+
+TEST_F(ServiceTest, OfAddsAtOnceTheOneThatIsAnsweredLastStays) {
+    for (int round = 0; round < 20; ++round) {
+        std::vector<std::pair<std::string, Dictionary>> replies;
+        platform::sideBySide(4, [&](int i) {
+            AddRequest request("name" + std::to_string(i), replies);
+            handleAuthenticationIPCMessage(request);
+        });
+        std::string last;
+        for (const auto& [name, reply] : replies) {
+            if (reply["success"] == kOn) {
+                last = name;
+                continue;
+            }
+            EXPECT_EQ(errorCode(reply), -108);
+            EXPECT_EQ(reply.dictionary("error")->dictionary("UserInfo")->string(kErrorFailureReasonKey),
+                      "replaced by another account");
+            EXPECT_FALSE(reply.contains("encDsId"));
+        }
+        ASSERT_EQ(accountNames(), Array{last}) << "round " << round;
+    }
+}
+
+TEST_F(ServiceTest, WaitingForTheCertificateEndsWithTheClientAndAsksNobody) {
+    struct Impatient : FakeMessage {
+        using FakeMessage::FakeMessage;
+        bool isSenderGone() const override { return platform::now() > goneAt; }
+        double goneAt = 0;
+    };
+    for (const auto& [patience, wait, seconds] :
+         {std::tuple(20.0, 1e9, 20.0), std::tuple(1e9, 30.0, 30.0), std::tuple(1e9, 1e9, 3'600.0)}) {
+        Impatient message({{"command", number(command::kAdd)},
+                           {"VeltoID", kName},
+                           {"hashedpassword", kPassword},
+                           {"options", Dictionary{{"certwaitduration", Value::real(wait)}}}});
+        const double begin = now();
+        message.goneAt = begin + patience;
+        platform::WorkQueue("client").async([&] { handleAuthenticationIPCMessage(message); });
+        clock_.settle();
+        while (message.replies() == 0) clock_.advanceBy(1);
+        EXPECT_NEAR(now() - begin, seconds, 4);
+        EXPECT_EQ(message.reply()["success"], kOn);
+        EXPECT_EQ(server_.takeMethods(), "authenticate authenticate getMyInfo")
+            << "by the add, not by waiting";
+    }
 }
 
 // --- Status

@@ -30,6 +30,7 @@ void Request::finish(bool success, const std::optional<Error>& error) {
     if (!success && error) reply_.setError(*error);
     message_.reply(
         [reply = reply_.message()](platform::ValueSink& sink) { writeMessageValue(*reply, sink); });
+    held_.reset();
 }
 
 }  // namespace veltoid

@@ -1,7 +1,9 @@
 // What both services' requests have in common: command, account, options, and the reply.
 #pragma once
 
+#include <memory>
 #include <optional>
+#include <utility>
 
 #include "IPCHelpers/IPCMessage.h"
 #include "Platform/bus/MessageService.h"
@@ -33,6 +35,12 @@ class Request {
     /// Adds an entry to the reply; an absent value adds nothing.
     void answer(const String& key, const Value& value) { reply_.setValue(key, value); }
 
+    /// Whether nobody waits for the reply any more.
+    bool isSenderGone() const { return message_.isSenderGone(); }
+
+    /// Keeps something until the reply is on its way, so that no later one overtakes it.
+    void holdUntilFinished(std::shared_ptr<const void> held) { held_ = std::move(held); }
+
     /// Sends the reply with "success", and with "error" when the outcome is a failure that has one.
     void finish(bool success, const std::optional<Error>& error);
 
@@ -43,6 +51,7 @@ class Request {
     int64_t command_ = 0;
     String account_;
     Dictionary options_;
+    std::shared_ptr<const void> held_;
 };
 
 }  // namespace veltoid

@@ -1,11 +1,11 @@
 #include "VeltoIDAuthd/Shutdown.h"
 
+#include <atomic>
 #include <charconv>
 #include <cmath>
 #include <csignal>
 #include <cstdlib>
 #include <string_view>
-#include <utility>
 
 #include "Logging/Log.h"
 #include "Platform/bus/BusConnection.h"
@@ -34,10 +34,11 @@ constexpr double kMaxCommandedEnd = 1;
 /// How long the end waits for a busy service manager to take the relaunch time (seconds).
 constexpr double kMaxHandOver = 2;
 
-/// Main thread only.
 struct Leaving {
-    bool hasBegun = false;
+    std::atomic<bool> hasBegun{false};
 };
+
+Leaving& leaving() { return platform::Lifetime::current().state<Leaving>(); }
 
 /// 0 for never.
 double idleExitSeconds() {
@@ -78,7 +79,7 @@ void endWhenWorkIsDone() {
 }
 
 void leave() {
-    if (std::exchange(platform::Lifetime::current().state<Leaving>().hasBegun, true)) return;
+    if (leaving().hasBegun.exchange(true)) return;
     // Before the names are free: a start that is asked for while the service manager believes that the agent
     // runs would come to nothing.
     platform::ServiceManager::shared().announceStopping();
@@ -113,6 +114,8 @@ void prepareShutdown() {
     platform::message_service::onConnectionLost(terminate);
     if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
 }
+
+bool isLeaving() { return leaving().hasBegun; }
 
 void endAfterPendingWork() {
     const platform::WorkQueue mainQueue = platform::WorkQueue::main();

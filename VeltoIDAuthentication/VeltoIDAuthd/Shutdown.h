@@ -11,6 +11,9 @@ void prepareShutdown();
 /// Begins the shutdown now. Requests that are still being served may delay it for a second. Any queue.
 void shutDownByCommand();
 
+/// Whether the agent has been asked to leave: what can wait is not waited for. Any queue.
+bool isLeaving();
+
 /// Ends the agent (event_loop::run returns) once the main queue has done what it was asked for so far,
 /// replies and relaunch included. On other queues than the main one this returns when the lifetime ends.
 void endAfterPendingWork();

@@ -1,5 +1,8 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
+#include <algorithm>
+#include <vector>
+
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
@@ -33,31 +36,90 @@ std::optional<AccountRecord> firstRecord(const Store& store, Condition condition
     return std::nullopt;
 }
 
-/// Whether the keychain holds exactly this password for the record.
-bool keychainHoldsPassword(const Dictionary& record, const String& hashedPassword) {
-    String stored;
-    return copyPasswordFromKeychainGivenPersistentRef(
-               record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey), &stored) &&
-           stored == hashedPassword;
-}
+/// A password on its way into the keychain, with its reference on the way into a record.
+class PasswordChange {
+  public:
+    PasswordChange(const String& name, const Dictionary& record)
+        : name_(name), referenceBefore_(record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey)) {
+        copyPasswordFromKeychainGivenPersistentRef(referenceBefore_, &before_);
+    }
 
-/// Brings the password into the keychain and its reference into the record.
-bool storePassword(const String& name, const String& hashedPassword, Dictionary& record) {
-    if (keychainHoldsPassword(record, hashedPassword)) {
-        VELTOID_LOG_FROM("__VeltoIDDBCreateVeltoIDAccount", kNotice, "Password being added for account ",
-                         name, " matches password on keychain, so skipping over addPasswordToKeychain");
+    bool make(const String& hashedPassword, Dictionary& record) {
+        if (before_ && before_ == hashedPassword) {
+            VELTOID_LOG_FROM("__VeltoIDDBCreateVeltoIDAccount", kNotice, "Password being added for account ",
+                             name_, " matches password on keychain, so skipping over addPasswordToKeychain");
+            return true;
+        }
+        if (!addPasswordToKeychain(name_, hashedPassword, nullptr, &reference_)) return false;
+        record.set(kVeltoIDAccountHashedPasswordKeychainReferenceKey, reference_);
         return true;
     }
-    Data reference;
-    if (!addPasswordToKeychain(name, hashedPassword, nullptr, &reference)) return false;
-    if (!record.contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-        record.set(kVeltoIDAccountHashedPasswordKeychainReferenceKey, reference);
-    return true;
-}
+
+    /// The record is stored: an item that it named before has no owner any more.
+    void keep() const {
+        if (before_ && reference_ && reference_ != referenceBefore_)
+            removePasswordFromKeychainGivenPersistentRef(referenceBefore_);
+    }
+
+    /// The record could not be stored.
+    void takeBack() const {
+        if (!reference_) return;
+        if (before_ && reference_ == referenceBefore_)
+            addPasswordToKeychain(name_, before_, nullptr, nullptr);
+        else
+            removePasswordFromKeychainGivenPersistentRef(reference_);
+    }
+
+  private:
+    const String& name_;
+    const Data referenceBefore_;
+    String before_;
+    /// Null while nothing was changed.
+    Data reference_;
+};
 
 void markDirty(Dictionary& record) {
     record.set(kVeltoIDDirtyKey, Value::boolean(true));
     record.set(kVeltoIDAccountModificationDateKey, Value::date(platform::now()));
+}
+
+Error notStored(int line) {
+    return makeError(identity_error::kUnknown,
+                     {"The change could not be stored; nothing was changed.", {}, {}}, {},
+                     "__VeltoIDDBRemoveVeltoIDAccountAndPassword", __FILE_NAME__, line);
+}
+
+/// Where records and entries refer to items of the keychain.
+constexpr std::string_view kReferenceKeys[] = {kVeltoIDAccountHashedPasswordKeychainReferenceKey,
+                                               kVeltoIDCertificateCertificatePersistentReferenceKey,
+                                               kVeltoIDCertificatePrivateKeyPersistentReferenceKey,
+                                               kVeltoIDCertificateIntermediateCertificateReferenceKey};
+
+Array keptItems(const Store& store) {
+    const Array* kept = store.metaInfo.array(kVeltoIDMetaKeptKeychainItemsKey);
+    return kept != nullptr ? *kept : Array();
+}
+
+/// The sections as they are when the account is gone.
+std::vector<Store::Change> withoutAccount(const Store& store, const AccountRecord& record,
+                                          const UnownedItems& items) {
+    Dictionary accounts = store.accounts;
+    Dictionary certificates = store.certificates;
+    Dictionary metaInfo = store.metaInfo;
+    accounts.remove(record.accountName().view());
+    const String encDsId = record.encDsId();
+    const bool isShared = std::any_of(accounts.begin(), accounts.end(), [&](const auto& other) {
+        const Dictionary* values = other.value.asDictionary();
+        return values != nullptr && values->string(kVeltoIDAccountDSIDKey) == encDsId;
+    });
+    if (encDsId && !isShared) certificates.remove(encDsId.view());
+    if (metaInfo[record.accountName().view()].isDictionary()) metaInfo.remove(record.accountName().view());
+    Array kept = items.wanted;
+    for (const Value& item : keptItems(store))
+        if (std::find(items.unwanted.begin(), items.unwanted.end(), item) == items.unwanted.end())
+            kept.append(item);
+    database::change(metaInfo, kVeltoIDMetaKeptKeychainItemsKey, kept.empty() ? Value() : Value(kept));
+    return {{&Store::accounts, accounts}, {&Store::certificates, certificates}, {&Store::metaInfo, metaInfo}};
 }
 
 void removeDirtyMarks(Dictionary& section) {
@@ -135,11 +197,14 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
                                 : Dictionary{{kVeltoIDAccountCreationDateKey, Value::date(platform::now())}};
         record.set(kVeltoIDAccountNameKey, name);
         record.set(kVeltoIDAccountDSIDKey, encDsId);
-        if (hashedPassword && !storePassword(name, hashedPassword, record)) return false;
+        PasswordChange password(name, record);
+        if (hashedPassword && !password.make(hashedPassword, record)) return false;
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);
-        return store.set(&Store::accounts, name, record, Notify::Yes);
+        const bool stored = store.set(&Store::accounts, name, record, Notify::Yes);
+        stored ? password.keep() : password.takeBack();
+        return stored;
     });
 }
 
@@ -149,29 +214,35 @@ String __VeltoIDDBCopyHashedPassword(const AccountRecord& record) {
     return record.ownPasswordHash();
 }
 
-bool __VeltoIDDBRemovePassword(const String& name) {
+bool __VeltoIDDBRemovePassword(const String& name, const String& refusedHash) {
     return database::perform([&](Store& store) {
-        const Dictionary* existing = Store::find(store.accounts, name);
-        if (existing == nullptr) return false;
-        if (!existing->contains(kVeltoIDAccountHashedPasswordKey) &&
-            !existing->contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-            return true;
-        Dictionary record = *existing;
-        record.remove(kVeltoIDAccountHashedPasswordKey);
-        removePasswordFromKeychainGivenPersistentRef(
-            record.data(kVeltoIDAccountHashedPasswordKeychainReferenceKey));
-        record.remove(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+        const auto existing = recordOf(store, name);
+        if (!existing || (refusedHash && existing->hasPassword() &&
+                          __VeltoIDDBCopyHashedPassword(*existing) != refusedHash))
+            return false;
+        Dictionary record = existing->values();
+        const bool hasOwn = record.remove(kVeltoIDAccountHashedPasswordKey);
+        const bool hasReference = record.remove(kVeltoIDAccountHashedPasswordKeychainReferenceKey);
+        if (!hasOwn && !hasReference) return true;
         markDirty(record);
-        return store.set(&Store::accounts, name, record, Notify::Yes);
+        if (!store.set(&Store::accounts, name, record, Notify::Yes)) return false;
+        removePasswordFromKeychainGivenPersistentRef(existing->passwordReference());
+        return true;
     });
 }
 
 bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, Notify notify) {
+    return setAccountValuesIf(nullptr, {name, {}}, values, notify);
+}
+
+bool setAccountValuesIf(RecordCondition condition, const AccountRecord& examined, const Dictionary& values,
+                        Notify notify) {
+    const String& name = examined.accountName();
     if (!name || values.empty()) return false;
     return database::perform([&](Store& store) {
-        const Dictionary* existing = Store::find(store.accounts, name);
-        if (existing == nullptr) return false;
-        Dictionary record = *existing;
+        const auto existing = recordOf(store, name);
+        if (!existing || (condition != nullptr && !condition(*existing, examined))) return false;
+        Dictionary record = existing->values();
         bool changed = false;
         bool significant = false;
         for (const auto& [key, value] : values) {
@@ -210,13 +281,36 @@ bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
     });
 }
 
-bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, AccountRecord* removed) {
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, const UnownedItems& items,
+                                                AccountRecord* removed, ErrorOut error) {
     return database::perform([&](Store& store) {
         const auto record = recordOf(store, name);
-        if (!record || !store.remove(&Store::accounts, name)) return false;
-        removePasswordFromKeychainGivenPersistentRef(record->passwordReference());
-        *removed = *record;
+        if (!record) return failWith(error, VELTOID_ERROR(missingAccountCode(store)));
+        const Dictionary before[] = {store.accounts, store.certificates, store.metaInfo};
+        if (!store.replace(withoutAccount(store, *record, items), Notify::Yes))
+            return failWith(error, notStored(__LINE__));
+        const Data password = record->passwordReference();
+        if (!removePasswordFromKeychainGivenPersistentRef(password) && keychainHasPasswordItem(password) &&
+            store.replace({{&Store::accounts, before[0]},
+                           {&Store::certificates, before[1]},
+                           {&Store::metaInfo, before[2]}},
+                          Notify::No))
+            return failWith(error, notStored(__LINE__));
+        fill(removed, *record);
         return true;
+    });
+}
+
+std::optional<Array> referencesInUse() {
+    return database::perform([](const Store& store) -> std::optional<Array> {
+        if (!store.isLoaded()) return std::nullopt;
+        Array references = keptItems(store);
+        for (const Dictionary* section : {&store.accounts, &store.certificates})
+            for (const auto& [key, value] : *section)
+                if (const Dictionary* entry = value.asDictionary())
+                    for (const std::string_view reference : kReferenceKeys)
+                        if (const Data item = entry->data(reference)) references.append(item);
+        return references;
     });
 }
 

@@ -111,21 +111,30 @@ AccountRecord accountRecordOf(const String& name);
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error = nullptr);
 
 /// Creates or updates the record; a password goes to the keychain, its reference into the record. Marks the
-/// record dirty and writes with signal. False, with the record as it was, when the keychain refuses the
-/// password.
+/// record dirty, ends what the account check has put off, and writes with signal. False, with record and
+/// password as they were, when the keychain refuses the password or the record cannot be stored.
 bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword, const String& encDsId);
 
 /// The password hash of a record: from the keychain, else the record's own. Runs on the caller's thread.
 String __VeltoIDDBCopyHashedPassword(const AccountRecord& record);
 
-/// Drops password and reference, deletes the keychain item, marks dirty, writes with signal. False without a
-/// record.
-bool __VeltoIDDBRemovePassword(const String& name);
+/// Drops password and reference, deletes the keychain item, marks dirty, writes with signal. With
+/// `refusedHash`, only a password of that hash: another one was stored meanwhile, or cannot be read now.
+/// False, with the password in place, without a record, for another password, or when the record cannot be
+/// stored.
+bool __VeltoIDDBRemovePassword(const String& name, const String& refusedHash = nullptr);
+
+/// What the stored record must still be like for a change that was decided earlier.
+using RecordCondition = bool (*)(const AccountRecord& stored, const AccountRecord& examined);
 
 /// Sets every key whose value differs; Null removes. A change stamps "ModificationDate", marks the record
 /// dirty when it notifies (unless the values say otherwise), and is written. False without name, values or
 /// record.
 bool __VeltoIDDBSetAccountValues(const String& name, const Dictionary& values, Notify notify = Notify::Yes);
+
+/// The same for the examined account, if the condition holds when the change is made; false if not.
+bool setAccountValuesIf(RecordCondition condition, const AccountRecord& examined, const Dictionary& values,
+                        Notify notify = Notify::Yes);
 
 /// The same for one key; an absent value removes it.
 bool __VeltoIDDBSetAccountValue(const String& name, const String& key, const Value& value,
@@ -138,9 +147,23 @@ Value __VeltoIDDBCopyAccountValue(const String& name, const String& key);
 /// record: -108.
 bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error = nullptr);
 
-/// Removes the record with its password item, in one step: a new record of that name would take the item up.
-/// Hands the record out; false without one, or when the change cannot be stored.
-bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, AccountRecord* removed);
+/// References to items of the keychain that are wanted without an owner from now on, and to those that are
+/// not any more.
+struct UnownedItems {
+    Array wanted;
+    Array unwanted;
+};
+
+/// Removes the record, its password item, its meta information and, unless another account shares its
+/// encDsId, its certificate entry, in one step: a new record of that name would take them up. The other items
+/// of the keychain stay; what is to become of them is noted. Hands the record out. False, with everything as
+/// it was: -108 without a record, -100 when the change cannot be stored.
+bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, const UnownedItems& items,
+                                                AccountRecord* removed, ErrorOut error = nullptr);
+
+/// The references to keychain items that are in use: of records, of certificate entries, and those that are
+/// wanted without an owner. None when the database cannot be read.
+std::optional<Array> referencesInUse();
 
 /// What becomes of the marks of changed records, and with ClearAll of changed certificate entries.
 enum class DirtyMarks { Keep, ClearOfAccounts, ClearAll };

@@ -1,8 +1,10 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 #include "TestSupport/DatabaseFixture.h"
+#include "TestSupport/SQLiteEdit.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
@@ -90,6 +92,72 @@ TEST_F(AccountsTest, APasswordThatTheKeychainRefusesLeavesTheRecordAsItWas) {
     EXPECT_FALSE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", nullptr));
     EXPECT_FALSE(__VeltoIDDBCopyVeltoIDAccount("other", nullptr));
     EXPECT_TRUE(log_.contains("Failed to add password to keychain,err="));
+}
+
+TEST_F(AccountsTest, WhatCannotBeStoredIsUndone) {
+    create(kName, "old hash", "d1");
+    ASSERT_TRUE(__VeltoIDDBSetCertificateInfo("d1", std::nullopt));
+    const Dictionary before = record();
+    const Array items = *copyAllPasswordsFromKeychain();
+    const struct {
+        const char* what;
+        bool (*change)();
+    } cases[] = {
+        {"a new account", [] { return __VeltoIDDBCreateVeltoIDAccount("other", "hash", nullptr); }},
+        {"a new password", [] { return __VeltoIDDBCreateVeltoIDAccount(kName, "new hash", nullptr); }},
+        {"forgotten", [] { return __VeltoIDDBRemoveVeltoIDAccountAndPassword(kName, {}, nullptr); }},
+        {"refused", [] { return __VeltoIDDBRemovePassword(kName, "old hash"); }},
+    };
+    const auto expectUnchanged = [&](const char* what) {
+        EXPECT_EQ(record(), before) << what;
+        EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, record()}), "old hash") << what;
+        EXPECT_EQ(copyAllPasswordsFromKeychain(), items) << what;
+        EXPECT_TRUE(__VeltoIDDBCopyCertificateInfo("d1", nullptr)) << what;
+        EXPECT_EQ(accountNames(), Array{kName}) << what;
+    };
+    for (const auto& [what, change] : cases) {
+        {
+            const platform::Obstacle obstacle("preferences.db");
+            EXPECT_FALSE(change()) << what;
+        }
+        expectUnchanged(what);
+    }
+    platform::editDatabase("keychain.db",
+                           "CREATE TRIGGER full BEFORE DELETE ON items BEGIN SELECT raise(ABORT, 'no'); END");
+    EXPECT_FALSE(cases[2].change());
+    expectUnchanged("an item that cannot be deleted");
+}
+
+TEST_F(AccountsTest, AddingAgainHealsTheReferenceToThePassword) {
+    const Data unknown(std::vector<uint8_t>(16, 7));
+    for (const bool isPersistent : {true, false}) {
+        setUseSystemKeychain(isPersistent);
+        const char* name = isPersistent ? "in the keychain" : "in memory";
+        create(name, "hash");
+        for (const Value& reference : {Value(unknown), Value("text"), kGone}) {
+            setValues(name, {{kReference, reference}});
+            create(name, "new hash");
+            EXPECT_EQ(__VeltoIDDBCopyHashedPassword({name, record(name)}), "new hash") << name;
+        }
+        create(name, "third hash");
+        EXPECT_EQ(__VeltoIDDBCopyHashedPassword({name, record(name)}), "third hash") << name;
+    }
+}
+
+TEST_F(AccountsTest, OnlyThePasswordThatWasRefusedGoes) {
+    create(kName, "stored hash");
+    EXPECT_FALSE(__VeltoIDDBRemovePassword(kName, "other hash"));
+    {
+        const platform::Obstacle unreadable("keychain.db");
+        EXPECT_FALSE(__VeltoIDDBRemovePassword(kName, "stored hash"));
+    }
+    EXPECT_TRUE(record().contains(kReference));
+    EXPECT_TRUE(__VeltoIDDBRemovePassword(kName, "stored hash"));
+    EXPECT_FALSE(record().contains(kReference));
+    EXPECT_TRUE(__VeltoIDDBRemovePassword(kName, "any hash")) << "there is none";
+    setValues(kName, {{kPassword, "own hash"}});
+    EXPECT_FALSE(__VeltoIDDBRemovePassword(kName, "other hash"));
+    EXPECT_TRUE(__VeltoIDDBRemovePassword(kName, "own hash"));
 }
 
 TEST_F(AccountsTest, IdentifiersOfAnAccount) {

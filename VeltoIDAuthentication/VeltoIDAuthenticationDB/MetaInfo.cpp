@@ -1,5 +1,6 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 
+#include <algorithm>
 #include <cmath>
 #include <limits>
 
@@ -44,7 +45,7 @@ bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const
         Dictionary changed = stored != nullptr ? *stored : Dictionary();
         if (!database::change(changed, key, value)) return true;
         return section ? store.set(&Store::metaInfo, section, changed, Notify::No)
-                       : store.replace(&Store::metaInfo, std::move(changed), Notify::No);
+                       : store.replace({{&Store::metaInfo, std::move(changed)}}, Notify::No);
     });
 }
 
@@ -54,8 +55,27 @@ int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Diction
     const Value current = __VeltoIDDBCopyMetaInfoValue(section, options, key, Value::Kind::Number);
     const auto sum = static_cast<int64_t>(static_cast<uint64_t>(current.asInt64().value_or(0)) +
                                           static_cast<uint64_t>(delta));
-    __VeltoIDDBSetMetaInfoValue(section, key, Value::int64(sum));
+    const bool isForNobody = section && database::perform([&](const Store& store) {
+                                 return Store::find(store.accounts, section) == nullptr;
+                             });
+    if (!isForNobody) __VeltoIDDBSetMetaInfoValue(section, key, Value::int64(sum));
     return sum;
+}
+
+void __VeltoIDDBForgetUnknownNames() {
+    database::perform([](Store& store) {
+        if (!store.isLoaded()) return;
+        Dictionary kept = store.metaInfo;
+        for (const auto& [name, value] : store.metaInfo) {
+            const Dictionary* section = value.asDictionary();
+            if (section == nullptr || Store::find(store.accounts, name) != nullptr) continue;
+            if (std::all_of(section->begin(), section->end(),
+                            [](const auto& entry) { return entry.key.view().ends_with("Count"); }))
+                kept.remove(name.view());
+        }
+        if (kept.size() != store.metaInfo.size())
+            store.replace({{&Store::metaInfo, std::move(kept)}}, Notify::No);
+    });
 }
 
 double metaInterval(const String& section, const Dictionary& options, std::string_view key,

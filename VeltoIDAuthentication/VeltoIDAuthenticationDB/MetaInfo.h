@@ -26,11 +26,14 @@ Value __VeltoIDDBCopyMetaInfoValue(const String& section, const Dictionary& opti
 /// absent or Null value removes it. False without key.
 bool __VeltoIDDBSetMetaInfoValue(const String& section, const String& key, const Value& value);
 
-/// Adds `delta` (wrapping) to the counter as the look-up finds it and stores it; the new value. Read and
-/// write are two operations, so that of two concurrent increments one may be lost. 0 and no change without
-/// key.
+/// Adds `delta` (wrapping) to the counter as the look-up finds it and stores it, unless the section is a name
+/// that no stored account has; the new value. Read and write are two operations, so that of two concurrent
+/// increments one may be lost. 0 and no change without key.
 int64_t __VeltoIDDBIncrementMetaInfoCounter(const String& section, const Dictionary& options,
                                             const String& key, int64_t delta);
+
+/// Removes the sections of names that no account has and that hold nothing but counters.
+void __VeltoIDDBForgetUnknownNames();
 
 /// What an interval counts as that is set to something other than a number.
 enum class UnreadableInterval { Default, Zero };

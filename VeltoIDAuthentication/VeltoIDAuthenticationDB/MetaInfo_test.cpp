@@ -3,6 +3,7 @@
 #include <limits>
 
 #include "TestSupport/DatabaseFixture.h"
+#include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 namespace {
@@ -96,6 +97,7 @@ TEST_F(MetaInfoTest, CountersCount) {
         EXPECT_EQ(stored, number(sum));
         EXPECT_EQ(stored.numberKind(), NumberKind::Int64);
     }
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("account", nullptr, nullptr));
     __VeltoIDDBSetMetaInfoValue(nullptr, "c", number(100));
     for (const int sum : {101, 102})
         EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {}, "c", 1), sum)
@@ -103,6 +105,9 @@ TEST_F(MetaInfoTest, CountersCount) {
     EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {{"c", number(1)}}, "c", 1), 2);
     EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue(nullptr, {}, "c"), number(100)) << "the device's own stays";
     EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("account", {}, nullptr, 1), 0);
+    EXPECT_EQ(__VeltoIDDBIncrementMetaInfoCounter("nobody", {}, "c", 1), 101);
+    EXPECT_EQ(__VeltoIDDBCopyMetaInfoValue("nobody", {}, "c"), number(100))
+        << "names without account leave nothing";
 }
 
 TEST_F(MetaInfoTest, WhatMayBeReported) {

@@ -155,26 +155,31 @@ bool Store::load() {
 bool Store::set(Dictionary Store::*section, const String& key, const Dictionary& entry, Notify notify) {
     Dictionary changed = this->*section;
     changed.set(key, entry);
-    return replace(section, std::move(changed), notify);
+    return replace({{section, std::move(changed)}}, notify);
 }
 
 bool Store::remove(Dictionary Store::*section, const String& key) {
     Dictionary changed = this->*section;
-    return key && changed.remove(key.view()) && replace(section, std::move(changed), Notify::Yes);
+    return key && changed.remove(key.view()) && replace({{section, std::move(changed)}}, Notify::Yes);
 }
 
-bool Store::replace(Dictionary Store::*section, Dictionary changed, Notify notify) {
+bool Store::replace(std::vector<Change> changes, Notify notify) {
     if (!isLoaded()) return false;
-    std::swap(this->*section, changed);
-    if (!writeSections({section})) {
-        std::swap(this->*section, changed);
+    std::vector<Dictionary Store::*> sections;
+    for (Change& each : changes) sections.push_back(each.section);
+    const auto exchange = [&] {
+        for (Change& each : changes) std::swap(this->*each.section, each.changed);
+    };
+    exchange();
+    if (!writeSections(sections)) {
+        exchange();
         return false;
     }
     if (notify == Notify::Yes && changeSemaphore_) changeSemaphore_->signal();
     return true;
 }
 
-bool Store::writeSections(std::initializer_list<Dictionary Store::*> sections) {
+bool Store::writeSections(const std::vector<Dictionary Store::*>& sections) {
     if (!usePreferences_) return true;
     if (!loaded_) return false;
     std::vector<std::pair<std::string, platform::ValueWriter>> values;

@@ -10,9 +10,9 @@
 #pragma once
 
 #include <atomic>
-#include <initializer_list>
 #include <memory>
 #include <optional>
+#include <vector>
 
 #include "IPCHelpers/Transaction.h"
 #include "Platform/runtime/WorkQueue.h"
@@ -63,9 +63,16 @@ class Store {
     /// be changed: what could not be read is never overwritten.
     bool isLoaded() const { return !usePreferences_ || loaded_; }
 
-    /// Replaces one section by a changed one, hands it to the preference store, plans the flush, and signals
-    /// the change semaphore if asked. False, with the section as it was, when it cannot be stored.
-    bool replace(Dictionary Store::*section, Dictionary changed, Notify notify);
+    /// A section and what takes its place.
+    struct Change {
+        Dictionary Store::*section;
+        Dictionary changed;
+    };
+
+    /// Replaces sections by changed ones, hands them to the preference store in one step, plans the flush,
+    /// and signals the change semaphore if asked. False, with the sections as they were, when they cannot be
+    /// stored.
+    bool replace(std::vector<Change> changes, Notify notify);
 
     /// The same with one entry of the section set.
     bool set(Dictionary Store::*section, const String& key, const Dictionary& entry, Notify notify);
@@ -88,7 +95,7 @@ class Store {
 
     platform::Preferences preferences() const;
     bool load();
-    bool writeSections(std::initializer_list<Dictionary Store::*> sections);
+    bool writeSections(const std::vector<Dictionary Store::*>& sections);
     void planFlush();
     void synchronize();
 

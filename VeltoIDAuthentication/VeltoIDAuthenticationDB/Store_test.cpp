@@ -315,6 +315,7 @@ TEST_F(StoreTest, AStoreThatCannotBeReadIsNeverOverwritten) {
     EXPECT_EQ(error->code, -1) << "not that there are no accounts";
     EXPECT_FALSE(__VeltoIDDBCopyCertificateKeys(nullptr, &error));
     EXPECT_EQ(error->code, -106);
+    EXPECT_EQ(referencesInUse(), std::nullopt) << "in doubt an item belongs to somebody";
     EXPECT_FALSE(__VeltoIDDBCreateVeltoIDAccount("lost", "hash", nullptr));
     EXPECT_FALSE(__VeltoIDDBSetCertificateInfo("lost", std::nullopt));
     EXPECT_FALSE(__VeltoIDDBSetMetaInfoValue(nullptr, "lost", "too"));

@@ -41,15 +41,22 @@ void dropLostPassword(const AccountRecord& record) {
     if (!platform::LockState::shared().hasBeenUnlockedSinceBoot() ||
         copyPasswordFromKeychainGivenPersistentRef(record.passwordReference(), nullptr))
         return;
-    __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountHashedPasswordKeychainReferenceKey,
-                               Value::null());
+    setAccountValuesIf(
+        [](const AccountRecord& stored, const AccountRecord& examined) {
+            return stored.passwordReference() == examined.passwordReference();
+        },
+        record, {{kVeltoIDAccountHashedPasswordKeychainReferenceKey, Value::null()}});
 }
 
-/// The account cannot be used until its password is given again. A password that the server refused was
-/// removed before; a hash that the record itself has, without an item in the keychain, goes here.
+/// The account cannot be used until its password is given again, unless that has happened meanwhile. A
+/// password that the server refused was removed before; a hash that the record itself has, without an item in
+/// the keychain, goes here.
 void disable(const AccountRecord& record) {
-    __VeltoIDDBSetAccountValues(record.accountName(), {{kVeltoIDAccountHashedPasswordKey, Value::null()},
-                                                       {kVeltoIDAccountDSIDKey, Value::null()}});
+    setAccountValuesIf(
+        [](const AccountRecord& stored, const AccountRecord& /*examined*/) {
+            return !stored.passwordReference();
+        },
+        record, {{kVeltoIDAccountHashedPasswordKey, Value::null()}, {kVeltoIDAccountDSIDKey, Value::null()}});
 }
 
 /// The certificate has just been evaluated and is good.

@@ -41,19 +41,19 @@ bool isAlreadyOnItsWay(const AccountRecord& record, const Dictionary& options) {
            (record.certificateToken() || hasValidCertificateEntry(record.encDsId()));
 }
 
-/// Signs in and fetches the account's information; null, with the error, when the sign-in failed.
-Session signIn(const String& accountName, const String& hashedPassword, const Dictionary& options,
-               String* encDsId, ErrorOut error) {
-    Session session =
-        __VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, encDsId, nullptr, error);
-    if (!session) return nullptr;
+/// Signs in and fetches the account's information; false, with the error, when the sign-in failed.
+bool signIn(const String& accountName, const String& hashedPassword, const Dictionary& options,
+            String* encDsId, ErrorOut error) {
+    // Released at once: the next calls may use it.
+    if (!__VeltoIDSessionDoCreateSession(accountName, hashedPassword, options, encDsId, nullptr, error))
+        return false;
     if (*encDsId) __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountDSIDKey, *encDsId);
     if (!getBool(&options, option::kDoNotFetchInformation, false)) {
         const Dictionary fetchOptions =
             copyDictionarySettingValue(options, option::kForceValidationRecordFetch, Value::boolean(true));
         __VeltoIDDoGetMyInfo(accountName, fetchOptions, nullptr);
     }
-    return session;
+    return true;
 }
 
 /// Whether the add itself asks for a certificate instead of leaving that to the account check.
@@ -68,7 +68,7 @@ bool createsRequest(const String& encDsId, const Dictionary& options) {
 AddedAccount storedAccount(const String& accountName, ErrorOut error) {
     AccountRecord record;
     if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return {};
-    return {record.encDsId(), record.values()};
+    return {record.encDsId(), record.values(), {}};
 }
 
 AddedAccount readd(const String& accountName) {
@@ -82,28 +82,36 @@ AddedAccount readd(const String& accountName) {
 AddedAccount addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options) {
     std::optional<Error> held;
     String encDsId;
-    Session session;
-    bool proceeds = getBool(&options, option::kDoNotCheckPassword, false);
-    if (!proceeds) {
-        session = signIn(accountName, hashedPassword, options, &encDsId, &held);
-        proceeds = session != nullptr;
-    }
+    bool proceeds = getBool(&options, option::kDoNotCheckPassword, false) ||
+                    signIn(accountName, hashedPassword, options, &encDsId, &held);
     if (proceeds && createsRequest(encDsId, options)) {
         encDsId = nullptr;
         proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held);
     }
-    AddedAccount added = proceeds ? storedAccount(accountName, &held) : AddedAccount{encDsId, {}};
+    AddedAccount added = proceeds ? storedAccount(accountName, &held) : AddedAccount{encDsId, {}, {}};
     VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Adding account ", accountName, " ",
                      (added.record ? "succeeded." : "failed, "), describeError(held));
     return added;
 }
 
+/// Whether the account is still there; -108 with the reason when not.
+bool isStored(const String& accountName, ErrorOut error) {
+    if (__VeltoIDDBCopyVeltoIDAccount(accountName, nullptr)) return true;
+    const bool isReplaced = !accountNames().empty();
+    return failWith(
+        error, makeError(identity_error::kUnknownAccount,
+                         {isReplaced ? "replaced by another account" : "forgotten meanwhile", {}, {}}, {},
+                         "addOnlyAccount", __FILE_NAME__, __LINE__));
+}
+
 /// The agent keeps one account.
-void forgetOtherAccounts(const String& added) {
+bool forgetOtherAccounts(const OwnershipLock& ownership, const String& added, ErrorOut error) {
     const String addedInLowerCase = lowerCased(added);
     for (const Value& name : accountNames())
-        if (name.isString() && lowerCased(name.asString()) != addedInLowerCase)
-            __VeltoIDForgetVeltoID(name.asString(), {{option::kRemovePrivateKey, Value::boolean(true)}});
+        if (lowerCased(name.asString()) != addedInLowerCase &&
+            !forgetAccount(ownership, name.asString(), {}, error))
+            return false;
+    return true;
 }
 
 /// Lets some time pass before the account is looked at again: until its next action, but not for long.
@@ -113,17 +121,13 @@ void waitForNextAction(const String& accountName) {
     (void)platform::Semaphore().wait(std::clamp(next - now, kMinWait, kMaxWait));
 }
 
-bool waitForCertificate(const String& accountName, const Dictionary& options,
-                        const std::function<void()>& wakeAccountCheck) {
-    const double duration = getDouble(&options, option::kCertificateWait, 0);
-    if (!(duration > 0)) return true;
-    const Dictionary checkOptions =
-        copyDictionarySettingValue(options, option::kCheckNetwork, Value::boolean(true));
+/// Only looks at what is stored: the account check asks the server. False when there will be no certificate.
+bool waitForCertificate(const String& accountName, double duration, const AddingClient& client) {
     const auto& lifetime = platform::Lifetime::current();
-    for (const double deadline = platform::now() + duration;
-         platform::now() <= deadline && !lifetime.isEnding();) {
-        wakeAccountCheck();
-        switch (checkAccountAndDetermineNextAction(accountName, checkOptions)) {
+    const double deadline = platform::now() + std::min(duration, kMaxCertificateWait);
+    while (platform::now() <= deadline && !lifetime.isEnding() && client.isWaiting() &&
+           isStored(accountName, nullptr)) {
+        switch (checkAccountAndDetermineNextAction(accountName, {})) {
             case NoEncodedDSID:
             case PasswordInaccessibleInKeychain:
             case PasswordInvalid:
@@ -153,14 +157,28 @@ bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPasswo
 }
 
 bool addOnlyAccount(const String& accountName, const String& hashedPassword, const Dictionary& options,
-                    const std::function<void()>& wakeAccountCheck, AddedAccount* added, ErrorOut error) {
-    const bool isAdded = __VeltoIDDoAddVeltoID(accountName, hashedPassword, options, added, error);
+                    const AddingClient& client, AddedAccount* added, ErrorOut error) {
+    AddedAccount outcome;
+    const bool isAdded = __VeltoIDDoAddVeltoID(accountName, hashedPassword, options, &outcome, error);
     __VeltoIDDBIncrementMetaInfoCounter(nullptr, options, kVeltoIDAddVeltoIDCountKey, 1);
     if (!isAdded) return false;
     __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountLastValidationDateKey, Value::null());
-    wakeAccountCheck();
-    forgetOtherAccounts(accountName);
-    return waitForCertificate(accountName, options, wakeAccountCheck);
+    client.wakeAccountCheck();
+    auto decision = std::make_shared<const OwnershipLock>();
+    bool succeeds = isStored(accountName, error) && forgetOtherAccounts(*decision, accountName, error);
+    const double wait = getDouble(&options, option::kCertificateWait, 0);
+    if (succeeds && wait > 0) {
+        decision.reset();
+        succeeds = waitForCertificate(accountName, wait, client);
+        decision = std::make_shared<const OwnershipLock>();
+        succeeds = isStored(accountName, error) && succeeds;
+        outcome = storedAccount(accountName, nullptr);
+    } else if (!succeeds) {
+        outcome = {};
+    }
+    outcome.decision = std::move(decision);
+    fill(added, std::move(outcome));
+    return succeeds;
 }
 
 }  // namespace veltoid

@@ -1,8 +1,10 @@
 // The account engine: adding and forgetting, people and breadcrumbs, passwords, dates.
 #include "TestSupport/EngineFixture.h"
+#include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
+#include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/ServerRequests.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
@@ -122,6 +124,37 @@ TEST_F(EngineTest, ForgettingTakesEverythingAlong) {
     }
 }
 
+TEST_F(EngineTest, ForgettingThatCannotBeStoredIsAnErrorAndChangesNothing) {
+    createAccount("d1");
+    const Dictionary before = record();
+    std::optional<Error> error;
+    {
+        const platform::Obstacle obstacle("preferences.db");
+        EXPECT_FALSE(__VeltoIDForgetVeltoID(kName, {}, &error));
+    }
+    EXPECT_EQ(error->code, -100);
+    EXPECT_TRUE(error->userInfo.contains(kErrorFailureReasonKey));
+    EXPECT_EQ(record(), before);
+}
+
+TEST_F(EngineTest, TheCleanUpFindsWhatBelongsToNobody) {
+    createAccount("d1");
+    ASSERT_TRUE(addPasswordToKeychain("nobody", "hash", nullptr, nullptr));
+    for (const char* name : {"nobody", kName}) {
+        __VeltoIDDBSetMetaInfoValue(name, kVeltoIDXMLGetMyInfoCountKey, number(1));
+        __VeltoIDDBSetMetaInfoValue(String(std::string(name) + "'s"), "ServerURL", kURL);
+    }
+    __VeltoIDCleanupAccountsAndCertificates({});
+    EXPECT_EQ(copyAllPasswordsFromKeychain(), Array{record().data("HashedPasswordRef")});
+    const auto hasSection = [](const std::string& name) {
+        return database::perform([&](const database::Store& store) { return store.metaInfo.contains(name); });
+    };
+    EXPECT_TRUE(hasSection(kName) && hasSection("nobody's"));
+    EXPECT_FALSE(hasSection("nobody"));
+    ASSERT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+    EXPECT_FALSE(hasSection(kName));
+}
+
 // --- People and breadcrumbs
 
 TEST_F(EngineTest, PeopleAreFoundOnBehalfOfAnAccount) {
@@ -201,22 +234,49 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
 }
 
 TEST_F(EngineTest, OnlyARefusalTakesThePassword) {
-    const std::tuple<Error, bool, const char*> cases[] = {
-        {identityError(-101), true, "is incorrect or the account has been disabled"},
-        {identityError(-102), true, "is incorrect or the account has been disabled"},
-        {identityError(-105), true, "no longer supports this client"},
-        {identityError(-100), false, "removing"},
-        {Error{kXMLErrorDomain, -101, {}}, false, "removing"},
+    constexpr const char* kIncorrect = "is incorrect or the account has been disabled";
+    const struct {
+        Error error;
+        String sentHash;
+        bool isTaken;
+        const char* line;
+    } cases[] = {
+        {identityError(-101), kPassword, true, kIncorrect},
+        {identityError(-101), "another hash", false, kIncorrect},
+        {identityError(-101), nullptr, false, kIncorrect},
+        {identityError(-102), kPassword, true, kIncorrect},
+        {identityError(-102), "another hash", true, kIncorrect},
+        {identityError(-105), kPassword, true, "no longer supports this client"},
+        {identityError(-105), "another hash", true, "no longer supports this client"},
+        {identityError(-100), kPassword, false, "removing"},
+        {Error{kXMLErrorDomain, -101, {}}, kPassword, false, "removing"},
     };
-    for (const auto& [error, isTaken, line] : cases) {
+    for (const auto& [error, sentHash, isTaken, line] : cases) {
         createAccount("d1");
         const auto lines = log_.count(line);
-        handleServerError(kName, kPassword, error);
-        EXPECT_EQ(hasPassword(), !isTaken) << error.code;
-        EXPECT_EQ(log_.count(line) - lines, isTaken ? 1 : 0) << error.code;
+        handleServerError(kName, sentHash, error);
+        EXPECT_EQ(hasPassword(), !isTaken) << error.code << sentHash.view();
+        EXPECT_EQ(log_.count(line) - lines, isTaken ? 1 : 0) << error.code << sentHash.view();
     }
     handleServerError(kName, kPassword, std::nullopt);
     EXPECT_TRUE(hasPassword());
+    std::optional<Error> error;
+    serverIs(Server::RefusesPassword);
+    EXPECT_FALSE(__VeltoIDDoVerifyPassword(kName, "mistyped", {}, &error));
+    EXPECT_EQ(error->code, -101);
+    EXPECT_TRUE(hasPassword());
+}
+
+TEST_F(EngineTest, ARefusalOfTheOldPasswordLeavesTheNewOne) {
+    createAccount("d1");
+    setValue("ValidationDate", kGone);
+    server_.answerWith("authenticate", [this](const Dictionary&) {
+        EXPECT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, "new hash", nullptr));
+        return FakeIdentityServer::faultOf(-20101);
+    });
+    checkAccount({kName, record()});
+    EXPECT_EQ(__VeltoIDDBCopyHashedPassword({kName, record()}), "new hash");
+    EXPECT_EQ(record()["encDsId"], Value("d1"));
 }
 
 // --- What an account needs next

@@ -4,7 +4,6 @@
 #include <set>
 #include <string>
 
-#include "Certificates/CertificateRequest.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
@@ -12,8 +11,10 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
+#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {
@@ -37,10 +38,26 @@ bool isReferredTo(const Data& reference) {
     });
 }
 
-void removeUnlessReferredTo(const std::optional<Array>& references, bool (*remove)(const Data& reference)) {
-    if (!references) return;
-    for (const Value& reference : *references)
-        if (!isReferredTo(reference.asData())) remove(reference.asData());
+/// The items are listed before the references: an item is stored together with its reference, so that one
+/// that is listed and has none by then is nobody's.
+void discardOrphans() {
+    const struct {
+        std::optional<Array> items;
+        bool (*remove)(const Data& reference);
+    } kinds[] = {{copyAllPasswordsFromKeychain(), removePasswordFromKeychainGivenPersistentRef},
+                 {copyAllKeysFromKeychain(), removeKeyFromKeychainGivenPersistentRef},
+                 {copyAllCertificatesFromKeychain(), removeCertificateFromKeychainGivenPersistentRef}};
+    const auto inUse = referencesInUse();
+    if (!inUse) return;
+    for (const auto& [items, remove] : kinds) {
+        if (!items) continue;
+        for (const Value& item : *items) {
+            if (std::find(inUse->begin(), inUse->end(), item) != inUse->end()) continue;
+            VELTOID_LOG_FROM("__VeltoIDCleanupAccountsAndCertificates", kNotice,
+                             "Removing an item from the keychain that belongs to no account: ", item);
+            remove(item.asData());
+        }
+    }
 }
 
 /// The encDsIds of all accounts; lifts their embargoes on the way.
@@ -104,17 +121,6 @@ void discardCertificate(const OwnershipLock& ownership, const String& encDsId, c
     discardReplacedItems(ownership, entry, {encDsId, kept});
 }
 
-void discardStrayItems(const OwnershipLock& /*ownership*/, const String& accountName,
-                       const DroppedItems& dropped) {
-    if (dropped.privateKey)
-        removeUnlessReferredTo(copyKeysFromKeychainGivenOwner(accountName, kPrivateKeyKind),
-                               removeKeyFromKeychainGivenPersistentRef);
-    if (dropped.certificate)
-        removeUnlessReferredTo(
-            copyCertificatesFromKeychainGivenLabel(certificateLabelForAccount(accountName)),
-            removeCertificateFromKeychainGivenPersistentRef);
-}
-
 bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& /*options*/, ErrorOut /*error*/) {
     cleanUpAccountsAndCertificates(OwnershipLock());
     return true;
@@ -135,6 +141,8 @@ void cleanUpAccountsAndCertificates(const OwnershipLock& ownership) {
             accountName, " / dsID=", encDsId);
         discardCertificate(ownership, encDsId);
     }
+    discardOrphans();
+    __VeltoIDDBForgetUnknownNames();
 }
 
 }  // namespace veltoid

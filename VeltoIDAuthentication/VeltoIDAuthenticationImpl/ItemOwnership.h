@@ -40,14 +40,11 @@ void discardReplacedItems(const OwnershipLock& ownership, const CertificateEntry
 void discardCertificate(const OwnershipLock& ownership, const String& encDsId,
                         const DroppedItems& dropped = {});
 
-/// Deletes the account's items that nothing refers to any more, such as one that was made just before the
-/// agent was killed. For an account that is being forgotten.
-void discardStrayItems(const OwnershipLock& ownership, const String& accountName,
-                       const DroppedItems& dropped);
-
 /// Removes, with their keychain items, the certificate entries that no account owns, that are invalid, or
-/// that lack certificate or key; lifts connection embargoes that are over. The options are not looked at.
-/// True. Caller's queue.
+/// that lack certificate or key; every password, key and certificate in the keychain that neither record nor
+/// entry refers to, whatever has left it behind, unless somebody wanted it to be kept (ForgetAccount.h); what
+/// is counted for names that no account has. Lifts connection embargoes that are over. Does nothing while the
+/// database cannot be read. The options are not looked at. True. Caller's queue.
 bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& options, ErrorOut error = nullptr);
 
 /// The same for callers that hold the ownership lock.

@@ -64,7 +64,8 @@ class Examination {
     }
 
     void takeDueValidation() {
-        validationIsDue_ = schedule().isDue(DueReason::Validation);
+        // Looking alone takes nothing.
+        validationIsDue_ = networkAllowed_ && schedule().isDue(DueReason::Validation);
         if (!validationIsDue_) return;
         if (record_.isValidationForced()) {
             __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountForceValidationKey, Value::null(),

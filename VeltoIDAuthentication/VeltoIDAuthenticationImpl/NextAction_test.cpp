@@ -179,19 +179,19 @@ TEST_F(NextActionTest, TheAccountIsValidatedWhenItIsDue) {
         {"older", {{kDate, date(-14 * kDay - 1)}}, kAsked, {}, {}},
         {"older, tried already", {{kDate, date(-15 * kDay)}, {kNext, soon}}, "authenticate", {}, soon},
         {"unknown", {{kDate, kGone}}, "authenticate", {}, {}},
-        {"embargo", {{"ForceValidation", kOn}, {kEmbargo, date(9)}}, "", {}, {}},
+        {"embargo", {{"ForceValidation", kOn}, {kEmbargo, date(9)}}, "", kOn, {}},
     };
     prepare();
     for (const auto& [what, values, methods, forced, next] : cases) {
         SCOPED_TRACE(what);
-        setValues({{kDate, date()}, {kNext, kGone}, {kEmbargo, kGone}});
+        setValues({{kDate, date()}, {kNext, kGone}, {kEmbargo, kGone}, {"ForceValidation", kGone}});
         setValues(values);
         EXPECT_EQ(check(), CertificateAssumedOK);
         EXPECT_EQ(server_.takeMethods(), methods);
         EXPECT_EQ(record()["ForceValidation"], forced);
         EXPECT_EQ(record()[kNext], next);
     }
-    setValues({{kDate, date(-15 * kDay)}, {kNext, kGone}, {kEmbargo, kGone}});
+    setValues({{kDate, date(-15 * kDay)}, {kNext, kGone}, {kEmbargo, kGone}, {"ForceValidation", kGone}});
     server_.refuse("authenticate", 503);
     EXPECT_EQ(check(), CertificateAssumedOK);
     EXPECT_EQ(record()[kNext], soon) << "a server that cannot be reached is tried again in an hour";

@@ -85,6 +85,15 @@ class MemoryTable {
     }
     const std::vector<std::pair<Data, Item>>& items() const { return items_; }
 
+    /// All references; none when there are none. Any queue.
+    std::optional<Array> references() const {
+        return keychainQueue().sync([&]() -> std::optional<Array> {
+            Array references;
+            for (const auto& [reference, item] : items_) references.append(reference);
+            return references.empty() ? std::nullopt : std::optional(references);
+        });
+    }
+
   private:
     std::vector<std::pair<Data, Item>> items_;
 };

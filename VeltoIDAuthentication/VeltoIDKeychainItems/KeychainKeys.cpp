@@ -134,11 +134,7 @@ bool removeKeyFromKeychainGivenPersistentRef(const Data& persistentReference) {
 std::optional<Array> copyAllKeysFromKeychain() {
     if (usesSystemKeychain())
         return keychain_items::copyReferences(keychain_items::itemsOf(KeychainItemClass::Key));
-    return keychainQueue().sync([] {
-        Array references;
-        for (const auto& [reference, key] : memoryItems().items()) references.append(reference);
-        return references.empty() ? std::nullopt : std::optional(references);
-    });
+    return memoryItems().references();
 }
 
 std::optional<Array> copyKeysFromKeychainGivenOwner(const String& owner, const String& kind) {

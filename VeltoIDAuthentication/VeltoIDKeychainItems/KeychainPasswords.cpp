@@ -114,6 +114,22 @@ bool copyPasswordFromKeychainGivenPersistentRef(const Data& persistentReference,
     });
 }
 
+bool keychainHasPasswordItem(const Data& persistentReference) {
+    if (!persistentReference) return false;
+    return keychainQueue().sync([&] {
+        if (!usesSystemKeychain()) return memoryItems().copy(persistentReference, nullptr);
+        return platform::keychain::copyMatchingReferences(queryForReference(persistentReference), nullptr) ==
+               platform::kKeychainSuccess;
+    });
+}
+
+std::optional<Array> copyAllPasswordsFromKeychain() {
+    if (usesSystemKeychain())
+        return keychain_items::copyReferences(
+            keychain_items::itemsOf(platform::KeychainItemClass::GenericPassword));
+    return memoryItems().references();
+}
+
 bool removePasswordFromKeychainGivenPersistentRef(const Data& persistentReference) {
     if (!persistentReference) return false;
     return keychainQueue().sync([&] {

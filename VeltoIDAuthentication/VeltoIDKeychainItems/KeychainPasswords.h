@@ -3,6 +3,8 @@
 // Every operation runs synchronously on KeychainDispatchQueue (KeychainItems.h).
 #pragma once
 
+#include <optional>
+
 #include "Values/Value.h"
 
 namespace veltoid {
@@ -15,7 +17,13 @@ bool addPasswordToKeychain(const String& accountName, const String& passwordHash
 /// True and the hash when the item exists and can be read.
 bool copyPasswordFromKeychainGivenPersistentRef(const Data& persistentReference, String* passwordHash);
 
+/// Whether the keychain can be read and has the item, whether it can be unsealed or not.
+bool keychainHasPasswordItem(const Data& persistentReference);
+
 /// True when the item was deleted.
 bool removePasswordFromKeychainGivenPersistentRef(const Data& persistentReference);
+
+/// The references of all password items; none when there are none.
+std::optional<Array> copyAllPasswordsFromKeychain();
 
 }  // namespace veltoid

@@ -18,12 +18,18 @@ bool refusesClient(const std::optional<Error>& error) {
     return isIdentityError(error, identity_error::kServerNoLongerSupported);
 }
 
-/// The verdict on a failed call that was made with this password hash: the account's password is removed,
-/// which disables the account until a client adds it again, when the server refuses it, has disabled the
-/// account, or no longer supports this client (-105). Nothing for any other error.
-void judgeRefusal(const String& accountName, const String& /*sentPasswordHash*/,
+/// The verdict on a failed call that was made with this password hash: when the server refuses it, the stored
+/// password goes if it is the same; when the server has disabled the account, or no longer supports this
+/// client
+/// (-105), whatever it is. That disables the account until a client adds it again. Nothing for any other
+/// error. False when a refused password is not the stored one.
+bool judgeRefusal(const String& accountName, const String& sentPasswordHash,
                   const std::optional<Error>& error) {
-    if (refusesPassword(error) || refusesClient(error)) __VeltoIDDBRemovePassword(accountName);
+    if (!refusesPassword(error) && !refusesClient(error)) return true;
+    const bool concernsPassword = isIdentityError(error, identity_error::kInvalidAccountOrPassword);
+    if (concernsPassword && !sentPasswordHash) return false;
+    return __VeltoIDDBRemovePassword(accountName, concernsPassword ? sentPasswordHash : String()) ||
+           !concernsPassword;
 }
 
 }  // namespace
@@ -67,11 +73,11 @@ void handleServerError(const String& accountName, const String& sentPasswordHash
                     "VeltoIDAuth: The server has reported that it no longer supports this client, so "
                     "removing the password from the system and disabling the account ",
                     accountName);
-    if (refusesPassword(error))
+    const bool isRemoved = judgeRefusal(accountName, sentPasswordHash, error);
+    if (refusesPassword(error) && isRemoved)
         VELTOID_LOG(kNotice, "VeltoIDAuth: The password for account ", accountName,
                     " is incorrect or the account has been disabled, so removing this password from the "
                     "system and disabling the account.");
-    judgeRefusal(accountName, sentPasswordHash, error);
 }
 
 }  // namespace veltoid

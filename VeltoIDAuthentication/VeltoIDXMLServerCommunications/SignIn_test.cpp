@@ -325,6 +325,7 @@ TEST_F(SignInTest, AnotherValidationRecordIsFetchedAgain) {
 
 TEST_F(SignInTest, SignInsOfOneAccountDoNotOverlapAndThoseOfOthersDo) {
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"dsSessionValidityDuration", number(100)}});
+    for (const char* name : {"even", "odd"}) __VeltoIDDBCreateVeltoIDAccount(name, kPassword, nullptr);
     platform::sideBySide(6, [](int i) {
         const String name = i % 2 == 0 ? "even" : "odd";
         for (int round = 0; round < 10; ++round) (void)__VeltoIDSessionDoCreateSession(name, kPassword, {});
