@@ -4,6 +4,7 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/InstanceLock.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/ValueStream.h"
@@ -146,6 +147,7 @@ platform::Preferences Store::preferences() const {
 
 bool Store::load() {
     if (!usePreferences_) return true;
+    if (!platform::instance_lock::mayRead()) return false;
     const platform::Preferences domain = preferences();
     if (!keepOrInitialize(domain)) return false;
     const auto storedAccounts = readSection(domain, kVeltoIDDBAccountsKey, OtherEntries::Drop);
