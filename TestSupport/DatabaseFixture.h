@@ -150,7 +150,8 @@ class DatabaseTest : public testing::Test {
     }
     static Dictionary storedDomain(std::string_view name = kVeltoIDDBDefaultDomain) {
         Dictionary contents;
-        for (const std::string& key : domain(name).keys()) {
+        const auto keys = domain(name).keys();
+        for (const std::string& key : keys.value()) {
             ValueBuilder builder;
             domain(name).read(key, builder);
             contents.set(String(key), builder.value());

@@ -66,10 +66,10 @@ class BusClient {
     BusClient& operator=(const BusClient&) = delete;
 
     void waitForAgent() {
+        takeSignals();
         while (!agentIsThere()) {
             sd_bus_wait(bus_, UINT64_MAX);
-            while (sd_bus_process(bus_, nullptr) > 0) {
-            }
+            takeSignals();
         }
     }
 
@@ -93,6 +93,11 @@ class BusClient {
     }
 
   private:
+    void takeSignals() {
+        while (sd_bus_process(bus_, nullptr) > 0) {
+        }
+    }
+
     static constexpr const char* kDaemon = "org.freedesktop.DBus";
     static constexpr const char* kDaemonPath = "/org/freedesktop/DBus";
 

@@ -7,12 +7,13 @@ import functools
 import os
 import pathlib
 import signal
+import sqlite3
 import subprocess
 import unittest
 
-from harness.world import (ACCOUNT, ADD, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT, OTHER_PASSWORD, PASSWORD,
-                           PASSWORD_SERVICE, PING, SET_VALUE, SET_VALUE_QUIETLY, STATUS, TERMINATE,
-                           UPDATE_LINKED_IDENTITY, VERIFY, BusError, NameOwner, World, busctl_send, execute,
+from harness.world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT,
+                           OTHER_PASSWORD, PASSWORD, PASSWORD_SERVICE, PING, SET_VALUE, SET_VALUE_QUIETLY, STATUS,
+                           TERMINATE, UPDATE_LINKED_IDENTITY, VERIFY, BusError, NameOwner, World, busctl_send, execute,
                            hashed)
 
 PROGRAM = os.environ["VELTOID_AGENT"]
@@ -241,17 +242,46 @@ class Files(unittest.TestCase):
                 self.assertTrue(aside.read_bytes().startswith(b"this is no database"))
                 self.assertIn(aside.name, world.log_text())
 
-    def test_a_file_of_a_newer_version_is_left_alone_and_nothing_is_claimed(self):
+    def test_accounts_that_cannot_be_read_now_are_not_said_to_be_none(self):
+        everything = (STATUS, DATABASE, CHECK, LIST, INFO, FORGET, CERTIFICATE)
+
+        @contextlib.contextmanager
+        def newer(file):
+            execute(file, "PRAGMA user_version = 99")
+            yield
+            execute(file, "PRAGMA user_version = 1")
+
+        @contextlib.contextmanager
+        def in_the_way(file):
+            file.rename(file.with_name("elsewhere"))
+            file.mkdir()
+            yield
+            file.rmdir()
+            file.with_name("elsewhere").rename(file)
+
+        @contextlib.contextmanager
+        def held(file):
+            with contextlib.closing(sqlite3.connect(file, isolation_level=None)) as other:
+                other.executescript("PRAGMA locking_mode = EXCLUSIVE; BEGIN EXCLUSIVE;")
+                yield
+
         with World() as world:
             file = self.prepared(world) / "preferences.db"
-            execute(file, "PRAGMA user_version = 99")
-            with world.running_agent() as client:
-                for reply in (client.call(LIST), client.add(OTHER_ACCOUNT, OTHER_PASSWORD),
-                              client.call(SET_VALUE, domain="MetaInfo", key="k", value="v")):
-                    self.assertFalse(reply["success"])
-            execute(file, "PRAGMA user_version = 1")
-            with world.running_agent() as client:
-                self.assertEqual(client.call(LIST)["result"], [ACCOUNT])
+            for obstacle, commands in [(newer, everything), (in_the_way, everything), (held, (LIST,))]:
+                with self.subTest(obstacle.__name__), obstacle(file):
+                    world.start_agent()
+                    with world.client(starts_agent=False) as client:
+                        for command in commands:
+                            error = client.call(command, VeltoID=ACCOUNT)["error"]
+                            self.assertEqual((error["Domain"], error["Code"]), (ENGINE, -1), command)
+                            self.assertIn("cannot be read now", error["UserInfo"]["HWLocalizedFailureReason"])
+                            self.assertLessEqual({"function", "file", "line"}, set(error["UserInfo"]))
+                        if obstacle is not held:
+                            self.assertFalse(client.add(OTHER_ACCOUNT, OTHER_PASSWORD)["success"])
+                with world.client(starts_agent=False) as client:
+                    self.assertEqual(client.call(LIST)["result"], [ACCOUNT], "as soon as it can be read")
+                    self.assertIn(ACCOUNT, client.call(STATUS)["status"]["AccountStatuses"])
+                self.assertEqual(world.stop_agent(), 0)
 
     def test_a_damaged_value_takes_no_other_down_and_is_kept(self):
         for key, accounts in [("Version", [ACCOUNT]), ("MetaInfo", [ACCOUNT]), ("Accounts", [])]:

@@ -4,6 +4,7 @@ from __future__ import annotations
 
 import os
 import signal
+import subprocess
 import unittest
 from concurrent.futures import ThreadPoolExecutor
 
@@ -65,6 +66,30 @@ class PlainBus(unittest.TestCase):
                 with self.assertRaises(TimeoutError):
                     owner.wait(False, timeout=1)
                 self.assertEqual(world.agent_pid(), first)
+
+    def test_a_second_agent_ends_says_who_is_there_and_writes_nothing(self):
+        def second(*arguments, **environment):
+            return subprocess.Popen([*world.command, *arguments, "k=v"], env={**world.environment, **environment},
+                                    stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, text=True)
+
+        with World(server=False) as world, world.running_agent() as client:
+            other_names = "--authServiceName", "com.example.other"
+            elsewhere = world.folder / "elsewhere"
+            same_store, impatient = [second(), second(*other_names)], second()
+            same_name = [second("--noprefsfile"), second(XDG_STATE_HOME=str(elsewhere))]
+            for agents, why in [(same_name, "cannot be had on this bus"), (same_store, "works on this user's accounts")]:
+                for agent in agents:
+                    said = agent.communicate(timeout=60)[1].splitlines()
+                    self.assertEqual(agent.returncode, 1, said)
+                    reasons = [line for line in said if why in line]
+                    self.assertEqual(len(reasons), 1, said)
+                    self.assertIn(f"process {world.agent.pid}", reasons[0])
+                if agents is same_name:
+                    impatient.terminate()
+                    impatient.communicate(timeout=60)
+                    self.assertEqual(impatient.returncode, -signal.SIGTERM, "it waited without being deaf")
+            self.assertNotIn("k", client.call(DATABASE)["result"].get("MetaInfo", {}))
+            self.assertEqual([file.name for file in elsewhere.rglob("*") if file.is_file()], ["agent.lock"])
 
     def test_ends_in_the_middle_of_requests_lose_none(self):
         ends = [lambda client: os.kill(client.call(STATUS)["status"]["pid"], signal.SIGTERM),

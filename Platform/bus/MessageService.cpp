@@ -1,10 +1,12 @@
 #include "Platform/bus/MessageService.h"
 
+#include <poll.h>
 #include <systemd/sd-bus.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+#include <cerrno>
 #include <map>
 #include <utility>
 #include <vector>
@@ -12,7 +14,6 @@
 #include "Platform/bus/BusConnection.h"
 #include "Platform/bus/BusMessage.h"
 #include "Platform/bus/BusPeer.h"
-#include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/SystemLog.h"
 #include "Platform/runtime/Transactions.h"
@@ -114,7 +115,6 @@ class BusListener;
 struct Services {
     std::vector<std::shared_ptr<BusListener>> listeners;
     bool objectAdded = false;
-    long namesAskedFor = 0;
 
     void lifetimeEnds();
 };
@@ -147,18 +147,17 @@ class BusListener : public Listener {
     const std::string& name() const { return name_; }
     void notify(const ListenerEvent& event) const { handler_(event); }
 
-    void resume() override {
+    bool claim() override {
         sd_bus* bus = bus::connection();
-        int result = bus != nullptr ? addObject(bus) : -ENOTCONN;
-        if (result >= 0 && name_.empty()) return;
-        if (result >= 0)
-            result = sd_bus_request_name_async(bus, nullptr, name_.c_str(), 0, nameRequested, this);
-        if (result >= 0) {
-            ++services().namesAskedFor;
-            return;
-        }
-        bus::logFailure("registering a service", result);
-        notify(ConnectionError::Invalid);
+        if (bus == nullptr) return false;
+        int result = addObject(bus);
+        if (result >= 0 && !name_.empty()) result = requestName(bus);
+        if (result == -EEXIST)
+            VELTOID_PLATFORM_LOG(Error, "The service name " + name_ + " cannot be had on this bus: process " +
+                                            holderOfName(bus) + " has it. This one ends.");
+        else if (result < 0)
+            bus::logFailure("registering a service", result);
+        return result >= 0;
     }
 
     /// False when there is nothing to wait for.
@@ -197,17 +196,24 @@ class BusListener : public Listener {
                                         kNotificationInterfaceTable, nullptr);
     }
 
-    static int nameRequested(sd_bus_message* reply, void* context, sd_bus_error* /*error*/) noexcept {
-        const auto* listener = static_cast<const BusListener*>(context);
-        constexpr uint32_t kPrimaryOwner = 1;
-        uint32_t outcome = 0;
-        const bool answered = sd_bus_message_is_method_error(reply, nullptr) <= 0 &&
-                              sd_bus_message_read(reply, "u", &outcome) > 0;
-        if (--services().namesAskedFor == 0) ServiceManager::shared().announceReady();
-        if (answered && outcome == kPrimaryOwner) return 0;
-        VELTOID_PLATFORM_LOG(Error, "The service name " + listener->name_ + " cannot be had on this bus.");
-        listener->notify(ConnectionError::Invalid);
-        return 0;
+    /// The bus may need a moment to see that a process which had the name is gone.
+    int requestName(sd_bus* bus) const {
+        constexpr int kPauseMilliseconds = 20;
+        int result = -EEXIST;
+        for (int tries = 50; tries > 0 && result == -EEXIST; --tries) {
+            result = sd_bus_request_name(bus, name_.c_str(), 0);
+            if (result == -EEXIST) (void)poll(nullptr, 0, kPauseMilliseconds);
+        }
+        return result;
+    }
+
+    std::string holderOfName(sd_bus* bus) const {
+        sd_bus_creds* credentials = nullptr;
+        pid_t process = 0;
+        if (sd_bus_get_name_creds(bus, name_.c_str(), SD_BUS_CREDS_PID, &credentials) >= 0)
+            (void)sd_bus_creds_get_pid(credentials, &process);
+        sd_bus_creds_unref(credentials);
+        return std::to_string(process);
     }
 
     static int nameReleased(sd_bus_message* /*reply*/, void* /*context*/, sd_bus_error* /*error*/) noexcept {

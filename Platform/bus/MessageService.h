@@ -31,8 +31,9 @@ class Listener {
     static std::shared_ptr<Listener> create(std::string serviceName,
                                             std::function<void(const ListenerEvent&)> handler);
 
-    /// Claims the name and starts delivery. Failing to reach the bus or to get the name is an Invalid event.
-    virtual void resume() = 0;
+    /// Claims the name; what comes for it is delivered once the event loop runs. False, logged with the
+    /// process that has the name, when it cannot be had, or no bus can.
+    [[nodiscard]] virtual bool claim() = 0;
 };
 
 namespace message_service {

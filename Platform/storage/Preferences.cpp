@@ -82,7 +82,7 @@ Preferences::ReadResult Preferences::read(std::string_view key, ValueSink& sink)
     return result;
 }
 
-std::vector<std::string> Preferences::keys() const {
+std::optional<std::vector<std::string>> Preferences::keys() const {
     std::vector<std::string> keys;
     const bool done = guarded(domain_, "keys", [&] {
         return file().read([&](SQLiteTransaction& transaction) {
@@ -93,8 +93,7 @@ std::vector<std::string> Preferences::keys() const {
             return true;
         }) == Outcome::Done;
     });
-    if (!done) keys.clear();
-    return keys;
+    return done ? std::optional(std::move(keys)) : std::nullopt;
 }
 
 bool Preferences::set(const std::vector<std::pair<std::string, ValueWriter>>& values) const {

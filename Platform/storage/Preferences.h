@@ -7,6 +7,7 @@
 // synchronize.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -34,8 +35,8 @@ class Preferences {
     /// Writes the value under `key` into the sink. What has reached the sink counts only when it was found.
     ReadResult read(std::string_view key, ValueSink& sink) const;
 
-    /// Empty, too, when the store cannot be read now.
-    std::vector<std::string> keys() const;
+    /// None when the store cannot be read now.
+    std::optional<std::vector<std::string>> keys() const;
 
     /// Sets all of the given keys or, on failure, none.
     bool set(const std::vector<std::pair<std::string, ValueWriter>>& values) const;

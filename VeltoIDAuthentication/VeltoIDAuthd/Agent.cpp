@@ -1,9 +1,11 @@
 #include "VeltoIDAuthd/Agent.h"
 
 #include <csignal>
+#include <cstdlib>
 #include <functional>
 
 #include "Platform/bus/BusConnection.h"
+#include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/EventLoop.h"
 #include "Platform/runtime/InstanceLock.h"
@@ -50,15 +52,12 @@ void prepareDatabase(const CommandLine& line) {
         __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
 }
 
-void startServices(const Agent::Configuration& configuration) {
+bool claimNames(const Agent::Configuration& configuration) {
     const CommandLine& line = configuration.line;
-    if (line.runsAuthentication()) {
-        scheduleRelaunch(platform::now() + kRelaunchAfterStart);
-        startAccountCheck(configuration.firstCheckDelay);
-        registerAuthenticationListener(
-            line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName));
-    }
-    if (line.checkPassword) registerPasswordCheckListener(configuration.linkedIdentity);
+    return (!line.runsAuthentication() ||
+            registerAuthenticationListener(
+                line.authenticationServiceName.value_or(kVeltoIDAuthenticationServiceName))) &&
+           (!line.checkPassword || registerPasswordCheckListener(configuration.linkedIdentity));
 }
 
 /// Every account is validated, at once unless the account check is about to start anyway, and clients that
@@ -67,7 +66,7 @@ void workForLeakChecker() {
     for (const Value& name : accountNames())
         __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountForceValidationKey, Value::boolean(true));
     startAccountCheck(0);
-    registerAuthenticationListener({});
+    (void)registerAuthenticationListener({});
     (void)platform::Semaphore().wait(kLeaksPause);
 }
 
@@ -76,17 +75,26 @@ void workForLeakChecker() {
 Agent::Agent(const Configuration& configuration)
     : lockState_(lockStateFor(configuration)),
       lifetime_(configuration.product, platform::Lifetime::Parts(configuration.parts).with(*lockState_)) {
+    if (configuration.line.usePreferences && !platform::instance_lock::take()) return;
     platform::event_loop::prepare();
+    isStarted_ = claimNames(configuration);
+    if (isStarted_) start(configuration);
+}
+
+void Agent::start(const Configuration& configuration) {
     const CommandLine& line = configuration.line;
-    if (line.usePreferences) platform::instance_lock::waitForPrevious();
     prepareDatabase(line);
     setProcessHooks({[](double date) { scheduleRelaunch(date); }, endAfterPendingWork});
     flushOnInterrupt();
     prepareShutdown();
-    startServices(configuration);
+    if (line.runsAuthentication()) {
+        scheduleRelaunch(platform::now() + kRelaunchAfterStart);
+        startAccountCheck(configuration.firstCheckDelay);
+    }
+    platform::ServiceManager::shared().announceReady();
     if (line.leaks) workForLeakChecker();
 }
 
-int Agent::run() { return platform::event_loop::run(); }
+int Agent::run() { return isStarted_ ? platform::event_loop::run() : EXIT_FAILURE; }
 
 }  // namespace veltoid

@@ -25,15 +25,19 @@ class Agent {
         double firstCheckDelay = kVeltoIDFirstAccountCheckDelay;
     };
 
-    /// Opens the database and starts the services; nothing is served before `run`. Waits for an earlier agent
-    /// that is leaving.
+    /// Takes the store's lock and the services' names, opens the database and starts; nothing is served
+    /// before `run`. Waits for an earlier agent that is leaving.
     explicit Agent(const Configuration& configuration);
 
-    /// Serves until the agent is told to end; the exit status.
+    /// Serves until the agent is told to end; the exit status. A failure at once, with nothing written, when
+    /// another process has the lock or a name.
     int run();
 
   private:
+    void start(const Configuration& configuration);
+
     const std::unique_ptr<platform::LockState> lockState_;
+    bool isStarted_ = false;
     /// Its end is the agent's.
     platform::Lifetime lifetime_;
 };

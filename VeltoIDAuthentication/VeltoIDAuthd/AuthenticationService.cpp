@@ -149,9 +149,9 @@ bool copyBreadcrumb(Request& request, ErrorOut error) {
     return static_cast<bool>(breadcrumb);
 }
 
-bool copyAllContents(Request& request, ErrorOut /*error*/) {
+bool copyAllContents(Request& request, ErrorOut error) {
     std::optional<Dictionary> contents;
-    const bool succeeded = __VeltoIDDBCopyAllContents(&contents);
+    const bool succeeded = __VeltoIDDBCopyAllContents(&contents, error);
     if (contents) request.answer(message::kResult, *contents);
     return succeeded;
 }
@@ -171,8 +171,9 @@ void terminateAfterReply() {
     });
 }
 
-bool status(Request& request, ErrorOut /*error*/) {
+bool status(Request& request, ErrorOut error) {
     const bool terminates = getBool(&request.options(), option::kTerminateServer, false);
+    if (!terminates && !__VeltoIDDBIsReadable(error)) return false;
     if (terminates) computeRelaunchFromAccounts();
     request.answer(message::kStatus, terminates ? copyDeviceStatusDictionary()
                                                 : copyAccountStatusesDictionary(request.options()));
@@ -180,9 +181,13 @@ bool status(Request& request, ErrorOut /*error*/) {
     return true;
 }
 
+/// What a command does while the database cannot be read.
+enum class WhileUnreadable { Run, Refuse };
+
 struct Command {
     int64_t number;
     bool (*run)(Request& request, ErrorOut error);
+    WhileUnreadable whileUnreadable = WhileUnreadable::Run;
 };
 
 constexpr Command kCommands[] = {
@@ -192,23 +197,25 @@ constexpr Command kCommands[] = {
     {command::kSetValueQuietly,
      [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(true); }},
     {command::kAdd, addAccount},
-    {command::kInfo, getMyInfo},
+    {command::kInfo, getMyInfo, WhileUnreadable::Refuse},
     {command::kFind, findPerson},
     {command::kFindCached, findCachedPerson},
-    {command::kList, listAccounts},
-    {command::kForget, forgetAccount},
-    {command::kCertificate, copyCertificateInformation},
+    {command::kList, listAccounts, WhileUnreadable::Refuse},
+    {command::kForget, forgetAccount, WhileUnreadable::Refuse},
+    {command::kCertificate, copyCertificateInformation, WhileUnreadable::Refuse},
     {command::kVerify, verifyRequestedPassword},
     {command::kSetBreadcrumb, setBreadcrumb},
     {command::kGetBreadcrumb, copyBreadcrumb},
     {command::kDatabase, copyAllContents},
-    {command::kCheck, check},
+    {command::kCheck, check, WhileUnreadable::Refuse},
     {command::kStatus, status},
 };
 
 bool dispatch(Request& request, ErrorOut error) {
     for (const Command& known : kCommands)
-        if (known.number == request.command()) return known.run(request, error);
+        if (known.number == request.command())
+            return (known.whileUnreadable == WhileUnreadable::Run || __VeltoIDDBIsReadable(error)) &&
+                   known.run(request, error);
     return false;
 }
 

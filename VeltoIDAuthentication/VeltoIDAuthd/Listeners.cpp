@@ -2,7 +2,6 @@
 
 #include <memory>
 
-#include "IPCHelpers/Transaction.h"
 #include "Platform/bus/MessageService.h"
 #include "Protocol/Commands.h"
 #include "Protocol/MessageKeys.h"
@@ -43,8 +42,7 @@ void handleAuthenticationListenerError(ConnectionError error) {
 
 }  // namespace
 
-void registerAuthenticationListener(const std::string& serviceName) {
-    const Transaction keepAlive("registerAuthenticationListener");
+bool registerAuthenticationListener(const std::string& serviceName) {
     const auto listener = platform::Listener::create(serviceName, [](const platform::ListenerEvent& event) {
         if (const auto* error = std::get_if<ConnectionError>(&event)) {
             handleAuthenticationListenerError(*error);
@@ -52,11 +50,10 @@ void registerAuthenticationListener(const std::string& serviceName) {
             serve(*std::get<std::shared_ptr<PeerConnection>>(event), handleAuthenticationIPCMessage);
         }
     });
-    listener->resume();
+    return listener->claim();
 }
 
-void registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity) {
-    const Transaction keepAlive("registerPasswordCheckListener");
+bool registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity) {
     const RequestHandler handle = [linkedIdentity](platform::IncomingMessage& message) {
         handlePasswordCheckIPCMessage(message, linkedIdentity);
     };
@@ -65,7 +62,7 @@ void registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity) 
             if (const auto* peer = std::get_if<std::shared_ptr<PeerConnection>>(&event))
                 serve(**peer, handle);
         });
-    listener->resume();
+    return listener->claim();
 }
 
 }  // namespace veltoid

@@ -9,8 +9,9 @@
 
 namespace veltoid {
 
-/// Main queue, once each. The authentication service may be there a second time without a name.
-void registerAuthenticationListener(const std::string& serviceName);
-void registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity);
+/// Main queue, once each. The authentication service may be there a second time without a name. False,
+/// logged, when the name cannot be had.
+[[nodiscard]] bool registerAuthenticationListener(const std::string& serviceName);
+[[nodiscard]] bool registerPasswordCheckListener(const LinkedIdentityHandler& linkedIdentity);
 
 }  // namespace veltoid

@@ -12,7 +12,6 @@
 #include "Platform/bus/MessageService.h"
 #include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/EventLoop.h"
-#include "Platform/runtime/InstanceLock.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/Transactions.h"
 #include "Platform/runtime/WorkQueue.h"
@@ -83,7 +82,6 @@ void leave() {
     // Before the names are free: a start that is asked for while the service manager believes that the agent
     // runs would come to nothing.
     platform::ServiceManager::shared().announceStopping();
-    platform::instance_lock::holdUpNext();
     platform::message_service::announceTermination();
     platform::message_service::releaseNames(endWhenWorkIsDone);
 }

@@ -4,6 +4,7 @@
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/InstanceLock.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/ValueStream.h"
@@ -68,8 +69,31 @@ bool keepOrInitialize(const platform::Preferences& domain) {
     const auto current = preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion));
     if (version.result == ReadResult::Damaged) return domain.set({current});
     const Value now = Value::date(platform::now());
-    return domain.remove(domain.keys()) &&
+    const auto keys = domain.keys();
+    return keys && domain.remove(*keys) &&
            domain.set({current, preference(kVeltoIDDBCreationDateKey, now)}) && domain.synchronize();
+}
+
+/// Every key of the domain with its value; none when it cannot be read now.
+std::optional<Dictionary> readAll(const platform::Preferences& domain) {
+    const auto keys = domain.keys();
+    if (!keys) return std::nullopt;
+    Dictionary all;
+    for (const std::string& key : *keys) {
+        const StoredValue stored = readPreference(domain, key);
+        if (stored.result == ReadResult::Failed) return std::nullopt;
+        all.set(String(key), stored.value);
+    }
+    return all;
+}
+
+Error unreadable() {
+    return makeError(
+        identity_error::kUnspecified,
+        {"The stored accounts cannot be read now.",
+         "Nothing is known about the accounts, and nothing is lost.",
+         "The log says what is in the way of the agent's preferences. Try again when it is gone."},
+        {}, "__VeltoIDDBIsReadable", __FILE_NAME__, __LINE__);
 }
 
 /// The name of a section in the domain.
@@ -123,6 +147,7 @@ platform::Preferences Store::preferences() const {
 
 bool Store::load() {
     if (!usePreferences_) return true;
+    if (!platform::instance_lock::mayRead()) return false;
     const platform::Preferences domain = preferences();
     if (!keepOrInitialize(domain)) return false;
     const auto storedAccounts = readSection(domain, kVeltoIDDBAccountsKey, OtherEntries::Drop);
@@ -235,21 +260,21 @@ bool __VeltoIDDBSynchronize() {
     return true;
 }
 
-bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents) {
-    if (contents == nullptr) return true;
-    *contents = database::perform([](const Store& store) {
-        Dictionary all;
-        if (store.usePreferences_) {
-            const platform::Preferences domain = store.preferences();
-            for (const std::string& key : domain.keys())
-                all.set(String(key), database::readPreference(domain, key).value);
-        } else {
-            all = {{kVeltoIDDBAccountsKey, store.accounts},
-                   {kVeltoIDDBUnstoredCertificatesKey, store.certificates},
-                   {kVeltoIDDBMetaInfoKey, store.metaInfo}};
-        }
-        return all;
+bool __VeltoIDDBIsReadable(ErrorOut error) {
+    const bool isLoaded = database::perform([](const Store& store) { return store.isLoaded(); });
+    return isLoaded || failWith(error, database::unreadable());
+}
+
+bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents, ErrorOut error) {
+    const auto all = database::perform([](const Store& store) -> std::optional<Dictionary> {
+        if (!store.usePreferences_)
+            return Dictionary{{kVeltoIDDBAccountsKey, store.accounts},
+                              {kVeltoIDDBUnstoredCertificatesKey, store.certificates},
+                              {kVeltoIDDBMetaInfoKey, store.metaInfo}};
+        return store.isLoaded() ? database::readAll(store.preferences()) : std::nullopt;
     });
+    if (!all) return failWith(error, database::unreadable());
+    fill(contents, all);
     return true;
 }
 

@@ -42,9 +42,13 @@ void __VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore);
 /// Makes all changes durable on disk. True.
 bool __VeltoIDDBSynchronize();
 
+/// Tries to load what is stored, unless that was done. False, with the error that says so, while it cannot be
+/// read: whoever would answer from the empty database says that instead.
+bool __VeltoIDDBIsReadable(ErrorOut error = nullptr);
+
 /// Every key of the preference domain with its value; without preferences the sections under "Accounts",
-/// "Certificates" and "MetaInfo". True.
-bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
+/// "Certificates" and "MetaInfo". False, with the same error, while they cannot be read.
+bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents, ErrorOut error = nullptr);
 
 /// For the rooms of the database; their callers use the operations above and those of the other headers.
 namespace database {
@@ -90,7 +94,7 @@ class Store {
     friend void veltoid::__VeltoIDDBSetUsePreferences(bool usePreferences);
     friend void veltoid::__VeltoIDDBSetChangeSemaphore(const platform::Semaphore& semaphore);
     friend bool veltoid::__VeltoIDDBSynchronize();
-    friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents);
+    friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents, ErrorOut error);
     friend Store& loadedStore();
 
     platform::Preferences preferences() const;
