@@ -79,7 +79,8 @@ AddedAccount readd(const String& accountName) {
     return added;
 }
 
-AddedAccount addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options) {
+AddedAccount addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options,
+                     RequestsSeen seen) {
     std::optional<Error> held;
     String encDsId;
     Session session;
@@ -90,7 +91,7 @@ AddedAccount addAnew(const String& accountName, const String& hashedPassword, co
     }
     if (proceeds && createsRequest(encDsId, options)) {
         encDsId = nullptr;
-        proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held);
+        proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held, seen);
     }
     AddedAccount added = proceeds ? storedAccount(accountName, &held) : AddedAccount{encDsId, {}};
     VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Adding account ", accountName, " ",
@@ -142,11 +143,12 @@ bool waitForCertificate(const String& accountName, const Dictionary& options,
 
 bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPassword, const Dictionary& options,
                            AddedAccount* added, ErrorOut error) {
+    const RequestsSeen seen = requestsSeen(accountName);
     if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr))
         return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
     AddedAccount outcome = isAlreadyOnItsWay(accountRecordOf(accountName), options)
                                ? readd(accountName)
-                               : addAnew(accountName, hashedPassword, options);
+                               : addAnew(accountName, hashedPassword, options, seen);
     platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
     fill(added, std::move(outcome));
     return true;

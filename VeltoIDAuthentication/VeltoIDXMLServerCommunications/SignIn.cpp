@@ -136,7 +136,8 @@ class SignIn {
         oldEncDsId_ = record_.encDsId();
         oldRecordIdentifier_ = record_.validationRecordIdentifier();
         parameters.set(wire::kKnownRecordIdentifier, oldRecordIdentifier_);
-        parameters.set(wire::kKnownSerialNumber, certificateEntryOf(oldEncDsId_).serialNumber());
+        oldCertificate_ = certificateEntryOf(oldEncDsId_);
+        parameters.set(wire::kKnownSerialNumber, oldCertificate_.serialNumber());
         const String uuid = record_.uuid();
         parameters.set(wire::kAccountUUID, uuid);
         parameters.set(wire::kMachineUUID, uuid);
@@ -200,15 +201,17 @@ class SignIn {
         __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_));
     }
 
+    /// The server speaks of the certificate that it was told of, not of one that was issued meanwhile.
     void applyCertificateState(const Dictionary& reply) {
+        if (oldCertificate_.encDsId() != encDsId_) return;
         if (reply.boolean(wire::kCertificateIsValid).value_or(false)) {
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                           Value::date(now_));
+            __VeltoIDDBSetCertificateValues(
+                oldCertificate_, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now_)}});
         } else if (reply.contains(wire::kCertificateIsValid) ||
                    reply.contains(wire::kCertificateNoLongerValid)) {
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey,
-                                           kVeltoIDCertificateStatusInvalid);
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_));
+            __VeltoIDDBSetCertificateValues(oldCertificate_,
+                                            {{kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid},
+                                             {kVeltoIDCertificateExpirationDateKey, Value::date(now_)}});
         }
     }
 
@@ -238,6 +241,7 @@ class SignIn {
     bool hasRecord_ = false;
     AccountRecord record_;
     String oldEncDsId_;
+    CertificateEntry oldCertificate_;
     String oldRecordIdentifier_;
     IdleSession session_;
     String encDsId_;
