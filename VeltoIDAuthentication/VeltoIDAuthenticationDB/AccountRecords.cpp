@@ -73,6 +73,11 @@ void removeDirtyMarks(Dictionary& section) {
 
 }  // namespace
 
+bool AccountRecord::isClientTooOld() const {
+    return boolean(kVeltoIDAccountClientTooOldKey).value_or(false) &&
+           number(kVeltoIDAccountClientTooOldVersionKey) == kVeltoIDDBAccessorVersion;
+}
+
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (store.accounts.empty())
@@ -136,6 +141,9 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         record.set(kVeltoIDAccountNameKey, name);
         record.set(kVeltoIDAccountDSIDKey, encDsId);
         if (hashedPassword && !storePassword(name, hashedPassword, record)) return false;
+        if (hashedPassword)
+            for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey})
+                record.remove(key);
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);

@@ -19,6 +19,7 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
@@ -263,7 +264,7 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
 void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer,
                                       const std::optional<CertificateEntry>& asked) {
     const AccountRecord before = accountRecordOf(accountName);
-    Dictionary values = answer;
+    Dictionary values = recordValuesFromServer(accountName, answer);
     values.set(kVeltoIDAccountLastValidationDateKey, Value::date(platform::now()));
     // Records keep the list of all addresses under their own name for it.
     values.set(kVeltoIDAccountEmailAddressesKey, answer[message::kAllEmails]);

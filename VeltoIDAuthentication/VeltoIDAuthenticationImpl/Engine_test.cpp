@@ -1,5 +1,6 @@
 // The account engine: adding and forgetting, people and breadcrumbs, passwords, dates.
 #include "TestSupport/EngineFixture.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
@@ -95,6 +96,41 @@ TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
     setValues({{kToken, "t"}, {"encDsId", kGone}});
     EXPECT_EQ(readd(), "");
     EXPECT_EQ(log_.count(" re-added; failed, "), 1) << "it has no encDsId";
+}
+
+TEST_F(Adding, AnAccountIsKnownByItsOwnNameWhateverItsRecordOrTheServerSays) {
+    for (const Value& entry : {kGone, Value("john@velto.example"), number(1)}) {
+        SCOPED_TRACE(testing::PrintToString(entry));
+        ASSERT_TRUE(add());
+        setValue("VeltoID", entry);
+        Dictionary information;
+        EXPECT_TRUE(__VeltoIDDoGetMyInfo(kName, {{"SkipValidation", kOn}}, &information));
+        EXPECT_EQ(information["VeltoID"], Value(kName));
+        ASSERT_TRUE(add({{"ForceCertificateCreation", kOn}}));
+        EXPECT_EQ(record()["VeltoID"], Value(kName));
+        setValue("VeltoID", entry);
+        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+        EXPECT_TRUE(record().empty());
+    }
+    for (const char* alias : {"JANE@VELTO.EXAMPLE", "someone.else@velto.example"}) {
+        SCOPED_TRACE(alias);
+        server_.answer("getMyInfo",
+                       Dictionary{{"encDsId", "d1"}, {"VeltoID", alias}, {"ValidatedEmail", kEmails}});
+        ASSERT_TRUE(add());
+        const Value uuid = record()["AccountStableUUID"];
+        Dictionary information;
+        EXPECT_TRUE(__VeltoIDDoGetMyInfo(kName, {{"ForceValidation", kOn}}, &information));
+        EXPECT_EQ(information["VeltoID"], Value(kName));
+        EXPECT_EQ(record()["VeltoID"], Value(kName));
+        EXPECT_EQ(record()["ServerVeltoID"], Value(alias));
+        EXPECT_EQ(record()["AccountStableUUID"], uuid);
+        EXPECT_EQ(accountNames(), Array{kName});
+        serverIs(Server::RefusesPassword);
+        EXPECT_FALSE(__VeltoIDDoVerifyPassword(kName, kPassword, {}));
+        EXPECT_FALSE(hasPassword());
+        serverIs(Server::Up);
+        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+    }
 }
 
 // --- Forgetting
@@ -202,10 +238,10 @@ TEST_F(EngineTest, VerifyingAPasswordAlwaysAsksTheServer) {
 
 TEST_F(EngineTest, OnlyARefusalTakesThePassword) {
     const std::tuple<Error, bool, const char*> cases[] = {
-        {identityError(-101), true, "is incorrect or the account has been disabled"},
-        {identityError(-102), true, "is incorrect or the account has been disabled"},
-        {identityError(-105), true, "no longer supports this client"},
-        {identityError(-100), false, "removing"},
+        {VELTOID_ERROR(-101), true, "is incorrect or the account has been disabled"},
+        {VELTOID_ERROR(-102), true, "is incorrect or the account has been disabled"},
+        {VELTOID_ERROR(-105), true, "no longer supports this client"},
+        {VELTOID_ERROR(-100), false, "removing"},
         {Error{kXMLErrorDomain, -101, {}}, false, "removing"},
     };
     for (const auto& [error, isTaken, line] : cases) {
@@ -245,7 +281,10 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
         {"embargo, expiry", {{kEmbargo, date(99)}}, Dictionary{{"Expires", date(9)}, {kRenewal, date(5)}}, 9},
         {"embargo, no certificate", {{kEmbargo, date(1000)}}, {}, 1000},
         {"embargo is over", {{kEmbargo, date(-1)}, {"ClientTooOld", kOn}}, entry, kFortnight},
-        {"too old", {{"ClientTooOld", kOn}, {"ForceValidation", kOn}}, {}, 3'153'600'000},
+        {"too old",
+         {{"ClientTooOld", kOn}, {"ClientTooOldVersion", Value::real(727.8)}, {"ForceValidation", kOn}},
+         {},
+         3'153'600'000},
         {"an expiry", {}, Dictionary{{"Expires", date(500)}}, 500},
         {"a renewal", {}, Dictionary{{"Expires", date(500)}, {kRenewal, date(400)}}, 400},
         {"a validated certificate", {}, Dictionary{{kValidated, date(-50)}}, kFortnight - 50},

@@ -14,6 +14,7 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/WireKeys.h"
@@ -164,7 +165,9 @@ class SignIn {
         serverVersion() = getInt32(&reply, wire::kVersion, 0);
         applyEmbargo(reply);
         if (reply.boolean(wire::kClientTooOld).value_or(false)) {
-            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true));
+            __VeltoIDDBSetAccountValues(accountName_, {{kVeltoIDAccountClientTooOldKey, Value::boolean(true)},
+                                                       {kVeltoIDAccountClientTooOldVersionKey,
+                                                        Value::real(kVeltoIDDBAccessorVersion)}});
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
         }
         encDsId_ = reply.string(wire::kEncDsId);
