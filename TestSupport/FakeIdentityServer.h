@@ -35,8 +35,8 @@ class FakeIdentityServer {
 
     // What every call of the method gets from now on. Unset methods get a fault.
     void answer(const std::string& method, const Value& reply) { set(method, answerOf(reply)); }
-    /// A reply that depends on the parameters of the call; an Error is a fault with its code, or, in domain
-    /// kNoAnswer, that HTTP status.
+    /// A reply that depends on the parameters of the call, or something that happens meanwhile; an Error is a
+    /// fault with its code, or, in domain kNoAnswer, that HTTP status.
     void answerWith(const std::string& method, std::function<Value(const Dictionary& parameters)> reply) {
         const std::lock_guard lock(mutex_);
         answers_[method] = [reply = std::move(reply)](const Dictionary& parameters) {
@@ -92,13 +92,17 @@ class FakeIdentityServer {
         const XMLRPCResponse parameter(platform::SecretBytes(body.begin(), body.end()));
         const Dictionary* parameters = parameter.object().asDictionary();
 
-        const std::lock_guard lock(mutex_);
-        calls_.push_back({request.url, method, parameters != nullptr ? *parameters : Dictionary()});
+        std::unique_lock lock(mutex_);
+        const Dictionary given = parameters != nullptr ? *parameters : Dictionary();
+        calls_.push_back({request.url, method, given});
         const auto found = answers_.find(method);
         platform::FakeHTTPAnswer answer;
         answer.status = 404;
         if (found == answers_.end()) return answer;
-        const auto [status, content] = found->second(calls_.back().parameters);
+        const auto reply = found->second;
+        // While one call is answered, others may come.
+        lock.unlock();
+        const auto [status, content] = reply(given);
         answer.status = status;
         answer.body = "<methodResponse>" + content + "</methodResponse>";
         return answer;

@@ -32,6 +32,7 @@ SimulatedIdentityServer::SimulatedIdentityServer(FakeIdentityServer& server, pla
     if (configuration.hasBadDays) planBadDays(configuration);
     const auto answer = [&](const char* method, Value (SimulatedIdentityServer::*reply)(const Dictionary&)) {
         server.answerWith(method, [this, reply](const Dictionary& parameters) -> Value {
+            const std::lock_guard lock(mutex_);
             if (isWithin(unreachable_)) {
                 ++events_.unreachable;
                 return FakeIdentityServer::noAnswer();

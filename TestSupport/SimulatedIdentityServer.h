@@ -4,6 +4,7 @@
 #pragma once
 
 #include <map>
+#include <mutex>
 #include <random>
 #include <string>
 #include <vector>
@@ -81,6 +82,8 @@ class SimulatedIdentityServer {
     Dictionary issue(Account& account);
     void tellValidity(const Account& account, const Dictionary& parameters, Dictionary& reply) const;
 
+    /// Held while a call is answered.
+    std::mutex mutex_;
     platform::Clock& clock_;
     const Configuration configuration_;
     std::mt19937 random_;

@@ -22,7 +22,10 @@ inline constexpr RecordKey kVeltoIDDBUnstoredCertificatesKey = "Certificates";
 inline constexpr RecordKey kVeltoIDDBAccessorVersionsKey = "AccessorVersions";
 
 // Account records.
+/// The name under which the record is stored, which alone counts; and the one that the server uses, where
+/// that is another one.
 inline constexpr RecordKey kVeltoIDAccountNameKey = "VeltoID";
+inline constexpr RecordKey kVeltoIDAccountServerNameKey = "ServerVeltoID";
 inline constexpr RecordKey kVeltoIDAccountDSIDKey = "encDsId";
 inline constexpr RecordKey kVeltoIDAccountHashedPasswordKey = "HashedPassword";
 inline constexpr RecordKey kVeltoIDAccountHashedPasswordKeychainReferenceKey = "HashedPasswordRef";
@@ -53,6 +56,8 @@ inline constexpr RecordKey kVeltoIDAccountCertificateNextCertificateFetchNextDel
     "NextCertificateFetchDelta";
 inline constexpr RecordKey kVeltoIDAccountEarliestAllowedConnectionDateKey = "EarliestAllowedConnectionDate";
 inline constexpr RecordKey kVeltoIDAccountClientTooOldKey = "ClientTooOld";
+/// The version of the agent that this was said of; said of another one, it does not count.
+inline constexpr RecordKey kVeltoIDAccountClientTooOldVersionKey = "ClientTooOldVersion";
 inline constexpr RecordKey kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
 inline constexpr RecordKey kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
 inline constexpr RecordKey kVeltoIDAccountValidationRecordIdentifierKey =

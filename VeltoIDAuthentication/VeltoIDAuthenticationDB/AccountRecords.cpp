@@ -135,6 +135,11 @@ void removeDirtyMarks(Dictionary& section) {
 
 }  // namespace
 
+bool AccountRecord::isClientTooOld() const {
+    return boolean(kVeltoIDAccountClientTooOldKey).value_or(false) &&
+           number(kVeltoIDAccountClientTooOldVersionKey) == kVeltoIDDBAccessorVersion;
+}
+
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (store.accounts.empty())
@@ -199,6 +204,9 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         record.set(kVeltoIDAccountDSIDKey, encDsId);
         PasswordChange password(name, record);
         if (hashedPassword && !password.make(hashedPassword, record)) return false;
+        if (hashedPassword)
+            for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey})
+                record.remove(key);
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);

@@ -36,9 +36,9 @@ class AccountRecord : Dictionary {
     String stableUUID() const { return string(kVeltoIDAccountStableUUIDKey); }
     String serverURL() const { return string(kVeltoIDAccountServerURLKey); }
     bool isDirty() const { return boolean(kVeltoIDDirtyKey).value_or(false); }
-    /// Whether name, encDsId and a validated address or phone are known.
+    /// Whether encDsId and a validated address or phone are known.
     bool isComplete() const {
-        return contains(kVeltoIDAccountNameKey) && contains(kVeltoIDAccountDSIDKey) &&
+        return contains(kVeltoIDAccountDSIDKey) &&
                (contains(kVeltoIDAccountValidatedEmailKey) || contains(kVeltoIDAccountValidatedPhonesKey));
     }
 
@@ -50,7 +50,8 @@ class AccountRecord : Dictionary {
     // Connecting to the server.
     Date lastConnectAttempt() const { return date(kVeltoIDMetaLastConnectAttemptKey); }
     Date earliestConnection() const { return date(kVeltoIDAccountEarliestAllowedConnectionDateKey); }
-    bool isClientTooOld() const { return boolean(kVeltoIDAccountClientTooOldKey).value_or(false); }
+    /// Whether the server has refused this version of the agent since the account was last added.
+    bool isClientTooOld() const;
 
     // Validation of the account's information.
     Date lastValidation() const { return date(kVeltoIDAccountLastValidationDateKey); }
@@ -110,9 +111,9 @@ AccountRecord accountRecordOf(const String& name);
 /// The name of the first account with that encDsId; -1 with texts when there is none.
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error = nullptr);
 
-/// Creates or updates the record; a password goes to the keychain, its reference into the record. Marks the
-/// record dirty, ends what the account check has put off, and writes with signal. False, with record and
-/// password as they were, when the keychain refuses the password or the record cannot be stored.
+/// Creates or updates the record; a password goes to the keychain, its reference into the record, and the
+/// server is asked again whether it takes this agent. Marks the record dirty and writes with signal. False, with
+/// record and password as they were, when the keychain refuses the password or the record cannot be stored.
 bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword, const String& encDsId);
 
 /// The password hash of a record: from the keychain, else the record's own. Runs on the caller's thread.

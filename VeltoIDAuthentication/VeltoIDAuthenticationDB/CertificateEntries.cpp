@@ -18,6 +18,32 @@ void applyInfo(Dictionary& entry, const Dictionary& info) {
                      info.string(kVeltoIDCertificateSerialNumberKey));
 }
 
+CertificateEntry entryOf(const Store& store, const String& encDsId) {
+    const Dictionary* found = Store::find(store.certificates, encDsId);
+    return found != nullptr ? CertificateEntry(encDsId, *found) : CertificateEntry();
+}
+
+/// Only a significant change marks the entry and notifies.
+bool setValues(Store& store, const String& encDsId, const Dictionary& values, Notify notify) {
+    const Dictionary* existing = Store::find(store.certificates, encDsId);
+    if (existing == nullptr) return false;
+    Dictionary entry = *existing;
+    bool changed = false;
+    bool isMarked = false;
+    bool significant = false;
+    for (const auto& [key, value] : values) {
+        if (!database::change(entry, key, value)) continue;
+        changed = true;
+        isMarked = isMarked || key.view() == kVeltoIDDirtyKey;
+        significant = significant || (key.view() != kVeltoIDDirtyKey &&
+                                      key.view() != kVeltoIDCertificateModificationDateKey);
+    }
+    if (!changed) return true;
+    entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));
+    if (notify == Notify::Yes && !isMarked) entry.set(kVeltoIDDirtyKey, Value::boolean(true));
+    return store.set(&Store::certificates, encDsId, entry, significant ? notify : Notify::No);
+}
+
 }  // namespace
 
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
@@ -51,19 +77,22 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
 
 bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
                                     Notify notify) {
-    if (!encDsId || !key) return false;
-    return database::perform([&](Store& store) {
-        const Dictionary* existing = Store::find(store.certificates, encDsId);
-        if (existing == nullptr) return false;
-        Dictionary entry = *existing;
-        if (!database::change(entry, key, value)) return true;
+    if (!key) return false;
+    return __VeltoIDDBSetCertificateValues(encDsId, {{key.view(), value.isAbsent() ? Value::null() : value}},
+                                           notify);
+}
 
-        const bool isMark = key.view() == kVeltoIDDirtyKey;
-        entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));
-        if (isMark) notify = Notify::No;
-        if (notify == Notify::Yes) entry.set(kVeltoIDDirtyKey, Value::boolean(true));
-        if (key.view() == kVeltoIDCertificateModificationDateKey) notify = Notify::No;
-        return store.set(&Store::certificates, encDsId, entry, notify);
+bool __VeltoIDDBSetCertificateValues(const String& encDsId, const Dictionary& values, Notify notify) {
+    if (!encDsId) return false;
+    return database::perform([&](Store& store) { return setValues(store, encDsId, values, notify); });
+}
+
+bool __VeltoIDDBSetCertificateValues(const CertificateEntry& examined, const Dictionary& values,
+                                     Notify notify) {
+    if (!examined.exists()) return false;
+    return database::perform([&](Store& store) {
+        return examined.isSameCertificateAs(entryOf(store, examined.encDsId())) &&
+               setValues(store, examined.encDsId(), values, notify);
     });
 }
 
@@ -75,10 +104,7 @@ bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* ent
 }
 
 CertificateEntry certificateEntryOf(const String& encDsId) {
-    return database::perform([&](const Store& store) {
-        const Dictionary* found = Store::find(store.certificates, encDsId);
-        return found != nullptr ? CertificateEntry(encDsId, *found) : CertificateEntry();
-    });
+    return database::perform([&](const Store& store) { return entryOf(store, encDsId); });
 }
 
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {

@@ -44,6 +44,12 @@ class CertificateEntry : Dictionary {
     Date lastValidationAttempt() const { return date(kVeltoIDCertificateLastValidationAttemptDateKey); }
     bool isDirty() const { return boolean(kVeltoIDDirtyKey).value_or(false); }
 
+    /// Whether nothing has taken the place of this certificate, or of none, by then.
+    bool isSameCertificateAs(const CertificateEntry& later) const {
+        return encDsId_ == later.encDsId_ && serialNumber() == later.serialNumber() &&
+               reference() == later.reference() && privateKeyReference() == later.privateKeyReference();
+    }
+
   private:
     bool has(std::string_view status) const {
         return (*this)[kVeltoIDCertificateStatusKey].asText() == status;
@@ -67,6 +73,15 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
 /// dirty when it notifies, and is written. False without encDsId, key or entry.
 bool __VeltoIDDBSetCertificateValue(const String& encDsId, const String& key, const Value& value,
                                     Notify notify = Notify::Yes);
+
+/// The same for several keys at once.
+bool __VeltoIDDBSetCertificateValues(const String& encDsId, const Dictionary& values,
+                                     Notify notify = Notify::Yes);
+
+/// The same while the encDsId still has this certificate: what was learnt of one is not said of its
+/// successor.
+bool __VeltoIDDBSetCertificateValues(const CertificateEntry& examined, const Dictionary& values,
+                                     Notify notify = Notify::Yes);
 
 /// True and a copy of the entry when there is one.
 bool __VeltoIDDBCopyCertificateInfo(const String& encDsId, CertificateEntry* entry);

@@ -60,10 +60,12 @@ void disable(const AccountRecord& record) {
 }
 
 /// The certificate has just been evaluated and is good.
-void noteValidation(const String& encDsId) {
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                   Value::date(platform::now()), Notify::No);
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDDirtyKey, Value::boolean(false), Notify::No);
+void noteValidation(const CertificateEntry& examined) {
+    __VeltoIDDBSetCertificateValues(
+        examined,
+        {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now())},
+         {kVeltoIDDirtyKey, Value::boolean(false)}},
+        Notify::No);
 }
 
 /// What is tried next after an attempt that failed.
@@ -82,23 +84,33 @@ Dictionary laterAttempt(const AccountRecord& record) {
 /// What becomes of the certificate that the account has: one that has expired or was revoked is removed.
 enum class OldCertificate { Keep, Remove };
 
+/// What was examined, and which requests had been made by then.
+struct Examined {
+    CertificateEntry certificate;
+    RequestsSeen requests = 0;
+};
+
 /// Asks for a new certificate, unless it is not time yet. The old one is removed first, or else the next
-/// attempt is planned first.
-void renewCertificateForAccount(const String& accountName, const String& encDsId, const Dictionary& options,
-                                OldCertificate old) {
+/// attempt is planned first; another one, that somebody has got meanwhile, is left alone.
+void renewCertificateForAccount(const String& accountName, const Examined& examined,
+                                const Dictionary& options, OldCertificate old) {
     if (old == OldCertificate::Remove) {
+        if (!discardExaminedCertificate(OwnershipLock(), examined.certificate)) return;
         VELTOID_LOG(kNotice, "Removing certificate for Velto ID ", describeAccountForLog(accountName),
-                    " dsID=", describeValue(encDsId), " because it has expired or been revoked.");
-        discardCertificate(OwnershipLock(), encDsId);
+                    " dsID=", describeValue(examined.certificate.encDsId()),
+                    " because it has expired or been revoked.");
     } else {
         const double interval = metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey,
                                              kRenewalInterval, UnreadableInterval::Zero);
-        __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateNextRenewalAttemptDateKey,
-                                       Value::date(platform::now() + interval), Notify::No);
+        __VeltoIDDBSetCertificateValues(
+            examined.certificate,
+            {{kVeltoIDCertificateNextRenewalAttemptDateKey, Value::date(platform::now() + interval)}},
+            Notify::No);
     }
     const auto next = nextRequestDate(accountRecordOf(accountName));
     if (!next || platform::now() >= *next)
-        __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, nullptr);
+        __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, nullptr, nullptr,
+                                                      examined.requests);
 }
 
 }  // namespace
@@ -106,7 +118,7 @@ void renewCertificateForAccount(const String& accountName, const String& encDsId
 void checkAccount(const AccountRecord& record) {
     const Dictionary options = {{option::kCheckNetwork, Value::boolean(true)}};
     const String& accountName = record.accountName();
-    const String encDsId = record.encDsId();
+    const Examined examined{certificateEntryOf(record.encDsId()), requestsSeen(accountName)};
     switch (checkAccountAndDetermineNextAction(accountName, options)) {
         case NoEncodedDSID:
             return __VeltoIDDoFetchEncodedDSIDForVeltoID(accountName, options);
@@ -116,13 +128,13 @@ void checkAccount(const AccountRecord& record) {
             return disable(record);
         case CertificateRevoked:
         case CertificateExpired:
-            return renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Remove);
+            return renewCertificateForAccount(accountName, examined, options, OldCertificate::Remove);
         case NoCertificate:
         case CertificateShouldBeRenewed:
         case CertificateMustBeRenewed:
-            return renewCertificateForAccount(accountName, encDsId, options, OldCertificate::Keep);
+            return renewCertificateForAccount(accountName, examined, options, OldCertificate::Keep);
         case CertificateOK:
-            return noteValidation(encDsId);
+            return noteValidation(examined.certificate);
         case ValidationRecordNeedsToBeUpdated:
             return fetchValidationRecordForAccount(record, options);
         case CertificatePending:

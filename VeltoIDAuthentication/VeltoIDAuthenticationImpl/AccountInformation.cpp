@@ -19,6 +19,7 @@
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/Methods.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/SignIn.h"
@@ -125,9 +126,10 @@ class InformationRequest {
 
     bool fetch(VeltoIDAuthenticationSessionInfo& session) {
         Dictionary result;
+        const CertificateEntry asked = certificateEntryOf(encDsId_);
         if (!_VeltoIDSessionDoGetMyInfo(session, encDsId_, fetchParameters(), options_, &result, &held_))
             return known_ && __VeltoIDDBCopyVeltoIDAccount(name_, &record_);
-        updateAccountWithGetMyInfoResult(name_, result);
+        updateAccountWithGetMyInfoResult(name_, result, asked);
         return __VeltoIDDBCopyVeltoIDAccount(name_, &record_, &held_);
     }
 
@@ -151,21 +153,23 @@ class InformationRequest {
 };
 
 /// The server's last word on the certificate goes into the certificate entry.
-void applyCertificateValidity(const String& accountName, const Dictionary& answer) {
+void applyCertificateValidity(const String& accountName, const Dictionary& answer,
+                              const std::optional<CertificateEntry>& asked) {
     const Value& isValid = answer[kVeltoIDAccountCertificateIsValidKey];
     if (isValid.isAbsent()) return;
     const String encDsId = answer.string(kVeltoIDAccountDSIDKey);
+    const CertificateEntry entry = asked ? *asked : certificateEntryOf(encDsId);
     if (isValid.asBoolean().value_or(false)) {
-        __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                       Value::date(platform::now()));
+        __VeltoIDDBSetCertificateValues(
+            entry, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now())}});
         return;
     }
     VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice, "Marking certificate for Velto ID ",
                      accountName, " dsID=", describeValue(encDsId),
                      "as invalid because the server said CertificateIsValid = false. (", isValid);
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid);
-    __VeltoIDDBSetCertificateValue(encDsId, kVeltoIDCertificateExpirationDateKey,
-                                   Value::date(platform::now()));
+    __VeltoIDDBSetCertificateValues(entry,
+                                    {{kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid},
+                                     {kVeltoIDCertificateExpirationDateKey, Value::date(platform::now())}});
 }
 
 bool bothPresentAndDifferent(const Value& before, const Value& after) {
@@ -257,14 +261,15 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
     return failWith(error, request.error().value_or(VELTOID_ERROR(identity_error::kUnknown)));
 }
 
-void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer) {
+void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer,
+                                      const std::optional<CertificateEntry>& asked) {
     const AccountRecord before = accountRecordOf(accountName);
-    Dictionary values = answer;
+    Dictionary values = recordValuesFromServer(accountName, answer);
     values.set(kVeltoIDAccountLastValidationDateKey, Value::date(platform::now()));
     // Records keep the list of all addresses under their own name for it.
     values.set(kVeltoIDAccountEmailAddressesKey, answer[message::kAllEmails]);
     values.remove(message::kAllEmails);
-    applyCertificateValidity(accountName, answer);
+    applyCertificateValidity(accountName, answer, asked);
 
     const bool hasOtherRecord = answer.contains(kVeltoIDAccountValidationRecordDataKey) &&
                                 applyValidationRecord(before, answer, values);

@@ -2,8 +2,11 @@
 // from the server; and its certificate.
 #pragma once
 
+#include <optional>
+
 #include "Values/Error.h"
 #include "Values/Value.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
 namespace veltoid {
 
@@ -24,8 +27,10 @@ bool __VeltoIDDoGetMyInfo(const String& accountName, const Dictionary& options, 
                           ErrorOut error = nullptr);
 
 /// Applies the server's answer to the account's record and certificate entry, and posts the change
-/// notification when something that clients see changed.
-void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer);
+/// notification when something that clients see changed. `asked`: the certificate that the server was asked
+/// about, if any; what it says is not said of another one that the account has got meanwhile.
+void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionary& answer,
+                                      const std::optional<CertificateEntry>& asked = {});
 
 /// The certificate entry of the account, or of the encDsId when no account is named, as far as it is known:
 /// "encDsId", "CertStatus", "CertType", "SerialNumber", "Expires", "CreationDate", "ModificationDate", and

@@ -79,14 +79,15 @@ AddedAccount readd(const String& accountName) {
     return added;
 }
 
-AddedAccount addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options) {
+AddedAccount addAnew(const String& accountName, const String& hashedPassword, const Dictionary& options,
+                     RequestsSeen seen) {
     std::optional<Error> held;
     String encDsId;
     bool proceeds = getBool(&options, option::kDoNotCheckPassword, false) ||
                     signIn(accountName, hashedPassword, options, &encDsId, &held);
     if (proceeds && createsRequest(encDsId, options)) {
         encDsId = nullptr;
-        proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held);
+        proceeds = __VeltoIDDoCreateCertificateRequestForVeltoID(accountName, options, &encDsId, &held, seen);
     }
     AddedAccount added = proceeds ? storedAccount(accountName, &held) : AddedAccount{encDsId, {}, {}};
     VELTOID_LOG_FROM("__VeltoIDDoAddVeltoID", kNotice, "VeltoIDAuth: Adding account ", accountName, " ",
@@ -146,11 +147,12 @@ bool waitForCertificate(const String& accountName, double duration, const Adding
 
 bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPassword, const Dictionary& options,
                            AddedAccount* added, ErrorOut error) {
+    const RequestsSeen seen = requestsSeen(accountName);
     if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr))
         return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
     AddedAccount outcome = isAlreadyOnItsWay(accountRecordOf(accountName), options)
                                ? readd(accountName)
-                               : addAnew(accountName, hashedPassword, options);
+                               : addAnew(accountName, hashedPassword, options, seen);
     platform::Notifications::shared().post(kVeltoIDAccountAddedOrRemovedNotification);
     fill(added, std::move(outcome));
     return true;

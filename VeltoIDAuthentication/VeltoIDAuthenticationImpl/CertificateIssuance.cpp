@@ -1,9 +1,15 @@
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
+#include <map>
+#include <memory>
+#include <string>
+
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Platform/runtime/Clock.h"
+#include "Platform/runtime/Lifetime.h"
+#include "Platform/runtime/WorkQueue.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
@@ -35,61 +41,103 @@ bool isPending(const Dictionary& result) {
     return result.string(kVeltoIDCertificateStatusKey) == kVeltoIDCertificateStatusPending;
 }
 
+/// The account's record, while it is still the account that it was then.
+std::optional<AccountRecord> recordOfSame(const AccountRecord& then) {
+    AccountRecord now = accountRecordOf(then.accountName());
+    if (!now.accountName() || now.uuid() != then.uuid()) return std::nullopt;
+    return now;
+}
+
+Error overtakenError() {
+    return makeError(
+        identity_error::kUnknown,
+        {"The account was forgotten, or has begun another request, while the server was asked.", {}, {}}, {},
+        kRequestFunction, __FILE_NAME__, __LINE__);
+}
+
+/// A request, who makes it, and what has come of it.
+struct Request {
+    const RequestsSeen number;
+    const AccountRecord record;
+    const String password;
+
+    bool isOver = false;
+    bool succeeded = false;
+    String encDsId = {};
+    std::optional<Error> error = {};
+    /// For those who wait for the outcome; each passes the signal on.
+    platform::Semaphore end = platform::Semaphore();
+};
+
+/// The last request of each account. Under the ownership lock only; outcomes do not change any more once a
+/// request is over.
+struct Requests {
+    RequestsSeen lastNumber = 0;
+    std::map<std::string, std::shared_ptr<Request>> last;
+};
+
+Requests& requests() { return platform::Lifetime::current().state<Requests>(); }
+
+std::shared_ptr<Request> lastRequest(const OwnershipLock& /*ownership*/, const String& accountName) {
+    const auto found = requests().last.find(accountName.text());
+    return found != requests().last.end() ? found->second : nullptr;
+}
+
+RequestsSeen seenBy(const OwnershipLock& ownership, const String& accountName) {
+    const auto last = lastRequest(ownership, accountName);
+    if (!last) return 0;
+    return last->isOver ? last->number : last->number - 1;
+}
+
+/// Puts a new request into the place of the account's last one; those of accounts that are gone are
+/// forgotten.
+std::shared_ptr<Request> noteRequest(const AccountRecord& record, const String& password) {
+    Requests& all = requests();
+    std::erase_if(all.last, [](const auto& entry) { return !recordOfSame(entry.second->record); });
+    const auto request = std::make_shared<Request>(Request{++all.lastNumber, record, password});
+    all.last[record.accountName().text()] = request;
+    return request;
+}
+
 /// One certificate signing request, from the key to what the server answered at once.
 class SigningRequest {
   public:
-    SigningRequest(const OwnershipLock& ownership, const String& accountName, const Dictionary& options)
-        : ownership_(ownership), accountName_(accountName), options_(options) {}
+    SigningRequest(Request& request, const Dictionary& options)
+        : request_(request), accountName_(request.record.accountName()), options_(options) {}
 
-    bool run(String* encDsId, ErrorOut error) {
-        const bool succeeded = perform();
-        if (encDsId_) fill(encDsId, encDsId_);
-        return succeeded || fail(accountName_, password_, held_, error);
+    bool run() {
+        const Session session = __VeltoIDSessionDoCreateSession(accountName_, request_.password, options_,
+                                                                &request_.encDsId, nullptr, &held_);
+        return (session && request_.encDsId && adoptEncDsId() && makeKeys() && send(*session)) ||
+               fail(accountName_, request_.password, held_, &request_.error);
     }
 
   private:
-    bool perform() {
-        AccountRecord record;
-        if (!__VeltoIDDBCopyVeltoIDAccount(accountName_, &record, &held_) ||
-            !admitCertificateRequest(record, &held_))
-            return false;
-        password_ = __VeltoIDDBCopyHashedPassword(record);
-        VELTOID_LOG_FROM(kRequestFunction, kNotice, "VeltoIDAuth: Creating CSR for ", accountName_, ".");
-        begin(record);
-        const Session session =
-            __VeltoIDSessionDoCreateSession(accountName_, password_, options_, &encDsId_, nullptr, &held_);
-        if (!session) return false;
-        const bool succeeded = encDsId_ && adoptEncDsId(record) && makeKeys() && send(*session);
-        if (!succeeded) discardKeys();
-        return succeeded;
+    /// Whether the answer is still for this account and its last request.
+    bool isCurrent(const OwnershipLock& ownership) {
+        if (recordOfSame(request_.record) && lastRequest(ownership, accountName_).get() == &request_)
+            return true;
+        VELTOID_LOG_FROM(kRequestFunction, kNotice, "The server's answer to a certificate request of ",
+                         accountName_,
+                         " is dropped: the account was forgotten meanwhile, or has begun another one.");
+        return failWith(&held_, overtakenError());
     }
 
-    /// The request takes the place of one that was pending.
-    void begin(const AccountRecord& record) {
-        setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now())},
-                     {kVeltoIDAccountCertificateTokenKey, Value::null()},
-                     {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
-                     {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()}},
-                    Notify::No);
-        if (!record.requestGenerationInterval())
-            setInRecord(
-                {{kVeltoIDAccountCSRGenerationIntervalKey, Value::real(kVeltoIDCSRGenerationInterval)}});
-        discardPendingKey(ownership_, accountName_);
-    }
-
-    bool adoptEncDsId(const AccountRecord& record) {
-        return record.encDsId() == encDsId_ ||
-               __VeltoIDDBCreateVeltoIDAccount(accountName_, nullptr, encDsId_) ||
-               failWith(&held_, statusCodeError());
+    bool adoptEncDsId() {
+        const OwnershipLock ownership;
+        return isCurrent(ownership) && (request_.record.encDsId() == request_.encDsId ||
+                                        setInRecord({{kVeltoIDAccountDSIDKey, request_.encDsId}}) ||
+                                        failWith(&held_, statusCodeError()));
     }
 
     bool makeKeys() {
+        Key publicKey;
         const int32_t status =
-            createKeyPairAndCertificateRequest(accountName_, &request_, &publicKey_, &privateKey_);
-        if (status == 0 && request_ && privateKey_) return true;
+            createKeyPairAndCertificateRequest(accountName_, &text_, &publicKey, &privateKey_);
+        if (status == 0 && text_ && privateKey_) return true;
         VELTOID_LOG_FROM(kRequestFunction, kError,
                          "Failed to generate a CSR or privateKey for the dsID, err=", status, " ",
-                         describeValue(request_), " ", privateKey_.description());
+                         describeValue(text_), " ", privateKey_.description());
         return failWith(&held_, statusCodeError());
     }
 
@@ -98,9 +146,17 @@ class SigningRequest {
         noteCertificateRequest(accountName_);
         String token;
         CertificateAnswer answer;
-        if (!__VeltoIDSessionDoSendCSR(session, encDsId_, request_, options_, &token, &answer, &held_))
+        if (!__VeltoIDSessionDoSendCSR(session, request_.encDsId, text_, options_, &token, &answer, &held_))
             return false;
+        const OwnershipLock ownership;
+        if (!isCurrent(ownership)) return false;
         setInRecord({{kVeltoIDAccountCSRCreationDateKey, Value::date(sent)}}, Notify::No);
+        if (apply(ownership, token, answer)) return true;
+        discardPendingKey(ownership, accountName_);
+        return false;
+    }
+
+    bool apply(const OwnershipLock& ownership, const String& token, const CertificateAnswer& answer) {
         if (token.view().size() > kMaxCertificateTokenBytes) {
             VELTOID_LOG_FROM(kRequestFunction, kError, "The server's certificate token is refused: it has ",
                              token.view().size(), " bytes.");
@@ -108,19 +164,22 @@ class SigningRequest {
         }
         if (!keepPrivateKey()) return false;
         if (answer.result && !(token && isPending(*answer.result)))
-            return updateAccountWithCertificateResult(ownership_, accountName_, encDsId_, answer, &held_);
+            return updateAccountWithCertificateResult(ownership, accountName_, request_.encDsId, answer,
+                                                      &held_);
         return token ? keepToken(token, answer.delay) : true;
     }
 
     bool keepPrivateKey() {
         Data reference;
-        if (!copyPersistentRefForKey(privateKey_, &reference) &&
-            !addKeyToKeychain(accountName_, kPrivateKeyKind, privateKey_, &reference)) {
+        if (!addKeyToKeychain(accountName_, kPrivateKeyKind, privateKey_, &reference)) {
             VELTOID_LOG_FROM(kRequestFunction, kError,
                              "FAILED adding public or private key to keychain, so ");
             return false;
         }
-        return setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference}}, Notify::No);
+        if (setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference}}, Notify::No))
+            return true;
+        removeKeyFromKeychainGivenPersistentRef(reference);
+        return false;
     }
 
     bool keepToken(const String& token, const Value& delay) {
@@ -140,28 +199,54 @@ class SigningRequest {
         return stored;
     }
 
-    /// Nothing of a failed attempt stays in the keychain.
-    void discardKeys() {
-        discardPendingKey(ownership_, accountName_);
-        for (const Key* key : {&publicKey_, &privateKey_})
-            if (Data reference; copyPersistentRefForKey(*key, &reference))
-                removeKeyFromKeychainGivenPersistentRef(reference);
-    }
-
     bool setInRecord(const Dictionary& values, Notify notify = Notify::Yes) {
         return __VeltoIDDBSetAccountValues(accountName_, values, notify);
     }
 
-    const OwnershipLock& ownership_;
-    const String& accountName_;
+    Request& request_;
+    const String accountName_;
     const Dictionary& options_;
-    String password_;
-    String encDsId_;
-    String request_;
-    Key publicKey_;
+    String text_;
     Key privateKey_;
     std::optional<Error> held_;
 };
+
+/// Begins a request, which takes the place of one that was pending. None, with the error, when that is not
+/// permitted.
+std::shared_ptr<Request> beginRequest(const OwnershipLock& ownership, const AccountRecord& record,
+                                      const String& password, ErrorOut error) {
+    if (!admitCertificateRequest(record, error)) return nullptr;
+    VELTOID_LOG_FROM(kRequestFunction, kNotice, "VeltoIDAuth: Creating CSR for ", record.accountName(), ".");
+    __VeltoIDDBSetAccountValues(record.accountName(),
+                                {{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now())},
+                                 {kVeltoIDAccountCertificateTokenKey, Value::null()},
+                                 {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
+                                 {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()}},
+                                Notify::No);
+    if (!record.requestGenerationInterval())
+        __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCSRGenerationIntervalKey,
+                                   Value::real(kVeltoIDCSRGenerationInterval));
+    discardPendingKey(ownership, record.accountName());
+    return noteRequest(record, password);
+}
+
+/// The request whose outcome is the caller's, and whether it is the caller who has to make it.
+struct Turn {
+    std::shared_ptr<Request> request;
+    bool isOurs = false;
+};
+
+Turn takeTurn(const String& accountName, std::optional<RequestsSeen> seen, ErrorOut error) {
+    const OwnershipLock ownership;
+    AccountRecord record;
+    if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, error)) return {};
+    const String password = __VeltoIDDBCopyHashedPassword(record);
+    auto last = lastRequest(ownership, accountName);
+    if (last && last->record.uuid() == record.uuid() && last->password == password &&
+        last->number > seen.value_or(seenBy(ownership, accountName)))
+        return {std::move(last), false};
+    return {beginRequest(ownership, record, password, error), true};
+}
 
 void putOffFetchAfterFailedSignIn(const AccountRecord& record) {
     const double delta = storedFetchDelta(record).value_or(kDefaultDelayAfterFailedSignIn);
@@ -173,41 +258,74 @@ void putOffFetchAfterFailedSignIn(const AccountRecord& record) {
         Notify::No);
 }
 
-/// Asks with the token and applies the answer.
-bool fetch(const OwnershipLock& ownership, VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
-           const String& token, const Dictionary& options, std::optional<Error>* held) {
-    CertificateAnswer answer;
-    if (!__VeltoIDSessionDoFetchCSRResult(session, encDsId, token, options, &answer, held)) {
-        VELTOID_LOG_FROM("__VeltoIDDoFetchCertificateForVeltoID", kNotice,
-                         "Failed while fetching result for certificate token ", token,
-                         ", error=", *held ? Value(**held) : Value(), " so discarding it.");
-        __VeltoIDSessionDoCompleteCertificate(session, encDsId, token, options, nullptr);
-        return false;
+/// One question for the certificate that a token stands for.
+class Fetch {
+  public:
+    Fetch(const AccountRecord& record, const Dictionary& options)
+        : record_(record), token_(record.certificateToken()), options_(options) {}
+
+    bool run(VeltoIDAuthenticationSessionInfo& session, const String& encDsId, std::optional<Error>* held) {
+        CertificateAnswer answer;
+        if (!__VeltoIDSessionDoFetchCSRResult(session, encDsId, token_, options_, &answer, held)) {
+            VELTOID_LOG_FROM("__VeltoIDDoFetchCertificateForVeltoID", kNotice,
+                             "Failed while fetching result for certificate token ", token_,
+                             ", error=", *held ? Value(**held) : Value(), " so discarding it.");
+            __VeltoIDSessionDoCompleteCertificate(session, encDsId, token_, options_, nullptr);
+            return false;
+        }
+        {
+            const OwnershipLock ownership;
+            if (!isStillAsked()) return !recordOfSame(record_) ? failWith(held, overtakenError()) : true;
+            if (!updateAccountWithCertificateResult(ownership, record_.accountName(), encDsId, answer, held))
+                return false;
+        }
+        if (isPending(*answer.result)) return failWith(held, VELTOID_ERROR(identity_error::kNotYet));
+        __VeltoIDSessionDoCompleteCertificate(session, encDsId, token_, options_, nullptr);
+        return true;
     }
-    if (!updateAccountWithCertificateResult(ownership, session.fAccountName, encDsId, answer, held))
-        return false;
-    if (isPending(*answer.result)) return failWith(held, VELTOID_ERROR(identity_error::kNotYet));
-    __VeltoIDSessionDoCompleteCertificate(session, encDsId, token, options, nullptr);
-    return true;
-}
+
+  private:
+    /// Whether the account still waits for what the token stands for. Under the ownership lock.
+    bool isStillAsked() const {
+        const auto now = recordOfSame(record_);
+        return now && now->certificateToken() == token_;
+    }
+
+    const AccountRecord& record_;
+    const String token_;
+    const Dictionary& options_;
+};
 
 }  // namespace
 
+RequestsSeen requestsSeen(const String& accountName) { return seenBy(OwnershipLock(), accountName); }
+
 bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
-                                                   String* encDsId, ErrorOut error) {
-    const OwnershipLock ownership;
-    return SigningRequest(ownership, accountName, options).run(encDsId, error);
+                                                   String* encDsId, ErrorOut error,
+                                                   std::optional<RequestsSeen> seen) {
+    std::optional<Error> held;
+    const auto [request, isOurs] = takeTurn(accountName, seen, &held);
+    if (!request) return fail(accountName, nullptr, held, error);
+    if (isOurs) {
+        const bool succeeded = SigningRequest(*request, options).run();
+        const OwnershipLock ownership;
+        request->succeeded = succeeded;
+        request->isOver = true;
+    } else {
+        request->end.wait();
+    }
+    request->end.signal();
+    if (request->encDsId) fill(encDsId, request->encDsId);
+    return request->succeeded || failWith(error, *request->error);
 }
 
 bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,
                                            const Dictionary& options, ErrorOut error) {
-    const OwnershipLock ownership;
     std::optional<Error> held;
     AccountRecord record;
     if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record, &held))
         return fail(accountName, nullptr, held, error);
-    const String token = record.certificateToken();
-    if (!token) return true;
+    if (!record.certificateToken()) return true;
     if (time == FetchTime::WhenDue && !AccountSchedule(record, {}, options).isDue(DueReason::PendingFetch)) {
         const Dictionary information = {{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
                                          Value::date(record.nextCertificateFetch().value_or(0))}};
@@ -222,8 +340,7 @@ bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime 
         putOffFetchAfterFailedSignIn(record);
         return true;
     }
-    return fetch(ownership, *session, encDsId, token, options, &held) ||
-           fail(accountName, password, held, error);
+    return Fetch(record, options).run(*session, encDsId, &held) || fail(accountName, password, held, error);
 }
 
 void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dictionary& options,

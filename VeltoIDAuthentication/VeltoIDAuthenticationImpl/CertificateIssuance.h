@@ -8,7 +8,9 @@
 // "CertificatePrivateKeyReference" (the pending request's key). When the certificate is there, all of it
 // goes, and the entry has certificate, intermediate certificate and key.
 //
-// All operations run on the caller's queue and block while the server is asked (up to 5 seconds a call).
+// All operations run on the caller's queue and block while the server is asked (up to 5 seconds a call). The
+// server is asked without any lock: an answer that comes when the account has been forgotten, or has begun
+// another request, is dropped, and what was made for it with it.
 #pragma once
 
 #include "Values/Error.h"
@@ -27,12 +29,21 @@ inline constexpr double kVeltoIDCSRRetryDelay = 3'600;
 /// Longer tokens are refused: they would be stored and logged.
 inline constexpr size_t kMaxCertificateTokenBytes = size_t{16} << 10U;
 
+/// What has become of an account's requests so far, for who decides now whether one is to be sent later.
+using RequestsSeen = uint64_t;
+RequestsSeen requestsSeen(const String& accountName);
+
 /// Generates a key pair, sends a certificate signing request and applies the answer: the certificate, a
 /// token, or a refusal. Keys made for an attempt that fails are deleted. The error (also passed to
 /// handleServerError) is the session's, else one of the status-code domain or -100. The encDsId is handed out
 /// as far as it is known.
+///
+/// Of several callers at once, one sends the request; the others wait for its outcome, which is theirs too.
+/// So is the outcome of a request that somebody else has made since `seen` (without one: since the call)
+/// with the same password.
 bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, const Dictionary& options,
-                                                   String* encDsId, ErrorOut error = nullptr);
+                                                   String* encDsId, ErrorOut error = nullptr,
+                                                   std::optional<RequestsSeen> seen = {});
 
 /// Applies what the server says of the request: by "CertStatus" the certificate is stored, the next fetch put
 /// off, the token given up, or, for anything else, the token kept until it expires. True when the certificate

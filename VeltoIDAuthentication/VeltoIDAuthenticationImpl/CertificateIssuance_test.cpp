@@ -2,8 +2,13 @@
 // is asked to, and simulated time.
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 
+#include <atomic>
+#include <thread>
+
 #include "Certificates/CertificateRequest.h"
 #include "TestSupport/CertificateFixture.h"
+#include "TestSupport/SideBySide.h"
+#include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
@@ -505,6 +510,189 @@ TEST_F(IssuanceTest, AnAccountThatAsksOverAndOverIsHeldUp) {
     EXPECT_EQ(requestsHeldUntil({kName, record()}), std::nullopt);
     setValue("CertificateRequestsHeldUntil", date(1e9));
     EXPECT_TRUE(request()) << "no clock that was right has noted that";
+}
+
+// What follows happens while the server answers, on the thread that waits for the answer.
+
+TEST_F(IssuanceTest, AnAnswerForAnAccountThatIsGoneIsDropped) {
+    const std::pair<const char*, std::function<void()>> events[] = {
+        {"forgotten", [] { EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {})); }},
+        {"forgotten and added again",
+         [] {
+             EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+             createAccount("d1");
+         }},
+    };
+    const Dictionary token = {{kToken, "t1"}};
+    const std::tuple<const char*, const char*, std::function<Dictionary()>> answers[] = {
+        {"sign-in", "authenticate",
+         [] {
+             return Dictionary{{"encDsId", "d1"}};
+         }},
+        {"certificate", "createCert",
+         [this] {
+             return Dictionary{{"dsCert", issued()}};
+         }},
+        {"token", "createCert", [&] { return token; }},
+        {"fetched", "fetchCert",
+         [this] {
+             return Dictionary{{"dsCert", issued()}};
+         }},
+    };
+    for (const auto& [event, happens] : events)
+        for (const auto& [answer, method, reply] : answers) {
+            SCOPED_TRACE(std::string(event) + " before the " + answer);
+            createAccount("d1");
+            server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
+            const bool isFetch = method == std::string("fetchCert");
+            if (isFetch) {
+                answerRequests(token);
+                ASSERT_TRUE(request());
+            }
+            server_.answerWith(method, [&, &happens = happens, &reply = reply](const Dictionary& given) {
+                if (const String text = given.string("CSR"))
+                    requested_ = testing_support::readRequest(text.text()).publicKey;
+                happens();
+                return reply();
+            });
+            (void)server_.take();
+            EXPECT_FALSE(isFetch ? fetch(FetchTime::AtOnce) : request());
+            EXPECT_EQ(takeCode(), -100);
+            EXPECT_EQ(keys() + certificates(), 0U);
+            EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
+            EXPECT_EQ(stored({kToken, kFetchDate, kKeyReference, kCreated, kGenerated}), kNone);
+            EXPECT_EQ(record().empty(), event == std::string("forgotten"));
+            EXPECT_EQ(server_.takeMethods().find("downloadCertComplete"), std::string::npos);
+            __VeltoIDForgetVeltoID(kName, {});
+        }
+}
+
+TEST_F(IssuanceTest, OneRequestAnswersAllWhoAskedForOneAtOnce) {
+    const std::tuple<const char*, std::function<Dictionary()>, bool> answers[] = {
+        {"a token",
+         [] {
+             return Dictionary{{kToken, "t1"}};
+         },
+         true},
+        {"a certificate",
+         [this] {
+             return Dictionary{{"dsCert", issued()}};
+         },
+         true},
+        {"a refusal",
+         [] {
+             return Dictionary{{"dsCert", Dictionary{{"CertStatus", "FAILED"}}}};
+         },
+         false},
+    };
+    for (const auto& [what, reply, succeeds] : answers) {
+        SCOPED_TRACE(what);
+        clock_.advanceBy(3'600);
+        onRequest(reply);
+        const auto seen = requestsSeen(kName);
+        std::atomic<int> successes = 0;
+        (void)server_.take();
+        platform::sideBySide(4, [&](int) {
+            String encDsId;
+            std::optional<Error> error;
+            if (__VeltoIDDoCreateCertificateRequestForVeltoID(kName, {}, &encDsId, &error, seen))
+                ++successes;
+            else
+                EXPECT_EQ(error->code, -100);
+            EXPECT_EQ(encDsId, "d1");
+        });
+        EXPECT_EQ(successes, succeeds ? 4 : 0);
+        EXPECT_EQ(server_.takeMethods(), "authenticate createCert");
+    }
+    EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+    answerRequests({{kToken, "t2"}});
+    platform::sideBySide(4, [&](int) {
+        AddedAccount added;
+        EXPECT_TRUE(__VeltoIDDoAddVeltoID(kName, kPassword, {{"CreateCSRAsynchronously", kOff}}, &added));
+        EXPECT_EQ(added.encDsId, "d1");
+        ASSERT_TRUE(added.record);
+        EXPECT_EQ(added.record->string(kToken), "t2");
+    });
+    const std::string methods = server_.takeMethods();
+    EXPECT_EQ(methods.find("createCert"), methods.rfind("createCert")) << methods;
+    EXPECT_EQ(keys(), 1U);
+}
+
+TEST_F(IssuanceTest, AnotherPasswordOrAccountHasARequestOfItsOwn) {
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount("other", "hash", nullptr));
+    onRequest([this] {
+        onRequest([] { return Dictionary{{kToken, "t2"}}; });
+        EXPECT_TRUE(__VeltoIDDoCreateCertificateRequestForVeltoID("other", {}, nullptr));
+        return Dictionary{{kToken, "t1"}};
+    });
+    EXPECT_TRUE(request()) << "while that of another account is in work";
+    EXPECT_EQ(record()[kToken], Value("t1"));
+    EXPECT_EQ(__VeltoIDDBCopyAccountValue("other", kToken), Value("t2"));
+    EXPECT_EQ(keys(), 2U);
+
+    std::thread later;
+    onRequest([&] {
+        const auto seen = requestsSeen(kName);
+        EXPECT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, "another password", nullptr));
+        onRequest([] { return Dictionary{{kToken, "t4"}}; });
+        later = std::thread([seen] {
+            EXPECT_TRUE(__VeltoIDDoCreateCertificateRequestForVeltoID(kName, {}, nullptr, nullptr, seen));
+        });
+        while (requestsSeen(kName) == seen) std::this_thread::yield();
+        return Dictionary{{kToken, "t3"}};
+    });
+    EXPECT_FALSE(request()) << "its place was taken";
+    later.join();
+    EXPECT_EQ(record()[kToken], Value("t4"));
+    EXPECT_EQ(keys(), 2U);
+}
+
+TEST_F(IssuanceTest, WhatWasIssuedMeanwhileIsNotWhatWasExamined) {
+    issueAtOnce();
+    ASSERT_TRUE(request());
+    const auto renewed = [this](const char* serialNumber) {
+        const auto pair = platform::generateRSAKeyPair(2048);
+        requested_ = pair->publicKey;
+        Data reference;
+        EXPECT_TRUE(addKeyToKeychain(kName, nullptr, Key::privateKey(pair->privateKey), &reference));
+        setValue(kKeyReference, reference);
+        EXPECT_TRUE(update(issued({{"SerialNumber", serialNumber}})));
+    };
+    const auto isGood = [&](const char* serialNumber) {
+        const CertificateEntry entry = certificateEntryOf("d1");
+        return entry.isIssued() && entry.serialNumber() == serialNumber && entry.expires() > now() &&
+               copyCertificateFromKeychainGivenPersistentRef(entry.reference(), nullptr) &&
+               copyKeyFromKeychainGivenPersistentRef(entry.privateKeyReference(), nullptr);
+    };
+    const Dictionary isInvalid = {{"encDsId", "d1"}, {"CertificateIsValid", kOff}};
+    for (const char* method : {"getMyInfo", "authenticate"}) {
+        SCOPED_TRACE(method);
+        server_.answerWith(method, [&](const Dictionary&) {
+            renewed(method);
+            return isInvalid;
+        });
+        setValue("ForceValidation", kOn);
+        setInEntry({{"Dirty", kOn}});
+        checkAccount({kName, record()});
+        EXPECT_TRUE(isGood(method));
+        server_.answer(method, Dictionary{{"encDsId", "d1"}});
+    }
+    EXPECT_EQ(keys(), 1U);
+    EXPECT_EQ(certificates(), 2U);
+    const CertificateEntry examined = certificateEntryOf("d1");
+    renewed("3");
+    EXPECT_FALSE(discardExaminedCertificate(OwnershipLock(), examined));
+    EXPECT_TRUE(isGood("3"));
+
+    setValue(kToken, "t1");
+    server_.answerWith("fetchCert", [&](const Dictionary&) {
+        renewed("4");
+        return Dictionary{{"dsCert", issued({{"SerialNumber", "5"}})}};
+    });
+    (void)server_.take();
+    EXPECT_TRUE(fetch(FetchTime::AtOnce)) << "somebody else has fetched it";
+    EXPECT_TRUE(isGood("4"));
+    EXPECT_EQ(server_.takeMethods(), "authenticate fetchCert");
 }
 
 }  // namespace

@@ -1,6 +1,7 @@
 // The account engine: adding and forgetting, people and breadcrumbs, passwords, dates.
 #include "TestSupport/EngineFixture.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
@@ -97,6 +98,41 @@ TEST_F(Adding, AnAccountWithItsCertificateOnTheWayIsNotSignedInAgain) {
     setValues({{kToken, "t"}, {"encDsId", kGone}});
     EXPECT_EQ(readd(), "");
     EXPECT_EQ(log_.count(" re-added; failed, "), 1) << "it has no encDsId";
+}
+
+TEST_F(Adding, AnAccountIsKnownByItsOwnNameWhateverItsRecordOrTheServerSays) {
+    for (const Value& entry : {kGone, Value("john@velto.example"), number(1)}) {
+        SCOPED_TRACE(testing::PrintToString(entry));
+        ASSERT_TRUE(add());
+        setValue("VeltoID", entry);
+        Dictionary information;
+        EXPECT_TRUE(__VeltoIDDoGetMyInfo(kName, {{"SkipValidation", kOn}}, &information));
+        EXPECT_EQ(information["VeltoID"], Value(kName));
+        ASSERT_TRUE(add({{"ForceCertificateCreation", kOn}}));
+        EXPECT_EQ(record()["VeltoID"], Value(kName));
+        setValue("VeltoID", entry);
+        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+        EXPECT_TRUE(record().empty());
+    }
+    for (const char* alias : {"JANE@VELTO.EXAMPLE", "someone.else@velto.example"}) {
+        SCOPED_TRACE(alias);
+        server_.answer("getMyInfo",
+                       Dictionary{{"encDsId", "d1"}, {"VeltoID", alias}, {"ValidatedEmail", kEmails}});
+        ASSERT_TRUE(add());
+        const Value uuid = record()["AccountStableUUID"];
+        Dictionary information;
+        EXPECT_TRUE(__VeltoIDDoGetMyInfo(kName, {{"ForceValidation", kOn}}, &information));
+        EXPECT_EQ(information["VeltoID"], Value(kName));
+        EXPECT_EQ(record()["VeltoID"], Value(kName));
+        EXPECT_EQ(record()["ServerVeltoID"], Value(alias));
+        EXPECT_EQ(record()["AccountStableUUID"], uuid);
+        EXPECT_EQ(accountNames(), Array{kName});
+        serverIs(Server::RefusesPassword);
+        EXPECT_FALSE(__VeltoIDDoVerifyPassword(kName, kPassword, {}));
+        EXPECT_FALSE(hasPassword());
+        serverIs(Server::Up);
+        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+    }
 }
 
 // --- Forgetting
@@ -241,14 +277,14 @@ TEST_F(EngineTest, OnlyARefusalTakesThePassword) {
         bool isTaken;
         const char* line;
     } cases[] = {
-        {identityError(-101), kPassword, true, kIncorrect},
-        {identityError(-101), "another hash", false, kIncorrect},
-        {identityError(-101), nullptr, false, kIncorrect},
-        {identityError(-102), kPassword, true, kIncorrect},
-        {identityError(-102), "another hash", true, kIncorrect},
-        {identityError(-105), kPassword, true, "no longer supports this client"},
-        {identityError(-105), "another hash", true, "no longer supports this client"},
-        {identityError(-100), kPassword, false, "removing"},
+        {VELTOID_ERROR(-101), kPassword, true, kIncorrect},
+        {VELTOID_ERROR(-101), "another hash", false, kIncorrect},
+        {VELTOID_ERROR(-101), nullptr, false, kIncorrect},
+        {VELTOID_ERROR(-102), kPassword, true, kIncorrect},
+        {VELTOID_ERROR(-102), "another hash", true, kIncorrect},
+        {VELTOID_ERROR(-105), kPassword, true, "no longer supports this client"},
+        {VELTOID_ERROR(-105), "another hash", true, "no longer supports this client"},
+        {VELTOID_ERROR(-100), kPassword, false, "removing"},
         {Error{kXMLErrorDomain, -101, {}}, kPassword, false, "removing"},
     };
     for (const auto& [error, sentHash, isTaken, line] : cases) {
@@ -305,7 +341,10 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
         {"embargo, expiry", {{kEmbargo, date(99)}}, Dictionary{{"Expires", date(9)}, {kRenewal, date(5)}}, 9},
         {"embargo, no certificate", {{kEmbargo, date(1000)}}, {}, 1000},
         {"embargo is over", {{kEmbargo, date(-1)}, {"ClientTooOld", kOn}}, entry, kFortnight},
-        {"too old", {{"ClientTooOld", kOn}, {"ForceValidation", kOn}}, {}, 3'153'600'000},
+        {"too old",
+         {{"ClientTooOld", kOn}, {"ClientTooOldVersion", Value::real(727.8)}, {"ForceValidation", kOn}},
+         {},
+         3'153'600'000},
         {"an expiry", {}, Dictionary{{"Expires", date(500)}}, 500},
         {"a renewal", {}, Dictionary{{"Expires", date(500)}, {kRenewal, date(400)}}, 400},
         {"a validated certificate", {}, Dictionary{{kValidated, date(-50)}}, kFortnight - 50},

@@ -19,7 +19,8 @@
 namespace veltoid {
 namespace {
 
-/// A semaphore, since simulated time goes on while a task waits for one, but not while it waits for a mutex.
+/// A semaphore, since simulated time goes on while a task waits for one, but not while it waits for a mutex:
+/// the keychain and the database, which are asked under the lock, may wait for a file.
 struct Ownership {
     const platform::Semaphore semaphore{1};
 };
@@ -92,7 +93,8 @@ OwnershipLock::~OwnershipLock() { ownershipSemaphore().signal(); }
 void discardPendingKey(const OwnershipLock& /*ownership*/, const String& accountName) {
     const Data reference = accountRecordOf(accountName).pendingKeyReference();
     if (!reference) return;
-    removeKeyFromKeychainGivenPersistentRef(reference);
+    // An agent that was killed while it stored the certificate has left the reference in both places.
+    if (!isReferredTo(reference)) removeKeyFromKeychainGivenPersistentRef(reference);
     __VeltoIDDBSetAccountValue(accountName, kVeltoIDCertificatePrivateKeyPersistentReferenceKey,
                                Value::null(), Notify::No);
 }
@@ -119,6 +121,12 @@ void discardCertificate(const OwnershipLock& ownership, const String& encDsId, c
     if (!dropped.privateKey)
         kept.set(kVeltoIDCertificatePrivateKeyPersistentReferenceKey, entry.privateKeyReference());
     discardReplacedItems(ownership, entry, {encDsId, kept});
+}
+
+bool discardExaminedCertificate(const OwnershipLock& ownership, const CertificateEntry& examined) {
+    if (!examined.isSameCertificateAs(certificateEntryOf(examined.encDsId()))) return false;
+    discardCertificate(ownership, examined.encDsId());
+    return true;
 }
 
 bool __VeltoIDCleanupAccountsAndCertificates(const Dictionary& /*options*/, ErrorOut /*error*/) {

@@ -3,7 +3,12 @@
 // An item lives as long as a record or certificate entry refers to it: the reference in the record while a
 // request is pending ("CertificatePrivateKeyReference"), the references in the entry afterwards. Code that
 // drops a reference drops the item here. Between the making of an item and the storing of its reference the
-// item would look abandoned, so all of this happens under one lock.
+// item would look abandoned, so both happen under one lock, without letting go of it.
+//
+// Nobody asks the server, or waits for anybody who does, under the lock. What was decided before a server
+// call is therefore looked at again under the lock afterwards: whether the account is still the one that it
+// was, the request still the one that was sent, the certificate still the one that was examined. What is not
+// changes nothing any more.
 #pragma once
 
 #include "Values/Error.h"
@@ -12,8 +17,8 @@
 
 namespace veltoid {
 
-/// Held by operations that make, store or drop key and certificate items, server calls in between included.
-/// Taken before any queue; not recursive.
+/// Held by operations that make, store or drop key and certificate items, for as long as that takes. Taken
+/// before any queue; not recursive.
 class OwnershipLock {
   public:
     OwnershipLock();
@@ -39,6 +44,9 @@ void discardReplacedItems(const OwnershipLock& ownership, const CertificateEntry
 /// Removes the encDsId's certificate entry, if there is one, with its items.
 void discardCertificate(const OwnershipLock& ownership, const String& encDsId,
                         const DroppedItems& dropped = {});
+
+/// The same, unless another certificate has taken the place of the one that was examined; false then.
+bool discardExaminedCertificate(const OwnershipLock& ownership, const CertificateEntry& examined);
 
 /// Removes, with their keychain items, the certificate entries that no account owns, that are invalid, or
 /// that lack certificate or key; every password, key and certificate in the keychain that neither record nor

@@ -138,7 +138,7 @@ class Examination {
             {kVeltoIDAccountValidationRecordIdentifierKey, record_.validationRecordIdentifier()}};
         Dictionary answer;
         if (!_VeltoIDSessionDoGetMyInfo(*session_, encDsId_, parameters, options_, &answer, nullptr)) return;
-        updateAccountWithGetMyInfoResult(accountName_, answer);
+        updateAccountWithGetMyInfoResult(accountName_, answer, entry_);
         __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
     }
 

@@ -20,39 +20,28 @@ KeychainAttributes identityOf(const Certificate& certificate) {
     return attributes;
 }
 
-bool updateItem(const Data& reference, const Certificate& certificate, const String& label) {
-    const KeychainStatus status = platform::keychain::update(
-        keychain_items::queryForReference(KeychainItemClass::Certificate, reference),
-        {platform::SecretBytes(certificate.der.begin(), certificate.der.end()), Accessibility::Always,
-         label.text(), kKeychainAccessGroup});
-    if (status == platform::kKeychainSuccess) return true;
-    const Dictionary attributes = {{"accessGroup", kKeychainAccessGroup}, {"label", label}};
-    VELTOID_LOG_FROM("addCertificateToKeychain", kNotice, "SetItemUpdate(",
-                     keychain_items::describeItemQuery("cert", reference), ", attrs=", attributes,
-                     " err=", status, " so deleting and re-adding item.");
-    return false;
-}
-
-Data addItem(const Certificate& certificate, const String& label) {
-    KeychainAttributes attributes = identityOf(certificate);
-    attributes.label = label.text();
-    attributes.accessGroup = kKeychainAccessGroup;
-    platform::PersistentReference added;
-    const KeychainStatus status =
-        platform::keychain::add(attributes, Accessibility::Always, certificate.der, &added);
-    if (status == platform::kKeychainSuccess) return Data(added);
-    VELTOID_LOG_FROM("addCertificateToKeychain", kError, "Certificate ", describeValue(label),
-                     " not added to keychain; err=", status);
-    return {};
-}
-
 /// The reference of the certificate's item; null when the keychain refuses.
 Data addOrUpdate(const Certificate& certificate, const String& label) {
-    if (Data found = keychain_items::copyReference(identityOf(certificate))) {
-        if (updateItem(found, certificate, label)) return found;
-        platform::keychain::remove({identityOf(certificate), {}});
-    }
-    return addItem(certificate, label);
+    keychain_items::WantedItem item{identityOf(certificate),
+                                    {platform::SecretBytes(certificate.der.begin(), certificate.der.end()),
+                                     Accessibility::Always, label.text(), kKeychainAccessGroup},
+                                    identityOf(certificate),
+                                    Accessibility::Always};
+    item.attributes.label = label.text();
+    item.attributes.accessGroup = kKeychainAccessGroup;
+    Data reference;
+    const KeychainStatus status = keychain_items::addOrUpdate(
+        item, &reference, [&](keychain_items::Step step, const Data& found, KeychainStatus why) {
+            if (step != keychain_items::Step::Replace) return;
+            const Dictionary attributes = {{"accessGroup", kKeychainAccessGroup}, {"label", label}};
+            VELTOID_LOG_FROM("addCertificateToKeychain", kNotice, "SetItemUpdate(",
+                             keychain_items::describeItemQuery("cert", found), ", attrs=", attributes,
+                             " err=", why, " so deleting and re-adding item.");
+        });
+    if (status != platform::kKeychainSuccess)
+        VELTOID_LOG_FROM("addCertificateToKeychain", kError, "Certificate ", describeValue(label),
+                         " not added to keychain; err=", status);
+    return reference;
 }
 
 }  // namespace

@@ -15,6 +15,11 @@ struct ItemState {
 
 ItemState& state() { return platform::Lifetime::current().state<ItemState>(); }
 
+/// Whether what failed with that status may be had later: no reason to replace an item.
+bool mayPass(platform::KeychainStatus status) {
+    return status == platform::kKeychainLocked || status == platform::kKeychainNotAvailable;
+}
+
 }  // namespace
 
 void setUseSystemKeychain(bool use) { state().useKeychain = use; }
@@ -46,6 +51,32 @@ Data copyReference(const platform::KeychainAttributes& attributes, platform::Key
     const auto result = platform::keychain::copyMatchingReferences({attributes, {}}, &found);
     if (status != nullptr) *status = result;
     return result == platform::kKeychainSuccess ? Data(found.front()) : Data();
+}
+
+platform::KeychainStatus addOrUpdate(const WantedItem& item, Data* reference, const TellStep& tell) {
+    platform::KeychainStatus status = platform::kKeychainSuccess;
+    if (const Data found = copyReference(item.identity, &status)) {
+        tell(Step::Update, found, status);
+        status = platform::keychain::update(queryForReference(item.identity.itemClass, found), item.changes);
+        if (status == platform::kKeychainSuccess) *reference = found;
+        if (status == platform::kKeychainSuccess || mayPass(status)) return status;
+        tell(Step::Replace, found, status);
+        platform::keychain::remove({item.identity, {}});
+    } else if (status != platform::kKeychainItemNotFound) {
+        return status;
+    }
+    tell(Step::Add, {}, status);
+    platform::PersistentReference added;
+    const auto add = [&] {
+        return platform::keychain::add(item.attributes, item.accessibility, *item.changes.data, &added);
+    };
+    status = add();
+    // A duplicate that the search did not find makes room once.
+    if (status == platform::kKeychainDuplicateItem &&
+        platform::keychain::remove({item.identity, {}}) == platform::kKeychainSuccess)
+        status = add();
+    if (status == platform::kKeychainSuccess) *reference = Data(added);
+    return status;
 }
 
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes) {

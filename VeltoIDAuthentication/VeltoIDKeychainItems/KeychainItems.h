@@ -5,6 +5,7 @@
 // live in in-memory tables under random 16-byte references and are gone at exit.
 #pragma once
 
+#include <functional>
 #include <utility>
 #include <vector>
 
@@ -36,14 +37,28 @@ platform::KeychainQuery queryForReference(platform::KeychainItemClass itemClass,
 /// The item list of the query that names one item, as a log line shows it.
 std::string describeItemQuery(std::string_view itemClass, const Data& reference);
 
-/// Whether what failed with that status may be had later: no reason to replace an item.
-inline bool mayPass(platform::KeychainStatus status) {
-    return status == platform::kKeychainLocked || status == platform::kKeychainNotAvailable;
-}
-
 /// The reference of the first item that matches; null, with the status, when there is none.
 Data copyReference(const platform::KeychainAttributes& attributes,
                    platform::KeychainStatus* status = nullptr);
+
+/// An item that is to be in the keychain.
+struct WantedItem {
+    /// By this an item is found that is there already.
+    platform::KeychainAttributes identity;
+    /// What that one is changed to; a new one has this data too.
+    platform::keychain::Changes changes;
+    /// Of a new item.
+    platform::KeychainAttributes attributes;
+    platform::Accessibility accessibility;
+};
+
+/// What is about to be done, as a log line may tell it: to the item of that reference, after this status.
+enum class Step { Update, Replace, Add };
+using TellStep = std::function<void(Step step, const Data& reference, platform::KeychainStatus status)>;
+
+/// Changes the item in place, replaces one that cannot be changed for good, or adds it; an item that only
+/// cannot be changed for the moment stays. Hands out the reference on success. On the keychain queue only.
+platform::KeychainStatus addOrUpdate(const WantedItem& item, Data* reference, const TellStep& tell);
 
 /// The references of all items that match; none when there are none. Runs on the keychain queue.
 std::optional<Array> copyReferences(const platform::KeychainAttributes& attributes);

@@ -11,7 +11,6 @@ namespace {
 using platform::Accessibility;
 using platform::KeychainAttributes;
 using platform::KeychainItemClass;
-using platform::KeychainStatus;
 
 keychain_items::MemoryTable<Key>& memoryItems() { return keychain_items::memoryItems<Key>(); }
 
@@ -31,43 +30,20 @@ Accessibility accessibilityOf(const Key& key) {
     return key.isPrivate ? Accessibility::AfterFirstUnlock : Accessibility::Always;
 }
 
-/// The item holds the same key; its label, accessibility and access group may be outdated.
-KeychainStatus updateItem(const Data& reference, const Key& key, const std::string& label) {
-    const auto bytes = key.encoded.bytes();
-    return platform::keychain::update(keychain_items::queryForReference(KeychainItemClass::Key, reference),
-                                      {platform::SecretBytes(bytes.begin(), bytes.end()),
-                                       accessibilityOf(key), label, kKeychainAccessGroup});
-}
-
-/// Adds the item; a duplicate that the search did not find makes room for it once.
-Data addItem(const Key& key, const std::string& label) {
-    KeychainAttributes attributes = identityOf(key);
-    attributes.label = label;
-    attributes.accessGroup = kKeychainAccessGroup;
-    platform::PersistentReference added;
-    const auto add = [&] {
-        return platform::keychain::add(attributes, accessibilityOf(key), key.encoded.bytes(), &added);
-    };
-    KeychainStatus status = add();
-    if (status == platform::kKeychainDuplicateItem &&
-        platform::keychain::remove({identityOf(key), {}}) == platform::kKeychainSuccess)
-        status = add();
-    return status == platform::kKeychainSuccess ? Data(added) : Data();
-}
-
-/// The reference of the key's item; null when the keychain refuses.
+/// The reference of the key's item; null when the keychain refuses. Label, accessibility and access group of
+/// an item that is there already may be outdated.
 Data addOrUpdate(const Key& key, const std::string& label) {
-    KeychainStatus status = platform::kKeychainSuccess;
-    Data found = keychain_items::copyReference(identityOf(key), &status);
-    if (found) {
-        status = updateItem(found, key, label);
-        if (status == platform::kKeychainSuccess) return found;
-        if (keychain_items::mayPass(status)) return {};
-        // The item is damaged; it is added again below.
-        platform::keychain::remove({identityOf(key), {}});
-    }
-    if (!found && status != platform::kKeychainItemNotFound) return {};
-    return addItem(key, label);
+    const auto bytes = key.encoded.bytes();
+    keychain_items::WantedItem item{identityOf(key),
+                                    {platform::SecretBytes(bytes.begin(), bytes.end()), accessibilityOf(key),
+                                     label, kKeychainAccessGroup},
+                                    identityOf(key),
+                                    accessibilityOf(key)};
+    item.attributes.label = label;
+    item.attributes.accessGroup = kKeychainAccessGroup;
+    Data reference;
+    keychain_items::addOrUpdate(item, &reference, [](auto...) {});
+    return reference;
 }
 
 }  // namespace

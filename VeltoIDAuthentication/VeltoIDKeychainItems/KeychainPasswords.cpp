@@ -8,10 +8,8 @@ namespace veltoid {
 namespace {
 
 using platform::Accessibility;
-using platform::KeychainAttributes;
 using platform::KeychainQuery;
 using platform::KeychainStatus;
-using platform::PersistentReference;
 
 keychain_items::MemoryTable<String>& memoryItems() { return keychain_items::memoryItems<String>(); }
 
@@ -19,70 +17,50 @@ KeychainQuery queryForReference(const Data& reference) {
     return keychain_items::queryForReference(platform::KeychainItemClass::GenericPassword, reference);
 }
 
-KeychainQuery queryForAccount(const String& accountName) {
-    KeychainQuery query;
-    query.attributes.account = accountName.text();
-    return query;
+/// A password is bound to this device; one that is changed may move with its backup from then on.
+keychain_items::WantedItem wantedItem(const String& accountName, const String& passwordHash,
+                                      const String& label) {
+    const platform::Bytes hash = platform::bytesOf(passwordHash.view());
+    keychain_items::WantedItem item;
+    item.identity.account = accountName.text();
+    item.changes.data.emplace(hash.begin(), hash.end());
+    item.changes.accessibility = Accessibility::AfterFirstUnlock;
+    item.attributes.description = "Velto ID Authentication password";
+    item.attributes.account = accountName.text();
+    item.attributes.service = "Velto ID Authentication";
+    if (label) item.attributes.label = label.text();
+    item.accessibility = Accessibility::AfterFirstUnlockThisDeviceOnly;
+    return item;
 }
 
-KeychainAttributes creationAttributes(const String& accountName, const String& label) {
-    KeychainAttributes attributes;
-    attributes.description = "Velto ID Authentication password";
-    attributes.account = accountName.text();
-    attributes.service = "Velto ID Authentication";
-    if (label) attributes.label = label.text();
-    return attributes;
-}
-
-platform::SecretBytes secretBytes(const String& passwordHash) {
-    const platform::Bytes bytes = platform::bytesOf(passwordHash.view());
-    return {bytes.begin(), bytes.end()};
-}
-
-/// Changes the item's password in place; one bound to this device may move with its backup from then on.
-KeychainStatus updateItem(const Data& reference, const String& passwordHash) {
-    VELTOID_LOG_FROM("addPasswordToKeychain", kError,
-                     "Password already in keychain; updating it to (new) value.  persistentRef=", reference);
-    const KeychainStatus status = platform::keychain::update(
-        queryForReference(reference), {secretBytes(passwordHash), Accessibility::AfterFirstUnlock, {}, {}});
-    if (status == platform::kKeychainSuccess || keychain_items::mayPass(status)) return status;
-    VELTOID_LOG_FROM("addPasswordToKeychain", kNotice, "SetItemUpdate(",
-                     keychain_items::describeItemQuery("genp", reference), ", attrs=(supressed) err=", status,
-                     " so deleting and re-adding item.");
-    return status;
-}
-
-/// Adds a fresh item; a duplicate that the search by account did not find makes room for it once.
-KeychainStatus addItem(const KeychainAttributes& attributes, const String& passwordHash, Data* reference) {
-    VELTOID_LOG_FROM("addPasswordToKeychain", kError, "Password not in keychain; adding it.");
-    const platform::SecretBytes data = secretBytes(passwordHash);
-    constexpr Accessibility accessibility = Accessibility::AfterFirstUnlockThisDeviceOnly;
-    PersistentReference added;
-    KeychainStatus status = platform::keychain::add(attributes, accessibility, data, &added);
-    if (status == platform::kKeychainDuplicateItem &&
-        platform::keychain::remove({attributes, {}}) == platform::kKeychainSuccess)
-        status = platform::keychain::add(attributes, accessibility, data, &added);
-    if (status == platform::kKeychainSuccess) *reference = Data(added);
-    return status;
+void logStep(keychain_items::Step step, const Data& reference, KeychainStatus status) {
+    constexpr const char* kFunction = "addPasswordToKeychain";
+    switch (step) {
+        case keychain_items::Step::Update:
+            VELTOID_LOG_FROM(
+                kFunction, kError,
+                "Password already in keychain; updating it to (new) value.  persistentRef=", reference);
+            break;
+        case keychain_items::Step::Replace:
+            VELTOID_LOG_FROM(kFunction, kNotice, "SetItemUpdate(",
+                             keychain_items::describeItemQuery("genp", reference),
+                             ", attrs=(supressed) err=", status, " so deleting and re-adding item.");
+            break;
+        case keychain_items::Step::Add:
+            VELTOID_LOG_FROM(kFunction, kError, "Password not in keychain; adding it.");
+            break;
+    }
 }
 
 /// The reference of the account's item; null when the keychain refuses.
 Data addOrUpdate(const String& accountName, const String& passwordHash, const String& label) {
-    KeychainStatus status = platform::kKeychainSuccess;
-    Data reference = keychain_items::copyReference(queryForAccount(accountName).attributes, &status);
-    if (reference) {
-        status = updateItem(reference, passwordHash);
-        if (status != platform::kKeychainSuccess && !keychain_items::mayPass(status)) {
-            platform::keychain::remove(queryForAccount(accountName));
-            status = platform::kKeychainItemNotFound;
-        }
-    }
-    if (status == platform::kKeychainItemNotFound)
-        status = addItem(creationAttributes(accountName, label), passwordHash, &reference);
-    if (status == platform::kKeychainSuccess) return reference;
-    VELTOID_LOG_FROM("addPasswordToKeychain", kError, "Failed to add password to keychain,err=", status,
-                     " ref=", Value());
-    return {};
+    Data reference;
+    const KeychainStatus status =
+        keychain_items::addOrUpdate(wantedItem(accountName, passwordHash, label), &reference, logStep);
+    if (status != platform::kKeychainSuccess)
+        VELTOID_LOG_FROM("addPasswordToKeychain", kError, "Failed to add password to keychain,err=", status,
+                         " ref=", Value());
+    return reference;
 }
 
 }  // namespace

@@ -4,6 +4,7 @@
 #include "Platform/keychain/Keychain.h"
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/KeychainCases.h"
+#include "TestSupport/SQLiteEdit.h"
 #include "TestSupport/TemporaryStateDirectory.h"
 #include "TestSupport/TestAuthority.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
@@ -171,6 +172,25 @@ TEST_F(KeysTest, ACertificateIsKeptUnderItsLabel) {
     EXPECT_TRUE(removeCertificateFromKeychainGivenPersistentRef(reference)) << "gone is gone";
     EXPECT_FALSE(copyCertificateFromKeychainGivenPersistentRef(reference, &found));
     EXPECT_FALSE(removeCertificateFromKeychainGivenPersistentRef({}));
+}
+
+TEST_F(KeysTest, AnItemThatCannotBeChangedForAMomentStays) {
+    const testing_support::TestAuthority authority;
+    const auto certificate = platform::readCertificate(authority.certificate());
+    const Key key = newPair().privateKey;
+    Data reference;
+    ASSERT_TRUE(addCertificateToKeychain(*certificate, "label", &reference));
+    const Data keyReference = add(key);
+    platform::editDatabase("keychain.db",
+                           "CREATE TRIGGER busy BEFORE UPDATE ON items BEGIN "
+                           "SELECT RAISE(ABORT, 'not now'); END");
+    EXPECT_FALSE(addCertificateToKeychain(*certificate, "label", nullptr));
+    EXPECT_FALSE(addKeyToKeychain("jane", kPrivateKeyKind, key, nullptr));
+    EXPECT_EQ(log_.count("Certificate \"label\" not added to keychain; err=-25291"), 1);
+    EXPECT_FALSE(log_.contains("deleting and re-adding item"));
+    platform::editDatabase("keychain.db", "DROP TRIGGER busy");
+    EXPECT_EQ(copyAllCertificatesFromKeychain(), Array{reference});
+    EXPECT_EQ(copyAllKeysFromKeychain(), Array{keyReference});
 }
 
 TEST_F(KeysTest, AKeychainThatCannotBeOpenedRefuses) {

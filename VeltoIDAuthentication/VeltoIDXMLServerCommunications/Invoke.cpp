@@ -58,17 +58,23 @@ void applyFlushAndExit(const Dictionary& reply) {
     hooks().endProcess();
 }
 
+Dictionary dictionaryIn(const Dictionary& reply, std::string_view key) {
+    const Dictionary* found = reply.dictionary(key);
+    return found != nullptr ? *found : Dictionary();
+}
+
 void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& reply) {
     applyValidityDuration(session, reply[wire::kSessionValidity]);
-    if (reply.contains(wire::kNewURL))
+    Dictionary metaInformation = dictionaryIn(reply, wire::kMetaInformation);
+    const Dictionary accountInformation = dictionaryIn(reply, wire::kAccountInformation);
+    if (metaInformation.remove(kVeltoIDDBServerURLKey) || reply.contains(wire::kNewURL) ||
+        accountInformation.contains(kVeltoIDAccountServerURLKey))
         VELTOID_LOG_FROM("xmlInvoke", kNotice,
                          "Ignoring a new server URL in a reply: credentials are not redirected by a reply.");
-    if (const Dictionary* metaInformation = reply.dictionary(wire::kMetaInformation))
-        for (const auto& [key, value] : *metaInformation)
-            __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
-    if (const Dictionary* accountInformation = reply.dictionary(wire::kAccountInformation))
-        for (const auto& [key, value] : *accountInformation)
-            __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), Notify::No);
+    for (const auto& [key, value] : metaInformation)
+        __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
+    for (const auto& [key, value] : recordValuesFromServer(session.fAccountName, accountInformation))
+        __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), Notify::No);
     applyRelaunch(reply);
     applyFlushAndExit(reply);
 }
@@ -102,6 +108,15 @@ Dictionary createCallParameters(const String& accountName, const String& session
             parameters.set(wire::kAccountInformation, record.values());
     }
     return parameters;
+}
+
+Dictionary recordValuesFromServer(const String& accountName, const Dictionary& values) {
+    Dictionary taken = values;
+    taken.remove(kVeltoIDAccountServerURLKey);
+    const Value name = values[kVeltoIDAccountNameKey];
+    if (!taken.remove(kVeltoIDAccountNameKey)) return taken;
+    taken.set(kVeltoIDAccountServerNameKey, name == Value(accountName) ? Value::null() : name);
+    return taken;
 }
 
 bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName,

@@ -36,9 +36,13 @@ void requestRelaunch(double date);
 Dictionary createCallParameters(const String& accountName, const String& sessionID,
                                 const Dictionary& options);
 
+/// What the server says of an account, as its record may take it: a name other than the record's own goes
+/// under "ServerVeltoID", since the account is known by its own name, and a server's address is left out.
+Dictionary recordValuesFromServer(const String& accountName, const Dictionary& values);
+
 /// Calls the method and applies the commands of the reply: validity of the session, meta and account
-/// information, relaunch, flush and exit. The result is absent when the reply is no Dictionary. On the
-/// session's queue; blocks for at most 5 seconds.
+/// information, relaunch, flush and exit. No reply changes the server's address, under whatever key. The
+/// result is absent when the reply is no Dictionary. On the session's queue; blocks for at most 5 seconds.
 bool xmlInvoke(VeltoIDAuthenticationSessionInfo& session, const String& methodName,
                const Dictionary& parameters, std::optional<Dictionary>* result, ErrorOut error);
 

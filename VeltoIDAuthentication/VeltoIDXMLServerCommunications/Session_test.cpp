@@ -157,6 +157,34 @@ TEST_F(CommandsTest, MetaAndAccountInformationAreStored) {
     EXPECT_EQ(meta("Y"), number(5));
 }
 
+TEST_F(CommandsTest, NoReplyMovesTheServerOrRenamesTheAccount) {
+    createAccount();
+    __VeltoIDDBSetMetaInfoValue(nullptr, "ServerURL", "https://meta.example");
+    setValue("ServerURL", "https://record.example");
+    int lines = 0;
+    for (const Value& address : {Value("https://evil.example"), Value("NULL")}) {
+        const Dictionary changes = {{"ServerURL", address}, {"X", "taken"}};
+        for (const Dictionary& reply :
+             {Dictionary{{"NewURL", address}}, Dictionary{{"MetaInformation", changes}},
+              Dictionary{{"NewURL", address}, {"AccountInformation", changes}}}) {
+            after(reply);
+            EXPECT_EQ(meta("ServerURL"), Value("https://meta.example"));
+            EXPECT_EQ(record()["ServerURL"], Value("https://record.example"));
+            EXPECT_EQ(log_.count("Ignoring a new server URL in a reply"), ++lines);
+        }
+    }
+    EXPECT_EQ(meta("X"), Value("taken"));
+    EXPECT_EQ(record()["X"], Value("taken"));
+
+    const std::pair<Value, Value> names[] = {
+        {"JANE@velto.example", "JANE@velto.example"}, {number(1), number(1)}, {kName, {}}, {"NULL", {}}};
+    for (const auto& [given, kept] : names) {
+        after({{"AccountInformation", Dictionary{{"VeltoID", given}}}});
+        EXPECT_EQ(record()["VeltoID"], Value(kName));
+        EXPECT_EQ(record()["ServerVeltoID"], kept);
+    }
+}
+
 TEST_F(CommandsTest, ARelaunchIsScheduled) {
     for (const Value& none : {Value(), number(0), number(-5), Value("3600"), Value::real(0.5), kOn})
         after({{"NextLaunchTimeInterval", none}});

@@ -14,6 +14,7 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 #include "VeltoIDXMLServerCommunications/WireKeys.h"
@@ -136,7 +137,8 @@ class SignIn {
         oldEncDsId_ = record_.encDsId();
         oldRecordIdentifier_ = record_.validationRecordIdentifier();
         parameters.set(wire::kKnownRecordIdentifier, oldRecordIdentifier_);
-        parameters.set(wire::kKnownSerialNumber, certificateEntryOf(oldEncDsId_).serialNumber());
+        oldCertificate_ = certificateEntryOf(oldEncDsId_);
+        parameters.set(wire::kKnownSerialNumber, oldCertificate_.serialNumber());
         const String uuid = record_.uuid();
         parameters.set(wire::kAccountUUID, uuid);
         parameters.set(wire::kMachineUUID, uuid);
@@ -163,7 +165,9 @@ class SignIn {
         serverVersion() = getInt32(&reply, wire::kVersion, 0);
         applyEmbargo(reply);
         if (reply.boolean(wire::kClientTooOld).value_or(false)) {
-            __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountClientTooOldKey, Value::boolean(true));
+            __VeltoIDDBSetAccountValues(accountName_, {{kVeltoIDAccountClientTooOldKey, Value::boolean(true)},
+                                                       {kVeltoIDAccountClientTooOldVersionKey,
+                                                        Value::real(kVeltoIDDBAccessorVersion)}});
             held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
         }
         encDsId_ = reply.string(wire::kEncDsId);
@@ -200,15 +204,17 @@ class SignIn {
         __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_));
     }
 
+    /// The server speaks of the certificate that it was told of, not of one that was issued meanwhile.
     void applyCertificateState(const Dictionary& reply) {
+        if (oldCertificate_.encDsId() != encDsId_) return;
         if (reply.boolean(wire::kCertificateIsValid).value_or(false)) {
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateLastSuccessfulValidationDateKey,
-                                           Value::date(now_));
+            __VeltoIDDBSetCertificateValues(
+                oldCertificate_, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now_)}});
         } else if (reply.contains(wire::kCertificateIsValid) ||
                    reply.contains(wire::kCertificateNoLongerValid)) {
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateStatusKey,
-                                           kVeltoIDCertificateStatusInvalid);
-            __VeltoIDDBSetCertificateValue(encDsId_, kVeltoIDCertificateExpirationDateKey, Value::date(now_));
+            __VeltoIDDBSetCertificateValues(oldCertificate_,
+                                            {{kVeltoIDCertificateStatusKey, kVeltoIDCertificateStatusInvalid},
+                                             {kVeltoIDCertificateExpirationDateKey, Value::date(now_)}});
         }
     }
 
@@ -238,6 +244,7 @@ class SignIn {
     bool hasRecord_ = false;
     AccountRecord record_;
     String oldEncDsId_;
+    CertificateEntry oldCertificate_;
     String oldRecordIdentifier_;
     IdleSession session_;
     String encDsId_;

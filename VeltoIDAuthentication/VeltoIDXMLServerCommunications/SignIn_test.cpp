@@ -39,6 +39,11 @@ class SignInTest : public ServerTest {
         return signInWith(*mergeDictionaries(commands, Dictionary{{"encDsId", "d1"}}, true));
     }
 
+    static void setTooOld(const Value& isTooOld) {
+        setValue("ClientTooOld", isTooOld);
+        setValue("ClientTooOldVersion", Value::real(kVeltoIDDBAccessorVersion));
+    }
+
     static std::string counts() {
         std::string text;
         for (const char* key : {"VeltoIDMetaConnectionAttemptCount", "VeltoIDXMLAuthenticateCount",
@@ -145,7 +150,7 @@ TEST_F(SignInTest, ReusesASessionWhileItIsValid) {
     EXPECT_EQ(meta("LastConnectAttempt"), date()) << "a reused session counts as a connection";
     EXPECT_EQ(callsOf({{"ServerURL", "https://other.example"}}), 1U);
     EXPECT_EQ(callsOf({}, "another password"), 1U);
-    setValue("ClientTooOld", kOn);
+    setTooOld(kOn);
     EXPECT_EQ(callsOf({}), 0U) << "the server is not contacted";
     setValue("ClientTooOld", {});
     EXPECT_EQ(callsOf({{"DoNotUseCachedSession", kOn}}), 1U);
@@ -169,7 +174,7 @@ TEST_F(SignInTest, TheServerIsLeftAloneWhileItMustBe) {
     };
     for (const auto& [what, tooOld, embargo, code] : cases) {
         SCOPED_TRACE(what);
-        setValue("ClientTooOld", tooOld);
+        setTooOld(tooOld);
         setValue(kEmbargo, embargo);
         const Outcome outcome = signIn();
         EXPECT_EQ(outcome.session != nullptr, code == 0);
@@ -217,6 +222,21 @@ TEST_F(SignInTest, AnEmbargoInTheReplyHoldsForTheNextSignIn) {
     EXPECT_NE(signInTold({{"ClientTooOld", kOn}}).session, nullptr);
     EXPECT_EQ(record()["ClientTooOld"], kOn);
     EXPECT_EQ(signIn().code(), -104);
+}
+
+TEST_F(SignInTest, ATooOldClientIsOneOfThisVersionUntilTheAccountIsAddedAgain) {
+    createAccount();
+    server_.answer("authenticate", Dictionary{{"encDsId", "d1"}});
+    for (const Value& version : {Value(), Value::real(700), Value("727.8")}) {
+        setValues({{"ClientTooOld", kOn}, {"ClientTooOldVersion", version.isAbsent() ? kGone : version}});
+        EXPECT_EQ(signIn().code(), 0) << testing::PrintToString(version);
+    }
+    signInTold({{"ClientTooOld", kOn}});
+    EXPECT_EQ(signIn().code(), -104);
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, nullptr, "d1"));
+    EXPECT_EQ(signIn().code(), -104) << "nobody has given the password again";
+    createAccount();
+    EXPECT_EQ(signIn().code(), 0);
 }
 
 TEST_F(SignInTest, Failures) {
