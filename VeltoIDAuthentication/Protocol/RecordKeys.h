@@ -58,6 +58,9 @@ inline constexpr RecordKey kVeltoIDAccountEarliestAllowedConnectionDateKey = "Ea
 inline constexpr RecordKey kVeltoIDAccountClientTooOldKey = "ClientTooOld";
 /// The version of the agent that this was said of; said of another one, it does not count.
 inline constexpr RecordKey kVeltoIDAccountClientTooOldVersionKey = "ClientTooOldVersion";
+/// When the account check looks at the account again at the earliest, and how far that was put off (seconds).
+inline constexpr RecordKey kVeltoIDAccountNextCheckDateKey = "NextAccountCheckDate";
+inline constexpr RecordKey kVeltoIDAccountCheckBackOffKey = "AccountCheckBackOff";
 inline constexpr RecordKey kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
 inline constexpr RecordKey kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
 inline constexpr RecordKey kVeltoIDAccountValidationRecordIdentifierKey =
@@ -132,6 +135,10 @@ inline constexpr RecordKey kVeltoIDMetaSendServerAccountInformationItemsKey =
     "VeltoIDMetaSendServerAccountInformationItems";
 inline constexpr RecordKey kVeltoIDMetaLastConnectAttemptKey = "LastConnectAttempt";
 inline constexpr RecordKey kVeltoIDMetaLastSuccessfulConnectKey = "LastSuccessfulConnect";
+/// The protocol version that the server last spoke.
+inline constexpr RecordKey kVeltoIDMetaServerVersionKey = "ServerVersion";
+/// When the server last asked to have the agent running.
+inline constexpr RecordKey kVeltoIDMetaRequestedLaunchDateKey = "RequestedLaunchDate";
 inline constexpr RecordKey kVeltoIDMetaAccountRequiresUserActionKey = "AccountRequiresUserAction";
 /// References to items of the keychain that somebody wanted to keep when their account was forgotten.
 inline constexpr RecordKey kVeltoIDMetaKeptKeychainItemsKey = "KeptKeychainItems";

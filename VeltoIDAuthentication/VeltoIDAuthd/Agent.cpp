@@ -1,5 +1,6 @@
 #include "VeltoIDAuthd/Agent.h"
 
+#include <algorithm>
 #include <csignal>
 #include <cstdlib>
 #include <functional>
@@ -84,12 +85,15 @@ Agent::Agent(const Configuration& configuration)
 void Agent::start(const Configuration& configuration) {
     const CommandLine& line = configuration.line;
     prepareDatabase(line);
-    setProcessHooks({[](double date) { scheduleRelaunch(date); }, endAfterPendingWork});
+    setProcessHooks({[](double date) { scheduleRelaunch(date, RelaunchDate::OnlyIfEarlier); },
+                     scheduleRequestedLaunch, endAfterPendingWork});
     flushOnInterrupt();
     prepareShutdown();
     if (line.runsAuthentication()) {
+        restoreRequestedLaunch();
         scheduleRelaunch(platform::now() + kRelaunchAfterStart);
-        startAccountCheck(configuration.firstCheckDelay);
+        // Half of the time for which an idle agent stays, so that it does not leave before.
+        startAccountCheck(std::min(configuration.firstCheckDelay, idleExitSeconds() / 2));
     }
     platform::ServiceManager::shared().announceReady();
     if (line.leaks) workForLeakChecker();

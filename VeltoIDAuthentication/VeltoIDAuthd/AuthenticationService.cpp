@@ -19,6 +19,7 @@
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
@@ -49,11 +50,16 @@ std::optional<bool> setDatabaseValue(const Request& request) {
     const Notify notify = getBool(&request.options(), option::kDirty, true) ? Notify::Yes : Notify::No;
     if (!section || !key) return std::nullopt;
     if (section == message::kMetaInfoSection) return __VeltoIDDBSetMetaInfoValue(item, key, value);
-    if (item && section == message::kAccountsSection)
-        return __VeltoIDDBSetAccountValue(item, key, value, notify);
-    if (item && section == message::kCertificatesSection)
-        return __VeltoIDDBSetCertificateValue(item, key, value, notify);
-    return std::nullopt;
+    String account = item;
+    std::optional<bool> isSet;
+    if (item && section == message::kAccountsSection) {
+        isSet = __VeltoIDDBSetAccountValue(item, key, value, notify);
+    } else if (item && section == message::kCertificatesSection) {
+        isSet = __VeltoIDDBSetCertificateValue(item, key, value, notify);
+        __VeltoIDDBCopyVeltoIDForDSID(item, &account);
+    }
+    if (isSet.value_or(false) && notify == Notify::Yes) noteNews(account);
+    return isSet;
 }
 
 bool addAccount(Request& request, ErrorOut error) {

@@ -33,14 +33,7 @@ constexpr double kMaxCommandedEnd = 1;
 /// How long the end waits for a busy service manager to take the relaunch time (seconds).
 constexpr double kMaxHandOver = 2;
 
-struct Leaving {
-    std::atomic<bool> hasBegun{false};
-};
-
-Leaving& leaving() { return platform::Lifetime::current().state<Leaving>(); }
-
-/// 0 for never.
-double idleExitSeconds() {
+double readIdleExit() {
     const char* text = std::getenv(kIdleExitVariable);
     if (text == nullptr) return kDefaultIdleExit;
     const std::string_view number = text;
@@ -48,11 +41,18 @@ double idleExitSeconds() {
     const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), seconds);
     if (error == std::errc() && end == number.data() + number.size() && std::isfinite(seconds) &&
         seconds >= 0)
-        return seconds;
+        return seconds > 0 ? seconds : platform::kForever;
     VELTOID_LOG_FROM("idleExitSeconds", kError, kIdleExitVariable, " is not a number of seconds; using ",
                      kDefaultIdleExit, ".");
     return kDefaultIdleExit;
 }
+
+struct Leaving {
+    std::atomic<bool> hasBegun{false};
+    const double idleExit = readIdleExit();
+};
+
+Leaving& leaving() { return platform::Lifetime::current().state<Leaving>(); }
 
 /// Makes the delayed writes now.
 void makeDurable() {
@@ -106,11 +106,13 @@ void shutDownWhenIdle(double seconds) {
 
 }  // namespace
 
+double idleExitSeconds() { return leaving().idleExit; }
+
 void prepareShutdown() {
     platform::event_loop::onSignal(SIGTERM, terminate);
     // Without its bus no client can reach the agent, and it would only hold up the end of a log-in session.
     platform::message_service::onConnectionLost(terminate);
-    if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
+    if (const double seconds = idleExitSeconds(); std::isfinite(seconds)) shutDownWhenIdle(seconds);
 }
 
 bool isLeaving() { return leaving().hasBegun; }

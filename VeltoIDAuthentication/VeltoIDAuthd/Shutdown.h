@@ -5,6 +5,10 @@
 
 namespace veltoid {
 
+/// How long the agent stays without anything to do (seconds); infinite when it stays for ever. From
+/// HARBWELL_IDLE_EXIT.
+double idleExitSeconds();
+
 /// Serves SIGTERM, the end of the bus, and idleness. Main queue, once, before the services are registered.
 void prepareShutdown();
 

@@ -140,6 +140,11 @@ bool AccountRecord::isClientTooOld() const {
            number(kVeltoIDAccountClientTooOldVersionKey) == kVeltoIDDBAccessorVersion;
 }
 
+AccountRecord::Date AccountRecord::embargoEnd(double now) const {
+    const Date end = date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
+    return end && *end > now && *end <= now + kMaxEmbargo ? end : std::nullopt;
+}
+
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (store.accounts.empty())
@@ -205,7 +210,8 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         PasswordChange password(name, record);
         if (hashedPassword && !password.make(hashedPassword, record)) return false;
         if (hashedPassword)
-            for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey})
+            for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey,
+                                   kVeltoIDAccountNextCheckDateKey, kVeltoIDAccountCheckBackOffKey})
                 record.remove(key);
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);

@@ -106,6 +106,8 @@ class Store {
     std::atomic<bool> isReady_{false};
     bool usePreferences_ = false;
     bool loaded_ = false;
+    /// The last attempt to load.
+    bool hasFailed_ = false;
     String domainName_;
     std::unique_ptr<Transaction> pendingFlush_;
     std::optional<platform::Semaphore> changeSemaphore_;

@@ -27,6 +27,7 @@ using enum AccountState;
 
 // Seconds.
 constexpr double kRenewalInterval = 86'400;
+constexpr double kMinRenewalInterval = 3'600;
 constexpr double kRecordRetryInterval = 180;
 constexpr double kRecordCheckSoon = 15;
 constexpr double kRecordIntervalAfterServersDate = 14'400;
@@ -71,12 +72,13 @@ void noteValidation(const CertificateEntry& examined) {
 /// What is tried next after an attempt that failed.
 Dictionary laterAttempt(const AccountRecord& record) {
     const auto stored = record.validationRecordNextCheckInterval();
-    const double interval = stored && *stored > 0 && std::isfinite(*stored)
-                                ? *stored
-                                : metaInterval(nullptr, {}, kVeltoIDMetaValidationRecordRetryIntervalKey,
-                                               kRecordRetryInterval, UnreadableInterval::Zero);
-    const double grown =
-        std::min(std::max(interval * kRecordRetryGrowth, kRecordRetryInterval), randomPollingDelay());
+    const double interval =
+        stored && *stored > 0 && std::isfinite(*stored)
+            ? *stored
+            : std::max(metaInterval(nullptr, {}, kVeltoIDMetaValidationRecordRetryIntervalKey,
+                                    kRecordRetryInterval),
+                       kRecordRetryInterval);
+    const double grown = std::min(interval * kRecordRetryGrowth, randomPollingDelay());
     return {{kNextCheckDate, Value::date(platform::now() + interval)},
             {kNextCheckInterval, Value::real(grown)}};
 }
@@ -100,8 +102,10 @@ void renewCertificateForAccount(const String& accountName, const Examined& exami
                     " dsID=", describeValue(examined.certificate.encDsId()),
                     " because it has expired or been revoked.");
     } else {
-        const double interval = metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey,
-                                             kRenewalInterval, UnreadableInterval::Zero);
+        const double given =
+            metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey, kRenewalInterval);
+        const double interval =
+            given > 0 ? std::clamp(given, kMinRenewalInterval, kRenewalInterval) : kRenewalInterval;
         __VeltoIDDBSetCertificateValues(
             examined.certificate,
             {{kVeltoIDCertificateNextRenewalAttemptDateKey, Value::date(platform::now() + interval)}},

@@ -17,6 +17,7 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -64,6 +65,7 @@ class InformationRequest {
         if (isOn(option::kDeferValidation)) {
             if (!record_.isComplete()) return false;
             markForValidation();
+            noteNews(name_);
             return true;
         }
         const bool mustAsk = isOn(option::kForceValidationRecordFetch) ||
@@ -161,7 +163,8 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
     const CertificateEntry entry = asked ? *asked : certificateEntryOf(encDsId);
     if (isValid.asBoolean().value_or(false)) {
         __VeltoIDDBSetCertificateValues(
-            entry, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now())}});
+            entry, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now())}},
+            Notify::No);
         return;
     }
     VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice, "Marking certificate for Velto ID ",

@@ -67,8 +67,8 @@ std::set<std::string> encDsIdsOfAccounts() {
     for (const Value& name : accountNames()) {
         const AccountRecord record = accountRecordOf(name.asString());
         if (const String encDsId = record.encDsId()) encDsIds.insert(encDsId.text());
-        const auto embargo = record.earliestConnection();
-        if (embargo && *embargo < platform::now())
+        if (record.values().contains(kVeltoIDAccountEarliestAllowedConnectionDateKey) &&
+            !record.embargoEnd(platform::now()))
             __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountEarliestAllowedConnectionDateKey,
                                        Value::null(), Notify::No);
     }

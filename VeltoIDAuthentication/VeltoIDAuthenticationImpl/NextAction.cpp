@@ -178,6 +178,7 @@ class Examination {
         if (!result) return Unknown;
         const AccountState state = stateOf(*result);
         setInEntry(kVeltoIDCertificateLastValidationAttemptDateKey, Value::date(platform::now()));
+        setInEntry(kVeltoIDDirtyKey, Value::boolean(false));
         if (state == CertificateOK || state == CertificateAssumedOK)
             setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now()));
         return state;

@@ -10,8 +10,8 @@ namespace veltoid {
 namespace {
 
 constexpr double kBackOffFactor = 1.5;
+constexpr double kDefaultTokenDelay = 30;
 constexpr double kDefaultPendingDelay = 60;
-constexpr double kDelayForUnbelievableOnes = 15;
 
 std::optional<double> finite(std::optional<double> number) {
     return number && std::isfinite(*number) ? number : std::nullopt;
@@ -29,10 +29,10 @@ double randomPollingDelay() {
 }
 
 double delayAfterPending(double delay) {
-    return delay < kMaxPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
+    return delay < kMaxOwnPollDelay ? std::min(delay * kBackOffFactor, kMaxOwnPollDelay) : delay;
 }
 
-double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
+double delayAfterFailedSignIn(double delay) { return delayAfterPending(delay); }
 
 std::optional<double> storedFetchDelta(const AccountRecord& record) {
     return finite(record.nextCertificateFetchDelta());
@@ -40,14 +40,15 @@ std::optional<double> storedFetchDelta(const AccountRecord& record) {
 
 double pendingDelay(const Value& delay, const AccountRecord& record) {
     const auto given = finite(delay.asDouble());
-    const double seconds = given ? *given : storedFetchDelta(record).value_or(kDefaultPendingDelay);
-    return std::min(seconds, kMaxFetchDelay);
+    if (given && *given > 0) return std::clamp(*given, kMinPollDelay, kMaxFetchDelay);
+    return std::clamp(storedFetchDelta(record).value_or(kDefaultPendingDelay), kMinPollDelay,
+                      kMaxOwnPollDelay);
 }
 
 std::optional<double> tokenDelay(const Value& delay) {
-    const auto seconds = delay.asDouble();
-    if (!seconds) return std::nullopt;
-    return *seconds >= 0 && *seconds <= kMaxPollingDelay ? *seconds : kDelayForUnbelievableOnes;
+    const auto given = delay.asDouble();
+    if (!given || *given == 0) return kDefaultTokenDelay;
+    return *given > 0 && *given <= kMaxPollingDelay ? std::max(*given, kMinPollDelay) : kMinPollDelay;
 }
 
 }  // namespace veltoid

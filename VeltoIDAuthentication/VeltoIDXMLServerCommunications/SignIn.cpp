@@ -1,5 +1,6 @@
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
+#include <algorithm>
 #include <atomic>
 #include <string>
 
@@ -25,12 +26,6 @@ namespace {
 constexpr const char* kOperation = "__VeltoIDSessionDoCreateSession";
 constexpr std::string_view kClientOutOfDate =
     "The client on this machine is out of date and can not talk with the Velto ID server.";
-
-struct Server {
-    std::atomic<int32_t> version{0};
-};
-
-std::atomic<int32_t>& serverVersion() { return platform::Lifetime::current().state<Server>().version; }
 
 Error signInError(int64_t code, int line, const ErrorTexts& texts = {}) {
     return makeError(code, texts, {}, kOperation, __FILE_NAME__, line);
@@ -62,11 +57,12 @@ class SignIn {
         if (session_) {
             encDsId_ = session_->fEncDsId;
             count(kVeltoIDXMLSessionReusedCountKey);
+            count(kVeltoIDMetaSuccessfulConnectionCountKey);
         } else {
             if (mayConnect()) signInAnew(url);
             if (!session_ && !held_) held_ = identityError(identity_error::kSignInFailed);
+            keepBooks();
         }
-        keepBooks();
     }
 
     void count(std::string_view counter) {
@@ -96,8 +92,7 @@ class SignIn {
             held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
             return false;
         }
-        const auto earliest = record_.earliestConnection();
-        if (earliest && *earliest > now_) {
+        if (const auto earliest = record_.embargoEnd(now_)) {
             VELTOID_LOG_FROM(kOperation, kNotice,
                              "Not connecting to VeltoID authentication server because there is an "
                              "earliest-allowed-connection-date set for this account ",
@@ -162,7 +157,8 @@ class SignIn {
     }
 
     void applyReply(const Dictionary& reply, VeltoIDAuthenticationSessionInfo& session) {
-        serverVersion() = getInt32(&reply, wire::kVersion, 0);
+        __VeltoIDDBSetMetaInfoValue(nullptr, kVeltoIDMetaServerVersionKey,
+                                    Value::int32(getInt32(&reply, wire::kVersion, 0)));
         applyEmbargo(reply);
         if (reply.boolean(wire::kClientTooOld).value_or(false)) {
             __VeltoIDDBSetAccountValues(accountName_, {{kVeltoIDAccountClientTooOldKey, Value::boolean(true)},
@@ -189,7 +185,7 @@ class SignIn {
         if (!date && seconds >= 1) date = now_ + seconds;
         if (!date || *date <= now_) return;
         __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountEarliestAllowedConnectionDateKey,
-                                   Value::date(*date));
+                                   Value::date(std::min(*date, now_ + kMaxEmbargo)));
         held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
     }
 
@@ -209,7 +205,8 @@ class SignIn {
         if (oldCertificate_.encDsId() != encDsId_) return;
         if (reply.boolean(wire::kCertificateIsValid).value_or(false)) {
             __VeltoIDDBSetCertificateValues(
-                oldCertificate_, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now_)}});
+                oldCertificate_, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now_)}},
+                Notify::No);
         } else if (reply.contains(wire::kCertificateIsValid) ||
                    reply.contains(wire::kCertificateNoLongerValid)) {
             __VeltoIDDBSetCertificateValues(oldCertificate_,
@@ -265,6 +262,10 @@ Session __VeltoIDSessionDoCreateSession(const String& accountName, const String&
     });
 }
 
-int32_t __VeltoIDSessionGetServerVersion() { return serverVersion(); }
+int32_t __VeltoIDSessionGetServerVersion() {
+    const Value version =
+        __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaServerVersionKey, Value::Kind::Number);
+    return static_cast<int32_t>(version.asInt64().value_or(0));
+}
 
 }  // namespace veltoid
