@@ -5,6 +5,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
@@ -50,8 +51,7 @@ bool storePassword(const String& name, const String& hashedPassword, Dictionary&
     }
     Data reference;
     if (!addPasswordToKeychain(name, hashedPassword, nullptr, &reference)) return false;
-    if (!record.contains(kVeltoIDAccountHashedPasswordKeychainReferenceKey))
-        record.set(kVeltoIDAccountHashedPasswordKeychainReferenceKey, reference);
+    record.set(kVeltoIDAccountHashedPasswordKeychainReferenceKey, reference);
     return true;
 }
 
@@ -136,6 +136,7 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         record.set(kVeltoIDAccountNameKey, name);
         record.set(kVeltoIDAccountDSIDKey, encDsId);
         if (hashedPassword && !storePassword(name, hashedPassword, record)) return false;
+        if (hashedPassword) database::adoptKeychain(store);
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);
