@@ -20,10 +20,10 @@ Data presentIdentity(Reopen reopen) {
 }
 
 bool remember(Store& store, const Data& identity) {
-    store.keychainIsKnown = !identity.bytes().empty() &&
-                            store.keychainDomain().set({{std::string(kIdentityKey), [identity](auto& sink) {
-                                                             writeValue(identity, sink);
-                                                         }}});
+    store.keychainIsKnown =
+        !identity.bytes().empty() &&
+        store.keychainDomain().set(
+            {{std::string(kIdentityKey), [identity](auto& sink) { writeValue(identity, sink); }}});
     return store.keychainIsKnown;
 }
 

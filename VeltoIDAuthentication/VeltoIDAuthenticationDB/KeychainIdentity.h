@@ -1,7 +1,7 @@
-// Which keychain the stored references are from. The database remembers its identity, so that a keychain that is
-// missing, emptied, exchanged or newly made is not taken for one whose items are gone: nothing that refers to
-// them is dropped, and all is well again when the right one is back. Adding an account makes the present one
-// the right one; so does its first sight, where none is remembered or nothing stored could refer to it.
+// Which keychain the stored references are from. The database remembers its identity, so that a keychain that
+// is missing, emptied, exchanged or newly made is not taken for one whose items are gone: nothing that refers
+// to them is dropped, and all is well again when the right one is back. Adding an account makes the present
+// one the right one; so does its first sight, where none is remembered or nothing stored could refer to it.
 #pragma once
 
 #include "VeltoIDAuthenticationDB/Store.h"
