@@ -11,10 +11,12 @@ import sqlite3
 import subprocess
 import unittest
 
+from jeepney.io.blocking import open_dbus_connection
+
 from harness.world import (ACCOUNT, ADD, CERTIFICATE, CHECK, DATABASE, FORGET, INFO, LIST, OTHER_ACCOUNT,
                            OTHER_PASSWORD, PASSWORD, PASSWORD_SERVICE, PING, SET_VALUE, SET_VALUE_QUIETLY, STATUS,
                            TERMINATE, UPDATE_LINKED_IDENTITY, VERIFY, BusError, NameOwner, World, busctl_send, execute,
-                           hashed)
+                           hashed, wait_until)
 
 PROGRAM = os.environ["VELTOID_AGENT"]
 ENGINE = "HWIdentityErrorDomain"
@@ -208,6 +210,21 @@ class BadRequests(unittest.TestCase):
             expected = {**values, "unsigned": 2**64 - 1, "date": {"date": 1234567890.5}}
             self.assertEqual({key: stored[key] for key in values}, expected)
 
+    def test_what_nobody_can_reckon_with_or_store_is_refused_and_leaves_what_is_there(self):
+        nan, endless = float("nan"), float("inf")
+        with self.world.client() as client:
+            client.connection.close()
+            client.connection = open_dbus_connection(bus=self.world.address, enable_fds=True)
+            kept = dict(domain="MetaInfo", key="kept", value="x")
+            self.assertEqual(client.call(SET_VALUE, **kept), DONE)
+            for wrong in (nan, -endless, ("(d)", (endless,)), [{"deep": ("(d)", (nan,))}], ("h", 1), [("h", 1)]):
+                for command in (SET_VALUE, SET_VALUE_QUIETLY):
+                    with self.subTest(wrong, command=command):
+                        self.assertEqual(outcome(client.call(command, **{**kept, "value": wrong})), -99)
+            for command in (PING, LIST, VERIFY, STATUS, INFO):
+                self.assertEqual(outcome(client.call(command, options={"x": nan})), -99, command)
+            self.assertEqual(client.call(DATABASE)["result"]["MetaInfo"]["kept"], "x")
+
     @unittest.skipUnless(os.geteuid() == 0, "only root can speak as another user")
     def test_other_users_are_refused(self):
         with World(server=False) as world:
@@ -353,6 +370,17 @@ class Process(unittest.TestCase):
                     self.assertTrue(nameless.call(SET_VALUE, domain="MetaInfo", key="k", value=1)["success"])
                 agent.terminate()
                 self.assertEqual(agent.wait(timeout=20), 0)
+
+    def test_numbers_on_the_command_line_count_as_such_unless_they_are_not_finite(self):
+        with World("DefaultRelaunchInterval=3600", "Other=-inf", "More=nan", server=False) as world, \
+                world.running_agent() as client:
+            def interval():
+                status = client.call(STATUS)["status"]
+                return status["NextLaunchTime"]["date"] - status["LaunchTime"]["date"]
+            wait_until(lambda: interval() > 60, 20, "the first pass")
+            self.assertLess(abs(interval() - 3600), 60)
+            self.assertEqual(set(client.call(DATABASE)["result"]["MetaInfo"]), {"DefaultRelaunchInterval"})
+            self.assertEqual(world.log_text().count("is not stored: its value is not finite"), 2)
 
     def test_an_unknown_option_prints_the_usage(self):
         run = subprocess.run([PROGRAM, "-x"], capture_output=True, text=True, check=False)

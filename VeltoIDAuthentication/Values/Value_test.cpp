@@ -164,6 +164,17 @@ TEST(ValueStream, EveryStoredKindComesBackFromItsStoredForm) {
     EXPECT_EQ(builder.value(), value);
 }
 
+TEST(ValueBuilder, LeavesOutWhatIsNotFinite) {
+    constexpr double kEndless = std::numeric_limits<double>::infinity();
+    const Value value = Dictionary{{"nan", Value::real(std::nan(""))},
+                                   {"date", Value::date(std::nan(""))},
+                                   {"single", Value::singleReal(std::numeric_limits<float>::infinity())},
+                                   {"list", Array{Value::date(-kEndless), "a", Value::real(kEndless)}}};
+    ValueBuilder builder;
+    writeValue(value, builder);
+    EXPECT_EQ(builder.value(), Value(Dictionary{{"list", Array{"a"}}}));
+}
+
 TEST(DateText, FormsOfOneInstantAgreeAndOthersAreRefused) {
     const double instant = 1'394'039'040;  // 2014-03-05 17:04:00 UTC
     const std::pair<const char*, double> cases[] = {

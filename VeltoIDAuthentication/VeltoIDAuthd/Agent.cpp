@@ -1,9 +1,11 @@
 #include "VeltoIDAuthd/Agent.h"
 
+#include <cmath>
 #include <csignal>
 #include <cstdlib>
 #include <functional>
 
+#include "Logging/Log.h"
 #include "Platform/bus/BusConnection.h"
 #include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/Clock.h"
@@ -11,6 +13,7 @@
 #include "Platform/runtime/InstanceLock.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/RecordKeys.h"
+#include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/Listeners.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -48,8 +51,12 @@ void prepareDatabase(const CommandLine& line) {
     __VeltoIDDBSetUsePreferences(line.usePreferences);
     __VeltoIDDBSetFindPersonCacheUsePreferences(line.usePreferences);
     setUseSystemKeychain(line.usePreferences);
-    for (const auto& [key, value] : line.metaInfoValues)
-        __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+    for (const auto& [key, value] : line.metaInfoValues) {
+        if (std::isfinite(numberFromText(value).asDouble().value_or(0)))
+            __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+        else
+            VELTOID_LOG_FROM("prepareDatabase", kError, key, " is not stored: its value is not finite.");
+    }
 }
 
 bool claimNames(const Agent::Configuration& configuration) {
