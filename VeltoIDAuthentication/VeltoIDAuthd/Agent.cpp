@@ -91,7 +91,7 @@ Agent::Agent(const Configuration& configuration)
 void Agent::start(const Configuration& configuration) {
     const CommandLine& line = configuration.line;
     prepareDatabase(line);
-    setProcessHooks({[](double date) { scheduleRelaunch(date); }, endAfterPendingWork});
+    setProcessHooks({[](double date) { scheduleRelaunch(date); }, shutDownByServer});
     flushOnInterrupt();
     prepareShutdown();
     if (line.runsAuthentication()) {

@@ -61,7 +61,14 @@ void makeDurable() {
 
 void endProcess() {
     makeDurable();
-    endAfterPendingWork();
+    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
+    const auto end = [] {
+        platform::ServiceManager::shared().announceStopping();
+        platform::bus::flush();
+        platform::event_loop::stop(EXIT_SUCCESS);
+    };
+    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
+    mainQueue.asyncAfter(kMaxHandOver, end);
 }
 
 /// Answers the requests that have arrived and finishes the work under way. Stored values are synced at once:
@@ -112,18 +119,7 @@ void prepareShutdown() {
     if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
 }
 
-void endAfterPendingWork() {
-    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
-    const auto end = [] {
-        platform::ServiceManager::shared().announceStopping();
-        platform::bus::flush();
-        platform::event_loop::stop(EXIT_SUCCESS);
-    };
-    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
-    mainQueue.asyncAfter(kMaxHandOver, end);
-    while (!mainQueue.isCurrent() && !platform::Lifetime::current().isEnding())
-        (void)platform::Semaphore().wait(kMaxTermination);
-}
+void shutDownByServer() { platform::WorkQueue::main().async(terminate); }
 
 void shutDownByCommand() {
     platform::WorkQueue::main().async([] { shutDownWithin(kMaxCommandedEnd); });

@@ -21,7 +21,7 @@ inline constexpr int64_t kVeltoIDAuthProtocolVersion = 101;
 struct ProcessHooks {
     /// Is running at the date (seconds since 1970).
     std::function<void(double date)> scheduleRelaunch = [](double) {};
-    /// Ends, and does not return before that.
+    /// Ends as soon as the work in hand is done; returns at once.
     std::function<void()> endProcess = [] {};
 };
 
