@@ -192,7 +192,9 @@ TEST(DateText, FormsOfOneInstantAgreeAndOthersAreRefused) {
     EXPECT_EQ(dateFromValue(std::string(129, '1')), std::nullopt);
 }
 
-TEST(LowerCase, KeepsBytesThatAreNoText) {
+TEST(LowerCase, GoesByUnicodeWhateverTheLocaleAndKeepsBytesThatAreNoText) {
+    EXPECT_EQ(lowerCased("ÄNNE.İÉÑ@ПРИМЕР.ΟΔΟΣ"), "änne.iéñ@пример.οδοσ");
+    EXPECT_EQ(lowerCased("Straße@ǄÅ"), "straße@ǆå");
     EXPECT_EQ(lowerCased("Jane.ROE@Example.COM"), "jane.roe@example.com");
     EXPECT_EQ(lowerCased("A\xff\x00Z"), "a\xff");
     EXPECT_FALSE(lowerCased(nullptr));
