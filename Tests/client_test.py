@@ -94,6 +94,20 @@ class CommandLine(unittest.TestCase):
             (["status"], "", 0, "NoCertificate"),
             (["forget", ACCOUNT], "", 0, "is forgotten")])
 
+    def test_a_keychain_that_is_not_the_accounts_is_shown_until_it_is_back(self):
+        self.add_account("--certificate")
+        file, kept = (self.world.state_files() / name for name in ("keychain.db", "kept.db"))
+        file.rename(kept)
+        strange, forget = (["status"], "", 0, "not the one of the stored accounts"), ["forget", ACCOUNT]
+        self.run_table([strange, (["info", ACCOUNT], "", 0, "jane@roe.example"),
+                        (["status", "--check"], "", 0, "PasswordInaccessibleInKeychain")])
+        kept.rename(file)
+        self.run_table([(["status"], "", 0, "CertificateAssumedOK"),
+                        (["verify", ACCOUNT, "--password-stdin"], PASSWORD, 0, "accepts")])
+        file.unlink()
+        self.run_table([strange, (forget, "", 0, "is forgotten")])
+        self.assertNotIn("keychain", self.run_client("status").stdout)
+
     def test_json_is_the_whole_reply_of_every_command(self):
         for command in (["ping"], ["list"], ["status"], ["database"], ["info", "nobody"], ["forget", "nobody"]):
             for arguments in (["--json", *command], [*command, "--json"]):

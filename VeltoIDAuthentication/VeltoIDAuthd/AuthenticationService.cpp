@@ -42,7 +42,11 @@ void countFor(const String& account, const Request& request, std::string_view co
 // there is one to tell.
 
 /// Sets the database value that the request names; none when section, item or key is missing or unknown.
-std::optional<bool> setDatabaseValue(const Request& request) {
+std::optional<bool> setDatabaseValue(const Request& request, ErrorOut error) {
+    if (request.hasDescriptor())
+        return failWith(error, makeError(identity_error::kInvalidParameters,
+                                         {"A file descriptor cannot be stored.", {}, {}}, {}, __func__,
+                                         __FILE_NAME__, __LINE__));
     const String section = request.string(message::kSection);
     const String item = request.string(message::kItem);
     const String key = request.string(message::kKey);
@@ -199,9 +203,9 @@ struct Command {
 constexpr Command kCommands[] = {
     {command::kPing, [](Request&, ErrorOut) { return true; }},
     {command::kSetValue,
-     [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(false); }},
+     [](Request& request, ErrorOut error) { return setDatabaseValue(request, error).value_or(false); }},
     {command::kSetValueQuietly,
-     [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(true); }},
+     [](Request& request, ErrorOut error) { return setDatabaseValue(request, error).value_or(true); }},
     {command::kAdd, addAccount},
     {command::kInfo, getMyInfo, WhileUnreadable::Refuse},
     {command::kFind, findPerson},
@@ -235,7 +239,7 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
         return shutDownByCommand();
     }
     std::optional<Error> error;
-    const bool succeeded = dispatch(request, &error);
+    const bool succeeded = request.isSound(&error) && dispatch(request, &error);
     request.finish(succeeded, error);
 }
 

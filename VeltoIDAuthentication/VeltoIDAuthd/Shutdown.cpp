@@ -62,7 +62,14 @@ void makeDurable() {
 
 void endProcess() {
     makeDurable();
-    endAfterPendingWork();
+    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
+    const auto end = [] {
+        platform::ServiceManager::shared().announceStopping();
+        platform::bus::flush();
+        platform::event_loop::stop(EXIT_SUCCESS);
+    };
+    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
+    mainQueue.asyncAfter(kMaxHandOver, end);
 }
 
 /// Answers the requests that have arrived and finishes the work under way. Stored values are synced at once:
@@ -117,18 +124,7 @@ void prepareShutdown() {
 
 bool isLeaving() { return leaving().hasBegun; }
 
-void endAfterPendingWork() {
-    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
-    const auto end = [] {
-        platform::ServiceManager::shared().announceStopping();
-        platform::bus::flush();
-        platform::event_loop::stop(EXIT_SUCCESS);
-    };
-    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
-    mainQueue.asyncAfter(kMaxHandOver, end);
-    while (!mainQueue.isCurrent() && !platform::Lifetime::current().isEnding())
-        (void)platform::Semaphore().wait(kMaxTermination);
-}
+void shutDownByServer() { platform::WorkQueue::main().async(terminate); }
 
 void shutDownByCommand() {
     platform::WorkQueue::main().async([] { shutDownWithin(kMaxCommandedEnd); });

@@ -8,6 +8,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
@@ -213,6 +214,7 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
             for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey,
                                    kVeltoIDAccountNextCheckDateKey, kVeltoIDAccountCheckBackOffKey})
                 record.remove(key);
+        if (hashedPassword) database::adoptKeychain(store);
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);

@@ -146,9 +146,13 @@ const Dictionary* Store::find(const Dictionary& section, const String& key) {
     return key ? section.dictionary(key.view()) : nullptr;
 }
 
-platform::Preferences Store::preferences() const {
-    return platform::Preferences(domainName_ ? domainName_.text() : std::string(kVeltoIDDBDefaultDomain));
+std::string Store::domain() const {
+    return domainName_ ? domainName_.text() : std::string(kVeltoIDDBDefaultDomain);
 }
+
+platform::Preferences Store::preferences() const { return platform::Preferences(domain()); }
+
+platform::Preferences Store::keychainDomain() const { return platform::Preferences(domain() + ".keychain"); }
 
 bool Store::load() {
     if (!usePreferences_) return true;

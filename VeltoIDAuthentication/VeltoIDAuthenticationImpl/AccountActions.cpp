@@ -6,19 +6,18 @@
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
-#include "Platform/keychain/LockState.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/PollBackOff.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
-#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {
@@ -37,10 +36,10 @@ constexpr double kRecordRetryGrowth = 1.5;
 constexpr std::string_view kNextCheckInterval = kVeltoIDAccountValidationRecordNextCheckIntervalKey;
 constexpr std::string_view kNextCheckDate = kVeltoIDAccountValidationRecordNextCheckDateKey;
 
-/// The keychain may have been unlocked, or locked, since the account was examined.
+/// What cannot be read now, or not in this keychain, is not lost.
 void dropLostPassword(const AccountRecord& record) {
-    if (!platform::LockState::shared().hasBeenUnlockedSinceBoot() ||
-        copyPasswordFromKeychainGivenPersistentRef(record.passwordReference(), nullptr))
+    if (stateOfItem(platform::KeychainItemClass::GenericPassword, record.passwordReference()) !=
+        ItemState::Gone)
         return;
     setAccountValuesIf(
         [](const AccountRecord& stored, const AccountRecord& examined) {

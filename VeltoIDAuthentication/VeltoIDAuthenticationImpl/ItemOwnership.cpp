@@ -11,6 +11,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
@@ -42,6 +43,7 @@ bool isReferredTo(const Data& reference) {
 /// The items are listed before the references: an item is stored together with its reference, so that one
 /// that is listed and has none by then is nobody's.
 void discardOrphans() {
+    if (!keychainIsOurs()) return;
     const struct {
         std::optional<Array> items;
         bool (*remove)(const Data& reference);

@@ -8,6 +8,7 @@
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
@@ -56,7 +57,10 @@ class Examination {
                              " doesn't have a password; no next action.");
             return PasswordInvalid;
         }
-        if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) return std::nullopt;
+        if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) {
+            noteKeychainInUse();
+            return std::nullopt;
+        }
         VELTOID_LOG_FROM(
             kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
             " doesn't have a password or the password has been removed from the keychain; no next action.");
@@ -110,7 +114,7 @@ class Examination {
         }
         if (static_cast<int>(state) < 0) return state;
         std::optional<platform::Certificate> certificate;
-        if (!readItems(&certificate)) return NoCertificate;
+        if (const auto missing = readItems(&certificate)) return *missing;
         if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate) : CertificateAssumedOK;
         if (state != CertificateOK && state != CertificateAssumedOK) return state;
         return schedule().isDue(DueReason::Renewal) || schedule().isDue(DueReason::PreExpiry)
@@ -142,31 +146,41 @@ class Examination {
         __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
     }
 
-    /// Whether certificate and private key can be had from the keychain.
-    bool readItems(std::optional<platform::Certificate>* certificate) const {
-        const bool hasCertificate = readCertificate(certificate);
-        return readPrivateKey() && hasCertificate;
+    /// Nothing when certificate and private key can be had from the keychain. What only cannot be read now is
+    /// no reason to ask for another certificate.
+    std::optional<AccountState> readItems(std::optional<platform::Certificate>* certificate) const {
+        const ItemState certificateState = readCertificate(certificate);
+        const ItemState keyState = readPrivateKey();
+        if (certificateState == ItemState::Gone || keyState == ItemState::Gone) return NoCertificate;
+        const bool areReadable = certificateState == ItemState::Readable && keyState == ItemState::Readable;
+        return areReadable ? std::nullopt : std::optional(Unknown);
     }
 
-    bool readCertificate(std::optional<platform::Certificate>* certificate) const {
+    /// After an attempt to read that failed.
+    static ItemState stateOfUnread(platform::KeychainItemClass itemClass, const Data& reference) {
+        const ItemState state = stateOfItem(itemClass, reference);
+        return state == ItemState::Readable ? ItemState::Unreadable : state;
+    }
+
+    ItemState readCertificate(std::optional<platform::Certificate>* certificate) const {
         const Data reference = entry_.reference();
-        if (copyCertificateFromKeychainGivenPersistentRef(reference, certificate) && *certificate)
-            return true;
+        const bool isRead = copyCertificateFromKeychainGivenPersistentRef(reference, certificate);
+        if (isRead && *certificate) return ItemState::Readable;
         VELTOID_LOG_FROM(kFunction, kNotice, "Failed trying to get certificate from keychain ",
                          reference ? "from persistent reference for veltoID " : "for veltoID ", accountName_,
                          reference ? logText(" certRef=", reference) : " because certRef=NULL");
-        return false;
+        return isRead ? ItemState::Gone : stateOfUnread(platform::KeychainItemClass::Certificate, reference);
     }
 
-    bool readPrivateKey() const {
+    ItemState readPrivateKey() const {
         const Data reference = entry_.privateKeyReference();
         // That it can be unsealed says enough: reading a key costs as much as all the rest of a check.
-        if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return true;
+        if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return ItemState::Readable;
         VELTOID_LOG_FROM(
             kFunction, kNotice,
             "Failed trying to get private key from keychain from persistent reference for veltoID ",
             accountName_, reference ? logText(" certRef=", reference) : " privateKeyRef=NULL");
-        return false;
+        return stateOfUnread(platform::KeychainItemClass::Key, reference);
     }
 
     AccountState evaluate(const platform::Certificate& certificate) {

@@ -23,7 +23,7 @@ struct ProcessHooks {
     std::function<void(double date)> scheduleRelaunch = [](double) {};
     /// Is running at the date, which the server asks for.
     std::function<void(double date)> scheduleRequestedLaunch = [](double) {};
-    /// Ends, and does not return before that.
+    /// Ends as soon as the work in hand is done; returns at once.
     std::function<void()> endProcess = [] {};
 };
 
