@@ -49,7 +49,8 @@ bool setValues(Store& store, const String& encDsId, const Dictionary& values, No
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (!store.isLoaded())
-            return failWith(error, identityError(identity_error::kNoCertificateForAccount));
+            return failWith(error, VELTOID_ERROR_FROM("__VeltoIDDBCopyCertificateKeys",
+                                                      identity_error::kNoCertificateForAccount));
         fill(keys, database::keysOf(store.certificates));
         return true;
     });

@@ -28,7 +28,9 @@ constexpr const char* kRequestFunction = "__VeltoIDDoCreateCertificateRequestFor
 // Seconds.
 constexpr double kDefaultDelayAfterFailedSignIn = 10;
 
-Error statusCodeError() { return {String(kOSStatusErrorDomain), -1, {}}; }
+Error statusCodeError(const char* description, int line) {
+    return makeStatusError(description, kRequestFunction, __FILE_NAME__, line);
+}
 
 /// Has the failure judged and hands it out.
 bool fail(const String& accountName, const String& sentPasswordHash, const std::optional<Error>& held,
@@ -125,9 +127,10 @@ class SigningRequest {
 
     bool adoptEncDsId() {
         const OwnershipLock ownership;
-        return isCurrent(ownership) && (request_.record.encDsId() == request_.encDsId ||
-                                        setInRecord({{kVeltoIDAccountDSIDKey, request_.encDsId}}) ||
-                                        failWith(&held_, statusCodeError()));
+        return isCurrent(ownership) &&
+               (request_.record.encDsId() == request_.encDsId ||
+                setInRecord({{kVeltoIDAccountDSIDKey, request_.encDsId}}) ||
+                failWith(&held_, statusCodeError("The encDsId cannot be stored", __LINE__)));
     }
 
     bool makeKeys() {
@@ -138,7 +141,7 @@ class SigningRequest {
         VELTOID_LOG_FROM(kRequestFunction, kError,
                          "Failed to generate a CSR or privateKey for the dsID, err=", status, " ",
                          describeValue(text_), " ", privateKey_.description());
-        return failWith(&held_, statusCodeError());
+        return failWith(&held_, statusCodeError("No key or certificate request can be made", __LINE__));
     }
 
     bool send(VeltoIDAuthenticationSessionInfo& session) {

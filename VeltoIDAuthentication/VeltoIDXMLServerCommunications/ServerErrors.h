@@ -12,9 +12,14 @@ namespace veltoid {
 /// Where people manage their account.
 inline constexpr std::string_view kVeltoIDAccountManagementSite = "https://account.velto.example";
 
+/// What is said of an answer that is no XML-RPC, or no Dictionary.
+inline constexpr const char* kUnusableAnswer = "The server's answer cannot be understood";
+
 /// The agent's error for a call that failed with this password hash: wrong account or password (-101),
 /// disabled account (-102), anything else (-100). What that means for the stored password is judged at
-/// once. Fault, fault code and response go into the user information. Any queue but the database's.
+/// once. Fault, fault code and response go into the user information; for -100 the description tells a fault,
+/// a server that cannot be reached, one that closes the connection, and an answer that is none apart. Any
+/// queue but the database's.
 Error copyAndHandleXMLErrorResponse(const String& accountName, const String& passwordHash,
                                     const std::optional<Dictionary>& response,
                                     const std::optional<Error>& error);
