@@ -3,6 +3,7 @@
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
 
 namespace veltoid {
 namespace {
@@ -115,7 +116,11 @@ bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {
 bool hasValidCertificateEntry(const String& encDsId) {
     const CertificateEntry entry = certificateEntryOf(encDsId);
     const auto expires = entry.expires();
-    return entry.isIssued() && (!expires || *expires > platform::now() - kVeltoIDCertificateExpirationGrace);
+    if (!entry.isIssued() || (expires && *expires <= platform::now() - kVeltoIDCertificateExpirationGrace))
+        return false;
+    std::optional<platform::Certificate> certificate;
+    copyCertificateFromKeychainGivenPersistentRef(entry.reference(), &certificate);
+    return !certificate || certificate->notAfter > platform::now();
 }
 
 }  // namespace veltoid

@@ -99,22 +99,35 @@ class Examination {
     }
 
     AccountState examineCertificate() {
+        takeCertificate();
         AccountState state = classify();
         if (triedRecently_) return withValidationRecord(state);
         if (state == Unknown) {
             askAboutCertificate();
             // The server's word counts at once.
+            const Data before = entry_.reference();
             __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
             if (entry_.isInvalid()) return CertificateRevoked;
+            if (entry_.reference() != before) takeCertificate();
         }
         if (static_cast<int>(state) < 0) return state;
-        std::optional<platform::Certificate> certificate;
-        if (!readItems(&certificate)) return NoCertificate;
-        if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate) : CertificateAssumedOK;
+        if (!hasItems()) return NoCertificate;
+        if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate_) : CertificateAssumedOK;
         if (state != CertificateOK && state != CertificateAssumedOK) return state;
         return schedule().isDue(DueReason::Renewal) || schedule().isDue(DueReason::PreExpiry)
                    ? CertificateShouldBeRenewed
                    : withValidationRecord(state);
+    }
+
+    /// The certificate itself, as far as it can be had. Entries that an earlier agent has made may call it
+    /// good for longer than it is.
+    void takeCertificate() {
+        certificate_.reset();
+        copyCertificateFromKeychainGivenPersistentRef(entry_.reference(), &certificate_);
+        const auto expires = entry_.expires();
+        if (!certificate_ || (expires && *expires <= certificate_->notAfter)) return;
+        setInEntry(kVeltoIDCertificateExpirationDateKey, Value::date(certificate_->notAfter));
+        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
     }
 
     /// By the entry alone.
@@ -142,15 +155,14 @@ class Examination {
     }
 
     /// Whether certificate and private key can be had from the keychain.
-    bool readItems(std::optional<platform::Certificate>* certificate) const {
-        const bool hasCertificate = readCertificate(certificate);
-        return readPrivateKey() && hasCertificate;
+    bool hasItems() const {
+        const bool isThere = hasCertificate();
+        return readPrivateKey() && isThere;
     }
 
-    bool readCertificate(std::optional<platform::Certificate>* certificate) const {
+    bool hasCertificate() const {
+        if (certificate_) return true;
         const Data reference = entry_.reference();
-        if (copyCertificateFromKeychainGivenPersistentRef(reference, certificate) && *certificate)
-            return true;
         VELTOID_LOG_FROM(kFunction, kNotice, "Failed trying to get certificate from keychain ",
                          reference ? "from persistent reference for veltoID " : "for veltoID ", accountName_,
                          reference ? logText(" certRef=", reference) : " because certRef=NULL");
@@ -208,7 +220,7 @@ class Examination {
     }
 
     void setInEntry(std::string_view key, const Value& value) const {
-        __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::No);
+        __VeltoIDDBSetCertificateValues(entry_, {{key, value}}, Notify::No);
     }
 
     const String& accountName_;
@@ -218,6 +230,7 @@ class Examination {
     bool triedRecently_ = false;
     AccountRecord record_;
     CertificateEntry entry_;
+    std::optional<platform::Certificate> certificate_;
     String encDsId_;
     Session session_;
 };

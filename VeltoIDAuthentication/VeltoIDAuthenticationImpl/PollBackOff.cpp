@@ -32,7 +32,7 @@ double delayAfterPending(double delay) {
     return delay < kMaxPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
 }
 
-double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
+double delayAfterFailure(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
 
 std::optional<double> storedFetchDelta(const AccountRecord& record) {
     return finite(record.nextCertificateFetchDelta());

@@ -20,9 +20,9 @@ double randomPollingDelay();
 /// The delay to store after a wait of `delay`.
 double delayAfterPending(double delay);
 
-/// The delay to store after a wait of `delay` whose fetch failed at the sign-in; at most
+/// The delay to store after a wait of `delay` whose question was not answered; at most
 /// randomPollingDelay().
-double delayAfterFailedSignIn(double delay);
+double delayAfterFailure(double delay);
 
 /// The record's "NextCertificateFetchDelta", if that is a finite number.
 std::optional<double> storedFetchDelta(const AccountRecord& record);

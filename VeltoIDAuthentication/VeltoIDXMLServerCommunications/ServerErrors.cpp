@@ -10,6 +10,8 @@ constexpr int64_t kFaultInvalidAccount = -20101;
 constexpr int64_t kFaultInvalidPassword = -20283;
 constexpr int64_t kFaultAccountDisabled = -20209;
 
+constexpr std::string_view kFaultCodeKey = "XMLFaultCode";
+
 // Codes of the HTTPS client library: the server has accepted the connection and closed it without an answer.
 constexpr int64_t kEmptyAnswer = 52;
 constexpr int64_t kReceiveFailed = 56;
@@ -58,7 +60,7 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
     if (error) {
         userInfo.set(kErrorUnderlyingErrorKey, *error);
         if (error->domain.view() == kXMLErrorDomain) {
-            userInfo.set("XMLFaultCode", Value::int64(error->code));
+            userInfo.set(kFaultCodeKey, Value::int64(error->code));
             if (error->code == kFaultInvalidAccount || error->code == kFaultInvalidPassword) {
                 code = identity_error::kInvalidAccountOrPassword;
                 texts.failureReason = "The Velto ID account or password are incorrect.";
@@ -79,6 +81,10 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
 bool refusesPassword(const std::optional<Error>& error) {
     return isIdentityError(error, identity_error::kInvalidAccountOrPassword) ||
            isIdentityError(error, identity_error::kAccountLogonDisabled);
+}
+
+bool isOtherFault(const std::optional<Error>& error) {
+    return isIdentityError(error, identity_error::kUnknown) && error->userInfo.contains(kFaultCodeKey);
 }
 
 void handleServerError(const String& accountName, const String& sentPasswordHash,

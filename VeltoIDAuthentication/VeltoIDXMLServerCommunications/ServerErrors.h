@@ -27,6 +27,9 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
 /// Whether the server refuses the password (-101) or has disabled the account (-102).
 bool refusesPassword(const std::optional<Error>& error);
 
+/// Whether the server itself has answered the call, with a fault that says nothing of the password.
+bool isOtherFault(const std::optional<Error>& error);
+
 /// Judges the failure of an operation of the engine that used this password hash, as above; the log says what
 /// becomes of the account. Any queue but the database's.
 void handleServerError(const String& accountName, const String& sentPasswordHash,
