@@ -108,6 +108,19 @@ class CommandLine(unittest.TestCase):
         self.run_table([strange, (forget, "", 0, "is forgotten")])
         self.assertNotIn("keychain", self.run_client("status").stdout)
 
+    def test_what_went_wrong_with_the_server_is_said(self):
+        for wrong, said in [
+                (dict(fault={"code": -7, "string": "not today"}), "The server answered with the fault -7: not today"),
+                (dict(status=503), "The server did not answer, or not with success"),
+                (dict(close="before"), "The server closed the connection without an answer"),
+                (dict(body="<html>Welcome!</html>"), "The server's answer cannot be understood"),
+                (dict(set={"encDsId": None}), "can not talk with the Velto ID server")]:
+            with self.subTest(wrong):
+                self.world.server.next("authenticate", **wrong)
+                self.run_table([(["verify", ACCOUNT, "--password-stdin"], PASSWORD, 1, said)])
+        self.run_table([(["verify", ACCOUNT, "--hashed-password-stdin"], hashed("wrong"), 1, "are incorrect"),
+                        (["info", "nobody"], "", 1, "There is no such account on this device")])
+
     def test_json_is_the_whole_reply_of_every_command(self):
         for command in (["ping"], ["list"], ["status"], ["database"], ["info", "nobody"], ["forget", "nobody"]):
             for arguments in (["--json", *command], [*command, "--json"]):

@@ -43,6 +43,8 @@ inline constexpr RecordKey kVeltoIDAccountNextValidationDateKey = "NextValidatio
 inline constexpr RecordKey kVeltoIDAccountForceValidationKey = "ForceValidation";
 inline constexpr RecordKey kVeltoIDAccountCertificateTokenKey = "CertificateToken";
 inline constexpr RecordKey kVeltoIDAccountCertificateTokenExpirationKey = "CertificateTokenExpiration";
+/// Since when the server answers questions for the token with faults.
+inline constexpr RecordKey kVeltoIDAccountCertificateTokenFaultsSinceKey = "CertificateTokenFaultsSince";
 inline constexpr RecordKey kVeltoIDAccountCSRGenerationDateKey = "CSRGenerationDate";
 /// Seconds.
 inline constexpr RecordKey kVeltoIDAccountCSRGenerationIntervalKey = "CSRGenerationInterval";

@@ -88,6 +88,7 @@ class AccountRecord : Dictionary {
     Data pendingKeyReference() const { return data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey); }
     String certificateToken() const { return string(kVeltoIDAccountCertificateTokenKey); }
     Date certificateTokenExpiration() const { return date(kVeltoIDAccountCertificateTokenExpirationKey); }
+    Date certificateTokenFaultsSince() const { return date(kVeltoIDAccountCertificateTokenFaultsSinceKey); }
     Date nextCertificateFetch() const { return date(kVeltoIDAccountCertificateNextCertificateFetchDateKey); }
     Seconds nextCertificateFetchDelta() const {
         return number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey);

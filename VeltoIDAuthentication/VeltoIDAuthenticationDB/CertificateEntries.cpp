@@ -5,6 +5,7 @@
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
 
 namespace veltoid {
 namespace {
@@ -75,7 +76,8 @@ bool setValues(Store& store, const String& encDsId, const Dictionary& values, No
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (!store.isLoaded())
-            return failWith(error, identityError(identity_error::kNoCertificateForAccount));
+            return failWith(error, VELTOID_ERROR_FROM("__VeltoIDDBCopyCertificateKeys",
+                                                      identity_error::kNoCertificateForAccount));
         fill(keys, database::keysOf(store.certificates));
         return true;
     });
@@ -144,7 +146,11 @@ bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {
 bool hasValidCertificateEntry(const String& encDsId) {
     const CertificateEntry entry = certificateEntryOf(encDsId);
     const auto expires = entry.expires();
-    return entry.isIssued() && (!expires || *expires > platform::now() - kVeltoIDCertificateExpirationGrace);
+    if (!entry.isIssued() || (expires && *expires <= platform::now() - kVeltoIDCertificateExpirationGrace))
+        return false;
+    std::optional<platform::Certificate> certificate;
+    copyCertificateFromKeychainGivenPersistentRef(entry.reference(), &certificate);
+    return !certificate || certificate->notAfter > platform::now();
 }
 
 }  // namespace veltoid

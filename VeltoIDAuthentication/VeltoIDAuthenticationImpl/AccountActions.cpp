@@ -141,6 +141,7 @@ void checkAccount(const AccountRecord& record) {
         case ValidationRecordNeedsToBeUpdated:
             return fetchValidationRecordForAccount(record, options);
         case CertificatePending:
+            if (endExpiredRequest(accountName)) return checkAccount(accountRecordOf(accountName));
             __VeltoIDDoFetchCertificateForVeltoID(accountName, FetchTime::WhenDue, options);
             return;
         case Unknown:

@@ -287,9 +287,14 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
 bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
                                   Dictionary* information, ErrorOut error) {
     const String requested = requestedEncDsId(accountName, encDsId);
-    if (!requested) return failWith(error, {kOSStatusErrorDomain, -1, {}});
+    if (!requested)
+        return failWith(error, makeStatusError("There is no such account on this device, or it was never "
+                                               "signed in",
+                                               __func__, __FILE_NAME__, __LINE__));
     const CertificateEntry entry = certificateEntryOf(requested);
-    if (!entry.exists()) return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+    if (!entry.exists())
+        return failWith(error, makeError(identity_error::kUnknown, {{}, "There is no certificate", {}}, {},
+                                         __func__, __FILE_NAME__, __LINE__));
     Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
     takeEntries(entry.values(), kCertificateEntries, found);
     if (getBool(&options, option::kCertificateDetails, false))

@@ -133,7 +133,8 @@ AccountSchedule::Date AccountSchedule::validation() const {
 AccountSchedule::Date AccountSchedule::pendingFetch() const {
     if (!record_.certificateToken()) return std::nullopt;
     const auto next = record_.nextCertificateFetch();
-    return next && *next <= now_ + kMaxFetchDelay ? at(next) : rightNow();
+    if (!next || *next > now_ + kMaxFetchDelay) return rightNow();
+    return at(std::min(*next, record_.certificateTokenExpiration().value_or(*next)));
 }
 
 AccountSchedule::Date AccountSchedule::expiry() const {

@@ -1,8 +1,6 @@
 // How long to wait before a pending certificate is asked for again. All in seconds.
 #pragma once
 
-#include <optional>
-
 #include "Values/Value.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
@@ -24,21 +22,16 @@ inline constexpr double kMaxFetchDelay = 604'800;
 /// A random delay between one and two days, so that devices that fail together do not come back together.
 double randomPollingDelay();
 
-/// The delay to store after a wait of `delay`: half as long again, up to kMaxOwnPollDelay.
-double delayAfterPending(double delay);
-
-/// The same after a wait of `delay` whose fetch failed at the sign-in.
-double delayAfterFailedSignIn(double delay);
-
-/// The record's "NextCertificateFetchDelta", if that is a finite number.
-std::optional<double> storedFetchDelta(const AccountRecord& record);
-
 /// How long to wait before the certificate is asked for: what the server says now (`delay`, absent or a
 /// Number; kMinPollDelay at least, a week at most), else what the record has noted, else a minute.
 double pendingDelay(const Value& delay, const AccountRecord& record);
 
 /// The delay that a fresh token came with: half a minute if the server gave none, kMinPollDelay for one that
 /// is shorter, or longer than a day.
-std::optional<double> tokenDelay(const Value& delay);
+double tokenDelay(const Value& delay);
+
+/// Lets the next fetch of the account's pending certificate be made after `delay`, and one after that half as long
+/// again later, up to kMaxOwnPollDelay. False when that cannot be stored.
+bool putOffFetch(const String& accountName, double delay);
 
 }  // namespace veltoid

@@ -240,11 +240,11 @@ TEST_F(SessionTest, FaultsBecomeTheAgentsErrors) {
         {"password", faultOf(-20283), some, -101, kIncorrect, true,
          with({kReason, kCause, kCode, kResponse})},
         {"disabled", faultOf(-20209), {}, -102, kDisabled, true, with({kReason, kText, kCause, kCode})},
-        {"another fault", faultOf(-4164), {}, -100, nullptr, false, with({kCause, kCode})},
-        {"another domain", sameCodeElsewhere, {}, -100, nullptr, false, with({kCause})},
-        {"the transport", transport, some, -100, nullptr, false, with({kCause, kResponse})},
-        {"a response", {}, some, -100, nullptr, false, with({kResponse})},
-        {"nothing", {}, {}, -100, nullptr, false, with({})},
+        {"another fault", faultOf(-4164), {}, -100, nullptr, false, with({kText, kCause, kCode})},
+        {"another domain", sameCodeElsewhere, {}, -100, nullptr, false, with({kText, kCause})},
+        {"the transport", transport, some, -100, nullptr, false, with({kText, kCause, kResponse})},
+        {"a response", {}, some, -100, nullptr, false, with({kText, kResponse})},
+        {"nothing", {}, {}, -100, nullptr, false, with({kText})},
     };
     for (const auto& [what, given, response, code, reason, removesPassword, userInfo] : cases) {
         SCOPED_TRACE(what);

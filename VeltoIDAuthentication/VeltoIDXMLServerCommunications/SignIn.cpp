@@ -31,6 +31,11 @@ Error signInError(int64_t code, int line, const ErrorTexts& texts = {}) {
     return makeError(code, texts, {}, kOperation, __FILE_NAME__, line);
 }
 
+/// Beside the words for people, what it comes from.
+Error outOfDateError(const char* description, int line) {
+    return signInError(identity_error::kServerProtocol, line, {kClientOutOfDate, description, {}});
+}
+
 /// One sign-in; everything runs on the account's queue.
 class SignIn {
   public:
@@ -60,7 +65,6 @@ class SignIn {
             count(kVeltoIDMetaSuccessfulConnectionCountKey);
         } else {
             if (mayConnect()) signInAnew(url);
-            if (!session_ && !held_) held_ = identityError(identity_error::kSignInFailed);
             keepBooks();
         }
     }
@@ -89,7 +93,7 @@ class SignIn {
                              "Not connecting to VeltoID authentication server because clientTooOld = true is "
                              "set for this account ",
                              accountName_, ".");
-            held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
+            held_ = outOfDateError("The server has refused this version of the agent", __LINE__);
             return false;
         }
         if (const auto earliest = record_.embargoEnd(now_)) {
@@ -109,8 +113,9 @@ class SignIn {
         if (url) {
             authenticate(url, parameters);
         } else {
-            held_ = copyAndHandleXMLErrorResponse(accountName_, passwordHash_, std::nullopt,
-                                                  signInError(identity_error::kUnknown, __LINE__));
+            held_ = copyAndHandleXMLErrorResponse(
+                accountName_, passwordHash_, std::nullopt,
+                signInError(identity_error::kUnknown, __LINE__, {{}, "The server has no address", {}}));
         }
         if (session_) return;
         VELTOID_LOG_FROM(kOperation, kNotice, "Didn't succeed with .authenticate, and error is ",
@@ -152,7 +157,10 @@ class SignIn {
             return;
         }
         count(kVeltoIDXMLAuthenticateCountKey);
-        if (reply) applyReply(*reply, *session);
+        if (reply)
+            applyReply(*reply, *session);
+        else
+            held_ = signInError(identity_error::kSignInFailed, __LINE__, {{}, kUnusableAnswer, {}});
         if (session->fEncDsId) session_ = std::move(session);
     }
 
@@ -164,7 +172,8 @@ class SignIn {
             __VeltoIDDBSetAccountValues(accountName_, {{kVeltoIDAccountClientTooOldKey, Value::boolean(true)},
                                                        {kVeltoIDAccountClientTooOldVersionKey,
                                                         Value::real(kVeltoIDDBAccessorVersion)}});
-            held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
+            held_ = signInError(identity_error::kServerCannotBeReached, __LINE__,
+                                {{}, "The server refuses this version of the agent", {}});
         }
         encDsId_ = reply.string(wire::kEncDsId);
         if (oldEncDsId_ && encDsId_ && oldEncDsId_ != encDsId_) disableCertificatesOfChangedAccount();
@@ -173,7 +182,8 @@ class SignIn {
             session.fEncDsId = encDsId_;
             applyCertificateState(reply);
         } else if (!held_) {
-            held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
+            held_ =
+                outOfDateError("The server's answer to the sign-in lacks the account's encDsId", __LINE__);
         }
         applyRecordIdentifier(reply.string(wire::kRecordIdentifier));
         result_ = reply;
