@@ -101,7 +101,7 @@ RequestsSeen seenBy(const OwnershipLock& ownership, const String& accountName) {
 std::shared_ptr<Request> noteRequest(const AccountRecord& record, const String& password) {
     Requests& all = requests();
     std::erase_if(all.last, [](const auto& entry) { return !recordOfSame(entry.second->record); });
-    const auto request = std::make_shared<Request>(Request{++all.lastNumber, record, password});
+    auto request = std::make_shared<Request>(Request{++all.lastNumber, record, password});
     all.last[record.accountName().text()] = request;
     return request;
 }

@@ -116,7 +116,7 @@ Dictionary createCallParameters(const String& accountName, const String& session
 Dictionary recordValuesFromServer(const String& accountName, const Dictionary& values) {
     Dictionary taken = values;
     taken.remove(kVeltoIDAccountServerURLKey);
-    const Value name = values[kVeltoIDAccountNameKey];
+    const Value& name = values[kVeltoIDAccountNameKey];
     if (!taken.remove(kVeltoIDAccountNameKey)) return taken;
     taken.set(kVeltoIDAccountServerNameKey, name == Value(accountName) ? Value::null() : name);
     return taken;
