@@ -60,7 +60,7 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
              check();
              (void)__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll);
          },
-         false, false, 0},
+         false, false, 300},
         {"PasswordInaccessibleInKeychain",
          [&] {
              add(true);
@@ -90,8 +90,8 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
              addWith("Dirty", kOn);
              std::filesystem::remove(directory_.base() / "harbwell" / "identity-authority.pem");
          },
-         true, false, 14 * kDay - 1},
-        {"CertificateOK", [&] { addWith("Dirty", kOn); }, true, false, 14 * kDay - 1},
+         true, false, 0},
+        {"CertificateOK", [&] { addWith("Dirty", kOn); }, true, false, 0},
         {"CertificateAssumedOK", [&] { add(true); }, false, false, 14 * kDay - 1},
         {"CertificateShouldBeRenewed",
          [&] {

@@ -225,14 +225,13 @@ TEST_F(IssuanceTest, TheServersEncDsIdBecomesTheAccounts) {
     EXPECT_TRUE(__VeltoIDDoCreateCertificateRequestForVeltoID(kName, {}, &encDsId));
     EXPECT_EQ(encDsId, "d1");
     EXPECT_EQ(record()["encDsId"], Value("d1"));
-    EXPECT_EQ(in(kFetchDate), 0) << "no delay, no wait";
-    EXPECT_EQ(stored({kDelta}), kNone);
+    EXPECT_EQ(delays(), Delays(30, 30)) << "no delay given";
 }
 
 TEST_F(IssuanceTest, TheDelayOfATokenIsBelievedUpToADay) {
-    const std::pair<Value, double> cases[] = {{number(0), 0},          {number(86'400), 86'400},
-                                              {number(100'000), 15},   {number(-5), 15},
-                                              {Value::real(0.5), 0.5}, {Value::real(1e300), 15}};
+    const std::pair<Value, double> cases[] = {{number(0), 30},        {number(86'400), 86'400},
+                                              {number(100'000), 15},  {number(-5), 15},
+                                              {Value::real(0.5), 15}, {Value::real(1e300), 15}};
     for (const auto& [delay, stored] : cases) {
         clock_.advanceBy(3'600);
         answerRequests({{kToken, "t"}, {"Delay", delay}});
@@ -262,17 +261,18 @@ TEST_F(IssuanceTest, EveryAnswerIsAppliedToTheAccount) {
         {"pending", pending, number(60), none, false, true, 60, 90, 90, {}},
         {"pending, noted delay", pending, none, number(100), false, true, 100, 150, 150, {}},
         {"pending, no delay", pending, none, none, false, true, 60, 90, 90, {}},
-        {"pending, at once", pending, number(0), none, false, true, 1, 0, 0, {}},
-        {"pending, in the past", pending, number(-8), none, false, true, 1, -12, -12, {}},
-        {"pending, a long day", pending, number(90'000), none, false, true, 90'000, 86'400, 172'800, {}},
-        {"pending, a year", pending, number(31'536'000), none, false, true, 604'800, 86'400, 172'800, {}},
-        {"pending, no number", pending, Value::real(nan), number(10), false, true, 10, 15, 15, {}},
+        {"pending, at once", pending, number(0), none, false, true, 60, 90, 90, {}},
+        {"pending, in the past", pending, number(-8), none, false, true, 60, 90, 90, {}},
+        {"pending, very soon", pending, number(2), none, false, true, 15, 22.5, 22.5, {}},
+        {"pending, a long day", pending, number(90'000), none, false, true, 90'000, 90'000, 90'000, {}},
+        {"pending, a year", pending, number(31'536'000), none, false, true, 604'800, 604'800, 604'800, {}},
+        {"pending, no number", pending, Value::real(nan), number(10), false, true, 15, 22.5, 22.5, {}},
         {"pending, for ever", pending, Value::real(infinity), none, false, true, 60, 90, 90, {}},
         {"failed", status("FAILED"), number(60), number(1), false, false, {}, 0, 0, 3600},
         {"unknown", status("?"), none, number(100), false, false, 100, 150, 150, 7},
-        {"unknown, no delta", noText, none, none, false, false, 86'400, 86'400, 172'800, 7},
-        {"unknown, no result", {}, none, number(0), false, false, 86'400, 86'400, 172'800, 7},
-        {"long", status("cert_issued"), none, number(90'000), false, false, 90'000, 86'400, 172'800, 7},
+        {"unknown, no delta", noText, none, none, false, false, 60, 90, 90, 7},
+        {"unknown, no result", {}, none, number(0), false, false, 15, 22.5, 22.5, 7},
+        {"long", status("cert_issued"), none, number(90'000), false, false, 3'600, 3'600, 3'600, 7},
         {"expired", status("?"), none, number(100), true, false, {}, 0, 0, 3600},
         {"failed, expired", status("FAILED"), none, none, true, false, {}, 0, 0, 3600},
         {"pending, expired", pending, none, none, true, true, 60, 90, 90, {}},
