@@ -370,7 +370,7 @@ TEST_F(IssuanceTest, ACertificateEndsByItsOwnAccountWhateverItsEntrySays) {
         if (expires.isString()) setInEntry({{kValidated, date(-1e8)}, {kAttempt, date()}});
         EXPECT_FALSE(hasValidCertificateEntry("d1"));
         EXPECT_EQ(checkAccountAndDetermineNextAction(kName, {}), AccountState::CertificateExpired);
-        EXPECT_LT(copyNextActionDateForAccount(kName), now());
+        EXPECT_LE(copyNextActionDateForAccount(kName), now());
     }
 }
 
@@ -396,18 +396,17 @@ TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
     EXPECT_EQ(record()[kToken], Value("t1")) << "until the next result or its expiry";
     EXPECT_EQ(log_.count("Failed while fetching result for certificate token t1, error="), 3);
 
-    clock_.advanceBy(10);
+    clock_.advanceBy(60);
     setValue(kDelta, kGone);
     server_.refuse("authenticate", 503);
     EXPECT_TRUE(fetch()) << "a server that cannot be reached is tried later";
-    EXPECT_EQ(delays(), Delays(10, 15));
-    clock_.advanceBy(10);
+    EXPECT_EQ(delays(), Delays(60, 90));
+    clock_.advanceBy(60);
     EXPECT_TRUE(fetch());
-    EXPECT_EQ(delays(), Delays(15, 22.5));
+    EXPECT_EQ(delays(), Delays(90, 135));
     setValue(kDelta, number(200'000));
     EXPECT_TRUE(fetch(FetchTime::AtOnce));
-    EXPECT_EQ(in(kFetchDate), 200'000);
-    EXPECT_TRUE(record().number(kDelta) >= kDay && record().number(kDelta) <= 2 * kDay);
+    EXPECT_EQ(delays(), Delays(3'600, 3'600));
 }
 
 TEST_F(IssuanceTest, WhatIsNotAnsweredIsAskedAgain) {
@@ -482,7 +481,7 @@ TEST_F(IssuanceTest, ACertificateThatCannotBeStoredNowIsFetchedAgain) {
     platform::editDatabase("keychain.db",
                            "CREATE TRIGGER busy BEFORE INSERT ON items BEGIN "
                            "SELECT RAISE(ABORT, 'not now'); END");
-    EXPECT_FALSE(fetch());
+    EXPECT_FALSE(fetch(FetchTime::AtOnce));
     EXPECT_EQ(server_.takeMethods(), "authenticate fetchCert");
     EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
     platform::editDatabase("keychain.db", "DROP TRIGGER busy");
