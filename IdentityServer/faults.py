@@ -40,6 +40,8 @@ class Injection:
     size: int | None = None
     close_at: str | None = None
     changes: dict[str, Any] = field(default_factory=dict)
+    # As it was queued.
+    request: dict[str, Any] | None = None
 
 
 class Injections:
@@ -89,7 +91,7 @@ class Injections:
         if not outcomes and "delay" not in request:
             raise ValueError("an injection needs an outcome or a delay")
         injection = Injection(method, int(_number(request, "times", 1, 1, 2**31)),
-                              _number(request, "delay", 0, 0, LONGEST_DELAY), _answer(request))
+                              _number(request, "delay", 0, 0, LONGEST_DELAY), _answer(request), request=request)
         if "size" in request:
             injection.size = int(_number(request, "size", 0, 1, LARGEST_REPLY))
         if "close" in request:

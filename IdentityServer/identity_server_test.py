@@ -287,6 +287,8 @@ class InjectionTest(ServerTest):
         server.next(status=503)
         self.assertEqual([self.observe() for _ in range(3)], [(502, ""), (502, ""), (503, "")])
         self.assertEqual(self.observe()["lastNm"], "Roe")
+        met = [call["injection"] for call in server.received("getMyInfo")][-4:]
+        self.assertEqual([injection and injection["status"] for injection in met], [502, 502, 503, None])
         self.assertEqual(server.pending(), [{"method": "authenticate", "times": 1}])
         server.clear_next()
         self.assertIsNone(fault_of("authenticate", SIGN_IN))

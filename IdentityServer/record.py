@@ -15,9 +15,10 @@ KEPT_CALLS = 10_000
 MALFORMED = "(malformed)"
 
 
-@dataclass(frozen=True)
+@dataclass
 class Call:
-    """One call. `name` is the full method name, or MALFORMED with the reason in `error`."""
+    """One call. `name` is the full method name, or MALFORMED with the reason in `error`. What became of it comes
+    later: the injection that it has met, and whether it was answered, or left without an answer on purpose."""
 
     name: str
     arguments: tuple[Any, ...]
@@ -25,6 +26,8 @@ class Call:
     raw: bytes
     error: str | None = None
     at: float = field(default_factory=time.time)
+    injection: dict[str, Any] | None = None
+    answered: bool = False
 
     @property
     def method(self) -> str:
@@ -36,6 +39,7 @@ class Call:
         arguments = to_json(self.arguments)
         return {"method": self.method, "parameters": arguments[0] if len(arguments) == 1 else arguments,
                 "headers": self.headers, "at": self.at, "error": self.error,
+                "injection": self.injection, "answered": self.answered,
                 "raw": self.raw.decode("utf-8", "replace")}
 
 

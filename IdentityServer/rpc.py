@@ -35,7 +35,11 @@ class RpcHandler(LoopbackHandler):
             body = self.read_body()
             if self.path != PATH:
                 raise Refusal(404, "not found")
-            self._answer_call(self._read_call(body))
+            call = self._read_call(body)
+            try:
+                self._answer_call(call)
+            finally:
+                call.answered = True
         except Refusal as refusal:
             self.answer(refusal.status, f"{refusal}\n".encode(), "text/plain; charset=utf-8")
 
@@ -56,7 +60,7 @@ class RpcHandler(LoopbackHandler):
             method, arguments = decode_call(body)
         except Exception as error:  # the decoder raises many kinds
             reason = f"{type(error).__name__}: {error}"
-            service.record.add(Call(MALFORMED, (), headers, body, reason), service.settings.record)
+            service.record.add(Call(MALFORMED, (), headers, body, reason, answered=True), service.settings.record)
             raise Refusal(400, reason) from error
         call = Call(method, arguments, headers, body)
         service.record.add(call, service.settings.record)
@@ -65,6 +69,7 @@ class RpcHandler(LoopbackHandler):
     def _answer_call(self, call: Call) -> None:
         service: Service = self.server.app
         injection = service.injections.take(call.method) or Injection(call.method, 1)
+        call.injection = injection.request
         if injection.delay:
             time.sleep(injection.delay)
         if injection.close_at == "before":

@@ -22,7 +22,7 @@ from dataclasses import dataclass
 
 from harness.load_clients import (PASSWORDS, WAITING_ACCOUNT, Conversation, Findings, Timetable, flood, is_success, mix,
                                   sleep_until, success_with, wait_for_certificate)
-from harness.world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, PING, World, hashed, references
+from harness.world import ACCOUNT, ADD, DATABASE, FORGET, LIST, PASSWORD, PING, World, hashed
 
 SECONDS = float(os.environ.get("VELTOID_LOAD_SECONDS", "8"))
 CALM_SHARE = 0.5  # of that, before
@@ -84,11 +84,6 @@ def ping_times(seconds: float) -> tuple[float, float]:
         return put_under_load(world, world.start_agent().pid, seconds).slowest_pings()
 
 
-def loose_ends(world: World, contents: dict) -> set:
-    """Items of the keychain that are not referred to, and references that lead to none."""
-    return references(contents) ^ world.keychain_items().keys()
-
-
 class ManyClients(unittest.TestCase):
     def test_every_request_has_its_reply_and_nothing_is_left_behind(self):
         with World(environment=SANITIZER) as world:
@@ -116,12 +111,12 @@ class ManyClients(unittest.TestCase):
             self.assertEqual(client.call(LIST).get("result", []), list(accounts))
             self.assertLessEqual(len(accounts), 1)
             self.assertLessEqual(set(entries), {record.get("encDsId") for record in accounts.values()})
-            self.assertEqual(loose_ends(world, contents), set())
+            self.assertEqual(world.loose_ends(contents), set())
             for one in load.findings:
                 self.assertLessEqual(one.stored.items(), contents["MetaInfo"].items())
             for name in accounts:
                 self.assertTrue(client.call(FORGET, VeltoID=name)["success"])
-            self.assertEqual(loose_ends(world, client.call(DATABASE)["result"]), set())
+            self.assertEqual(world.loose_ends(client.call(DATABASE)["result"]), set())
 
     @staticmethod
     def report(load: Load):
@@ -165,7 +160,7 @@ class OneAccount(unittest.TestCase):
                                    hashedpassword=hashed(PASSWORD), options={"DoNotCheckPassword": True})
                 for client in clients:
                     client.take_all()
-                self.assertEqual(loose_ends(world, clients[0].call(DATABASE)["result"]), set())
+                self.assertEqual(world.loose_ends(clients[0].call(DATABASE)["result"]), set())
 
 
 if __name__ == "__main__":

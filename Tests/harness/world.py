@@ -271,6 +271,10 @@ class World(contextlib.AbstractContextManager):
         """Class by reference."""
         return dict(execute(self.state_files() / "keychain.db", "SELECT id, class FROM items"))
 
+    def loose_ends(self, contents: dict) -> set:
+        """Items of the keychain that are not referred to, and references that lead to none."""
+        return references(contents) ^ self.keychain_items().keys()
+
 
 def references(contents: dict) -> set:
     """The items of the keychain that a database refers to."""

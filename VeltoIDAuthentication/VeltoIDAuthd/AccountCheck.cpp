@@ -12,6 +12,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
@@ -31,6 +32,7 @@ constexpr double kMinRelaunchInterval = 900;
 constexpr double kFirstRetry = 2;
 constexpr double kMaxRetry = 60;
 constexpr double kRetryGrowth = 1.5;
+constexpr double kUnreadableKeychainRetry = 900;
 
 double relaunchInterval() {
     const double seconds =
@@ -84,8 +86,10 @@ class AccountCheckLoop {
             lockState.onChange(nullptr);
         });
         while (!lockState.hasBeenUnlockedSinceBoot() && !isEnding()) {
-            scheduleRelaunch(platform::now() + kDay);
-            wait(kDay);
+            // Nobody tells when a keychain can be read again.
+            const double pause = keychainTrouble() ? kUnreadableKeychainRetry : kDay;
+            scheduleRelaunch(platform::now() + pause);
+            wait(pause);
         }
         lockState.onChange(nullptr);
     }
