@@ -59,6 +59,18 @@ class BroughtBack(unittest.TestCase):
                 self.assertLess(started, date + 2)
 
 
+    def test_a_first_look_at_the_accounts_is_taken_however_soon_it_leaves(self):
+        session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="1"))
+        with NameOwner(session.address) as owner, session.client() as client:
+            client.add(DoNotCheckPassword=True)
+            account = {}
+            while "LastAttempt" not in account:
+                owner.wait(False)
+                account = client.call(STATUS)["status"]["AccountStatuses"][ACCOUNT]
+                self.assertLess(owner.owners_gone, 5)
+            self.assertEqual((account["LastAttempt"], account["LastAttemptOutcome"]), ("sign-in", "failed"))
+
+
 class NothingIsLost(unittest.TestCase):
     def test_stop_and_restart_in_the_middle_of_requests(self):
         session = self.enterContext(UserSession(HARBWELL_IDLE_EXIT="0"))

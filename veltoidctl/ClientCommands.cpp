@@ -22,6 +22,10 @@ void printStatusOf(const std::string& account, const Json& status) {
     std::cout << account << "\n";
     printEntries(status, {{message::kAccountState, "  state"},
                           {message::kRequiresUserAction, "  needs you"},
+                          {veltoid::kVeltoIDAccountLastAttemptKey, "  last attempt"},
+                          {veltoid::kVeltoIDAccountLastAttemptDateKey, "    when"},
+                          {veltoid::kVeltoIDAccountLastAttemptOutcomeKey, "    outcome"},
+                          {veltoid::kVeltoIDAccountLastAttemptReasonKey, "    reason"},
                           {message::kNextActionTime, "  next action"},
                           {message::kNextFetchAttempt, "  next fetch"},
                           {veltoid::kVeltoIDAccountCertificateRequestsHeldUntilKey, "  requests held until"},

@@ -63,6 +63,11 @@ inline constexpr RecordKey kVeltoIDAccountClientTooOldVersionKey = "ClientTooOld
 /// When the account check looks at the account again at the earliest, and how far that was put off (seconds).
 inline constexpr RecordKey kVeltoIDAccountNextCheckDateKey = "NextAccountCheckDate";
 inline constexpr RecordKey kVeltoIDAccountCheckBackOffKey = "AccountCheckBackOff";
+/// The last contact with the server: what for, when, with which outcome, and why it failed.
+inline constexpr RecordKey kVeltoIDAccountLastAttemptKey = "LastAttempt";
+inline constexpr RecordKey kVeltoIDAccountLastAttemptDateKey = "LastAttemptDate";
+inline constexpr RecordKey kVeltoIDAccountLastAttemptOutcomeKey = "LastAttemptOutcome";
+inline constexpr RecordKey kVeltoIDAccountLastAttemptReasonKey = "LastAttemptReason";
 inline constexpr RecordKey kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
 inline constexpr RecordKey kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
 inline constexpr RecordKey kVeltoIDAccountValidationRecordIdentifierKey =

@@ -7,6 +7,7 @@
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AccountBackOff.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
@@ -120,6 +121,53 @@ TEST_F(AccountCheckTest, AnAccountThatAPassCannotHelpIsPutOff) {
     setValue("CSRGenerationDate", kGone);
     __VeltoIDDBSetAccountValue(kName, "x", "y", Notify::Yes);
     EXPECT_TRUE(asksForCertificateIn(11)) << "a change counts at once";
+}
+
+TEST_F(AccountCheckTest, AChangedCertificateIsLookedAtWithinHalfAMinute) {
+    issueAtOnce();
+    start();
+    clock_.advanceBy(kDay);
+    ASSERT_TRUE(hasValidCertificateEntry("d1"));
+    (void)server_.take();
+    ASSERT_TRUE(__VeltoIDDBSetCertificateValue("d1", "CertStatus", "CERTIFICATE_INVALID", Notify::Yes));
+    EXPECT_TRUE(asksForCertificateIn(30));
+    EXPECT_TRUE(hasValidCertificateEntry("d1"));
+}
+
+TEST_F(AccountCheckTest, AnUnreadableDatabaseIsTriedAgainSoon) {
+    issueAtOnce();
+    setValue("Dirty", kOn);
+    platform::TestLifetime::restart();
+    __VeltoIDDBSetUsePreferences(true);
+    std::optional<platform::Obstacle> obstacle("preferences.db");
+    start();
+    EXPECT_EQ(methodsIn(600), "");
+    EXPECT_GT(platform::transactions::openCount(), 0) << "it stays meanwhile";
+    EXPECT_LE(relaunch(), 60);
+    obstacle.reset();
+    EXPECT_TRUE(asksForCertificateIn(60));
+    EXPECT_TRUE(hasValidCertificateEntry("d1"));
+}
+
+TEST_F(AccountCheckTest, WhatWasPutOffStaysSoAcrossRestartsUntilThereIsNews) {
+    server_.fault("createCert", -1);
+    server_.refuse("authenticate", 503);
+    setValues({{"encDsId", kGone}, {"LastConnectAttempt", kGone}});
+    double until = 0;
+    for (int life = 0; life < 8; ++life) {
+        platform::TestLifetime::restart();
+        __VeltoIDDBSetUsePreferences(true);
+        start();
+        clock_.advanceBy(std::max(until - now(), 0.0) + 1);
+        EXPECT_EQ(server_.takeMethods(), "authenticate") << "life " << life;
+        const double before = until;
+        until = copyNextActionDateForAccount(kName).value_or(0);
+        EXPECT_GE(until - now(), life < 2 ? 290 : (now() - before) * 0.9) << "later each time";
+        EXPECT_LE(until - now(), 3'600);
+    }
+    ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, kPassword, nullptr));
+    setValue("LastConnectAttempt", kGone);
+    EXPECT_NE(methodsIn(10), "") << "adding it again is news";
 }
 
 TEST_F(AccountCheckTest, AClockThatIsSetMakesItLookAgain) {

@@ -53,6 +53,10 @@ Dictionary copyAccountStatus(const String& name, const Dictionary& options) {
             status.set(message::kNextFetchAttempt, Value::date(*nextFetch));
     if (const auto held = requestsHeldUntil(record))
         status.set(kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::date(*held));
+    for (const std::string_view key :
+         {kVeltoIDAccountLastAttemptKey, kVeltoIDAccountLastAttemptDateKey,
+          kVeltoIDAccountLastAttemptOutcomeKey, kVeltoIDAccountLastAttemptReasonKey})
+        status.set(key, record.values()[key]);
     if (const auto required = requiresUserAction(state))
         status.set(message::kRequiresUserAction, Value::boolean(*required));
     return status;

@@ -15,6 +15,8 @@
 #include "VeltoIDAuthd/PasswordCheckService.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
+#include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/ServerRequests.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
@@ -233,6 +235,41 @@ TEST_F(ServiceTest, WaitingForTheCertificateEndsWithTheClientAndAsksNobody) {
 }
 
 // --- Status
+
+TEST_F(ServiceTest, TheStatusTellsTheLastAttempt) {
+    createAccount("d1");
+    const auto attempt = [](const Dictionary& options) {
+        __VeltoIDDoGetMyInfo(kName, options, nullptr);
+        Dictionary of;
+        for (const auto& [key, value] : firstStatus())
+            if (key.view().starts_with("LastAttempt")) of.set(key, value);
+        return of;
+    };
+    const Dictionary forced = {{"ForceValidation", kOn}};
+    const Dictionary asked = {{"LastAttempt", "account information"},
+                              {"LastAttemptDate", date()},
+                              {"LastAttemptOutcome", "succeeded"}};
+    EXPECT_EQ(attempt(forced), asked);
+    server_.answer("authenticate",
+                   Dictionary{{"encDsId", "d1"}, {"dsSessionValidityDuration", number(1000)}});
+    (void)attempt(forced);
+    clock_.advanceBy(10);
+    const Value contact = meta("LastSuccessfulConnect");
+    EXPECT_EQ(attempt(forced)["LastAttemptDate"], date());
+    EXPECT_EQ(meta("LastSuccessfulConnect"), contact) << "a cached session is no contact by itself";
+    server_.refuse("authenticate", 503);
+    const Dictionary failed = attempt({{"ForceValidation", kOn}, {"DoNotUseCachedSession", kOn}});
+    EXPECT_EQ(failed["LastAttempt"], Value("sign-in"));
+    EXPECT_EQ(failed["LastAttemptOutcome"], Value("failed"));
+    EXPECT_NE(failed.string("LastAttemptReason").text().find("did not answer"), std::string::npos);
+    server_.fault("authenticate", -20101);
+    std::optional<Error> error;
+    EXPECT_FALSE(__VeltoIDDoVerifyPassword(kName, "mistyped", {{"DoNotSaveSessionInfo", kOn}}, &error));
+    EXPECT_EQ(firstStatus()["LastAttemptOutcome"], Value("failed")) << "somebody's typing is no attempt";
+    const Dictionary refused = attempt({{"ForceValidation", kOn}, {"DoNotUseCachedSession", kOn}});
+    EXPECT_EQ(refused["LastAttemptOutcome"], Value("refused"));
+    EXPECT_EQ(refused["LastAttemptReason"], Value("The Velto ID account or password are incorrect."));
+}
 
 TEST_F(ServiceTest, StatusOfAnAccount) {
     createAccount(nullptr);

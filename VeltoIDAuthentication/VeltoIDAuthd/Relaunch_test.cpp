@@ -98,6 +98,30 @@ TEST_F(RelaunchTest, AccountsThatNeedAnActionAndWhen) {
     EXPECT_EQ(earliest, now() + 1000);
 }
 
+TEST_F(RelaunchTest, WhatTheServerAskedForHidesNothingNearerAndOutlivesTheAgent) {
+    const auto begin = [this] {
+        platform::TestLifetime::restart();
+        __VeltoIDDBSetUsePreferences(true);
+        restoreRequestedLaunch();
+        clock_.settle();
+    };
+    begin();
+    const double requested = now() + 20 * kDay;
+    scheduleRelaunch(now() + kDay);
+    scheduleRequestedLaunch(requested);
+    clock_.settle();
+    EXPECT_EQ(manager_.take(), kDay);
+    EXPECT_EQ(nextLaunchDate(), requested) << "told until it has come";
+    __VeltoIDDBSynchronize();
+    begin();
+    EXPECT_EQ(nextLaunchDate(), requested);
+    scheduleRelaunch(now() + 30 * kDay);
+    clock_.settle();
+    EXPECT_EQ(manager_.take(), 20 * kDay);
+    clock_.advanceBy(21 * kDay);
+    EXPECT_EQ(nextLaunchDate(), now() + 9 * kDay);
+}
+
 TEST_F(RelaunchTest, TheEarliestActionIsWhenTheAgentComesBack) {
     scheduleRelaunch(now() + 10);
     computeRelaunchFromAccounts();

@@ -118,7 +118,7 @@ AccountSchedule::Date AccountSchedule::due(DueReason reason) const {
 
 AccountSchedule::Date AccountSchedule::signIn() const {
     const auto attempt = record_.lastConnectAttempt();
-    return attempt && *attempt <= now_ ? after(attempt, kReconnectInterval) : rightNow();
+    return attempt && *attempt <= now_ ? at(*attempt + kReconnectInterval) : rightNow();
 }
 
 AccountSchedule::Date AccountSchedule::validation() const {

@@ -16,6 +16,7 @@
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
+#include "VeltoIDXMLServerCommunications/ServerErrors.h"
 
 namespace veltoid {
 namespace {
@@ -147,6 +148,7 @@ class CertificateResult {
 
     bool applyPending() {
         const bool stored = putOffFetch(accountName_, pendingDelay(delay_, record_));
+        noteAttempt(accountName_, "certificate", kAttemptPending);
         setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::null()},
                      {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
                      {kVeltoIDAccountCertificateTokenFaultsSinceKey, Value::null()}},
@@ -159,6 +161,8 @@ class CertificateResult {
                          ", ", encDsId_, ", certToken=", token(), ".");
         VELTOID_LOG_FROM(kFunction, kWarning, "Certificate issuance request for ", accountName_,
                          " dsID=", encDsId_, " certToken=", token(), " failed to be issued by the server.");
+        noteAttempt(accountName_, "certificate", kAttemptRefused,
+                    "The server has issued no certificate for this account's request.");
         dropRequest();
         return false;
     }
@@ -169,6 +173,8 @@ class CertificateResult {
                          ", ", encDsId_, " ");
         VELTOID_LOG_FROM(kFunction, kWarning, "UNKNOWN Certificate issuance request for ", accountName_,
                          " dsID=", encDsId_, " certToken=", token(), ", status=", statusText(), ".");
+        noteAttempt(accountName_, "certificate", kAttemptFailed,
+                    "The server's answer on the certificate cannot be understood.");
         const auto expiration = record_.certificateTokenExpiration();
         if (expiration && *expiration < platform::now()) {
             dropRequest();

@@ -395,7 +395,7 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
                 __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
             __VeltoIDDBSetCertificateValue("d1", "Dirty", kGone, Notify::No);
         }
-        setValue("Dirty", {});
+        setValue("Dirty", values["Dirty"]);
         EXPECT_EQ(copyNextActionDateForAccount(kName), now() + due);
     }
     __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(7200));

@@ -25,6 +25,8 @@ struct Method {
     std::string_view shortName;
     /// Empty when successes are not counted.
     std::string_view counter;
+    /// As people call it; empty for what is no attempt at anything.
+    std::string_view purpose;
 };
 
 struct Call {
@@ -47,17 +49,19 @@ Call invoke(VeltoIDAuthenticationSessionInfo& session, const Method& method, con
     return call;
 }
 
-void count(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& options) {
+void noteSuccess(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& options) {
     if (!method.counter.empty())
         __VeltoIDDBIncrementMetaInfoCounter(session.fAccountName, options, method.counter, 1);
+    if (!method.purpose.empty()) noteAttempt(session.fAccountName, method.purpose, kAttemptSucceeded);
 }
 
 /// A failed call: hands out the translated error; the session is not used for anything else. False.
-bool fail(VeltoIDAuthenticationSessionInfo& session, const Call& call, ErrorOut error) {
-    fillError(error, copyAndHandleXMLErrorResponse(session.fAccountName, session.fPasswordHash, call.reply,
-                                                   call.error));
+bool fail(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Call& call, ErrorOut error) {
+    const Error held =
+        copyAndHandleXMLErrorResponse(session.fAccountName, session.fPasswordHash, call.reply, call.error);
+    if (!method.purpose.empty()) noteAttempt(session.fAccountName, method.purpose, held);
     session.spoil();
-    return false;
+    return failWith(error, held);
 }
 
 /// One call; `take` gets the reply.
@@ -65,8 +69,8 @@ template <typename Take>
 bool call(VeltoIDAuthenticationSessionInfo& session, const Method& method, const Dictionary& own,
           const Dictionary& options, ErrorOut error, Take take) {
     const Call made = invoke(session, method, own, options);
-    if (!made.isAnswered()) return fail(session, made, error);
-    count(session, method, options);
+    if (!made.isAnswered()) return fail(session, method, made, error);
+    noteSuccess(session, method, options);
     take(*made.reply);
     return true;
 }
@@ -169,8 +173,8 @@ bool _VeltoIDSessionDoGetMyInfo(VeltoIDAuthenticationSessionInfo& session, const
              stored ? stored : parameters.string(kVeltoIDCertificateSerialNumberKey)},
             {wire::kKnownRecordIdentifier, parameters.string(kVeltoIDAccountValidationRecordIdentifierKey)},
         };
-        return call(session, {"getMyInfo", kVeltoIDXMLGetMyInfoCountKey}, own, options, error,
-                    [&](const Dictionary& reply) {
+        return call(session, {"getMyInfo", kVeltoIDXMLGetMyInfoCountKey, "account information"}, own, options,
+                    error, [&](const Dictionary& reply) {
                         if (!session.fEncDsId) session.fEncDsId = reply.string(wire::kEncDsId);
                         fill(result, getMyInfoResult(reply));
                     });
@@ -179,7 +183,7 @@ bool _VeltoIDSessionDoGetMyInfo(VeltoIDAuthenticationSessionInfo& session, const
 
 bool __VeltoIDSessionDoFindPerson(VeltoIDAuthenticationSessionInfo& session, const Dictionary& criteria,
                                   const Dictionary& options, std::optional<Array>* matches, ErrorOut error) {
-    return callOnQueue(session, {"findPerson", kVeltoIDXMLFindPersonCountKey},
+    return callOnQueue(session, {"findPerson", kVeltoIDXMLFindPersonCountKey, "finding people"},
                        {{wire::kSearchCriteria, criteria}}, options, error, [&](const Dictionary& reply) {
                            const Array* found = reply.array(wire::kMatches);
                            if (found != nullptr) __VeltoIDDBAddFindPersonResultsToCache(*found);
@@ -200,8 +204,8 @@ bool __VeltoIDSessionDoSendCSR(VeltoIDAuthenticationSessionInfo& session, const 
              Value::real(metaInterval(session.fAccountName, options, kVeltoIDMetaCertificateLifetimeKey,
                                       kVeltoIDRequestedCertificateLifetime))},
         };
-        return call(session, {"createCert", kVeltoIDXMLSendCSRCountKey}, own, options, error,
-                    [&](const Dictionary& reply) {
+        return call(session, {"createCert", kVeltoIDXMLSendCSRCountKey, "certificate request"}, own, options,
+                    error, [&](const Dictionary& reply) {
                         fill(token, reply.string(wire::kCertificateToken));
                         fill(answer,
                              {copyCertificateResultFromDsCert(reply.dictionary(wire::kCertificateEntry)),
@@ -213,7 +217,7 @@ bool __VeltoIDSessionDoSendCSR(VeltoIDAuthenticationSessionInfo& session, const 
 bool __VeltoIDSessionDoFetchCSRResult(VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
                                       const String& token, const Dictionary& options,
                                       CertificateAnswer* answer, ErrorOut error) {
-    constexpr Method kMethod{"fetchCert", kVeltoIDXMLFetchCertCountKey};
+    constexpr Method kMethod{"fetchCert", kVeltoIDXMLFetchCertCountKey, "certificate"};
     return session.fDispatchQueue.sync([&] {
         const Call made =
             invoke(session, kMethod, {{wire::kCertificateToken, token}, {wire::kEncDsId, encDsId}}, options);
@@ -222,23 +226,23 @@ bool __VeltoIDSessionDoFetchCSRResult(VeltoIDAuthenticationSessionInfo& session,
         } else if (isPending(made)) {
             fill(answer, pendingAnswer(made, token));
         } else {
-            return fail(session, made, error);
+            return fail(session, kMethod, made, error);
         }
-        count(session, kMethod, options);
+        noteSuccess(session, kMethod, options);
         return true;
     });
 }
 
 bool __VeltoIDSessionDoCompleteCertificate(VeltoIDAuthenticationSessionInfo& session, const String& encDsId,
                                            const String& token, const Dictionary& options, ErrorOut error) {
-    return callOnQueue(session, {"downloadCertComplete", kVeltoIDXMLCompleteCertCountKey},
+    return callOnQueue(session, {"downloadCertComplete", kVeltoIDXMLCompleteCertCountKey, {}},
                        {{wire::kCertificateToken, token}, {wire::kEncDsId, encDsId}}, options, error);
 }
 
 bool __VeltoIDSessionDoFetchCertificateBySerialNumber(VeltoIDAuthenticationSessionInfo& session,
                                                       const String& serialNumber, const Dictionary& options,
                                                       String* certificate, ErrorOut error) {
-    return callOnQueue(session, {"fetchCert", kVeltoIDXMLFetchCertCountKey},
+    return callOnQueue(session, {"fetchCert", kVeltoIDXMLFetchCertCountKey, "certificate"},
                        {{wire::kFetchedSerialNumber, serialNumber}}, options, error,
                        [&](const Dictionary& reply) { fill(certificate, reply.string(wire::kCertificate)); });
 }
@@ -246,18 +250,20 @@ bool __VeltoIDSessionDoFetchCertificateBySerialNumber(VeltoIDAuthenticationSessi
 bool __VeltoIDSessionDoRevokeCertificate(VeltoIDAuthenticationSessionInfo& session,
                                          const String& serialNumber, const Dictionary& options,
                                          ErrorOut error) {
-    return callOnQueue(session, {"revokeCert", {}}, {{wire::kSerialNumber, serialNumber}}, options, error);
+    return callOnQueue(session, {"revokeCert", {}, "revocation"}, {{wire::kSerialNumber, serialNumber}},
+                       options, error);
 }
 
 Data __VeltoIDSessionDoCopyBreadcrumb(VeltoIDAuthenticationSessionInfo& session, const String& key,
                                       const Dictionary& options, ErrorOut error) {
+    constexpr Method kMethod{"fetchBreadcrumbEk", {}, "breadcrumb"};
     return session.fDispatchQueue.sync([&]() -> Data {
-        const Call made = invoke(session, {"fetchBreadcrumbEk", {}},
-                                 breadcrumbParameters(session.fAccountName, key), options);
+        const Call made = invoke(session, kMethod, breadcrumbParameters(session.fAccountName, key), options);
         if (!made.succeeded) {
-            fail(session, made, error);
+            fail(session, kMethod, made, error);
             return {};
         }
+        noteSuccess(session, kMethod, options);
         const Data data = made.reply ? base64Decode(made.reply->string(wire::kBreadcrumb)) : Data();
         // Text that is no base64 decodes to nothing.
         return data.size() > 0 ? data : Data();
@@ -268,7 +274,7 @@ bool __VeltoIDSessionDoSetBreadcrumb(VeltoIDAuthenticationSessionInfo& session, 
                                      const Data& data, const Dictionary& options, ErrorOut error) {
     Dictionary own = breadcrumbParameters(session.fAccountName, key);
     own.set(wire::kBreadcrumb, base64Encode(data));
-    return callOnQueue(session, {"saveBreadcrumbEk", {}}, own, options, error);
+    return callOnQueue(session, {"saveBreadcrumbEk", {}, "breadcrumb"}, own, options, error);
 }
 
 }  // namespace veltoid

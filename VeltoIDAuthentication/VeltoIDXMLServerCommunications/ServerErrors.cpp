@@ -1,6 +1,8 @@
 #include "VeltoIDXMLServerCommunications/ServerErrors.h"
 
 #include "Logging/Log.h"
+#include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
@@ -91,6 +93,28 @@ bool refusesPassword(const std::optional<Error>& error) {
 
 bool isOtherFault(const std::optional<Error>& error) {
     return isIdentityError(error, identity_error::kUnknown) && error->userInfo.contains(kFaultCodeKey);
+}
+
+void noteAttempt(const String& accountName, std::string_view what, std::string_view outcome,
+                 const String& reason) {
+    __VeltoIDDBSetAccountValues(
+        accountName,
+        {{kVeltoIDAccountLastAttemptKey, what},
+         {kVeltoIDAccountLastAttemptDateKey, Value::date(platform::now())},
+         {kVeltoIDAccountLastAttemptOutcomeKey, outcome},
+         {kVeltoIDAccountLastAttemptReasonKey, reason ? Value(reason) : Value::null()}},
+        Notify::No);
+}
+
+void noteAttempt(const String& accountName, std::string_view what, const std::optional<Error>& error) {
+    if (!error) return noteAttempt(accountName, what, kAttemptSucceeded);
+    const bool isRefused = refusesPassword(error) || refusesClient(error);
+    const String description = error->userInfo.string(kErrorDescriptionKey);
+    const String reason = error->userInfo.string(kErrorFailureReasonKey);
+    // What people are told to do is no reason.
+    const bool isReason = reason && (isRefused || !description);
+    noteAttempt(accountName, what, isRefused ? kAttemptRefused : kAttemptFailed,
+                (isReason ? reason : description));
 }
 
 void handleServerError(const String& accountName, const String& sentPasswordHash,

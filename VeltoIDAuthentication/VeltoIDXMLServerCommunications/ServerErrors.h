@@ -30,6 +30,20 @@ bool refusesPassword(const std::optional<Error>& error);
 /// Whether the server itself has answered the call, with a fault that says nothing of the password.
 bool isOtherFault(const std::optional<Error>& error);
 
+// Outcomes of an attempt.
+inline constexpr const char* kAttemptSucceeded = "succeeded";
+inline constexpr const char* kAttemptFailed = "failed";
+inline constexpr const char* kAttemptRefused = "refused";
+inline constexpr const char* kAttemptPending = "pending";
+
+/// Notes in the account's record what was last asked of the server, now, and what came of it. The reason is
+/// for people; null for none. Any queue but the database's.
+void noteAttempt(const String& accountName, std::string_view what, std::string_view outcome,
+                 const String& reason = nullptr);
+
+/// The same for a call with that error, if any.
+void noteAttempt(const String& accountName, std::string_view what, const std::optional<Error>& error);
+
 /// Judges the failure of an operation of the engine that used this password hash, as above; the log says what
 /// becomes of the account. Any queue but the database's.
 void handleServerError(const String& accountName, const String& sentPasswordHash,

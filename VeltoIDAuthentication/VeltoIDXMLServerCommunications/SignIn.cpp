@@ -117,6 +117,9 @@ class SignIn {
                 accountName_, passwordHash_, std::nullopt,
                 signInError(identity_error::kUnknown, __LINE__, {{}, "The server has no address", {}}));
         }
+        // Somebody's try of a password says nothing of the account's own.
+        if (!getBool(&options_, option::kDoNotSaveSessionInfo, false))
+            noteAttempt(accountName_, "sign-in", session_ ? std::nullopt : held_);
         if (session_) return;
         VELTOID_LOG_FROM(kOperation, kNotice, "Didn't succeed with .authenticate, and error is ",
                          held_ ? Value(*held_) : Value(), " so releasing session.");
