@@ -27,6 +27,8 @@ namespace {
 constexpr double kDay = 86'400;
 constexpr double kDefaultRelaunchInterval = 1'209'600;
 constexpr double kMinRelaunchInterval = 900;
+/// Some of what is due is so only after its date.
+constexpr double kTick = 0.001;
 
 // Between two attempts to read a database that cannot be read (seconds).
 constexpr double kFirstRetry = 2;
@@ -125,7 +127,7 @@ class AccountCheckLoop {
         const double missing = std::max(*earliest - now, missingDistance());
         if (missing > 0) {
             scheduleRelaunch(now + missing);
-            return wait(std::min(missing, relaunchInterval()));
+            return wait(std::min(missing + kTick, relaunchInterval()));
         }
         // It may have been locked while the loop slept: a pass that can read nothing counts for nothing.
         if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return;

@@ -39,12 +39,6 @@ bool isStillPutOffAsExamined(const AccountRecord& stored, const AccountRecord& e
 
 }  // namespace
 
-std::optional<double> putOffUntil(const AccountRecord& record) {
-    const auto date = record.nextCheck();
-    // A later date was stored while the clock was wrong.
-    return date && *date <= platform::now() + kMaxBackOff ? date : std::nullopt;
-}
-
 void noteNews(const String& accountName) {
     __VeltoIDDBSetAccountValues(accountName, {{kVeltoIDAccountNextCheckDateKey, Value::null()},
                                               {kVeltoIDAccountCheckBackOffKey, Value::null()}});

@@ -7,8 +7,6 @@
 // the check itself has changed is no news to it.
 #pragma once
 
-#include <optional>
-
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
@@ -17,13 +15,8 @@ namespace veltoid {
 // enough; an account without a valid certificate is what its user waits for.
 inline constexpr double kFirstBackOff = 90;
 inline constexpr double kMaxBackOffInNeed = 3'600;
-inline constexpr double kMaxBackOff = 14'400;
 /// Until a pass that has brought an account a step forward is followed by the next one, once.
 inline constexpr double kFollowUpDelay = 5;
-
-/// The date (seconds since 1970) before which the account check leaves the account alone; none when it does
-/// not.
-std::optional<double> putOffUntil(const AccountRecord& record);
 
 /// Ends what was put off for the account. Caller's queue.
 void noteNews(const String& accountName);

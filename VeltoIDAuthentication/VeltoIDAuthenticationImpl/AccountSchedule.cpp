@@ -8,7 +8,6 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
-#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDAuthenticationImpl/PollBackOff.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
@@ -118,7 +117,7 @@ AccountSchedule::Date AccountSchedule::due(DueReason reason) const {
 
 AccountSchedule::Date AccountSchedule::signIn() const {
     const auto attempt = record_.lastConnectAttempt();
-    return attempt && *attempt <= now_ ? at(*attempt + kReconnectInterval) : rightNow();
+    return attempt && *attempt <= now_ ? after(attempt, kReconnectInterval) : rightNow();
 }
 
 AccountSchedule::Date AccountSchedule::validation() const {
@@ -204,6 +203,12 @@ double AccountSchedule::certificateLifetime() const {
 std::optional<double> AccountSchedule::endOfEmbargo() const {
     if (record_.isClientTooOld()) return now_ + kNeverForOldClients;
     return record_.embargoEnd(now_);
+}
+
+std::optional<double> putOffUntil(const AccountRecord& record) {
+    const auto date = record.nextCheck();
+    // A later date was stored while the clock was wrong.
+    return date && *date <= platform::now() + kMaxBackOff ? date : std::nullopt;
 }
 
 std::optional<double> copyNextActionDateForAccount(const String& accountName) {
