@@ -47,7 +47,12 @@ class FakeIdentityServer {
     static Value noAnswer() { return Error{kNoAnswer, 503, {}}; }
     static Value faultOf(int64_t code) { return Error{"fault", code, {}}; }
     void fault(const std::string& method, int64_t code) { set(method, answerOf(faultOf(code))); }
-    void refuse(const std::string& method, int status) { set(method, {status, ""}); }
+    void refuse(const std::string& method, int status) { set(method, {status}); }
+    /// Whatever the exchange yields.
+    void set(const std::string& method, const platform::FakeHTTPAnswer& answer) {
+        const std::lock_guard lock(mutex_);
+        answers_[method] = [answer](const Dictionary&) { return answer; };
+    }
 
     /// The calls since the last time.
     std::vector<Call> take() {
@@ -63,14 +68,17 @@ class FakeIdentityServer {
     }
 
   private:
-    using StatusAndContent = std::pair<int, std::string>;
+    using Answer = platform::FakeHTTPAnswer;
 
-    static StatusAndContent answerOf(const Value& reply) {
+    static Answer answerOf(const Value& reply) {
         const Error* error = reply.asError();
-        if (error == nullptr) return {200, "<params><param>" + encoded(reply) + "</param></params>"};
-        if (error->domain == kNoAnswer) return {static_cast<int>(error->code), ""};
+        if (error == nullptr) return methodResponse("<params><param>" + encoded(reply) + "</param></params>");
+        if (error->domain == kNoAnswer) return {static_cast<int>(error->code)};
         const Dictionary fault = {{"faultCode", Value::int64(error->code)}, {"faultString", "because"}};
-        return {200, "<fault>" + encoded(fault) + "</fault>"};
+        return methodResponse("<fault>" + encoded(fault) + "</fault>");
+    }
+    static Answer methodResponse(const std::string& content) {
+        return {200, "<methodResponse>" + content + "</methodResponse>"};
     }
 
     static std::string encoded(const Value& value) {
@@ -78,12 +86,7 @@ class FakeIdentityServer {
         return {text.begin(), text.end()};
     }
 
-    void set(const std::string& method, StatusAndContent answer) {
-        const std::lock_guard lock(mutex_);
-        answers_[method] = [answer = std::move(answer)](const Dictionary&) { return answer; };
-    }
-
-    platform::FakeHTTPAnswer serve(const platform::HTTPRequest& request) {
+    Answer serve(const platform::HTTPRequest& request) {
         const std::string_view body(request.body);
         const size_t start = body.find("<methodName>") + std::string_view("<methodName>").size();
         std::string method(body.substr(start, body.find("</methodName>") - start));
@@ -96,21 +99,16 @@ class FakeIdentityServer {
         const Dictionary given = parameters != nullptr ? *parameters : Dictionary();
         calls_.push_back({request.url, method, given});
         const auto found = answers_.find(method);
-        platform::FakeHTTPAnswer answer;
-        answer.status = 404;
-        if (found == answers_.end()) return answer;
+        if (found == answers_.end()) return {404};
         const auto reply = found->second;
         // While one call is answered, others may come.
         lock.unlock();
-        const auto [status, content] = reply(given);
-        answer.status = status;
-        answer.body = "<methodResponse>" + content + "</methodResponse>";
-        return answer;
+        return reply(given);
     }
 
     platform::FakeHTTPTransport transport_;
     std::mutex mutex_;
-    std::map<std::string, std::function<StatusAndContent(const Dictionary&)>> answers_;
+    std::map<std::string, std::function<Answer(const Dictionary&)>> answers_;
     std::vector<Call> calls_;
 };
 

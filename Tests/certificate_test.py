@@ -4,6 +4,7 @@ with the openssl command line as the judge."""
 from __future__ import annotations
 
 import base64
+import concurrent.futures
 import contextlib
 import datetime
 import plistlib
@@ -121,6 +122,27 @@ class Issuance(AgentCase):
             state = self.client.call(CHECK, VeltoID=ACCOUNT, options={"CheckNetwork": True})["status"]
             self.assertIn(state, (1, 2), "evaluated under the authority, or not long ago")
 
+    def test_a_fetch_that_fails_costs_no_certificate(self):
+        for wrong in ({"status": 503}, {"fault": {"code": -1, "string": "busy"}}):
+            with self.case(wrong, issuance="token", issuanceDelay=1):
+                self.server.next("fetchCert", **wrong)
+                self.assertIsNotNone(self.add_with_certificate(certwaitduration=60, timeout=90))
+                self.assertEqual(self.entry()["CertStatus"], "CERT_ISSUED")
+                counts = self.server.counts()
+                self.assertEqual((counts["createCert"], counts["fetchCert"], counts["downloadCertComplete"]), (1, 2, 1))
+
+    def test_forgetting_waits_for_nobody_and_what_comes_later_is_dropped(self):
+        with self.case("at once"), self.world.client() as other, concurrent.futures.ThreadPoolExecutor() as pool:
+            self.server.next("createCert", delay=4)
+            add = pool.submit(other.add, CreateCSRAsynchronously=False)
+            self.assertTrue(self.server.wait("createCert"))
+            self.assertTrue(self.client.call(FORGET, VeltoID=ACCOUNT)["success"])
+            self.assertFalse(add.done(), "the server has not answered yet")
+            self.assertNotIn(ACCOUNT, self.database()["Accounts"])
+            self.assertNotIn("accountinfo", add.result())
+            self.assertNotIn(ACCOUNT, self.database()["Accounts"])
+            self.assertEqual(self.stored(), (0, 0))
+
     def test_a_failed_attempt_is_said_to_have_failed_and_leaves_no_key(self):
         fault = {"code": -20101, "string": "no"}
         cases = [("refused", {"issuance": "refuse"}, {}),
@@ -176,8 +198,8 @@ class Issuance(AgentCase):
                 self.assertNotIn("CertificateReference", shown)
 
     def test_delays_are_believed_within_reason(self):
-        for delay, expected in [(None, 0), (30.5, 30.5), (DAY, DAY), (DAY + 1, 15), (-5, 15), (1e300, 15),
-                                (float("nan"), 0), ("30", 0)]:
+        for delay, expected in [(None, 30), (1, 15), (30.5, 30.5), (DAY, DAY), (DAY + 1, 15), (-5, 15), (1e300, 15),
+                                (float("nan"), 30), ("30", 30)]:
             with self.case(str(delay), issuance="never"):
                 self.server.next("createCert", set={"Delay": delay})
                 self.assertTrue(self.add_with_certificate())

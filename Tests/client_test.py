@@ -94,6 +94,33 @@ class CommandLine(unittest.TestCase):
             (["status"], "", 0, "NoCertificate"),
             (["forget", ACCOUNT], "", 0, "is forgotten")])
 
+    def test_a_keychain_that_is_not_the_accounts_is_shown_until_it_is_back(self):
+        self.add_account("--certificate")
+        file, kept = (self.world.state_files() / name for name in ("keychain.db", "kept.db"))
+        file.rename(kept)
+        strange, forget = (["status"], "", 0, "not the one of the stored accounts"), ["forget", ACCOUNT]
+        self.run_table([strange, (["info", ACCOUNT], "", 0, "jane@roe.example"),
+                        (["status", "--check"], "", 0, "PasswordInaccessibleInKeychain")])
+        kept.rename(file)
+        self.run_table([(["status"], "", 0, "CertificateAssumedOK"),
+                        (["verify", ACCOUNT, "--password-stdin"], PASSWORD, 0, "accepts")])
+        file.unlink()
+        self.run_table([strange, (forget, "", 0, "is forgotten")])
+        self.assertNotIn("keychain", self.run_client("status").stdout)
+
+    def test_what_went_wrong_with_the_server_is_said(self):
+        for wrong, said in [
+                (dict(fault={"code": -7, "string": "not today"}), "The server answered with the fault -7: not today"),
+                (dict(status=503), "The server did not answer, or not with success"),
+                (dict(close="before"), "The server closed the connection without an answer"),
+                (dict(body="<html>Welcome!</html>"), "The server's answer cannot be understood"),
+                (dict(set={"encDsId": None}), "can not talk with the Velto ID server")]:
+            with self.subTest(wrong):
+                self.world.server.next("authenticate", **wrong)
+                self.run_table([(["verify", ACCOUNT, "--password-stdin"], PASSWORD, 1, said)])
+        self.run_table([(["verify", ACCOUNT, "--hashed-password-stdin"], hashed("wrong"), 1, "are incorrect"),
+                        (["info", "nobody"], "", 1, "There is no such account on this device")])
+
     def test_json_is_the_whole_reply_of_every_command(self):
         for command in (["ping"], ["list"], ["status"], ["database"], ["info", "nobody"], ["forget", "nobody"]):
             for arguments in (["--json", *command], [*command, "--json"]):

@@ -77,7 +77,8 @@ class PlainBus(unittest.TestCase):
             elsewhere = world.folder / "elsewhere"
             same_store, impatient = [second(), second(*other_names)], second()
             same_name = [second("--noprefsfile"), second(XDG_STATE_HOME=str(elsewhere))]
-            for agents, why in [(same_name, "cannot be had on this bus"), (same_store, "works on this user's accounts")]:
+            for agents, why in [(same_name, "cannot be had on this bus"),
+                                (same_store, "works on this user's accounts")]:
                 for agent in agents:
                     said = agent.communicate(timeout=60)[1].splitlines()
                     self.assertEqual(agent.returncode, 1, said)

@@ -143,6 +143,7 @@ int status(AgentConnection& agent, const Arguments& arguments) {
                               {veltoid::kVeltoIDMetaLastConnectAttemptKey, "last connect"},
                               {veltoid::kVeltoIDMetaLastSuccessfulConnectKey, "last success"},
                               {message::kUnlockedSinceBoot, "unlocked since boot"},
+                              {message::kKeychainTrouble, "keychain"},
                               {message::kDirtyAccounts, "changed accounts"}});
         const Json accounts = status.value(message::kAccountStatuses, Json::object());
         for (const auto& [account, entry] : accounts.items()) printStatusOf(account, entry);

@@ -26,22 +26,17 @@ std::string withoutControls(std::string text) {
     return text;
 }
 
-/// The most telling text of an error, its own or that of the one underneath.
+/// The most telling text of an error, its own or that of the one underneath; else `otherwise`.
 std::string reasonOf(const Json& error, const std::string& otherwise) {
     const Json information = error.value(message::kErrorUserInfo, Json::object());
+    const bool hasCause = information.contains(veltoid::kErrorUnderlyingErrorKey);
+    // Then the caller knows better.
+    const bool isVague = error.value(message::kErrorCode, int64_t{0}) == veltoid::identity_error::kUnknown;
+    if (isVague && !hasCause && !otherwise.empty()) return otherwise;
     for (const std::string_view key : {veltoid::kErrorFailureReasonKey, veltoid::kErrorDescriptionKey})
         if (information.contains(key)) return textOf(information[key]);
-    if (information.contains(veltoid::kErrorUnderlyingErrorKey))
-        return reasonOf(information[veltoid::kErrorUnderlyingErrorKey], otherwise);
-    switch (error.value(message::kErrorCode, int64_t{0})) {
-        case veltoid::identity_error::kServerCannotBeReached:
-            return "the server has asked not to be contacted for a while";
-        case veltoid::identity_error::kNoAccounts:
-        case veltoid::identity_error::kUnknownAccount:
-            return "there is no such account on this device";
-        default:
-            return otherwise;
-    }
+    if (hasCause) return reasonOf(information[veltoid::kErrorUnderlyingErrorKey], otherwise);
+    return otherwise.empty() ? "the agent could not do it" : otherwise;
 }
 
 }  // namespace
@@ -72,7 +67,7 @@ void printJson(const Json& value) {
 void printRefusal(const Json& reply, const std::string& what, const std::string& otherwise) {
     std::cerr << "veltoidctl: " << what << ": ";
     if (!reply.contains(message::kError)) {
-        std::cerr << otherwise << "\n";
+        std::cerr << (otherwise.empty() ? "the agent could not do it" : otherwise) << "\n";
         return;
     }
     const Json& error = reply[message::kError];

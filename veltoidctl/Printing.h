@@ -23,13 +23,13 @@ void printEntries(const Json& dictionary,
 
 void printJson(const Json& value);
 
-/// Says on standard error what did not work, and why: `otherwise` when the reply does not tell.
+/// Says on standard error what did not work, and why: `otherwise` when the reply tells nothing, or only that
+/// it was not done.
 void printRefusal(const Json& reply, const std::string& what, const std::string& otherwise);
 
 /// Prints the reply as JSON when that was asked for, else what `print` makes of a success, or the refusal.
 /// Returns the exit status.
 int present(const Json& reply, const Arguments& arguments, const std::string& what,
-            const std::function<void(const Json&)>& print,
-            const std::string& otherwise = "the agent could not do it");
+            const std::function<void(const Json&)>& print, const std::string& otherwise = {});
 
 }  // namespace veltoidctl

@@ -1,7 +1,6 @@
 // The command-line client of the account agent.
 #include <sys/resource.h>
 
-#include <clocale>
 #include <iostream>
 #include <stdexcept>
 
@@ -33,8 +32,6 @@ int run(int argc, char** argv) {
 }  // namespace veltoidctl
 
 int main(int argc, char** argv) {
-    // Account names are lower-cased by the locale's rules, as the agent does it.
-    std::setlocale(LC_CTYPE, "");
     const platform::Lifetime lifetime(veltoid::kProduct);
     try {
         veltoidctl::keepSecrets();

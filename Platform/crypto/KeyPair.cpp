@@ -5,6 +5,7 @@
 #include <openssl/x509v3.h>
 
 #include "Platform/crypto/OpenSSLLibrary.h"
+#include "Platform/encoding/UTF8.h"
 #include "Platform/runtime/SystemLog.h"
 
 namespace platform {
@@ -59,8 +60,9 @@ bool addSubject(X509_REQ* request, std::span<const SubjectAttribute> subject) {
     X509_NAME* const name = X509_REQ_get_subject_name(request);
     for (const SubjectAttribute& attribute : subject) {
         const Bytes value = bytesOf(attribute.value);
-        if (X509_NAME_add_entry_by_NID(name, identifierOf(attribute.type), V_ASN1_PRINTABLESTRING,
-                                       value.data(), static_cast<int>(value.size()), -1, 0) != 1)
+        const int form = isASCII(attribute.value) ? V_ASN1_PRINTABLESTRING : V_ASN1_UTF8STRING;
+        if (X509_NAME_add_entry_by_NID(name, identifierOf(attribute.type), form, value.data(),
+                                       static_cast<int>(value.size()), -1, 0) != 1)
             return false;
     }
     return true;

@@ -39,10 +39,10 @@ struct SubjectAttribute {
 /// A certification request (PKCS#10, RFC 2986) in DER, signed with the private key (SHA-256), that asks for
 /// the key usages digitalSignature and keyEncipherment (critical).
 ///
-/// Each attribute is written in the given order as one PrintableString holding the value's bytes as they are.
-/// PrintableString (X.680) has no "@", no "_" and nothing beyond ASCII: values with such characters make a
-/// request that strict readers may refuse, but the identity service tells accounts apart by exactly this
-/// text.
+/// Each attribute is written in the given order, as a UTF8String when there is anything beyond ASCII in it,
+/// else as a PrintableString holding the value's bytes as they are. PrintableString (X.680) has no "@" and no
+/// "_": values with such characters make a request that strict readers may refuse, but the identity service
+/// tells accounts apart by exactly this text.
 ///
 /// None (and a log line) when the key is none or the library refuses.
 std::optional<std::vector<uint8_t>> createCertificationRequest(Bytes privateKey,

@@ -39,13 +39,19 @@ constexpr const char* kSchema =
     "CREATE UNIQUE INDEX objects ON items (class, coalesce(key_class, x''), application_value) WHERE class "
     "<> 0;";
 
+// Files of earlier agents have none: they get it when they are opened. It counts the items, so that one that
+// was emptied by another program is told from one whose items were removed here.
+constexpr const char* kIdentity =
+    "CREATE TABLE IF NOT EXISTS identity AS"
+    " SELECT randomblob(16) AS id, (SELECT count(*) FROM items) AS items;";
+
 // What rowOf reads. A macro, since statements are kept under the address of their literal.
 #define VELTOID_SELECT_ITEMS                                                                     \
     "SELECT sequence, id, class, account, service, label, description, access_group, key_class," \
     " application_value, accessibility FROM items WHERE "
 
 struct KeychainFile : SQLiteFile {
-    KeychainFile() : SQLiteFile({"keychain.db", 0x48574B43 /* "HWKC" */, 1, schema().c_str()}) {}
+    KeychainFile() : SQLiteFile({"keychain.db", 0x48574B43 /* "HWKC" */, 1, schema().c_str(), kIdentity}) {}
 
     static const std::string& schema() {
         static const std::string text = std::string(kSchema) + kClassKeysSchema;
@@ -86,7 +92,10 @@ KeychainStatus perform(Outcome (SQLiteFile::*kind)(const SQLiteFile::Work&), con
 KeychainStatus readItems(const Work& work) { return perform(&SQLiteFile::read, work); }
 
 KeychainStatus changeItems(const Work& work) {
-    const KeychainStatus status = perform(&SQLiteFile::write, work);
+    const KeychainStatus status = perform(&SQLiteFile::write, [&](SQLiteTransaction& transaction) {
+        work(transaction);
+        transaction.prepare("UPDATE identity SET items = (SELECT count(*) FROM items)").run();
+    });
     // Not the item's failure: it is stored, and the store logs why it could not be made durable yet.
     if (status == kKeychainSuccess) (void)file().checkpoint();
     return status;
@@ -268,6 +277,22 @@ std::optional<Accessibility> accessibilityOf(const KeychainQuery& query) {
         accessibility = findSome(transaction, query).front().identity.accessibility;
     });
     return status == kKeychainSuccess ? accessibility : std::nullopt;
+}
+
+std::optional<std::vector<uint8_t>> identity(Reopen reopen) {
+    if (reopen == Reopen::Yes) file().reopen();
+    std::vector<uint8_t> found;
+    const KeychainStatus status = readItems([&](SQLiteTransaction& transaction) {
+        found.clear();
+        auto statement =
+            transaction.prepare("SELECT id FROM identity WHERE items = 0 OR EXISTS (SELECT 1 FROM items)");
+        if (!statement.step()) return;
+        const Bytes id = statement.blob(0);
+        found.assign(id.begin(), id.end());
+    });
+    // What another program has left in the log would be read with a file that takes the place of this one.
+    if (reopen == Reopen::Yes) (void)file().checkpoint();
+    return status == kKeychainSuccess ? std::optional(std::move(found)) : std::nullopt;
 }
 
 std::optional<Protection> protection() {

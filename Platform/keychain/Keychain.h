@@ -56,6 +56,12 @@ KeychainStatus remove(const KeychainQuery& query);
 /// The stored accessibility of the first matching item.
 std::optional<Accessibility> accessibilityOf(const KeychainQuery& query);
 
+/// What tells this keychain from any other: made with its file, at random, and stored in it. Empty when its
+/// items have been removed behind its back; none when the keychain cannot be read. With `Reopen::Yes` the
+/// file is opened anew, as a copy may have been written over it.
+enum class Reopen { No, Yes };
+std::optional<std::vector<uint8_t>> identity(Reopen reopen = Reopen::No);
+
 // --- The passphrase. With one, items other than the always accessible ones can be had only after it was
 // given; what opens them is then in the kernel's keyring of the user until the device is switched off or
 // locked again.

@@ -289,6 +289,37 @@ TEST_F(KeychainTest, IsNotAvailableWithoutASoundDeviceKey) {
     EXPECT_TRUE(log.contains("was open to other users"));
 }
 
+TEST_F(KeychainTest, HasAnIdentityOfItsOwn) {
+    using keychain::identity;
+    using keychain::Reopen;
+    const auto first = identity();
+    ASSERT_TRUE(first && !first->empty());
+    const auto item = added(password("a"));
+    EXPECT_EQ(identity(Reopen::Yes), first);
+    const fs::path file = TemporaryStateDirectory::file("keychain.db");
+    const std::string kept = TemporaryStateDirectory::readFile(file);
+
+    edit("DELETE FROM items");
+    EXPECT_TRUE(identity()->empty()) << "not by this program";
+    fs::remove(file);
+    const auto second = identity();
+    EXPECT_TRUE(!second->empty() && second != first);
+    fs::remove(file);
+    TemporaryStateDirectory::writeFile(file, kept);
+    EXPECT_EQ(identity(), first) << "restored";
+    EXPECT_EQ(valueOf(byReference(item)), kSecret);
+    EXPECT_EQ(keychain::remove(byReference(item)), kKeychainSuccess);
+    EXPECT_EQ(identity(), first);
+
+    const auto old = added(password("b"));
+    edit("DROP TABLE identity");
+    const auto given = identity(Reopen::Yes);
+    EXPECT_TRUE(!given->empty() && given != first) << "to a file of an earlier agent";
+    EXPECT_EQ(valueOf(byReference(old)), kSecret);
+    const Obstacle obstacle("keychain.db");
+    EXPECT_EQ(identity(), std::nullopt);
+}
+
 class PassphraseTest : public KeychainTest {
   protected:
     void SetUp() override {

@@ -11,6 +11,7 @@
 #include <cctype>
 #include <cerrno>
 #include <cstdlib>
+#include <mutex>
 #include <vector>
 
 #include "Platform/runtime/Lifetime.h"
@@ -38,15 +39,35 @@ std::string baseDirectory() {
     return home.empty() ? home : home + "/.local/state";
 }
 
+constexpr const char* kNoMachineID = "no-machine-id";
+
 /// The name under which this machine is known to its user; a home directory may be shared between machines.
-std::string machineName() {
+/// Empty with errno set when it cannot be read now: under another name everything stored would seem to be
+/// gone.
+std::string readMachineName() {
     constexpr size_t kDigits = 32;
     std::array<uint8_t, kDigits> digits{};
     const FileDescriptor file(open("/etc/machine-id", O_RDONLY | O_CLOEXEC));
-    const bool valid =
-        readFully(file.number(), digits) == kDigits &&
-        std::ranges::all_of(digits, [](unsigned char digit) { return std::isxdigit(digit) != 0; });
-    return valid ? std::string(digits.begin(), digits.end()) : "no-machine-id";
+    if (!file.isOpen()) return errno == ENOENT ? kNoMachineID : "";
+    const auto size = readFully(file.number(), digits);
+    if (!size) return {};
+    const bool valid = size == kDigits && std::ranges::all_of(digits, [](unsigned char digit) {
+                           return std::isxdigit(digit) != 0;
+                       });
+    return valid ? std::string(digits.begin(), digits.end()) : kNoMachineID;
+}
+
+/// Found once: it stays the same until the end.
+struct MachineName {
+    std::mutex mutex;
+    std::string name;
+};
+
+std::string machineName() {
+    auto& [mutex, name] = Lifetime::current().state<MachineName>();
+    const std::lock_guard lock(mutex);
+    if (name.empty()) name = readMachineName();
+    return name;
 }
 
 FileDescriptor openDirectory(const std::string& path) {
@@ -89,8 +110,10 @@ std::string stateDirectory() {
         errno = ENOENT;
         return {};
     }
+    const std::string machine = machineName();
+    if (machine.empty()) return {};
     const std::string ours = base + '/' + Lifetime::current().product().folder;
-    std::string directory = ours + '/' + machineName();
+    std::string directory = ours + '/' + machine;
     return createDirectories(directory) && makePrivate(ours) && makePrivate(directory) ? directory
                                                                                        : std::string();
 }

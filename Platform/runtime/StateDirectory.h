@@ -8,8 +8,8 @@
 
 namespace platform {
 
-/// The directory of this user's state on this machine, created with mode 0700 when missing; empty when it
-/// cannot be.
+/// The directory of this user's state on this machine, created with mode 0700 when missing; empty, with errno
+/// set, when it cannot be had now.
 std::string stateDirectory();
 
 /// Makes the directory's entries durable; false with errno set.

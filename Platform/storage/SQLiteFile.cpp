@@ -239,6 +239,11 @@ bool SQLiteFile::checkpoint() {
            }) == Outcome::Done;
 }
 
+void SQLiteFile::reopen() {
+    const std::lock_guard lock(mutex_);
+    close();
+}
+
 int SQLiteFile::syncLog() {
     sqlite3_file* log = nullptr;
     const int code =
@@ -330,7 +335,7 @@ SQLiteFile::State SQLiteFile::checkFormat() {
         fail(SQLITE_CORRUPT, "ends within a page");
         return State::Damaged;
     }
-    return execute("PRAGMA journal_mode = WAL") ? State::Ready : State::Failed;
+    return execute("PRAGMA journal_mode = WAL") && execute(format_.additions) ? State::Ready : State::Failed;
 }
 
 /// The library would read the missing part as zeros. With something in the log it may be a page that a crash
@@ -352,7 +357,12 @@ SQLiteFile::State SQLiteFile::layOut() {
         execute(("PRAGMA application_id = " + std::to_string(format_.applicationID)).c_str());
         execute(("PRAGMA user_version = " + std::to_string(format_.version)).c_str());
     }
-    if (error_ == SQLITE_OK && execute("COMMIT")) return State::Ready;
+    execute(format_.additions);
+    if (error_ == SQLITE_OK && execute("COMMIT")) {
+        // Out of the log at once: another file that takes this one's place would be read with it.
+        sqlite3_wal_checkpoint_v2(database_, nullptr, SQLITE_CHECKPOINT_TRUNCATE, nullptr, nullptr);
+        return State::Ready;
+    }
     sqlite3_exec(database_, "ROLLBACK", nullptr, nullptr, nullptr);
     return State::Failed;
 }
@@ -362,7 +372,8 @@ bool SQLiteFile::schemaIsOurs() {
     sqlite3* fresh = nullptr;
     std::optional<std::string> expected;
     if (sqlite3_open(":memory:", &fresh) == SQLITE_OK &&
-        sqlite3_exec(fresh, format_.schema, nullptr, nullptr, nullptr) == SQLITE_OK) {
+        sqlite3_exec(fresh, format_.schema, nullptr, nullptr, nullptr) == SQLITE_OK &&
+        sqlite3_exec(fresh, format_.additions, nullptr, nullptr, nullptr) == SQLITE_OK) {
         expected = schemaText(fresh);
     }
     sqlite3_close(fresh);

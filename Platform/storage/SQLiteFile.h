@@ -98,6 +98,8 @@ class SQLiteFile {
         int32_t version;
         /// The statements that lay out an empty file.
         const char* schema;
+        /// Those that add what earlier files of the version lack; without effect where it is there already.
+        const char* additions = "";
     };
 
     enum class Outcome {
@@ -121,6 +123,9 @@ class SQLiteFile {
 
     /// Makes everything done so far durable on disk.
     bool checkpoint();
+
+    /// The next transaction opens the file anew: one that was written over in place would not be noticed.
+    void reopen();
 
   private:
     friend class SQLiteStatement;

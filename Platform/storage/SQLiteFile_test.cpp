@@ -10,6 +10,7 @@
 
 #include "TestSupport/FakeSystemLog.h"
 #include "TestSupport/SQLiteEdit.h"
+#include "TestSupport/TestLifetime.h"
 
 namespace platform {
 namespace {
@@ -218,6 +219,12 @@ TEST_F(SQLiteFileTest, WaitsOutTroubleOfTheSurroundings) {
     const auto setHome = [](const fs::path& path) { setenv("XDG_STATE_HOME", path.c_str(), 1); };
     const auto goHome = [&] { setHome(base); };
     const auto putBack = [&] { fs::remove(database), fs::rename(kept, database); };
+    rlimit before{};
+    getrlimit(RLIMIT_NOFILE, &before);
+    const auto allowFiles = [&](rlim_t count) {
+        const rlimit limit{count, before.rlim_max};
+        setrlimit(RLIMIT_NOFILE, &limit);
+    };
     const std::tuple<const char*, std::function<void()>, std::function<void()>> cases[] = {
         {"a file in the place of the directory", [&] { setHome(kept); }, goHome},
         {"a directory that cannot be created", [&] { setHome("/proc/nowhere"); }, goHome},
@@ -225,6 +232,8 @@ TEST_F(SQLiteFileTest, WaitsOutTroubleOfTheSurroundings) {
          [&] { fs::rename(database, kept), fs::create_directory(database); }, putBack},
         {"a link to nothing", [&] { fs::rename(database, kept), fs::create_symlink("nowhere", database); },
          putBack},
+        {"no descriptors at the start", [&] { TestLifetime::restart(), allowFiles(0); },
+         [&] { allowFiles(before.rlim_cur); }},
     };
     fill();
     for (const auto& [name, spoil, restore] : cases) {
@@ -243,6 +252,8 @@ TEST_F(SQLiteFileTest, WaitsOutTroubleOfTheSurroundings) {
         EXPECT_EQ(put(file, "row 1", name), Outcome::Done);
         EXPECT_EQ(get(file, "row 2"), std::string(500, 'v'));
         EXPECT_TRUE(movedAside().empty());
+        EXPECT_EQ(std::distance(fs::directory_iterator(base / "harbwell"), {}), 1)
+            << "another device's folder";
     }
 }
 

@@ -28,13 +28,17 @@ Made make(const String& accountName) {
 }
 
 TEST(CertificateRequest, SaysWhoseItIsInTheOrderThatTheServerWants) {
-    for (const std::string name : {"jane.roe@velto.example", "Jane Roe", "jürgen_#+,\"=<>;\\", ""}) {
+    for (const auto& [name, form] :
+         std::vector<std::pair<std::string, std::string>>{{"jane.roe@velto.example", "PRINTABLESTRING"},
+                                                          {"Jane Roe", "PRINTABLESTRING"},
+                                                          {"j_#+,\"=<>;\\", "PRINTABLESTRING"},
+                                                          {"jürgen_#+,\"=<>;\\", "UTF8STRING"},
+                                                          {"", "PRINTABLESTRING"}}) {
         const Made made = make(name);
         const auto content = readRequest(made.text.text());
         EXPECT_TRUE(content.signatureVerifies) << name;
-        EXPECT_EQ(content.subject,
-                  (std::vector<std::string>{"PRINTABLESTRING/CN=" + name, "PRINTABLESTRING/C=US",
-                                            "PRINTABLESTRING/O=Velto, Inc."}));
+        EXPECT_EQ(content.subject, (std::vector<std::string>{form + "/CN=" + name, "PRINTABLESTRING/C=US",
+                                                             "PRINTABLESTRING/O=Velto, Inc."}));
         EXPECT_EQ(content.keyBits, 2048);
         EXPECT_EQ(content.keyUsage, (std::vector<int>{0, 2})) << "digitalSignature, keyEncipherment";
         EXPECT_TRUE(content.keyUsageIsCritical);

@@ -9,8 +9,6 @@
 namespace veltoid {
 namespace {
 
-constexpr std::string_view kUpperCaseLetters = "ABCDEFGHIJKLMNOPQRSTUVWXYZ";
-
 MessageDictionary* dictionaryOf(const MessageObject& message) {
     return message ? std::get_if<MessageDictionary>(&message->content) : nullptr;
 }
@@ -46,9 +44,7 @@ Value IPCMessage::copyValue(std::string_view key, std::optional<Value::Kind> exp
 }
 
 String IPCMessage::copyAccountName(std::string_view key) const {
-    String name = copyValue(key, Value::Kind::String).asString();
-    if (!name || name.view().find_first_of(kUpperCaseLetters) == std::string_view::npos) return name;
-    return lowerCased(name);
+    return lowerCased(copyValue(key, Value::Kind::String).asString());
 }
 
 void IPCMessage::setError(const Error& error) { setValue(message::kError, errorToDictionary(error)); }

@@ -35,8 +35,8 @@ class IPCMessage {
     /// expected kind.
     Value copyValue(std::string_view key, std::optional<Value::Kind> expectedKind = std::nullopt) const;
 
-    /// The String under `key`, in lower case (by the current locale) when it contains any of the letters A to
-    /// Z.
+    /// The String under `key`, in lower case: accounts whose names differ in case alone, whatever the
+    /// alphabet, are one.
     String copyAccountName(std::string_view key) const;
 
     /// Stores the error as a dictionary under "error".

@@ -148,6 +148,8 @@ TEST_F(IPCMessageTest, AccountNamesAreInLowerCase) {
     const std::pair<Value, String> cases[] = {{"Jane.Roe@Velto.Example", "jane.roe@velto.example"},
                                               {"jane.roe@velto.example", "jane.roe@velto.example"},
                                               {"Z", "z"},
+                                              {"ÄNNE@Straße.example", "änne@straße.example"},
+                                              {"Ä@é.example", "ä@é.example"},
                                               {"[@`{", "[@`{"},
                                               {"", ""},
                                               {Value::int64(5), nullptr},

@@ -2,6 +2,7 @@
 #pragma once
 
 #include <array>
+#include <cmath>
 #include <string>
 #include <utility>
 #include <variant>
@@ -73,12 +74,21 @@ class MessageValueBuilder : public platform::ValueSink {
     void boolean(bool value) override { add({value}); }
     void integer(int64_t value) override { add({value}); }
     void unsignedInteger(uint64_t value) override { add({value}); }
-    void real(double value) override { add({value}); }
+    void real(double value) override {
+        isFinite_ = isFinite_ && std::isfinite(value);
+        add({value});
+    }
     void string(std::string_view utf8) override { add({String(utf8)}); }
     void data(platform::Bytes bytes) override { add({Data(bytes)}); }
-    void date(double seconds) override { add({MessageDate{seconds}}); }
+    void date(double seconds) override {
+        isFinite_ = isFinite_ && std::isfinite(seconds);
+        add({MessageDate{seconds}});
+    }
     void uuid(std::span<const uint8_t, 16> bytes) override;
-    void fileDescriptor(int) override { add({MessageFileDescriptor()}); }
+    void fileDescriptor(int) override {
+        hasDescriptor_ = true;
+        add({MessageFileDescriptor()});
+    }
     void beginArray() override { open_.push_back({{MessageArray()}, {}}); }
     void endArray() override { endContainer(); }
     void beginDictionary() override { open_.push_back({{MessageDictionary()}, {}}); }
@@ -87,6 +97,11 @@ class MessageValueBuilder : public platform::ValueSink {
 
     /// The value once it is complete; empty when the events ended early.
     MessageValue take() { return std::move(value_); }
+
+    /// Whether all dates and numbers so far, at any depth, are finite.
+    bool isFinite() const { return isFinite_; }
+    /// Whether there was a file descriptor at any depth.
+    bool hasDescriptor() const { return hasDescriptor_; }
 
   private:
     struct Level {
@@ -98,6 +113,8 @@ class MessageValueBuilder : public platform::ValueSink {
 
     std::vector<Level> open_;
     MessageValue value_;
+    bool isFinite_ = true;
+    bool hasDescriptor_ = false;
 };
 
 }  // namespace veltoid

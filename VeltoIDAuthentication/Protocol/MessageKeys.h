@@ -72,6 +72,8 @@ inline constexpr Key kLaunchTime = "LaunchTime";
 inline constexpr Key kNextLaunchTime = "NextLaunchTime";
 inline constexpr Key kProcessID = "pid";
 inline constexpr Key kUnlockedSinceBoot = "DeviceUnlockedSinceBoot";
+/// Why secrets cannot be read though the device is unlocked; absent when they can.
+inline constexpr Key kKeychainTrouble = "KeychainTrouble";
 inline constexpr Key kAccountState = "AccountState";
 inline constexpr Key kNextActionTime = "NextActionTime";
 inline constexpr Key kNextFetchAttempt = "NextFetchAttempt";

@@ -43,6 +43,8 @@ inline constexpr RecordKey kVeltoIDAccountNextValidationDateKey = "NextValidatio
 inline constexpr RecordKey kVeltoIDAccountForceValidationKey = "ForceValidation";
 inline constexpr RecordKey kVeltoIDAccountCertificateTokenKey = "CertificateToken";
 inline constexpr RecordKey kVeltoIDAccountCertificateTokenExpirationKey = "CertificateTokenExpiration";
+/// Since when the server answers questions for the token with faults.
+inline constexpr RecordKey kVeltoIDAccountCertificateTokenFaultsSinceKey = "CertificateTokenFaultsSince";
 inline constexpr RecordKey kVeltoIDAccountCSRGenerationDateKey = "CSRGenerationDate";
 /// Seconds.
 inline constexpr RecordKey kVeltoIDAccountCSRGenerationIntervalKey = "CSRGenerationInterval";
@@ -58,6 +60,9 @@ inline constexpr RecordKey kVeltoIDAccountEarliestAllowedConnectionDateKey = "Ea
 inline constexpr RecordKey kVeltoIDAccountClientTooOldKey = "ClientTooOld";
 /// The version of the agent that this was said of; said of another one, it does not count.
 inline constexpr RecordKey kVeltoIDAccountClientTooOldVersionKey = "ClientTooOldVersion";
+/// When the account check looks at the account again at the earliest, and how far that was put off (seconds).
+inline constexpr RecordKey kVeltoIDAccountNextCheckDateKey = "NextAccountCheckDate";
+inline constexpr RecordKey kVeltoIDAccountCheckBackOffKey = "AccountCheckBackOff";
 inline constexpr RecordKey kVeltoIDAccountValidForIntervalKey = "ValidForInterval";
 inline constexpr RecordKey kVeltoIDAccountCertificateIsValidKey = "CertificateIsValid";
 inline constexpr RecordKey kVeltoIDAccountValidationRecordIdentifierKey =
@@ -132,6 +137,10 @@ inline constexpr RecordKey kVeltoIDMetaSendServerAccountInformationItemsKey =
     "VeltoIDMetaSendServerAccountInformationItems";
 inline constexpr RecordKey kVeltoIDMetaLastConnectAttemptKey = "LastConnectAttempt";
 inline constexpr RecordKey kVeltoIDMetaLastSuccessfulConnectKey = "LastSuccessfulConnect";
+/// The protocol version that the server last spoke.
+inline constexpr RecordKey kVeltoIDMetaServerVersionKey = "ServerVersion";
+/// When the server last asked to have the agent running.
+inline constexpr RecordKey kVeltoIDMetaRequestedLaunchDateKey = "RequestedLaunchDate";
 inline constexpr RecordKey kVeltoIDMetaAccountRequiresUserActionKey = "AccountRequiresUserAction";
 /// References to items of the keychain that somebody wanted to keep when their account was forgotten.
 inline constexpr RecordKey kVeltoIDMetaKeptKeychainItemsKey = "KeptKeychainItems";

@@ -1,6 +1,8 @@
 #include "Values/DictionaryAccess.h"
 
 #include <algorithm>
+#include <charconv>
+#include <limits>
 
 namespace veltoid {
 namespace {
@@ -30,6 +32,17 @@ double getDouble(const Dictionary* dictionary, std::string_view key, double defa
     // An integer beyond 2^53 may have no double of its own.
     if (!value.isFloating() && value != Value::real(*number)) return defaultValue;
     return *number;
+}
+
+Value numberFromText(std::string_view text) {
+    const char* const end = text.data() + text.size();
+    int64_t integer = 0;
+    if (const auto read = std::from_chars(text.data(), end, integer);
+        read.ec == std::errc() && read.ptr == end)
+        return Value::int64(integer);
+    double number = std::numeric_limits<double>::infinity();
+    const auto read = std::from_chars(text.data(), end, number);
+    return read.ec != std::errc::invalid_argument && read.ptr == end ? Value::real(number) : Value();
 }
 
 std::optional<Dictionary> makeDictionary(std::initializer_list<std::pair<String, Value>> pairs) {

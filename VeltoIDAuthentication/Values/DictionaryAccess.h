@@ -15,6 +15,9 @@ int32_t getInt32(const Dictionary* dictionary, std::string_view key, int32_t def
 long getLong(const Dictionary* dictionary, std::string_view key, long defaultValue);
 double getDouble(const Dictionary* dictionary, std::string_view key, double defaultValue);
 
+/// The Number that the whole text writes in decimal, finite or not; absent when it writes none.
+Value numberFromText(std::string_view text);
+
 /// The pairs whose key and value are both present, in the order given; none when no pair is complete.
 std::optional<Dictionary> makeDictionary(std::initializer_list<std::pair<String, Value>> pairs);
 

@@ -63,13 +63,14 @@ struct ErrorTexts {
     String recoverySuggestion;
 };
 
-/// An error of kIdentityErrorDomain with nothing but its code.
-inline Error identityError(int64_t code) { return {String(kIdentityErrorDomain), code, {}}; }
-
 /// An error of kIdentityErrorDomain whose user information is a copy of `userInfo` plus the given texts and
-/// "function", "file" ("-" when null) and "line". Any thread.
+/// "function", "file" ("-" when null) and "line". Without a reason or a description it gets the description
+/// of its code. Any thread.
 Error makeError(int64_t code, const ErrorTexts& texts, const Dictionary& userInfo, const char* function,
                 const char* file, int line);
+
+/// The same of kOSStatusErrorDomain, with the code -1.
+Error makeStatusError(const String& description, const char* function, const char* file, int line);
 
 /// "Domain", "Code" and "UserInfo", an underlying error being converted too.
 Dictionary errorToDictionary(const Error& error);
@@ -94,5 +95,7 @@ inline bool failWith(ErrorOut out, Error error) {
 
 }  // namespace veltoid
 
-/// An error of kIdentityErrorDomain that names the place where it was made.
-#define VELTOID_ERROR(code) ::veltoid::makeError((code), {}, {}, __func__, __FILE_NAME__, __LINE__)
+/// An error of kIdentityErrorDomain that names the place where it was made, by default the function.
+#define VELTOID_ERROR(code) VELTOID_ERROR_FROM(__func__, code)
+#define VELTOID_ERROR_FROM(function, code) \
+    ::veltoid::makeError((code), {}, {}, function, __FILE_NAME__, __LINE__)

@@ -2,6 +2,8 @@
 
 #include <gtest/gtest.h>
 
+#include <set>
+
 namespace veltoid {
 namespace {
 
@@ -15,6 +17,19 @@ TEST(Error, SaysWhereItWasMadeAndKeepsTheGivenInformation) {
                                           {"function", "function"},
                                           {"file", "-"},
                                           {"line", Value::int64(7)}}));
+}
+
+TEST(Error, EveryCodeHasAText) {
+    std::set<std::string> texts;
+    for (const int64_t code :
+         {99, 1, -1, -2, -99, -101, -102, -103, -104, -105, -106, -107, -108, -114, -100}) {
+        const Error error = VELTOID_ERROR(code);
+        EXPECT_TRUE(texts.insert(error.userInfo.string(kErrorDescriptionKey).text()).second) << code;
+        EXPECT_EQ(error.userInfo["file"], Value("Error_test.cpp"));
+    }
+    const Error other = makeStatusError("text", "f", "g", 1);
+    EXPECT_EQ(other.domain.view(), kOSStatusErrorDomain);
+    EXPECT_EQ(other.userInfo.string(kErrorDescriptionKey), "text");
 }
 
 TEST(Error, SurvivesTheWayThroughADictionaryWithWhatLiesUnderneath) {

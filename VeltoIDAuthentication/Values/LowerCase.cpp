@@ -1,38 +1,45 @@
 #include "Values/LowerCase.h"
 
-#include <cwchar>
+#include <atomic>
+#include <clocale>
 #include <cwctype>
-#include <string>
+
+#include "Platform/encoding/UTF8.h"
 
 namespace veltoid {
+namespace {
+
+/// Of the program, like a table: Unicode's characters, in no language. None while it cannot be loaded.
+locale_t unicode() {
+    static std::atomic<locale_t> known{nullptr};
+    if (known.load() == nullptr) {
+        const locale_t made = newlocale(LC_CTYPE_MASK, "C.UTF-8", nullptr);
+        locale_t none = nullptr;
+        if (made != nullptr && !known.compare_exchange_strong(none, made)) freelocale(made);
+    }
+    return known.load();
+}
+
+char32_t lowerCased(char32_t point) {
+    if (point < 0x80) return point >= 'A' && point <= 'Z' ? point + ('a' - 'A') : point;
+    const locale_t locale = unicode();
+    return locale != nullptr ? static_cast<char32_t>(towlower_l(static_cast<wint_t>(point), locale)) : point;
+}
+
+}  // namespace
 
 String lowerCased(const String& original) {
     if (!original) return nullptr;
-    const std::string_view text = original.view();
-    std::string lower;
-    std::mbstate_t readState{};
-    std::mbstate_t writeState{};
-    for (size_t position = 0; position < text.size();) {
-        wchar_t wide = 0;
-        const size_t length = std::mbrtowc(&wide, text.data() + position, text.size() - position, &readState);
-        char narrow[16];
-        if (length == 0 || length > text.size() - position) {
-            const char c = text[position++];
-            lower += c >= 'A' && c <= 'Z' ? static_cast<char>(c + 32) : c;
-            readState = {};
-            continue;
-        }
-        const size_t written =
-            std::wcrtomb(narrow, static_cast<wchar_t>(std::towlower(static_cast<wint_t>(wide))), &writeState);
-        if (written == static_cast<size_t>(-1)) {
-            lower += text.substr(position, length);
-            writeState = {};
+    platform::SecretText lower;
+    for (std::string_view left = original.view(); !left.empty();) {
+        if (const auto point = platform::takeCodePoint(left)) {
+            platform::appendUTF8(lower, lowerCased(*point));
         } else {
-            lower.append(narrow, written);
+            lower += left.front();
+            left.remove_prefix(1);
         }
-        position += length;
     }
-    return String(lower);
+    return String(std::string_view(lower));
 }
 
 }  // namespace veltoid

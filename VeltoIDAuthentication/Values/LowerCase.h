@@ -5,8 +5,8 @@
 
 namespace veltoid {
 
-/// Every character lower-cased by the current locale's rules; bytes that the locale cannot read stay, A to Z
-/// aside. Null for null. Any thread.
+/// Every character lower-cased by Unicode's simple mapping, whatever the locale; bytes that are no UTF-8
+/// stay. Null for null. Any thread.
 String lowerCased(const String& text);
 
 }  // namespace veltoid

@@ -1,5 +1,7 @@
 #include "Values/ValueStream.h"
 
+#include <cmath>
+
 namespace veltoid {
 namespace {
 
@@ -71,6 +73,10 @@ void ValueBuilder::add(Value value) {
     } else {
         open_.back().dictionary->set(open_.back().key, std::move(value));
     }
+}
+
+void ValueBuilder::addFinite(double number, Value value) {
+    if (std::isfinite(number)) add(std::move(value));
 }
 
 void ValueBuilder::endContainer(Value container) {

@@ -164,6 +164,17 @@ TEST(ValueStream, EveryStoredKindComesBackFromItsStoredForm) {
     EXPECT_EQ(builder.value(), value);
 }
 
+TEST(ValueBuilder, LeavesOutWhatIsNotFinite) {
+    constexpr double kEndless = std::numeric_limits<double>::infinity();
+    const Value value = Dictionary{{"nan", Value::real(std::nan(""))},
+                                   {"date", Value::date(std::nan(""))},
+                                   {"single", Value::singleReal(std::numeric_limits<float>::infinity())},
+                                   {"list", Array{Value::date(-kEndless), "a", Value::real(kEndless)}}};
+    ValueBuilder builder;
+    writeValue(value, builder);
+    EXPECT_EQ(builder.value(), Value(Dictionary{{"list", Array{"a"}}}));
+}
+
 TEST(DateText, FormsOfOneInstantAgreeAndOthersAreRefused) {
     const double instant = 1'394'039'040;  // 2014-03-05 17:04:00 UTC
     const std::pair<const char*, double> cases[] = {
@@ -181,7 +192,9 @@ TEST(DateText, FormsOfOneInstantAgreeAndOthersAreRefused) {
     EXPECT_EQ(dateFromValue(std::string(129, '1')), std::nullopt);
 }
 
-TEST(LowerCase, KeepsBytesThatAreNoText) {
+TEST(LowerCase, GoesByUnicodeWhateverTheLocaleAndKeepsBytesThatAreNoText) {
+    EXPECT_EQ(lowerCased("ÄNNE.İÉÑ@ПРИМЕР.ΟΔΟΣ"), "änne.iéñ@пример.οδοσ");
+    EXPECT_EQ(lowerCased("Straße@ǄÅ"), "straße@ǆå");
     EXPECT_EQ(lowerCased("Jane.ROE@Example.COM"), "jane.roe@example.com");
     EXPECT_EQ(lowerCased("A\xff\x00Z"), "a\xff");
     EXPECT_FALSE(lowerCased(nullptr));

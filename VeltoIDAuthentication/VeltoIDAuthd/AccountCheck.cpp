@@ -2,8 +2,6 @@
 
 #include <algorithm>
 #include <atomic>
-#include <map>
-#include <string>
 
 #include "IPCHelpers/Transaction.h"
 #include "Platform/keychain/LockState.h"
@@ -14,9 +12,11 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/ItemOwnership.h"
 
@@ -26,12 +26,19 @@ namespace {
 // Seconds.
 constexpr double kDay = 86'400;
 constexpr double kDefaultRelaunchInterval = 1'209'600;
-constexpr double kFirstDeferral = 60;
-constexpr double kDeferralGrowth = 1.5;
+constexpr double kMinRelaunchInterval = 900;
+
+// Between two attempts to read a database that cannot be read (seconds).
+constexpr double kFirstRetry = 2;
+constexpr double kMaxRetry = 60;
+constexpr double kRetryGrowth = 1.5;
+constexpr double kUnreadableKeychainRetry = 900;
 
 double relaunchInterval() {
-    return metaInterval(nullptr, {}, kVeltoIDMetaRelaunchIntervalKey, kDefaultRelaunchInterval,
-                        UnreadableInterval::Zero);
+    const double seconds =
+        metaInterval(nullptr, {}, kVeltoIDMetaRelaunchIntervalKey, kDefaultRelaunchInterval);
+    return seconds > 0 ? std::clamp(seconds, kMinRelaunchInterval, kDefaultRelaunchInterval)
+                       : kDefaultRelaunchInterval;
 }
 
 struct CheckState {
@@ -48,55 +55,29 @@ CheckState& state() { return platform::Lifetime::current().state<CheckState>(); 
 
 bool isEnding() { return platform::Lifetime::current().isEnding(); }
 
-/// Accounts that were due before a pass and are still due after it.
-class Deferrals {
-  public:
-    /// When the account is next looked at, if its own date is `date`.
-    double dateFor(const String& accountName, double date) const {
-        const auto found = deferrals_.find(accountName.text());
-        return found != deferrals_.end() ? std::max(date, found->second.until) : date;
-    }
-
-    /// After a pass over the account.
-    void note(const String& accountName) {
-        const auto next = copyNextActionDateForAccount(accountName);
-        if (!next || *next > platform::now() || accountRecordOf(accountName).isDirty()) {
-            deferrals_.erase(accountName.text());
-            return;
-        }
-        Deferral& deferral = deferrals_[accountName.text()];
-        deferral.interval =
-            deferral.interval > 0 ? std::min(deferral.interval * kDeferralGrowth, kDay) : kFirstDeferral;
-        deferral.until = platform::now() + deferral.interval;
-    }
-
-  private:
-    struct Deferral {
-        double until = 0;
-        double interval = 0;
-    };
-    std::map<std::string, Deferral> deferrals_;
-};
-
-/// What the next pass looks at, and when; no date without accounts.
-struct Plan {
-    Array accounts;
-    std::optional<double> date;
-    /// The accounts were chosen by their marks, which are cleared now: a later pass would not find them.
-    bool isForChanged = false;
-};
-
 /// The loop's state belongs to its queue.
 class AccountCheckLoop {
   public:
     void run() {
+        waitForDatabase();
+        __VeltoIDCleanupAccountsAndCertificates({});
         while (!isEnding()) {
             waitForUnlock();
+            waitForDatabase();
             pass();
         }
     }
 
   private:
+    /// While nothing is known of the accounts the agent stays, and tries again soon.
+    static void waitForDatabase() {
+        double pause = kFirstRetry;
+        for (; !isEnding() && !__VeltoIDDBIsReadable(); pause = std::min(pause * kRetryGrowth, kMaxRetry)) {
+            scheduleRelaunch(platform::now() + kMaxRetry);
+            (void)state().semaphore.wait(pause);
+        }
+    }
+
     void waitForUnlock() {
         auto& lockState = platform::LockState::shared();
         if (lockState.hasBeenUnlockedSinceBoot()) return;
@@ -105,93 +86,75 @@ class AccountCheckLoop {
             lockState.onChange(nullptr);
         });
         while (!lockState.hasBeenUnlockedSinceBoot() && !isEnding()) {
-            scheduleRelaunch(platform::now() + kDay);
-            (void)wait(kDay);
+            // Nobody tells when a keychain can be read again.
+            const double pause = keychainTrouble() ? kUnreadableKeychainRetry : kDay;
+            scheduleRelaunch(platform::now() + pause);
+            wait(pause);
         }
         lockState.onChange(nullptr);
     }
 
-    /// Waits for a signal without a transaction; true when one came. A jump of the clock ends it too.
-    bool wait(double seconds, const platform::Semaphore& semaphore = state().semaphore) {
+    /// Waits without a transaction, until something signals, the clock jumps, or the time is over.
+    void wait(double seconds) {
         transaction_.close();
-        const bool signalled = semaphore.wait(seconds);
+        const bool signalled = state().semaphore.wait(seconds);
         transaction_.reopen();
-        return signalled;
-    }
-
-    /// Waits until a pass is allowed again; what signals meanwhile is looked at by that pass.
-    void keepDistance() {
-        while (lastPass_ && !isEnding()) {
-            const double missing = *lastPass_ + kMinTimeBetweenPasses - platform::now();
-            // A clock that was set back is no reason to wait for longer.
-            if (missing <= 0 || missing > kMinTimeBetweenPasses) break;
-            (void)wait(missing, platform::Semaphore());
-        }
+        if (signalled && !woken_) woken_ = platform::now();
         while (state().semaphore.wait(0)) {
         }
-        lastPass_ = platform::now();
     }
 
-    Plan plan() const {
-        if (auto changed = __VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll))
-            return {std::move(*changed), platform::now(), true};
-        Plan plan{copyAccountsNeedingAction(nullptr), {}, false};
-        for (const Value& name : plan.accounts) {
-            const auto date = copyNextActionDateForAccount(name.asString());
-            if (!date) continue;
-            const double deferred = deferrals_.dateFor(name.asString(), *date);
-            plan.date = plan.date ? std::min(*plan.date, deferred) : deferred;
+    /// How long to keep still, the distance from the last pass and from what has woken the loop since: who
+    /// has changed something may not be done yet. A clock that was set back is no reason to wait for longer.
+    double missingDistance() const {
+        double most = 0;
+        for (const auto& since : {lastPass_, woken_}) {
+            const double missing = since ? *since + kMinTimeBetweenPasses - platform::now() : 0;
+            if (missing <= kMinTimeBetweenPasses) most = std::max(most, missing);
         }
-        return plan;
+        return most;
     }
 
+    /// Looks at the accounts that are due, or waits for the first of them.
     void pass() {
-        const Plan next = plan();
-        if (!sleepUntilTimeFor(next)) return;
-        keepDistance();
-        if (isEnding() || !platform::LockState::shared().hasBeenUnlockedSinceBoot()) return giveBack(next);
-        if (next.accounts.empty()) {
-            __VeltoIDCleanupAccountsAndCertificates({});
-        } else {
-            check(next.accounts);
+        std::optional<double> earliest;
+        const Array accounts = copyAccountsNeedingAction(&earliest);
+        if (accounts.empty() || !earliest || !platform::isHTTPSClientAvailable())
+            return sleepWithoutAccounts();
+        const double now = platform::now();
+        const double missing = std::max(*earliest - now, missingDistance());
+        if (missing > 0) {
+            scheduleRelaunch(now + missing);
+            return wait(std::min(missing, relaunchInterval()));
         }
-    }
-
-    /// The plan is for later: the keychain was locked while the loop slept, or the agent ends.
-    static void giveBack(const Plan& plan) {
-        if (!plan.isForChanged) return;
-        for (const Value& name : plan.accounts)
-            __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDDirtyKey, Value::boolean(true), Notify::No);
-    }
-
-    /// False when a change or the clock has ended the sleep early: the plan may be another one now.
-    bool sleepUntilTimeFor(const Plan& next) {
-        if (next.accounts.empty() || !next.date || !platform::isHTTPSClientAvailable()) {
-            scheduleRelaunch(platform::now() + relaunchInterval());
-            return wait(platform::kForever);
-        }
-        const double most = std::max(relaunchInterval(), kMinTimeBetweenPasses);
-        scheduleRelaunch(*next.date);
-        (void)wait(std::clamp(*next.date - platform::now(), kMinTimeBetweenPasses, most));
-        return next.isForChanged || *next.date <= platform::now();
-    }
-
-    void check(const Array& accounts) {
+        // It may have been locked while the loop slept: a pass that can read nothing counts for nothing.
+        if (!platform::LockState::shared().hasBeenUnlockedSinceBoot()) return;
+        lastPass_ = now;
+        woken_.reset();
         if (state().onPass) state().onPass();
         for (const Value& name : accounts) {
-            const String accountName = name.asString();
-            AccountRecord record;
-            if (!__VeltoIDDBCopyVeltoIDAccount(accountName, &record)) continue;
-            __VeltoIDDBSetAccountValue(accountName, kVeltoIDDirtyKey, Value::null(), Notify::No);
-            checkAccount(record);
-            deferrals_.note(accountName);
+            const auto date = copyNextActionDateForAccount(name.asString());
+            if (date && *date <= platform::now()) check(accountRecordOf(name.asString()));
         }
+    }
+
+    void sleepWithoutAccounts() {
+        scheduleRelaunch(platform::now() + relaunchInterval());
+        wait(platform::kForever);
+        if (accountNames().empty()) __VeltoIDCleanupAccountsAndCertificates({});
+    }
+
+    static void check(const AccountRecord& record) {
+        if (!record.accountName() || isEnding()) return;
+        const AccountPass pass(record);
+        checkAccount(record);
+        pass.end();
     }
 
     /// Closed while the loop waits.
     Transaction transaction_{"accountCheck"};
     std::optional<double> lastPass_;
-    Deferrals deferrals_;
+    std::optional<double> woken_;
 };
 
 }  // namespace

@@ -1,13 +1,13 @@
 // The account check: one loop on a queue of its own that keeps every account usable without its user.
 //
-// A pass takes the accounts that were changed, or, if none was, those for which an action is foreseen; waits
-// for the earliest of their dates; examines each and does what its state asks for. The loop is woken early by
-// the semaphore that notifying changes of the database signal. While it waits no transaction is open, so that
-// the agent may be ended meanwhile: it has handed the service manager the date at which it must be back.
+// A pass examines the accounts that are due and does what their state asks for; until then the loop waits for
+// the earliest date of all accounts. It is woken early by the semaphore that notifying changes of the
+// database signal. While it waits no transaction is open, so that the agent may be ended meanwhile: it has
+// handed the service manager the date at which it must be back. Only a database that cannot be read keeps it
+// up.
 //
-// Two passes are never less than kMinTimeBetweenPasses apart. An account that is still due after a
-// pass that could do nothing for it is put off for longer and longer, unless it is changed: its dates alone
-// would keep the agent awake.
+// Two passes are never less than kMinTimeBetweenPasses apart. An account that a pass could not help is put
+// off for longer and longer (AccountBackOff.h).
 #pragma once
 
 #include <functional>

@@ -6,6 +6,7 @@
 #include "Values/Base64.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 
 namespace veltoid {
@@ -18,7 +19,8 @@ class AccountCheckTest : public CertificateTest {
   protected:
     void SetUp() override {
         CertificateTest::SetUp();
-        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date); }});
+        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date); },
+                         .scheduleRequestedLaunch = scheduleRequestedLaunch});
     }
     void TearDown() override {
         // What the loop has taken of marks is on disk later.
@@ -96,6 +98,7 @@ TEST_F(AccountCheckTest, PassesKeepTheirDistance) {
     for (int i = 0; i < 100; ++i) {
         setValues({{"LastConnectAttempt", kGone}});
         __VeltoIDDBSetAccountValue(kName, "x", number(i), Notify::Yes);
+        noteNews(kName);
         wakeAccountCheck();
         clock_.advanceBy(0.1);
     }

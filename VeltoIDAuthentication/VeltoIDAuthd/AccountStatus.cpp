@@ -8,6 +8,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthd/Relaunch.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
@@ -87,6 +88,7 @@ Dictionary copyAccountStatusesDictionary(const Dictionary& options) {
     if (const auto next = nextLaunchDate()) status.set(message::kNextLaunchTime, Value::date(*next));
     status.set(message::kProcessID, Value::int64(getpid()));
     for (const auto& [key, value] : copyDeviceStatusDictionary()) status.set(key, value);
+    status.set(message::kKeychainTrouble, keychainTrouble());
     return status;
 }
 

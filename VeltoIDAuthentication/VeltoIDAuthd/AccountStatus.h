@@ -9,9 +9,9 @@ namespace veltoid {
 Dictionary copyDeviceStatusDictionary();
 
 /// "AccountStatuses" by account name, "DirtyAccounts", "DirtyAccountsAndCertificates",
-/// "LastSuccessfulConnect", "LastConnectAttempt", "LaunchTime", "NextLaunchTime", "pid" and the device's
-/// status, each when there is one. Of each account: "AccountState" (the name of an AccountState),
-/// "ValidationDate", "NextActionTime", "NextFetchAttempt" while a certificate is pending,
+/// "LastSuccessfulConnect", "LastConnectAttempt", "LaunchTime", "NextLaunchTime", "pid", "KeychainTrouble" (a
+/// text) and the device's status, each when there is one. Of each account: "AccountState" (the name of an
+/// AccountState), "ValidationDate", "NextActionTime", "NextFetchAttempt" while a certificate is pending,
 /// "CertificateRequestsHeldUntil" while requests are held up, and "AccountRequiresUserAction" unless that is
 /// not known yet. Client's queue.
 Dictionary copyAccountStatusesDictionary(const Dictionary& options);

@@ -3,6 +3,7 @@
 
 #include "TestSupport/CertificateFixture.h"
 #include "TestSupport/FakeLockState.h"
+#include "TestSupport/SQLiteEdit.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
@@ -59,7 +60,7 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
              check();
              (void)__VeltoIDDBCopyDirtyVeltoIDs(DirtyMarks::ClearAll);
          },
-         false, false, 0},
+         false, false, 300},
         {"PasswordInaccessibleInKeychain",
          [&] {
              add(true);
@@ -89,8 +90,8 @@ TEST_F(AccountStatusTest, TellsEveryStateThatAnAccountCanBeIn) {
              addWith("Dirty", kOn);
              std::filesystem::remove(directory_.base() / "harbwell" / "identity-authority.pem");
          },
-         true, false, 14 * kDay - 1},
-        {"CertificateOK", [&] { addWith("Dirty", kOn); }, true, false, 14 * kDay - 1},
+         true, false, 0},
+        {"CertificateOK", [&] { addWith("Dirty", kOn); }, true, false, 0},
         {"CertificateAssumedOK", [&] { add(true); }, false, false, 14 * kDay - 1},
         {"CertificateShouldBeRenewed",
          [&] {
@@ -137,6 +138,71 @@ TEST_F(LockedDeviceStatusTest, SaysNothingOfAPasswordThatMayYetBecomeReadable) {
     EXPECT_EQ(statusOf({})["AccountState"], Value("PasswordInaccessibleInKeychain"));
     EXPECT_FALSE(statusOf({}).contains("AccountRequiresUserAction"));
     EXPECT_EQ(copyAccountStatusesDictionary({})["DeviceUnlockedSinceBoot"], kOff);
+}
+
+TEST_F(AccountStatusTest, WhatAStrangeKeychainDoesNotHoldIsNotLost) {
+    namespace fs = std::filesystem;
+    const auto file = platform::TemporaryStateDirectory::file("keychain.db");
+    const fs::path kept = directory_.base() / "kept";
+    const auto writeOver = [&](std::string_view text) {
+        platform::TemporaryStateDirectory::writeFile(file, text);
+    };
+    const std::pair<const char*, std::function<void()>> cases[] = {
+        {"missing", [&] { fs::remove(file); }},
+        {"empty", [&] { writeOver(""); }},
+        {"without items", [] { platform::editDatabase("keychain.db", "DELETE FROM items"); }},
+        {"another one's",
+         [] {
+             platform::editDatabase("keychain.db",
+                                    "UPDATE identity SET id = x'01'; DELETE FROM items WHERE class = 0");
+         }},
+        {"damaged", [&] { writeOver(std::string(9'000, 'x')); }},
+        {"a folder", [&] { fs::remove(file), fs::create_directory(file); }},
+    };
+    add(true);
+    fs::copy_file(file, kept);
+    const auto trouble = [] { return copyAccountStatusesDictionary({})["KeychainTrouble"]; };
+    const auto held = [] {
+        const Dictionary account = record();
+        const Dictionary entry = certificateEntry();
+        return Array{account["HashedPasswordRef"], account["encDsId"], entry[kCertificateReference],
+                     entry[kKeyReference]};
+    };
+    const Array before = held();
+    EXPECT_EQ(trouble(), Value());
+    int troubles = 0;
+    for (const bool renamedBack : {true, false}) {
+        for (const auto& [what, spoil] : cases) {
+            SCOPED_TRACE(what);
+            spoil();
+            (void)server_.take();
+            for (int pass = 0; pass < 2; ++pass) check();
+            EXPECT_EQ(held(), before);
+            EXPECT_EQ(server_.takeMethods(), "") << "no other certificate is asked for";
+            EXPECT_EQ(statusOf({})["AccountState"], Value("PasswordInaccessibleInKeychain"));
+            EXPECT_TRUE(trouble().isString());
+            EXPECT_EQ(log_.count("The keychain cannot be read, or is not the one"), ++troubles) << "once";
+            if (fs::is_directory(file) || renamedBack) {
+                fs::remove(file);
+                fs::copy_file(kept, kept.string() + "2");
+                fs::rename(kept.string() + "2", file);
+            } else {
+                writeOver(platform::TemporaryStateDirectory::readFile(kept));
+            }
+            EXPECT_EQ(trouble(), Value()) << "without a restart";
+            EXPECT_EQ(statusOf({})["AccountState"], Value("CertificateAssumedOK"));
+        }
+    }
+    fs::remove(file);
+    add(true);
+    EXPECT_EQ(trouble(), Value()) << "the new keychain is the right one now";
+    clock_.advanceBy(2 * kDay);
+    check();
+    EXPECT_NE(certificateEntry()[kKeyReference], before[3]) << "and what it lacks is lost";
+    fs::remove(file);
+    EXPECT_TRUE(trouble().isString());
+    EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+    EXPECT_EQ(trouble(), Value()) << "nobody misses anything";
 }
 
 TEST_F(AccountStatusTest, TellsWhatHasChangedAndWhatIsHeldUp) {

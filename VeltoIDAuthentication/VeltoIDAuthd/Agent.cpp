@@ -1,9 +1,12 @@
 #include "VeltoIDAuthd/Agent.h"
 
+#include <algorithm>
+#include <cmath>
 #include <csignal>
 #include <cstdlib>
 #include <functional>
 
+#include "Logging/Log.h"
 #include "Platform/bus/BusConnection.h"
 #include "Platform/bus/ServiceManager.h"
 #include "Platform/runtime/Clock.h"
@@ -11,6 +14,7 @@
 #include "Platform/runtime/InstanceLock.h"
 #include "Platform/runtime/WorkQueue.h"
 #include "Protocol/RecordKeys.h"
+#include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthd/AccountCheck.h"
 #include "VeltoIDAuthd/Listeners.h"
 #include "VeltoIDAuthd/Relaunch.h"
@@ -48,8 +52,12 @@ void prepareDatabase(const CommandLine& line) {
     __VeltoIDDBSetUsePreferences(line.usePreferences);
     __VeltoIDDBSetFindPersonCacheUsePreferences(line.usePreferences);
     setUseSystemKeychain(line.usePreferences);
-    for (const auto& [key, value] : line.metaInfoValues)
-        __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+    for (const auto& [key, value] : line.metaInfoValues) {
+        if (std::isfinite(numberFromText(value).asDouble().value_or(0)))
+            __VeltoIDDBSetMetaInfoValue(nullptr, key, String(value));
+        else
+            VELTOID_LOG_FROM("prepareDatabase", kError, key, " is not stored: its value is not finite.");
+    }
 }
 
 bool claimNames(const Agent::Configuration& configuration) {
@@ -84,12 +92,15 @@ Agent::Agent(const Configuration& configuration)
 void Agent::start(const Configuration& configuration) {
     const CommandLine& line = configuration.line;
     prepareDatabase(line);
-    setProcessHooks({[](double date) { scheduleRelaunch(date); }, endAfterPendingWork});
+    setProcessHooks({[](double date) { scheduleRelaunch(date, RelaunchDate::OnlyIfEarlier); },
+                     scheduleRequestedLaunch, shutDownByServer});
     flushOnInterrupt();
     prepareShutdown();
     if (line.runsAuthentication()) {
+        restoreRequestedLaunch();
         scheduleRelaunch(platform::now() + kRelaunchAfterStart);
-        startAccountCheck(configuration.firstCheckDelay);
+        // Half of the time for which an idle agent stays, so that it does not leave before.
+        startAccountCheck(std::min(configuration.firstCheckDelay, idleExitSeconds() / 2));
     }
     platform::ServiceManager::shared().announceReady();
     if (line.leaks) workForLeakChecker();

@@ -19,6 +19,7 @@
 #include "VeltoIDAuthenticationDB/FindPersonCache.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
@@ -41,7 +42,11 @@ void countFor(const String& account, const Request& request, std::string_view co
 // there is one to tell.
 
 /// Sets the database value that the request names; none when section, item or key is missing or unknown.
-std::optional<bool> setDatabaseValue(const Request& request) {
+std::optional<bool> setDatabaseValue(const Request& request, ErrorOut error) {
+    if (request.hasDescriptor())
+        return failWith(error, makeError(identity_error::kInvalidParameters,
+                                         {"A file descriptor cannot be stored.", {}, {}}, {}, __func__,
+                                         __FILE_NAME__, __LINE__));
     const String section = request.string(message::kSection);
     const String item = request.string(message::kItem);
     const String key = request.string(message::kKey);
@@ -49,11 +54,16 @@ std::optional<bool> setDatabaseValue(const Request& request) {
     const Notify notify = getBool(&request.options(), option::kDirty, true) ? Notify::Yes : Notify::No;
     if (!section || !key) return std::nullopt;
     if (section == message::kMetaInfoSection) return __VeltoIDDBSetMetaInfoValue(item, key, value);
-    if (item && section == message::kAccountsSection)
-        return __VeltoIDDBSetAccountValue(item, key, value, notify);
-    if (item && section == message::kCertificatesSection)
-        return __VeltoIDDBSetCertificateValue(item, key, value, notify);
-    return std::nullopt;
+    String account = item;
+    std::optional<bool> isSet;
+    if (item && section == message::kAccountsSection) {
+        isSet = __VeltoIDDBSetAccountValue(item, key, value, notify);
+    } else if (item && section == message::kCertificatesSection) {
+        isSet = __VeltoIDDBSetCertificateValue(item, key, value, notify);
+        __VeltoIDDBCopyVeltoIDForDSID(item, &account);
+    }
+    if (isSet.value_or(false) && notify == Notify::Yes) noteNews(account);
+    return isSet;
 }
 
 bool addAccount(Request& request, ErrorOut error) {
@@ -193,9 +203,9 @@ struct Command {
 constexpr Command kCommands[] = {
     {command::kPing, [](Request&, ErrorOut) { return true; }},
     {command::kSetValue,
-     [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(false); }},
+     [](Request& request, ErrorOut error) { return setDatabaseValue(request, error).value_or(false); }},
     {command::kSetValueQuietly,
-     [](Request& request, ErrorOut) { return setDatabaseValue(request).value_or(true); }},
+     [](Request& request, ErrorOut error) { return setDatabaseValue(request, error).value_or(true); }},
     {command::kAdd, addAccount},
     {command::kInfo, getMyInfo, WhileUnreadable::Refuse},
     {command::kFind, findPerson},
@@ -229,7 +239,7 @@ void handleAuthenticationIPCMessage(platform::IncomingMessage& message) {
         return shutDownByCommand();
     }
     std::optional<Error> error;
-    const bool succeeded = dispatch(request, &error);
+    const bool succeeded = request.isSound(&error) && dispatch(request, &error);
     request.finish(succeeded, error);
 }
 

@@ -239,7 +239,7 @@ TEST_F(ServiceTest, StatusOfAnAccount) {
     setValues(
         {{"Dirty", kGone}, {"LastConnectAttempt", date(-100)}, {"ValidationDate", "whatever is stored"}});
     EXPECT_EQ(firstStatus(), (Dictionary{{"ValidationDate", "whatever is stored"},
-                                         {"NextActionTime", date()},
+                                         {"NextActionTime", date(200)},
                                          {"AccountState", "NoEncodedDSID"},
                                          {kAction, kOff}}));
     setValue("encDsId", "d1");

@@ -5,18 +5,31 @@
 namespace veltoid {
 namespace {
 
-MessageObject readMessage(platform::IncomingMessage& message) {
+MessageValueBuilder readMessage(platform::IncomingMessage& message) {
     MessageValueBuilder builder;
     message.read(builder);
-    return std::make_shared<MessageValue>(builder.take());
+    return builder;
 }
 
 }  // namespace
 
-Request::Request(platform::IncomingMessage& message) : message_(message), request_(readMessage(message)) {
+Request::Request(platform::IncomingMessage& message) : Request(message, readMessage(message)) {}
+
+Request::Request(platform::IncomingMessage& message, MessageValueBuilder read)
+    : message_(message),
+      isFinite_(read.isFinite()),
+      hasDescriptor_(read.hasDescriptor()),
+      request_(std::make_shared<MessageValue>(read.take())) {
     command_ = request_.copyValue(message::kCommand, Value::Kind::Number).asInt64().value_or(0);
     account_ = request_.copyAccountName(message::kAccount);
     options_ = dictionary(message::kOptions);
+}
+
+bool Request::isSound(ErrorOut error) const {
+    return isFinite_ ||
+           failWith(error, makeError(identity_error::kInvalidParameters,
+                                     {"The request holds a date or a number that is not finite.", {}, {}}, {},
+                                     __func__, __FILE_NAME__, __LINE__));
 }
 
 Dictionary Request::dictionary(std::string_view key) const {

@@ -19,6 +19,10 @@ class Request {
     explicit Request(platform::IncomingMessage& message);
 
     int64_t command() const { return command_; }
+    /// False, with the error, when the request holds a date or a number that is not finite: it is refused.
+    bool isSound(ErrorOut error) const;
+    /// Whether it holds what cannot be stored: a file descriptor.
+    bool hasDescriptor() const { return hasDescriptor_; }
     /// Lower-cased; null when absent.
     const String& account() const { return account_; }
     /// Empty when absent.
@@ -45,7 +49,11 @@ class Request {
     void finish(bool success, const std::optional<Error>& error);
 
   private:
+    explicit Request(platform::IncomingMessage& message, MessageValueBuilder read);
+
     platform::IncomingMessage& message_;
+    bool isFinite_;
+    bool hasDescriptor_;
     IPCMessage request_;
     IPCMessage reply_;
     int64_t command_ = 0;

@@ -31,7 +31,7 @@ void handlePasswordCheckIPCMessage(platform::IncomingMessage& message,
     const Transaction guard("handlePasswordCheckIPCMessage");
     Request request(message);
     std::optional<Error> error;
-    const bool succeeded = run(request, linkedIdentity, &error);
+    const bool succeeded = request.isSound(&error) && run(request, linkedIdentity, &error);
     request.finish(succeeded, error);
 }
 

@@ -1,5 +1,6 @@
 #include "VeltoIDAuthd/Relaunch.h"
 
+#include <algorithm>
 #include <cstdint>
 #include <limits>
 #include <memory>
@@ -10,8 +11,10 @@
 #include "Platform/runtime/Clock.h"
 #include "Platform/runtime/Lifetime.h"
 #include "Platform/runtime/WorkQueue.h"
+#include "Protocol/RecordKeys.h"
 #include "Values/Error.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
+#include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 
@@ -21,12 +24,16 @@ namespace {
 constexpr double kNoParticularTime = 1e10;
 constexpr double kMaxInterval = std::numeric_limits<uint32_t>::max();
 
-/// The next date is changed on the main queue only; the lock is for the status, which reads it from a
-/// client's queue.
 struct Launches {
     const double begun = platform::now();
+    /// Guards the rest.
     std::mutex mutex;
     std::optional<double> next;
+    double requestedByServer = 0;
+
+    std::optional<double> requestAhead() const {
+        return requestedByServer > platform::now() ? std::optional(requestedByServer) : std::nullopt;
+    }
 };
 
 Launches& launches() { return platform::Lifetime::current().state<Launches>(); }
@@ -35,15 +42,20 @@ Launches& launches() { return platform::Lifetime::current().state<Launches>(); }
 void handOver(double requested, RelaunchDate rule) {
     const double now = platform::now();
     const double target = requested > 0 ? requested : now + kNoParticularTime;
-    auto& [begun, mutex, next] = launches();
-    const std::lock_guard lock(mutex);
-    if (rule == RelaunchDate::OnlyIfEarlier && next && target > *next) return;
-    const double delta = target - now;
-    next.reset();
-    if (delta < 0) return;
-    next = now + delta;
+    Launches& current = launches();
+    const std::lock_guard lock(current.mutex);
+    if (rule == RelaunchDate::OnlyIfEarlier && current.next && target > *current.next) return;
+    current.next.reset();
+    if (target < now) return;
+    current.next = target;
+    const double delta = std::min(target, current.requestAhead().value_or(target)) - now;
     platform::ServiceManager::shared().setStartInterval(
         delta >= kMaxInterval ? std::numeric_limits<uint32_t>::max() : static_cast<uint32_t>(delta));
+}
+
+void setRequestedLaunch(double date) {
+    const std::lock_guard lock(launches().mutex);
+    launches().requestedByServer = date;
 }
 
 }  // namespace
@@ -55,6 +67,18 @@ void scheduleRelaunch(std::optional<double> date, RelaunchDate rule) {
         handOver(requested, rule);
         keepAlive->close();
     });
+}
+
+void scheduleRequestedLaunch(double date) {
+    setRequestedLaunch(date);
+    __VeltoIDDBSetMetaInfoValue(nullptr, kVeltoIDMetaRequestedLaunchDateKey, Value::date(date));
+    scheduleRelaunch(date, RelaunchDate::OnlyIfEarlier);
+}
+
+void restoreRequestedLaunch() {
+    const Value stored =
+        __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaRequestedLaunchDateKey, Value::Kind::Date);
+    setRequestedLaunch(stored.asDate().value_or(0));
 }
 
 Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
@@ -73,13 +97,15 @@ Array copyAccountsNeedingAction(std::optional<double>* earliestDate) {
 void computeRelaunchFromAccounts() {
     std::optional<double> earliest;
     copyAccountsNeedingAction(&earliest);
-    if (earliest) scheduleRelaunch(earliest);
+    // What is due already is so when the next agent begins.
+    if (earliest) scheduleRelaunch(std::max(*earliest, platform::now() + 1));
     __VeltoIDDBSynchronize();
 }
 
 std::optional<double> nextLaunchDate() {
     const std::lock_guard lock(launches().mutex);
-    return launches().next;
+    const auto requested = launches().requestAhead();
+    return requested ? requested : launches().next;
 }
 
 double launchDate() { return launches().begun; }

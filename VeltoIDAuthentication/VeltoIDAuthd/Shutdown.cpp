@@ -33,14 +33,7 @@ constexpr double kMaxCommandedEnd = 1;
 /// How long the end waits for a busy service manager to take the relaunch time (seconds).
 constexpr double kMaxHandOver = 2;
 
-struct Leaving {
-    std::atomic<bool> hasBegun{false};
-};
-
-Leaving& leaving() { return platform::Lifetime::current().state<Leaving>(); }
-
-/// 0 for never.
-double idleExitSeconds() {
+double readIdleExit() {
     const char* text = std::getenv(kIdleExitVariable);
     if (text == nullptr) return kDefaultIdleExit;
     const std::string_view number = text;
@@ -48,11 +41,18 @@ double idleExitSeconds() {
     const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), seconds);
     if (error == std::errc() && end == number.data() + number.size() && std::isfinite(seconds) &&
         seconds >= 0)
-        return seconds;
+        return seconds > 0 ? seconds : platform::kForever;
     VELTOID_LOG_FROM("idleExitSeconds", kError, kIdleExitVariable, " is not a number of seconds; using ",
                      kDefaultIdleExit, ".");
     return kDefaultIdleExit;
 }
+
+struct Leaving {
+    std::atomic<bool> hasBegun{false};
+    const double idleExit = readIdleExit();
+};
+
+Leaving& leaving() { return platform::Lifetime::current().state<Leaving>(); }
 
 /// Makes the delayed writes now.
 void makeDurable() {
@@ -62,7 +62,14 @@ void makeDurable() {
 
 void endProcess() {
     makeDurable();
-    endAfterPendingWork();
+    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
+    const auto end = [] {
+        platform::ServiceManager::shared().announceStopping();
+        platform::bus::flush();
+        platform::event_loop::stop(EXIT_SUCCESS);
+    };
+    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
+    mainQueue.asyncAfter(kMaxHandOver, end);
 }
 
 /// Answers the requests that have arrived and finishes the work under way. Stored values are synced at once:
@@ -106,27 +113,18 @@ void shutDownWhenIdle(double seconds) {
 
 }  // namespace
 
+double idleExitSeconds() { return leaving().idleExit; }
+
 void prepareShutdown() {
     platform::event_loop::onSignal(SIGTERM, terminate);
     // Without its bus no client can reach the agent, and it would only hold up the end of a log-in session.
     platform::message_service::onConnectionLost(terminate);
-    if (const double seconds = idleExitSeconds(); seconds > 0) shutDownWhenIdle(seconds);
+    if (const double seconds = idleExitSeconds(); std::isfinite(seconds)) shutDownWhenIdle(seconds);
 }
 
 bool isLeaving() { return leaving().hasBegun; }
 
-void endAfterPendingWork() {
-    const platform::WorkQueue mainQueue = platform::WorkQueue::main();
-    const auto end = [] {
-        platform::ServiceManager::shared().announceStopping();
-        platform::bus::flush();
-        platform::event_loop::stop(EXIT_SUCCESS);
-    };
-    mainQueue.async([end] { platform::ServiceManager::shared().whenHandedOver(end); });
-    mainQueue.asyncAfter(kMaxHandOver, end);
-    while (!mainQueue.isCurrent() && !platform::Lifetime::current().isEnding())
-        (void)platform::Semaphore().wait(kMaxTermination);
-}
+void shutDownByServer() { platform::WorkQueue::main().async(terminate); }
 
 void shutDownByCommand() {
     platform::WorkQueue::main().async([] { shutDownWithin(kMaxCommandedEnd); });

@@ -3,7 +3,6 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
-#include <clocale>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
@@ -47,7 +46,6 @@ void limitEnd() {
 int main(int argc, char** argv) {
     using namespace veltoid;
     keepMemoryPrivate();
-    std::setlocale(LC_CTYPE, "");
     platform::SystemLog::shared().open(program_invocation_short_name);
 
     CommandLineError error;

@@ -8,6 +8,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
 
@@ -140,11 +141,17 @@ bool AccountRecord::isClientTooOld() const {
            number(kVeltoIDAccountClientTooOldVersionKey) == kVeltoIDDBAccessorVersion;
 }
 
+AccountRecord::Date AccountRecord::embargoEnd(double now) const {
+    const Date end = date(kVeltoIDAccountEarliestAllowedConnectionDateKey);
+    return end && *end > now && *end <= now + kMaxEmbargo ? end : std::nullopt;
+}
+
 bool __VeltoIDDBCopyVeltoIDs(Array* names, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (store.accounts.empty())
-            return failWith(error, identityError(store.isLoaded() ? identity_error::kNoAccounts
-                                                                  : identity_error::kUnspecified));
+            return failWith(error, VELTOID_ERROR_FROM("__VeltoIDDBCopyVeltoIDs",
+                                                      store.isLoaded() ? identity_error::kNoAccounts
+                                                                       : identity_error::kUnspecified));
         fill(names, database::keysOf(store.accounts));
         return true;
     });
@@ -163,10 +170,12 @@ std::optional<AccountRecord> __VeltoIDDBCopyFirstVeltoIDAccount(const AccountReq
 }
 
 bool __VeltoIDDBCopyVeltoIDAccount(const String& name, AccountRecord* record, ErrorOut error) {
-    if (!name) return failWith(error, identityError(identity_error::kInvalidParameters));
+    if (!name) return failWith(error, VELTOID_ERROR(identity_error::kInvalidParameters));
     return database::perform([&](const Store& store) {
         auto found = recordOf(store, name);
-        if (!found) return failWith(error, identityError(missingAccountCode(store)));
+        if (!found)
+            return failWith(error,
+                            VELTOID_ERROR_FROM("__VeltoIDDBCopyVeltoIDAccount", missingAccountCode(store)));
         fill(record, std::move(*found));
         return true;
     });
@@ -205,8 +214,10 @@ bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPas
         PasswordChange password(name, record);
         if (hashedPassword && !password.make(hashedPassword, record)) return false;
         if (hashedPassword)
-            for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey})
+            for (const auto key : {kVeltoIDAccountClientTooOldKey, kVeltoIDAccountClientTooOldVersionKey,
+                                   kVeltoIDAccountNextCheckDateKey, kVeltoIDAccountCheckBackOffKey})
                 record.remove(key);
+        if (hashedPassword) database::adoptKeychain(store);
         if (!record.contains(kVeltoIDAccountUUIDKey) || !record.contains(kVeltoIDAccountStableUUIDKey))
             database::deriveAccountUUIDs(name, record, store.metaInfo);
         markDirty(record);
@@ -280,12 +291,14 @@ Value __VeltoIDDBCopyAccountValue(const String& name, const String& key) {
 }
 
 bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
-    if (!name) return failWith(error, {kOSStatusErrorDomain, -1, {}});
+    if (!name)
+        return failWith(error, makeStatusError("No account was named", __func__, __FILE_NAME__, __LINE__));
     return database::perform([&](Store& store) {
         const bool exists = store.accounts.contains(name.view());
         if (store.remove(&Store::accounts, name)) return true;
-        return failWith(error,
-                        identityError(exists ? identity_error::kUnspecified : missingAccountCode(store)));
+        return failWith(
+            error, VELTOID_ERROR_FROM("__VeltoIDDBRemoveVeltoIDAccount",
+                                      exists ? identity_error::kUnspecified : missingAccountCode(store)));
     });
 }
 

@@ -15,6 +15,10 @@
 
 namespace veltoid {
 
+/// A server is left alone for at most this long when it asks for that (seconds); a later date is not
+/// believed.
+inline constexpr double kMaxEmbargo = 1'209'600;
+
 /// A record as its readers see it: the stored dictionary under the names of its entries. Shares the stored
 /// value and copies nothing; entries of the wrong type count as absent.
 class AccountRecord : Dictionary {
@@ -49,9 +53,14 @@ class AccountRecord : Dictionary {
 
     // Connecting to the server.
     Date lastConnectAttempt() const { return date(kVeltoIDMetaLastConnectAttemptKey); }
-    Date earliestConnection() const { return date(kVeltoIDAccountEarliestAllowedConnectionDateKey); }
+    /// The end of the embargo that is in force at `now`.
+    Date embargoEnd(double now) const;
     /// Whether the server has refused this version of the agent since the account was last added.
     bool isClientTooOld() const;
+
+    // What the account check puts off.
+    Date nextCheck() const { return date(kVeltoIDAccountNextCheckDateKey); }
+    Seconds checkBackOff() const { return number(kVeltoIDAccountCheckBackOffKey); }
 
     // Validation of the account's information.
     Date lastValidation() const { return date(kVeltoIDAccountLastValidationDateKey); }
@@ -79,6 +88,7 @@ class AccountRecord : Dictionary {
     Data pendingKeyReference() const { return data(kVeltoIDCertificatePrivateKeyPersistentReferenceKey); }
     String certificateToken() const { return string(kVeltoIDAccountCertificateTokenKey); }
     Date certificateTokenExpiration() const { return date(kVeltoIDAccountCertificateTokenExpirationKey); }
+    Date certificateTokenFaultsSince() const { return date(kVeltoIDAccountCertificateTokenFaultsSinceKey); }
     Date nextCertificateFetch() const { return date(kVeltoIDAccountCertificateNextCertificateFetchDateKey); }
     Seconds nextCertificateFetchDelta() const {
         return number(kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey);
@@ -112,8 +122,9 @@ AccountRecord accountRecordOf(const String& name);
 bool __VeltoIDDBCopyVeltoIDForDSID(const String& encDsId, String* name, ErrorOut error = nullptr);
 
 /// Creates or updates the record; a password goes to the keychain, its reference into the record, and the
-/// server is asked again whether it takes this agent. Marks the record dirty and writes with signal. False, with
-/// record and password as they were, when the keychain refuses the password or the record cannot be stored.
+/// server is asked again whether it takes this agent. Marks the record dirty and writes with signal. False,
+/// with record and password as they were, when the keychain refuses the password or the record cannot be
+/// stored.
 bool __VeltoIDDBCreateVeltoIDAccount(const String& name, const String& hashedPassword, const String& encDsId);
 
 /// The password hash of a record: from the keychain, else the record's own. Runs on the caller's thread.

@@ -194,6 +194,9 @@ TEST_F(AccountsTest, ErrorsOfLookUps) {
         std::optional<Error> error;
         EXPECT_FALSE(operation(&error));
         EXPECT_EQ(error->domain, kIdentityErrorDomain);
+        EXPECT_TRUE(error->userInfo.string("function").view().starts_with("__VeltoIDDB"));
+        EXPECT_TRUE(error->userInfo.contains("file") && error->userInfo.contains("line"));
+        EXPECT_TRUE(error->userInfo.string(kErrorDescriptionKey));
         return error->code;
     };
     Array names{"left over"};
@@ -208,7 +211,9 @@ TEST_F(AccountsTest, ErrorsOfLookUps) {
 
     std::optional<Error> error;
     EXPECT_FALSE(__VeltoIDDBRemoveVeltoIDAccount(nullptr, &error));
-    EXPECT_EQ(error, (Error{kOSStatusErrorDomain, -1, {}}));
+    EXPECT_EQ(std::pair(error->domain, error->code), std::pair(String(kOSStatusErrorDomain), int64_t{-1}));
+    EXPECT_EQ(error->userInfo.string("function"), "__VeltoIDDBRemoveVeltoIDAccount");
+    EXPECT_EQ(error->userInfo.string(kErrorDescriptionKey), "No account was named");
     for (const String& encDsId : {String("d"), String()}) {
         EXPECT_FALSE(__VeltoIDDBCopyVeltoIDForDSID(encDsId, nullptr, &error));
         EXPECT_EQ(error->code, -1);

@@ -1,8 +1,11 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 
+#include <vector>
+
 #include "Platform/runtime/Clock.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/Store.h"
+#include "VeltoIDKeychainItems/KeychainCertificates.h"
 
 namespace veltoid {
 namespace {
@@ -23,6 +26,30 @@ CertificateEntry entryOf(const Store& store, const String& encDsId) {
     return found != nullptr ? CertificateEntry(encDsId, *found) : CertificateEntry();
 }
 
+/// Stores the certificates as they are now; with a notification the accounts of the encDsId count as changed,
+/// since the account check looks at accounts.
+bool storeCertificates(Store& store, const String& encDsId, Dictionary certificates, Notify notify) {
+    std::vector<Store::Change> changes = {{&Store::certificates, std::move(certificates)}};
+    if (notify == Notify::Yes) {
+        Dictionary accounts = store.accounts;
+        for (const auto& [name, value] : store.accounts) {
+            const Dictionary* record = value.asDictionary();
+            if (record == nullptr || record->string(kVeltoIDAccountDSIDKey) != encDsId) continue;
+            Dictionary marked = *record;
+            marked.set(kVeltoIDDirtyKey, Value::boolean(true));
+            accounts.set(name, marked);
+        }
+        changes.push_back({&Store::accounts, std::move(accounts)});
+    }
+    return store.replace(std::move(changes), notify);
+}
+
+bool storeEntry(Store& store, const String& encDsId, const Dictionary& entry, Notify notify) {
+    Dictionary certificates = store.certificates;
+    certificates.set(encDsId, entry);
+    return storeCertificates(store, encDsId, std::move(certificates), notify);
+}
+
 /// Only a significant change marks the entry and notifies.
 bool setValues(Store& store, const String& encDsId, const Dictionary& values, Notify notify) {
     const Dictionary* existing = Store::find(store.certificates, encDsId);
@@ -41,7 +68,7 @@ bool setValues(Store& store, const String& encDsId, const Dictionary& values, No
     if (!changed) return true;
     entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));
     if (notify == Notify::Yes && !isMarked) entry.set(kVeltoIDDirtyKey, Value::boolean(true));
-    return store.set(&Store::certificates, encDsId, entry, significant ? notify : Notify::No);
+    return storeEntry(store, encDsId, entry, significant ? notify : Notify::No);
 }
 
 }  // namespace
@@ -49,7 +76,8 @@ bool setValues(Store& store, const String& encDsId, const Dictionary& values, No
 bool __VeltoIDDBCopyCertificateKeys(Array* keys, ErrorOut error) {
     return database::perform([&](const Store& store) {
         if (!store.isLoaded())
-            return failWith(error, identityError(identity_error::kNoCertificateForAccount));
+            return failWith(error, VELTOID_ERROR_FROM("__VeltoIDDBCopyCertificateKeys",
+                                                      identity_error::kNoCertificateForAccount));
         fill(keys, database::keysOf(store.certificates));
         return true;
     });
@@ -71,7 +99,7 @@ bool __VeltoIDDBSetCertificateInfo(const String& encDsId, const std::optional<Di
         }
         entry.set(kVeltoIDDirtyKey, Value::boolean(true));
         entry.set(kVeltoIDCertificateModificationDateKey, Value::date(platform::now()));
-        return store.set(&Store::certificates, encDsId, entry, Notify::Yes);
+        return storeEntry(store, encDsId, entry, Notify::Yes);
     });
 }
 
@@ -108,13 +136,21 @@ CertificateEntry certificateEntryOf(const String& encDsId) {
 }
 
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId) {
-    return database::perform([&](Store& store) { return store.remove(&Store::certificates, encDsId); });
+    return database::perform([&](Store& store) {
+        Dictionary certificates = store.certificates;
+        return encDsId && certificates.remove(encDsId.view()) &&
+               storeCertificates(store, encDsId, std::move(certificates), Notify::Yes);
+    });
 }
 
 bool hasValidCertificateEntry(const String& encDsId) {
     const CertificateEntry entry = certificateEntryOf(encDsId);
     const auto expires = entry.expires();
-    return entry.isIssued() && (!expires || *expires > platform::now() - kVeltoIDCertificateExpirationGrace);
+    if (!entry.isIssued() || (expires && *expires <= platform::now() - kVeltoIDCertificateExpirationGrace))
+        return false;
+    std::optional<platform::Certificate> certificate;
+    copyCertificateFromKeychainGivenPersistentRef(entry.reference(), &certificate);
+    return !certificate || certificate->notAfter > platform::now();
 }
 
 }  // namespace veltoid

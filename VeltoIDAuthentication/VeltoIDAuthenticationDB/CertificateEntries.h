@@ -91,7 +91,8 @@ CertificateEntry certificateEntryOf(const String& encDsId);
 /// True when an entry was removed.
 bool __VeltoIDDBRemoveCertificateInfo(const String& encDsId);
 
-/// Whether the encDsId has an entry that is issued and, a day of grace included, has not expired.
+/// Whether the encDsId has an entry that is issued and, a day of grace included, has not expired, with a
+/// certificate that has not ended by its own account.
 bool hasValidCertificateEntry(const String& encDsId);
 
 }  // namespace veltoid

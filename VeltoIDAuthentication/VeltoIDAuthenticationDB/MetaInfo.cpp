@@ -5,6 +5,7 @@
 #include <limits>
 
 #include "Protocol/RecordKeys.h"
+#include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/Store.h"
 
 namespace veltoid {
@@ -19,6 +20,8 @@ const Dictionary& defaults() {
     };
     return *values;
 }
+
+Value numberOf(const Value& value) { return value.isString() ? numberFromText(*value.asText()) : value; }
 
 bool fits(const Value& value, std::optional<Value::Kind> requiredKind) {
     return !value.isAbsent() && (!requiredKind || value.kind() == *requiredKind);
@@ -81,10 +84,11 @@ void __VeltoIDDBForgetUnknownNames() {
 double metaInterval(const String& section, const Dictionary& options, std::string_view key,
                     double defaultValue, UnreadableInterval unreadable) {
     const bool isZero = unreadable == UnreadableInterval::Zero;
-    const Value stored = __VeltoIDDBCopyMetaInfoValue(
-        section, options, key, isZero ? std::nullopt : std::optional(Value::Kind::Number));
+    Value stored = __VeltoIDDBCopyMetaInfoValue(section, options, key);
+    if (!isZero && !fits(numberOf(stored), Value::Kind::Number))
+        stored = __VeltoIDDBCopyMetaInfoValue(section, options, key, Value::Kind::Number);
     if (stored.isAbsent()) return defaultValue;
-    const double seconds = stored.asDouble().value_or(std::numeric_limits<double>::quiet_NaN());
+    const double seconds = numberOf(stored).asDouble().value_or(std::numeric_limits<double>::quiet_NaN());
     if (std::isfinite(seconds)) return seconds;
     return isZero ? 0 : defaultValue;
 }

@@ -38,8 +38,9 @@ void __VeltoIDDBForgetUnknownNames();
 /// What an interval counts as that is set to something other than a number.
 enum class UnreadableInterval { Default, Zero };
 
-/// The Number of seconds under `key`, looked up as above; the default when there is none. One that is not
-/// finite counts as something other than a number.
+/// The Number of seconds under `key`, looked up as above; the default when there is none. A text that writes
+/// a number, as every value of the agent's command line is a text, is that number. One that is not finite
+/// counts as something other than a number.
 double metaInterval(const String& section, const Dictionary& options, std::string_view key,
                     double defaultValue, UnreadableInterval unreadable = UnreadableInterval::Default);
 

@@ -3,8 +3,10 @@
 #include <algorithm>
 #include <vector>
 
+#include "Platform/encoding/UTF8.h"
 #include "Protocol/RecordKeys.h"
 #include "Values/Digest.h"
+#include "Values/LowerCase.h"
 #include "VeltoIDAuthenticationDB/AccountUUIDs.h"
 
 namespace veltoid::database {
@@ -45,6 +47,22 @@ bool addUserUUID(Dictionary& accounts, Dictionary& metaInfo) {
     return true;
 }
 
+/// Agents whose locale did not know a letter kept its case: nobody could ask for the account any more. False
+/// when there is none.
+bool lowerCaseNames(Dictionary& accounts) {
+    bool changed = false;
+    const Dictionary before = accounts;
+    for (const auto& [name, value] : before) {
+        const String lower = lowerCased(name);
+        if (platform::isASCII(name.view()) || lower == name || accounts.contains(lower.view())) continue;
+        Dictionary record = *value.asDictionary();
+        record.set(kVeltoIDAccountNameKey, lower);
+        accounts.set(lower, record);
+        changed = accounts.remove(name.view());
+    }
+    return changed;
+}
+
 }  // namespace
 
 MigrationOutcome migrate(Dictionary& accounts, Dictionary& metaInfo, Array& versions) {
@@ -75,6 +93,7 @@ MigrationOutcome migrate(Dictionary& accounts, Dictionary& metaInfo, Array& vers
             });
         }
     }
+    outcome.sectionsChanged = lowerCaseNames(accounts) || outcome.sectionsChanged;
     return outcome;
 }
 

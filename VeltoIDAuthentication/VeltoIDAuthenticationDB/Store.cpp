@@ -1,6 +1,7 @@
 #include "VeltoIDAuthenticationDB/Store.h"
 
 #include <algorithm>
+#include <utility>
 #include <vector>
 
 #include "Platform/runtime/Clock.h"
@@ -117,8 +118,12 @@ Store& loadedStore() {
     Store& current = store();
     if (!current.isReady_.load(std::memory_order_acquire)) {
         current.queue.sync([&] {
-            if (!current.isReady_.load(std::memory_order_relaxed))
-                current.isReady_.store(current.load(), std::memory_order_release);
+            if (current.isReady_.load(std::memory_order_relaxed)) return;
+            const bool isLoaded = current.load();
+            current.isReady_.store(isLoaded, std::memory_order_release);
+            // Who waits for that need not wait any longer.
+            if (std::exchange(current.hasFailed_, !isLoaded) && isLoaded && current.changeSemaphore_)
+                current.changeSemaphore_->signal();
         });
     }
     return current;
@@ -141,9 +146,13 @@ const Dictionary* Store::find(const Dictionary& section, const String& key) {
     return key ? section.dictionary(key.view()) : nullptr;
 }
 
-platform::Preferences Store::preferences() const {
-    return platform::Preferences(domainName_ ? domainName_.text() : std::string(kVeltoIDDBDefaultDomain));
+std::string Store::domain() const {
+    return domainName_ ? domainName_.text() : std::string(kVeltoIDDBDefaultDomain);
 }
+
+platform::Preferences Store::preferences() const { return platform::Preferences(domain()); }
+
+platform::Preferences Store::keychainDomain() const { return platform::Preferences(domain() + ".keychain"); }
 
 bool Store::load() {
     if (!usePreferences_) return true;

@@ -60,6 +60,14 @@ class Store {
     Dictionary certificates;
     Dictionary metaInfo;
 
+    // Of KeychainIdentity.cpp: whether the keychain's identity is stored (any thread), and whether it was the
+    // right one last time.
+    std::atomic<bool> keychainIsKnown{false};
+    bool keychainWasOurs = true;
+
+    /// Where the keychain's identity is remembered: beside the database, as it is nothing for clients.
+    platform::Preferences keychainDomain() const;
+
     /// The record or entry under a key of a section; null when there is none or it is not a Dictionary.
     static const Dictionary* find(const Dictionary& section, const String& key);
 
@@ -97,6 +105,7 @@ class Store {
     friend bool veltoid::__VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents, ErrorOut error);
     friend Store& loadedStore();
 
+    std::string domain() const;
     platform::Preferences preferences() const;
     bool load();
     bool writeSections(const std::vector<Dictionary Store::*>& sections);
@@ -106,6 +115,8 @@ class Store {
     std::atomic<bool> isReady_{false};
     bool usePreferences_ = false;
     bool loaded_ = false;
+    /// The last attempt to load.
+    bool hasFailed_ = false;
     String domainName_;
     std::unique_ptr<Transaction> pendingFlush_;
     std::optional<platform::Semaphore> changeSemaphore_;

@@ -175,6 +175,14 @@ TEST_F(StoreTest, TheDevicesIdentifierIsMadeOnce) {
     EXPECT_EQ(openCount(), 0);
 }
 
+TEST_F(StoreTest, NamesThatAnotherLocaleKeptInCapitalsCanBeAskedForAgain) {
+    storeDomain({{"Version", number(100)},
+                 {"Accounts", Dictionary{{"Änne@x", Dictionary{{"VeltoID", "Änne@x"}, {"k", "v"}}}}},
+                 {"AccessorVersions", Array{kOwnVersion}}});
+    EXPECT_EQ(account("änne@x"), (Dictionary{{"VeltoID", "änne@x"}, {"k", "v"}}));
+    EXPECT_EQ(accountNames(), Array{"änne@x"});
+}
+
 TEST_F(StoreTest, SectionsOfTheWrongFormLoadAsFarAsTheyAreRight) {
     storeDomain(
         {{"Version", number(100)},

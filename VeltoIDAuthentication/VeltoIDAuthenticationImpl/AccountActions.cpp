@@ -6,19 +6,18 @@
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
 #include "Logging/LogText.h"
-#include "Platform/keychain/LockState.h"
 #include "Platform/runtime/Clock.h"
 #include "Protocol/OptionKeys.h"
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/PollBackOff.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
-#include "VeltoIDKeychainItems/KeychainPasswords.h"
 
 namespace veltoid {
 namespace {
@@ -27,6 +26,7 @@ using enum AccountState;
 
 // Seconds.
 constexpr double kRenewalInterval = 86'400;
+constexpr double kMinRenewalInterval = 3'600;
 constexpr double kRecordRetryInterval = 180;
 constexpr double kRecordCheckSoon = 15;
 constexpr double kRecordIntervalAfterServersDate = 14'400;
@@ -36,10 +36,10 @@ constexpr double kRecordRetryGrowth = 1.5;
 constexpr std::string_view kNextCheckInterval = kVeltoIDAccountValidationRecordNextCheckIntervalKey;
 constexpr std::string_view kNextCheckDate = kVeltoIDAccountValidationRecordNextCheckDateKey;
 
-/// The keychain may have been unlocked, or locked, since the account was examined.
+/// What cannot be read now, or not in this keychain, is not lost.
 void dropLostPassword(const AccountRecord& record) {
-    if (!platform::LockState::shared().hasBeenUnlockedSinceBoot() ||
-        copyPasswordFromKeychainGivenPersistentRef(record.passwordReference(), nullptr))
+    if (stateOfItem(platform::KeychainItemClass::GenericPassword, record.passwordReference()) !=
+        ItemState::Gone)
         return;
     setAccountValuesIf(
         [](const AccountRecord& stored, const AccountRecord& examined) {
@@ -71,12 +71,13 @@ void noteValidation(const CertificateEntry& examined) {
 /// What is tried next after an attempt that failed.
 Dictionary laterAttempt(const AccountRecord& record) {
     const auto stored = record.validationRecordNextCheckInterval();
-    const double interval = stored && *stored > 0 && std::isfinite(*stored)
-                                ? *stored
-                                : metaInterval(nullptr, {}, kVeltoIDMetaValidationRecordRetryIntervalKey,
-                                               kRecordRetryInterval, UnreadableInterval::Zero);
-    const double grown =
-        std::min(std::max(interval * kRecordRetryGrowth, kRecordRetryInterval), randomPollingDelay());
+    const double interval =
+        stored && *stored > 0 && std::isfinite(*stored)
+            ? *stored
+            : std::max(metaInterval(nullptr, {}, kVeltoIDMetaValidationRecordRetryIntervalKey,
+                                    kRecordRetryInterval),
+                       kRecordRetryInterval);
+    const double grown = std::min(interval * kRecordRetryGrowth, randomPollingDelay());
     return {{kNextCheckDate, Value::date(platform::now() + interval)},
             {kNextCheckInterval, Value::real(grown)}};
 }
@@ -100,8 +101,10 @@ void renewCertificateForAccount(const String& accountName, const Examined& exami
                     " dsID=", describeValue(examined.certificate.encDsId()),
                     " because it has expired or been revoked.");
     } else {
-        const double interval = metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey,
-                                             kRenewalInterval, UnreadableInterval::Zero);
+        const double given =
+            metaInterval(nullptr, {}, kVeltoIDMetaCertificateRenewalIntervalKey, kRenewalInterval);
+        const double interval =
+            given > 0 ? std::clamp(given, kMinRenewalInterval, kRenewalInterval) : kRenewalInterval;
         __VeltoIDDBSetCertificateValues(
             examined.certificate,
             {{kVeltoIDCertificateNextRenewalAttemptDateKey, Value::date(platform::now() + interval)}},
@@ -138,6 +141,7 @@ void checkAccount(const AccountRecord& record) {
         case ValidationRecordNeedsToBeUpdated:
             return fetchValidationRecordForAccount(record, options);
         case CertificatePending:
+            if (endExpiredRequest(accountName)) return checkAccount(accountRecordOf(accountName));
             __VeltoIDDoFetchCertificateForVeltoID(accountName, FetchTime::WhenDue, options);
             return;
         case Unknown:

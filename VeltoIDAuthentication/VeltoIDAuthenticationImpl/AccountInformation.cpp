@@ -17,6 +17,7 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -64,6 +65,7 @@ class InformationRequest {
         if (isOn(option::kDeferValidation)) {
             if (!record_.isComplete()) return false;
             markForValidation();
+            noteNews(name_);
             return true;
         }
         const bool mustAsk = isOn(option::kForceValidationRecordFetch) ||
@@ -161,7 +163,8 @@ void applyCertificateValidity(const String& accountName, const Dictionary& answe
     const CertificateEntry entry = asked ? *asked : certificateEntryOf(encDsId);
     if (isValid.asBoolean().value_or(false)) {
         __VeltoIDDBSetCertificateValues(
-            entry, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now())}});
+            entry, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now())}},
+            Notify::No);
         return;
     }
     VELTOID_LOG_FROM("updateAccountWithGetMyInfoResult", kNotice, "Marking certificate for Velto ID ",
@@ -284,9 +287,14 @@ void updateAccountWithGetMyInfoResult(const String& accountName, const Dictionar
 bool __VeltoIDCopyCertificateInfo(const String& accountName, const String& encDsId, const Dictionary& options,
                                   Dictionary* information, ErrorOut error) {
     const String requested = requestedEncDsId(accountName, encDsId);
-    if (!requested) return failWith(error, {kOSStatusErrorDomain, -1, {}});
+    if (!requested)
+        return failWith(error, makeStatusError("There is no such account on this device, or it was never "
+                                               "signed in",
+                                               __func__, __FILE_NAME__, __LINE__));
     const CertificateEntry entry = certificateEntryOf(requested);
-    if (!entry.exists()) return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+    if (!entry.exists())
+        return failWith(error, makeError(identity_error::kUnknown, {{}, "There is no certificate", {}}, {},
+                                         __func__, __FILE_NAME__, __LINE__));
     Dictionary found = {{kVeltoIDAccountDSIDKey, requested}};
     takeEntries(entry.values(), kCertificateEntries, found);
     if (getBool(&options, option::kCertificateDetails, false))

@@ -46,7 +46,8 @@ TEST_F(Information, IsFreshForSomeTime) {
         {"presumed by the server", 100, {}, number(100), true},
         {"presumed, over", 101, {}, number(100), false},
         {"presumed caps its own", 31, number(50), number(30), false},
-        {"presumed is no number", 28'800, {}, "5", true},
+        {"presumed is no number", 28'800, {}, "five", true},
+        {"presumed is a text", 101, {}, "100", false},
     };
     for (const auto& [what, age, own, presumed, isFresh] : cases) {
         prepare(age);

@@ -8,6 +8,7 @@
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
 #include "VeltoIDAuthenticationImpl/PollBackOff.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
@@ -18,6 +19,7 @@ namespace {
 
 // Seconds.
 constexpr double kDefaultValidationInterval = 1'209'600;
+constexpr double kMinValidationInterval = 3'600;
 constexpr double kReconnectInterval = 300;
 constexpr double kNeverForOldClients = 3'153'600'000;
 constexpr double kValidationAttemptSpacing = 43'200;
@@ -34,13 +36,11 @@ constexpr std::string_view kOfInformation = kVeltoIDMetaAccountValidationInterva
 constexpr std::string_view kOfCertificate = kVeltoIDMetaCertificateValidationIntervalKey;
 
 using enum DueReason;
-// Request is among them, so that an account whose sign-in keeps failing stays due and is put off for longer
-// and longer, instead of being tried every five minutes.
-constexpr DueReason kUnknownToServer[] = {Change, SignIn, Request};
-constexpr DueReason kPending[] = {Change, Validation, PendingFetch};
-constexpr DueReason kWithoutCertificate[] = {Change, Validation, Request};
-constexpr DueReason kWithCertificate[] = {
-    Change, Validation, Expiry, Renewal, PreExpiry, CertificateValidation, ValidationRecord};
+constexpr DueReason kUnknownToServer[] = {SignIn};
+constexpr DueReason kPending[] = {Validation, PendingFetch};
+constexpr DueReason kWithoutCertificate[] = {Validation, Request};
+constexpr DueReason kWithCertificate[] = {Validation,      Expiry, Renewal, PreExpiry, CertificateValidation,
+                                          ValidationRecord};
 constexpr DueReason kEmbargoed[] = {Expiry};
 
 /// The reasons that an examination gets to, by how far the account has come.
@@ -71,6 +71,12 @@ bool AccountSchedule::isDue(DueReason reason) const {
 }
 
 std::optional<double> AccountSchedule::nextAction() const {
+    const auto reason = record_.isDirty() && !endOfEmbargo() ? std::optional(now_) : nextReason();
+    if (!reason) return std::nullopt;
+    return std::max(*reason, putOffUntil(record_).value_or(*reason));
+}
+
+std::optional<double> AccountSchedule::nextReason() const {
     std::optional<double> earliest = endOfEmbargo();
     // While the server wants to be left alone, only the certificate's expiry can lead to an action.
     for (const DueReason reason :
@@ -88,8 +94,6 @@ std::optional<double> AccountSchedule::nextAction() const {
 
 AccountSchedule::Date AccountSchedule::due(DueReason reason) const {
     switch (reason) {
-        case DueReason::Change:
-            return record_.isDirty() ? rightNow() : std::nullopt;
         case DueReason::SignIn:
             return signIn();
         case DueReason::Validation:
@@ -129,7 +133,8 @@ AccountSchedule::Date AccountSchedule::validation() const {
 AccountSchedule::Date AccountSchedule::pendingFetch() const {
     if (!record_.certificateToken()) return std::nullopt;
     const auto next = record_.nextCertificateFetch();
-    return next && *next <= now_ + kMaxFetchDelay ? at(next) : rightNow();
+    if (!next || *next > now_ + kMaxFetchDelay) return rightNow();
+    return at(std::min(*next, record_.certificateTokenExpiration().value_or(*next)));
 }
 
 AccountSchedule::Date AccountSchedule::expiry() const {
@@ -155,7 +160,7 @@ AccountSchedule::Date AccountSchedule::preExpiry() const {
 
 AccountSchedule::Date AccountSchedule::certificateValidation() const {
     const auto validated = entry_.lastSuccessfulValidation();
-    if (!validated || *validated > now_) return rightNow();
+    if (!validated || *validated > now_ || entry_.isDirty()) return rightNow();
     const double old = *validated + validationInterval(kOfCertificate);
     const auto attempt = after(entry_.lastValidationAttempt(), kValidationAttemptSpacing);
     return attempt && attempt->date >= old ? attempt : at(old);
@@ -185,7 +190,9 @@ bool AccountSchedule::isInformationFresh() const {
 }
 
 double AccountSchedule::validationInterval(std::string_view key) const {
-    return metaInterval(record_.accountName(), {}, key, kDefaultValidationInterval);
+    const double seconds = metaInterval(record_.accountName(), {}, key, kDefaultValidationInterval);
+    return seconds > 0 ? std::clamp(seconds, kMinValidationInterval, kDefaultValidationInterval)
+                       : kDefaultValidationInterval;
 }
 
 double AccountSchedule::certificateLifetime() const {
@@ -195,11 +202,8 @@ double AccountSchedule::certificateLifetime() const {
 }
 
 std::optional<double> AccountSchedule::endOfEmbargo() const {
-    if (isEmbargoed()) return record_.earliestConnection();
-    if (record_.values().contains(kVeltoIDAccountEarliestAllowedConnectionDateKey) ||
-        !record_.isClientTooOld())
-        return std::nullopt;
-    return now_ + kNeverForOldClients;
+    if (record_.isClientTooOld()) return now_ + kNeverForOldClients;
+    return record_.embargoEnd(now_);
 }
 
 std::optional<double> copyNextActionDateForAccount(const String& accountName) {

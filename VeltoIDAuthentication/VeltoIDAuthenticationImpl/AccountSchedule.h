@@ -15,8 +15,6 @@ namespace veltoid {
 inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
 
 enum class DueReason {
-    /// The record was changed.
-    Change,
     /// The encDsId is to be learnt.
     SignIn,
     /// The account's information is to be validated: forced, planned, or old.
@@ -47,12 +45,15 @@ class AccountSchedule {
     /// Whether it is time for that, leaving aside what has to be done before.
     bool isDue(DueReason reason) const;
 
-    /// The earliest date (seconds since 1970) of all reasons that the examination gets to; none: no action is
-    /// foreseen.
+    /// The earliest date (seconds since 1970) of all reasons that the examination gets to, but not before
+    /// what the account check has put the account off to; none: no action is foreseen.
     std::optional<double> nextAction() const;
 
+    /// The same for what is due whether the record was changed or not, and whatever was put off.
+    std::optional<double> nextReason() const;
+
     /// Whether the server wants to be left alone by this account.
-    bool isEmbargoed() const { return record_.earliestConnection() > now_; }
+    bool isEmbargoed() const { return record_.embargoEnd(now_).has_value(); }
     /// Whether the account's information was validated not long ago.
     bool isInformationFresh() const;
     /// Whether the certificate's evaluation is due, but was tried not long ago.

@@ -26,9 +26,16 @@ namespace {
 constexpr const char* kRequestFunction = "__VeltoIDDoCreateCertificateRequestForVeltoID";
 
 // Seconds.
-constexpr double kDefaultDelayAfterFailedSignIn = 10;
 
-Error statusCodeError() { return {String(kOSStatusErrorDomain), -1, {}}; }
+Error statusCodeError(const char* description, int line) {
+    return makeStatusError(description, kRequestFunction, __FILE_NAME__, line);
+}
+
+/// Whether the server has issued or refused the certificate.
+bool isDecided(const Dictionary& result) {
+    const String status = result.string(kVeltoIDCertificateStatusKey);
+    return status == kVeltoIDCertificateStatusIssued || status == kVeltoIDCertificateStatusFailed;
+}
 
 /// Has the failure judged and hands it out.
 bool fail(const String& accountName, const String& sentPasswordHash, const std::optional<Error>& held,
@@ -94,7 +101,7 @@ RequestsSeen seenBy(const OwnershipLock& ownership, const String& accountName) {
 std::shared_ptr<Request> noteRequest(const AccountRecord& record, const String& password) {
     Requests& all = requests();
     std::erase_if(all.last, [](const auto& entry) { return !recordOfSame(entry.second->record); });
-    const auto request = std::make_shared<Request>(Request{++all.lastNumber, record, password});
+    auto request = std::make_shared<Request>(Request{++all.lastNumber, record, password});
     all.last[record.accountName().text()] = request;
     return request;
 }
@@ -125,9 +132,10 @@ class SigningRequest {
 
     bool adoptEncDsId() {
         const OwnershipLock ownership;
-        return isCurrent(ownership) && (request_.record.encDsId() == request_.encDsId ||
-                                        setInRecord({{kVeltoIDAccountDSIDKey, request_.encDsId}}) ||
-                                        failWith(&held_, statusCodeError()));
+        return isCurrent(ownership) &&
+               (request_.record.encDsId() == request_.encDsId ||
+                setInRecord({{kVeltoIDAccountDSIDKey, request_.encDsId}}) ||
+                failWith(&held_, statusCodeError("The encDsId cannot be stored", __LINE__)));
     }
 
     bool makeKeys() {
@@ -138,7 +146,7 @@ class SigningRequest {
         VELTOID_LOG_FROM(kRequestFunction, kError,
                          "Failed to generate a CSR or privateKey for the dsID, err=", status, " ",
                          describeValue(text_), " ", privateKey_.description());
-        return failWith(&held_, statusCodeError());
+        return failWith(&held_, statusCodeError("No key or certificate request can be made", __LINE__));
     }
 
     bool send(VeltoIDAuthenticationSessionInfo& session) {
@@ -189,10 +197,9 @@ class SigningRequest {
         if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}))
             setInRecord({{kVeltoIDAccountCertificateTokenExpirationKey,
                           Value::date(platform::now() + kVeltoIDCertificateTokenLifetime)}});
-        const auto seconds = tokenDelay(delay);
-        setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-                      seconds ? Value::real(*seconds) : Value::null()}});
-        const double nextFetch = platform::now() + seconds.value_or(0);
+        const double seconds = tokenDelay(delay);
+        setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::real(seconds)}});
+        const double nextFetch = platform::now() + seconds;
         const bool stored = setInRecord(
             {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, Notify::No);
         requestRelaunch(nextFetch);
@@ -217,13 +224,10 @@ std::shared_ptr<Request> beginRequest(const OwnershipLock& ownership, const Acco
                                       const String& password, ErrorOut error) {
     if (!admitCertificateRequest(record, error)) return nullptr;
     VELTOID_LOG_FROM(kRequestFunction, kNotice, "VeltoIDAuth: Creating CSR for ", record.accountName(), ".");
-    __VeltoIDDBSetAccountValues(record.accountName(),
-                                {{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now())},
-                                 {kVeltoIDAccountCertificateTokenKey, Value::null()},
-                                 {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
-                                 {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()}},
-                                Notify::No);
-    if (!record.requestGenerationInterval())
+    __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCSRGenerationDateKey,
+                               Value::date(platform::now()), Notify::No);
+    __VeltoIDDBSetAccountValues(record.accountName(), noPendingRequest(), Notify::No);
+    if (record.requestGenerationInterval().value_or(0) <= 0)
         __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCSRGenerationIntervalKey,
                                    Value::real(kVeltoIDCSRGenerationInterval));
     discardPendingKey(ownership, record.accountName());
@@ -248,16 +252,6 @@ Turn takeTurn(const String& accountName, std::optional<RequestsSeen> seen, Error
     return {beginRequest(ownership, record, password, error), true};
 }
 
-void putOffFetchAfterFailedSignIn(const AccountRecord& record) {
-    const double delta = storedFetchDelta(record).value_or(kDefaultDelayAfterFailedSignIn);
-    __VeltoIDDBSetAccountValues(
-        record.accountName(),
-        {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(platform::now() + delta)},
-         {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-          Value::real(delayAfterFailedSignIn(delta))}},
-        Notify::No);
-}
-
 /// One question for the certificate that a token stands for.
 class Fetch {
   public:
@@ -266,29 +260,57 @@ class Fetch {
 
     bool run(VeltoIDAuthenticationSessionInfo& session, const String& encDsId, std::optional<Error>* held) {
         CertificateAnswer answer;
-        if (!__VeltoIDSessionDoFetchCSRResult(session, encDsId, token_, options_, &answer, held)) {
-            VELTOID_LOG_FROM("__VeltoIDDoFetchCertificateForVeltoID", kNotice,
-                             "Failed while fetching result for certificate token ", token_,
-                             ", error=", *held ? Value(**held) : Value(), " so discarding it.");
-            __VeltoIDSessionDoCompleteCertificate(session, encDsId, token_, options_, nullptr);
-            return false;
-        }
+        const bool isAnswered =
+            __VeltoIDSessionDoFetchCSRResult(session, encDsId, token_, options_, &answer, held);
+        bool succeeded = false;
         {
             const OwnershipLock ownership;
-            if (!isStillAsked()) return !recordOfSame(record_) ? failWith(held, overtakenError()) : true;
-            if (!updateAccountWithCertificateResult(ownership, record_.accountName(), encDsId, answer, held))
-                return false;
+            const auto now = recordIfStillAsked();
+            if (!now) return recordOfSame(record_) || failWith(held, overtakenError());
+            if (!isAnswered) return applyFailure(ownership, *now, *held);
+            succeeded =
+                updateAccountWithCertificateResult(ownership, record_.accountName(), encDsId, answer, held);
         }
-        if (isPending(*answer.result)) return failWith(held, VELTOID_ERROR(identity_error::kNotYet));
-        __VeltoIDSessionDoCompleteCertificate(session, encDsId, token_, options_, nullptr);
-        return true;
+        if (!answer.result) return false;
+        if (isPending(*answer.result))
+            return succeeded && failWith(held, VELTOID_ERROR(identity_error::kNotYet));
+        // A server may forget the token then: not before the certificate is stored.
+        if (isDecided(*answer.result) && !recordIfStillAsked())
+            __VeltoIDSessionDoCompleteCertificate(session, encDsId, token_, options_, nullptr);
+        return succeeded;
+    }
+
+    void putOff() const {
+        const OwnershipLock ownership;
+        if (const auto now = recordIfStillAsked()) putOffFetch(now->accountName(), pendingDelay({}, *now));
     }
 
   private:
-    /// Whether the account still waits for what the token stands for. Under the ownership lock.
-    bool isStillAsked() const {
-        const auto now = recordOfSame(record_);
-        return now && now->certificateToken() == token_;
+    /// The record while the account waits for what the token stands for.
+    std::optional<AccountRecord> recordIfStillAsked() const {
+        auto now = recordOfSame(record_);
+        return now && now->certificateToken() == token_ ? now : std::nullopt;
+    }
+
+    bool applyFailure(const OwnershipLock& ownership, const AccountRecord& record,
+                      const std::optional<Error>& error) {
+        const bool isFault = isOtherFault(error);
+        const double since = record.certificateTokenFaultsSince().value_or(platform::now());
+        const bool isOver = isFault && platform::now() - since >= kVeltoIDTokenFaultPatience;
+        VELTOID_LOG_FROM("__VeltoIDDoFetchCertificateForVeltoID", kNotice,
+                         "Failed while fetching result for certificate token ", token_,
+                         ", error=", error ? Value(*error) : Value(),
+                         isOver ? " so discarding it." : " so asking again later.");
+        if (isOver) {
+            endPendingRequest(ownership, record.accountName());
+        } else {
+            if (isFault)
+                __VeltoIDDBSetAccountValue(record.accountName(),
+                                           kVeltoIDAccountCertificateTokenFaultsSinceKey, Value::date(since),
+                                           Notify::No);
+            putOffFetch(record.accountName(), pendingDelay({}, record));
+        }
+        return false;
     }
 
     const AccountRecord& record_;
@@ -319,6 +341,33 @@ bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, co
     return request->succeeded || failWith(error, *request->error);
 }
 
+Dictionary noPendingRequest() {
+    Dictionary values;
+    for (const std::string_view key :
+         {kVeltoIDAccountCertificateTokenKey, kVeltoIDAccountCertificateTokenExpirationKey,
+          kVeltoIDAccountCertificateNextCertificateFetchDateKey,
+          kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
+          kVeltoIDAccountCertificateTokenFaultsSinceKey})
+        values.set(key, Value::null());
+    return values;
+}
+
+void endPendingRequest(const OwnershipLock& ownership, const String& accountName) {
+    __VeltoIDDBSetAccountValues(accountName, noPendingRequest());
+    discardPendingKey(ownership, accountName);
+}
+
+bool endExpiredRequest(const String& accountName) {
+    const OwnershipLock ownership;
+    const AccountRecord record = accountRecordOf(accountName);
+    const auto expiration = record.certificateTokenExpiration();
+    if (!record.certificateToken() || !expiration || *expiration >= platform::now()) return false;
+    VELTOID_LOG(kNotice, "The certificate token of ", accountName, " has expired at ",
+                Value::date(*expiration), "; a new request is made.");
+    endPendingRequest(ownership, accountName);
+    return !accountRecordOf(accountName).certificateToken();
+}
+
 bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,
                                            const Dictionary& options, ErrorOut error) {
     std::optional<Error> held;
@@ -336,11 +385,12 @@ bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime 
     String encDsId;
     const Session session =
         __VeltoIDSessionDoCreateSession(accountName, password, options, &encDsId, nullptr, &held);
+    Fetch fetch(record, options);
     if (!session) {
-        putOffFetchAfterFailedSignIn(record);
+        fetch.putOff();
         return true;
     }
-    return Fetch(record, options).run(*session, encDsId, &held) || fail(accountName, password, held, error);
+    return fetch.run(*session, encDsId, &held) || fail(accountName, password, held, error);
 }
 
 void __VeltoIDDoFetchEncodedDSIDForVeltoID(const String& accountName, const Dictionary& options,

@@ -5,8 +5,14 @@
 // What the record says while that goes on: "CertificateToken" with "CertificateTokenExpiration" (a request is
 // pending), "NextCertificateFetchDate" and "NextCertificateFetchDelta" (when to ask next, and how far to put
 // it off then), "CSRGenerationDate" and "CSRGenerationInterval" (when the next request may be made),
-// "CertificatePrivateKeyReference" (the pending request's key). When the certificate is there, all of it
-// goes, and the entry has certificate, intermediate certificate and key.
+// "CertificatePrivateKeyReference" (the pending request's key), "CertificateTokenFaultsSince" (since when the
+// server answers with faults). When the certificate is there, all of it goes, and the entry has certificate,
+// intermediate certificate and key.
+//
+// A question that is not answered is asked again, later each time. The server is told that an answer has
+// arrived ("downloadCertComplete") when it is stored or was a refusal, not before: a server may forget the
+// token then. A token that is over (expired, or unknown to the server for half an hour: a fault does not say
+// which it is) is given up without a word, and the next check makes a new request.
 //
 // All operations run on the caller's queue and block while the server is asked (up to 5 seconds a call). The
 // server is asked without any lock: an answer that comes when the account has been forgotten, or has begun
@@ -25,6 +31,8 @@ inline constexpr double kVeltoIDCertificateTokenLifetime = 1'209'600;
 inline constexpr double kVeltoIDCSRGenerationInterval = 3'600;
 /// After a refusal, or a token that expired, until the next request.
 inline constexpr double kVeltoIDCSRRetryDelay = 3'600;
+/// How long a server may answer with faults until its token counts as unknown to it.
+inline constexpr double kVeltoIDTokenFaultPatience = 1'800;
 
 /// Longer tokens are refused: they would be stored and logged.
 inline constexpr size_t kMaxCertificateTokenBytes = size_t{16} << 10U;
@@ -48,16 +56,28 @@ bool __VeltoIDDoCreateCertificateRequestForVeltoID(const String& accountName, co
 /// Applies what the server says of the request: by "CertStatus" the certificate is stored, the next fetch put
 /// off, the token given up, or, for anything else, the token kept until it expires. True when the certificate
 /// is stored or the request pending. Otherwise -100, and nothing of a request that was given up stays in the
-/// keychain. A certificate for another key than the pending one counts as a refusal.
+/// keychain. A certificate for another key than the pending one counts as a refusal, and so does a renewal
+/// without a readable one: the account keeps what it has. What cannot be stored now, and has a token, is
+/// asked for again. "Expires" of the entry is no later than the certificate's own end.
 bool updateAccountWithCertificateResult(const OwnershipLock& ownership, const String& accountName,
                                         const String& encDsId, const CertificateAnswer& answer,
                                         ErrorOut error = nullptr);
 
+/// What a pending request has in the record, beside its key, each as Null.
+Dictionary noPendingRequest();
+
+/// Gives up the account's pending request: its token, its key, and what was planned for it.
+void endPendingRequest(const OwnershipLock& ownership, const String& accountName);
+
+/// The same for a request whose token has expired. True when there was one.
+bool endExpiredRequest(const String& accountName);
+
 enum class FetchTime { WhenDue, AtOnce };
 
 /// Asks the server for the certificate that the account's token stands for, and applies the answer. True also
-/// when there is no token, or no session could be opened (the next fetch is put off). Error 99: it is not
-/// time yet (with "NextCertificateFetchDate"), or the request is still pending.
+/// when there is no token any more, or no session could be opened. Without an answer the next fetch is put
+/// off for longer and longer. Error 99: it is not time yet (with "NextCertificateFetchDate"), or the request
+/// is still pending.
 bool __VeltoIDDoFetchCertificateForVeltoID(const String& accountName, FetchTime time,
                                            const Dictionary& options, ErrorOut error = nullptr);
 

@@ -7,12 +7,15 @@
 
 #include "Certificates/CertificateRequest.h"
 #include "TestSupport/CertificateFixture.h"
+#include "TestSupport/SQLiteEdit.h"
 #include "TestSupport/SideBySide.h"
 #include "VeltoIDAuthenticationImpl/AccountActions.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 #include "VeltoIDAuthenticationImpl/ForgetAccount.h"
 #include "VeltoIDAuthenticationImpl/ItemOwnership.h"
+#include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/RequestRateLimit.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDKeychainItems/KeychainPasswords.h"
@@ -222,14 +225,13 @@ TEST_F(IssuanceTest, TheServersEncDsIdBecomesTheAccounts) {
     EXPECT_TRUE(__VeltoIDDoCreateCertificateRequestForVeltoID(kName, {}, &encDsId));
     EXPECT_EQ(encDsId, "d1");
     EXPECT_EQ(record()["encDsId"], Value("d1"));
-    EXPECT_EQ(in(kFetchDate), 0) << "no delay, no wait";
-    EXPECT_EQ(stored({kDelta}), kNone);
+    EXPECT_EQ(delays(), Delays(30, 30)) << "no delay given";
 }
 
 TEST_F(IssuanceTest, TheDelayOfATokenIsBelievedUpToADay) {
-    const std::pair<Value, double> cases[] = {{number(0), 0},          {number(86'400), 86'400},
-                                              {number(100'000), 15},   {number(-5), 15},
-                                              {Value::real(0.5), 0.5}, {Value::real(1e300), 15}};
+    const std::pair<Value, double> cases[] = {{number(0), 30},        {number(86'400), 86'400},
+                                              {number(100'000), 15},  {number(-5), 15},
+                                              {Value::real(0.5), 15}, {Value::real(1e300), 15}};
     for (const auto& [delay, stored] : cases) {
         clock_.advanceBy(3'600);
         answerRequests({{kToken, "t"}, {"Delay", delay}});
@@ -259,17 +261,18 @@ TEST_F(IssuanceTest, EveryAnswerIsAppliedToTheAccount) {
         {"pending", pending, number(60), none, false, true, 60, 90, 90, {}},
         {"pending, noted delay", pending, none, number(100), false, true, 100, 150, 150, {}},
         {"pending, no delay", pending, none, none, false, true, 60, 90, 90, {}},
-        {"pending, at once", pending, number(0), none, false, true, 1, 0, 0, {}},
-        {"pending, in the past", pending, number(-8), none, false, true, 1, -12, -12, {}},
-        {"pending, a long day", pending, number(90'000), none, false, true, 90'000, 86'400, 172'800, {}},
-        {"pending, a year", pending, number(31'536'000), none, false, true, 604'800, 86'400, 172'800, {}},
-        {"pending, no number", pending, Value::real(nan), number(10), false, true, 10, 15, 15, {}},
+        {"pending, at once", pending, number(0), none, false, true, 60, 90, 90, {}},
+        {"pending, in the past", pending, number(-8), none, false, true, 60, 90, 90, {}},
+        {"pending, very soon", pending, number(2), none, false, true, 15, 22.5, 22.5, {}},
+        {"pending, a long day", pending, number(90'000), none, false, true, 90'000, 90'000, 90'000, {}},
+        {"pending, a year", pending, number(31'536'000), none, false, true, 604'800, 604'800, 604'800, {}},
+        {"pending, no number", pending, Value::real(nan), number(10), false, true, 15, 22.5, 22.5, {}},
         {"pending, for ever", pending, Value::real(infinity), none, false, true, 60, 90, 90, {}},
         {"failed", status("FAILED"), number(60), number(1), false, false, {}, 0, 0, 3600},
         {"unknown", status("?"), none, number(100), false, false, 100, 150, 150, 7},
-        {"unknown, no delta", noText, none, none, false, false, 86'400, 86'400, 172'800, 7},
-        {"unknown, no result", {}, none, number(0), false, false, 86'400, 86'400, 172'800, 7},
-        {"long", status("cert_issued"), none, number(90'000), false, false, 90'000, 86'400, 172'800, 7},
+        {"unknown, no delta", noText, none, none, false, false, 60, 90, 90, 7},
+        {"unknown, no result", {}, none, number(0), false, false, 15, 22.5, 22.5, 7},
+        {"long", status("cert_issued"), none, number(90'000), false, false, 3'600, 3'600, 3'600, 7},
         {"expired", status("?"), none, number(100), true, false, {}, 0, 0, 3600},
         {"failed, expired", status("FAILED"), none, none, true, false, {}, 0, 0, 3600},
         {"pending, expired", pending, none, none, true, true, 60, 90, 90, {}},
@@ -305,20 +308,24 @@ TEST_F(IssuanceTest, EveryAnswerIsAppliedToTheAccount) {
 TEST_F(IssuanceTest, WhatIsMissingInACertificateResultIsMissingInTheEntry) {
     requested_ = platform::generateRSAKeyPair(2048)->publicKey;
     const Value usual = date(75 * kDay);
+    const Value given = date(100 * kDay);
     const Value end = Value::date(253'402'300'799);
-    const Value nearEnd = date(0.75 * (253'402'300'799 - now()));
-    const std::tuple<const char*, Dictionary, bool, bool, Value> cases[] = {
-        {"nothing", {}, true, true, usual},
-        {"no certificate", {{"Certificate", kGone}}, false, true, usual},
-        {"no DER", {{"Certificate", pemOf({'A', 'B', 'C'})}}, false, true, usual},
-        {"no text", {{"Certificate", number(1)}}, false, true, usual},
-        {"no intermediate", {{"IntermediateCertificate", kGone}}, true, false, usual},
-        {"no PEM", {{"IntermediateCertificate", "hello"}}, true, false, usual},
-        {"no expiry", {{"Expires", kGone}}, true, true, {}},
-        {"expired", {{"Expires", date(-1)}}, true, true, {}},
-        {"for ever", {{"Expires", end}}, true, true, nearEnd},
+    // Of the certificate itself.
+    const Value itsEnd = Value::date(4'070'908'800);
+    const Value nearItsEnd = date(0.75 * (4'070'908'800 - now()));
+    const std::tuple<const char*, Dictionary, bool, bool, Value, Value> cases[] = {
+        {"nothing", {}, true, true, given, usual},
+        {"no certificate", {{"Certificate", kGone}}, false, true, given, usual},
+        {"no DER", {{"Certificate", pemOf({'A', 'B', 'C'})}}, false, true, given, usual},
+        {"no text", {{"Certificate", number(1)}}, false, true, given, usual},
+        {"no intermediate", {{"IntermediateCertificate", kGone}}, true, false, given, usual},
+        {"no PEM", {{"IntermediateCertificate", "hello"}}, true, false, given, usual},
+        {"no expiry", {{"Expires", kGone}}, true, true, itsEnd, nearItsEnd},
+        {"an expiry in words", {{"Expires", "soon"}}, true, true, itsEnd, nearItsEnd},
+        {"expired", {{"Expires", date(-1)}}, true, true, date(-1), {}},
+        {"for ever", {{"Expires", end}}, true, true, itsEnd, nearItsEnd},
     };
-    for (const auto& [what, changes, hasCertificate, hasIntermediate, renewal] : cases) {
+    for (const auto& [what, changes, hasCertificate, hasIntermediate, expires, renewal] : cases) {
         SCOPED_TRACE(what);
         __VeltoIDDBRemoveCertificateInfo("d1");
         Dictionary result = issued();
@@ -329,12 +336,46 @@ TEST_F(IssuanceTest, WhatIsMissingInACertificateResultIsMissingInTheEntry) {
         const Dictionary entry = certificateEntry();
         EXPECT_EQ(entry.contains(kCertificateReference), hasCertificate);
         EXPECT_EQ(entry.contains(kIntermediateReference), hasIntermediate);
+        EXPECT_EQ(entry["Expires"], expires);
         EXPECT_EQ(entry[kRenewal], renewal);
     }
 }
 
+TEST_F(IssuanceTest, ARenewalWithoutAReadableCertificateLeavesWhatThereIs) {
+    issueAtOnce();
+    ASSERT_TRUE(request());
+    const CertificateEntry before = certificateEntryOf("d1");
+    for (const Value& certificate : {kGone, Value(pemOf({'A', 'B', 'C'})), number(1)}) {
+        SCOPED_TRACE(testing::PrintToString(certificate));
+        clock_.advanceBy(3'600);
+        onRequest([&] { return Dictionary{{"dsCert", issued({{"Certificate", certificate}})}}; });
+        EXPECT_FALSE(request());
+        EXPECT_EQ(takeCode(), -100);
+        EXPECT_EQ(certificateEntryOf("d1").values(), before.values());
+        EXPECT_EQ(copyAllKeysFromKeychain(), Array{before.privateKeyReference()});
+        EXPECT_TRUE(copyCertificateFromKeychainGivenPersistentRef(before.reference(), nullptr));
+        EXPECT_EQ(in(kGenerated), 3'600) << "it counts as a refusal";
+    }
+}
+
+TEST_F(IssuanceTest, ACertificateEndsByItsOwnAccountWhateverItsEntrySays) {
+    requested_ = platform::generateRSAKeyPair(2048)->publicKey;
+    const std::string ended = pemOf(intermediate_.issue(requested_, {.notAfter = "20250101000000Z"}));
+    ASSERT_TRUE(update(issued({{"Certificate", ended}})));
+    setInEntry({{kKeyReference, storedKey()}});
+    for (const Value& expires : {certificateEntry()["Expires"], date(1e7), kGone, Value("never")}) {
+        SCOPED_TRACE(testing::PrintToString(expires));
+        // As an agent before this one has stored it; in the last case the evaluation is put off.
+        setInEntry({{"Expires", expires}, {kValidated, date()}, {"Dirty", kGone}});
+        if (expires.isString()) setInEntry({{kValidated, date(-1e8)}, {kAttempt, date()}});
+        EXPECT_FALSE(hasValidCertificateEntry("d1"));
+        EXPECT_EQ(checkAccountAndDetermineNextAction(kName, {}), AccountState::CertificateExpired);
+        EXPECT_LE(copyNextActionDateForAccount(kName), now());
+    }
+}
+
 TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
-    constexpr const char* kAsked = "authenticate fetchCert downloadCertComplete";
+    constexpr const char* kAsked = "authenticate fetchCert";
     const std::tuple<const char*, Dictionary, const char*, int64_t> cases[] = {
         {"no token", {{kToken, kGone}}, "", 0},
         {"no text", {{kToken, number(1)}}, "", 0},
@@ -346,7 +387,7 @@ TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
     server_.fault("fetchCert", -7);
     for (const auto& [what, values, methods, code] : cases) {
         SCOPED_TRACE(what);
-        setValues({{kToken, "t1"}, {kFetchDate, kGone}});
+        setValues({{kToken, "t1"}, {kFetchDate, kGone}, {kDelta, kGone}});
         setValues(values);
         EXPECT_EQ(fetch(), code == 0);
         EXPECT_EQ(takeCode(), code);
@@ -355,16 +396,99 @@ TEST_F(IssuanceTest, ATokenIsFetchedWhenItsTimeHasCome) {
     EXPECT_EQ(record()[kToken], Value("t1")) << "until the next result or its expiry";
     EXPECT_EQ(log_.count("Failed while fetching result for certificate token t1, error="), 3);
 
+    clock_.advanceBy(60);
+    setValue(kDelta, kGone);
     server_.refuse("authenticate", 503);
     EXPECT_TRUE(fetch()) << "a server that cannot be reached is tried later";
-    EXPECT_EQ(delays(), Delays(10, 15));
-    clock_.advanceBy(10);
+    EXPECT_EQ(delays(), Delays(60, 90));
+    clock_.advanceBy(60);
     EXPECT_TRUE(fetch());
-    EXPECT_EQ(delays(), Delays(15, 22.5));
+    EXPECT_EQ(delays(), Delays(90, 135));
     setValue(kDelta, number(200'000));
     EXPECT_TRUE(fetch(FetchTime::AtOnce));
-    EXPECT_EQ(in(kFetchDate), 200'000);
-    EXPECT_TRUE(record().number(kDelta) >= kDay && record().number(kDelta) <= 2 * kDay);
+    EXPECT_EQ(delays(), Delays(3'600, 3'600));
+}
+
+TEST_F(IssuanceTest, WhatIsNotAnsweredIsAskedAgain) {
+    const std::pair<const char*, platform::FakeHTTPAnswer> cases[] = {
+        {"no answer in time", {.delaySeconds = platform::kForever}},
+        {"closed", {.status = 0, .error = platform::HTTPError{52, "empty"}}},
+        {"a status", {503}},
+        {"rubbish", {200, "<html>"}},
+        {"no result", {200, "<methodResponse><params><param><value>hello</value></param></params>"}},
+    };
+    for (const auto& [what, answer] : cases) {
+        SCOPED_TRACE(what);
+        answerRequests({{kToken, "t1"}, {"Delay", number(20)}});
+        ASSERT_TRUE(request());
+        server_.set("fetchCert", answer);
+        (void)server_.take();
+        for (const double delta : {30.0, 45.0}) {
+            clock_.advanceBy(in(kFetchDate));
+            platform::WorkQueue("fetch").async([&] { EXPECT_FALSE(fetch()); });
+            clock_.advanceBy(5);
+            EXPECT_EQ(takeCode(), -100);
+            EXPECT_EQ(server_.takeMethods(), "authenticate fetchCert");
+            EXPECT_EQ(record()[kDelta], Value::real(delta));
+            EXPECT_GT(in(kFetchDate), 0);
+        }
+        EXPECT_EQ(keys(), 1U);
+        server_.answer("fetchCert", Dictionary{{"dsCert", issued()}});
+        EXPECT_TRUE(fetch(FetchTime::AtOnce));
+        EXPECT_EQ(server_.takeMethods(), "authenticate fetchCert downloadCertComplete");
+        EXPECT_TRUE(hasValidCertificateEntry("d1"));
+        EXPECT_TRUE(__VeltoIDForgetVeltoID(kName, {}));
+        createAccount("d1");
+    }
+}
+
+TEST_F(IssuanceTest, ATokenThatIsOverMakesRoomForANewRequest) {
+    answerRequests({{kToken, "t1"}, {"Delay", number(20)}});
+    ASSERT_TRUE(request());
+    server_.fault("fetchCert", -9);
+    (void)server_.take();
+    const double begin = now();
+    while (record()[kToken] == Value("t1")) {
+        ASSERT_LT(now(), begin + 2 * 3'600) << "a token that the server does not know";
+        clock_.advanceBy(std::max(in(kFetchDate), 0.0));
+        checkAccount({kName, record()});
+    }
+    EXPECT_GE(now(), begin + 1'800) << "a fault may pass";
+    EXPECT_EQ(server_.takeMethods().find("downloadCertComplete"), std::string::npos);
+    EXPECT_EQ(keys(), 0U);
+    EXPECT_EQ(stored({kToken, kTokenExpiration, kFetchDate, kDelta, "CertificateTokenFaultsSince"}), kNone);
+    answerRequests({{kToken, "t2"}});
+    clock_.advanceBy(3'600);
+    checkAccount({kName, record()});
+    EXPECT_EQ(record()[kToken], Value("t2"));
+
+    setValues({{kTokenExpiration, date(100)}, {kFetchDate, date(3'600)}, {"Dirty", kGone}});
+    EXPECT_EQ(copyNextActionDateForAccount(kName), now() + 100);
+    clock_.advanceBy(3'600);
+    answerRequests({{kToken, "t3"}});
+    (void)server_.take();
+    checkAccount({kName, record()});
+    EXPECT_EQ(record()[kToken], Value("t3"));
+    EXPECT_EQ(server_.takeMethods().find("fetchCert"), std::string::npos);
+    EXPECT_EQ(keys(), 1U);
+}
+
+TEST_F(IssuanceTest, ACertificateThatCannotBeStoredNowIsFetchedAgain) {
+    answerRequests({{kToken, "t1"}});
+    ASSERT_TRUE(request());
+    server_.answer("fetchCert", Dictionary{{"dsCert", issued()}});
+    (void)server_.take();
+    platform::editDatabase("keychain.db",
+                           "CREATE TRIGGER busy BEFORE INSERT ON items BEGIN "
+                           "SELECT RAISE(ABORT, 'not now'); END");
+    EXPECT_FALSE(fetch(FetchTime::AtOnce));
+    EXPECT_EQ(server_.takeMethods(), "authenticate fetchCert");
+    EXPECT_FALSE(__VeltoIDDBCopyCertificateInfo("d1", nullptr));
+    platform::editDatabase("keychain.db", "DROP TRIGGER busy");
+    EXPECT_TRUE(fetch(FetchTime::AtOnce));
+    EXPECT_EQ(server_.takeMethods(), "authenticate fetchCert downloadCertComplete");
+    EXPECT_EQ(keys(), 1U);
+    EXPECT_EQ(certificates(), 2U);
 }
 
 TEST_F(IssuanceTest, AnEncDsIdIsLearntByASignInNowAndThen) {

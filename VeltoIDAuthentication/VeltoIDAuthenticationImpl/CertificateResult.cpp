@@ -1,5 +1,7 @@
 // Applying what the server says of a certificate request.
 
+#include <algorithm>
+
 #include "Certificates/CertificateRequest.h"
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
@@ -33,7 +35,8 @@ class CertificateResult {
           encDsId_(encDsId),
           result_(answer.result.value_or(Dictionary())),
           delay_(answer.delay),
-          record_(accountRecordOf(accountName)) {}
+          record_(accountRecordOf(accountName)),
+          certificate_(certificateFromPEM(result_.string(kVeltoIDCertificateCertificateKey))) {}
 
     bool apply() {
         const String status = result_.string(kVeltoIDCertificateStatusKey);
@@ -44,87 +47,98 @@ class CertificateResult {
 
   private:
     bool applyIssued() {
+        const CertificateEntry before = certificateEntryOf(encDsId_);
+        if (!certificate_ && before.reference()) {
+            VELTOID_LOG_FROM(kFunction, kError, "The server's renewal for ", accountName_,
+                             " holds no certificate that can be read; the old one stays.");
+            return giveUp();
+        }
         VELTOID_LOG_FROM(kFunction, kNotice, "VeltoIDAuth: Adding certificate for ", accountName_, ", ",
                          encDsId_,
                          " to keychain, serial#=", result_.string(kVeltoIDCertificateSerialNumberKey));
-        const CertificateEntry before = certificateEntryOf(encDsId_);
-        const bool stored = storeEntry() && storeCertificate() && storeIntermediate() && movePrivateKey();
-        if (stored) {
-            planRenewal();
-            discardReplacedItems(ownership_, before, certificateEntryOf(encDsId_));
-        } else {
+        Dictionary values = valuesOfEntry();
+        const bool stored = storeItems(values) && storeEntry(before, values);
+        const CertificateEntry made(encDsId_, values);
+        // What nothing refers to goes: the old items, or the new ones. The key is still the pending
+        // request's.
+        discardReplacedItems(ownership_, stored ? before : withoutKey(made), certificateEntryOf(encDsId_));
+        if (stored)
+            endRequest();
+        else if (token())
+            putOffFetch(accountName_, pendingDelay({}, record_));
+        else
             discardPendingKey(ownership_, accountName_);
-        }
-        endRequest();
         return stored;
     }
 
-    /// Everything that the server said of the certificate stays with it.
-    bool storeEntry() {
-        if (!__VeltoIDDBSetCertificateInfo(encDsId_, result_)) return false;
-        for (const auto& [key, value] : result_) setInEntry(key, value);
-        setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now() - 1));
-        return true;
+    static CertificateEntry withoutKey(const CertificateEntry& entry) {
+        Dictionary values = entry.values();
+        values.remove(kVeltoIDCertificatePrivateKeyPersistentReferenceKey);
+        return {entry.encDsId(), values};
     }
 
-    bool setInEntry(const String& key, const Value& value) {
-        return __VeltoIDDBSetCertificateValue(encDsId_, key, value);
-    }
-
-    /// Text that is no certificate is passed over: the entry tells that there is none.
-    bool storeCertificate() {
-        const auto certificate = certificateFromPEM(result_.string(kVeltoIDCertificateCertificateKey));
-        if (!certificate) return true;
-        Data reference;
-        if (!addCertificateToKeychain(*certificate, certificateLabelForAccount(accountName_), &reference))
-            return false;
-        setInEntry(kVeltoIDCertificateCertificatePersistentReferenceKey, reference);
-        platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
-        return true;
-    }
-
-    bool storeIntermediate() {
-        const auto certificate =
-            certificateFromPEM(result_.string(kVeltoIDCertificateIntermediateCertificateKey));
-        Data reference;
-        if (certificate && (copyPersistentRefForCertificate(*certificate, &reference) ||
-                            addCertificateToKeychain(*certificate, kIntermediateLabel, &reference)))
-            setInEntry(kVeltoIDCertificateIntermediateCertificateReferenceKey, reference);
-        return true;
-    }
-
-    bool movePrivateKey() {
-        const Data reference = record_.pendingKeyReference();
-        if (!reference) return true;
-        return setInEntry(kVeltoIDCertificatePrivateKeyPersistentReferenceKey, reference) &&
-               setInRecord({{kVeltoIDCertificatePrivateKeyPersistentReferenceKey, Value::null()}},
-                           Notify::No);
-    }
-
-    void planRenewal() {
-        const auto expires = result_.date(kVeltoIDCertificateExpirationDateKey);
-        if (expires && *expires > platform::now())
-            setInEntry(kVeltoIDCertificateNextRenewalAttemptDateKey,
+    /// Everything that the server said of the certificate stays with it, and nothing of an older one.
+    Dictionary valuesOfEntry() const {
+        Dictionary values = {{kVeltoIDCertificateSerialNumberKey, Value::null()},
+                             {kVeltoIDCertificateExpirationDateKey, Value::null()},
+                             {kVeltoIDCertificateNextRenewalAttemptDateKey, Value::null()}};
+        for (const auto& [key, value] : result_) values.set(key, value);
+        values.set(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now() - 1));
+        values.set(kVeltoIDCertificatePrivateKeyPersistentReferenceKey, record_.pendingKeyReference());
+        auto expires = result_.date(kVeltoIDCertificateExpirationDateKey);
+        if (certificate_)
+            expires = std::min(expires.value_or(certificate_->notAfter), certificate_->notAfter);
+        if (!expires) return values;
+        values.set(kVeltoIDCertificateExpirationDateKey, Value::date(*expires));
+        if (*expires > platform::now())
+            values.set(kVeltoIDCertificateNextRenewalAttemptDateKey,
                        Value::date(platform::now() + kRenewalShare * (*expires - platform::now())));
+        return values;
+    }
+
+    /// The certificates go into the keychain, their references into the values. Text that is no certificate
+    /// is passed over: the entry tells that there is none.
+    bool storeItems(Dictionary& values) const {
+        Data reference;
+        if (certificate_) {
+            if (!addCertificateToKeychain(*certificate_, certificateLabelForAccount(accountName_),
+                                          &reference))
+                return false;
+            values.set(kVeltoIDCertificateCertificatePersistentReferenceKey, reference);
+        }
+        const auto intermediate =
+            certificateFromPEM(result_.string(kVeltoIDCertificateIntermediateCertificateKey));
+        if (intermediate && (copyPersistentRefForCertificate(*intermediate, &reference) ||
+                             addCertificateToKeychain(*intermediate, kIntermediateLabel, &reference)))
+            values.set(kVeltoIDCertificateIntermediateCertificateReferenceKey, reference);
+        return true;
+    }
+
+    /// At once, so that the entry never has the certificate of one request and the key of another.
+    bool storeEntry(const CertificateEntry& before, const Dictionary& values) const {
+        if ((!before.exists() && !__VeltoIDDBSetCertificateInfo(encDsId_, Dictionary())) ||
+            !__VeltoIDDBSetCertificateValues(encDsId_, values))
+            return false;
+        if (certificate_) platform::Notifications::shared().post(kVeltoIDAccountChangeNotification);
+        return true;
     }
 
     /// Last, so that an agent that is killed before asks for the certificate once more.
     void endRequest() {
-        setInRecord({{kVeltoIDAccountCertificateTokenKey, Value::null()},
-                     {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
-                     {kVeltoIDAccountCSRGenerationDateKey, Value::null()},
-                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
-                     {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
-                     {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()},
-                     {kVeltoIDAccountCSRCreationDateKey, Value::null()}});
+        Dictionary values = noPendingRequest();
+        for (const std::string_view key :
+             {kVeltoIDCertificatePrivateKeyPersistentReferenceKey, kVeltoIDAccountCSRGenerationDateKey,
+              kVeltoIDAccountCSRGenerationIntervalKey, kVeltoIDAccountCSRCreationDateKey})
+            values.set(key, Value::null());
+        setInRecord(values);
     }
 
     /// Without its key the certificate would be of no use.
     bool isForAnotherKey() const {
-        const auto certificate = certificateFromPEM(result_.string(kVeltoIDCertificateCertificateKey));
         Key pending;
-        if (!certificate || !copyKeyFromKeychainGivenPersistentRef(record_.pendingKeyReference(), &pending) ||
-            pending.publicPart == Data(certificate->publicKey))
+        if (!certificate_ ||
+            !copyKeyFromKeychainGivenPersistentRef(record_.pendingKeyReference(), &pending) ||
+            pending.publicPart == Data(certificate_->publicKey))
             return false;
         VELTOID_LOG_FROM(kFunction, kError, "The certificate that the server issued for ", accountName_,
                          " is not for the key that was requested.");
@@ -132,18 +146,11 @@ class CertificateResult {
     }
 
     bool applyPending() {
-        const double delay = pendingDelay(delay_, record_);
-        const double nextFetch = platform::now() + (delay > 0 ? delay : 1);
-        const bool stored =
-            setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}});
-        if (stored)
-            setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-                          Value::real(delayAfterPending(delay))}},
-                        Notify::No);
+        const bool stored = putOffFetch(accountName_, pendingDelay(delay_, record_));
         setInRecord({{kVeltoIDAccountCSRGenerationDateKey, Value::null()},
-                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()}},
+                     {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
+                     {kVeltoIDAccountCertificateTokenFaultsSinceKey, Value::null()}},
                     Notify::No);
-        requestRelaunch(nextFetch);
         return stored;
     }
 
@@ -166,29 +173,17 @@ class CertificateResult {
         if (expiration && *expiration < platform::now()) {
             dropRequest();
         } else {
-            putOffFetch();
+            putOffFetch(accountName_, pendingDelay({}, record_));
         }
         return false;
     }
 
-    /// Back to no request at all; the next one is made in an hour at the earliest.
+    /// Back to no request at all; the next one is made in an hour.
     void dropRequest() {
         setInRecord(
-            {{kVeltoIDAccountCertificateTokenKey, Value::null()},
-             {kVeltoIDAccountCertificateTokenExpirationKey, Value::null()},
-             {kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now() + kVeltoIDCSRRetryDelay)},
-             {kVeltoIDAccountCSRGenerationIntervalKey, Value::null()},
-             {kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::null()},
-             {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::null()}});
-        discardPendingKey(ownership_, accountName_);
-    }
-
-    void putOffFetch() {
-        const double delta = storedFetchDelta(record_).value_or(kMaxPollingDelay);
-        setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchDateKey,
-                      Value::date(platform::now() + (delta > 0 ? delta : kMaxPollingDelay))},
-                     {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey,
-                      Value::real(delta > 0 ? delayAfterPending(delta) : randomPollingDelay())}});
+            {{kVeltoIDAccountCSRGenerationDateKey, Value::date(platform::now() + kVeltoIDCSRRetryDelay)},
+             {kVeltoIDAccountCSRGenerationIntervalKey, Value::real(0)}});
+        endPendingRequest(ownership_, accountName_);
     }
 
     String token() const { return record_.certificateToken(); }
@@ -208,6 +203,7 @@ class CertificateResult {
     const Dictionary result_;
     const Value& delay_;
     const AccountRecord record_;
+    const std::optional<platform::Certificate> certificate_;
 };
 
 }  // namespace

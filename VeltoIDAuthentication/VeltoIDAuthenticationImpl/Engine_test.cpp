@@ -393,13 +393,15 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
             __VeltoIDDBSetCertificateValue("d1", kValidated, date(), Notify::No);
             for (const auto& [key, value] : *entry)
                 __VeltoIDDBSetCertificateValue("d1", key, value, Notify::No);
+            __VeltoIDDBSetCertificateValue("d1", "Dirty", kGone, Notify::No);
         }
+        setValue("Dirty", {});
         EXPECT_EQ(copyNextActionDateForAccount(kName), now() + due);
     }
-    __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(100));
+    __VeltoIDDBSetMetaInfoValue(nullptr, "AccountValidationInterval", number(7200));
     setValue("ValidationDate", date(-30));
-    setValue(kNextCheck, date(1000));
-    EXPECT_EQ(copyNextActionDateForAccount(kName), now() + 70);
+    setValue(kNextCheck, date(10'000));
+    EXPECT_EQ(copyNextActionDateForAccount(kName), now() + 7170);
     EXPECT_EQ(copyNextActionDateForAccount("nobody"), std::nullopt);
     ASSERT_TRUE(__VeltoIDDBRemovePassword(kName));
     EXPECT_EQ(copyNextActionDateForAccount(kName), std::nullopt) << "without a password nothing can be done";

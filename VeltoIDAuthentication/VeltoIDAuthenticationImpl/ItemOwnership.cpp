@@ -11,6 +11,7 @@
 #include "Protocol/RecordKeys.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainKeys.h"
@@ -42,6 +43,7 @@ bool isReferredTo(const Data& reference) {
 /// The items are listed before the references: an item is stored together with its reference, so that one
 /// that is listed and has none by then is nobody's.
 void discardOrphans() {
+    if (!keychainIsOurs()) return;
     const struct {
         std::optional<Array> items;
         bool (*remove)(const Data& reference);
@@ -67,8 +69,8 @@ std::set<std::string> encDsIdsOfAccounts() {
     for (const Value& name : accountNames()) {
         const AccountRecord record = accountRecordOf(name.asString());
         if (const String encDsId = record.encDsId()) encDsIds.insert(encDsId.text());
-        const auto embargo = record.earliestConnection();
-        if (embargo && *embargo < platform::now())
+        if (record.values().contains(kVeltoIDAccountEarliestAllowedConnectionDateKey) &&
+            !record.embargoEnd(platform::now()))
             __VeltoIDDBSetAccountValue(name.asString(), kVeltoIDAccountEarliestAllowedConnectionDateKey,
                                        Value::null(), Notify::No);
     }

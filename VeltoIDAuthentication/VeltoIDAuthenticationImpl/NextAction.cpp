@@ -8,6 +8,7 @@
 #include "Values/DictionaryAccess.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
@@ -56,7 +57,10 @@ class Examination {
                              " doesn't have a password; no next action.");
             return PasswordInvalid;
         }
-        if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) return std::nullopt;
+        if (copyPasswordFromKeychainGivenPersistentRef(reference, nullptr)) {
+            noteKeychainInUse();
+            return std::nullopt;
+        }
         VELTOID_LOG_FROM(
             kFunction, kNotice, "checkAccount: Velto ID ", accountName_,
             " doesn't have a password or the password has been removed from the keychain; no next action.");
@@ -100,22 +104,35 @@ class Examination {
     }
 
     AccountState examineCertificate() {
+        takeCertificate();
         AccountState state = classify();
         if (triedRecently_) return withValidationRecord(state);
         if (state == Unknown) {
             askAboutCertificate();
             // The server's word counts at once.
+            const Data before = entry_.reference();
             __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
             if (entry_.isInvalid()) return CertificateRevoked;
+            if (entry_.reference() != before) takeCertificate();
         }
         if (static_cast<int>(state) < 0) return state;
-        std::optional<platform::Certificate> certificate;
-        if (!readItems(&certificate)) return NoCertificate;
-        if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate) : CertificateAssumedOK;
+        if (const auto missing = missingItems()) return *missing;
+        if (state == Unknown) state = networkAllowed_ ? evaluate(*certificate_) : CertificateAssumedOK;
         if (state != CertificateOK && state != CertificateAssumedOK) return state;
         return schedule().isDue(DueReason::Renewal) || schedule().isDue(DueReason::PreExpiry)
                    ? CertificateShouldBeRenewed
                    : withValidationRecord(state);
+    }
+
+    /// The certificate itself, as far as it can be had. Entries that an earlier agent has made may call it
+    /// good for longer than it is.
+    void takeCertificate() {
+        certificate_.reset();
+        copyCertificateFromKeychainGivenPersistentRef(entry_.reference(), &certificate_);
+        const auto expires = entry_.expires();
+        if (!certificate_ || (expires && *expires <= certificate_->notAfter)) return;
+        setInEntry(kVeltoIDCertificateExpirationDateKey, Value::date(certificate_->notAfter));
+        __VeltoIDDBCopyCertificateInfo(encDsId_, &entry_);
     }
 
     /// By the entry alone.
@@ -142,31 +159,38 @@ class Examination {
         __VeltoIDDBCopyVeltoIDAccount(accountName_, &record_);
     }
 
-    /// Whether certificate and private key can be had from the keychain.
-    bool readItems(std::optional<platform::Certificate>* certificate) const {
-        const bool hasCertificate = readCertificate(certificate);
-        return readPrivateKey() && hasCertificate;
+    /// Nothing when certificate and private key can be had from the keychain. What only cannot be read now is
+    /// no reason to ask for another certificate.
+    std::optional<AccountState> missingItems() const {
+        const ItemState certificate = certificateState();
+        const ItemState key = privateKeyState();
+        if (certificate == ItemState::Gone || key == ItemState::Gone) return NoCertificate;
+        const bool areReadable = certificate == ItemState::Readable && key == ItemState::Readable;
+        return areReadable ? std::nullopt : std::optional(Unknown);
     }
 
-    bool readCertificate(std::optional<platform::Certificate>* certificate) const {
+    ItemState certificateState() const {
+        if (certificate_) return ItemState::Readable;
         const Data reference = entry_.reference();
-        if (copyCertificateFromKeychainGivenPersistentRef(reference, certificate) && *certificate)
-            return true;
         VELTOID_LOG_FROM(kFunction, kNotice, "Failed trying to get certificate from keychain ",
                          reference ? "from persistent reference for veltoID " : "for veltoID ", accountName_,
                          reference ? logText(" certRef=", reference) : " because certRef=NULL");
-        return false;
+        // What can be read is no certificate.
+        const ItemState state = stateOfItem(platform::KeychainItemClass::Certificate, reference);
+        return state == ItemState::Readable ? ItemState::Gone : state;
     }
 
-    bool readPrivateKey() const {
+    ItemState privateKeyState() const {
         const Data reference = entry_.privateKeyReference();
         // That it can be unsealed says enough: reading a key costs as much as all the rest of a check.
-        if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return true;
+        if (copyKeyFromKeychainGivenPersistentRef(reference, nullptr)) return ItemState::Readable;
         VELTOID_LOG_FROM(
             kFunction, kNotice,
             "Failed trying to get private key from keychain from persistent reference for veltoID ",
             accountName_, reference ? logText(" certRef=", reference) : " privateKeyRef=NULL");
-        return false;
+        // It may have become readable since.
+        const ItemState state = stateOfItem(platform::KeychainItemClass::Key, reference);
+        return state == ItemState::Readable ? ItemState::Unreadable : state;
     }
 
     AccountState evaluate(const platform::Certificate& certificate) {
@@ -178,6 +202,7 @@ class Examination {
         if (!result) return Unknown;
         const AccountState state = stateOf(*result);
         setInEntry(kVeltoIDCertificateLastValidationAttemptDateKey, Value::date(platform::now()));
+        setInEntry(kVeltoIDDirtyKey, Value::boolean(false));
         if (state == CertificateOK || state == CertificateAssumedOK)
             setInEntry(kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(platform::now()));
         return state;
@@ -209,7 +234,7 @@ class Examination {
     }
 
     void setInEntry(std::string_view key, const Value& value) const {
-        __VeltoIDDBSetCertificateValue(encDsId_, key, value, Notify::No);
+        __VeltoIDDBSetCertificateValues(entry_, {{key, value}}, Notify::No);
     }
 
     const String& accountName_;
@@ -219,6 +244,7 @@ class Examination {
     bool triedRecently_ = false;
     AccountRecord record_;
     CertificateEntry entry_;
+    std::optional<platform::Certificate> certificate_;
     String encDsId_;
     Session session_;
 };

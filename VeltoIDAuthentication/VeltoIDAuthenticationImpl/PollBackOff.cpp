@@ -3,15 +3,19 @@
 #include <algorithm>
 #include <cmath>
 #include <cstring>
+#include <optional>
 
 #include "Platform/crypto/Crypto.h"
+#include "Platform/runtime/Clock.h"
+#include "Protocol/RecordKeys.h"
+#include "VeltoIDXMLServerCommunications/Invoke.h"
 
 namespace veltoid {
 namespace {
 
 constexpr double kBackOffFactor = 1.5;
+constexpr double kDefaultTokenDelay = 30;
 constexpr double kDefaultPendingDelay = 60;
-constexpr double kDelayForUnbelievableOnes = 15;
 
 std::optional<double> finite(std::optional<double> number) {
     return number && std::isfinite(*number) ? number : std::nullopt;
@@ -28,26 +32,29 @@ double randomPollingDelay() {
     return kMaxPollingDelay + kMaxPollingDelay * (number & kMaxStoredDelay) / kMaxStoredDelay;
 }
 
-double delayAfterPending(double delay) {
-    return delay < kMaxPollingDelay ? delay * kBackOffFactor : randomPollingDelay();
-}
-
-double delayAfterFailedSignIn(double delay) { return std::min(delay * kBackOffFactor, randomPollingDelay()); }
-
-std::optional<double> storedFetchDelta(const AccountRecord& record) {
-    return finite(record.nextCertificateFetchDelta());
-}
-
 double pendingDelay(const Value& delay, const AccountRecord& record) {
     const auto given = finite(delay.asDouble());
-    const double seconds = given ? *given : storedFetchDelta(record).value_or(kDefaultPendingDelay);
-    return std::min(seconds, kMaxFetchDelay);
+    if (given && *given > 0) return std::clamp(*given, kMinPollDelay, kMaxFetchDelay);
+    return std::clamp(finite(record.nextCertificateFetchDelta()).value_or(kDefaultPendingDelay), kMinPollDelay,
+                      kMaxOwnPollDelay);
 }
 
-std::optional<double> tokenDelay(const Value& delay) {
-    const auto seconds = delay.asDouble();
-    if (!seconds) return std::nullopt;
-    return *seconds >= 0 && *seconds <= kMaxPollingDelay ? *seconds : kDelayForUnbelievableOnes;
+double tokenDelay(const Value& delay) {
+    const auto given = delay.asDouble();
+    if (!given || *given == 0) return kDefaultTokenDelay;
+    return *given > 0 && *given <= kMaxPollingDelay ? std::max(*given, kMinPollDelay) : kMinPollDelay;
+}
+
+bool putOffFetch(const String& accountName, double delay) {
+    const double nextFetch = platform::now() + delay;
+    const double after =
+        delay < kMaxOwnPollDelay ? std::min(delay * kBackOffFactor, kMaxOwnPollDelay) : delay;
+    const bool stored = __VeltoIDDBSetAccountValues(
+        accountName,
+        {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)},
+         {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::real(after)}});
+    requestRelaunch(nextFetch);
+    return stored;
 }
 
 }  // namespace veltoid

@@ -1,14 +1,19 @@
 // How long to wait before a pending certificate is asked for again. All in seconds.
 #pragma once
 
-#include <optional>
-
 #include "Values/Value.h"
 #include "VeltoIDAuthenticationDB/AccountRecords.h"
 
 namespace veltoid {
 
-/// Up to here waits grow by half each time; from here on they are spread at random over the second day.
+/// A pending certificate is asked for at least so often, unless the server wants longer waits: its user waits
+/// for it.
+inline constexpr double kMaxOwnPollDelay = 3'600;
+
+/// The shortest wait, whatever the server says.
+inline constexpr double kMinPollDelay = 15;
+
+/// Waits that grow without end are spread at random over the second day from here on.
 inline constexpr double kMaxPollingDelay = 86'400;
 
 /// Longer waits than this, whether the server or a record asks for them, are not believed.
@@ -17,22 +22,16 @@ inline constexpr double kMaxFetchDelay = 604'800;
 /// A random delay between one and two days, so that devices that fail together do not come back together.
 double randomPollingDelay();
 
-/// The delay to store after a wait of `delay`.
-double delayAfterPending(double delay);
-
-/// The delay to store after a wait of `delay` whose fetch failed at the sign-in; at most
-/// randomPollingDelay().
-double delayAfterFailedSignIn(double delay);
-
-/// The record's "NextCertificateFetchDelta", if that is a finite number.
-std::optional<double> storedFetchDelta(const AccountRecord& record);
-
-/// How long the server wants to be left alone: what it says now (`delay`, absent or a Number), else what the
-/// record has noted, else a minute. What cannot be believed (infinite, longer than a week) is cut off.
+/// How long to wait before the certificate is asked for: what the server says now (`delay`, absent or a
+/// Number; kMinPollDelay at least, a week at most), else what the record has noted, else a minute.
 double pendingDelay(const Value& delay, const AccountRecord& record);
 
-/// The delay that a fresh token came with: none if the server gave none; 15 seconds for one that is negative,
-/// longer than a day or no number.
-std::optional<double> tokenDelay(const Value& delay);
+/// The delay that a fresh token came with: half a minute if the server gave none, kMinPollDelay for one that
+/// is shorter, or longer than a day.
+double tokenDelay(const Value& delay);
+
+/// Lets the next fetch of the account's pending certificate be made after `delay`, and one after that half as long
+/// again later, up to kMaxOwnPollDelay. False when that cannot be stored.
+bool putOffFetch(const String& accountName, double delay);
 
 }  // namespace veltoid

@@ -8,12 +8,12 @@ namespace veltoid {
 
 namespace {
 
-struct ItemState {
+struct State {
     std::atomic<bool> useKeychain{true};
     const platform::WorkQueue queue{"KeychainDispatchQueue"};
 };
 
-ItemState& state() { return platform::Lifetime::current().state<ItemState>(); }
+State& state() { return platform::Lifetime::current().state<State>(); }
 
 /// Whether what failed with that status may be had later: no reason to replace an item.
 bool mayPass(platform::KeychainStatus status) {
@@ -26,6 +26,16 @@ void setUseSystemKeychain(bool use) { state().useKeychain = use; }
 bool usesSystemKeychain() { return state().useKeychain; }
 
 platform::WorkQueue keychainQueue() { return state().queue; }
+
+ItemState keychainItemState(platform::KeychainItemClass itemClass, const Data& reference) {
+    if (!reference) return ItemState::Gone;
+    return keychainQueue().sync([&] {
+        const auto status = platform::keychain::copyMatchingData(
+            keychain_items::queryForReference(itemClass, reference), nullptr);
+        if (status == platform::kKeychainSuccess) return ItemState::Readable;
+        return mayPass(status) ? ItemState::Unreadable : ItemState::Gone;
+    });
+}
 
 namespace keychain_items {
 

@@ -28,6 +28,18 @@ bool usesSystemKeychain();
 /// The queue of all keychain operations.
 platform::WorkQueue keychainQueue();
 
+enum class ItemState {
+    Readable,
+    /// There is no such item, or it is damaged.
+    Gone,
+    /// It may be had later: the keychain is locked, or cannot be read now.
+    Unreadable,
+};
+
+/// The state of the item of that class and reference; gone without reference. Says nothing about whether the
+/// keychain is the one that the reference is from (VeltoIDAuthenticationDB/KeychainIdentity.h does).
+ItemState keychainItemState(platform::KeychainItemClass itemClass, const Data& reference);
+
 /// For the rooms' own sources: their callers use the operations of the other headers.
 namespace keychain_items {
 

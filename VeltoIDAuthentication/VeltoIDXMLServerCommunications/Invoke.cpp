@@ -20,6 +20,9 @@
 namespace veltoid {
 namespace {
 
+/// The shortest interval that is followed (seconds).
+constexpr int32_t kMinLaunchInterval = 15;
+
 ProcessHooks& hooks() { return platform::Lifetime::current().state<ProcessHooks>(); }
 
 String frameworkVersionText() {
@@ -43,10 +46,10 @@ void applyValidityDuration(VeltoIDAuthenticationSessionInfo& session, const Valu
 void applyRelaunch(const Dictionary& reply) {
     const int32_t interval = getInt32(&reply, wire::kNextLaunchInterval, 0);
     if (interval < 1) return;
-    const double date = platform::now() + interval;
+    const double date = platform::now() + std::max(interval, kMinLaunchInterval);
     VELTOID_LOG_FROM("xmlInvoke", kNotice, "Received 'NextLaunchTimeInterval' == ", interval,
                      " from server, so setting NextLaunchDate to ", Value::date(date));
-    requestRelaunch(date);
+    hooks().scheduleRequestedLaunch(date);
 }
 
 void applyFlushAndExit(const Dictionary& reply) {
@@ -113,7 +116,7 @@ Dictionary createCallParameters(const String& accountName, const String& session
 Dictionary recordValuesFromServer(const String& accountName, const Dictionary& values) {
     Dictionary taken = values;
     taken.remove(kVeltoIDAccountServerURLKey);
-    const Value name = values[kVeltoIDAccountNameKey];
+    const Value& name = values[kVeltoIDAccountNameKey];
     if (!taken.remove(kVeltoIDAccountNameKey)) return taken;
     taken.set(kVeltoIDAccountServerNameKey, name == Value(accountName) ? Value::null() : name);
     return taken;

@@ -19,9 +19,11 @@ inline constexpr int64_t kVeltoIDAuthProtocolVersion = 101;
 
 /// What the process does when a reply asks for it. Any queue.
 struct ProcessHooks {
-    /// Is running at the date (seconds since 1970).
+    /// Is running at the date (seconds since 1970), which something that is due asks for.
     std::function<void(double date)> scheduleRelaunch = [](double) {};
-    /// Ends, and does not return before that.
+    /// Is running at the date, which the server asks for.
+    std::function<void(double date)> scheduleRequestedLaunch = [](double) {};
+    /// Ends as soon as the work in hand is done; returns at once.
     std::function<void()> endProcess = [] {};
 };
 

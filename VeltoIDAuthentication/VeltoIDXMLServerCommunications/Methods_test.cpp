@@ -224,7 +224,8 @@ TEST_F(Methods, SendWhatTheyAreGiven) {
         EXPECT_EQ(working->fSessionID, "s1") << "not spoiled";
         EXPECT_EQ(counted(), before + (counter != nullptr ? 1 : 0));
     }
-    for (const auto& [stored, sent] : {std::pair(number(60), 60.0), std::pair(Value("60"), 1'209'600.0)}) {
+    for (const auto& [stored, sent] : {std::pair(number(60), 60.0), std::pair(Value("61.5"), 61.5),
+                                       std::pair(Value("60 s"), 1'209'600.0)}) {
         __VeltoIDDBSetMetaInfoValue(nullptr, "VeltoIDMetaDefaultCertificateRequestedLifetime", stored);
         EXPECT_TRUE(std::get<Call>(cases[1])(*session()));
         EXPECT_EQ(takeOwnParameters()["RequestedCertificateLifetimeInSeconds"], Value::real(sent));

@@ -10,6 +10,28 @@ constexpr int64_t kFaultInvalidAccount = -20101;
 constexpr int64_t kFaultInvalidPassword = -20283;
 constexpr int64_t kFaultAccountDisabled = -20209;
 
+constexpr std::string_view kFaultCodeKey = "XMLFaultCode";
+
+// Codes of the HTTPS client library: the server has accepted the connection and closed it without an answer.
+constexpr int64_t kEmptyAnswer = 52;
+constexpr int64_t kReceiveFailed = 56;
+
+/// What happened in a call that failed for none of the known reasons.
+std::string descriptionOf(const std::optional<Error>& error) {
+    if (!error) return kUnusableAnswer;
+    const auto withText = [](const std::string& what, const Error& cause) {
+        const String text = cause.userInfo.string(kErrorDescriptionKey);
+        return text ? what + ": " + text.text() : what;
+    };
+    if (error->domain == kXMLErrorDomain)
+        return withText("The server answered with the fault " + std::to_string(error->code), *error);
+    const Error* cause = error->userInfo[kErrorUnderlyingErrorKey].asError();
+    if (cause == nullptr) return withText("The server did not answer, or not with success", *error);
+    if (cause->code == kEmptyAnswer || cause->code == kReceiveFailed)
+        return withText("The server closed the connection without an answer", *cause);
+    return withText("The server cannot be reached", *cause);
+}
+
 bool isIdentityError(const std::optional<Error>& error, int64_t code) {
     return error && error->domain.view() == kIdentityErrorDomain && error->code == code;
 }
@@ -44,7 +66,7 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
     if (error) {
         userInfo.set(kErrorUnderlyingErrorKey, *error);
         if (error->domain.view() == kXMLErrorDomain) {
-            userInfo.set("XMLFaultCode", Value::int64(error->code));
+            userInfo.set(kFaultCodeKey, Value::int64(error->code));
             if (error->code == kFaultInvalidAccount || error->code == kFaultInvalidPassword) {
                 code = identity_error::kInvalidAccountOrPassword;
                 texts.failureReason = "The Velto ID account or password are incorrect.";
@@ -56,6 +78,7 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
             }
         }
     }
+    if (code == identity_error::kUnknown) texts.description = descriptionOf(error);
     Error translated = makeError(code, texts, userInfo, __func__, __FILE_NAME__, __LINE__);
     judgeRefusal(accountName, passwordHash, translated);
     return translated;
@@ -64,6 +87,10 @@ Error copyAndHandleXMLErrorResponse(const String& accountName, const String& pas
 bool refusesPassword(const std::optional<Error>& error) {
     return isIdentityError(error, identity_error::kInvalidAccountOrPassword) ||
            isIdentityError(error, identity_error::kAccountLogonDisabled);
+}
+
+bool isOtherFault(const std::optional<Error>& error) {
+    return isIdentityError(error, identity_error::kUnknown) && error->userInfo.contains(kFaultCodeKey);
 }
 
 void handleServerError(const String& accountName, const String& sentPasswordHash,

@@ -1,5 +1,6 @@
 #include "VeltoIDXMLServerCommunications/SignIn.h"
 
+#include <algorithm>
 #include <atomic>
 #include <string>
 
@@ -26,14 +27,13 @@ constexpr const char* kOperation = "__VeltoIDSessionDoCreateSession";
 constexpr std::string_view kClientOutOfDate =
     "The client on this machine is out of date and can not talk with the Velto ID server.";
 
-struct Server {
-    std::atomic<int32_t> version{0};
-};
-
-std::atomic<int32_t>& serverVersion() { return platform::Lifetime::current().state<Server>().version; }
-
 Error signInError(int64_t code, int line, const ErrorTexts& texts = {}) {
     return makeError(code, texts, {}, kOperation, __FILE_NAME__, line);
+}
+
+/// Beside the words for people, what it comes from.
+Error outOfDateError(const char* description, int line) {
+    return signInError(identity_error::kServerProtocol, line, {kClientOutOfDate, description, {}});
 }
 
 /// One sign-in; everything runs on the account's queue.
@@ -62,11 +62,11 @@ class SignIn {
         if (session_) {
             encDsId_ = session_->fEncDsId;
             count(kVeltoIDXMLSessionReusedCountKey);
+            count(kVeltoIDMetaSuccessfulConnectionCountKey);
         } else {
             if (mayConnect()) signInAnew(url);
-            if (!session_ && !held_) held_ = identityError(identity_error::kSignInFailed);
+            keepBooks();
         }
-        keepBooks();
     }
 
     void count(std::string_view counter) {
@@ -93,11 +93,10 @@ class SignIn {
                              "Not connecting to VeltoID authentication server because clientTooOld = true is "
                              "set for this account ",
                              accountName_, ".");
-            held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
+            held_ = outOfDateError("The server has refused this version of the agent", __LINE__);
             return false;
         }
-        const auto earliest = record_.earliestConnection();
-        if (earliest && *earliest > now_) {
+        if (const auto earliest = record_.embargoEnd(now_)) {
             VELTOID_LOG_FROM(kOperation, kNotice,
                              "Not connecting to VeltoID authentication server because there is an "
                              "earliest-allowed-connection-date set for this account ",
@@ -114,8 +113,9 @@ class SignIn {
         if (url) {
             authenticate(url, parameters);
         } else {
-            held_ = copyAndHandleXMLErrorResponse(accountName_, passwordHash_, std::nullopt,
-                                                  signInError(identity_error::kUnknown, __LINE__));
+            held_ = copyAndHandleXMLErrorResponse(
+                accountName_, passwordHash_, std::nullopt,
+                signInError(identity_error::kUnknown, __LINE__, {{}, "The server has no address", {}}));
         }
         if (session_) return;
         VELTOID_LOG_FROM(kOperation, kNotice, "Didn't succeed with .authenticate, and error is ",
@@ -157,18 +157,23 @@ class SignIn {
             return;
         }
         count(kVeltoIDXMLAuthenticateCountKey);
-        if (reply) applyReply(*reply, *session);
+        if (reply)
+            applyReply(*reply, *session);
+        else
+            held_ = signInError(identity_error::kSignInFailed, __LINE__, {{}, kUnusableAnswer, {}});
         if (session->fEncDsId) session_ = std::move(session);
     }
 
     void applyReply(const Dictionary& reply, VeltoIDAuthenticationSessionInfo& session) {
-        serverVersion() = getInt32(&reply, wire::kVersion, 0);
+        __VeltoIDDBSetMetaInfoValue(nullptr, kVeltoIDMetaServerVersionKey,
+                                    Value::int32(getInt32(&reply, wire::kVersion, 0)));
         applyEmbargo(reply);
         if (reply.boolean(wire::kClientTooOld).value_or(false)) {
             __VeltoIDDBSetAccountValues(accountName_, {{kVeltoIDAccountClientTooOldKey, Value::boolean(true)},
                                                        {kVeltoIDAccountClientTooOldVersionKey,
                                                         Value::real(kVeltoIDDBAccessorVersion)}});
-            held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
+            held_ = signInError(identity_error::kServerCannotBeReached, __LINE__,
+                                {{}, "The server refuses this version of the agent", {}});
         }
         encDsId_ = reply.string(wire::kEncDsId);
         if (oldEncDsId_ && encDsId_ && oldEncDsId_ != encDsId_) disableCertificatesOfChangedAccount();
@@ -177,7 +182,8 @@ class SignIn {
             session.fEncDsId = encDsId_;
             applyCertificateState(reply);
         } else if (!held_) {
-            held_ = signInError(identity_error::kServerProtocol, __LINE__, {kClientOutOfDate, {}, {}});
+            held_ =
+                outOfDateError("The server's answer to the sign-in lacks the account's encDsId", __LINE__);
         }
         applyRecordIdentifier(reply.string(wire::kRecordIdentifier));
         result_ = reply;
@@ -189,7 +195,7 @@ class SignIn {
         if (!date && seconds >= 1) date = now_ + seconds;
         if (!date || *date <= now_) return;
         __VeltoIDDBSetAccountValue(accountName_, kVeltoIDAccountEarliestAllowedConnectionDateKey,
-                                   Value::date(*date));
+                                   Value::date(std::min(*date, now_ + kMaxEmbargo)));
         held_ = signInError(identity_error::kServerCannotBeReached, __LINE__);
     }
 
@@ -209,7 +215,8 @@ class SignIn {
         if (oldCertificate_.encDsId() != encDsId_) return;
         if (reply.boolean(wire::kCertificateIsValid).value_or(false)) {
             __VeltoIDDBSetCertificateValues(
-                oldCertificate_, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now_)}});
+                oldCertificate_, {{kVeltoIDCertificateLastSuccessfulValidationDateKey, Value::date(now_)}},
+                Notify::No);
         } else if (reply.contains(wire::kCertificateIsValid) ||
                    reply.contains(wire::kCertificateNoLongerValid)) {
             __VeltoIDDBSetCertificateValues(oldCertificate_,
@@ -265,6 +272,10 @@ Session __VeltoIDSessionDoCreateSession(const String& accountName, const String&
     });
 }
 
-int32_t __VeltoIDSessionGetServerVersion() { return serverVersion(); }
+int32_t __VeltoIDSessionGetServerVersion() {
+    const Value version =
+        __VeltoIDDBCopyMetaInfoValue(nullptr, {}, kVeltoIDMetaServerVersionKey, Value::Kind::Number);
+    return static_cast<int32_t>(version.asInt64().value_or(0));
+}
 
 }  // namespace veltoid

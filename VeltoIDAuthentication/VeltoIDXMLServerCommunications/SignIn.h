@@ -23,7 +23,8 @@ Session __VeltoIDSessionDoCreateSession(const String& accountName, const String&
                                         std::optional<Dictionary>* result = nullptr,
                                         ErrorOut error = nullptr);
 
-/// The protocol version of the last authenticate reply; 0 before any. Any thread.
+/// The protocol version of the last authenticate reply, of an earlier agent too; 0 before any. Any queue but
+/// the database's.
 int32_t __VeltoIDSessionGetServerVersion();
 
 }  // namespace veltoid

@@ -147,7 +147,7 @@ TEST_F(SignInTest, ReusesASessionWhileItIsValid) {
     clock_.advanceBy(50);
     EXPECT_EQ(callsOf({}), 0U);
     EXPECT_EQ(counts(), "1 1 1 2 0 ");
-    EXPECT_EQ(meta("LastConnectAttempt"), date()) << "a reused session counts as a connection";
+    EXPECT_EQ(meta("LastConnectAttempt"), date(-50)) << "a reused session is no contact with the server";
     EXPECT_EQ(callsOf({{"ServerURL", "https://other.example"}}), 1U);
     EXPECT_EQ(callsOf({}, "another password"), 1U);
     setTooOld(kOn);
@@ -205,7 +205,8 @@ TEST_F(SignInTest, AnEmbargoInTheReplyHoldsForTheNextSignIn) {
         {"until a past date", {{kBefore, date(-50)}}, {}},
         {"the date comes first", {{kBefore, date(50)}, {kFor, Value::int32(5)}}, 50},
         {"a past date, too", {{kBefore, date(-50)}, {kFor, Value::int32(5)}}, {}},
-        {"a date in words", {{kBefore, "2100-01-01T00:00:00Z"}}, 4'102'444'800 - now()},
+        {"a date in words", {{kBefore, "2025-06-20T00:00:00Z"}}, 1'750'377'600 - now()},
+        {"a date that nobody believes", {{kBefore, "2100-01-01T00:00:00Z"}}, 14 * kDay},
         {"no date", {{kBefore, "soon"}, {kFor, Value::int32(5)}}, 5},
     };
     createAccount();
@@ -246,19 +247,38 @@ TEST_F(SignInTest, Failures) {
     const auto faults = [this](int64_t code) {
         return [this, code] { server_.fault("authenticate", code); };
     };
-    const std::tuple<const char*, std::function<void()>, int64_t, bool> cases[] = {
-        {"wrong password", faults(-20101), -101, false},
-        {"disabled", faults(-20209), -102, false},
-        {"another fault", faults(-5), -100, true},
-        {"no server", [this] { server_.refuse("authenticate", 503); }, -100, true},
-        {"no encDsId", answers(Dictionary{{"dsSession", "s"}}), -104, true},
-        {"an encDsId of the wrong kind", answers(Dictionary{{"encDsId", Value::int32(1)}}), -104, true},
-        {"no encDsId under embargo", answers(Dictionary{{"DoNotConnectForX", Value::int32(9)}}), -103, true},
-        {"no encDsId, too old", answers(Dictionary{{"ClientTooOld", kOn}}), -103, true},
-        {"no dictionary", answers("hello"), 1, true},
+    const auto yields = [this](const platform::FakeHTTPAnswer& answer) {
+        return [this, answer] { server_.set("authenticate", answer); };
+    };
+    constexpr const char* kRefuses = "The server refuses this version of the agent";
+    constexpr const char* kNoIdentifier = "The server's answer to the sign-in lacks the account's encDsId";
+    constexpr const char* kNoAnswer = "The server's answer cannot be understood";
+    const struct {
+        const char* what;
+        std::function<void()> prepare;
+        int64_t code;
+        bool keepsPassword;
+        const char* text;
+    } cases[] = {
+        {"wrong password", faults(-20101), -101, false, "The Velto ID account or password are incorrect."},
+        {"disabled", faults(-20209), -102, false, "This Velto ID has been disabled for security reasons."},
+        {"another fault", faults(-5), -100, true, "The server answered with the fault -5: because"},
+        {"a status", yields({503}), -100, true, "The server did not answer, or not with success"},
+        {"no server", yields({.status = 0, .error = platform::HTTPError{7, "no connection"}}), -100, true,
+         "The server cannot be reached: no connection"},
+        {"closed", yields({.status = 0, .error = platform::HTTPError{52, "empty"}}), -100, true,
+         "The server closed the connection without an answer: empty"},
+        {"no encDsId", answers(Dictionary{{"dsSession", "s"}}), -104, true, kNoIdentifier},
+        {"an encDsId of the wrong kind", answers(Dictionary{{"encDsId", Value::int32(1)}}), -104, true,
+         kNoIdentifier},
+        {"no encDsId under embargo", answers(Dictionary{{"DoNotConnectForX", Value::int32(9)}}), -103, true,
+         "The server has asked not to be contacted for a while"},
+        {"no encDsId, too old", answers(Dictionary{{"ClientTooOld", kOn}}), -103, true, kRefuses},
+        {"no dictionary", answers("hello"), 1, true, kNoAnswer},
+        {"no XML-RPC", yields({200, "<html>Welcome"}), 1, true, kNoAnswer},
     };
     int64_t failures = 0;
-    for (const auto& [what, prepare, code, keepsPassword] : cases) {
+    for (const auto& [what, prepare, code, keepsPassword, text] : cases) {
         SCOPED_TRACE(what);
         createAccount();
         setValue(kEmbargo, {});
@@ -270,11 +290,16 @@ TEST_F(SignInTest, Failures) {
         EXPECT_EQ(outcome.result, std::nullopt);
         EXPECT_EQ(outcome.code(), code);
         EXPECT_EQ(outcome.error->domain, kIdentityErrorDomain);
+        const Dictionary& said = outcome.error->userInfo;
+        EXPECT_EQ(said[code == -101 || code == -102 ? kErrorFailureReasonKey : kErrorDescriptionKey],
+                  Value(text));
+        EXPECT_TRUE(said.contains("function") && said.contains("file") && said.contains("line"));
+        EXPECT_NE(log_.lines().back().text.find(text), std::string::npos);
         EXPECT_EQ(hasPassword(), keepsPassword);
         EXPECT_EQ(count("VeltoIDMetaUnsuccessfulConnectionCount"), ++failures);
     }
-    EXPECT_EQ(counts(), "9 5 0 0 9 ");
-    EXPECT_EQ(log_.count("Didn't succeed with .authenticate, and error is "), 9);
+    EXPECT_EQ(counts(), "12 6 0 0 12 ");
+    EXPECT_EQ(log_.count("Didn't succeed with .authenticate, and error is "), 12);
     EXPECT_TRUE(meta("LastConnectAttempt").isAbsent());
     EXPECT_FALSE(log_.contains(kPassword));
 }

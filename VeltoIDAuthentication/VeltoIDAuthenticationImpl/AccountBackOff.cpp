@@ -1,0 +1,77 @@
+#include "VeltoIDAuthenticationImpl/AccountBackOff.h"
+
+#include <algorithm>
+
+#include "Platform/runtime/Clock.h"
+#include "VeltoIDAuthenticationDB/CertificateEntries.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
+
+namespace veltoid {
+namespace {
+
+constexpr double kGrowth = 1.5;
+
+/// What a pass may change for the better.
+Array stateOf(const AccountRecord& record) {
+    const CertificateEntry entry = certificateEntryOf(record.encDsId());
+    return {record.encDsId(),
+            record.certificateToken(),
+            record.passwordReference(),
+            entry.reference(),
+            entry.serialNumber(),
+            Value::boolean(entry.isInvalid()),
+            record.validationRecordIdentifier()};
+}
+
+Dictionary putOff(double from, double backOff) {
+    return {{kVeltoIDAccountNextCheckDateKey, Value::date(from + backOff)},
+            {kVeltoIDAccountCheckBackOffKey, Value::real(backOff)}};
+}
+
+double grown(double backOff, const AccountRecord& record) {
+    const double most = hasValidCertificateEntry(record.encDsId()) ? kMaxBackOff : kMaxBackOffInNeed;
+    return std::clamp(backOff * kGrowth, kFirstBackOff, most);
+}
+
+bool isStillPutOffAsExamined(const AccountRecord& stored, const AccountRecord& examined) {
+    return stored.nextCheck() == examined.nextCheck();
+}
+
+}  // namespace
+
+std::optional<double> putOffUntil(const AccountRecord& record) {
+    const auto date = record.nextCheck();
+    // A later date was stored while the clock was wrong.
+    return date && *date <= platform::now() + kMaxBackOff ? date : std::nullopt;
+}
+
+void noteNews(const String& accountName) {
+    __VeltoIDDBSetAccountValues(accountName, {{kVeltoIDAccountNextCheckDateKey, Value::null()},
+                                              {kVeltoIDAccountCheckBackOffKey, Value::null()}});
+}
+
+AccountPass::AccountPass(const AccountRecord& record)
+    : accountName_(record.accountName()),
+      backOff_(putOffUntil(record) ? record.checkBackOff().value_or(0) : 0),
+      begun_(platform::now()),
+      stateBefore_(stateOf(record)) {
+    Dictionary values = putOff(begun_, grown(backOff_, record));
+    values.set(kVeltoIDDirtyKey, Value::null());
+    __VeltoIDDBSetAccountValues(accountName_, values, Notify::No);
+}
+
+void AccountPass::end() const {
+    const AccountRecord record = accountRecordOf(accountName_);
+    const double now = platform::now();
+    const auto next = AccountSchedule(record, certificateEntryOf(record.encDsId()), {}).nextReason();
+    const bool isInNeed = !record.encDsId() || (next && *next <= now);
+    const bool isOneStepOn = backOff_ == 0 && stateOf(record) != stateBefore_;
+    Dictionary values = {{kVeltoIDAccountNextCheckDateKey, Value::null()},
+                         {kVeltoIDAccountCheckBackOffKey, Value::null()}};
+    if (isInNeed) values = putOff(now, isOneStepOn ? kFollowUpDelay : grown(backOff_, record));
+    values.set(kVeltoIDDirtyKey, Value::null());
+    const AccountRecord begun(accountName_, putOff(begun_, grown(backOff_, record)));
+    setAccountValuesIf(isStillPutOffAsExamined, begun, values, Notify::No);
+}
+
+}  // namespace veltoid
