@@ -95,8 +95,8 @@ class ManyClients(unittest.TestCase):
             self.assertIsNone(agent.poll())
             self.assertLess(load.memory[1] - load.memory[0], MOST_GROWTH)
             succeeded = load.total("succeeded")
-            # There may have been no moment with an account that had a certificate.
-            failed = {name for name in load.total("answered") if not succeeded[name]} - {"certificate"}
+            # There may have been no moment with an account that had a certificate, and who waits for one is replaced.
+            failed = {name for name in load.total("answered") if not succeeded[name]} - {"certificate", "waiting add"}
             self.assertGreaterEqual(failed, NEVER_SUCCEED)
             if not SANITIZED:
                 self.assertEqual(failed, NEVER_SUCCEED)

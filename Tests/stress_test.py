@@ -28,7 +28,7 @@ CLIENTS = 8
 MOST_REQUESTS = 8  # of a client in a burst
 PATIENCE = 120
 # The agent's own look at its accounts, which comes ten seconds after its start, belongs to the quarrel as well.
-KILLS_BEGIN, KILL_SHARE = 0.6, 0.3
+KILLS_BEGIN, KILL_SHARE = 0.6, 0.5
 
 PASSWORDS = {ACCOUNT: PASSWORD, OTHER_ACCOUNT: OTHER_PASSWORD, "kim@example.com": "a third one"}
 REFUSALS = {-20101: WRONG_PASSWORD, -20283: WRONG_PASSWORD, -20209: DISABLED}
