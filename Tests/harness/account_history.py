@@ -140,11 +140,7 @@ class History:
             return
         if add.code() != UNKNOWN_ACCOUNT:
             yield "an add cannot fail so"
-        if not any(one.overlaps(add) and one.may_remove(add.name) for one in self.requests):
-            yield "nobody has removed it meanwhile"
-        # The agent tells the two apart by whether there is another account by then.
-        if "replaced" in str(add.reply):
-            if not any(self.may_be_there(name, add) for name in self.names if name != add.name):
-                yield "there is no other account"
-        elif any(self.is_there(name, add) for name in self.names):
-            yield "there is another account"
+        replaced = "replaced by another account" in str(add.reply)
+        if not any(one.overlaps(add) and one.may_remove(add.name) and (one.name != add.name) == replaced
+                   for one in self.requests):
+            yield "nobody has removed it so meanwhile"

@@ -17,8 +17,8 @@ inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
 /// The longest that the account check puts an account off (seconds).
 inline constexpr double kMaxBackOff = 14'400;
 
-/// The date (seconds since 1970) before which the account check leaves the account alone (AccountBackOff.h); none
-/// when it does not.
+/// The date (seconds since 1970) before which the account check leaves the account alone (AccountBackOff.h);
+/// none when it does not.
 std::optional<double> putOffUntil(const AccountRecord& record);
 
 enum class DueReason {

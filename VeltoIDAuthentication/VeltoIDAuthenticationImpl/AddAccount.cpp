@@ -1,6 +1,8 @@
 #include "VeltoIDAuthenticationImpl/AddAccount.h"
 
 #include <algorithm>
+#include <set>
+#include <string>
 
 #include "Logging/Describe.h"
 #include "Logging/Log.h"
@@ -95,10 +97,22 @@ AddedAccount addAnew(const String& accountName, const String& hashedPassword, co
     return added;
 }
 
+/// The names whose accounts were replaced by another one, until they are added again. Guarded by the
+/// ownership lock.
+struct ReplacedAccounts {
+    std::set<std::string> names;
+};
+
+std::set<std::string>& replacedNames(const OwnershipLock& /*ownership*/) {
+    return platform::Lifetime::current().state<ReplacedAccounts>().names;
+}
+
+bool isStored(const String& accountName) { return __VeltoIDDBCopyVeltoIDAccount(accountName, nullptr); }
+
 /// Whether the account is still there; -108 with the reason when not.
-bool isStored(const String& accountName, ErrorOut error) {
-    if (__VeltoIDDBCopyVeltoIDAccount(accountName, nullptr)) return true;
-    const bool isReplaced = !accountNames().empty();
+bool isStillStored(const OwnershipLock& ownership, const String& accountName, ErrorOut error) {
+    if (isStored(accountName)) return true;
+    const bool isReplaced = replacedNames(ownership).contains(accountName.text());
     return failWith(
         error, makeError(identity_error::kUnknownAccount,
                          {isReplaced ? "replaced by another account" : "forgotten meanwhile", {}, {}}, {},
@@ -108,10 +122,11 @@ bool isStored(const String& accountName, ErrorOut error) {
 /// The agent keeps one account.
 bool forgetOtherAccounts(const OwnershipLock& ownership, const String& added, ErrorOut error) {
     const String addedInLowerCase = lowerCased(added);
-    for (const Value& name : accountNames())
-        if (lowerCased(name.asString()) != addedInLowerCase &&
-            !forgetAccount(ownership, name.asString(), {}, error))
-            return false;
+    for (const Value& name : accountNames()) {
+        if (lowerCased(name.asString()) == addedInLowerCase) continue;
+        if (!forgetAccount(ownership, name.asString(), {}, error)) return false;
+        replacedNames(ownership).insert(name.asString().text());
+    }
     return true;
 }
 
@@ -127,7 +142,7 @@ bool waitForCertificate(const String& accountName, double duration, const Adding
     const auto& lifetime = platform::Lifetime::current();
     const double deadline = platform::now() + std::min(duration, kMaxCertificateWait);
     while (platform::now() <= deadline && !lifetime.isEnding() && client.isWaiting() &&
-           isStored(accountName, nullptr)) {
+           isStored(accountName)) {
         switch (checkAccountAndDetermineNextAction(accountName, {})) {
             case NoEncodedDSID:
             case PasswordInaccessibleInKeychain:
@@ -161,19 +176,21 @@ bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPasswo
 bool addOnlyAccount(const String& accountName, const String& hashedPassword, const Dictionary& options,
                     const AddingClient& client, AddedAccount* added, ErrorOut error) {
     AddedAccount outcome;
+    if (accountName) replacedNames(OwnershipLock()).erase(accountName.text());
     const bool isAdded = __VeltoIDDoAddVeltoID(accountName, hashedPassword, options, &outcome, error);
     __VeltoIDDBIncrementMetaInfoCounter(nullptr, options, kVeltoIDAddVeltoIDCountKey, 1);
     if (!isAdded) return false;
     __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountLastValidationDateKey, Value::null());
     client.wakeAccountCheck();
     auto decision = std::make_shared<const OwnershipLock>();
-    bool succeeds = isStored(accountName, error) && forgetOtherAccounts(*decision, accountName, error);
+    bool succeeds =
+        isStillStored(*decision, accountName, error) && forgetOtherAccounts(*decision, accountName, error);
     const double wait = getDouble(&options, option::kCertificateWait, 0);
     if (succeeds && wait > 0) {
         decision.reset();
         succeeds = waitForCertificate(accountName, wait, client);
         decision = std::make_shared<const OwnershipLock>();
-        succeeds = isStored(accountName, error) && succeeds;
+        succeeds = isStillStored(*decision, accountName, error) && succeeds;
         outcome = storedAccount(accountName, nullptr);
     } else if (!succeeds) {
         outcome = {};
