@@ -18,6 +18,7 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountBackOff.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -209,7 +210,8 @@ bool applyValidationRecord(const AccountRecord& before, const Dictionary& answer
         if (nextCheck) {
             values.set(kVeltoIDAccountValidationRecordIdentifierKey, identifier);
             values.set(kVeltoIDAccountValidationRecordDataKey, data);
-            values.set(kVeltoIDAccountValidationRecordNextCheckDateKey, Value::date(*nextCheck));
+            values.set(kVeltoIDAccountValidationRecordNextCheckDateKey,
+                       Value::date(std::min(*nextCheck, platform::now() + kMaxRecordCheckInterval)));
         }
     }
     return bothPresentAndDifferent(before.validationRecordIdentifier(), identifier);

@@ -122,7 +122,7 @@ AccountSchedule::Date AccountSchedule::signIn() const {
 
 AccountSchedule::Date AccountSchedule::validation() const {
     if (record_.isValidationForced()) return rightNow();
-    if (const auto next = record_.nextValidation()) return at(next);
+    if (const auto next = record_.nextValidation()) return isFar(*next) ? rightNow() : at(next);
     // While a certificate is pending, the examination does not look at how old the information is.
     if (record_.certificateToken()) return std::nullopt;
     const auto validated = record_.lastValidation();
@@ -161,6 +161,7 @@ AccountSchedule::Date AccountSchedule::certificateValidation() const {
     const auto validated = entry_.lastSuccessfulValidation();
     if (!validated || *validated > now_ || entry_.isDirty()) return rightNow();
     const double old = *validated + validationInterval(kOfCertificate);
+    if (entry_.lastValidationAttempt() > now_) return at(old);
     const auto attempt = after(entry_.lastValidationAttempt(), kValidationAttemptSpacing);
     return attempt && attempt->date >= old ? attempt : at(old);
 }
@@ -173,7 +174,7 @@ bool AccountSchedule::isCertificateValidationPutOff() const {
 
 AccountSchedule::Date AccountSchedule::validationRecord() const {
     if (__VeltoIDSessionGetServerVersion() < kVeltoIDFirstVersionWithValidationRecords) return std::nullopt;
-    if (const auto next = record_.validationRecordNextCheck()) return at(next);
+    if (const auto next = record_.validationRecordNextCheck()) return isFar(*next) ? rightNow() : at(next);
     const auto validAsOf = record_.validationRecordValidAsOf();
     if (record_.validationRecordData().size() == 0 || !validAsOf || now_ < *validAsOf - kRecordDateTolerance)
         return rightNow();

@@ -14,6 +14,9 @@ namespace veltoid {
 /// Servers of this version and later give out validation records.
 inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
 
+/// A validation record is looked at again after this time at the latest (seconds).
+inline constexpr double kMaxRecordCheckInterval = 2'592'000;
+
 /// The longest that the account check puts an account off (seconds).
 inline constexpr double kMaxBackOff = 14'400;
 
@@ -77,6 +80,8 @@ class AccountSchedule {
     static Date at(std::optional<double> date);
     static Date after(std::optional<double> date, double offset = 0);
     Date rightNow() const { return Due{now_, false}; }
+    /// Whether a date lies further ahead than any that is stored here: the clock was wrong then.
+    bool isFar(double date) const { return date > now_ + kMaxRecordCheckInterval; }
 
     Date due(DueReason reason) const;
     Date signIn() const;

@@ -46,7 +46,8 @@ std::optional<double> requestsHeldUntil(const AccountRecord& record) {
 std::optional<double> nextRequestDate(const AccountRecord& record) {
     std::optional<double> next = requestsHeldUntil(record);
     const auto generated = record.requestGeneration();
-    if (!generated) return next;
+    // As above.
+    if (!generated || *generated > platform::now() + kMaxGenerationInterval) return next;
     return std::max(*generated + generationInterval(record), next.value_or(*generated));
 }
 

@@ -368,6 +368,15 @@ TEST_F(SignInTest, AnotherValidationRecordIsFetchedAgain) {
     }
 }
 
+TEST_F(SignInTest, TheServersVersionIsKnownAfterARestart) {
+    createAccount();
+    signInWith({{"encDsId", "d1"}, {"Version", Value::int32(101)}});
+    __VeltoIDDBSynchronize();
+    platform::TestLifetime::restart();
+    __VeltoIDDBSetUsePreferences(true);
+    EXPECT_EQ(__VeltoIDSessionGetServerVersion(), 101);
+}
+
 TEST_F(SignInTest, SignInsOfOneAccountDoNotOverlapAndThoseOfOthersDo) {
     server_.answer("authenticate", Dictionary{{"encDsId", "d1"}, {"dsSessionValidityDuration", number(100)}});
     for (const char* name : {"even", "odd"}) __VeltoIDDBCreateVeltoIDAccount(name, kPassword, nullptr);
