@@ -40,8 +40,10 @@ double readIdleExit() {
     double seconds = 0;
     const auto [end, error] = std::from_chars(number.data(), number.data() + number.size(), seconds);
     if (error == std::errc() && end == number.data() + number.size() && std::isfinite(seconds) &&
-        seconds >= 0)
-        return seconds > 0 ? seconds : platform::kForever;
+        seconds >= 0) {
+        if (seconds == 0) seconds = platform::kForever;
+        return seconds;
+    }
     VELTOID_LOG_FROM("idleExitSeconds", kError, kIdleExitVariable, " is not a number of seconds; using ",
                      kDefaultIdleExit, ".");
     return kDefaultIdleExit;

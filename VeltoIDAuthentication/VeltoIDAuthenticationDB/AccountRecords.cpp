@@ -304,9 +304,10 @@ bool __VeltoIDDBRemoveVeltoIDAccount(const String& name, ErrorOut error) {
 
 bool __VeltoIDDBRemoveVeltoIDAccountAndPassword(const String& name, const UnownedItems& items,
                                                 AccountRecord* removed, ErrorOut error) {
+    constexpr const char* kFunction = "__VeltoIDDBRemoveVeltoIDAccountAndPassword";
     return database::perform([&](Store& store) {
         const auto record = recordOf(store, name);
-        if (!record) return failWith(error, VELTOID_ERROR(missingAccountCode(store)));
+        if (!record) return failWith(error, VELTOID_ERROR_FROM(kFunction, missingAccountCode(store)));
         const Dictionary before[] = {store.accounts, store.certificates, store.metaInfo};
         if (!store.replace(withoutAccount(store, *record, items), Notify::Yes))
             return failWith(error, notStored(__LINE__));

@@ -200,6 +200,7 @@ bool Store::remove(Dictionary Store::*section, const String& key) {
 bool Store::replace(std::vector<Change> changes, Notify notify) {
     if (!isLoaded()) return false;
     std::vector<Dictionary Store::*> sections;
+    sections.reserve(changes.size());
     for (Change& each : changes) sections.push_back(each.section);
     const auto exchange = [&] {
         for (Change& each : changes) std::swap(this->*each.section, each.changed);
@@ -217,6 +218,7 @@ bool Store::writeSections(const std::vector<Dictionary Store::*>& sections) {
     if (!usePreferences_) return true;
     if (!loaded_) return false;
     std::vector<std::pair<std::string, platform::ValueWriter>> values;
+    values.reserve(sections.size());
     for (Dictionary Store::*section : sections) values.push_back(preference(keyOf(section), this->*section));
     if (!preferences().set(values)) return false;
     planFlush();
