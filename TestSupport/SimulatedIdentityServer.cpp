@@ -179,7 +179,7 @@ Value SimulatedIdentityServer::fetchCert(const Dictionary& parameters) {
         return Dictionary{{"dsCert", Dictionary{{"CertStatus", "SIGNIN_PENDING"}}},
                           {"Delay", behaviour_.delay.value_or(Value())}};
     if (behaviour_.refusesCertificates) return Dictionary{{"dsCert", Dictionary{{"CertStatus", "FAILED"}}}};
-    if (account.pendingPolls-- > 0) return FakeIdentityServer::faultOf(-4164);
+    if (behaviour_.pendingChance > 0 && account.pendingPolls-- > 0) return FakeIdentityServer::faultOf(-4164);
     return Dictionary{{"dsCert", issue(account)}};
 }
 

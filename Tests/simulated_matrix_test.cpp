@@ -113,15 +113,16 @@ class Cell : public ServerTest {
     }
     void expectFewStartsAndCalls() const {
         const double end = begin_ + kTrouble;
+        const double kFirst = 30;
         const auto most = [&](const std::vector<double>& dates, double length, double from, double until, size_t limit,
                               size_t& figure, const char* what) {
             const size_t found = mostWithin(dates, length, from, until);
             EXPECT_LE(found, limit) << what << describeWithin(dates, from);
             figure = std::max(figure, found);
         };
-        most(life_.starts(), kHour, begin_, begin_ + 1, kMaxStartsFirstHour, figures.startsFirstHour, "starts first");
-        most(calls_, kHour, begin_, begin_ + kFirstWhile, kMaxCallsFirstHour, figures.callsFirstHour, "calls first");
-        most(calls_, kFirstWhile, begin_, begin_ + 1, kMaxCallsFirstWhile, figures.callsFirstWhile, "first while");
+        most(life_.starts(), kHour, begin_, begin_ + kFirst, kMaxStartsFirstHour, figures.startsFirstHour, "starts first");
+        most(calls_, kHour, begin_, begin_ + kFirst, kMaxCallsFirstHour, figures.callsFirstHour, "calls first");
+        most(calls_, kFirstWhile, begin_, begin_ + kFirst, kMaxCallsFirstWhile, figures.callsFirstWhile, "first while");
         most(life_.starts(), kHour, begin_ + kHour, end, kMaxStartsPerHour, figures.starts, "starts");
         most(calls_, kHour, begin_ + kHour, end, kMaxCallsPerHour, figures.calls, "calls");
         most(life_.starts(), 10 * kHour, end - 10 * kHour, end, 12, figures.startsLate, "starts late");
@@ -193,7 +194,7 @@ const Server kServers[] = {
          for (const char* method : {"getMyInfo", "createCert", "fetchCert"}) cell.server().set(method, kRubbish);
      }},
     {"no encDsId", [](Cell& cell) { cell.simulation().behave({.tellsEncDsId = false}); }},
-    {"another encDsId each time", [](Cell& cell) { cell.simulation().behave({.changesEncDsId = true}); }},
+    {"another encDsId each time", [](Cell& cell) { cell.simulation().behave({.pendingChance = 0, .changesEncDsId = true}); }},
     {"pending, delay 0",
      [](Cell& cell) {
          cell.simulation().behave({.pendingChance = 1, .isPendingForEver = true, .delay = Value::int32(0)});
@@ -207,8 +208,10 @@ const Server kServers[] = {
          cell.simulation().behave(
              {.pendingChance = 1, .isPendingForEver = true, .delay = Value::int32(-1), .sessionValidity = 600});
      }},
-    {"no authority", [](Cell& cell) { cell.trustNobody(); }},
-    {"another authority", [](Cell& cell) { cell.trust(testing_support::TestAuthority("Other")); }},
+    {"no authority", [](Cell& cell) { cell.simulation().behave({.pendingChance = 0});
+         cell.trustNobody(); }},
+    {"another authority", [](Cell& cell) { cell.simulation().behave({.pendingChance = 0});
+         cell.trust(testing_support::TestAuthority("Other")); }},
     {"intervals 0", [](Cell& cell) { cell.intervals(Value::int64(0)); }},
     {"intervals negative", [](Cell& cell) { cell.intervals(Value::int64(-100)); }},
     {"intervals huge", [](Cell& cell) { cell.intervals(Value::real(1e300)); }},

@@ -42,6 +42,7 @@ class AccountPass {
     const double backOff_;
     const double begun_;
     const Array stateBefore_;
+    const int stepBefore_;
 };
 
 }  // namespace veltoid

@@ -53,20 +53,21 @@ std::optional<double> nextRequestDate(const AccountRecord& record) {
 bool admitCertificateRequest(const AccountRecord& record, ErrorOut error) {
     auto heldUntil = requestsHeldUntil(record);
     if (!heldUntil) {
-        if (recentRequests(record).size() < kMaxRequestsInWindow) return true;
-        heldUntil = platform::now() + generationInterval(record);
+        // One request follows each time that it has refused them for long enough.
+        if (record.requestsHeldUntil() || recentRequests(record).size() < kMaxRequestsInWindow) return true;
+        heldUntil = platform::now() + kRequestHold;
         __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCertificateRequestsHeldUntilKey,
                                    Value::date(*heldUntil), Notify::No);
         VELTOID_LOG(kError, "Velto ID ", describeAccountForLog(record.accountName()), " has asked for ",
                     kMaxRequestsInWindow,
-                    " certificates within an hour and wants another one; its requests are held up until ",
+                    " certificates within two hours and a half and wants another one; its requests are held up until ",
                     Value::date(*heldUntil), ".");
     }
     const Dictionary information = {
         {kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::date(*heldUntil)}};
     return failWith(error,
                     makeError(identity_error::kNotYet,
-                              {"This account has asked for too many certificates within an hour.", {}, {}},
+                              {"This account has asked for too many certificates within two hours and a half.", {}, {}},
                               information, __func__, __FILE_NAME__, __LINE__));
 }
 
