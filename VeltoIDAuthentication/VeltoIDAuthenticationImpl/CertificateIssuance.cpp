@@ -197,7 +197,13 @@ class SigningRequest {
         if (setInRecord({{kVeltoIDAccountCertificateTokenKey, token}}))
             setInRecord({{kVeltoIDAccountCertificateTokenExpirationKey,
                           Value::date(platform::now() + kVeltoIDCertificateTokenLifetime)}});
-        return putOffFetch(accountName_, tokenDelay(delay));
+        const double seconds = tokenDelay(delay);
+        setInRecord({{kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::real(seconds)}});
+        const double nextFetch = platform::now() + seconds;
+        const bool stored = setInRecord(
+            {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)}}, Notify::No);
+        requestRelaunch(nextFetch);
+        return stored;
     }
 
     bool setInRecord(const Dictionary& values, Notify notify = Notify::Yes) {
