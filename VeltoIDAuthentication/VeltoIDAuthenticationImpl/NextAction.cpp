@@ -91,8 +91,9 @@ class Examination {
     /// the check ends here; a server that cannot be reached does not end it.
     std::optional<AccountState> validateAccount() {
         if (!networkAllowed_ || (!validationIsDue_ && schedule().isInformationFresh())) return std::nullopt;
-        // Without a certificate what follows is a request for one, which signs in, and tells what is refused.
-        if (!validationIsDue_ && !certificateEntryOf(encDsId_).exists()) return std::nullopt;
+        // A request for a certificate follows, which signs in and learns the same.
+        if (!validationIsDue_ && !certificateEntryOf(encDsId_).exists() && schedule().isDue(DueReason::Request))
+            return std::nullopt;
         // What is too old is asked for again, and in an hour once more if the server cannot be reached.
         if (validationIsDue_ && !record_.isValidationForced() && !record_.nextValidation())
             postponeValidation(Notify::No);

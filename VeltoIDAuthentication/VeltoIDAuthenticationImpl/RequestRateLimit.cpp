@@ -33,6 +33,13 @@ Array recentRequests(const AccountRecord& record) {
     return recent;
 }
 
+/// An account that the guard has just refused goes on with one request in the window.
+size_t maxRequests(const AccountRecord& record) {
+    const auto held = record.requestsHeldUntil();
+    const double now = platform::now();
+    return held && *held <= now && now < *held + 2 * kRequestWindow ? 1 : kMaxRequestsInWindow;
+}
+
 }  // namespace
 
 std::optional<double> requestsHeldUntil(const AccountRecord& record) {
@@ -53,31 +60,27 @@ std::optional<double> nextRequestDate(const AccountRecord& record) {
 bool admitCertificateRequest(const AccountRecord& record, ErrorOut error) {
     auto heldUntil = requestsHeldUntil(record);
     if (!heldUntil) {
-        // One request follows each time that it has refused them for long enough.
-        if (record.requestsHeldUntil() || recentRequests(record).size() < kMaxRequestsInWindow) return true;
+        if (recentRequests(record).size() < maxRequests(record)) return true;
         heldUntil = platform::now() + kRequestHold;
         __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCertificateRequestsHeldUntilKey,
                                    Value::date(*heldUntil), Notify::No);
         VELTOID_LOG(kError, "Velto ID ", describeAccountForLog(record.accountName()), " has asked for ",
-                    kMaxRequestsInWindow,
-                    " certificates within two hours and a half and wants another one; its requests are held up until ",
+                    recentRequests(record).size(),
+                    " certificates within an hour and wants another one; its requests are held up until ",
                     Value::date(*heldUntil), ".");
     }
     const Dictionary information = {
         {kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::date(*heldUntil)}};
     return failWith(error,
                     makeError(identity_error::kNotYet,
-                              {"This account has asked for too many certificates within two hours and a half.", {}, {}},
+                              {"This account has asked for too many certificates within an hour.", {}, {}},
                               information, __func__, __FILE_NAME__, __LINE__));
 }
 
 void noteCertificateRequest(const String& accountName) {
     Array requests = recentRequests(accountRecordOf(accountName));
     requests.append(Value::date(platform::now()));
-    __VeltoIDDBSetAccountValues(accountName,
-                                {{kVeltoIDAccountCertificateRequestDatesKey, requests},
-                                 {kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::null()}},
-                                Notify::No);
+    __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountCertificateRequestDatesKey, requests, Notify::No);
 }
 
 }  // namespace veltoid

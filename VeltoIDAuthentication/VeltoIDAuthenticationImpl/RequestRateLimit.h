@@ -15,7 +15,7 @@ namespace veltoid {
 
 /// The number of requests that an account may send within kRequestWindow (seconds).
 inline constexpr size_t kMaxRequestsInWindow = 3;
-inline constexpr double kRequestWindow = 9'000;
+inline constexpr double kRequestWindow = 3'600;
 /// How long the guard refuses, each time (seconds): who waits for a certificate does so for no longer.
 inline constexpr double kRequestHold = 3'600;
 
