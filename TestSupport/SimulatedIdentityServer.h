@@ -31,11 +31,32 @@ class SimulatedIdentityServer {
         bool hasBadDays = true;
     };
 
-    /// Answers in the fake server's place from now on.
+    /// How it answers, beside what the days bring.
+    struct Behaviour {
+        /// Of a request not being answered with a certificate at once.
+        double pendingChance = 0.5;
+        bool isPendingForEver = false;
+        /// What comes with a token, and with each answer that the certificate is not there yet; absent: nothing;
+        /// unset: some minutes with the token.
+        std::optional<Value> delay = {};
+        bool refusesCertificates = false;
+        bool tellsEncDsId = true;
+        bool changesEncDsId = false;
+        /// How long sessions may be used again (seconds).
+        double sessionValidity = 0;
+    };
+    void behave(const Behaviour& behaviour) {
+        const std::lock_guard lock(mutex_);
+        behaviour_ = behaviour;
+    }
+
+    /// Answers in the fake server's place from now on, whoever did so meanwhile.
+    void serve();
+
     SimulatedIdentityServer(FakeIdentityServer& server, platform::Clock& clock,
                             const Configuration& configuration);
 
-    const TestAuthority& root() const { return root_; }
+    static const TestAuthority& root();
 
     /// When the account's certificates were asked for.
     const std::vector<double>& requests(const std::string& account) { return accounts_[account].requests; }
@@ -54,6 +75,9 @@ class SimulatedIdentityServer {
     };
     const Events& events() const { return events_; }
 
+    /// When it told an account something that changed it.
+    const std::vector<double>& news() const { return news_; }
+
     /// Whether the server could be reached and gave out all it was asked for during the whole period.
     bool wasGood(const Period& period) const;
 
@@ -67,6 +91,7 @@ class SimulatedIdentityServer {
         double serial = 0;
         double recordMade = 0;
         std::string token;
+        std::string encDsId;
     };
 
     void planBadDays(const Configuration& configuration);
@@ -79,21 +104,23 @@ class SimulatedIdentityServer {
     Value getMyInfo(const Dictionary& parameters);
     Value createCert(const Dictionary& parameters);
     Value fetchCert(const Dictionary& parameters);
+    Value downloadCertComplete(const Dictionary& parameters);
     Dictionary issue(Account& account);
     void tellValidity(const Account& account, const Dictionary& parameters, Dictionary& reply) const;
 
     /// Held while a call is answered.
     std::mutex mutex_;
+    FakeIdentityServer& server_;
     platform::Clock& clock_;
+    Behaviour behaviour_;
     const Configuration configuration_;
     std::mt19937 random_;
-    const TestAuthority root_{"Root"};
-    const TestAuthority intermediate_{"Intermediate", &root_};
     std::map<std::string, Account> accounts_;
     std::vector<Period> unreachable_;
     std::vector<Period> refusing_;
     int signInsDuringEmbargo_ = 0;
     Events events_;
+    std::vector<double> news_;
     long lastSerial_ = 1'000;
 };
 

@@ -23,10 +23,19 @@ Array stateOf(const AccountRecord& record) {
             record.validationRecordIdentifier()};
 }
 
-Dictionary putOff(double from, double backOff) {
-    return {{kVeltoIDAccountNextCheckDateKey, Value::date(from + backOff)},
+/// How far the account has come on its way to a certificate.
+int stepOf(const AccountRecord& record) {
+    if (hasValidCertificateEntry(record.encDsId())) return 3;
+    if (record.certificateToken()) return 2;
+    return record.encDsId() ? 1 : 0;
+}
+
+Dictionary putOff(double until, double backOff) {
+    return {{kVeltoIDAccountNextCheckDateKey, Value::date(until)},
             {kVeltoIDAccountCheckBackOffKey, Value::real(backOff)}};
 }
+
+Dictionary putOffFrom(double from, double backOff) { return putOff(from + backOff, backOff); }
 
 double grown(double backOff, const AccountRecord& record) {
     const double most = hasValidCertificateEntry(record.encDsId()) ? kMaxBackOff : kMaxBackOffInNeed;
@@ -48,8 +57,9 @@ AccountPass::AccountPass(const AccountRecord& record)
     : accountName_(record.accountName()),
       backOff_(putOffUntil(record) ? record.checkBackOff().value_or(0) : 0),
       begun_(platform::now()),
-      stateBefore_(stateOf(record)) {
-    Dictionary values = putOff(begun_, grown(backOff_, record));
+      stateBefore_(stateOf(record)),
+      stepBefore_(stepOf(record)) {
+    Dictionary values = putOffFrom(begun_, grown(backOff_, record));
     values.set(kVeltoIDDirtyKey, Value::null());
     __VeltoIDDBSetAccountValues(accountName_, values, Notify::No);
 }
@@ -59,12 +69,16 @@ void AccountPass::end() const {
     const double now = platform::now();
     const auto next = AccountSchedule(record, certificateEntryOf(record.encDsId()), {}).nextReason();
     const bool isInNeed = !record.encDsId() || (next && *next <= now);
-    const bool isOneStepOn = backOff_ == 0 && stateOf(record) != stateBefore_;
+    const bool isOneStepOn =
+        stepOf(record) > stepBefore_ || (backOff_ == 0 && stateOf(record) != stateBefore_);
     Dictionary values = {{kVeltoIDAccountNextCheckDateKey, Value::null()},
                          {kVeltoIDAccountCheckBackOffKey, Value::null()}};
-    if (isInNeed) values = putOff(now, isOneStepOn ? kFollowUpDelay : grown(backOff_, record));
+    // The back-off stays as it is: who goes one step on and one back again and again is put off.
+    if (isInNeed)
+        values = isOneStepOn ? putOff(now + kFollowUpDelay, std::max(backOff_, kFollowUpDelay))
+                             : putOffFrom(now, grown(backOff_, record));
     values.set(kVeltoIDDirtyKey, Value::null());
-    const AccountRecord begun(accountName_, putOff(begun_, grown(backOff_, record)));
+    const AccountRecord begun(accountName_, putOffFrom(begun_, grown(backOff_, record)));
     setAccountValuesIf(isStillPutOffAsExamined, begun, values, Notify::No);
 }
 

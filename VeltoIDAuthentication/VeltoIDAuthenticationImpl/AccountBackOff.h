@@ -35,6 +35,7 @@ class AccountPass {
     const double backOff_;
     const double begun_;
     const Array stateBefore_;
+    const int stepBefore_;
 };
 
 }  // namespace veltoid

@@ -28,6 +28,9 @@ constexpr const char* kFunction = "checkAccountAndDetermineNextAction";
 /// Until a validation that was due is tried again (seconds).
 constexpr double kValidationPostponement = 3'600;
 
+/// What the server has just issued, or called good, it is not asked about (seconds).
+constexpr double kServersWordHolds = 60;
+
 /// One examination of one account.
 class Examination {
   public:
@@ -88,6 +91,9 @@ class Examination {
     /// the check ends here; a server that cannot be reached does not end it.
     std::optional<AccountState> validateAccount() {
         if (!networkAllowed_ || (!validationIsDue_ && schedule().isInformationFresh())) return std::nullopt;
+        // A request for a certificate follows, which signs in and learns the same.
+        if (!validationIsDue_ && !certificateEntryOf(encDsId_).exists() && schedule().isDue(DueReason::Request))
+            return std::nullopt;
         // What is too old is asked for again, and in an hour once more if the server cannot be reached.
         if (validationIsDue_ && !record_.isValidationForced() && !record_.nextValidation())
             postponeValidation(Notify::No);
@@ -149,6 +155,9 @@ class Examination {
 
     void askAboutCertificate() {
         const String serialNumber = entry_.serialNumber();
+        const auto validated = entry_.lastSuccessfulValidation();
+        if (validated && *validated <= platform::now() && platform::now() < *validated + kServersWordHolds)
+            return;
         if (!networkAllowed_ || !serialNumber || (!session_ && !openSession(nullptr))) return;
         const Dictionary parameters = {
             {kVeltoIDCertificateSerialNumberKey, serialNumber},

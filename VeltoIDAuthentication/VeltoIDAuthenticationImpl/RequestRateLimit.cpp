@@ -33,6 +33,13 @@ Array recentRequests(const AccountRecord& record) {
     return recent;
 }
 
+/// An account that the guard has just refused goes on with one request in the window.
+size_t maxRequests(const AccountRecord& record) {
+    const auto held = record.requestsHeldUntil();
+    const double now = platform::now();
+    return held && *held <= now && now < *held + 2 * kRequestWindow ? 1 : kMaxRequestsInWindow;
+}
+
 }  // namespace
 
 std::optional<double> requestsHeldUntil(const AccountRecord& record) {
@@ -54,12 +61,12 @@ std::optional<double> nextRequestDate(const AccountRecord& record) {
 bool admitCertificateRequest(const AccountRecord& record, ErrorOut error) {
     auto heldUntil = requestsHeldUntil(record);
     if (!heldUntil) {
-        if (recentRequests(record).size() < kMaxRequestsInWindow) return true;
-        heldUntil = platform::now() + generationInterval(record);
+        if (recentRequests(record).size() < maxRequests(record)) return true;
+        heldUntil = platform::now() + kRequestHold;
         __VeltoIDDBSetAccountValue(record.accountName(), kVeltoIDAccountCertificateRequestsHeldUntilKey,
                                    Value::date(*heldUntil), Notify::No);
         VELTOID_LOG(kError, "Velto ID ", describeAccountForLog(record.accountName()), " has asked for ",
-                    kMaxRequestsInWindow,
+                    recentRequests(record).size(),
                     " certificates within an hour and wants another one; its requests are held up until ",
                     Value::date(*heldUntil), ".");
     }
@@ -74,10 +81,7 @@ bool admitCertificateRequest(const AccountRecord& record, ErrorOut error) {
 void noteCertificateRequest(const String& accountName) {
     Array requests = recentRequests(accountRecordOf(accountName));
     requests.append(Value::date(platform::now()));
-    __VeltoIDDBSetAccountValues(accountName,
-                                {{kVeltoIDAccountCertificateRequestDatesKey, requests},
-                                 {kVeltoIDAccountCertificateRequestsHeldUntilKey, Value::null()}},
-                                Notify::No);
+    __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountCertificateRequestDatesKey, requests, Notify::No);
 }
 
 }  // namespace veltoid

@@ -2,7 +2,7 @@
 //
 // Requests are spaced by the account's "CSRGenerationInterval". A guard also counts the requests that were
 // sent: an account that sends more than kMaxRequestsInWindow within kRequestWindow is in a loop. It is then
-// refused until a generation interval has passed; the log and the account's status show that.
+// refused for kRequestHold, so that it goes on with one request in that time; the log and the account's status show that.
 #pragma once
 
 #include <optional>
@@ -16,6 +16,8 @@ namespace veltoid {
 /// The number of requests that an account may send within kRequestWindow (seconds).
 inline constexpr size_t kMaxRequestsInWindow = 3;
 inline constexpr double kRequestWindow = 3'600;
+/// How long the guard refuses, each time (seconds): who waits for a certificate does so for no longer.
+inline constexpr double kRequestHold = 3'600;
 
 /// The earliest date of the next request (seconds since 1970); none when it may be sent at any time.
 std::optional<double> nextRequestDate(const AccountRecord& record);
