@@ -3,6 +3,7 @@
 // alone.
 #pragma once
 
+#include <algorithm>
 #include <map>
 #include <mutex>
 #include <random>
@@ -76,7 +77,10 @@ class SimulatedIdentityServer {
     const Events& events() const { return events_; }
 
     /// When it told an account something that changed it.
-    const std::vector<double>& news() const { return news_; }
+    bool hadNews(const Period& period) const {
+        const auto next = std::lower_bound(news_.begin(), news_.end(), period.begin);
+        return next != news_.end() && *next < period.end;
+    }
 
     /// Whether the server could be reached and gave out all it was asked for during the whole period.
     bool wasGood(const Period& period) const;
