@@ -144,9 +144,10 @@ Dictionary SimulatedIdentityServer::issue(Account& account) {
     ++events_.issued;
     news_.push_back(now());
     const double expires = now() + configuration_.certificateLifetime;
-    const Bytes certificate = intermediate().issue(account.requestedKey, {.notBefore = generalizedTime(now()),
-                                                                         .notAfter = generalizedTime(expires),
-                                                                         .serialNumber = lastSerial_});
+    const Bytes certificate =
+        intermediate().issue(account.requestedKey, {.notBefore = generalizedTime(now()),
+                                                    .notAfter = generalizedTime(expires),
+                                                    .serialNumber = lastSerial_});
     Dictionary issued = {{"Certificate", pemOf(certificate)},
                          {"IntermediateCert", pemOf(intermediate().certificate())},
                          {"CertStatus", "CERT_ISSUED"},

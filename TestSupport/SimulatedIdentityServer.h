@@ -37,8 +37,8 @@ class SimulatedIdentityServer {
         /// Of a request not being answered with a certificate at once.
         double pendingChance = 0.5;
         bool isPendingForEver = false;
-        /// What comes with a token, and with each answer that the certificate is not there yet; absent: nothing;
-        /// unset: some minutes with the token.
+        /// What comes with a token, and with each answer that the certificate is not there yet; absent:
+        /// nothing; unset: some minutes with the token.
         std::optional<Value> delay = {};
         bool refusesCertificates = false;
         bool tellsEncDsId = true;

@@ -31,12 +31,12 @@ bool remember(Store& store, const Data& identity) {
     return store.keychainIsKnown;
 }
 
-/// Without stored accounts whose the items are is not known: the accounts may have been lost, or may come back.
-/// The clean-up leaves these items alone.
+/// Without stored accounts whose the items are is not known: the accounts may have been lost, or may come
+/// back. The clean-up leaves these items alone.
 void keepItemsOfOthers(Store& store) {
     Array kept;
-    for (const auto& items : {copyAllPasswordsFromKeychain(), copyAllKeysFromKeychain(),
-                              copyAllCertificatesFromKeychain()})
+    for (const auto& items :
+         {copyAllPasswordsFromKeychain(), copyAllKeysFromKeychain(), copyAllCertificatesFromKeychain()})
         for (const Value& item : items.value_or(Array())) kept.append(item);
     if (kept.empty()) return;
     Dictionary metaInfo = store.metaInfo;

@@ -35,8 +35,8 @@ double randomPollingDelay() {
 double pendingDelay(const Value& delay, const AccountRecord& record) {
     const auto given = finite(delay.asDouble());
     if (given && *given > 0) return std::clamp(*given, kMinPollDelay, kMaxFetchDelay);
-    return std::clamp(finite(record.nextCertificateFetchDelta()).value_or(kDefaultPendingDelay), kMinPollDelay,
-                      kMaxOwnPollDelay);
+    return std::clamp(finite(record.nextCertificateFetchDelta()).value_or(kDefaultPendingDelay),
+                      kMinPollDelay, kMaxOwnPollDelay);
 }
 
 double tokenDelay(const Value& delay) {
@@ -50,9 +50,8 @@ bool putOffFetch(const String& accountName, double delay) {
     const double after =
         delay < kMaxOwnPollDelay ? std::min(delay * kBackOffFactor, kMaxOwnPollDelay) : delay;
     const bool stored = __VeltoIDDBSetAccountValues(
-        accountName,
-        {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)},
-         {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::real(after)}});
+        accountName, {{kVeltoIDAccountCertificateNextCertificateFetchDateKey, Value::date(nextFetch)},
+                      {kVeltoIDAccountCertificateNextCertificateFetchNextDeltaKey, Value::real(after)}});
     requestRelaunch(nextFetch);
     return stored;
 }

@@ -30,8 +30,8 @@ double pendingDelay(const Value& delay, const AccountRecord& record);
 /// is shorter, or longer than a day.
 double tokenDelay(const Value& delay);
 
-/// Lets the next fetch of the account's pending certificate be made after `delay`, and one after that half as long
-/// again later, up to kMaxOwnPollDelay. False when that cannot be stored.
+/// Lets the next fetch of the account's pending certificate be made after `delay`, and one after that half as
+/// long again later, up to kMaxOwnPollDelay. False when that cannot be stored.
 bool putOffFetch(const String& accountName, double delay);
 
 }  // namespace veltoid
