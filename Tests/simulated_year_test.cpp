@@ -1,5 +1,5 @@
 // The agent's account check through years of an identity server's good and bad days, in simulated time:
-// everything but the connection and the clock is real. VELTOID_YEARS says how many (default 0.3;
+// everything but the connection and the clock is real. VELTOID_YEARS says how many (default 0.2;
 // sanitizers pass less).
 #include <cstdlib>
 
@@ -31,9 +31,9 @@ constexpr double kIntervalAfterAnswer = 4 * kHour;
 double yearsToPass() {
     const char* text = std::getenv("VELTOID_YEARS");  // NOLINT(concurrency-mt-unsafe): no other thread yet
 #ifdef VELTOID_SANITIZED
-    constexpr double kDefault = 0.1;
+    constexpr double kDefault = 0.05;
 #else
-    constexpr double kDefault = 0.3;
+    constexpr double kDefault = 0.2;
 #endif
     return text != nullptr ? std::strtod(text, nullptr) : kDefault;
 }
