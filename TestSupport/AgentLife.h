@@ -1,6 +1,6 @@
-// The life of the agent in simulated time, as its service manager has it: it starts, makes its first pass, leaves
-// when it has been idle, and is started again when its time has come or a client speaks to it. Nothing but files
-// outlives a start.
+// The life of the agent in simulated time, as its service manager has it: it starts, makes its first pass,
+// leaves when it has been idle, and is started again when its time has come or a client speaks to it. Nothing
+// but files outlives a start.
 #pragma once
 
 #include <algorithm>
@@ -20,8 +20,8 @@
 
 namespace veltoid::testing_support {
 
-/// How many of the dates (in order) fall into the fullest stretch of `length` seconds that begins at `from` or
-/// later and before `until`.
+/// How many of the dates (in order) fall into the fullest stretch of `length` seconds that begins at `from`
+/// or later and before `until`.
 inline size_t mostWithin(const std::vector<double>& dates, double length, double from, double until) {
     size_t most = 0;
     for (auto first = std::lower_bound(dates.begin(), dates.end(), from);
@@ -83,8 +83,9 @@ class AgentLife : private platform::ServiceManager {
         hasLeft_ = false;
         isRunning_ = true;
         __VeltoIDDBSetUsePreferences(true);
-        setProcessHooks({.scheduleRelaunch = [](double date) { scheduleRelaunch(date, RelaunchDate::OnlyIfEarlier); },
-                         .scheduleRequestedLaunch = scheduleRequestedLaunch});
+        setProcessHooks(
+            {.scheduleRelaunch = [](double date) { scheduleRelaunch(date, RelaunchDate::OnlyIfEarlier); },
+             .scheduleRequestedLaunch = scheduleRequestedLaunch});
         leaveWhenIdle();
         restoreRequestedLaunch();
         scheduleRelaunch(clock_.now() + kAfterStart);

@@ -77,6 +77,14 @@ bool SimulatedIdentityServer::isWithin(const std::vector<Period>& periods) const
                        [&](const Period& each) { return each.includes(now()); });
 }
 
+bool SimulatedIdentityServer::hadNews(const Period& period) const {
+    for (const auto* periods : {&unreachable_, &refusing_})
+        for (const Period& bad : *periods)
+            if (period.includes(bad.begin) || period.includes(bad.end)) return true;
+    const auto next = std::lower_bound(news_.begin(), news_.end(), period.begin);
+    return next != news_.end() && *next < period.end;
+}
+
 bool SimulatedIdentityServer::wasGood(const Period& period) const {
     for (const auto* periods : {&unreachable_, &refusing_})
         for (const Period& bad : *periods)
@@ -144,9 +152,10 @@ Dictionary SimulatedIdentityServer::issue(Account& account) {
     ++events_.issued;
     news_.push_back(now());
     const double expires = now() + configuration_.certificateLifetime;
-    const Bytes certificate = intermediate().issue(account.requestedKey, {.notBefore = generalizedTime(now()),
-                                                                         .notAfter = generalizedTime(expires),
-                                                                         .serialNumber = lastSerial_});
+    const Bytes certificate =
+        intermediate().issue(account.requestedKey, {.notBefore = generalizedTime(now()),
+                                                    .notAfter = generalizedTime(expires),
+                                                    .serialNumber = lastSerial_});
     Dictionary issued = {{"Certificate", pemOf(certificate)},
                          {"IntermediateCert", pemOf(intermediate().certificate())},
                          {"CertStatus", "CERT_ISSUED"},

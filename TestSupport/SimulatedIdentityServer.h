@@ -3,6 +3,7 @@
 // alone.
 #pragma once
 
+#include <algorithm>
 #include <map>
 #include <mutex>
 #include <random>
@@ -36,8 +37,8 @@ class SimulatedIdentityServer {
         /// Of a request not being answered with a certificate at once.
         double pendingChance = 0.5;
         bool isPendingForEver = false;
-        /// What comes with a token, and with each answer that the certificate is not there yet; absent: nothing;
-        /// unset: some minutes with the token.
+        /// What comes with a token, and with each answer that the certificate is not there yet; absent:
+        /// nothing; unset: some minutes with the token.
         std::optional<Value> delay = {};
         bool refusesCertificates = false;
         bool tellsEncDsId = true;
@@ -75,8 +76,8 @@ class SimulatedIdentityServer {
     };
     const Events& events() const { return events_; }
 
-    /// When it told an account something that changed it.
-    const std::vector<double>& news() const { return news_; }
+    /// Whether it told an account something that changed it, or its good or bad days began.
+    bool hadNews(const Period& period) const;
 
     /// Whether the server could be reached and gave out all it was asked for during the whole period.
     bool wasGood(const Period& period) const;

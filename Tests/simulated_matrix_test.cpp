@@ -1,6 +1,6 @@
-// Every state of an account with every kind of server, for more than a day of simulated time in which the agent
-// comes and goes: how often it is started and asks, that it goes on trying, and that the account is usable soon
-// after the trouble ends.
+// Every state of an account with every kind of server, for more than a day of simulated time in which the
+// agent comes and goes: how often it is started and asks, that it goes on trying, and that the account is
+// usable soon after the trouble ends.
 #include "TestSupport/AgentLife.h"
 #include "TestSupport/SimulatedIdentityServer.h"
 #include "VeltoIDAuthenticationImpl/AccountSchedule.h"
@@ -32,7 +32,8 @@ constexpr size_t kMaxCallsPerHour = 12;
 
 /// The most of each that any cell has seen.
 struct Figures {
-    size_t startsFirstHour = 0, callsFirstHour = 0, callsFirstWhile = 0, starts = 0, calls = 0, startsLate = 0;
+    size_t startsFirstHour = 0, callsFirstHour = 0, callsFirstWhile = 0, starts = 0, calls = 0,
+           startsLate = 0;
     double repair = 0;
 };
 Figures figures;
@@ -55,7 +56,9 @@ class Cell : public ServerTest {
 
     // What an account is.
     void add() {
-        life_.ask([] { (void)(addOnlyAccount(kName, kPassword, {}, {wakeAccountCheck, [] { return false; }}, nullptr)); });
+        life_.ask([] {
+            (void)(addOnlyAccount(kName, kPassword, {}, {wakeAccountCheck, [] { return false; }}, nullptr));
+        });
     }
     void create(const String& encDsId) {
         ASSERT_TRUE(__VeltoIDDBCreateVeltoIDAccount(kName, kPassword, encDsId));
@@ -76,11 +79,13 @@ class Cell : public ServerTest {
     FakeIdentityServer& server() { return server_; }
     SimulatedIdentityServer& simulation() { return simulation_; }
     void every(const platform::FakeHTTPAnswer& answer) {
-        for (const char* method : {"authenticate", "getMyInfo", "createCert", "fetchCert", "downloadCertComplete"})
+        for (const char* method :
+             {"authenticate", "getMyInfo", "createCert", "fetchCert", "downloadCertComplete"})
             server_.set(method, answer);
     }
     void everyFault(int64_t code) {
-        for (const char* method : {"authenticate", "getMyInfo", "createCert", "fetchCert", "downloadCertComplete"})
+        for (const char* method :
+             {"authenticate", "getMyInfo", "createCert", "fetchCert", "downloadCertComplete"})
             server_.fault(method, code);
     }
     void trust(const testing_support::TestAuthority& authority) const {
@@ -119,15 +124,18 @@ class Cell : public ServerTest {
         }
         const double end = now();
         const double kFirst = 30;
-        const auto most = [&](const std::vector<double>& dates, double length, double from, double until, size_t limit,
-                              size_t& figure, const char* what) {
+        const auto most = [&](const std::vector<double>& dates, double length, double from, double until,
+                              size_t limit, size_t& figure, const char* what) {
             const size_t found = mostWithin(dates, length, from, until);
             EXPECT_LE(found, limit) << what << describeWithin(dates, from);
             figure = std::max(figure, found);
         };
-        most(life_.starts(), kHour, begin_, begin_ + kFirst, kMaxStartsFirstHour, figures.startsFirstHour, "starts first");
-        most(calls_, kHour, begin_, begin_ + kFirst, kMaxCallsFirstHour, figures.callsFirstHour, "calls first");
-        most(calls_, kFirstWhile, begin_, begin_ + kFirst, maxCallsFirstWhile, figures.callsFirstWhile, "first while");
+        most(life_.starts(), kHour, begin_, begin_ + kFirst, kMaxStartsFirstHour, figures.startsFirstHour,
+             "starts first");
+        most(calls_, kHour, begin_, begin_ + kFirst, kMaxCallsFirstHour, figures.callsFirstHour,
+             "calls first");
+        most(calls_, kFirstWhile, begin_, begin_ + kFirst, maxCallsFirstWhile, figures.callsFirstWhile,
+             "first while");
         most(life_.starts(), kHour, begin_ + kHour, end, kMaxStartsPerHour, figures.starts, "starts");
         most(calls_, kHour, begin_ + kHour, end, kMaxCallsPerHour, figures.calls, "calls");
         most(life_.starts(), 10 * kHour, end - 10 * kHour, end, 12, figures.startsLate, "starts late");
@@ -136,7 +144,8 @@ class Cell : public ServerTest {
         const double healed = now();
         // What the server has refused needs its user.
         if (!hasPassword()) add();
-        while (!__VeltoIDDBHasValidCertificate(kName) && now() < std::max(healed, embargoEnd_) + kMaxRepair) live(30);
+        while (!__VeltoIDDBHasValidCertificate(kName) && now() < std::max(healed, embargoEnd_) + kMaxRepair)
+            live(30);
         EXPECT_TRUE(__VeltoIDDBHasValidCertificate(kName)) << describeValue(record());
         figures.repair = std::max(figures.repair, now() - std::max(healed, embargoEnd_));
     }
@@ -149,19 +158,23 @@ class Cell : public ServerTest {
     std::string describeWithin(const std::vector<double>& dates, double from) const {
         std::string text = ":";
         for (const double each : dates)
-            if (each >= from && each < from + 3 * kHour) text += " " + std::to_string(std::lround(each - begin_));
+            if (each >= from && each < from + 3 * kHour)
+                text += " " + std::to_string(std::lround(each - begin_));
         return text;
     }
     /// What the status says of the next action is about to happen, or the agent will be there.
     void look() {
         for (const auto& call : server_.take()) {
             calls_.push_back(now());
-            if (std::getenv("VELTOID_TRACE") != nullptr) std::printf("%.0f %s\n", now() - begin_, call.method.c_str());
+            if (std::getenv("VELTOID_TRACE") != nullptr)
+                std::printf("%.0f %s\n", now() - begin_, call.method.c_str());
         }
         const auto next = copyNextActionDateForAccount(kName);
         if (!next) return;
         // The first pass may be yet to come.
-        const double since = life_.isRunning() ? std::max(*next, life_.starts().back() + kVeltoIDFirstAccountCheckDelay) : *next;
+        const double since = life_.isRunning()
+                                 ? std::max(*next, life_.starts().back() + kVeltoIDFirstAccountCheckDelay)
+                                 : *next;
         EXPECT_GE(since, now() - kTolerance) << "the next action is overdue";
         if (life_.isRunning()) return;
         EXPECT_LE(life_.alarm().value_or(1e12), std::max(*next, now()) + 1) << "the agent comes too late";
@@ -179,12 +192,16 @@ struct Server {
     /// A token without a delay is asked with every half minute at first, each time with a sign-in.
     size_t maxCallsFirstWhile = 8;
 };
-const platform::FakeHTTPAnswer kRubbish{200, "<html><body>Please log in to the hotel's network</body></html>"};
+const platform::FakeHTTPAnswer kRubbish{200,
+                                        "<html><body>Please log in to the hotel's network</body></html>"};
 const Server kServers[] = {
     {"up", [](Cell& /*cell*/) {}},
     {"up, sessions", [](Cell& cell) { cell.simulation().behave({.sessionValidity = 600}); }},
     {"503", [](Cell& cell) { cell.every({503}); }},
-    {"no answer", [](Cell& cell) { cell.every({0, {}, platform::HTTPError{7, "cannot connect"}}); }},
+    {"no answer",
+     [](Cell& cell) {
+         cell.every({0, {}, platform::HTTPError{7, "cannot connect"}});
+     }},
     {"wrong password", [](Cell& cell) { cell.server().fault("authenticate", -20101); }},
     {"disabled", [](Cell& cell) { cell.server().fault("authenticate", -20209); }},
     {"no certificates", [](Cell& cell) { cell.simulation().behave({.refusesCertificates = true}); }},
@@ -198,29 +215,42 @@ const Server kServers[] = {
     {"rubbish", [](Cell& cell) { cell.every(kRubbish); }},
     {"rubbish but sign-in",
      [](Cell& cell) {
-         for (const char* method : {"getMyInfo", "createCert", "fetchCert"}) cell.server().set(method, kRubbish);
+         for (const char* method : {"getMyInfo", "createCert", "fetchCert"})
+             cell.server().set(method, kRubbish);
      }},
     {"no encDsId", [](Cell& cell) { cell.simulation().behave({.tellsEncDsId = false}); }},
-    {"another encDsId each time", [](Cell& cell) { cell.simulation().behave({.pendingChance = 0, .changesEncDsId = true}); }},
-    {"pending, delay 0",
-     [](Cell& cell) {
-         cell.simulation().behave({.pendingChance = 1, .isPendingForEver = true, .delay = Value::int32(0)});
-     },
-     10},
-    {"pending, no delay",
-     [](Cell& cell) {
-         cell.simulation().behave({.pendingChance = 1, .isPendingForEver = true, .delay = Value()});
-     },
-     10},
+    {"another encDsId each time",
+     [](Cell& cell) { cell.simulation().behave({.pendingChance = 0, .changesEncDsId = true}); }},
+    {
+        "pending, delay 0",
+        [](Cell& cell) {
+            cell.simulation().behave(
+                {.pendingChance = 1, .isPendingForEver = true, .delay = Value::int32(0)});
+        },
+    },
+    {
+        "pending, no delay",
+        [](Cell& cell) {
+            cell.simulation().behave({.pendingChance = 1, .isPendingForEver = true, .delay = Value()});
+        },
+    },
     {"pending, delay -1, sessions",
      [](Cell& cell) {
-         cell.simulation().behave(
-             {.pendingChance = 1, .isPendingForEver = true, .delay = Value::int32(-1), .sessionValidity = 600});
+         cell.simulation().behave({.pendingChance = 1,
+                                   .isPendingForEver = true,
+                                   .delay = Value::int32(-1),
+                                   .sessionValidity = 600});
      }},
-    {"no authority", [](Cell& cell) { cell.simulation().behave({.pendingChance = 0});
-         cell.trustNobody(); }},
-    {"another authority", [](Cell& cell) { cell.simulation().behave({.pendingChance = 0});
-         cell.trust(testing_support::TestAuthority("Other")); }},
+    {"no authority",
+     [](Cell& cell) {
+         cell.simulation().behave({.pendingChance = 0});
+         cell.trustNobody();
+     }},
+    {"another authority",
+     [](Cell& cell) {
+         cell.simulation().behave({.pendingChance = 0});
+         cell.trust(testing_support::TestAuthority("Other"));
+     }},
     {"intervals 0", [](Cell& cell) { cell.intervals(Value::int64(0)); }},
     {"intervals negative", [](Cell& cell) { cell.intervals(Value::int64(-100)); }},
     {"intervals huge", [](Cell& cell) { cell.intervals(Value::real(1e300)); }},
@@ -248,14 +278,25 @@ const State kStates[] = {
      nothing},
     {"Good", [](Cell& cell) { cell.issue(); }, nothing},
     {"RenewalDue", [](Cell& cell) { cell.issue(); },
-     [](Cell& cell) { cell.setInCertificate({{kRenewal, Value::date(cell.date() - 1)}}); }},
+     [](Cell& cell) {
+         cell.setInCertificate({{kRenewal, Value::date(cell.date() - 1)}});
+     }},
     {"Expired", [](Cell& cell) { cell.issue(); },
-     [](Cell& cell) { cell.setInCertificate({{"Expires", Value::date(cell.date() - 1)}}); }},
+     [](Cell& cell) {
+         cell.setInCertificate({{"Expires", Value::date(cell.date() - 1)}});
+     }},
     {"Revoked", [](Cell& cell) { cell.issue(); },
-     [](Cell& cell) { cell.setInCertificate({{"CertStatus", "CERTIFICATE_INVALID"}}); }},
+     [](Cell& cell) {
+         cell.setInCertificate({{"CertStatus", "CERTIFICATE_INVALID"}});
+     }},
     {"RecordDue", [](Cell& cell) { cell.issue(); },
-     [](Cell& cell) { cell.set({{kNextCheck, Value::date(cell.date() - 1)}}); }},
-    {"Forced", [](Cell& cell) { cell.issue(); }, [](Cell& cell) { cell.set({{"ForceValidation", kOn}}); }},
+     [](Cell& cell) {
+         cell.set({{kNextCheck, Value::date(cell.date() - 1)}});
+     }},
+    {"Forced", [](Cell& cell) { cell.issue(); },
+     [](Cell& cell) {
+         cell.set({{"ForceValidation", kOn}});
+     }},
     {"Embargo", nothing,
      [](Cell& cell) {
          cell.create(Cell::encDsId());
@@ -264,8 +305,8 @@ const State kStates[] = {
      }},
 };
 
-/// All of them where VELTOID_YEARS asks for a long test, or the one that VELTOID_SERVER names; else every third, a
-/// different one for each state.
+/// All of them where VELTOID_YEARS asks for a long test, or the one that VELTOID_SERVER names; else every
+/// third, a different one for each state.
 bool isChosen(const State& state, const Server& server) {
     if (const char* only = std::getenv("VELTOID_SERVER")) return std::string(server.what) == only;
 #ifdef VELTOID_SANITIZED
@@ -294,10 +335,12 @@ TEST_P(SimulatedMatrix, FewStartsAndCallsAndUsableSoonAfter) {
         cell.expectUsableSoon();
         cell.end();
     }
-    std::printf("first hour: %zu starts, %zu calls, %zu of them in %.0f s; later: %zu starts, %zu calls; last ten hours: "
-                "%zu starts; usable after %.0f s\n",
-                figures.startsFirstHour, figures.callsFirstHour, figures.callsFirstWhile, kFirstWhile, figures.starts,
-                figures.calls, figures.startsLate, figures.repair);
+    std::printf(
+        "first hour: %zu starts, %zu calls, %zu of them in %.0f s; later: %zu starts, %zu calls; last ten "
+        "hours: "
+        "%zu starts; usable after %.0f s\n",
+        figures.startsFirstHour, figures.callsFirstHour, figures.callsFirstWhile, kFirstWhile, figures.starts,
+        figures.calls, figures.startsLate, figures.repair);
 }
 
 INSTANTIATE_TEST_SUITE_P(States, SimulatedMatrix, testing::ValuesIn([] {

@@ -5,6 +5,7 @@
 #include "Protocol/MessageKeys.h"
 #include "Protocol/OptionKeys.h"
 #include "Values/DictionaryAccess.h"
+#include "VeltoIDAuthenticationDB/Store.h"
 #include "VeltoIDAuthenticationImpl/ServerRequests.h"
 
 namespace veltoid {
@@ -37,7 +38,8 @@ void handlePasswordCheckIPCMessage(platform::IncomingMessage& message,
 
 bool verifyRequestedPassword(Request& request, ErrorOut error) {
     const String password = request.string(message::kHashedPassword);
-    if (!request.account() || !password) return false;
+    // Where the password is to be sent is among what is stored.
+    if (!request.account() || !password || !__VeltoIDDBIsReadable(error)) return false;
     const Dictionary options =
         copyDictionarySettingValue(request.options(), option::kDoNotSaveSessionInfo, Value::boolean(true));
     return __VeltoIDDoVerifyPassword(request.account(), password, options, error);

@@ -104,7 +104,9 @@ void adoptKeychain(Store& store) {
     if (!usesSystemKeychain() || !store.isLoaded()) return;
     const auto stored = readStored(store.keychainDomain(), kIdentityKey);
     const Data present = presentIdentity(Reopen::No);
-    if (present && stored && stored->asData() != present) remember(store, present);
+    if (!present || !stored || stored->asData() == present) return;
+    if (!stored->asData() && store.accounts.empty() && store.certificates.empty()) keepItemsOfOthers(store);
+    remember(store, present);
 }
 
 }  // namespace database

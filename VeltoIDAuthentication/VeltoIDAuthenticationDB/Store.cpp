@@ -217,10 +217,15 @@ bool Store::replace(std::vector<Change> changes, Notify notify) {
 bool Store::writeSections(const std::vector<Dictionary Store::*>& sections) {
     if (!usePreferences_) return true;
     if (!loaded_) return false;
+    const platform::Preferences domain = preferences();
     std::vector<std::pair<std::string, platform::ValueWriter>> values;
-    values.reserve(sections.size());
-    for (Dictionary Store::*section : sections) values.push_back(preference(keyOf(section), this->*section));
-    if (!preferences().set(values)) return false;
+    // The file may have been taken away: its successor would be taken for one of another layout.
+    const bool isWhole = readPreference(domain, kVeltoIDDBVersionKey).result != ReadResult::Absent;
+    const std::vector<Dictionary Store::*> all = {&Store::accounts, &Store::certificates, &Store::metaInfo};
+    if (!isWhole) values.push_back(preference(kVeltoIDDBVersionKey, Value::int64(kVeltoIDDBVersion)));
+    for (Dictionary Store::*section : isWhole ? sections : all)
+        values.push_back(preference(keyOf(section), this->*section));
+    if (!domain.set(values)) return false;
     planFlush();
     return true;
 }
@@ -277,12 +282,15 @@ bool __VeltoIDDBIsReadable(ErrorOut error) {
 }
 
 bool __VeltoIDDBCopyAllContents(std::optional<Dictionary>* contents, ErrorOut error) {
-    const auto all = database::perform([](const Store& store) -> std::optional<Dictionary> {
+    const auto all = database::perform([](Store& store) -> std::optional<Dictionary> {
         if (!store.usePreferences_)
             return Dictionary{{kVeltoIDDBAccountsKey, store.accounts},
                               {kVeltoIDDBUnstoredCertificatesKey, store.certificates},
                               {kVeltoIDDBMetaInfoKey, store.metaInfo}};
-        return store.isLoaded() ? database::readAll(store.preferences()) : std::nullopt;
+        if (!store.isLoaded()) return std::nullopt;
+        auto stored = database::readAll(store.preferences());
+        if (!stored || stored->contains(kVeltoIDDBVersionKey) || !store.writeSections({})) return stored;
+        return database::readAll(store.preferences());
     });
     if (!all) return failWith(error, database::unreadable());
     fill(contents, all);

@@ -14,6 +14,7 @@
 #include "VeltoIDAuthenticationDB/KeychainIdentity.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountInformation.h"
+#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDAuthenticationImpl/CertificateIssuance.h"
 #include "VeltoIDAuthenticationImpl/NextAction.h"
 #include "VeltoIDAuthenticationImpl/PollBackOff.h"
@@ -116,6 +117,14 @@ void renewCertificateForAccount(const String& accountName, const Examined& exami
                                                       examined.requests);
 }
 
+/// A renewal that waits for its time must not hold up the validation record.
+void fetchDueValidationRecord(const String& accountName, const Dictionary& options) {
+    const AccountRecord record = accountRecordOf(accountName);
+    if (!record.certificateToken() && AccountSchedule(record, certificateEntryOf(record.encDsId()), options)
+                                          .isDue(DueReason::ValidationRecord))
+        fetchValidationRecordForAccount(record, options);
+}
+
 }  // namespace
 
 void checkAccount(const AccountRecord& record) {
@@ -133,9 +142,11 @@ void checkAccount(const AccountRecord& record) {
         case CertificateExpired:
             return renewCertificateForAccount(accountName, examined, options, OldCertificate::Remove);
         case NoCertificate:
+            return renewCertificateForAccount(accountName, examined, options, OldCertificate::Keep);
         case CertificateShouldBeRenewed:
         case CertificateMustBeRenewed:
-            return renewCertificateForAccount(accountName, examined, options, OldCertificate::Keep);
+            renewCertificateForAccount(accountName, examined, options, OldCertificate::Keep);
+            return fetchDueValidationRecord(accountName, options);
         case CertificateOK:
             return noteValidation(examined.certificate);
         case ValidationRecordNeedsToBeUpdated:

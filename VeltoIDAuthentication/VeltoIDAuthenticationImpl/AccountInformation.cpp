@@ -18,7 +18,6 @@
 #include "VeltoIDAuthenticationDB/CertificateEntries.h"
 #include "VeltoIDAuthenticationDB/MetaInfo.h"
 #include "VeltoIDAuthenticationImpl/AccountBackOff.h"
-#include "VeltoIDAuthenticationImpl/AccountSchedule.h"
 #include "VeltoIDKeychainItems/KeychainCertificates.h"
 #include "VeltoIDKeychainItems/KeychainItems.h"
 #include "VeltoIDXMLServerCommunications/Invoke.h"
@@ -210,8 +209,7 @@ bool applyValidationRecord(const AccountRecord& before, const Dictionary& answer
         if (nextCheck) {
             values.set(kVeltoIDAccountValidationRecordIdentifierKey, identifier);
             values.set(kVeltoIDAccountValidationRecordDataKey, data);
-            values.set(kVeltoIDAccountValidationRecordNextCheckDateKey,
-                       Value::date(std::min(*nextCheck, platform::now() + kMaxRecordCheckInterval)));
+            values.set(kVeltoIDAccountValidationRecordNextCheckDateKey, Value::date(*nextCheck));
         }
     }
     return bothPresentAndDifferent(before.validationRecordIdentifier(), identifier);

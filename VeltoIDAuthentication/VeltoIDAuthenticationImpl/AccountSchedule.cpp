@@ -174,7 +174,8 @@ bool AccountSchedule::isCertificateValidationPutOff() const {
 
 AccountSchedule::Date AccountSchedule::validationRecord() const {
     if (__VeltoIDSessionGetServerVersion() < kVeltoIDFirstVersionWithValidationRecords) return std::nullopt;
-    if (const auto next = record_.validationRecordNextCheck()) return isFar(*next) ? rightNow() : at(next);
+    if (const auto next = record_.validationRecordNextCheck())
+        return at(std::min(*next, record_.lastValidation().value_or(*next) + kMaxRecordCheckInterval));
     const auto validAsOf = record_.validationRecordValidAsOf();
     if (record_.validationRecordData().size() == 0 || !validAsOf || now_ < *validAsOf - kRecordDateTolerance)
         return rightNow();

@@ -14,7 +14,8 @@ namespace veltoid {
 /// Servers of this version and later give out validation records.
 inline constexpr int32_t kVeltoIDFirstVersionWithValidationRecords = 101;
 
-/// A validation record is looked at again after this time at the latest (seconds).
+/// A validation record is looked at again so long after the server's last answer at the latest (seconds),
+/// whatever its date.
 inline constexpr double kMaxRecordCheckInterval = 2'592'000;
 
 /// The longest that the account check puts an account off (seconds).

@@ -164,7 +164,10 @@ bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPasswo
                            AddedAccount* added, ErrorOut error) {
     const RequestsSeen seen = requestsSeen(accountName);
     if (!__VeltoIDDBCreateVeltoIDAccount(accountName, hashedPassword, nullptr))
-        return failWith(error, VELTOID_ERROR(identity_error::kUnknown));
+        return failWith(
+            error, makeError(identity_error::kUnknown,
+                             {"The account could not be stored on this device; the log says why.", {}, {}},
+                             {}, __func__, __FILE_NAME__, __LINE__));
     AddedAccount outcome = isAlreadyOnItsWay(accountRecordOf(accountName), options)
                                ? readd(accountName)
                                : addAnew(accountName, hashedPassword, options, seen);
@@ -176,6 +179,7 @@ bool __VeltoIDDoAddVeltoID(const String& accountName, const String& hashedPasswo
 bool addOnlyAccount(const String& accountName, const String& hashedPassword, const Dictionary& options,
                     const AddingClient& client, AddedAccount* added, ErrorOut error) {
     AddedAccount outcome;
+    const bool isNew = !isStored(accountName);
     if (accountName) replacedNames(OwnershipLock()).erase(accountName.text());
     const bool isAdded = __VeltoIDDoAddVeltoID(accountName, hashedPassword, options, &outcome, error);
     __VeltoIDDBIncrementMetaInfoCounter(nullptr, options, kVeltoIDAddVeltoIDCountKey, 1);
@@ -183,8 +187,11 @@ bool addOnlyAccount(const String& accountName, const String& hashedPassword, con
     __VeltoIDDBSetAccountValue(accountName, kVeltoIDAccountLastValidationDateKey, Value::null());
     client.wakeAccountCheck();
     auto decision = std::make_shared<const OwnershipLock>();
-    bool succeeds =
-        isStillStored(*decision, accountName, error) && forgetOtherAccounts(*decision, accountName, error);
+    bool succeeds = isStillStored(*decision, accountName, error);
+    if (succeeds && !forgetOtherAccounts(*decision, accountName, error)) {
+        succeeds = false;
+        if (isNew) forgetAccount(*decision, accountName, {});
+    }
     const double wait = getDouble(&options, option::kCertificateWait, 0);
     if (succeeds && wait > 0) {
         decision.reset();

@@ -343,7 +343,6 @@ TEST_F(EngineTest, TheNextActionIsTheEarliestOfManyDates) {
          {},
          Dictionary{{kValidated, date(-2e6)}, {kAttempt, date(1.5e9)}},
          -790'400},
-        {"a record for ever", {{kNextCheck, date(1.5e9)}}, entry, 0, 101},
         {"embargo for ever", {{kEmbargo, date(1.5e9)}}, {}, 0},
         {"embargo", {{kEmbargo, date(1000)}, {"ForceValidation", kOn}, {"Dirty", kOn}}, entry, 1000},
         {"embargo, expiry", {{kEmbargo, date(99)}}, Dictionary{{"Expires", date(9)}, {kRenewal, date(5)}}, 9},

@@ -92,7 +92,8 @@ class Examination {
     std::optional<AccountState> validateAccount() {
         if (!networkAllowed_ || (!validationIsDue_ && schedule().isInformationFresh())) return std::nullopt;
         // A request for a certificate follows, which signs in and learns the same.
-        if (!validationIsDue_ && !certificateEntryOf(encDsId_).exists() && schedule().isDue(DueReason::Request))
+        if (!validationIsDue_ && !certificateEntryOf(encDsId_).exists() &&
+            schedule().isDue(DueReason::Request))
             return std::nullopt;
         // What is too old is asked for again, and in an hour once more if the server cannot be reached.
         if (validationIsDue_ && !record_.isValidationForced() && !record_.nextValidation())

@@ -44,6 +44,9 @@ TEST_F(NextActionTest, WithoutWhatASignInNeedsThereIsNothingToExamine) {
     EXPECT_EQ(checkOffline(), NoCertificate);
     EXPECT_EQ(server_.takeMethods(), "");
     EXPECT_EQ(check(), NoCertificate);
+    EXPECT_EQ(server_.takeMethods(), "") << "the request that follows signs in";
+    setValue("CSRGenerationDate", date());
+    EXPECT_EQ(check(), NoCertificate);
     EXPECT_EQ(server_.takeMethods(), "authenticate") << "nobody knows when it was last validated";
     server_.fault("authenticate", -20209);
     EXPECT_EQ(check(), PasswordInvalid);
@@ -67,7 +70,8 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
     const Value past = date(-1);
     const std::tuple<const char*, Dictionary, Found, const char*> cases[] = {
         {"validated not long ago", {}, kGood, ""},
-        {"marked", {{"Dirty", kOn}}, kEvaluated, kAsked},
+        {"marked", {{"Dirty", kOn}, {kValidated, date(-100)}}, kEvaluated, kAsked},
+        {"marked, just issued", {{"Dirty", kOn}, {kValidated, date(-1)}}, kEvaluated, ""},
         {"never validated", {{kValidated, kGone}}, kEvaluated, kAsked},
         {"validated in the future", {{kValidated, date(5)}}, kEvaluated, kAsked},
         {"validated long ago", {{kValidated, longAgo}}, kEvaluated, kAsked},
@@ -76,7 +80,10 @@ TEST_F(NextActionTest, ACertificateIsJudgedByItsEntryAndItsDates) {
         {"expired", {{"Expires", past}}, kExpired, ""},
         {"invalid", {{"CertStatus", "CERTIFICATE_INVALID"}, {"Expires", past}}, kRevoked, ""},
         {"to be renewed", {{kRenewal, past}}, kToBeRenewed, ""},
-        {"to be renewed, evaluated", {{kRenewal, past}, {"Dirty", kOn}}, kToBeRenewed, kAsked},
+        {"to be renewed, evaluated",
+         {{kRenewal, past}, {"Dirty", kOn}, {kValidated, date(-100)}},
+         kToBeRenewed,
+         kAsked},
         {"its last 36 hours", {{"Expires", date(129'000)}}, kToBeRenewed, ""},
         {"just before them", {{"Expires", date(130'000)}}, kGood, ""},
         {"no plan, no renewal", {{"Expires", date(100)}, {kRenewal, kGone}}, kGood, ""},
@@ -132,7 +139,7 @@ TEST_F(NextActionTest, ACertificateIsEvaluatedUnderTheAuthority) {
     trust(root_);
 
     server_.answer("getMyInfo", Dictionary{{"encDsId", "d1"}, {"CertificateIsValid", kOff}});
-    setInEntry({{"Dirty", kOn}});
+    setInEntry({{"Dirty", kOn}, {kValidated, date(-100)}});
     EXPECT_EQ(check(), CertificateRevoked) << "the server's word counts at once";
     EXPECT_EQ(certificateEntry()["CertStatus"], Value("CERTIFICATE_INVALID"));
 }

@@ -14,8 +14,7 @@ namespace veltoid {
 namespace {
 
 constexpr double kBackOffFactor = 1.5;
-constexpr double kDefaultTokenDelay = 30;
-constexpr double kDefaultPendingDelay = 60;
+constexpr double kDefaultPollDelay = 60;
 
 std::optional<double> finite(std::optional<double> number) {
     return number && std::isfinite(*number) ? number : std::nullopt;
@@ -35,13 +34,13 @@ double randomPollingDelay() {
 double pendingDelay(const Value& delay, const AccountRecord& record) {
     const auto given = finite(delay.asDouble());
     if (given && *given > 0) return std::clamp(*given, kMinPollDelay, kMaxFetchDelay);
-    return std::clamp(finite(record.nextCertificateFetchDelta()).value_or(kDefaultPendingDelay),
-                      kMinPollDelay, kMaxOwnPollDelay);
+    return std::clamp(finite(record.nextCertificateFetchDelta()).value_or(kDefaultPollDelay), kMinPollDelay,
+                      kMaxOwnPollDelay);
 }
 
 double tokenDelay(const Value& delay) {
     const auto given = delay.asDouble();
-    if (!given || *given == 0) return kDefaultTokenDelay;
+    if (!given || *given == 0) return kDefaultPollDelay;
     return *given > 0 && *given <= kMaxPollingDelay ? std::max(*given, kMinPollDelay) : kMinPollDelay;
 }
 

@@ -26,7 +26,7 @@ double randomPollingDelay();
 /// Number; kMinPollDelay at least, a week at most), else what the record has noted, else a minute.
 double pendingDelay(const Value& delay, const AccountRecord& record);
 
-/// The delay that a fresh token came with: half a minute if the server gave none, kMinPollDelay for one that
+/// The delay that a fresh token came with: a minute if the server gave none, kMinPollDelay for one that
 /// is shorter, or longer than a day.
 double tokenDelay(const Value& delay);
 

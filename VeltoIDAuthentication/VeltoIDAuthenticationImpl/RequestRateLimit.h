@@ -2,7 +2,8 @@
 //
 // Requests are spaced by the account's "CSRGenerationInterval". A guard also counts the requests that were
 // sent: an account that sends more than kMaxRequestsInWindow within kRequestWindow is in a loop. It is then
-// refused for kRequestHold, so that it goes on with one request in that time; the log and the account's status show that.
+// refused for kRequestHold, so that it goes on with one request in that time; the log and the account's
+// status show that.
 #pragma once
 
 #include <optional>

@@ -74,8 +74,9 @@ void applyCommands(VeltoIDAuthenticationSessionInfo& session, const Dictionary& 
         accountInformation.contains(kVeltoIDAccountServerURLKey))
         VELTOID_LOG_FROM("xmlInvoke", kNotice,
                          "Ignoring a new server URL in a reply: credentials are not redirected by a reply.");
+    // A dictionary would be the section of some account.
     for (const auto& [key, value] : metaInformation)
-        __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
+        if (!value.isDictionary()) __VeltoIDDBSetMetaInfoValue(nullptr, key, commandValue(value));
     for (const auto& [key, value] : recordValuesFromServer(session.fAccountName, accountInformation))
         __VeltoIDDBSetAccountValue(session.fAccountName, key, commandValue(value), Notify::No);
     applyRelaunch(reply);

@@ -17,6 +17,7 @@ constexpr std::string_view kFaultCodeKey = "XMLFaultCode";
 // Codes of the HTTPS client library: the server has accepted the connection and closed it without an answer.
 constexpr int64_t kEmptyAnswer = 52;
 constexpr int64_t kReceiveFailed = 56;
+constexpr int64_t kPartialAnswer = 18;
 
 /// What happened in a call that failed for none of the known reasons.
 std::string descriptionOf(const std::optional<Error>& error) {
@@ -29,7 +30,7 @@ std::string descriptionOf(const std::optional<Error>& error) {
         return withText("The server answered with the fault " + std::to_string(error->code), *error);
     const Error* cause = error->userInfo[kErrorUnderlyingErrorKey].asError();
     if (cause == nullptr) return withText("The server did not answer, or not with success", *error);
-    if (cause->code == kEmptyAnswer || cause->code == kReceiveFailed)
+    if (cause->code == kEmptyAnswer || cause->code == kReceiveFailed || cause->code == kPartialAnswer)
         return withText("The server closed the connection without an answer", *cause);
     return withText("The server cannot be reached", *cause);
 }
