@@ -15,10 +15,10 @@ void prepareShutdown();
 /// Begins the shutdown now. Requests that are still being served may delay it for a second. Any queue.
 void shutDownByCommand();
 
-/// Whether the agent has been asked to leave: what can wait is not waited for. Any queue.
-bool isLeaving();
-
 /// The same for the server, whose answer is part of such a request: as on SIGTERM that may take ten seconds.
 void shutDownByServer();
+
+/// Whether the agent has been asked to leave: what can wait is not waited for. Any queue.
+bool isLeaving();
 
 }  // namespace veltoid

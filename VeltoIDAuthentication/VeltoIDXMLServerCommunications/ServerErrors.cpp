@@ -45,9 +45,8 @@ bool refusesClient(const std::optional<Error>& error) {
 
 /// The verdict on a failed call that was made with this password hash: when the server refuses it, the stored
 /// password goes if it is the same; when the server has disabled the account, or no longer supports this
-/// client
-/// (-105), whatever it is. That disables the account until a client adds it again. Nothing for any other
-/// error. False when a refused password is not the stored one.
+/// client (-105), whatever it is. That disables the account until a client adds it again. Nothing for any
+/// other error. False when a refused password is not the stored one.
 bool judgeRefusal(const String& accountName, const String& sentPasswordHash,
                   const std::optional<Error>& error) {
     if (!refusesPassword(error) && !refusesClient(error)) return true;
